@@ -1,0 +1,84 @@
+#pragma once
+
+#include <cstddef>
+#include <memory>
+#include <new>
+#include <type_traits>
+#include <utility>
+
+namespace quarvel {
+
+/// A piece of work to be run once: a callable without arguments or result, moved and never copied,
+/// so that it can own what it works on. Callables of up to `kInlineBytes` are held in place, without
+/// an allocation.
+class Block {
+ public:
+  static constexpr std::size_t kInlineBytes = 88;
+
+  Block() = default;
+  template <class F>
+    requires(!std::is_same_v<std::remove_cvref_t<F>, Block> && std::is_invocable_v<F&>)
+  Block(F&& work) {  // NOLINT(google-explicit-constructor): a lambda is a block
+    using Work = std::remove_cvref_t<F>;
+    if constexpr (fitsInPlace<Work>()) {
+      ::new (static_cast<void*>(storage_)) Work(std::forward<F>(work));
+      operations_ = &kInPlace<Work>;
+    } else {
+      ::new (static_cast<void*>(storage_)) Work*(new Work(std::forward<F>(work)));
+      operations_ = &kOnHeap<Work>;
+    }
+  }
+  Block(Block&& other) noexcept { take(other); }
+  Block& operator=(Block&& other) noexcept {
+    if (this != &other) {
+      reset();
+      take(other);
+    }
+    return *this;
+  }
+  Block(const Block&) = delete;
+  Block& operator=(const Block&) = delete;
+  ~Block() { reset(); }
+
+  explicit operator bool() const { return operations_ != nullptr; }
+  void operator()() { operations_->run(storage_); }
+
+ private:
+  struct Operations {
+    void (*run)(void* storage);
+    void (*move)(void* from, void* to);
+    void (*destroy)(void* storage);
+  };
+
+  template <class Work>
+  static constexpr bool fitsInPlace() {
+    return sizeof(Work) <= kInlineBytes && alignof(Work) <= alignof(std::max_align_t) &&
+           std::is_nothrow_move_constructible_v<Work>;
+  }
+  template <class Work>
+  static constexpr Operations kInPlace = {
+      [](void* storage) { (*static_cast<Work*>(storage))(); },
+      [](void* from, void* to) {
+        ::new (to) Work(std::move(*static_cast<Work*>(from)));
+        std::destroy_at(static_cast<Work*>(from));
+      },
+      [](void* storage) { std::destroy_at(static_cast<Work*>(storage)); }};
+  template <class Work>
+  static constexpr Operations kOnHeap = {
+      [](void* storage) { (**static_cast<Work**>(storage))(); },
+      [](void* from, void* to) { ::new (to) Work*(*static_cast<Work**>(from)); },
+      [](void* storage) { delete *static_cast<Work**>(storage); }};
+
+  void take(Block& other) noexcept {
+    operations_ = std::exchange(other.operations_, nullptr);
+    if (operations_ != nullptr) operations_->move(other.storage_, storage_);
+  }
+  void reset() noexcept {
+    if (operations_ != nullptr) std::exchange(operations_, nullptr)->destroy(storage_);
+  }
+
+  const Operations* operations_ = nullptr;
+  alignas(std::max_align_t) std::byte storage_[kInlineBytes];
+};
+
+}  // namespace quarvel

@@ -1,0 +1,24 @@
+#pragma once
+
+#include <chrono>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace quarvel {
+
+/// A point in time: microseconds since 1970-01-01T00:00:00Z.
+using Date = std::chrono::sys_time<std::chrono::microseconds>;
+
+/// The dates that have an RFC 3339 text: years 1 to 9999.
+inline constexpr Date kEarliestDate{std::chrono::seconds{-62'135'596'800}};
+inline constexpr Date kLatestDate{std::chrono::microseconds{253'402'300'799'999'999}};
+
+/// RFC 3339 in UTC with microseconds: "2026-01-31T13:25:01.123456Z".
+[[nodiscard]] std::string DateText(Date date);
+
+/// Reads RFC 3339 text with up to nine digits of a second (what is finer than a microsecond is cut
+/// off) and "Z" or a numeric offset. None when it is no such text.
+[[nodiscard]] std::optional<Date> DateFromText(std::string_view text);
+
+}  // namespace quarvel

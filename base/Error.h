@@ -1,0 +1,50 @@
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <utility>
+#include <variant>
+
+#include "base/Value.h"
+
+namespace quarvel {
+
+/// Why something did not happen. `userInfo` may hold "reason", a sentence that says what was wrong
+/// and what is allowed.
+struct Error {
+  std::string domain;
+  std::int64_t code = 0;
+  Dictionary userInfo;
+
+  /// An error whose `userInfo` holds just the reason.
+  [[nodiscard]] static Error because(std::string domain, std::int64_t code, std::string reason);
+  /// "domain code: reason", or "domain code" when there is no reason.
+  [[nodiscard]] std::string description() const;
+  bool operator==(const Error&) const = default;
+};
+
+/// A value, or why there is none.
+template <class T>
+class [[nodiscard]] Result {
+ public:
+  Result(T value) : result_(std::in_place_index<0>, std::move(value)) {}     // NOLINT(google-explicit-constructor)
+  Result(Error error) : result_(std::in_place_index<1>, std::move(error)) {}  // NOLINT(google-explicit-constructor)
+
+  [[nodiscard]] bool ok() const { return result_.index() == 0; }
+  explicit operator bool() const { return ok(); }
+  // Precondition of the next two: ok().
+  [[nodiscard]] T& value() { return *std::get_if<0>(&result_); }
+  [[nodiscard]] const T& value() const { return *std::get_if<0>(&result_); }
+  // Precondition: !ok().
+  [[nodiscard]] Error& error() { return *std::get_if<1>(&result_); }
+  [[nodiscard]] const Error& error() const { return *std::get_if<1>(&result_); }
+
+ private:
+  std::variant<T, Error> result_;
+};
+
+/// The result of what yields nothing but may fail.
+using Outcome = Result<std::monostate>;
+inline Outcome Success() { return std::monostate{}; }
+
+}  // namespace quarvel

@@ -1,0 +1,31 @@
+#pragma once
+
+#include <string>
+#include <string_view>
+
+#include "base/Error.h"
+#include "base/Payload.h"
+#include "base/Value.h"
+
+namespace quarvel {
+
+// JSON keeps less than MessagePack does, so some values are written as text: dates as RFC 3339 with
+// microseconds, bytes as base64, the numbers that JSON lacks as "NaN", "Infinity", "-Infinity".
+// Integer keys become their decimal text. Keys keep their order.
+
+/// Appends compact JSON.
+void AppendJson(std::string& out, PayloadValue value);
+void AppendJson(std::string& out, const Value& value);
+void AppendJson(std::string& out, const Dictionary& dictionary);
+
+/// Compact JSON.
+[[nodiscard]] std::string JsonText(const Payload& payload);
+[[nodiscard]] std::string JsonText(const Value& value);
+[[nodiscard]] std::string JsonText(const Dictionary& dictionary);
+
+/// Reads one JSON text, nested at most `MessagePackScanner::kDeepest` deep. Numbers without a
+/// fraction or exponent become integers when they fit 64 bits. Errors: domain "quarvel.json", with a
+/// reason that names the offset.
+[[nodiscard]] Result<Value> ValueFromJson(std::string_view text);
+
+}  // namespace quarvel

@@ -1,0 +1,85 @@
+#pragma once
+
+#include <chrono>
+#include <condition_variable>
+#include <mutex>
+
+#include "base/ThreadAnnotations.h"
+
+namespace quarvel {
+
+/// A lock that Clang's thread-safety analysis sees. Covers few lines and calls nothing foreign.
+class QUARVEL_CAPABILITY("mutex") Mutex {
+ public:
+  Mutex() = default;
+  Mutex(const Mutex&) = delete;
+  Mutex& operator=(const Mutex&) = delete;
+
+  void lock() QUARVEL_ACQUIRE() { mutex_.lock(); }
+  void unlock() QUARVEL_RELEASE() { mutex_.unlock(); }
+
+ private:
+  friend class ConditionVariable;
+  std::mutex mutex_;
+};
+
+/// A lock that its holder may take again. Only where a locked public function calls back into its
+/// own class.
+class QUARVEL_CAPABILITY("mutex") RecursiveMutex {
+ public:
+  RecursiveMutex() = default;
+  RecursiveMutex(const RecursiveMutex&) = delete;
+  RecursiveMutex& operator=(const RecursiveMutex&) = delete;
+
+  void lock() QUARVEL_ACQUIRE() { mutex_.lock(); }
+  void unlock() QUARVEL_RELEASE() { mutex_.unlock(); }
+
+ private:
+  std::recursive_mutex mutex_;
+};
+
+/// Holds a lock for a scope.
+template <class Lock>
+class QUARVEL_SCOPED_CAPABILITY BasicMutexLock {
+ public:
+  explicit BasicMutexLock(Lock& lock) QUARVEL_ACQUIRE(lock) : lock_(lock) { lock_.lock(); }
+  ~BasicMutexLock() QUARVEL_RELEASE() { lock_.unlock(); }
+  BasicMutexLock(const BasicMutexLock&) = delete;
+  BasicMutexLock& operator=(const BasicMutexLock&) = delete;
+
+ private:
+  Lock& lock_;
+};
+
+using MutexLock = BasicMutexLock<Mutex>;
+using RecursiveMutexLock = BasicMutexLock<RecursiveMutex>;
+
+/// Waiting for a change of what a `Mutex` guards. Waits are written as loops: the analysis does not
+/// look into predicates. For the platform and the client library; the core of the service waits in
+/// `Condition`, which its platform can see.
+class ConditionVariable {
+ public:
+  void wait(Mutex& mutex) QUARVEL_REQUIRES(mutex) {
+    std::unique_lock<std::mutex> lock(mutex.mutex_, std::adopt_lock);
+    condition_.wait(lock);
+    lock.release();
+  }
+
+  /// Returns false when `deadline` passed.
+  template <class Clock, class Duration>
+  bool waitUntil(Mutex& mutex, const std::chrono::time_point<Clock, Duration>& deadline)
+      QUARVEL_REQUIRES(mutex) {
+    std::unique_lock<std::mutex> lock(mutex.mutex_, std::adopt_lock);
+    const bool woken = condition_.wait_until(lock, deadline) == std::cv_status::no_timeout;
+    lock.release();
+    return woken;
+  }
+
+  void notifyOne() { condition_.notify_one(); }
+  void notifyAll() { condition_.notify_all(); }
+
+ private:
+  std::condition_variable condition_;
+};
+
+}  // namespace quarvel

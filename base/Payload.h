@@ -1,0 +1,165 @@
+#pragma once
+
+#include <atomic>
+#include <cstddef>
+#include <cstdint>
+#include <iterator>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+
+#include "base/Error.h"
+#include "base/Value.h"
+
+namespace quarvel {
+
+/// A look at one value inside MessagePack bytes, walked in place: no tree, no copy. Cheap to copy,
+/// valid as long as the bytes are. The bytes must be well-formed (a `MessagePackScanner` has found
+/// the value's end); that strings are UTF-8 and keys are of a kind that is allowed is known only
+/// inside a `Payload`.
+class PayloadValue {
+ public:
+  using Kind = Value::Kind;
+  class Items;
+  class Entries;
+
+  /// The value whose first byte is at `wellFormed`.
+  explicit PayloadValue(const char* wellFormed) : at_(wellFormed) {}
+
+  /// Extension values are dates: no other extension is allowed in a payload.
+  [[nodiscard]] Kind kind() const;
+  [[nodiscard]] bool isNil() const { return kind() == Kind::nil; }
+
+  // Each is none when the value is of another kind. The integers accept every integer form whose
+  // number fits.
+  [[nodiscard]] std::optional<bool> boolean() const;
+  [[nodiscard]] std::optional<std::int64_t> integer() const;
+  [[nodiscard]] std::optional<std::uint64_t> unsignedInteger() const;
+  [[nodiscard]] std::optional<double> real() const;
+  [[nodiscard]] std::optional<std::string_view> string() const;
+  [[nodiscard]] std::optional<std::string_view> bytes() const;
+  [[nodiscard]] std::optional<Date> date() const;
+
+  /// How many items a list, or entries a dictionary, holds; 0 for other kinds.
+  [[nodiscard]] std::size_t count() const;
+  /// For range-for over a list's values; empty for other kinds.
+  [[nodiscard]] Items items() const;
+  /// For range-for over a dictionary's entries in the order received; empty for other kinds.
+  [[nodiscard]] Entries entries() const;
+  /// A dictionary's value under a key; none for other kinds.
+  [[nodiscard]] std::optional<PayloadValue> find(std::string_view key) const;
+
+  /// The value's own MessagePack bytes.
+  [[nodiscard]] std::string_view encoded() const;
+  /// The same value as a tree.
+  [[nodiscard]] Value toValue() const;
+  [[nodiscard]] Dictionary toDictionary() const;
+
+ private:
+  friend class Payload;
+  const char* at_;
+};
+
+/// One entry of a dictionary. `key` is a string or an integer inside a `Payload`.
+struct PayloadEntry {
+  PayloadValue key;
+  PayloadValue value;
+};
+
+class PayloadValue::Items {
+ public:
+  class Iterator {
+   public:
+    Iterator(const char* at, std::size_t left) : at_(at), left_(left) {}
+    PayloadValue operator*() const { return PayloadValue(at_); }
+    Iterator& operator++();
+    bool operator==(std::default_sentinel_t) const { return left_ == 0; }
+
+   private:
+    const char* at_;
+    std::size_t left_;
+  };
+  Items(const char* first, std::size_t count) : first_(first), count_(count) {}
+  [[nodiscard]] Iterator begin() const { return {first_, count_}; }
+  [[nodiscard]] std::default_sentinel_t end() const { return {}; }
+
+ private:
+  const char* first_;
+  std::size_t count_;
+};
+
+class PayloadValue::Entries {
+ public:
+  class Iterator {
+   public:
+    Iterator(const char* at, std::size_t left);
+    PayloadEntry operator*() const { return {PayloadValue(at_), PayloadValue(value_)}; }
+    Iterator& operator++();
+    bool operator==(std::default_sentinel_t) const { return left_ == 0; }
+
+   private:
+    const char* at_;
+    const char* value_ = nullptr;
+    std::size_t left_;
+  };
+  Entries(const char* first, std::size_t count) : first_(first), count_(count) {}
+  [[nodiscard]] Iterator begin() const { return {first_, count_}; }
+  [[nodiscard]] std::default_sentinel_t end() const { return {}; }
+
+ private:
+  const char* first_;
+  std::size_t count_;
+};
+
+/// What a client sends: a dictionary as one immutable, shared block of its own MessagePack bytes.
+/// Its strings are UTF-8, its keys strings or integers, its dates have an RFC 3339 text, no key
+/// stands twice in one dictionary. Copying shares the block; safe to read from every thread.
+class Payload {
+ public:
+  /// The empty dictionary.
+  Payload();
+  /// Copies a well-formed value (nesting at most `MessagePackScanner::kDeepest`) and checks that it
+  /// is a payload. Of equal keys the last one stays. Errors: domain "quarvel.payload", with a reason.
+  [[nodiscard]] static Result<Payload> from(PayloadValue dictionary);
+  explicit Payload(const Dictionary& dictionary);
+
+  Payload(const Payload& other) noexcept;
+  Payload(Payload&& other) noexcept : block_(std::exchange(other.block_, nullptr)) {}
+  Payload& operator=(Payload other) noexcept {
+    std::swap(block_, other.block_);
+    return *this;
+  }
+  ~Payload();
+
+  [[nodiscard]] PayloadValue root() const { return PayloadValue(bytes()); }
+  [[nodiscard]] std::size_t count() const { return root().count(); }
+  [[nodiscard]] bool empty() const { return count() == 0; }
+  [[nodiscard]] auto begin() const;
+  [[nodiscard]] auto end() const;
+  [[nodiscard]] std::optional<PayloadValue> find(std::string_view key) const {
+    return root().find(key);
+  }
+  [[nodiscard]] std::string_view encoded() const;
+
+  /// The payload with `from` replaced by `to` in its own string keys; nested dictionaries are left
+  /// as they are. Of keys that become equal the last one stays. Shares the block when nothing
+  /// changes.
+  [[nodiscard]] Payload replacingInKeys(char from, char to) const;
+
+  /// Whether both are the same block, or hold the same bytes.
+  bool operator==(const Payload& other) const { return encoded() == other.encoded(); }
+  [[nodiscard]] bool sharesBlockWith(const Payload& other) const { return block_ == other.block_; }
+
+ private:
+  struct Block;
+  explicit Payload(std::string_view encoded);
+  [[nodiscard]] const char* bytes() const;
+
+  Block* block_;
+};
+
+inline auto Payload::begin() const { return root().entries().begin(); }
+inline auto Payload::end() const { return std::default_sentinel; }
+
+}  // namespace quarvel

@@ -1,0 +1,166 @@
+#pragma once
+
+#include <concepts>
+#include <cstddef>
+#include <cstdint>
+#include <initializer_list>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <unordered_map>
+#include <utility>
+#include <variant>
+#include <vector>
+
+#include "base/Date.h"
+
+namespace quarvel {
+
+class Value;
+class Dictionary;
+using List = std::vector<Value>;
+
+/// Octets that are not text.
+struct Bytes {
+  std::string octets;
+  bool operator==(const Bytes&) const = default;
+};
+
+/// A dictionary's key: a string or an integer. An unsigned integer only above the signed range, so
+/// that equal numbers are equal keys.
+class Key {
+ public:
+  Key(std::string text) : key_(std::move(text)) {}          // NOLINT(google-explicit-constructor)
+  Key(std::string_view text) : key_(std::string(text)) {}   // NOLINT(google-explicit-constructor)
+  Key(const char* text) : key_(std::string(text)) {}        // NOLINT(google-explicit-constructor)
+  template <std::integral Integer>
+  Key(Integer integer) {  // NOLINT(google-explicit-constructor)
+    if (std::in_range<std::int64_t>(integer)) {
+      key_ = static_cast<std::int64_t>(integer);
+    } else {
+      key_ = static_cast<std::uint64_t>(integer);
+    }
+  }
+
+  [[nodiscard]] const std::string* string() const { return std::get_if<std::string>(&key_); }
+  [[nodiscard]] const std::int64_t* integer() const { return std::get_if<std::int64_t>(&key_); }
+  [[nodiscard]] const std::uint64_t* unsignedInteger() const {
+    return std::get_if<std::uint64_t>(&key_);
+  }
+  [[nodiscard]] std::size_t hash() const {
+    return std::hash<std::variant<std::string, std::int64_t, std::uint64_t>>{}(key_);
+  }
+  bool operator==(const Key&) const = default;
+
+ private:
+  std::variant<std::string, std::int64_t, std::uint64_t> key_;
+};
+
+/// A tree of property-list values that the service builds and changes itself: user information,
+/// defaults, session info, summaries. Numbers keep their kind: signed 64-bit, unsigned 64-bit (only
+/// above the signed range), double and boolean are different. Strings are UTF-8.
+/// Not synchronised: one thread at a time, or a lock around it.
+class Value {
+ public:
+  enum class Kind : std::uint8_t {
+    nil, boolean, integer, unsignedInteger, real, string, bytes, date, list, dictionary
+  };
+
+  Value() = default;
+  Value(std::nullptr_t) {}                                   // NOLINT(google-explicit-constructor)
+  Value(std::same_as<bool> auto boolean) : value_(boolean) {}  // NOLINT(google-explicit-constructor)
+  template <std::integral Integer>
+    requires(!std::same_as<Integer, bool>)
+  Value(Integer integer) {  // NOLINT(google-explicit-constructor)
+    if (std::in_range<std::int64_t>(integer)) {
+      value_ = static_cast<std::int64_t>(integer);
+    } else {
+      value_ = static_cast<std::uint64_t>(integer);
+    }
+  }
+  Value(double real) : value_(real) {}                       // NOLINT(google-explicit-constructor)
+  Value(std::string text) : value_(std::move(text)) {}       // NOLINT(google-explicit-constructor)
+  Value(std::string_view text) : value_(std::string(text)) {}  // NOLINT(google-explicit-constructor)
+  Value(const char* text) : value_(std::string(text)) {}     // NOLINT(google-explicit-constructor)
+  Value(Bytes bytes) : value_(std::move(bytes)) {}           // NOLINT(google-explicit-constructor)
+  Value(Date date) : value_(date) {}                         // NOLINT(google-explicit-constructor)
+  Value(List list);                                          // NOLINT(google-explicit-constructor)
+  Value(Dictionary dictionary);                              // NOLINT(google-explicit-constructor)
+
+  [[nodiscard]] Kind kind() const { return static_cast<Kind>(value_.index()); }
+  [[nodiscard]] bool isNil() const { return kind() == Kind::nil; }
+
+  // Each is null when the value is of another kind.
+  [[nodiscard]] const bool* boolean() const { return std::get_if<bool>(&value_); }
+  [[nodiscard]] const std::int64_t* integer() const { return std::get_if<std::int64_t>(&value_); }
+  [[nodiscard]] const std::uint64_t* unsignedInteger() const {
+    return std::get_if<std::uint64_t>(&value_);
+  }
+  [[nodiscard]] const double* real() const { return std::get_if<double>(&value_); }
+  [[nodiscard]] const std::string* string() const { return std::get_if<std::string>(&value_); }
+  [[nodiscard]] const Bytes* bytes() const { return std::get_if<Bytes>(&value_); }
+  [[nodiscard]] const Date* date() const { return std::get_if<Date>(&value_); }
+  [[nodiscard]] const List* list() const { return std::get_if<List>(&value_); }
+  [[nodiscard]] const Dictionary* dictionary() const;
+
+  bool operator==(const Value& other) const;
+
+ private:
+  // A dictionary is held behind a pointer-sized box since it is not complete here.
+  class DictionaryBox {
+   public:
+    explicit DictionaryBox(Dictionary dictionary);
+    DictionaryBox(const DictionaryBox& other);
+    DictionaryBox(DictionaryBox&& other) noexcept;
+    DictionaryBox& operator=(DictionaryBox other) noexcept;
+    ~DictionaryBox();
+    [[nodiscard]] const Dictionary& get() const { return *dictionary_; }
+    bool operator==(const DictionaryBox& other) const;
+
+   private:
+    Dictionary* dictionary_;
+  };
+
+  // In the order of `Kind`.
+  std::variant<std::monostate, bool, std::int64_t, std::uint64_t, double, std::string, Bytes, Date,
+               List, DictionaryBox>
+      value_;
+};
+
+/// Keys to values, enumerated in the order in which the keys were first set. Two dictionaries are
+/// equal when they hold equal entries, in whatever order.
+class Dictionary {
+ public:
+  using Entry = std::pair<Key, Value>;
+
+  Dictionary() = default;
+  Dictionary(std::initializer_list<Entry> entries);
+
+  /// Null when there is no such key. Valid until the dictionary changes.
+  [[nodiscard]] const Value* find(const Key& key) const;
+  /// A new value replaces an old one in its place.
+  void set(Key key, Value value);
+  /// Sets every entry of `other`; nothing is removed.
+  void merge(const Dictionary& other);
+
+  [[nodiscard]] std::size_t size() const { return entries_.size(); }
+  [[nodiscard]] bool empty() const { return entries_.empty(); }
+  [[nodiscard]] auto begin() const { return entries_.begin(); }
+  [[nodiscard]] auto end() const { return entries_.end(); }
+
+  bool operator==(const Dictionary& other) const;
+
+ private:
+  struct KeyHash {
+    std::size_t operator()(const Key& key) const { return key.hash(); }
+  };
+  /// From here on an index is kept, so that a large hostile dictionary costs no quadratic time.
+  static constexpr std::size_t kIndexedFrom = 16;
+
+  [[nodiscard]] std::size_t indexOf(const Key& key) const;
+
+  std::vector<Entry> entries_;
+  std::unordered_map<Key, std::size_t, KeyHash> index_;
+};
+
+}  // namespace quarvel

@@ -1,0 +1,36 @@
+# What every target of the project shares: the language, the warnings and the sanitizers.
+set(CMAKE_CXX_STANDARD 20)
+set(CMAKE_CXX_STANDARD_REQUIRED ON)
+set(CMAKE_CXX_EXTENSIONS OFF)
+set(CMAKE_POSITION_INDEPENDENT_CODE ON)
+
+add_library(quarvel_options INTERFACE)
+target_include_directories(quarvel_options INTERFACE ${PROJECT_SOURCE_DIR})
+target_compile_options(quarvel_options INTERFACE
+  -Wall -Wextra -Wpedantic -Wshadow -Wnon-virtual-dtor -Woverloaded-virtual -Wconversion
+  -Wsign-conversion -Wold-style-cast -Wcast-qual -Wformat=2 -Wundef -Werror
+  $<$<CXX_COMPILER_ID:Clang>:-Wthread-safety>)
+if(QUARVEL_SANITIZE)
+  target_compile_options(quarvel_options INTERFACE
+    -fsanitize=${QUARVEL_SANITIZE} -fno-sanitize-recover=all -fno-omit-frame-pointer)
+  target_link_options(quarvel_options INTERFACE -fsanitize=${QUARVEL_SANITIZE})
+endif()
+
+# quarvel_library(NAME SOURCES … LINKS …): one static library a folder; LINKS are its PUBLIC dependencies.
+function(quarvel_library NAME)
+  cmake_parse_arguments(ARG "" "" "SOURCES;LINKS;PRIVATE_LINKS" ${ARGN})
+  add_library(${NAME} STATIC ${ARG_SOURCES})
+  target_link_libraries(${NAME} PUBLIC ${ARG_LINKS} PRIVATE quarvel_options ${ARG_PRIVATE_LINKS})
+  target_include_directories(${NAME} PUBLIC $<BUILD_INTERFACE:${PROJECT_SOURCE_DIR}>)
+endfunction()
+
+# quarvel_test(NAME SOURCES … LINKS … [TIMEOUT seconds]): a GoogleTest program that ctest runs case by case.
+function(quarvel_test NAME)
+  cmake_parse_arguments(ARG "" "TIMEOUT" "SOURCES;LINKS" ${ARGN})
+  if(NOT ARG_TIMEOUT)
+    set(ARG_TIMEOUT 120)
+  endif()
+  add_executable(${NAME} ${ARG_SOURCES})
+  target_link_libraries(${NAME} PRIVATE quarvel_options ${ARG_LINKS} GTest::gmock GTest::gtest_main)
+  gtest_discover_tests(${NAME} PROPERTIES TIMEOUT ${ARG_TIMEOUT} DISCOVERY_TIMEOUT 60)
+endfunction()

@@ -1,0 +1,156 @@
+#pragma once
+
+#include <concepts>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <span>
+#include <string>
+#include <string_view>
+#include <tuple>
+#include <utility>
+#include <vector>
+
+#include "base/Payload.h"
+#include "base/Value.h"
+#include "platform/Reply.h"
+
+namespace quarvel {
+
+/// An object whose operations a connection's client may call.
+class ExportedObject {
+ public:
+  virtual ~ExportedObject() = default;
+};
+
+/// One operation: how a call's arguments, as they came over the wire, become a typed call.
+struct ExportedMethod {
+  /// Checks the arguments and, when they fit, calls the operation on `object`, which must be of the
+  /// interface's class. Returns what was wrong with them, a sentence, when it did not call.
+  using Invoke = std::optional<std::string> (*)(const ExportedMethod& method, ExportedObject& object,
+                                                std::span<const PayloadValue> arguments,
+                                                std::shared_ptr<ReplySink> reply);
+
+  std::string_view name;  // the full keyword name, "setConfiguration:forReporterID:reply:"
+  std::size_t argumentCount;  // without the reply
+  Invoke invoke;
+
+  /// The keyword in front of argument `index`.
+  [[nodiscard]] std::string_view keyword(std::size_t index) const;
+};
+
+/// A protocol that can be exported: its name and its operations. Lives as long as the process.
+struct ExportedInterface {
+  std::string_view name;
+  std::span<const ExportedMethod> methods;
+
+  /// Null when there is no such operation.
+  [[nodiscard]] const ExportedMethod* find(std::string_view method) const;
+};
+
+// How one argument is read. `decode` returns false when the value is not what `expected` says, and
+// leaves a more precise `fault` where it has one.
+template <class T>
+struct ExportedArgument;
+
+template <std::integral Integer>
+  requires(!std::same_as<Integer, bool>)
+struct ExportedArgument<Integer> {
+  static bool decode(PayloadValue value, Integer& out, std::string& fault);
+  static std::string expected();
+};
+
+template <>
+struct ExportedArgument<std::optional<Payload>> {
+  static bool decode(PayloadValue value, std::optional<Payload>& out, std::string& fault);
+  static std::string expected();
+};
+
+template <>
+struct ExportedArgument<std::optional<Dictionary>> {
+  static bool decode(PayloadValue value, std::optional<Dictionary>& out, std::string& fault);
+  static std::string expected();
+};
+
+template <>
+struct ExportedArgument<std::optional<std::vector<std::int64_t>>> {
+  static bool decode(PayloadValue value, std::optional<std::vector<std::int64_t>>& out,
+                     std::string& fault);
+  static std::string expected();
+};
+
+/// The sentences for arguments that do not fit.
+[[nodiscard]] std::string WrongArgumentCount(const ExportedMethod& method, std::size_t given);
+[[nodiscard]] std::string WrongArgument(const ExportedMethod& method, std::size_t index,
+                                        std::string_view expected, std::string_view fault);
+
+template <auto Operation>
+struct ExportedOperation;
+
+template <class Object, class... Parameters, void (Object::*Operation)(Parameters...)>
+struct ExportedOperation<Operation> {
+  static_assert(std::derived_from<Object, ExportedObject>);
+  static constexpr std::size_t kArguments = sizeof...(Parameters) - 1;
+  using Values = std::tuple<std::remove_cvref_t<Parameters>...>;
+
+  static std::optional<std::string> invoke(const ExportedMethod& method, ExportedObject& object,
+                                           std::span<const PayloadValue> arguments,
+                                           std::shared_ptr<ReplySink> reply) {
+    if (arguments.size() != kArguments) return WrongArgumentCount(method, arguments.size());
+    Values values;
+    std::optional<std::string> wrong;
+    decode(method, arguments, values, wrong, std::make_index_sequence<kArguments>{});
+    if (wrong) return wrong;
+    using ReplyType = std::tuple_element_t<kArguments, Values>;
+    std::get<kArguments>(values) = ReplyType(std::move(reply));
+    std::apply(
+        [&object](auto&&... value) {
+          (static_cast<Object&>(object).*Operation)(std::forward<decltype(value)>(value)...);
+        },
+        std::move(values));
+    return std::nullopt;
+  }
+
+ private:
+  template <std::size_t... Index>
+  static void decode(const ExportedMethod& method, std::span<const PayloadValue> arguments,
+                     Values& values, std::optional<std::string>& wrong,
+                     std::index_sequence<Index...>) {
+    const auto decodeOne = [&]<class T>(std::size_t index, T& out) {
+      std::string fault;
+      if (ExportedArgument<T>::decode(arguments[index], out, fault)) return true;
+      wrong = WrongArgument(method, index, ExportedArgument<T>::expected(), fault);
+      return false;
+    };
+    (void)(decodeOne(Index, std::get<Index>(values)) && ...);
+  }
+};
+
+/// Describes one operation, a member function of the exported class whose last parameter is its reply.
+template <auto Operation>
+constexpr ExportedMethod Exported(std::string_view name) {
+  return {name, ExportedOperation<Operation>::kArguments, &ExportedOperation<Operation>::invoke};
+}
+
+template <std::integral Integer>
+  requires(!std::same_as<Integer, bool>)
+bool ExportedArgument<Integer>::decode(PayloadValue value, Integer& out, std::string&) {
+  if (const auto integer = value.integer(); integer && std::in_range<Integer>(*integer)) {
+    out = static_cast<Integer>(*integer);
+    return true;
+  }
+  if (const auto integer = value.unsignedInteger(); integer && std::in_range<Integer>(*integer)) {
+    out = static_cast<Integer>(*integer);
+    return true;
+  }
+  return false;
+}
+
+template <std::integral Integer>
+  requires(!std::same_as<Integer, bool>)
+std::string ExportedArgument<Integer>::expected() {
+  return std::string(std::is_signed_v<Integer> ? "a signed " : "an unsigned ") +
+         std::to_string(sizeof(Integer) * 8) + "-bit integer";
+}
+
+}  // namespace quarvel

@@ -1,0 +1,68 @@
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <utility>
+#include <vector>
+
+#include "base/Error.h"
+#include "base/Value.h"
+
+namespace quarvel {
+
+/// Where the answer to one call goes. The connection facility delivers the first answer and ignores
+/// every later one; an answer that is never given is never delivered. From any thread, without
+/// blocking; an answer to a client that has gone is ignored.
+class ReplySink {
+ public:
+  virtual ~ReplySink() = default;
+  virtual void result(Value value) = 0;
+  virtual void error(const Error& error) = 0;
+};
+
+/// A reply callback. Copies share the one answer. An absent reply (the default) may be called and
+/// does nothing.
+template <class T>
+class Reply {
+ public:
+  Reply() = default;
+  explicit Reply(std::shared_ptr<ReplySink> sink) : sink_(std::move(sink)) {}
+
+  void operator()(T answer) const {
+    if (sink_) sink_->result(Value(std::move(answer)));
+  }
+  explicit operator bool() const { return sink_ != nullptr; }
+
+ private:
+  std::shared_ptr<ReplySink> sink_;
+};
+
+/// Takes an error, or none for success.
+template <>
+class Reply<std::optional<Error>> {
+ public:
+  Reply() = default;
+  explicit Reply(std::shared_ptr<ReplySink> sink) : sink_(std::move(sink)) {}
+
+  void operator()(const std::optional<Error>& answer) const {
+    if (!sink_) return;
+    if (answer) {
+      sink_->error(*answer);
+    } else {
+      sink_->result(nullptr);
+    }
+  }
+  explicit operator bool() const { return sink_ != nullptr; }
+
+ private:
+  std::shared_ptr<ReplySink> sink_;
+};
+
+using BoolReply = Reply<bool>;
+using ServiceTypeReply = Reply<std::uint16_t>;
+using DictionaryReply = Reply<Dictionary>;
+using ListReply = Reply<List>;
+using ErrorReply = Reply<std::optional<Error>>;
+
+}  // namespace quarvel

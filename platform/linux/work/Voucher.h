@@ -1,0 +1,72 @@
+#pragma once
+
+#include <atomic>
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <utility>
+
+namespace quarvel {
+
+/// Stands for one call of a client for as long as any work that came of it is still to be done.
+/// A block that is queued while a voucher is current holds it until the block has run, and so do the
+/// blocks that this one queues; so a connection knows how much of what it took in is still waiting
+/// anywhere, without the blocks knowing of connections.
+class Voucher {
+ public:
+  virtual ~Voucher() = default;
+  /// The size of the call, for bounds on bytes.
+  [[nodiscard]] virtual std::size_t bytes() const = 0;
+
+ protected:
+  /// Called once, when the last hold goes, on whatever thread that is. Must not block.
+  virtual void completed() = 0;
+
+ private:
+  friend class VoucherHold;
+  std::atomic<std::uint32_t> holds_{0};
+};
+
+/// Keeps a voucher open. May be empty.
+class VoucherHold {
+ public:
+  VoucherHold() = default;
+  explicit VoucherHold(std::shared_ptr<Voucher> voucher) : voucher_(std::move(voucher)) {
+    if (voucher_) voucher_->holds_.fetch_add(1, std::memory_order_relaxed);
+  }
+  VoucherHold(VoucherHold&& other) noexcept : voucher_(std::move(other.voucher_)) {}
+  VoucherHold& operator=(VoucherHold&& other) noexcept {
+    std::swap(voucher_, other.voucher_);
+    return *this;
+  }
+  VoucherHold(const VoucherHold&) = delete;
+  VoucherHold& operator=(const VoucherHold&) = delete;
+  ~VoucherHold() {
+    if (voucher_ && voucher_->holds_.fetch_sub(1, std::memory_order_acq_rel) == 1) {
+      voucher_->completed();
+    }
+  }
+
+  [[nodiscard]] const std::shared_ptr<Voucher>& voucher() const { return voucher_; }
+  explicit operator bool() const { return voucher_ != nullptr; }
+
+  /// A further hold on the voucher that is current on this thread; empty when none is.
+  [[nodiscard]] static VoucherHold current();
+
+ private:
+  std::shared_ptr<Voucher> voucher_;
+};
+
+/// Makes a voucher (or none) current on this thread for a scope.
+class VoucherScope {
+ public:
+  explicit VoucherScope(const VoucherHold& hold);
+  ~VoucherScope();
+  VoucherScope(const VoucherScope&) = delete;
+  VoucherScope& operator=(const VoucherScope&) = delete;
+
+ private:
+  const VoucherHold* previous_;
+};
+
+}  // namespace quarvel
