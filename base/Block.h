@@ -9,16 +9,16 @@
 namespace quarvel {
 
 /// A piece of work to be run once: a callable without arguments or result, moved and never copied,
-/// so that it can own what it works on. Callables of up to `kInlineBytes` are held in place, without
-/// an allocation.
+/// so that it can own what it works on. Callables of up to `kInlineBytes` are held in place,
+/// without an allocation.
 class Block {
  public:
   static constexpr std::size_t kInlineBytes = 88;
 
   Block() = default;
   template <class F>
-    requires(!std::is_same_v<std::remove_cvref_t<F>, Block> && std::is_invocable_v<F&>)
-  Block(F&& work) {  // NOLINT(google-explicit-constructor): a lambda is a block
+  requires(!std::is_same_v<std::remove_cvref_t<F>, Block> && std::is_invocable_v<F&>)
+      Block(F&& work) {  // NOLINT(google-explicit-constructor): a lambda is a block
     using Work = std::remove_cvref_t<F>;
     if constexpr (fitsInPlace<Work>()) {
       ::new (static_cast<void*>(storage_)) Work(std::forward<F>(work));

@@ -27,8 +27,10 @@ struct Error {
 template <class T>
 class [[nodiscard]] Result {
  public:
-  Result(T value) : result_(std::in_place_index<0>, std::move(value)) {}     // NOLINT(google-explicit-constructor)
-  Result(Error error) : result_(std::in_place_index<1>, std::move(error)) {}  // NOLINT(google-explicit-constructor)
+  Result(T value)
+      : result_(std::in_place_index<0>, std::move(value)) {}  // NOLINT(google-explicit-constructor)
+  Result(Error error)
+      : result_(std::in_place_index<1>, std::move(error)) {}  // NOLINT(google-explicit-constructor)
 
   [[nodiscard]] bool ok() const { return result_.index() == 0; }
   explicit operator bool() const { return ok(); }
@@ -45,6 +47,8 @@ class [[nodiscard]] Result {
 
 /// The result of what yields nothing but may fail.
 using Outcome = Result<std::monostate>;
-inline Outcome Success() { return std::monostate{}; }
+inline Outcome Success() {
+  return std::monostate{};
+}
 
 }  // namespace quarvel

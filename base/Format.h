@@ -14,14 +14,20 @@ inline constexpr std::string_view kAbsentText = "(null)";
 
 // How a log line prints an object: dictionaries and lists as compact JSON, a string as it stands,
 // what is absent as "(null)".
-[[nodiscard]] inline std::string Described(const Dictionary& dictionary) { return JsonText(dictionary); }
+[[nodiscard]] inline std::string Described(const Dictionary& dictionary) {
+  return JsonText(dictionary);
+}
 [[nodiscard]] inline std::string Described(const Value& value) {
   if (value.isNil()) return std::string(kAbsentText);
   if (const std::string* text = value.string()) return *text;
   return JsonText(value);
 }
-[[nodiscard]] inline std::string Described(const Payload& payload) { return JsonText(payload); }
-[[nodiscard]] inline std::string Described(std::string_view text) { return std::string(text); }
+[[nodiscard]] inline std::string Described(const Payload& payload) {
+  return JsonText(payload);
+}
+[[nodiscard]] inline std::string Described(std::string_view text) {
+  return std::string(text);
+}
 template <class T>
 [[nodiscard]] std::string Described(const std::optional<T>& object) {
   return object ? Described(*object) : std::string(kAbsentText);

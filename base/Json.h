@@ -24,8 +24,8 @@ void AppendJson(std::string& out, const Dictionary& dictionary);
 [[nodiscard]] std::string JsonText(const Dictionary& dictionary);
 
 /// Reads one JSON text, nested at most `MessagePackScanner::kDeepest` deep. Numbers without a
-/// fraction or exponent become integers when they fit 64 bits. Errors: domain "quarvel.json", with a
-/// reason that names the offset.
+/// fraction or exponent become integers when they fit 64 bits. Errors: domain "quarvel.json", with
+/// a reason that names the offset.
 [[nodiscard]] Result<Value> ValueFromJson(std::string_view text);
 
 }  // namespace quarvel

@@ -39,12 +39,11 @@ class MessagePackScanner {
 
  private:
   Progress fail(std::string reason);
-  Progress begin(std::string_view bytes, std::size_t headerBytes, std::uint64_t items);
 
   std::size_t maximumBytes_;
   unsigned maximumDepth_;
-  std::size_t position_ = 0;          // every byte before it has been looked at, or is to be skipped
-  unsigned depth_ = 0;                // containers that are open
+  std::size_t position_ = 0;  // every byte before it has been looked at, or is to be skipped
+  unsigned depth_ = 0;        // containers that are open
   std::array<std::uint64_t, kDeepest> remaining_{};  // values still to come in each
   std::string fault_;
 };

@@ -120,7 +120,8 @@ class Payload {
   /// The empty dictionary.
   Payload();
   /// Copies a well-formed value (nesting at most `MessagePackScanner::kDeepest`) and checks that it
-  /// is a payload. Of equal keys the last one stays. Errors: domain "quarvel.payload", with a reason.
+  /// is a payload. Of equal keys the last one stays. Errors: domain "quarvel.payload", with a
+  /// reason.
   [[nodiscard]] static Result<Payload> from(PayloadValue dictionary);
   explicit Payload(const Dictionary& dictionary);
 
@@ -159,7 +160,11 @@ class Payload {
   Block* block_;
 };
 
-inline auto Payload::begin() const { return root().entries().begin(); }
-inline auto Payload::end() const { return std::default_sentinel; }
+inline auto Payload::begin() const {
+  return root().entries().begin();
+}
+inline auto Payload::end() const {
+  return std::default_sentinel;
+}
 
 }  // namespace quarvel

@@ -30,9 +30,9 @@ struct Bytes {
 /// that equal numbers are equal keys.
 class Key {
  public:
-  Key(std::string text) : key_(std::move(text)) {}          // NOLINT(google-explicit-constructor)
-  Key(std::string_view text) : key_(std::string(text)) {}   // NOLINT(google-explicit-constructor)
-  Key(const char* text) : key_(std::string(text)) {}        // NOLINT(google-explicit-constructor)
+  Key(std::string text) : key_(std::move(text)) {}         // NOLINT(google-explicit-constructor)
+  Key(std::string_view text) : key_(std::string(text)) {}  // NOLINT(google-explicit-constructor)
+  Key(const char* text) : key_(std::string(text)) {}       // NOLINT(google-explicit-constructor)
   template <std::integral Integer>
   Key(Integer integer) {  // NOLINT(google-explicit-constructor)
     if (std::in_range<std::int64_t>(integer)) {
@@ -63,29 +63,40 @@ class Key {
 class Value {
  public:
   enum class Kind : std::uint8_t {
-    nil, boolean, integer, unsignedInteger, real, string, bytes, date, list, dictionary
+    nil,
+    boolean,
+    integer,
+    unsignedInteger,
+    real,
+    string,
+    bytes,
+    date,
+    list,
+    dictionary
   };
 
   Value() = default;
-  Value(std::nullptr_t) {}                                   // NOLINT(google-explicit-constructor)
-  Value(std::same_as<bool> auto boolean) : value_(boolean) {}  // NOLINT(google-explicit-constructor)
+  Value(std::nullptr_t) {}  // NOLINT(google-explicit-constructor)
+  Value(std::same_as<bool> auto boolean)
+      : value_(boolean) {}  // NOLINT(google-explicit-constructor)
   template <std::integral Integer>
-    requires(!std::same_as<Integer, bool>)
-  Value(Integer integer) {  // NOLINT(google-explicit-constructor)
+  requires(!std::same_as<Integer, bool>)
+      Value(Integer integer) {  // NOLINT(google-explicit-constructor)
     if (std::in_range<std::int64_t>(integer)) {
       value_ = static_cast<std::int64_t>(integer);
     } else {
       value_ = static_cast<std::uint64_t>(integer);
     }
   }
-  Value(double real) : value_(real) {}                       // NOLINT(google-explicit-constructor)
-  Value(std::string text) : value_(std::move(text)) {}       // NOLINT(google-explicit-constructor)
-  Value(std::string_view text) : value_(std::string(text)) {}  // NOLINT(google-explicit-constructor)
-  Value(const char* text) : value_(std::string(text)) {}     // NOLINT(google-explicit-constructor)
-  Value(Bytes bytes) : value_(std::move(bytes)) {}           // NOLINT(google-explicit-constructor)
-  Value(Date date) : value_(date) {}                         // NOLINT(google-explicit-constructor)
-  Value(List list);                                          // NOLINT(google-explicit-constructor)
-  Value(Dictionary dictionary);                              // NOLINT(google-explicit-constructor)
+  Value(double real) : value_(real) {}                  // NOLINT(google-explicit-constructor)
+  Value(std::string text) : value_(std::move(text)) {}  // NOLINT(google-explicit-constructor)
+  Value(std::string_view text)
+      : value_(std::string(text)) {}                      // NOLINT(google-explicit-constructor)
+  Value(const char* text) : value_(std::string(text)) {}  // NOLINT(google-explicit-constructor)
+  Value(Bytes bytes) : value_(std::move(bytes)) {}        // NOLINT(google-explicit-constructor)
+  Value(Date date) : value_(date) {}                      // NOLINT(google-explicit-constructor)
+  Value(List list);                                       // NOLINT(google-explicit-constructor)
+  Value(Dictionary dictionary);                           // NOLINT(google-explicit-constructor)
 
   [[nodiscard]] Kind kind() const { return static_cast<Kind>(value_.index()); }
   [[nodiscard]] bool isNil() const { return kind() == Kind::nil; }

@@ -17,8 +17,9 @@ class QUARVEL_CAPABILITY("mutex") Condition {
   virtual void unlock() QUARVEL_RELEASE() = 0;
   /// Wakes one waiter, if there is one.
   virtual void signal() QUARVEL_REQUIRES(this) = 0;
-  /// Gives the lock up, waits until signalled or until the wall clock reads `deadline`, and takes the
-  /// lock again. Returns false when the deadline passed. A wake-up without a signal is possible.
+  /// Gives the lock up, waits until signalled or until the wall clock reads `deadline`, and takes
+  /// the lock again. Returns false when the deadline passed. A wake-up without a signal is
+  /// possible.
   virtual bool waitUntil(Date deadline) QUARVEL_REQUIRES(this) = 0;
 };
 

@@ -57,7 +57,9 @@ bool ExportedArgument<std::optional<Payload>>::decode(PayloadValue value,
   return decodePayload(value, out, fault);
 }
 
-std::string ExportedArgument<std::optional<Payload>>::expected() { return kDictionaryExpected; }
+std::string ExportedArgument<std::optional<Payload>>::expected() {
+  return kDictionaryExpected;
+}
 
 bool ExportedArgument<std::optional<Dictionary>>::decode(PayloadValue value,
                                                          std::optional<Dictionary>& out,
@@ -72,7 +74,9 @@ bool ExportedArgument<std::optional<Dictionary>>::decode(PayloadValue value,
   return true;
 }
 
-std::string ExportedArgument<std::optional<Dictionary>>::expected() { return kDictionaryExpected; }
+std::string ExportedArgument<std::optional<Dictionary>>::expected() {
+  return kDictionaryExpected;
+}
 
 bool ExportedArgument<std::optional<std::vector<std::int64_t>>>::decode(
     PayloadValue value, std::optional<std::vector<std::int64_t>>& out, std::string& fault) {

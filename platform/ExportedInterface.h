@@ -27,11 +27,12 @@ class ExportedObject {
 struct ExportedMethod {
   /// Checks the arguments and, when they fit, calls the operation on `object`, which must be of the
   /// interface's class. Returns what was wrong with them, a sentence, when it did not call.
-  using Invoke = std::optional<std::string> (*)(const ExportedMethod& method, ExportedObject& object,
+  using Invoke = std::optional<std::string> (*)(const ExportedMethod& method,
+                                                ExportedObject& object,
                                                 std::span<const PayloadValue> arguments,
                                                 std::shared_ptr<ReplySink> reply);
 
-  std::string_view name;  // the full keyword name, "setConfiguration:forReporterID:reply:"
+  std::string_view name;      // the full keyword name, "setConfiguration:forReporterID:reply:"
   std::size_t argumentCount;  // without the reply
   Invoke invoke;
 
@@ -54,8 +55,7 @@ template <class T>
 struct ExportedArgument;
 
 template <std::integral Integer>
-  requires(!std::same_as<Integer, bool>)
-struct ExportedArgument<Integer> {
+requires(!std::same_as<Integer, bool>) struct ExportedArgument<Integer> {
   static bool decode(PayloadValue value, Integer& out, std::string& fault);
   static std::string expected();
 };
@@ -126,15 +126,17 @@ struct ExportedOperation<Operation> {
   }
 };
 
-/// Describes one operation, a member function of the exported class whose last parameter is its reply.
+/// Describes one operation, a member function of the exported class whose last parameter is its
+/// reply.
 template <auto Operation>
 constexpr ExportedMethod Exported(std::string_view name) {
   return {name, ExportedOperation<Operation>::kArguments, &ExportedOperation<Operation>::invoke};
 }
 
 template <std::integral Integer>
-  requires(!std::same_as<Integer, bool>)
-bool ExportedArgument<Integer>::decode(PayloadValue value, Integer& out, std::string&) {
+requires(!std::same_as<Integer, bool>) bool ExportedArgument<Integer>::decode(PayloadValue value,
+                                                                              Integer& out,
+                                                                              std::string&) {
   if (const auto integer = value.integer(); integer && std::in_range<Integer>(*integer)) {
     out = static_cast<Integer>(*integer);
     return true;
@@ -147,8 +149,7 @@ bool ExportedArgument<Integer>::decode(PayloadValue value, Integer& out, std::st
 }
 
 template <std::integral Integer>
-  requires(!std::same_as<Integer, bool>)
-std::string ExportedArgument<Integer>::expected() {
+requires(!std::same_as<Integer, bool>) std::string ExportedArgument<Integer>::expected() {
   return std::string(std::is_signed_v<Integer> ? "a signed " : "an unsigned ") +
          std::to_string(sizeof(Integer) * 8) + "-bit integer";
 }

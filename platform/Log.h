@@ -19,10 +19,10 @@ enum class LogLevel : std::uint8_t {
 class LogScope;
 using LogHandle = const LogScope*;
 
-/// Registers a scope. Called once a scope; calling again with the same `code` yields the same handle.
-/// `code`: the scope's four characters, the first in the most significant byte. The texts must be
-/// string literals. `verboseKey` is the key, in the preferences domain `subsystem`, that switches the
-/// scope's verbose lines on; the facility follows it by itself.
+/// Registers a scope. Called once a scope; calling again with the same `code` yields the same
+/// handle. `code`: the scope's four characters, the first in the most significant byte. The texts
+/// must be string literals. `verboseKey` is the key, in the preferences domain `subsystem`, that
+/// switches the scope's verbose lines on; the facility follows it by itself.
 [[nodiscard]] LogHandle ZQLogRegister(std::uint32_t code, std::string_view scope,
                                       std::string_view subsystem, std::string_view verboseKey,
                                       int options, int levelMask);
@@ -51,10 +51,10 @@ constexpr std::uint32_t FourCharacterCode(const char (&text)[5]) {
 #define ZQ_FUNCTION(name) [[maybe_unused]] static constexpr const char* kFunctionName = name
 
 /// ZQ_LOG(scope, level, format, arguments…): formats (fmt) and writes when the level is enabled.
-#define ZQ_LOG(scope, level, ...)                                                              \
-  do {                                                                                         \
-    if (::quarvel::ZQLogEnabled(::quarvel::LogLevel::level, scope)) {                          \
-      ::quarvel::ZQLogWrite(scope, ::quarvel::LogLevel::level, __FILE_NAME__, __LINE__,        \
-                            kFunctionName, ::fmt::format(__VA_ARGS__));                        \
-    }                                                                                          \
+#define ZQ_LOG(scope, level, ...)                                                       \
+  do {                                                                                  \
+    if (::quarvel::ZQLogEnabled(::quarvel::LogLevel::level, scope)) {                   \
+      ::quarvel::ZQLogWrite(scope, ::quarvel::LogLevel::level, __FILE_NAME__, __LINE__, \
+                            kFunctionName, ::fmt::format(__VA_ARGS__));                 \
+    }                                                                                   \
   } while (false)

@@ -46,8 +46,8 @@ class RelmReportingSession {
   /// Hands a message over. Success means that the agent will keep it.
   virtual Outcome agentSendMessage(std::uint16_t category, std::uint16_t type,
                                    const Payload& payload) = 0;
-  /// Makes everything that was sent before safe. Returns at once; `completion` is called once, later,
-  /// on a thread of the agent, also when the session has been released meanwhile.
+  /// Makes everything that was sent before safe. Returns at once; `completion` is called once,
+  /// later, on a thread of the agent, also when the session has been released meanwhile.
   virtual void flushMessages(FlushCompletion completion) = 0;
   /// For log lines.
   [[nodiscard]] virtual std::string description() const = 0;

@@ -4,6 +4,8 @@
 
 namespace quarvel {
 
-void WorkQueue::assertCurrent() const { assert(isCurrent()); }
+void WorkQueue::assertCurrent() const {
+  assert(isCurrent());
+}
 
 }  // namespace quarvel

@@ -22,7 +22,8 @@ enum class QualityOfService { background = 9, utility = 17, userInteractive = 33
 ///   one before. A concurrent queue runs blocks in any order and several at once.
 /// - A block may wait in a `Condition`, or be held back inside a platform call: that delays its own
 ///   serial queue and nothing else.
-/// - A block is destroyed after it has run, before the next of its serial queue begins. Blocks do not
+/// - A block is destroyed after it has run, before the next of its serial queue begins. Blocks do
+/// not
 ///   throw.
 /// - A queue may be destroyed from any thread, from its own blocks too, and with blocks still
 ///   waiting: those run nevertheless.

@@ -61,9 +61,9 @@ struct Configuration {
     std::size_t connections = 4096;
   } limits;
 
-  /// The process's configuration, read on first use. When the file has an error, says so on standard
-  /// error (file, line, key, what is allowed) and ends the process with status 1. Unknown keys are
-  /// warnings in the log.
+  /// The process's configuration, read on first use. When the file has an error, says so on
+  /// standard error (file, line, key, what is allowed) and ends the process with status 1. Unknown
+  /// keys are warnings in the log.
   [[nodiscard]] static const Configuration& process();
 
   /// Reads one file; a missing file yields the defaults. `warnings` receives a sentence for each

@@ -4,8 +4,8 @@
 
 namespace quarvel {
 
-/// Where the service keeps its files: systemd's directory variables first, then the fall-backs for a
-/// run by hand. Read once per process.
+/// Where the service keeps its files: systemd's directory variables first, then the fall-backs for
+/// a run by hand. Read once per process.
 struct Directories {
   std::filesystem::path runtime;
   std::filesystem::path state;

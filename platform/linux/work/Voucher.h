@@ -9,9 +9,9 @@
 namespace quarvel {
 
 /// Stands for one call of a client for as long as any work that came of it is still to be done.
-/// A block that is queued while a voucher is current holds it until the block has run, and so do the
-/// blocks that this one queues; so a connection knows how much of what it took in is still waiting
-/// anywhere, without the blocks knowing of connections.
+/// A block that is queued while a voucher is current holds it until the block has run, and so do
+/// the blocks that this one queues; so a connection knows how much of what it took in is still
+/// waiting anywhere, without the blocks knowing of connections.
 class Voucher {
  public:
   virtual ~Voucher() = default;

@@ -1,0 +1,173 @@
+#include "base/Payload.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "base/Json.h"
+#include "base/MessagePack.h"
+
+namespace quarvel {
+namespace {
+
+using testing::HasSubstr;
+
+TEST(Payload, IsWalkedInTheOrderReceived) {
+  const Payload payload(
+      Dictionary{{"zulu", 1}, {5, List{1, "two", nullptr}}, {"alpha", Dictionary{{"k", 2.5}}}});
+  std::vector<std::string> keys;
+  for (const PayloadEntry& entry : payload) {
+    keys.emplace_back(entry.key.string() ? *entry.key.string() : "5");
+  }
+  EXPECT_THAT(keys, testing::ElementsAre("zulu", "5", "alpha"));
+  EXPECT_EQ(payload.find("alpha")->find("k")->real(), 2.5);
+  EXPECT_FALSE(payload.find("beta"));
+  EXPECT_FALSE(payload.find("zulu")->find("k"));
+  EXPECT_EQ(payload.root().items().begin(), std::default_sentinel) << "a dictionary has no items";
+  EXPECT_TRUE(Payload().empty());
+  EXPECT_EQ(Payload(), Payload(Dictionary{}));
+}
+
+TEST(Payload, RefusesWhatIsNoPayload) {
+  const struct {
+    const char* name;
+    std::string bytes;
+    const char* reason;
+  } kRows[] = {
+      {"no dictionary", {"\x90", 1}, "not a dictionary"},
+      {"list as a key", {"\x81\x90\x01", 3}, "neither a string nor an integer"},
+      {"boolean as a nested key", {"\x81\xa1k\x81\xc3\x01", 6}, "neither a string nor an integer"},
+      {"extension of another type", {"\x81\xa1k\xd4\x05\x00", 6}, "not a timestamp"},
+      {"timestamp of an unknown length", {"\x81\xa1k\xd4\xff\x00", 6}, "not a timestamp"},
+      {"timestamp with too many nanoseconds",
+       {"\x81\xa1k\xd7\xff\xff\xff\xff\xff\x00\x00\x00\x00", 13},
+       "not a timestamp"},
+      {"timestamp after the year 9999",
+       {"\x81\xa1k\xc7\x0c\xff\x00\x00\x00\x00\x7f\xff\xff\xff\xff\xff\xff\xff", 18},
+       "not a timestamp"},
+      {"stray continuation byte", {"\x81\xa1\x80\x01", 4}, "not UTF-8"},
+      {"overlong form", {"\x81\xa1k\xa2\xc0\xaf", 6}, "not UTF-8"},
+      {"surrogate", {"\x81\xa1k\xa3\xed\xa0\x80", 7}, "not UTF-8"},
+      {"above U+10FFFF", {"\x81\xa1k\xa4\xf4\x90\x80\x80", 8}, "not UTF-8"},
+      {"cut off after eight plain bytes",
+       {"\x81\xa1k\xaa"
+        "12345678\xe2\x82",
+        14},
+       "not UTF-8"},
+  };
+  for (const auto& row : kRows) {
+    MessagePackScanner scanner(1024, 4);
+    ASSERT_EQ(scanner.scan(row.bytes), MessagePackScanner::Progress::complete) << row.name;
+    const Result<Payload> payload = Payload::from(PayloadValue(row.bytes.data()));
+    ASSERT_FALSE(payload) << row.name;
+    EXPECT_THAT(payload.error().description(), HasSubstr(row.reason)) << row.name;
+  }
+}
+
+TEST(Payload, OfEqualKeysTheLastCounts) {
+  std::string many;
+  MessagePackWriter writer(many);
+  writer.dictionary(100);
+  for (int i = 0; i < 100; ++i) {
+    writer.integer(i % 50);
+    writer.integer(i);
+  }
+  const struct {
+    std::string bytes;
+    std::string json;
+  } kRows[] = {
+      {"\x82\xa1"
+       "a\x01\xa1"
+       "a\x02",
+       R"({"a":2})"},
+      {"\x83\xa1"
+       "a\x01\xa1"
+       "b\x02\xa1"
+       "a\x03",
+       R"({"b":2,"a":3})"},
+      {"\x81\xa1"
+       "n\x91\x82\xa1"
+       "a\x01\xa1"
+       "a\x02",
+       R"({"n":[{"a":2}]})"},
+      {std::string("\x82\x05\x01\xcd\x00\x05\x02", 7), R"({"5":2})"},
+      {"\x82\x05\x01\xa1"
+       "5\x02",
+       R"({"5":1,"5":2})"},
+  };
+  for (const auto& row : kRows) {
+    EXPECT_EQ(JsonText(Payload::from(PayloadValue(row.bytes.data())).value()), row.json);
+  }
+  const Payload unique = Payload::from(PayloadValue(many.data())).value();
+  EXPECT_EQ(unique.count(), 50);
+  for (const PayloadEntry& entry : unique)
+    EXPECT_EQ(*entry.key.integer() + 50, entry.value.integer());
+}
+
+TEST(Payload, ReplacesInItsOwnKeysOnly) {
+  const Payload plain(Dictionary{{"no_blank", "a b"}, {7, Dictionary{{"in side", 1}}}});
+  EXPECT_TRUE(plain.replacingInKeys(' ', '_').sharesBlockWith(plain));
+  const Payload blanks(
+      Dictionary{{"two words here", 1}, {7, Dictionary{{"in side", 1}}}, {"a b", 2}, {"a_b", 3}});
+  EXPECT_EQ(JsonText(blanks.replacingInKeys(' ', '_')),
+            R"({"two_words_here":1,"7":{"in side":1},"a_b":3})");
+}
+
+TEST(Json, WritesWhatItLacksAsText) {
+  const Dictionary values{{"date", Date(std::chrono::microseconds(1'769'865'901'000'001))},
+                          {"bytes", Bytes{{"\x00\x01\xfe", 3}}},
+                          {"padded", Bytes{"ab"}},
+                          {"nan", std::nan("")},
+                          {"infinite", -std::numeric_limits<double>::infinity()},
+                          {"large", std::numeric_limits<std::uint64_t>::max()},
+                          {"real", 2.0},
+                          {"escaped", "\"\\\n\x01 \u20ac"}};
+  const std::string expected =
+      R"({"date":"2026-01-31T13:25:01.000001Z","bytes":"AAH+","padded":"YWI=","nan":"NaN",)"
+      R"("infinite":"-Infinity","large":18446744073709551615,"real":2.0,)"
+      "\"escaped\":\"\\\"\\\\\\n\\u0001 \u20ac\"}";
+  EXPECT_EQ(JsonText(values), expected);
+  EXPECT_EQ(JsonText(Payload(values)), expected) << "both forms read alike";
+}
+
+TEST(Json, ComesBackAsATree) {
+  const std::string text =
+      R"({"a":[1,-2,18446744073709551615,2.5,true,null,{"b":"\u20ac"}],"c":{}})";
+  const Result<Value> tree = ValueFromJson(text);
+  ASSERT_TRUE(tree);
+  EXPECT_EQ(tree.value(), (Dictionary{{"a", List{1, -2, std::numeric_limits<std::uint64_t>::max(),
+                                                 2.5, true, nullptr, Dictionary{{"b", "\u20ac"}}}},
+                                      {"c", Dictionary{}}}));
+  for (const char* bad : {"", "{", "[1,]", "{\"a\":1} x", "\"\xff\"", "nul"}) {
+    EXPECT_FALSE(ValueFromJson(bad)) << bad;
+  }
+  EXPECT_THAT(ValueFromJson(std::string(100'000, '[')).error().description(), HasSubstr("deeper"));
+}
+
+TEST(DateText, IsReadAsItIsWritten) {
+  for (const char* text : {"0001-01-01T00:00:00.000000Z", "2024-02-29T23:59:59.999999Z",
+                           "9999-12-31T23:59:59.999999Z", "1969-12-31T23:59:59.000001Z"}) {
+    ASSERT_TRUE(DateFromText(text)) << text;
+    EXPECT_EQ(DateText(*DateFromText(text)), text);
+  }
+  EXPECT_EQ(DateFromText("2026-01-31T14:25:01.1234567+01:00"),
+            DateFromText("2026-01-31T13:25:01.123456Z"));
+  for (const char* bad :
+       {"", "2026-01-31", "2026-02-29T00:00:00Z", "2026-01-31T24:00:00Z", "2026-01-31T00:00:00",
+        "2026-01-31T00:00:00.Z", "2026-01-31T00:00:00Z ", "0000-12-31T00:00:00Z"}) {
+    EXPECT_FALSE(DateFromText(bad)) << bad;
+  }
+}
+
+TEST(Dictionary, ALargeOneKeepsOrderAndReplacesInPlace) {
+  Dictionary dictionary;
+  for (int round = 0; round < 2; ++round) {
+    for (int i = 0; i < 50; ++i) dictionary.set("key " + std::to_string(i), i + 100 * round);
+  }
+  EXPECT_EQ(dictionary.size(), 50);
+  int expected = 100;
+  for (const auto& [key, value] : dictionary) EXPECT_EQ(value, Value(expected++));
+  EXPECT_EQ(dictionary.find("key 50"), nullptr);
+}
+
+}  // namespace
+}  // namespace quarvel
