@@ -23,15 +23,15 @@ namespace quarvel {
 /// up across all clients. 0 names no session.
 using ReporterID = std::int64_t;
 
+// NOLINTBEGIN(google-explicit-constructor): both views are there to be converted to.
+
 /// What a call carries besides numbers: a dictionary in either of its forms, or nothing. A view for
 /// the length of one call; it owns nothing.
 class PayloadArgument {
  public:
-  PayloadArgument(const Payload& payload)
-      : payload_(&payload) {}                    // NOLINT(google-explicit-constructor)
-  PayloadArgument(const Dictionary& dictionary)  // NOLINT(google-explicit-constructor)
-      : dictionary_(&dictionary) {}
-  PayloadArgument(std::nullopt_t) {}  // NOLINT(google-explicit-constructor)
+  PayloadArgument(const Payload& payload) : payload_(&payload) {}
+  PayloadArgument(const Dictionary& dictionary) : dictionary_(&dictionary) {}
+  PayloadArgument(std::nullopt_t) {}
 
   /// At most one of the two is not null.
   [[nodiscard]] const Payload* payload() const { return payload_; }
@@ -46,12 +46,10 @@ class PayloadArgument {
 /// the length of one call; it owns nothing.
 class Recipients {
  public:
-  Recipients(const ReporterID& session)
-      : sessions_({&session, 1}) {}  // NOLINT(google-explicit-constructor)
+  Recipients(const ReporterID& session) : sessions_({&session, 1}) {}
   Recipients(std::initializer_list<ReporterID> sessions)
       : sessions_(std::span(sessions.begin(), sessions.size())) {}
-  Recipients(const std::vector<ReporterID>& sessions)  // NOLINT(google-explicit-constructor)
-      : sessions_(sessions) {}
+  Recipients(const std::vector<ReporterID>& sessions) : sessions_(sessions) {}
   /// When no session is started anywhere, the service sends the message on its own.
   [[nodiscard]] static Recipients everyStartedSession() { return Recipients(); }
 
@@ -64,6 +62,8 @@ class Recipients {
   Recipients() = default;
   std::optional<std::span<const ReporterID>> sessions_;
 };
+
+// NOLINTEND(google-explicit-constructor)
 
 /// A connection to the reporting service.
 ///
