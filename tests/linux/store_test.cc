@@ -298,7 +298,7 @@ TEST_F(StoreTest, ClosingOnAFullDiskCountsWhatIsLost) {
   EXPECT_THAT(store->counters(),
               AllOf(IsBalanced(), Field(&StoreCounters::stored, 1), Field(&StoreCounters::lost, 5),
                     Field(&StoreCounters::refused, 1)));
-  EXPECT_THAT(errorLines(), ElementsAre(HasSubstr("takes no rows"), HasSubstr("5 rows are lost")));
+  EXPECT_THAT(errorLines(), ElementsAre(HasSubstr("takes no rows"), HasSubstr("5 are lost")));
 }
 
 TEST_F(StoreTest, AFlushCoversEverythingBeforeItWithOneSync) {

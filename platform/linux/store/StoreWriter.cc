@@ -147,13 +147,9 @@ void StoreWriter::completeFlushes(const StoreBatch& batch, std::size_t first, st
 }
 
 void StoreWriter::lose(const StoreBatch& batch, std::size_t first) {
-  ZQ_FUNCTION("StoreWriter::lose");
   StoreQueue::Tally tally;
   for (std::size_t i = first; i < batch.rows().size(); ++i) tally.add(batch.rows()[i]);
   queue_.lost(tally);
-  ZQ_LOG(nullptr, error,
-         "The telemetry store {} was closed while it took no rows: {} rows are lost.",
-         options_.database.path.string(), tally.counted);
   completeFlushes(batch, first, batch.rows().size(), failure_);
 }
 
@@ -227,7 +223,12 @@ bool StoreWriter::reopen() {
 }
 
 void StoreWriter::finish() {
+  ZQ_FUNCTION("StoreWriter::finish");
   if (unsyncedSince_) syncTail();
+  if (const std::uint64_t lost = queue_.counters().lost; lost > 0) {
+    ZQ_LOG(nullptr, error, "The telemetry store {} was closed while it took no rows: {} are lost.",
+           options_.database.path.string(), lost);
+  }
   reportRemoved(true);
   database_.reset();
 }
