@@ -1,5 +1,6 @@
 #pragma once
 
+#include <concepts>
 #include <cstddef>
 #include <memory>
 #include <new>
@@ -7,6 +8,12 @@
 #include <utility>
 
 namespace quarvel {
+
+class Block;
+
+/// What a block can be made of.
+template <class F>
+concept BlockWork = !std::same_as<std::remove_cvref_t<F>, Block> && std::is_invocable_v<F&>;
 
 /// A piece of work to be run once: a callable without arguments or result, moved and never copied,
 /// so that it can own what it works on. Callables of up to `kInlineBytes` are held in place,
@@ -16,9 +23,8 @@ class Block {
   static constexpr std::size_t kInlineBytes = 88;
 
   Block() = default;
-  template <class F>
-  requires(!std::is_same_v<std::remove_cvref_t<F>, Block> && std::is_invocable_v<F&>)
-      Block(F&& work) {  // NOLINT(google-explicit-constructor): a lambda is a block
+  template <BlockWork F>
+  Block(F&& work) {  // NOLINT(google-explicit-constructor): a lambda is a block
     using Work = std::remove_cvref_t<F>;
     if constexpr (fitsInPlace<Work>()) {
       ::new (static_cast<void*>(storage_)) Work(std::forward<F>(work));

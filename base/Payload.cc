@@ -425,6 +425,27 @@ Result<Payload> Payload::from(PayloadValue dictionary) {
   return Payload(rewritten);
 }
 
+Payload Payload::setting(std::string_view key, const Value& value) const {
+  const bool replaces = find(key).has_value();
+  std::string rewritten;
+  rewritten.reserve(encoded().size() + key.size() + 64);
+  MessagePackWriter writer(rewritten);
+  writer.dictionary(count() + (replaces ? 0 : 1));
+  for (const PayloadEntry& entry : root().entries()) {
+    writer.encoded(entry.key.encoded());
+    if (entry.key.string() == key) {
+      writer.value(value);
+    } else {
+      writer.encoded(entry.value.encoded());
+    }
+  }
+  if (!replaces) {
+    writer.string(key);
+    writer.value(value);
+  }
+  return Payload(rewritten);
+}
+
 Payload Payload::replacingInKeys(char from, char to) const {
   const auto concerned = [from](const PayloadEntry& entry) {
     const auto text = entry.key.string();

@@ -148,6 +148,9 @@ class Payload {
   /// changes.
   [[nodiscard]] Payload replacingInKeys(char from, char to) const;
 
+  /// The payload with `value` under `key`, in place of what stood there or at the end.
+  [[nodiscard]] Payload setting(std::string_view key, const Value& value) const;
+
   /// Whether both are the same block, or hold the same bytes.
   bool operator==(const Payload& other) const { return encoded() == other.encoded(); }
   [[nodiscard]] bool sharesBlockWith(const Payload& other) const { return block_ == other.block_; }

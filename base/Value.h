@@ -16,6 +16,10 @@
 
 namespace quarvel {
 
+/// The integer types that are numbers.
+template <class T>
+concept IntegerNumber = std::integral<T> && !std::same_as<T, bool>;
+
 class Value;
 class Dictionary;
 using List = std::vector<Value>;
@@ -33,7 +37,7 @@ class Key {
   Key(std::string text) : key_(std::move(text)) {}         // NOLINT(google-explicit-constructor)
   Key(std::string_view text) : key_(std::string(text)) {}  // NOLINT(google-explicit-constructor)
   Key(const char* text) : key_(std::string(text)) {}       // NOLINT(google-explicit-constructor)
-  template <std::integral Integer>
+  template <IntegerNumber Integer>
   Key(Integer integer) {  // NOLINT(google-explicit-constructor)
     if (std::in_range<std::int64_t>(integer)) {
       key_ = static_cast<std::int64_t>(integer);
@@ -79,9 +83,8 @@ class Value {
   Value(std::nullptr_t) {}  // NOLINT(google-explicit-constructor)
   Value(std::same_as<bool> auto boolean)
       : value_(boolean) {}  // NOLINT(google-explicit-constructor)
-  template <std::integral Integer>
-  requires(!std::same_as<Integer, bool>)
-      Value(Integer integer) {  // NOLINT(google-explicit-constructor)
+  template <IntegerNumber Integer>
+  Value(Integer integer) {  // NOLINT(google-explicit-constructor)
     if (std::in_range<std::int64_t>(integer)) {
       value_ = static_cast<std::int64_t>(integer);
     } else {

@@ -54,10 +54,20 @@ struct ExportedInterface {
 template <class T>
 struct ExportedArgument;
 
-template <std::integral Integer>
-requires(!std::same_as<Integer, bool>) struct ExportedArgument<Integer> {
-  static bool decode(PayloadValue value, Integer& out, std::string& fault);
-  static std::string expected();
+template <IntegerNumber Integer>
+struct ExportedArgument<Integer> {
+  static bool decode(PayloadValue value, Integer& out, std::string& /*fault*/) {
+    const auto takeIfItFits = [&out](auto integer) {
+      if (!integer || !std::in_range<Integer>(*integer)) return false;
+      out = static_cast<Integer>(*integer);
+      return true;
+    };
+    return takeIfItFits(value.integer()) || takeIfItFits(value.unsignedInteger());
+  }
+  static std::string expected() {
+    return std::string(std::is_signed_v<Integer> ? "a signed " : "an unsigned ") +
+           std::to_string(sizeof(Integer) * 8) + "-bit integer";
+  }
 };
 
 template <>
@@ -116,7 +126,7 @@ struct ExportedOperation<Operation> {
   static void decode(const ExportedMethod& method, std::span<const PayloadValue> arguments,
                      Values& values, std::optional<std::string>& wrong,
                      std::index_sequence<Index...>) {
-    const auto decodeOne = [&]<class T>(std::size_t index, T& out) {
+    [[maybe_unused]] const auto decodeOne = [&]<class T>(std::size_t index, T& out) {
       std::string fault;
       if (ExportedArgument<T>::decode(arguments[index], out, fault)) return true;
       wrong = WrongArgument(method, index, ExportedArgument<T>::expected(), fault);
@@ -131,27 +141,6 @@ struct ExportedOperation<Operation> {
 template <auto Operation>
 constexpr ExportedMethod Exported(std::string_view name) {
   return {name, ExportedOperation<Operation>::kArguments, &ExportedOperation<Operation>::invoke};
-}
-
-template <std::integral Integer>
-requires(!std::same_as<Integer, bool>) bool ExportedArgument<Integer>::decode(PayloadValue value,
-                                                                              Integer& out,
-                                                                              std::string&) {
-  if (const auto integer = value.integer(); integer && std::in_range<Integer>(*integer)) {
-    out = static_cast<Integer>(*integer);
-    return true;
-  }
-  if (const auto integer = value.unsignedInteger(); integer && std::in_range<Integer>(*integer)) {
-    out = static_cast<Integer>(*integer);
-    return true;
-  }
-  return false;
-}
-
-template <std::integral Integer>
-requires(!std::same_as<Integer, bool>) std::string ExportedArgument<Integer>::expected() {
-  return std::string(std::is_signed_v<Integer> ? "a signed " : "an unsigned ") +
-         std::to_string(sizeof(Integer) * 8) + "-bit integer";
 }
 
 }  // namespace quarvel

@@ -1,0 +1,181 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "Statistics/Service/ServerQueue.h"
+#include "Statistics/Service/ZQReportingServiceProtocol.h"
+#include "Statistics/Service/ZQReportingSession.h"
+#include "Statistics/ZQReportingDriverUtility.h"
+#include "base/Date.h"
+#include "base/Mutex.h"
+#include "base/Value.h"
+#include "platform/Notifications.h"
+#include "platform/ServiceListener.h"
+
+namespace quarvel {
+
+class ZQReportingServerInstance;
+
+/// What a server instance may ask of the whole service. Called on the `ServerQueue`.
+class ZQReportingServiceDelegateProtocol {
+ public:
+  using Clients = std::vector<std::shared_ptr<ZQReportingServerInstance>>;
+
+  virtual ~ZQReportingServiceDelegateProtocol() = default;
+
+  /// The preferences as last read; absent until the first notification of a change.
+  [[nodiscard]] virtual const std::optional<Dictionary>& getDefaults()
+      QUARVEL_REQUIRES(serverQueueRole) = 0;
+  /// The live list itself, in order of acceptance.
+  [[nodiscard]] virtual const Clients& getAllClients() QUARVEL_REQUIRES(serverQueueRole) = 0;
+  [[nodiscard]] virtual bool isReportingEnabled() = 0;
+  /// The session of the first client that has one of this identifier; none for 0 and while
+  /// reporting is switched off.
+  [[nodiscard]] virtual std::shared_ptr<ZQReportingSession> findReportingSessionForID(
+      ReporterID reporterID) QUARVEL_REQUIRES(serverQueueRole) = 0;
+  /// What the drivers count now, and how far the counters rose since (`ZQReportingDriverUtility`).
+  [[nodiscard]] virtual DriverSnapShot getSnapShot() QUARVEL_REQUIRES(serverQueueRole) = 0;
+  [[nodiscard]] virtual std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
+      const std::optional<DriverSnapShot>& snapShot) QUARVEL_REQUIRES(serverQueueRole) = 0;
+  /// Takes a client off the list; one that is not there is ignored.
+  virtual void removeClient(const ZQReportingServerInstance& client)
+      QUARVEL_REQUIRES(serverQueueRole) = 0;
+};
+
+/// One client: the exported object of its connection, and the owner of the sessions it made.
+///
+/// Owned by its connection and by the delegate's client list. The protocol's operations come on the
+/// connection's thread and only queue their work on the `ServerQueue`.
+class ZQReportingServerInstance final
+    : public ZQReportingServiceProtocol,
+      public std::enable_shared_from_this<ZQReportingServerInstance> {
+  struct Private {};
+
+ public:
+  using SessionMap = std::map<ReporterID, std::shared_ptr<ZQReportingSession>>;
+
+  ZQReportingServerInstance(Private, std::int32_t pid,
+                            std::weak_ptr<ZQReportingServiceDelegateProtocol> delegate);
+  ~ZQReportingServerInstance() override;
+
+  [[nodiscard]] static std::shared_ptr<ZQReportingServerInstance> initWithPID(
+      std::int32_t pid, std::weak_ptr<ZQReportingServiceDelegateProtocol> delegate);
+
+  void createReportingSession(ReporterID reporterID, BoolReply reply) override;
+  void setServiceType(std::uint16_t serviceType, ReporterID reportingSession,
+                      BoolReply reply) override;
+  void getServiceNameForReporterID(ReporterID reporterID, ServiceTypeReply reply) override;
+  void setConfiguration(std::optional<Dictionary> configuration, ReporterID reporterID,
+                        BoolReply reply) override;
+  void startReportingSessionForID(ReporterID reporterID, BoolReply reply) override;
+  void sendMessage(std::optional<Payload> payload, std::uint32_t category, std::uint16_t type,
+                   std::optional<std::vector<ReporterID>> reportingIDs, ErrorReply reply) override;
+  void stopReportingSessionForID(ReporterID reporterID, BoolReply reply) override;
+  void destroyReportingSession(ReporterID reporterID, BoolReply reply) override;
+  void reporterID(ReporterID reporterID, DictionaryReply valid) override;
+  void getAllReporters(ListReply reply) override;
+  void killService(BoolReply reply) override;
+
+  /// A session of this client, or with `acrossAllClients` of the first client that has it.
+  [[nodiscard]] std::shared_ptr<ZQReportingSession> findReportingSessionForID(ReporterID reporterID,
+                                                                              bool acrossAllClients)
+      QUARVEL_REQUIRES(serverQueueRole);
+
+  /// The connection has ended: stops the client's started sessions and takes it off the client
+  /// list, on the `ServerQueue`; a second call does nothing. From any thread.
+  void handleConnectionError();
+
+  [[nodiscard]] std::int32_t processIdentifier() const { return processIdentifier_; }
+  /// When the client was registered; absent before. From any thread, as the next three.
+  [[nodiscard]] std::optional<Date> clientStartDate() const;
+  void setClientStartDate(Date date);
+  [[nodiscard]] std::optional<std::string> clientProcessName() const;
+  void setClientProcessName(std::optional<std::string> name);
+  [[nodiscard]] const SessionMap& clientReportingSessionMap() const
+      QUARVEL_REQUIRES(serverQueueRole) {
+    return clientReportingSessionMap_;
+  }
+
+ private:
+  void reportDriverStatistics(ZQReportingSession& session) QUARVEL_REQUIRES(serverQueueRole);
+  void routeByIDs(const std::optional<Payload>& payload, std::uint32_t category, std::uint16_t type,
+                  const std::vector<ReporterID>& reportingIDs) QUARVEL_REQUIRES(serverQueueRole);
+  void broadcast(ZQReportingServiceDelegateProtocol& delegate,
+                 const std::optional<Payload>& payload, std::uint32_t category, std::uint16_t type)
+      QUARVEL_REQUIRES(serverQueueRole);
+
+  const std::int32_t processIdentifier_;
+  const std::weak_ptr<ZQReportingServiceDelegateProtocol> delegate_;
+
+  mutable Mutex clientMutex_;
+  std::optional<Date> clientStartDate_ QUARVEL_GUARDED_BY(clientMutex_);
+  std::optional<std::string> clientProcessName_ QUARVEL_GUARDED_BY(clientMutex_);
+
+  SessionMap clientReportingSessionMap_ QUARVEL_GUARDED_BY(serverQueueRole);
+};
+
+/// The one object of the whole process: accepts every connection, keeps the list of clients and the
+/// reporting switch, and answers the server instances' questions about each other.
+class ZQReportingServiceDelegate final
+    : public ServiceListenerDelegate,
+      public ZQReportingServiceDelegateProtocol,
+      public std::enable_shared_from_this<ZQReportingServiceDelegate> {
+  struct Private {};
+
+ public:
+  explicit ZQReportingServiceDelegate(Private);
+
+  /// Makes the `ServerQueue` too, and listens for changes of the preferences. Reads none yet:
+  /// reporting is on until they are said to have changed.
+  [[nodiscard]] static std::shared_ptr<ZQReportingServiceDelegate> create();
+
+  /// Never refuses. Thread: the platform's, for connections.
+  bool shouldAcceptNewConnection(ServiceListener& listener,
+                                 const std::shared_ptr<ClientConnection>& connection) override;
+
+  [[nodiscard]] const std::optional<Dictionary>& getDefaults() override
+      QUARVEL_REQUIRES(serverQueueRole) {
+    return defaults_;
+  }
+  [[nodiscard]] const Clients& getAllClients() override QUARVEL_REQUIRES(serverQueueRole) {
+    return clients_;
+  }
+  [[nodiscard]] bool isReportingEnabled() override { return reportingEnabled_; }
+  [[nodiscard]] std::shared_ptr<ZQReportingSession> findReportingSessionForID(
+      ReporterID reporterID) override QUARVEL_REQUIRES(serverQueueRole);
+  [[nodiscard]] DriverSnapShot getSnapShot() override QUARVEL_REQUIRES(serverQueueRole) {
+    return driverUtility_.getSnapShot();
+  }
+  [[nodiscard]] std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
+      const std::optional<DriverSnapShot>& snapShot) override QUARVEL_REQUIRES(serverQueueRole) {
+    return driverUtility_.getDriverStatisticsRelativeToSnapShot(snapShot);
+  }
+  void removeClient(const ZQReportingServerInstance& client) override
+      QUARVEL_REQUIRES(serverQueueRole);
+
+  /// The preferences as they are now: "device_name" when there is one, and "disable_reporting".
+  [[nodiscard]] static Dictionary ZQReportingDefaults();
+
+ private:
+  void listenForDefaultsNotification();
+  void readDefaults(NotificationToken token) QUARVEL_REQUIRES(serverQueueRole);
+
+  /// Covers the export of a server instance and the search across clients.
+  RecursiveMutex lock_;
+  std::atomic<bool> reportingEnabled_ = true;
+  Clients clients_ QUARVEL_GUARDED_BY(serverQueueRole);
+  std::optional<Dictionary> defaults_ QUARVEL_GUARDED_BY(serverQueueRole);
+  NotificationToken defaultsToken_ = 0;  // constant once notifications can come
+  ZQReportingDriverUtility driverUtility_;
+};
+
+/// The short name of a client's process; none when it cannot be told. From any thread.
+[[nodiscard]] std::optional<std::string> ProcessNameForPID(std::int32_t pid);
+
+}  // namespace quarvel

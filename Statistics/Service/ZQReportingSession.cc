@@ -1,0 +1,443 @@
+#include "Statistics/Service/ZQReportingSession.h"
+
+#include <fmt/format.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cmath>
+#include <utility>
+
+#include "base/Format.h"
+#include "platform/Clock.h"
+#include "platform/Condition.h"
+#include "platform/DeviceProperties.h"
+#include "platform/FileSystem.h"
+#include "platform/Log.h"
+#include "platform/Orientation.h"
+#include "platform/Random.h"
+#include "platform/Trace.h"
+
+namespace quarvel {
+
+namespace {
+
+constexpr std::uint32_t kTraceCreated = 0x21042828;
+constexpr std::uint32_t kTraceStarted = 0x2104282c;
+constexpr std::uint32_t kTraceStopping = 0x21042830;
+constexpr std::uint32_t kTraceDisposed = 0x21042834;
+constexpr std::uint32_t kTraceMessageSent = 0x21042838;
+
+constexpr int kClientType = 19;
+constexpr double kClientVersion = 2.0;
+constexpr double kBackendSeconds = 9.0;
+constexpr std::uint32_t kLongestAlarmDelaySeconds = 59;
+
+LogHandle Scope() {
+  static const LogHandle scope = ZQLogRegister(FourCharacterCode("zqrr"), "zqrr", kSubsystem,
+                                               "reporting_session_verbose", 1, 31);
+  return scope;
+}
+
+/// Blanks in the payload's own keys become underscores.
+Payload EnrichPayload(const Payload& payload) {
+  return payload.replacingInKeys(' ', '_');
+}
+
+/// The agent takes the low half of a category code.
+std::uint16_t AgentCategory(std::uint32_t category) {
+  return static_cast<std::uint16_t>(category & 0xffff);
+}
+
+constexpr const char* kDiagnosticsDirectory =
+    "/private/var/mobile/Library/Logs/Faultkeep/DiagnosticLogs/Audio/Reporting";
+constexpr std::uint32_t kDiagnosticsPermissions = 0777;
+constexpr std::int64_t kDeviceClassWithoutOrientation = 6;
+constexpr const char* kSummaryKey = "ZQ_Session_Summary_Event";
+
+/// One orientation entry of the history.
+Dictionary OrientationEntry(std::string_view mode, std::string_view orientation, double seconds) {
+  return {{fmt::format("{}_orientation", mode), orientation},
+          {fmt::format("{}_orientation_time", mode), seconds}};
+}
+
+/// The texts that each key of a history had, joined, in the order in which the keys first came.
+class SummaryText {
+ public:
+  void add(const Key& key, std::string text) {
+    const auto [found, isNew] = index_.try_emplace(KeyText(key), texts_.size());
+    if (isNew) {
+      texts_.emplace_back(found->first, std::move(text));
+    } else {
+      texts_[found->second].second.append(1, ',').append(text);
+    }
+  }
+  [[nodiscard]] Dictionary dictionary() && {
+    Dictionary summary;
+    for (auto& [key, text] : texts_) summary.set(std::move(key), std::move(text));
+    return summary;
+  }
+
+ private:
+  static std::string KeyText(const Key& key) {
+    if (const auto* text = key.string()) return *text;
+    if (const auto* number = key.integer()) return fmt::to_string(*number);
+    return fmt::to_string(*key.unsignedInteger());
+  }
+
+  std::vector<std::pair<std::string, std::string>> texts_;
+  std::unordered_map<std::string, std::size_t> index_;
+};
+
+/// A client's text as part of a file name: it can name no directory and leaves room for the rest.
+std::string FileNamePart(std::string text) {
+  constexpr std::size_t kLongest = 128;
+  if (text.size() > kLongest) {
+    std::size_t end = kLongest;
+    while ((static_cast<unsigned char>(text[end]) & 0xc0) == 0x80) --end;  // not inside a character
+    text.resize(end);
+  }
+  std::ranges::replace_if(
+      text, [](char c) { return c == '/' || c == '\0'; }, '_');
+  return text;
+}
+
+/// What the agent set-up waits for. Shared with the agent's completion, which may come after the
+/// wait has ended.
+struct BackendSearch {
+  const std::shared_ptr<Condition> condition = CreateCondition();
+  bool found QUARVEL_GUARDED_BY(*condition) = false;
+};
+
+void SendOneMessage(const Payload& payload, std::uint32_t category, std::uint16_t type,
+                    std::uint16_t serviceType, const ZQReportingSession::SendReply& reply) {
+  ZQ_FUNCTION("+[ZQReportingSession sendSingleMessage:category:type:serviceType:userInfo:reply:]");
+  EmitKernelTrace(kTraceMessageSent);
+  ZQ_LOG(Scope(), debug, "sending single message");
+  const Dictionary sessionInfo = {{kRelmReportingSessionInfoClientType, kClientType},
+                                  {kRelmReportingSessionInfoClientVersion, kClientVersion},
+                                  {kRelmReportingSessionInfoSessionID, -1}};
+  const Dictionary userInfo = {
+      {kRelmReportingUserInfoClientName, kSubsystem},
+      {kRelmReportingUserInfoServiceName, ZQReportingUtilityServiceTypeName(serviceType)}};
+  const Outcome sent = RelmReporting::sendOneMessage(sessionInfo, userInfo, AgentCategory(category),
+                                                     type, EnrichPayload(payload));
+  if (sent) {
+    ZQ_LOG(Scope(), debug, "message {} : category {} : type {}", Described(payload), category,
+           type);
+  } else {
+    ZQ_LOG(Scope(), error, "sendOneMessageWithSessionInfo {}", sent.error().description());
+  }
+  if (reply) reply(sent ? std::nullopt : std::optional(sent.error()));
+}
+
+}  // namespace
+
+std::shared_ptr<ZQReportingSession> ZQReportingSession::initWithID(
+    ReporterID reporterID, std::vector<std::int32_t> processIdentifiers) {
+  return std::make_shared<ZQReportingSession>(Private{}, reporterID, std::move(processIdentifiers));
+}
+
+ZQReportingSession::ZQReportingSession(Private, ReporterID reporterID,
+                                       std::vector<std::int32_t> processIdentifiers)
+    : reporterID_(reporterID),
+      processIdentifiers_(std::move(processIdentifiers)),
+      aggregatedPayloadData_(std::make_shared<PayloadHistory>()),
+      relmReportingQueue_(
+          CreateSerialQueue("tarnwick.quarvel.session.relmreporting", QualityOfService::utility)) {
+  ZQ_FUNCTION("-[ZQReportingSession initWithID:processIdentifiers:]");
+  ZQ_LOG(Scope(), info, "created reporting session for ID: {}", reporterID_);
+  EmitKernelTrace(kTraceCreated);
+}
+
+ZQReportingSession::~ZQReportingSession() {
+  ZQ_FUNCTION("-[ZQReportingSession dealloc]");
+  EmitKernelTrace(kTraceDisposed);
+  ZQ_LOG(Scope(), info, "deallocing this session {}", reporterID_);
+}
+
+std::string ZQReportingSession::description() const {
+  return fmt::format("<ZQReportingSession {}>", reporterID_);
+}
+
+std::shared_ptr<PayloadHistory> ZQReportingSession::aggregatedPayloadData() const {
+  const MutexLock lock(historyMutex_);
+  return aggregatedPayloadData_;
+}
+
+void ZQReportingSession::setAggregatedPayloadData(std::shared_ptr<PayloadHistory> history) {
+  {
+    const MutexLock lock(historyMutex_);
+    aggregatedPayloadData_.swap(history);
+  }
+  // The old one goes here, outside the lock: it may be large.
+}
+
+void ZQReportingSession::setServiceType(std::uint16_t serviceType) {
+  ZQ_FUNCTION("-[ZQReportingSession setServiceType:]");
+  serviceType_ = serviceType;
+  serviceName_ = ZQReportingUtilityServiceTypeName(serviceType);
+  ZQ_LOG(Scope(), info, "setting service type {}", serviceName_);
+}
+
+void ZQReportingSession::setConfiguration(const std::optional<Dictionary>& configuration) {
+  if (configuration) userInfo_->merge(*configuration);
+}
+
+void ZQReportingSession::updateDefaults(const std::optional<Dictionary>& defaults) {
+  if (defaults) userInfo_->merge(*defaults);
+}
+
+void ZQReportingSession::start() {
+  ZQ_FUNCTION("-[ZQReportingSession start]");
+  ZQ_LOG(Scope(), debug, "starting session owned by {}", reporterID_);
+  if (started_) {
+    ZQ_LOG(Scope(), info, "{} is already started", reporterID_);
+    return;
+  }
+  started_ = true;
+  setAggregatedPayloadData(std::make_shared<PayloadHistory>());
+  EmitKernelTrace(kTraceStarted);
+  if (shouldReportOrientation()) registerOrientationHandlers();
+  relmReportingQueue_->async([self = shared_from_this(), userInfo = userInfo_,
+                              serviceName = serviceName_,
+                              backendFound = relmReportingSessionStarted_.load()] {
+    self->setUpAgent(*userInfo, serviceName, backendFound);
+  });
+}
+
+void ZQReportingSession::setUpAgent(const SharedDictionary& userInfo,
+                                    const std::string& serviceName, bool backendFound) {
+  ZQ_FUNCTION("-[ZQReportingSession start]");
+  relmReportingQueue_->assertCurrent();
+  if (serviceType_ == kServiceTypeTest) return;
+  relmReportingAgentToken_ = RelmReporting::newSecureHierarchyToken(std::nullopt);
+  const Dictionary sessionInfo = {
+      {kRelmReportingSessionInfoClientType, kClientType},
+      {kRelmReportingSessionInfoClientVersion, kClientVersion},
+      {kRelmReportingSessionInfoSessionID, reporterID_},
+      {kRelmReportingSessionInfoBatchEvent, true},
+      {kRelmReportingSessionInfoHierarchyToken, *relmReportingAgentToken_}};
+  Dictionary agentUserInfo = {{kRelmReportingUserInfoClientName, kSubsystem},
+                              {kRelmReportingUserInfoServiceName, serviceName + "_session"}};
+  agentUserInfo.merge(userInfo.copy());
+  relmReportingSession_ = RelmReporting::createAgentSession(sessionInfo, agentUserInfo, {});
+
+  const auto search = std::make_shared<BackendSearch>();
+  {
+    const BasicMutexLock<Condition> lock(*search->condition);
+    search->found = backendFound;
+  }
+  relmReportingSession_->startConfiguration(
+      [search](const std::optional<std::vector<std::string>>& backends) {
+        if (!backends) {
+          ZQ_LOG(Scope(), error, "No backends found, this session won't get sent to the server");
+          return;
+        }
+        ZQ_LOG(Scope(), standard, "List of backends {}",
+               Described(Value(List(backends->begin(), backends->end()))));
+        const BasicMutexLock<Condition> lock(*search->condition);
+        search->found = true;
+        search->condition->signal();
+      });
+  const LogHandle scope = Scope();
+  if (!ZQReportingUtilityWait(*search->condition, &search->found,
+                              "waiting for relmreportingd to find backends",
+                              "failed to find backend", &scope, kBackendSeconds)) {
+    relmReportingSession_ = nullptr;
+    relmReportingSessionStarted_ = false;
+  }
+}
+
+void ZQReportingSession::stop() {
+  ZQ_FUNCTION("-[ZQReportingSession stop]");
+  ZQ_LOG(Scope(), debug, "ending session {}", reporterID_);
+  if (shouldReportOrientation() && orientationCallbackID_) unregisterOrientationHandlers();
+  if (!started_) return;
+  // Said a second time on purpose: the first line tells of every call, this one of those that end
+  // something.
+  ZQ_LOG(Scope(), debug, "ending session {}", reporterID_);
+  EmitKernelTrace(kTraceStopping);
+  if (const auto summary = createSummaryEventForSession()) {
+    ZQ_LOG(Scope(), standard, "sending summary event for reporter {}", reporterID_);
+    sendMessage(Payload(*summary), kCategorySummary, kTypeSummary, true, nullptr);
+  }
+  relmReportingQueue_->async([self = shared_from_this()] { self->endAgent(); });
+  setAggregatedPayloadData(nullptr);
+  started_ = false;
+  transactionCompleteBlock_(true);
+}
+
+bool ZQReportingSession::shouldReportOrientation() const {
+  if (!ZQReportingUtilityIsInternalBuild()) return false;
+  const std::uint16_t serviceType = serviceType_;
+  if (serviceType != kServiceTypeLongFormAudio && serviceType != kServiceTypeTelephony)
+    return false;
+  return DevicePropertyInteger("DeviceClassNumber") != kDeviceClassWithoutOrientation;
+}
+
+void ZQReportingSession::registerOrientationHandlers() {
+  ZQ_FUNCTION("-[ZQReportingSession start]_block_invoke");
+  const std::string callbackID = fmt::format("ZQReportingService {}", reporterID_);
+  const Date startDate = CurrentDate();
+  const auto handler = [&](const char* mode) {
+    return [self = shared_from_this(), mode, startDate, callbackID](Orientation orientation) {
+      const std::string_view name = OrientationName(orientation);
+      const double elapsed = std::chrono::duration<double>(CurrentDate() - startDate).count();
+      const double seconds = std::round(std::abs(elapsed) * 1000) / 1000;
+      ZQ_LOG(Scope(), debug,
+             "Orientation handler callback mode={} orientation=\"{}\" app=\"{}\", time={}, "
+             "id=\"{}\"",
+             mode, name, Described(self->userInfo_->find(kHostApplicationDisplayID)), seconds,
+             callbackID);
+      if (const auto history = self->aggregatedPayloadData()) {
+        history->append(OrientationEntry(mode, name, seconds));
+      }
+    };
+  };
+  RegisterDeviceOrientationHandler(callbackID, handler("device"));
+  RegisterUIOrientationHandler(callbackID, handler("ui"));
+  orientationCallbackID_ = callbackID;
+}
+
+void ZQReportingSession::unregisterOrientationHandlers() {
+  UnregisterDeviceOrientationHandler(*orientationCallbackID_);
+  UnregisterUIOrientationHandler(*orientationCallbackID_);
+  orientationCallbackID_.reset();
+}
+
+std::optional<Dictionary> ZQReportingSession::createSummaryEventForSession() {
+  const auto history = aggregatedPayloadData();
+  if (history == nullptr || history->empty()) return std::nullopt;
+  SummaryText texts;
+  texts.add(kSummaryKey, fmt::to_string(serviceType_.load()));
+  history->forEach([&texts](const PayloadHistory::Entry& entry) {
+    if (const auto* message = std::get_if<SentMessage>(&entry)) {
+      texts.add(message->messageID, JsonText(message->payload));
+    } else {
+      for (const auto& [key, value] : std::get<Dictionary>(entry)) texts.add(key, Described(value));
+    }
+  });
+  history->insertAtFront(userInfo_->copy());
+  if (ZQReportingUtilityIsInternalBuild()) writeSummaryLogFile(*history);
+  return std::move(texts).dictionary();
+}
+
+void ZQReportingSession::writeSummaryLogFile(const PayloadHistory& history) const {
+  ZQ_FUNCTION("-[ZQReportingSession createSummaryEventForSession]");
+  PrettyJsonWriter writer;
+  writer.beginList();
+  history.forEach([&writer](const PayloadHistory::Entry& entry) {
+    if (const auto* message = std::get_if<SentMessage>(&entry)) {
+      writer.beginDictionary();
+      writer.key(message->messageID);
+      writer.value(message->payload.root());
+      writer.endDictionary();
+    } else {
+      writer.value(std::get<Dictionary>(entry));
+    }
+  });
+  writer.endList();
+  const Result<std::string> json = writer.finish();
+  if (!json) {
+    ZQ_LOG(Scope(), error, "dataWithJSONObject: {}", json.error().description());
+  }
+  const std::string directory = DiagnosticsPath(kDiagnosticsDirectory);
+  if (const Outcome made = CreateDirectory(directory, kDiagnosticsPermissions); !made) {
+    ZQ_LOG(Scope(), error, "can't create logging directory at {}: {}", directory,
+           made.error().description());
+  }
+  const auto application = userInfo_->find(kHostApplicationDisplayID);
+  const std::string path =
+      fmt::format("{}/{}-{}-{}-{}.json", directory, LocalDateText(CurrentDate(), "%Y%m%d-%H%M%S%z"),
+                  "quarvel", application ? FileNamePart(Described(*application)) : "unknown",
+                  ZQReportingUtilityServiceTypeName(serviceType_));
+  const Outcome written = WriteFileAtomically(path, json ? json.value() : std::string());
+  if (!written) {
+    ZQ_LOG(Scope(), error, "jsonOutput writeToURL: {}", written.error().description());
+  }
+}
+
+void ZQReportingSession::endAgent() {
+  ZQ_FUNCTION("-[ZQReportingSession stop]");
+  relmReportingQueue_->assertCurrent();
+  if (serviceType_ == kServiceTypeTest) return;
+  if (relmReportingSession_ == nullptr) return;
+  relmReportingSession_->flushMessages([](const std::optional<Error>& error) {
+    if (error) ZQ_LOG(Scope(), error, "flush error {}", error->description());
+  });
+  relmReportingSession_ = nullptr;
+}
+
+std::string ZQReportingSession::messageIdForCategory(std::uint32_t category, std::uint16_t type) {
+  std::string id =
+      ZQReportingUtilityCategoryName(category) + '_' + ZQReportingUtilityTypeName(type);
+  const std::uint64_t count = ++messageTypeCounts_[id];
+  id += '_';
+  id += fmt::to_string(count);
+  return id;
+}
+
+void ZQReportingSession::sendMessage(const std::optional<Payload>& payload, std::uint32_t category,
+                                     std::uint16_t type, bool /*sync*/, const SendReply& reply) {
+  ZQ_FUNCTION("-[ZQReportingSession sendMessage:category:type:sync:reply:]");
+  ZQ_LOG(Scope(), debug, "sending message for session owned by {}", reporterID_);
+  const Payload original = payload.value_or(Payload());
+  const Payload enriched = EnrichPayload(original);
+  std::string messageID = messageIdForCategory(category, type);
+  if (const auto history = aggregatedPayloadData()) {
+    history->append(SentMessage{std::move(messageID), enriched});
+  }
+  EmitKernelTrace(kTraceMessageSent);
+  relmReportingQueue_->async(
+      [self = shared_from_this(), enriched, category, type, original, wasStarted = started_] {
+        self->deliver(enriched, category, type, original, wasStarted);
+      });
+  if (reply) reply(std::nullopt);
+}
+
+void ZQReportingSession::sendMessage(const std::optional<Payload>& payload, std::uint32_t category,
+                                     std::uint16_t type, const SendReply& reply) {
+  sendMessage(payload, category, type, false, reply);
+}
+
+void ZQReportingSession::deliver(const Payload& enriched, std::uint32_t category,
+                                 std::uint16_t type, const Payload& original, bool wasStarted) {
+  ZQ_FUNCTION("-[ZQReportingSession sendMessage:category:type:sync:reply:]");
+  relmReportingQueue_->assertCurrent();
+  if (!wasStarted) {
+    ZQ_LOG(Scope(), debug, "session not started, will send as a single message");
+    sendSingleMessage(enriched, category, type, serviceType_, userInfo_->copy(), nullptr);
+    return;
+  }
+  if (serviceType_ == kServiceTypeTest) {
+    ZQ_LOG(Scope(), info, "transactions aren't allowed on this platform");
+    return;
+  }
+  if (relmReportingSession_ == nullptr) {
+    ZQ_LOG(Scope(), error, "{}", "No valid RelmReportingSession");
+    return;
+  }
+  // A refusal is silent on purpose: the message stands in the session's history all the same.
+  if (relmReportingSession_->agentSendMessage(AgentCategory(category), type, enriched)) {
+    ZQ_LOG(Scope(), debug, "RelmReportingAgent {} : message {} : category {} : type {}",
+           relmReportingSession_->description(), Described(original), category, type);
+  }
+}
+
+void ZQReportingSession::sendSingleMessage(const std::optional<Payload>& payload,
+                                           std::uint32_t category, std::uint16_t type,
+                                           std::uint16_t serviceType,
+                                           const std::optional<Dictionary>& /*userInfo*/,
+                                           SendReply reply) {
+  ZQ_FUNCTION("+[ZQReportingSession sendSingleMessage:category:type:serviceType:userInfo:reply:]");
+  const std::chrono::seconds delay(
+      serviceType == kServiceTypeAlarms ? RandomBelow(kLongestAlarmDelaySeconds + 1) : 0);
+  ZQ_LOG(Scope(), debug, "sending single message after delta {} for service {}", delay.count(),
+         serviceType);
+  BackgroundQueue().after(delay, [payload = payload.value_or(Payload()), category, type,
+                                  serviceType, reply = std::move(reply)] {
+    SendOneMessage(payload, category, type, serviceType, reply);
+  });
+}
+
+}  // namespace quarvel

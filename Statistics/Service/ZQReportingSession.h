@@ -1,0 +1,166 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <unordered_map>
+#include <vector>
+
+#include "Statistics/Service/PayloadHistory.h"
+#include "Statistics/Service/ServerQueue.h"
+#include "Statistics/SharedDictionary.h"
+#include "Statistics/ZQReportingDriverUtility.h"
+#include "Statistics/ZQReportingUtility.h"
+#include "base/Error.h"
+#include "base/Mutex.h"
+#include "base/Payload.h"
+#include "platform/RelmReporting.h"
+#include "platform/Reply.h"
+#include "platform/WorkQueue.h"
+
+namespace quarvel {
+
+/// One client's reporting session: takes the messages sent to it, hands them to the telemetry agent
+/// inside an agent session of its own while it is started, or one by one while it is not, and
+/// reports its end to the client.
+///
+/// Owned by the session map of its server instance. Every operation is called on the `ServerQueue`
+/// and returns at once; all work with the agent runs on the session's own serial queue, in order.
+/// Dropping a session neither stops it nor loses what is queued: its blocks keep it alive.
+class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSession> {
+  struct Private {};
+
+ public:
+  /// Called with the agent's error, or none.
+  using SendReply = std::function<void(const std::optional<Error>& error)>;
+
+  ZQReportingSession(Private, ReporterID reporterID, std::vector<std::int32_t> processIdentifiers);
+  ~ZQReportingSession();
+  ZQReportingSession(const ZQReportingSession&) = delete;
+  ZQReportingSession& operator=(const ZQReportingSession&) = delete;
+
+  /// A new session. `processIdentifiers`: the clients that own it. From any thread.
+  [[nodiscard]] static std::shared_ptr<ZQReportingSession> initWithID(
+      ReporterID reporterID, std::vector<std::int32_t> processIdentifiers);
+
+  /// Takes effect for messages from now on; an agent session that exists keeps its service name.
+  void setServiceType(std::uint16_t serviceType) QUARVEL_REQUIRES(serverQueueRole);
+  /// Merges into the user information, in which keys are never removed; an absent dictionary
+  /// changes nothing.
+  void setConfiguration(const std::optional<Dictionary>& configuration);
+  void updateDefaults(const std::optional<Dictionary>& defaults);
+
+  /// Begins an agent session, for whose backends the session queue waits up to 9 seconds. Already
+  /// started: changes nothing.
+  void start() QUARVEL_REQUIRES(serverQueueRole);
+  /// Sends the summary, flushes and ends the agent session and answers the start call
+  /// (`transactionCompleteBlock`).
+  void stop() QUARVEL_REQUIRES(serverQueueRole);
+
+  /// The message's identifier, "category_type_n"; counts the message.
+  [[nodiscard]] std::string messageIdForCategory(std::uint32_t category, std::uint16_t type)
+      QUARVEL_REQUIRES(serverQueueRole);
+
+  /// Records the message and delivers it on the session queue. `reply` is called at once, without
+  /// an error: the outcome of the delivery never reaches the caller, whatever `sync` says. An
+  /// absent payload counts as an empty one.
+  void sendMessage(const std::optional<Payload>& payload, std::uint32_t category,
+                   std::uint16_t type, bool sync, const SendReply& reply)
+      QUARVEL_REQUIRES(serverQueueRole);
+  void sendMessage(const std::optional<Payload>& payload, std::uint32_t category,
+                   std::uint16_t type, const SendReply& reply) QUARVEL_REQUIRES(serverQueueRole);
+
+  /// Hands one message that belongs to no session to the agent, on the background queue: at once,
+  /// or for alarms 0 to 59 seconds later. `userInfo` has no effect. `reply` is called there. From
+  /// any thread.
+  static void sendSingleMessage(const std::optional<Payload>& payload, std::uint32_t category,
+                                std::uint16_t type, std::uint16_t serviceType,
+                                const std::optional<Dictionary>& userInfo, SendReply reply);
+
+  /// Condenses the history into one dictionary, each key's values joined by ",". Leaves the user
+  /// information at the front of the history, and on an internal build the whole history as a JSON
+  /// file in the diagnostics directory. None when nothing was sent.
+  [[nodiscard]] std::optional<Dictionary> createSummaryEventForSession()
+      QUARVEL_REQUIRES(serverQueueRole);
+  /// Whether changes of the orientation go into the history: on internal builds, for some service
+  /// types, not on every class of device.
+  [[nodiscard]] bool shouldReportOrientation() const;
+
+  [[nodiscard]] ReporterID reporterID() const { return reporterID_; }
+  [[nodiscard]] const std::vector<std::int32_t>& processIdentifiers() const {
+    return processIdentifiers_;
+  }
+  [[nodiscard]] bool started() const QUARVEL_REQUIRES(serverQueueRole) { return started_; }
+  /// Never true: nothing sets it.
+  [[nodiscard]] bool relmReportingSessionStarted() const { return relmReportingSessionStarted_; }
+  [[nodiscard]] std::uint16_t serviceType() const { return serviceType_; }
+  [[nodiscard]] const std::string& serviceName() const QUARVEL_REQUIRES(serverQueueRole) {
+    return serviceName_;
+  }
+  [[nodiscard]] const SharedDictionary& userInfo() const { return *userInfo_; }
+  /// The history of this run; none after a stop. From any thread.
+  [[nodiscard]] std::shared_ptr<PayloadHistory> aggregatedPayloadData() const;
+  /// What the drivers had counted at the start. Kept for whoever started the session; not read
+  /// here.
+  [[nodiscard]] const std::optional<DriverSnapShot>& driverSnapShot() const
+      QUARVEL_REQUIRES(serverQueueRole) {
+    return driverSnapShot_;
+  }
+  void setDriverSnapShot(std::optional<DriverSnapShot> snapShot) QUARVEL_REQUIRES(serverQueueRole) {
+    driverSnapShot_ = std::move(snapShot);
+  }
+  /// The client's start reply, to be answered at the stop.
+  [[nodiscard]] const BoolReply& transactionCompleteBlock() const
+      QUARVEL_REQUIRES(serverQueueRole) {
+    return transactionCompleteBlock_;
+  }
+  void setTransactionCompleteBlock(BoolReply block) QUARVEL_REQUIRES(serverQueueRole) {
+    transactionCompleteBlock_ = std::move(block);
+  }
+  /// For log lines: "<ZQReportingSession 7>".
+  [[nodiscard]] std::string description() const;
+
+ private:
+  void setUpAgent(const SharedDictionary& userInfo, const std::string& serviceName,
+                  bool backendFound);
+  void deliver(const Payload& enriched, std::uint32_t category, std::uint16_t type,
+               const Payload& original, bool wasStarted);
+  void endAgent();
+  void registerOrientationHandlers() QUARVEL_REQUIRES(serverQueueRole);
+  void unregisterOrientationHandlers() QUARVEL_REQUIRES(serverQueueRole);
+  void writeSummaryLogFile(const PayloadHistory& history) const;
+  void setAggregatedPayloadData(std::shared_ptr<PayloadHistory> history);
+
+  const ReporterID reporterID_;
+  const std::vector<std::int32_t> processIdentifiers_;
+
+  bool started_ QUARVEL_GUARDED_BY(serverQueueRole) = false;
+  std::string serviceName_ QUARVEL_GUARDED_BY(serverQueueRole) = "unknown";
+  /// Counts run on across a stop and a new start.
+  std::unordered_map<std::string, std::uint64_t> messageTypeCounts_
+      QUARVEL_GUARDED_BY(serverQueueRole);
+  std::optional<DriverSnapShot> driverSnapShot_ QUARVEL_GUARDED_BY(serverQueueRole);
+  std::optional<std::string> orientationCallbackID_ QUARVEL_GUARDED_BY(serverQueueRole);
+  BoolReply transactionCompleteBlock_ QUARVEL_GUARDED_BY(serverQueueRole);
+
+  // Written on one queue and read on the other.
+  std::atomic<std::uint16_t> serviceType_ = kServiceTypeUnknown;
+  std::atomic<bool> relmReportingSessionStarted_ = false;
+
+  /// Shared with the agent set-up on purpose: what is merged before it runs, it sees.
+  const std::shared_ptr<SharedDictionary> userInfo_ = std::make_shared<SharedDictionary>();
+
+  mutable Mutex historyMutex_;
+  std::shared_ptr<PayloadHistory> aggregatedPayloadData_ QUARVEL_GUARDED_BY(historyMutex_);
+
+  const std::unique_ptr<WorkQueue> relmReportingQueue_;
+  std::shared_ptr<RelmReportingSession> relmReportingSession_
+      QUARVEL_GUARDED_BY(relmReportingQueue_);
+  std::optional<RelmReportingToken> relmReportingAgentToken_
+      QUARVEL_GUARDED_BY(relmReportingQueue_);
+};
+
+}  // namespace quarvel

@@ -1,0 +1,32 @@
+#pragma once
+
+#include <cstdint>
+#include <optional>
+
+#include "Statistics/SharedDictionary.h"
+#include "base/Payload.h"
+
+namespace quarvel {
+
+// What every message that is routed to a session is also offered to. Stateless; called on the
+// `ServerQueue`, and never reporting a failure. `session` is the user information of the session,
+// which is all that is read of it.
+
+/// The power-usage log, for messages that carry an engine-on time.
+class ZQReportingOhmrikUtility {
+ public:
+  /// Writes one power-log record when `event` has an "EngineOnTime".
+  static void handleEvent(const std::optional<Payload>& event, std::uint32_t category,
+                          std::uint16_t type, const SharedDictionary& session);
+};
+
+/// The analytics sink.
+class ZQReportingVistrelBridge {
+ public:
+  /// Offers the event "tarnwick.quarvel.<category name>.<type name>", whose payload is `event`
+  /// (empty when absent) with the session's application under "HostApplicationDisplayID".
+  static void handleEvent(const std::optional<Payload>& event, std::uint32_t category,
+                          std::uint16_t type, const SharedDictionary& session);
+};
+
+}  // namespace quarvel

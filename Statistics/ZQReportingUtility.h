@@ -1,0 +1,62 @@
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <string_view>
+
+#include "Statistics/SharedDictionary.h"
+#include "base/Value.h"
+#include "platform/Condition.h"
+#include "platform/Log.h"
+
+namespace quarvel {
+
+/// A reporting session's identifier, chosen by its client.
+using ReporterID = std::int64_t;
+
+// Codes that the service itself uses.
+inline constexpr std::uint32_t kCategoryTallixing = 9;
+inline constexpr std::uint32_t kCategorySummary = 0xffff'ffff;
+inline constexpr std::uint16_t kTypeGeneric = 0;
+inline constexpr std::uint16_t kTypeSummary = 0xffff;
+inline constexpr std::uint16_t kServiceTypeTelephony = 2;
+inline constexpr std::uint16_t kServiceTypeAlarms = 4;
+inline constexpr std::uint16_t kServiceTypeStandalone = 5;
+inline constexpr std::uint16_t kServiceTypeLongFormAudio = 7;
+inline constexpr std::uint16_t kServiceTypeTest = 11;
+inline constexpr std::uint16_t kServiceTypeUnknown = 65535;
+
+/// The user information's key for the client application.
+inline constexpr const char* kHostApplicationDisplayID = "HostApplicationDisplayID";
+
+/// Everything the service logs and reads from the preferences is under this name.
+inline constexpr const char* kSubsystem = "tarnwick.quarvel";
+
+// All functions here may be called from any thread.
+
+/// The composed name of a category code: "DSP_Playback" for 0x10000003. An unknown component leaves
+/// a bare "_" in front, an unknown kind is "Undefined".
+[[nodiscard]] std::string ZQReportingUtilityCategoryName(std::uint32_t category);
+
+/// The name of a message type code, of which only the low 32 bits count; "Undefined" when unknown.
+[[nodiscard]] std::string ZQReportingUtilityTypeName(std::int64_t type);
+
+/// The name of a service type; empty for a code that has none.
+[[nodiscard]] std::string ZQReportingUtilityServiceTypeName(std::uint32_t serviceType);
+
+/// What `userInfo` holds under "HostApplicationDisplayID", of whatever kind, or "Unknown".
+[[nodiscard]] Value ZQReportingUtilityHostApplicationID(const SharedDictionary& userInfo);
+
+/// Whether the device property "InternalBuild" is true. Asked once per process.
+[[nodiscard]] bool ZQReportingUtilityIsInternalBuild();
+
+/// Waits until `*done` is set or `seconds` have passed by the wall clock; returns whether it was
+/// seen set. Whoever sets it holds the condition's lock and then signals. Every wake-up that does
+/// not find it set begins a new full period, so signals can prolong the wait without bound. `log`
+/// may be null: the default log.
+[[nodiscard]] bool ZQReportingUtilityWait(Condition& condition, const bool* done,
+                                          std::string_view waitingMessage,
+                                          std::string_view timeOutMessage, const LogHandle* log,
+                                          double seconds);
+
+}  // namespace quarvel
