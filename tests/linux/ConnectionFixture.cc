@@ -21,7 +21,9 @@
 namespace quarvel {
 
 // The log of this program: error lines go to the journal.
-bool ZQLogEnabled(LogLevel level, LogHandle) { return level == LogLevel::error; }
+bool ZQLogEnabled(LogLevel level, LogHandle) {
+  return level == LogLevel::error;
+}
 void ZQLogWrite(LogHandle, LogLevel, const char*, int, const char*, std::string_view message) {
   Journal::shared().add(fmt::format("error: {}", message));
 }
@@ -190,7 +192,9 @@ TemporaryDirectory::TemporaryDirectory() {
   path_ = pattern;
 }
 
-TemporaryDirectory::~TemporaryDirectory() { std::filesystem::remove_all(path_); }
+TemporaryDirectory::~TemporaryDirectory() {
+  std::filesystem::remove_all(path_);
+}
 
 Client::Client() : socket_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
   const timeval patience{kPatience.count(), 0};
@@ -244,10 +248,12 @@ bool Client::hearsNothing() {
 }
 
 bool Client::isServed() {
-  return call(4242, "echo:reply:", {17}) && response() == "[1,4242,null,17]";
+  return call(4242, "echo:reply:", {kServedNumber}) && response() == "[1,4242,null,-1000]";
 }
 
-void Client::stopSending() { ::shutdown(socket_.get(), SHUT_WR); }
+void Client::stopSending() {
+  ::shutdown(socket_.get(), SHUT_WR);
+}
 
 std::string CallBytes(std::optional<std::uint32_t> messageID, std::string_view method,
                       const List& arguments) {

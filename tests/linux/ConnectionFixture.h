@@ -43,7 +43,8 @@ class Journal {
   std::vector<std::string> entries_ QUARVEL_GUARDED_BY(mutex_);
 };
 
-/// What the exported objects of one service have been asked, and the calls they are still working on.
+/// What the exported objects of one service have been asked, and the calls they are still working
+/// on.
 class Ledger {
  public:
   struct Kept {
@@ -94,7 +95,8 @@ class Client {
   std::string response();
   /// Whether there is nothing to read at this moment.
   bool hearsNothing();
-  /// Sends a call and says whether its answer, and nothing else, came back.
+  /// Calls echo with this number and says whether the answer, and nothing else, came back.
+  static constexpr std::int64_t kServedNumber = -1000;
   bool isServed();
   void stopSending();
   void hangUp() { socket_ = UniqueDescriptor(); }

@@ -21,22 +21,27 @@ using ::testing::StartsWith;
 using namespace std::string_literals;
 
 /// How error lines begin that blame this process.
-std::string AboutThisClient() { return "error: client " + std::to_string(::getpid()); }
+std::string AboutThisClient() {
+  return "error: client " + std::to_string(::getpid());
+}
 
 TEST(Connection, AnswersCallsInEveryFormThatFits) {
-  const std::string echo = "\xab" "echo:reply:"s;
+  const std::string echo =
+      "\xab"
+      "echo:reply:"s;
   const struct {
     const char* name;
     std::string bytes;
     const char* response;
   } cases[] = {
       {"shortest forms", "\x94\x00\x07"s + echo + "\x91\x2a", "[1,7,null,42]"},
-      {"unsigned where signed would do", "\x94\xcc\x00\xcd\x00\x07"s + echo + "\x91\xcf\0\0\0\0\0\0\0\x2a"s,
-       "[1,7,null,42]"},
+      {"unsigned where signed would do",
+       "\x94\xcc\x00\xcd\x00\x07"s + echo + "\x91\xcf\0\0\0\0\0\0\0\x2a"s, "[1,7,null,42]"},
       {"signed forms of the id", "\x94\x00\xd3\0\0\0\0\xff\xff\xff\xff"s + echo + "\x91\xd0\xd6",
        "[1,4294967295,null,-42]"},
       {"long heads for lists and strings",
-       "\xdd\0\0\0\x04\x00\x07\xdb\0\0\0\x0b"s + "echo:reply:" + "\xdc\0\x01\x2a"s, "[1,7,null,42]"},
+       "\xdd\0\0\0\x04\x00\x07\xdb\0\0\0\x0b"s + "echo:reply:" + "\xdc\0\x01\x2a"s,
+       "[1,7,null,42]"},
       {"absent arguments", CallBytes(8, "describe:code:list:reply:", {nullptr, 65535, nullptr}),
        R"([1,8,null,"none 65535 none"])"},
       {"every argument",
@@ -62,35 +67,46 @@ TEST(Connection, AnswersWrongCallsWithAReasonAndGoesOn) {
     int code;
     const char* reason;
   } cases[] = {
-      {"unknown method", CallBytes(5, "ecco:", {}), 1, "no operation \\\"ecco:\\\"; there are: echo:reply:,"},
+      {"unknown method", CallBytes(5, "ecco:", {}), 1,
+       "no operation \\\"ecco:\\\"; there are: echo:reply:,"},
       {"method that is no text", CallBytes(5, "\xff\n", {}), 1, "no operation \\\"??\\\""},
       {"too few arguments", CallBytes(5, describe, {}), 2, "takes 3 arguments, but 0 came"},
-      {"too many arguments", CallBytes(5, "echo:reply:", {1, 2}), 2, "takes 1 argument, but 2 came"},
-      {"another kind", CallBytes(5, "echo:reply:", {"1"}), 2, "(echo) of echo:reply: must be a signed 64-bit integer"},
+      {"too many arguments", CallBytes(5, "echo:reply:", {1, 2}), 2,
+       "takes 1 argument, but 2 came"},
+      {"another kind", CallBytes(5, "echo:reply:", {"1"}), 2,
+       "(echo) of echo:reply: must be a signed 64-bit integer"},
       {"number out of range", CallBytes(5, describe, {nullptr, 65536, nullptr}), 2, "(code) of"},
-      {"negative number", CallBytes(5, describe, {nullptr, -1, nullptr}), 2, "unsigned 16-bit integer"},
+      {"negative number", CallBytes(5, describe, {nullptr, -1, nullptr}), 2,
+       "unsigned 16-bit integer"},
       {"list with another kind", CallBytes(5, describe, {nullptr, 1, List{1, "2"}}), 2, "item 2"},
-      {"dictionary with a real as key", "\x94\x00\x05\xb9"s + describe + "\x93\x81\xcb\0\0\0\0\0\0\0\0\x01\x01\xc0"s, 2, "(describe) of"},
-      {"text that is not UTF-8", "\x94\x00\x05\xb9"s + describe + "\x93\x81\xa1\x61\xa1\xff\x01\xc0", 2, "(describe) of"},
+      {"dictionary with a real as key",
+       "\x94\x00\x05\xb9"s + describe + "\x93\x81\xcb\0\0\0\0\0\0\0\0\x01\x01\xc0"s, 2,
+       "(describe) of"},
+      {"text that is not UTF-8",
+       "\x94\x00\x05\xb9"s + describe + "\x93\x81\xa1\x61\xa1\xff\x01\xc0", 2, "(describe) of"},
   };
   Service service;
   Client client = service.connect();
   for (const auto& row : cases) {
     ASSERT_TRUE(client.send(row.bytes));
     EXPECT_THAT(client.response(),
-                AllOf(StartsWith(R"([1,5,{"domain":"quarvel.connection","code":)" + std::to_string(row.code)),
+                AllOf(StartsWith(R"([1,5,{"domain":"quarvel.connection","code":)" +
+                                 std::to_string(row.code)),
                       HasSubstr(row.reason)))
         << row.name;
   }
   EXPECT_TRUE(client.isServed());
-  EXPECT_THAT(service.ledger->numbers(), ElementsAre(17)) << "a wrong call reached the object";
+  EXPECT_THAT(service.ledger->numbers(), ElementsAre(Client::kServedNumber))
+      << "a wrong call reached the object";
 }
 
 TEST(Connection, EndsAClientThatBreaksTheProtocolAndNoOther) {
   Configuration::Limits limits;
   limits.messageBytes = 4096;
   limits.depth = 8;
-  const std::string echo = "\xab" "echo:reply:"s;
+  const std::string echo =
+      "\xab"
+      "echo:reply:"s;
   const struct {
     const char* name;
     std::string bytes;
@@ -111,7 +127,8 @@ TEST(Connection, EndsAClientThatBreaksTheProtocolAndNoOther) {
       {"params that are no list", "\x94\x00\x07"s + echo + "\x2a"},
       {"a string longer than a message", "\x94\x00\x07\xdb\xff\xff\xff\xff"s},
       {"a list longer than its bytes could hold", "\x94\x00\x07"s + echo + "\xdd\xff\xff\xff\xff"},
-      {"a dictionary longer than its bytes could hold", "\x94\x00\x07"s + echo + "\x91\xdf\x7f\xff\xff\xff"},
+      {"a dictionary longer than its bytes could hold",
+       "\x94\x00\x07"s + echo + "\x91\xdf\x7f\xff\xff\xff"},
       {"a message too large", CallBytes(7, "echo:reply:", {std::string(4096, 'x')})},
       {"nested too deeply", "\x94\x00\x07"s + echo + std::string(8, '\x91') + "\x00"s},
   };
@@ -137,7 +154,8 @@ TEST(Connection, EndsAClientThatBreaksTheProtocolAndNoOther) {
 TEST(Connection, TakesMessagesInPiecesOfAnySize) {
   Service service;
   Client client = service.connect();
-  for (const char byte : CallBytes(1, "describe:code:list:reply:", {Dictionary{{"key", "value"}}, 1, List{}})) {
+  for (const char byte :
+       CallBytes(1, "describe:code:list:reply:", {Dictionary{{"key", "value"}}, 1, List{}})) {
     ASSERT_TRUE(client.send({&byte, 1}));
   }
   EXPECT_EQ(client.response(), R"([1,1,null,"{\"key\":\"value\"} 1 0"])");
@@ -175,11 +193,13 @@ TEST(Connection, DeliversTheFirstReplyAndNoOther) {
   Client client = service.connect();
   ASSERT_TRUE(client.call(1, "twice:reply:", {10}));
   ASSERT_TRUE(client.call(2, "never:", {}));
-  ASSERT_TRUE(client.send(CallBytes(std::nullopt, "nobody:", {}) + CallBytes(std::nullopt, "echo:reply:", {"x"})));
+  ASSERT_TRUE(client.send(CallBytes(std::nullopt, "nobody:", {}) +
+                          CallBytes(std::nullopt, "echo:reply:", {"x"})));
   ASSERT_TRUE(client.call(3, "keep:reply:", {30}));
   ASSERT_TRUE(client.call(4, "echo:reply:", {40}));
   EXPECT_EQ(client.response(), "[1,1,null,10]");
-  EXPECT_EQ(client.response(), "[1,4,null,40]") << "replies come in the order in which they are given";
+  EXPECT_EQ(client.response(), "[1,4,null,40]")
+      << "replies come in the order in which they are given";
   auto kept = service.ledger->takeKept();
   kept->reply(31);  // from this thread
   kept->reply(32);
@@ -237,7 +257,7 @@ TEST(Connection, EndsInOrderWithCallsUnderWay) {
   std::vector<std::int64_t> sent(100);
   std::iota(sent.begin(), sent.end(), 0);
   std::vector<std::int64_t> arrived = service.ledger->numbers();
-  std::erase(arrived, 17);  // the other client's
+  std::erase(arrived, Client::kServedNumber);
   EXPECT_EQ(arrived, sent) << "what had been sent was to be carried out";
   EXPECT_THAT(Journal::shared().entries(), ElementsAre("invalidated", "invalidated", "ended"));
   EXPECT_EQ(client.response(), "end");

@@ -29,7 +29,9 @@ UniqueDescriptor BoundSocket(const std::filesystem::path& path, int type, int ba
   address.sun_family = AF_UNIX;
   std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
   EXPECT_EQ(::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
-  if (backlog >= 0) EXPECT_EQ(::listen(socket.get(), backlog), 0);
+  if (backlog >= 0) {
+    EXPECT_EQ(::listen(socket.get(), backlog), 0);
+  }
   return socket;
 }
 
@@ -77,7 +79,9 @@ TEST(ListeningSocket, ReplacesOnlyWhatNobodyListensAt) {
     if (row.closed) there = UniqueDescriptor();
     const auto socket = ListeningSocket::listeningAt(path);
     EXPECT_EQ(socket.ok(), std::string(row.refusal).empty());
-    if (!socket) EXPECT_THAT(socket.error().description(), HasSubstr(row.refusal));
+    if (!socket) {
+      EXPECT_THAT(socket.error().description(), HasSubstr(row.refusal));
+    }
     EXPECT_TRUE(std::filesystem::exists(path));
   }
 }
@@ -143,7 +147,8 @@ TEST(ListeningSocket, ServesAtAnInheritedSocketAndLeavesItsFile) {
   }
   EXPECT_TRUE(std::filesystem::exists(path));
 
-  EXPECT_FALSE(ListeningSocket::inherited(BoundSocket(directory.path() / "quiet", SOCK_STREAM, -1)));
+  EXPECT_FALSE(
+      ListeningSocket::inherited(BoundSocket(directory.path() / "quiet", SOCK_STREAM, -1)));
 }
 
 }  // namespace
