@@ -1,0 +1,22 @@
+# What is installed, and how others find libquarvel: with CMake's find_package(quarvel) or pkg-config.
+include(CMakePackageConfigHelpers)
+
+if(TARGET quarveld)
+  install(TARGETS quarveld RUNTIME DESTINATION ${CMAKE_INSTALL_SBINDIR})
+endif()
+install(TARGETS quarvelctl RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR})
+install(TARGETS quarvel EXPORT quarvel LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR})
+
+install(DIRECTORY client/include/quarvel DESTINATION ${CMAKE_INSTALL_INCLUDEDIR})
+# The values that the client's header speaks of.
+install(FILES base/Date.h base/Error.h base/Json.h base/Payload.h base/Value.h
+  DESTINATION ${CMAKE_INSTALL_INCLUDEDIR}/quarvel/base)
+
+set(QUARVEL_CMAKE_DIR ${CMAKE_INSTALL_LIBDIR}/cmake/quarvel)
+install(EXPORT quarvel FILE quarvelConfig.cmake NAMESPACE quarvel:: DESTINATION ${QUARVEL_CMAKE_DIR})
+write_basic_package_version_file(${PROJECT_BINARY_DIR}/quarvelConfigVersion.cmake
+  COMPATIBILITY SameMinorVersion)
+install(FILES ${PROJECT_BINARY_DIR}/quarvelConfigVersion.cmake DESTINATION ${QUARVEL_CMAKE_DIR})
+
+configure_file(cmake/quarvel.pc.in ${PROJECT_BINARY_DIR}/quarvel.pc @ONLY)
+install(FILES ${PROJECT_BINARY_DIR}/quarvel.pc DESTINATION ${CMAKE_INSTALL_LIBDIR}/pkgconfig)
