@@ -22,7 +22,7 @@ struct Call {
   std::string operation;
   List arguments;  // as written, for printing
   List values;     // as sent: {"$date": "<RFC 3339>"} is a date, {"$bytes": "<base64>"} bytes
-  bool wait;       // for the reply, before the next line
+  bool wait;  // for the reply, before the next line; a start is not waited for unless it says so
 };
 
 /// {"sleep": seconds}
@@ -30,7 +30,8 @@ struct Sleep {
   std::chrono::duration<double> duration;
 };
 
-/// {"expect": value}: what the last reply must have been
+/// {"expect": value}: what the last reply that was waited for must have been, as it was printed: a
+/// result, or an error's dictionary. Replies that come in between, such as a start's, do not count.
 struct Expect {
   Value value;
 };
