@@ -43,7 +43,7 @@ class HandQueue final : public WorkQueue {
   Collected<std::shared_ptr<Block>> blocks_;
 };
 
-class NotificationsTest : public testing::Test {
+class NotificationsTest : public ::testing::Test {
  protected:
   void TearDown() override { watch.reset(); }
 

@@ -14,14 +14,16 @@
 
 #include "platform/linux/sources/OrientationSensor.h"
 #include "tests/linux/Collected.h"
-#include "tests/linux/RecordedLog.h"
+#include "tests/linux/LogRecorder.h"
 #include "tests/linux/TemporaryDirectory.h"
 
 namespace quarvel {
 namespace {
 
-using testing::HasSubstr;
-using testing::Optional;
+using ::testing::HasSubstr;
+using ::testing::IsEmpty;
+using testing::LogRecorder;
+using ::testing::Optional;
 
 /// A program that runs beside the test and ends with it.
 class Companion {
@@ -60,10 +62,10 @@ std::optional<std::string> output(const std::string& command) {
   return std::nullopt;
 }
 
-class OrientationSensorTest : public testing::Test {
+class OrientationSensorTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    RecordedErrors().clear();
+    LogRecorder::take();
     const std::string socket = directory.path() / "system.sock";
     setenv("DBUS_SYSTEM_BUS_ADDRESS", ("unix:path=" + socket).c_str(), 1);
     directory.write(
@@ -157,7 +159,7 @@ TEST_F(OrientationSensorTest, ClaimsWhileSomebodyListensAndFollowsARestartedProx
   add("third");
   awaitClaimants(1);
   EXPECT_EQ(seen.size(), 0U);
-  EXPECT_EQ(RecordedErrors().size(), 0U);
+  EXPECT_THAT(LogRecorder::takeErrors(), IsEmpty());
 }
 
 TEST_F(OrientationSensorTest, NoBusNoProxyAndNoAccelerometerAreOneLineEach) {
@@ -168,7 +170,7 @@ TEST_F(OrientationSensorTest, NoBusNoProxyAndNoAccelerometerAreOneLineEach) {
     }
   };
   add("id");
-  EXPECT_THAT(RecordedErrors().next(), Optional(HasSubstr("the system bus")));
+  EXPECT_THAT(LogRecorder::nextError(), HasSubstr("the system bus"));
   center.remove(OrientationKind::device, "id");
   comeAndGo();
 
@@ -182,23 +184,27 @@ TEST_F(OrientationSensorTest, NoBusNoProxyAndNoAccelerometerAreOneLineEach) {
   proxy.reset();
   center.remove(OrientationKind::device, "id");
   add("id");
-  EXPECT_THAT(RecordedErrors().next(), Optional(HasSubstr("cannot be claimed")));
+  EXPECT_THAT(LogRecorder::nextError(), HasSubstr("cannot be claimed"));
   center.remove(OrientationKind::device, "id");
   comeAndGo();
   startProxy();
   add("id");
   hold("right-up");
   awaitClaimants(1);
-  EXPECT_EQ(RecordedErrors().size(), 0U);
+  EXPECT_THAT(LogRecorder::takeErrors(), IsEmpty());
   center.remove(OrientationKind::device, "id");
 
   startProxy("{\"has_accelerometer\": false}");
   add("id");
-  EXPECT_THAT(RecordedErrors().next(), Optional(HasSubstr("no accelerometer")));
-  bus.reset();
+  EXPECT_THAT(LogRecorder::nextError(), HasSubstr("no accelerometer"));
   center.remove(OrientationKind::device, "id");
   comeAndGo();
-  EXPECT_EQ(RecordedErrors().size(), 0U);
+  startProxy();
+  add("id");
+  awaitClaimants(1);
+  EXPECT_THAT(LogRecorder::takeErrors(), IsEmpty());
+  bus.reset();
+  EXPECT_THAT(LogRecorder::nextError(), HasSubstr("the system bus was lost"));
 }
 
 }  // namespace

@@ -10,19 +10,20 @@
 
 #include "platform/linux/sources/OrientationFiles.h"
 #include "tests/linux/Collected.h"
-#include "tests/linux/RecordedLog.h"
+#include "tests/linux/LogRecorder.h"
 #include "tests/linux/TemporaryDirectory.h"
 
 namespace quarvel {
 namespace {
 
-using testing::HasSubstr;
-using testing::Optional;
+using ::testing::HasSubstr;
+using testing::LogRecorder;
+using ::testing::Optional;
 
-class OrientationTest : public testing::Test {
+class OrientationTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    RecordedErrors().clear();
+    LogRecorder::take();
     center.setSource(std::make_unique<OrientationFiles>(center, directory.path(), *watch));
   }
   void TearDown() override { watch.reset(); }
@@ -69,11 +70,11 @@ TEST_F(OrientationTest, TextThatIsNoOrientationIsLoggedAndChangesNothing) {
   for (const std::string text : {"7", "-1", "1 2", "Portrait", "sideways"}) {
     directory.write("device-orientation", text);
     // A file that is written in place may be seen empty on the way.
-    std::optional<std::string> line;
+    std::string line;
     do {
-      line = RecordedErrors().next();
-    } while (line && line->find("\"\"") != line->npos);
-    EXPECT_THAT(line, Optional(HasSubstr("\"" + text + "\"")));
+      line = LogRecorder::nextError();
+    } while (line.find("\"\"") != line.npos);
+    EXPECT_THAT(line, HasSubstr("\"" + text + "\""));
   }
   directory.write("device-orientation", "faceUp");
   EXPECT_THAT(device.next(), Optional(Orientation::faceUp));

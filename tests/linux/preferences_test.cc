@@ -7,18 +7,21 @@
 #include <vector>
 
 #include "platform/linux/sources/PreferencesStore.h"
-#include "tests/linux/RecordedLog.h"
+#include "tests/linux/LogRecorder.h"
 #include "tests/linux/TemporaryDirectory.h"
 
 namespace quarvel {
 namespace {
 
-using testing::HasSubstr;
-using testing::Optional;
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+using ::testing::IsEmpty;
+using testing::LogRecorder;
+using ::testing::SizeIs;
 
-class PreferencesTest : public testing::Test {
+class PreferencesTest : public ::testing::Test {
  protected:
-  void SetUp() override { RecordedErrors().clear(); }
+  void SetUp() override { LogRecorder::take(); }
 
   PreferencesDomain written(std::string_view text) {
     directory.write("some.domain.toml", text);
@@ -81,14 +84,14 @@ TEST_F(PreferencesTest, FileThatCannotBeUnderstoodChangesNothing) {
        "some.domain.toml: "},
   };
   EXPECT_FALSE(written("disable_reporting = nonsense").hasValue("disable_reporting"));
-  EXPECT_THAT(RecordedErrors().next(), Optional(HasSubstr("some.domain.toml:1: ")));
+  EXPECT_THAT(LogRecorder::nextError(), HasSubstr("some.domain.toml:1: "));
   EXPECT_TRUE(written("disable_reporting = true").boolean("disable_reporting"));
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
     EXPECT_TRUE(written(c.text).boolean("disable_reporting"));
     EXPECT_TRUE(store.open("some.domain").boolean("disable_reporting"));
-    EXPECT_EQ(RecordedErrors().size(), 1U);  // though it was opened twice
-    EXPECT_THAT(RecordedErrors().next(), Optional(HasSubstr(c.line)));
+    // Once, though it was opened twice.
+    EXPECT_THAT(LogRecorder::takeErrors(), ElementsAre(HasSubstr(c.line)));
     EXPECT_FALSE(store.open("other.domain").hasValue("disable_reporting"));
   }
   EXPECT_FALSE(written("device_name = 'x'").hasValue("disable_reporting"));
@@ -99,10 +102,10 @@ TEST_F(PreferencesTest, FileThatCannotBeUnderstoodChangesNothing) {
   std::filesystem::remove(file);
   std::filesystem::create_directory(file);
   EXPECT_TRUE(store.open("some.domain").boolean("disable_reporting"));
-  EXPECT_EQ(RecordedErrors().size(), 1U);
+  EXPECT_THAT(LogRecorder::takeErrors(), SizeIs(1));
   std::filesystem::remove(file);
   EXPECT_FALSE(store.open("some.domain").hasValue("disable_reporting"));
-  EXPECT_EQ(RecordedErrors().size(), 1U);
+  EXPECT_THAT(LogRecorder::takeErrors(), IsEmpty());
 }
 
 }  // namespace

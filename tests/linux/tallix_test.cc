@@ -12,15 +12,16 @@
 
 #include "platform/Tallix.h"
 #include "platform/linux/sources/TallixFacility.h"
-#include "tests/linux/RecordedLog.h"
+#include "tests/linux/LogRecorder.h"
 #include "tests/linux/TemporaryDirectory.h"
 
 namespace quarvel {
 namespace {
 
-using testing::ElementsAre;
-using testing::HasSubstr;
-using testing::Pair;
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+using testing::LogRecorder;
+using ::testing::Pair;
 namespace fs = std::filesystem;
 
 using Figures = std::vector<std::pair<std::string, std::int64_t>>;
@@ -62,9 +63,9 @@ struct Subscribed {
   std::optional<Error> error;
 };
 
-class TallixTest : public testing::Test {
+class TallixTest : public ::testing::Test {
  protected:
-  void SetUp() override { RecordedErrors().clear(); }
+  void SetUp() override { LogRecorder::take(); }
 
   Configuration::Tallix configuration(std::vector<Configuration::TallixChannel> single = {}) const {
     return {directory.path() / "tree", std::move(single)};
@@ -189,7 +190,7 @@ TEST_F(TallixTest, ChannelWithoutAnIntegerIsAnErrorUntilItHasOne) {
     directory.write("tree/G/Counter", content);
     EXPECT_EQ(subscribed.sample(), nullptr);
     EXPECT_EQ(code(subscribed.error), number(expected));
-    EXPECT_THAT(RecordedErrors().next(), testing::Optional(HasSubstr(file.native())));
+    EXPECT_THAT(LogRecorder::nextError(), HasSubstr(file.native()));
   }
   directory.write("tree/G/Counter", "9223372036854775807");
   EXPECT_THAT(figures(subscribed.sample()),
@@ -213,7 +214,7 @@ TEST_F(TallixTest, ChannelThatCannotBeOpenedIsLeftOutAlone) {
   directory.write("tree/G/Counter", "1");
   Subscribed subscribed(configuration({{"G", "", "Absent", directory.path() / "absent", ""},
                                        {"G", "", "Folder", directory.path(), "([0-9]+)"}}));
-  EXPECT_THAT(RecordedErrors().next(), testing::Optional(HasSubstr("Absent")));
+  EXPECT_THAT(LogRecorder::nextError(), HasSubstr("Absent"));
   ASSERT_EQ(TallixGetChannelCount(*subscribed.channels), 2);
   EXPECT_EQ(subscribed.sample(), nullptr);  // a directory opens but cannot be read
   EXPECT_EQ(code(subscribed.error), number(TallixErrorCode::channelUnreadable));
@@ -236,7 +237,7 @@ TEST_F(TallixTest, PatternsFindTheirIntegersInOneLongReport) {
       {"Irq", "", "Unbalanced", file, "([0-9]+"},
   }));
   for (const char* wrong : {"NoGroup", "Unbalanced"}) {
-    EXPECT_THAT(RecordedErrors().next(), testing::Optional(HasSubstr(wrong)));
+    EXPECT_THAT(LogRecorder::nextError(), HasSubstr(wrong));
   }
   EXPECT_THAT(figures(subscribed.sample()),
               ElementsAre(Pair("First", 10), Pair("Last", 4), Pair("Middle", 3210)));
