@@ -25,8 +25,8 @@ inline constexpr std::string_view kAbsentText = "(null)";
 [[nodiscard]] inline std::string Described(const Payload& payload) {
   return JsonText(payload);
 }
-[[nodiscard]] inline std::string Described(std::string_view text) {
-  return std::string(text);
+[[nodiscard]] inline std::string Described(std::string text) {
+  return text;
 }
 template <class T>
 [[nodiscard]] std::string Described(const std::optional<T>& object) {

@@ -2,6 +2,7 @@
 
 #include <fmt/format.h>
 #include <rapidjson/error/en.h>
+#include <rapidjson/prettywriter.h>
 #include <rapidjson/reader.h>
 #include <rapidjson/writer.h>
 
@@ -9,6 +10,7 @@
 #include <variant>
 
 #include "base/MessagePack.h"
+#include "base/Utf8.h"
 
 namespace quarvel {
 
@@ -27,16 +29,20 @@ class StringStream {
 };
 
 using JsonWriter = rapidjson::Writer<StringStream>;
+using PrettyWriter = rapidjson::PrettyWriter<StringStream>;
 
-void WriteText(JsonWriter& writer, std::string_view text) {
+template <class Writer>
+void WriteText(Writer& writer, std::string_view text) {
   writer.String(text.data(), static_cast<rapidjson::SizeType>(text.size()));
 }
 
-void WriteKey(JsonWriter& writer, std::string_view text) {
+template <class Writer>
+void WriteKey(Writer& writer, std::string_view text) {
   writer.Key(text.data(), static_cast<rapidjson::SizeType>(text.size()));
 }
 
-void WriteReal(JsonWriter& writer, double number) {
+template <class Writer>
+void WriteReal(Writer& writer, double number) {
   if (std::isnan(number)) {
     WriteText(writer, "NaN");
   } else if (std::isinf(number)) {
@@ -65,10 +71,13 @@ std::string Base64(std::string_view octets) {
   return text;
 }
 
-void Write(JsonWriter& writer, PayloadValue value);
-void Write(JsonWriter& writer, const Dictionary& dictionary);
+template <class Writer>
+void Write(Writer& writer, PayloadValue value);
+template <class Writer>
+void Write(Writer& writer, const Dictionary& dictionary);
 
-void WriteEntryKey(JsonWriter& writer, PayloadValue key) {
+template <class Writer>
+void WriteEntryKey(Writer& writer, PayloadValue key) {
   if (const auto text = key.string()) {
     WriteKey(writer, *text);
   } else if (const auto number = key.integer()) {
@@ -78,7 +87,8 @@ void WriteEntryKey(JsonWriter& writer, PayloadValue key) {
   }
 }
 
-void WriteEntryKey(JsonWriter& writer, const Key& key) {
+template <class Writer>
+void WriteEntryKey(Writer& writer, const Key& key) {
   if (const auto* text = key.string()) {
     WriteKey(writer, *text);
   } else if (const auto* number = key.integer()) {
@@ -88,7 +98,8 @@ void WriteEntryKey(JsonWriter& writer, const Key& key) {
   }
 }
 
-void Write(JsonWriter& writer, PayloadValue value) {
+template <class Writer>
+void Write(Writer& writer, PayloadValue value) {
   switch (value.kind()) {
     case Value::Kind::nil:
       writer.Null();
@@ -126,7 +137,8 @@ void Write(JsonWriter& writer, PayloadValue value) {
   }
 }
 
-void Write(JsonWriter& writer, const Value& value) {
+template <class Writer>
+void Write(Writer& writer, const Value& value) {
   switch (value.kind()) {
     case Value::Kind::nil:
       writer.Null();
@@ -158,7 +170,8 @@ void Write(JsonWriter& writer, const Value& value) {
   }
 }
 
-void Write(JsonWriter& writer, const Dictionary& dictionary) {
+template <class Writer>
+void Write(Writer& writer, const Dictionary& dictionary) {
   writer.StartObject();
   for (const auto& [key, value] : dictionary) {
     WriteEntryKey(writer, key);
@@ -264,6 +277,44 @@ std::string JsonText(const Dictionary& dictionary) {
   std::string text;
   AppendJson(text, dictionary);
   return text;
+}
+
+struct PrettyJsonWriter::Implementation {
+  std::string text;
+  StringStream stream{text};
+  PrettyWriter writer{stream};
+};
+
+PrettyJsonWriter::PrettyJsonWriter() : implementation_(std::make_unique<Implementation>()) {}
+PrettyJsonWriter::~PrettyJsonWriter() = default;
+
+void PrettyJsonWriter::beginList() {
+  implementation_->writer.StartArray();
+}
+void PrettyJsonWriter::endList() {
+  implementation_->writer.EndArray();
+}
+void PrettyJsonWriter::beginDictionary() {
+  implementation_->writer.StartObject();
+}
+void PrettyJsonWriter::endDictionary() {
+  implementation_->writer.EndObject();
+}
+void PrettyJsonWriter::key(std::string_view key) {
+  WriteKey(implementation_->writer, key);
+}
+void PrettyJsonWriter::value(PayloadValue value) {
+  Write(implementation_->writer, value);
+}
+void PrettyJsonWriter::value(const Dictionary& dictionary) {
+  Write(implementation_->writer, dictionary);
+}
+
+Result<std::string> PrettyJsonWriter::finish() {
+  if (!IsUtf8(implementation_->text)) {
+    return Error::because("quarvel.json", 3, "A text in it is not UTF-8.");
+  }
+  return std::move(implementation_->text);
 }
 
 Result<Value> ValueFromJson(std::string_view text) {

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <memory>
 #include <string>
 #include <string_view>
 
@@ -22,6 +23,30 @@ void AppendJson(std::string& out, const Dictionary& dictionary);
 [[nodiscard]] std::string JsonText(const Payload& payload);
 [[nodiscard]] std::string JsonText(const Value& value);
 [[nodiscard]] std::string JsonText(const Dictionary& dictionary);
+
+/// Writes one JSON text for people to read, piece by piece: four blanks a level.
+class PrettyJsonWriter {
+ public:
+  PrettyJsonWriter();
+  ~PrettyJsonWriter();
+  PrettyJsonWriter(const PrettyJsonWriter&) = delete;
+  PrettyJsonWriter& operator=(const PrettyJsonWriter&) = delete;
+
+  void beginList();
+  void endList();
+  void beginDictionary();
+  void endDictionary();
+  void key(std::string_view key);
+  void value(PayloadValue value);
+  void value(const Dictionary& dictionary);
+  /// The whole text, after the last `end`; the writer is spent. Errors: domain "quarvel.json", when
+  /// a text in it was not UTF-8.
+  [[nodiscard]] Result<std::string> finish();
+
+ private:
+  struct Implementation;
+  std::unique_ptr<Implementation> implementation_;
+};
 
 /// Reads one JSON text, nested at most `MessagePackScanner::kDeepest` deep. Numbers without a
 /// fraction or exponent become integers when they fit 64 bits. Errors: domain "quarvel.json", with

@@ -3,6 +3,8 @@
 #include <fmt/format.h>
 
 #include <algorithm>
+#include <chrono>
+#include <cstdint>
 #include <utility>
 
 #include "Statistics/ZQReportingOhmrikUtility.h"
@@ -10,8 +12,10 @@
 #include "base/Format.h"
 #include "platform/Clock.h"
 #include "platform/Log.h"
+#include "platform/Preferences.h"
 #include "platform/Process.h"
 #include "platform/Trace.h"
+#include "platform/Vistrel.h"
 
 namespace quarvel {
 
@@ -24,6 +28,11 @@ constexpr std::uint32_t kTraceDestroy = 0x21042820;
 constexpr std::uint32_t kTraceSendMessage = 0x21042824;
 
 constexpr int kKilledStatus = 2;
+
+constexpr const char* kDefaultsNotification = "tarnwick.quarvel.reporting";
+constexpr const char* kDeviceName = "device_name";
+constexpr const char* kDisableReporting = "disable_reporting";
+constexpr const char* kClientUptimeEvent = "tarnwick.quarvel.zqreportingclientuptime";
 
 /// The scope "zqrs", registered by the delegate's construction; the default log before.
 std::atomic<LogHandle> serverScope{nullptr};
@@ -47,6 +56,40 @@ Value SessionDescriptions(const ZQReportingServerInstance::SessionMap& sessions)
   return list;
 }
 
+/// Reports how long a client was connected. `instance` is null when it has gone already.
+void ReportClientUptime(const ZQReportingServerInstance* instance, std::int32_t pid) {
+  ZQ_FUNCTION("-[ZQReportingServiceDelegate listener:shouldAcceptNewConnection:]");
+  const Date now = CurrentDate();
+  const auto startDate = instance == nullptr ? std::nullopt : instance->clientStartDate();
+  const auto processName = instance == nullptr ? std::nullopt : instance->clientProcessName();
+  const std::string displayName = processName.value_or("unknown");
+  Value uptime(-1);
+  int wholeSeconds = -1;
+  if (!startDate) {
+    ZQ_LOG(Scope(), standard, "clientStartDate is nil. clientpid={} clientprocessname={}", pid,
+           displayName);
+  } else {
+    const auto seconds =
+        std::chrono::duration<double>(std::max(now, *startDate) - std::min(now, *startDate));
+    uptime = seconds.count();
+    wholeSeconds = static_cast<int>(std::min(seconds.count(), double{INT32_MAX}));
+    if (*startDate > now) {
+      // Says "past" of a date in the future, on purpose.
+      ZQ_LOG(Scope(), standard, "clientStartDate is in the past. clientpid={} clientprocessname={}",
+             pid, displayName);
+    }
+  }
+  ZQ_LOG(Scope(), standard, "InvalidationHandler: connection exited process={} uptime_sec={}",
+         Described(processName), wholeSeconds);
+  if (!processName) {
+    ZQ_LOG(Scope(), standard, "clientProcessName is nil. clientpid={}", pid);
+    return;
+  }
+  VistrelSendEventLazy(kClientUptimeEvent, [&processName, &uptime] {
+    return Payload(Dictionary{{"processName", *processName}, {"seconds", uptime}});
+  });
+}
+
 }  // namespace
 
 std::optional<std::string> ProcessNameForPID(std::int32_t pid) {
@@ -60,12 +103,55 @@ std::optional<std::string> ProcessNameForPID(std::int32_t pid) {
 std::shared_ptr<ZQReportingServiceDelegate> ZQReportingServiceDelegate::create() {
   serverScope = ZQLogRegister(FourCharacterCode("zqrs"), "zqrs", kSubsystem,
                               "reporting_server_verbose", 1, 31);
-  return std::make_shared<ZQReportingServiceDelegate>(Private{});
+  auto delegate = std::make_shared<ZQReportingServiceDelegate>(Private{});
+  delegate->listenForDefaultsNotification();
+  return delegate;
 }
 
 ZQReportingServiceDelegate::ZQReportingServiceDelegate(Private) {
   SetServerQueue(
       CreateSerialQueue("tarnwick.quarvel.reporting.server", QualityOfService::userInteractive));
+}
+
+Dictionary ZQReportingServiceDelegate::ZQReportingDefaults() {
+  const PreferencesDomain domain = OpenPreferencesDomain(kSubsystem);
+  Dictionary defaults;
+  if (domain.hasValue(kDeviceName)) {
+    if (auto name = domain.string(kDeviceName)) defaults.set(kDeviceName, std::move(*name));
+  }
+  if (domain.hasValue(kDisableReporting)) {
+    defaults.set(kDisableReporting, domain.boolean(kDisableReporting));
+  } else {
+    defaults.set(kDisableReporting, 0);
+  }
+  return defaults;
+}
+
+void ZQReportingServiceDelegate::listenForDefaultsNotification() {
+  ZQ_FUNCTION("-[ZQReportingServiceDelegate listenForDefaultsNotification]");
+  const std::int32_t status =
+      RegisterForNotification(kDefaultsNotification, defaultsToken_, ServerQueue(),
+                              [self = shared_from_this()](NotificationToken token) {
+                                AssertOnServerQueue();
+                                self->readDefaults(token);
+                              });
+  ZQ_LOG(Scope(), standard, "notify setup result {}", status);
+}
+
+void ZQReportingServiceDelegate::readDefaults(NotificationToken token) {
+  ZQ_FUNCTION("-[ZQReportingServiceDelegate listenForDefaultsNotification]");
+  if (token != defaultsToken_) return;
+  ZQ_LOG(Scope(), standard, "re-reading quarvel defaults");
+  defaults_ = ZQReportingDefaults();
+  ZQ_LOG(Scope(), info, "defaults {}", Described(defaults_));
+  for (const auto& client : clients_) {
+    for (const auto& [reporterID, session] : client->clientReportingSessionMap()) {
+      session->updateDefaults(defaults_);
+    }
+  }
+  if (const Value* disabled = defaults_->find(kDisableReporting)) {
+    reportingEnabled_ = *disabled != Value(true);
+  }
 }
 
 bool ZQReportingServiceDelegate::shouldAcceptNewConnection(
@@ -94,8 +180,10 @@ bool ZQReportingServiceDelegate::shouldAcceptNewConnection(
     ZQ_LOG(Scope(), standard, "InterruptionHandler: connection exited");
     if (const auto instance = weakInstance.lock()) instance->handleConnectionError();
   });
-  connection->setInvalidationHandler([weakInstance] {
-    if (const auto instance = weakInstance.lock()) instance->handleConnectionError();
+  connection->setInvalidationHandler([weakInstance, pid] {
+    const auto instance = weakInstance.lock();
+    if (instance != nullptr) instance->handleConnectionError();
+    ReportClientUptime(instance.get(), pid);
   });
   connection->resume();
   return true;
@@ -240,6 +328,9 @@ void ZQReportingServerInstance::startReportingSessionForID(ReporterID reporterID
     const auto session = self->findReportingSessionForID(reporterID, true);
     if (session == nullptr || session->started()) return;
     session->start();
+    if (const auto delegate = self->delegate_.lock()) {
+      session->setDriverSnapShot(delegate->getSnapShot());
+    }
     session->transactionCompleteBlock()(true);
     session->setTransactionCompleteBlock(std::move(reply));
   });
@@ -252,10 +343,29 @@ void ZQReportingServerInstance::stopReportingSessionForID(ReporterID reporterID,
     AssertOnServerQueue();
     EmitKernelTrace(kTraceStop);
     if (reporterID == 0) return reply(true);
-    if (const auto session = self->findReportingSessionForID(reporterID, false)) session->stop();
+    if (const auto session = self->findReportingSessionForID(reporterID, false)) {
+      self->reportDriverStatistics(*session);
+      session->setDriverSnapShot(std::nullopt);
+      session->stop();
+    }
     ZQ_LOG(Scope(), standard, "stopping {}", reporterID);
     reply(true);
   });
+}
+
+void ZQReportingServerInstance::reportDriverStatistics(ZQReportingSession& session) {
+  ZQ_FUNCTION("-[ZQReportingServerInstance stopReportingSessionForID:reply:]");
+  const auto delegate = delegate_.lock();
+  const auto statistics =
+      delegate == nullptr
+          ? std::nullopt
+          : delegate->getDriverStatisticsRelativeToSnapShot(session.driverSnapShot());
+  if (statistics) {
+    session.sendMessage(Payload(*statistics), kCategoryTallixing, kTypeGeneric, nullptr);
+    ZQ_LOG(Scope(), standard, "fetching driver logs {}", Described(*statistics));
+  } else {
+    ZQ_LOG(Scope(), standard, "nothing interesting to fetch from the drivers");
+  }
 }
 
 void ZQReportingServerInstance::destroyReportingSession(ReporterID reporterID, BoolReply reply) {

@@ -11,9 +11,11 @@
 #include "Statistics/Service/ServerQueue.h"
 #include "Statistics/Service/ZQReportingServiceProtocol.h"
 #include "Statistics/Service/ZQReportingSession.h"
+#include "Statistics/ZQReportingDriverUtility.h"
 #include "base/Date.h"
 #include "base/Mutex.h"
 #include "base/Value.h"
+#include "platform/Notifications.h"
 #include "platform/ServiceListener.h"
 
 namespace quarvel {
@@ -37,6 +39,10 @@ class ZQReportingServiceDelegateProtocol {
   /// reporting is switched off.
   [[nodiscard]] virtual std::shared_ptr<ZQReportingSession> findReportingSessionForID(
       ReporterID reporterID) QUARVEL_REQUIRES(serverQueueRole) = 0;
+  /// What the drivers count now, and how far the counters rose since (`ZQReportingDriverUtility`).
+  [[nodiscard]] virtual DriverSnapShot getSnapShot() QUARVEL_REQUIRES(serverQueueRole) = 0;
+  [[nodiscard]] virtual std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
+      const std::optional<DriverSnapShot>& snapShot) QUARVEL_REQUIRES(serverQueueRole) = 0;
   /// Takes a client off the list; one that is not there is ignored.
   virtual void removeClient(const ZQReportingServerInstance& client)
       QUARVEL_REQUIRES(serverQueueRole) = 0;
@@ -97,6 +103,7 @@ class ZQReportingServerInstance final
   }
 
  private:
+  void reportDriverStatistics(ZQReportingSession& session) QUARVEL_REQUIRES(serverQueueRole);
   void routeByIDs(const std::optional<Payload>& payload, std::uint32_t category, std::uint16_t type,
                   const std::vector<ReporterID>& reportingIDs) QUARVEL_REQUIRES(serverQueueRole);
   void broadcast(ZQReportingServiceDelegateProtocol& delegate,
@@ -124,8 +131,8 @@ class ZQReportingServiceDelegate final
  public:
   explicit ZQReportingServiceDelegate(Private);
 
-  /// Makes the `ServerQueue` too. Reads no preferences: reporting is on until they are said to have
-  /// changed.
+  /// Makes the `ServerQueue` too, and listens for changes of the preferences. Reads none yet:
+  /// reporting is on until they are said to have changed.
   [[nodiscard]] static std::shared_ptr<ZQReportingServiceDelegate> create();
 
   /// Never refuses. Thread: the platform's, for connections.
@@ -142,15 +149,30 @@ class ZQReportingServiceDelegate final
   [[nodiscard]] bool isReportingEnabled() override { return reportingEnabled_; }
   [[nodiscard]] std::shared_ptr<ZQReportingSession> findReportingSessionForID(
       ReporterID reporterID) override QUARVEL_REQUIRES(serverQueueRole);
+  [[nodiscard]] DriverSnapShot getSnapShot() override QUARVEL_REQUIRES(serverQueueRole) {
+    return driverUtility_.getSnapShot();
+  }
+  [[nodiscard]] std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
+      const std::optional<DriverSnapShot>& snapShot) override QUARVEL_REQUIRES(serverQueueRole) {
+    return driverUtility_.getDriverStatisticsRelativeToSnapShot(snapShot);
+  }
   void removeClient(const ZQReportingServerInstance& client) override
       QUARVEL_REQUIRES(serverQueueRole);
 
+  /// The preferences as they are now: "device_name" when there is one, and "disable_reporting".
+  [[nodiscard]] static Dictionary ZQReportingDefaults();
+
  private:
+  void listenForDefaultsNotification();
+  void readDefaults(NotificationToken token) QUARVEL_REQUIRES(serverQueueRole);
+
   /// Covers the export of a server instance and the search across clients.
   RecursiveMutex lock_;
   std::atomic<bool> reportingEnabled_ = true;
   Clients clients_ QUARVEL_GUARDED_BY(serverQueueRole);
   std::optional<Dictionary> defaults_ QUARVEL_GUARDED_BY(serverQueueRole);
+  NotificationToken defaultsToken_ = 0;  // constant once notifications can come
+  ZQReportingDriverUtility driverUtility_;
 };
 
 /// The short name of a client's process; none when it cannot be told. From any thread.

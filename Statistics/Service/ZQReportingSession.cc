@@ -2,12 +2,18 @@
 
 #include <fmt/format.h>
 
+#include <algorithm>
 #include <chrono>
+#include <cmath>
 #include <utility>
 
 #include "base/Format.h"
+#include "platform/Clock.h"
 #include "platform/Condition.h"
+#include "platform/DeviceProperties.h"
+#include "platform/FileSystem.h"
 #include "platform/Log.h"
+#include "platform/Orientation.h"
 #include "platform/Random.h"
 #include "platform/Trace.h"
 
@@ -40,6 +46,59 @@ Payload EnrichPayload(const Payload& payload) {
 /// The agent takes the low half of a category code.
 std::uint16_t AgentCategory(std::uint32_t category) {
   return static_cast<std::uint16_t>(category & 0xffff);
+}
+
+constexpr const char* kDiagnosticsDirectory =
+    "/private/var/mobile/Library/Logs/Faultkeep/DiagnosticLogs/Audio/Reporting";
+constexpr std::uint32_t kDiagnosticsPermissions = 0777;
+constexpr std::int64_t kDeviceClassWithoutOrientation = 6;
+constexpr const char* kSummaryKey = "ZQ_Session_Summary_Event";
+
+/// One orientation entry of the history.
+Dictionary OrientationEntry(std::string_view mode, std::string_view orientation, double seconds) {
+  return {{fmt::format("{}_orientation", mode), orientation},
+          {fmt::format("{}_orientation_time", mode), seconds}};
+}
+
+/// The texts that each key of a history had, joined, in the order in which the keys first came.
+class SummaryText {
+ public:
+  void add(const Key& key, std::string text) {
+    const auto [found, isNew] = index_.try_emplace(KeyText(key), texts_.size());
+    if (isNew) {
+      texts_.emplace_back(found->first, std::move(text));
+    } else {
+      texts_[found->second].second.append(1, ',').append(text);
+    }
+  }
+  [[nodiscard]] Dictionary dictionary() && {
+    Dictionary summary;
+    for (auto& [key, text] : texts_) summary.set(std::move(key), std::move(text));
+    return summary;
+  }
+
+ private:
+  static std::string KeyText(const Key& key) {
+    if (const auto* text = key.string()) return *text;
+    if (const auto* number = key.integer()) return fmt::to_string(*number);
+    return fmt::to_string(*key.unsignedInteger());
+  }
+
+  std::vector<std::pair<std::string, std::string>> texts_;
+  std::unordered_map<std::string, std::size_t> index_;
+};
+
+/// A client's text as part of a file name: it can name no directory and leaves room for the rest.
+std::string FileNamePart(std::string text) {
+  constexpr std::size_t kLongest = 128;
+  if (text.size() > kLongest) {
+    std::size_t end = kLongest;
+    while ((static_cast<unsigned char>(text[end]) & 0xc0) == 0x80) --end;  // not inside a character
+    text.resize(end);
+  }
+  std::ranges::replace_if(
+      text, [](char c) { return c == '/' || c == '\0'; }, '_');
+  return text;
 }
 
 /// What the agent set-up waits for. Shared with the agent's completion, which may come after the
@@ -138,6 +197,7 @@ void ZQReportingSession::start() {
   started_ = true;
   setAggregatedPayloadData(std::make_shared<PayloadHistory>());
   EmitKernelTrace(kTraceStarted);
+  if (shouldReportOrientation()) registerOrientationHandlers();
   relmReportingQueue_->async([self = shared_from_this(), userInfo = userInfo_,
                               serviceName = serviceName_,
                               backendFound = relmReportingSessionStarted_.load()] {
@@ -191,15 +251,110 @@ void ZQReportingSession::setUpAgent(const SharedDictionary& userInfo,
 void ZQReportingSession::stop() {
   ZQ_FUNCTION("-[ZQReportingSession stop]");
   ZQ_LOG(Scope(), debug, "ending session {}", reporterID_);
+  if (shouldReportOrientation() && orientationCallbackID_) unregisterOrientationHandlers();
   if (!started_) return;
   // Said a second time on purpose: the first line tells of every call, this one of those that end
   // something.
   ZQ_LOG(Scope(), debug, "ending session {}", reporterID_);
   EmitKernelTrace(kTraceStopping);
+  if (const auto summary = createSummaryEventForSession()) {
+    ZQ_LOG(Scope(), standard, "sending summary event for reporter {}", reporterID_);
+    sendMessage(Payload(*summary), kCategorySummary, kTypeSummary, true, nullptr);
+  }
   relmReportingQueue_->async([self = shared_from_this()] { self->endAgent(); });
   setAggregatedPayloadData(nullptr);
   started_ = false;
   transactionCompleteBlock_(true);
+}
+
+bool ZQReportingSession::shouldReportOrientation() const {
+  if (!ZQReportingUtilityIsInternalBuild()) return false;
+  const std::uint16_t serviceType = serviceType_;
+  if (serviceType != kServiceTypeLongFormAudio && serviceType != kServiceTypeTelephony)
+    return false;
+  return DevicePropertyInteger("DeviceClassNumber") != kDeviceClassWithoutOrientation;
+}
+
+void ZQReportingSession::registerOrientationHandlers() {
+  ZQ_FUNCTION("-[ZQReportingSession start]_block_invoke");
+  const std::string callbackID = fmt::format("ZQReportingService {}", reporterID_);
+  const Date startDate = CurrentDate();
+  const auto handler = [&](const char* mode) {
+    return [self = shared_from_this(), mode, startDate, callbackID](Orientation orientation) {
+      const std::string_view name = OrientationName(orientation);
+      const double elapsed = std::chrono::duration<double>(CurrentDate() - startDate).count();
+      const double seconds = std::round(std::abs(elapsed) * 1000) / 1000;
+      ZQ_LOG(Scope(), debug,
+             "Orientation handler callback mode={} orientation=\"{}\" app=\"{}\", time={}, "
+             "id=\"{}\"",
+             mode, name, Described(self->userInfo_->find(kHostApplicationDisplayID)), seconds,
+             callbackID);
+      if (const auto history = self->aggregatedPayloadData()) {
+        history->append(OrientationEntry(mode, name, seconds));
+      }
+    };
+  };
+  RegisterDeviceOrientationHandler(callbackID, handler("device"));
+  RegisterUIOrientationHandler(callbackID, handler("ui"));
+  orientationCallbackID_ = callbackID;
+}
+
+void ZQReportingSession::unregisterOrientationHandlers() {
+  UnregisterDeviceOrientationHandler(*orientationCallbackID_);
+  UnregisterUIOrientationHandler(*orientationCallbackID_);
+  orientationCallbackID_.reset();
+}
+
+std::optional<Dictionary> ZQReportingSession::createSummaryEventForSession() {
+  const auto history = aggregatedPayloadData();
+  if (history == nullptr || history->empty()) return std::nullopt;
+  SummaryText texts;
+  texts.add(kSummaryKey, fmt::to_string(serviceType_.load()));
+  history->forEach([&texts](const PayloadHistory::Entry& entry) {
+    if (const auto* message = std::get_if<SentMessage>(&entry)) {
+      texts.add(message->messageID, JsonText(message->payload));
+    } else {
+      for (const auto& [key, value] : std::get<Dictionary>(entry)) texts.add(key, Described(value));
+    }
+  });
+  history->insertAtFront(userInfo_->copy());
+  if (ZQReportingUtilityIsInternalBuild()) writeSummaryLogFile(*history);
+  return std::move(texts).dictionary();
+}
+
+void ZQReportingSession::writeSummaryLogFile(const PayloadHistory& history) const {
+  ZQ_FUNCTION("-[ZQReportingSession createSummaryEventForSession]");
+  PrettyJsonWriter writer;
+  writer.beginList();
+  history.forEach([&writer](const PayloadHistory::Entry& entry) {
+    if (const auto* message = std::get_if<SentMessage>(&entry)) {
+      writer.beginDictionary();
+      writer.key(message->messageID);
+      writer.value(message->payload.root());
+      writer.endDictionary();
+    } else {
+      writer.value(std::get<Dictionary>(entry));
+    }
+  });
+  writer.endList();
+  const Result<std::string> json = writer.finish();
+  if (!json) {
+    ZQ_LOG(Scope(), error, "dataWithJSONObject: {}", json.error().description());
+  }
+  const std::string directory = DiagnosticsPath(kDiagnosticsDirectory);
+  if (const Outcome made = CreateDirectory(directory, kDiagnosticsPermissions); !made) {
+    ZQ_LOG(Scope(), error, "can't create logging directory at {}: {}", directory,
+           made.error().description());
+  }
+  const auto application = userInfo_->find(kHostApplicationDisplayID);
+  const std::string path =
+      fmt::format("{}/{}-{}-{}-{}.json", directory, LocalDateText(CurrentDate(), "%Y%m%d-%H%M%S%z"),
+                  "quarvel", application ? FileNamePart(Described(*application)) : "unknown",
+                  ZQReportingUtilityServiceTypeName(serviceType_));
+  const Outcome written = WriteFileAtomically(path, json ? json.value() : std::string());
+  if (!written) {
+    ZQ_LOG(Scope(), error, "jsonOutput writeToURL: {}", written.error().description());
+  }
 }
 
 void ZQReportingSession::endAgent() {

@@ -12,6 +12,7 @@
 #include "Statistics/Service/PayloadHistory.h"
 #include "Statistics/Service/ServerQueue.h"
 #include "Statistics/SharedDictionary.h"
+#include "Statistics/ZQReportingDriverUtility.h"
 #include "Statistics/ZQReportingUtility.h"
 #include "base/Error.h"
 #include "base/Mutex.h"
@@ -55,7 +56,8 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
   /// Begins an agent session, for whose backends the session queue waits up to 9 seconds. Already
   /// started: changes nothing.
   void start() QUARVEL_REQUIRES(serverQueueRole);
-  /// Flushes and ends the agent session and answers the start call (`transactionCompleteBlock`).
+  /// Sends the summary, flushes and ends the agent session and answers the start call
+  /// (`transactionCompleteBlock`).
   void stop() QUARVEL_REQUIRES(serverQueueRole);
 
   /// The message's identifier, "category_type_n"; counts the message.
@@ -78,6 +80,15 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
                                 std::uint16_t type, std::uint16_t serviceType,
                                 const std::optional<Dictionary>& userInfo, SendReply reply);
 
+  /// Condenses the history into one dictionary, each key's values joined by ",". Leaves the user
+  /// information at the front of the history, and on an internal build the whole history as a JSON
+  /// file in the diagnostics directory. None when nothing was sent.
+  [[nodiscard]] std::optional<Dictionary> createSummaryEventForSession()
+      QUARVEL_REQUIRES(serverQueueRole);
+  /// Whether changes of the orientation go into the history: on internal builds, for some service
+  /// types, not on every class of device.
+  [[nodiscard]] bool shouldReportOrientation() const;
+
   [[nodiscard]] ReporterID reporterID() const { return reporterID_; }
   [[nodiscard]] const std::vector<std::int32_t>& processIdentifiers() const {
     return processIdentifiers_;
@@ -92,6 +103,15 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
   [[nodiscard]] const SharedDictionary& userInfo() const { return *userInfo_; }
   /// The history of this run; none after a stop. From any thread.
   [[nodiscard]] std::shared_ptr<PayloadHistory> aggregatedPayloadData() const;
+  /// What the drivers had counted at the start. Kept for whoever started the session; not read
+  /// here.
+  [[nodiscard]] const std::optional<DriverSnapShot>& driverSnapShot() const
+      QUARVEL_REQUIRES(serverQueueRole) {
+    return driverSnapShot_;
+  }
+  void setDriverSnapShot(std::optional<DriverSnapShot> snapShot) QUARVEL_REQUIRES(serverQueueRole) {
+    driverSnapShot_ = std::move(snapShot);
+  }
   /// The client's start reply, to be answered at the stop.
   [[nodiscard]] const BoolReply& transactionCompleteBlock() const
       QUARVEL_REQUIRES(serverQueueRole) {
@@ -109,6 +129,9 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
   void deliver(const Payload& enriched, std::uint32_t category, std::uint16_t type,
                const Payload& original, bool wasStarted);
   void endAgent();
+  void registerOrientationHandlers() QUARVEL_REQUIRES(serverQueueRole);
+  void unregisterOrientationHandlers() QUARVEL_REQUIRES(serverQueueRole);
+  void writeSummaryLogFile(const PayloadHistory& history) const;
   void setAggregatedPayloadData(std::shared_ptr<PayloadHistory> history);
 
   const ReporterID reporterID_;
@@ -119,6 +142,8 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
   /// Counts run on across a stop and a new start.
   std::unordered_map<std::string, std::uint64_t> messageTypeCounts_
       QUARVEL_GUARDED_BY(serverQueueRole);
+  std::optional<DriverSnapShot> driverSnapShot_ QUARVEL_GUARDED_BY(serverQueueRole);
+  std::optional<std::string> orientationCallbackID_ QUARVEL_GUARDED_BY(serverQueueRole);
   BoolReply transactionCompleteBlock_ QUARVEL_GUARDED_BY(serverQueueRole);
 
   // Written on one queue and read on the other.
