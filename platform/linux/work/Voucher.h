@@ -19,12 +19,24 @@ class Voucher {
   [[nodiscard]] virtual std::size_t bytes() const = 0;
 
  protected:
-  /// Called once, when the last hold goes, on whatever thread that is. Must not block.
+  /// Called once, when the last hold goes, on whatever thread that is. Must not block. A hold that
+  /// is taken later (a delayed block's, `Keeper`) has no effect.
   virtual void completed() = 0;
 
  private:
   friend class VoucherHold;
-  std::atomic<std::uint32_t> holds_{0};
+
+  static constexpr std::uint32_t kCompleted = std::uint32_t{1} << 31;
+
+  void hold() { holds_.fetch_add(1, std::memory_order_relaxed); }
+  void release() {
+    if (holds_.fetch_sub(1, std::memory_order_acq_rel) != 1) return;
+    // Somebody may take hold again just now, and then it is theirs to complete.
+    std::uint32_t none = 0;
+    if (holds_.compare_exchange_strong(none, kCompleted, std::memory_order_acq_rel)) completed();
+  }
+
+  std::atomic<std::uint32_t> holds_{0};  // plus kCompleted, once it has
 };
 
 /// Keeps a voucher open. May be empty.
@@ -32,7 +44,7 @@ class VoucherHold {
  public:
   VoucherHold() = default;
   explicit VoucherHold(std::shared_ptr<Voucher> voucher) : voucher_(std::move(voucher)) {
-    if (voucher_) voucher_->holds_.fetch_add(1, std::memory_order_relaxed);
+    if (voucher_) voucher_->hold();
   }
   VoucherHold(VoucherHold&& other) noexcept : voucher_(std::move(other.voucher_)) {}
   VoucherHold& operator=(VoucherHold&& other) noexcept {
@@ -42,9 +54,7 @@ class VoucherHold {
   VoucherHold(const VoucherHold&) = delete;
   VoucherHold& operator=(const VoucherHold&) = delete;
   ~VoucherHold() {
-    if (voucher_ && voucher_->holds_.fetch_sub(1, std::memory_order_acq_rel) == 1) {
-      voucher_->completed();
-    }
+    if (voucher_) voucher_->release();
   }
 
   [[nodiscard]] const std::shared_ptr<Voucher>& voucher() const { return voucher_; }

@@ -1,0 +1,13 @@
+#pragma once
+
+#include <filesystem>
+#include <string>
+
+namespace quarvel {
+
+/// What the machine allows: a server that takes frames from a Unix socket in `directory`, answers
+/// each and writes `json` as its row into the service's message table, all on one thread, one
+/// transaction for what has arrived. Ends with the process.
+[[noreturn]] void RunFloor(const std::filesystem::path& directory, const std::string& json);
+
+}  // namespace quarvel

@@ -1,0 +1,105 @@
+#include "platform/linux/work/Keeper.h"
+
+#include <fmt/format.h>
+
+#include <algorithm>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+
+#include "platform/linux/work/Activity.h"
+#include "platform/linux/work/Pool.h"
+#include "platform/linux/work/Thread.h"
+
+namespace quarvel {
+namespace {
+
+// Far enough to be never, near enough that no clock arithmetic overflows.
+constexpr std::chrono::milliseconds kLongestDelay = std::chrono::hours(24 * 365 * 10);
+
+}  // namespace
+
+Keeper& Keeper::instance() {
+  static Keeper& keeper = *new Keeper;
+  return keeper;
+}
+
+Keeper::Keeper() {
+  const int failure = StartThread("work.keeper", 0, [this] { run(); });
+  if (failure == 0) return;
+  fmt::print(stderr, "quarvel: no thread for work: {}\n", std::strerror(failure));
+  std::abort();
+}
+
+void Keeper::startThread(Pool& pool) {
+  {
+    const MutexLock lock(mutex_);
+    starts_.push_back(&pool);
+  }
+  changed_.notifyOne();
+}
+
+void Keeper::after(std::chrono::milliseconds delay, std::shared_ptr<Lane> lane, Block block) {
+  Delayed delayed{std::move(lane), std::move(block), nullptr, VoucherHold::current(), 0};
+  delayed.voucher = delayed.held.voucher();
+  bool first = false;
+  VoucherHold released;  // after the lock: what completes a voucher is foreign code
+  {
+    const MutexLock lock(mutex_);
+    if (delay > std::chrono::milliseconds::zero() && !delaysEnded_) {
+      if (delayed.held && unheldBytes_ <= kUnheldBytes) {
+        delayed.unheldBytes = delayed.voucher->bytes();
+        unheldBytes_ += delayed.unheldBytes;
+        released = std::move(delayed.held);
+      }
+      const auto due = Clock::now() + std::min(delay, kLongestDelay);
+      const auto place = delayed_.emplace(std::pair(due, delays_++), std::move(delayed)).first;
+      first = place == delayed_.begin();
+      ActivityBegan();
+      delayed.lane = nullptr;
+    }
+  }
+  if (first) changed_.notifyOne();
+  if (delayed.lane != nullptr) deliver(std::move(delayed));
+}
+
+void Keeper::endDelays() {
+  {
+    const MutexLock lock(mutex_);
+    delaysEnded_ = true;
+  }
+  changed_.notifyOne();
+}
+
+void Keeper::run() {
+  mutex_.lock();
+  for (;;) {
+    if (!starts_.empty()) {
+      Pool& pool = *starts_.back();
+      starts_.pop_back();
+      mutex_.unlock();
+      pool.startThread();
+      mutex_.lock();
+    } else if (delayed_.empty()) {
+      changed_.wait(mutex_);
+    } else if (const auto due = delayed_.begin()->first.first;
+               !delaysEnded_ && due > Clock::now()) {
+      changed_.waitUntil(mutex_, due);
+    } else {
+      Delayed delayed = std::move(delayed_.begin()->second);
+      delayed_.erase(delayed_.begin());
+      unheldBytes_ -= delayed.unheldBytes;
+      mutex_.unlock();
+      deliver(std::move(delayed));
+      ActivityEnded();
+      mutex_.lock();
+    }
+  }
+}
+
+void Keeper::deliver(Delayed delayed) {
+  if (!delayed.held) delayed.held = VoucherHold(std::move(delayed.voucher));
+  delayed.lane->add({std::move(delayed.held), std::move(delayed.block)});
+}
+
+}  // namespace quarvel

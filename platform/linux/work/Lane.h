@@ -1,0 +1,48 @@
+#pragma once
+
+#include <memory>
+#include <string_view>
+#include <utility>
+
+#include "base/Block.h"
+#include "platform/linux/work/Voucher.h"
+
+namespace quarvel {
+
+/// A block with the voucher under which it was queued.
+struct WorkItem {
+  VoucherHold voucher;
+  Block block;
+
+  /// Runs the block, destroys it, and only then lets the voucher go.
+  void run() {
+    {
+      const VoucherScope scope(voucher);
+      block();
+      block = Block();
+    }
+    voucher = VoucherHold();
+  }
+};
+
+/// A queue as its pool sees it: work in a line. Shared by the queue, which may go at any time, and
+/// by whoever still has to run its blocks.
+class Lane : public std::enable_shared_from_this<Lane> {
+ public:
+  explicit Lane(std::string_view label) : label_(label) {}
+  virtual ~Lane() = default;
+  Lane(const Lane&) = delete;
+  Lane& operator=(const Lane&) = delete;
+
+  [[nodiscard]] std::string_view label() const { return label_; }
+  /// From any thread.
+  virtual void add(WorkItem&& item) = 0;
+  /// Runs a bounded number of blocks, so that other queues get their turn. Returns whether the lane
+  /// wants another turn. On a pool's thread, once for each turn asked for.
+  [[nodiscard]] virtual bool takeTurn() = 0;
+
+ private:
+  const std::string_view label_;
+};
+
+}  // namespace quarvel

@@ -1,0 +1,156 @@
+#include "platform/linux/work/Pool.h"
+
+#include <fmt/format.h>
+
+#include <algorithm>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <thread>
+
+#include "platform/linux/work/Activity.h"
+#include "platform/linux/work/Keeper.h"
+#include "platform/linux/work/Thread.h"
+
+namespace quarvel {
+namespace {
+
+struct Worker {
+  Pool* pool = nullptr;
+  const Lane* lane = nullptr;
+  unsigned blockingScopes = 0;
+};
+thread_local Worker worker;
+
+}  // namespace
+
+Pool& Pool::of(QualityOfService qualityOfService) {
+  // Never destroyed: their threads outlive the end of main. The first class serves one queue only.
+  static Pool& userInteractive = *new Pool("user-interactive", 0, 1);
+  static Pool& utility =
+      *new Pool("utility", 5, std::max<std::size_t>(2, std::thread::hardware_concurrency()));
+  static Pool& background = *new Pool("background", 10, 2);
+  switch (qualityOfService) {
+    case QualityOfService::background:
+      return background;
+    case QualityOfService::utility:
+      return utility;
+    case QualityOfService::userInteractive:
+      break;
+  }
+  return userInteractive;
+}
+
+Pool::Pool(std::string_view name, int nice, std::size_t width)
+    : name_(name), nice_(nice), width_(width) {}
+
+void Pool::submit(std::shared_ptr<Lane> lane) {
+  ActivityBegan();
+  Help help = Help::none;
+  {
+    const MutexLock lock(mutex_);
+    ready_.push_back(std::move(lane));
+    help = helpNeeded();
+  }
+  call(help);
+}
+
+Pool::Help Pool::helpNeeded() {
+  if (ready_.empty() || active_ >= width_) return Help::none;
+  ++active_;
+  if (idle_ == 0) return Help::startThread;
+  --idle_;
+  ++called_;
+  return Help::wakeThread;
+}
+
+void Pool::call(Help help) {
+  switch (help) {
+    case Help::none:
+      break;
+    case Help::wakeThread:
+      wake_.notifyOne();
+      break;
+    case Help::startThread:
+      Keeper::instance().startThread(*this);
+      break;
+  }
+}
+
+void Pool::startThread() {
+  const int failure = StartThread(name_, nice_, [this] { work(); });
+  if (failure == 0) return;
+  // With another thread in the pool the work waits for that one; whoever next brings work or is
+  // held back calls for a thread again.
+  bool alone = false;
+  {
+    const MutexLock lock(mutex_);
+    --active_;
+    alone = active_ + blocked_ + idle_ == 0;
+  }
+  if (!alone) return;
+  fmt::print(stderr, "quarvel: no thread for {} work: {}\n", name_, std::strerror(failure));
+  std::abort();
+}
+
+const Lane* Pool::currentLane() {
+  return worker.lane;
+}
+
+void Pool::work() {
+  worker.pool = this;
+  std::string_view shown = name_;
+  std::shared_ptr<Lane> lane;
+  while ((lane = nextLane(std::move(lane)))) {
+    if (shown.data() != lane->label().data()) {
+      shown = lane->label();
+      NameThisThread(shown);
+    }
+    worker.lane = lane.get();
+    const bool wantsAnother = lane->takeTurn();
+    worker.lane = nullptr;
+    if (wantsAnother) continue;
+    lane.reset();
+    ActivityEnded();
+  }
+}
+
+// Takes the calling thread's unfinished lane (or null) back and gives it the next one, waiting as
+// long as there is none; null when the thread is to leave.
+std::shared_ptr<Lane> Pool::nextLane(std::shared_ptr<Lane> unfinished) {
+  const MutexLock lock(mutex_);
+  if (unfinished) ready_.push_back(std::move(unfinished));
+  while (ready_.empty() || active_ > width_) {
+    --active_;
+    if (idle_ >= width_) return nullptr;
+    ++idle_;
+    while (called_ == 0) wake_.wait(mutex_);
+    --called_;
+  }
+  std::shared_ptr<Lane> next = std::move(ready_.front());
+  ready_.pop_front();
+  return next;
+}
+
+void Pool::beginBlocking() {
+  Pool* const pool = worker.pool;
+  if (pool == nullptr || worker.blockingScopes++ > 0) return;
+  Help help = Help::none;
+  {
+    const MutexLock lock(pool->mutex_);
+    --pool->active_;
+    ++pool->blocked_;
+    help = pool->helpNeeded();
+  }
+  pool->call(help);
+}
+
+void Pool::endBlocking() {
+  Pool* const pool = worker.pool;
+  if (pool == nullptr || --worker.blockingScopes > 0) return;
+  const MutexLock lock(pool->mutex_);
+  --pool->blocked_;
+  ++pool->active_;
+}
+
+}  // namespace quarvel

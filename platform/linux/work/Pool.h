@@ -1,0 +1,68 @@
+#pragma once
+
+#include <cstddef>
+#include <deque>
+#include <memory>
+#include <string_view>
+
+#include "base/Mutex.h"
+#include "platform/WorkQueue.h"
+#include "platform/linux/work/Lane.h"
+
+namespace quarvel {
+
+/// The threads of one quality-of-service class and the line of queues that are ready for them.
+///
+/// As long as a queue is ready, as many threads as the pool's width run blocks; a thread whose
+/// block is in a `BlockingScope` does not count. So the pool starts another thread for every one
+/// that is held back while there is work, and threads above the width leave when their turn is
+/// over. Threads that have nothing to do wait without waking up. Lives as long as the process.
+class Pool {
+ public:
+  [[nodiscard]] static Pool& of(QualityOfService qualityOfService);
+
+  /// `width`: how many threads run blocks at once.
+  Pool(std::string_view name, int nice, std::size_t width);
+  Pool(const Pool&) = delete;
+  Pool& operator=(const Pool&) = delete;
+
+  /// Puts a lane in the line for one turn, and for another as long as it wants one. From any
+  /// thread.
+  void submit(std::shared_ptr<Lane> lane) QUARVEL_EXCLUDES(mutex_);
+
+  /// Starts a thread that has been counted already. On the keeper's thread, whose nice value no
+  /// pool undercuts.
+  void startThread() QUARVEL_EXCLUDES(mutex_);
+
+  /// The lane whose block the calling thread is running; null when none.
+  [[nodiscard]] static const Lane* currentLane();
+
+  // What `BlockingScope` does, for the pool of the calling thread.
+  static void beginBlocking();
+  static void endBlocking();
+
+ private:
+  enum class Help { none, wakeThread, startThread };
+
+  void work();
+  [[nodiscard]] std::shared_ptr<Lane> nextLane(std::shared_ptr<Lane> unfinished)
+      QUARVEL_EXCLUDES(mutex_);
+  [[nodiscard]] Help helpNeeded() QUARVEL_REQUIRES(mutex_);
+  void call(Help help) QUARVEL_EXCLUDES(mutex_);
+
+  const std::string_view name_;
+  const int nice_;
+  const std::size_t width_;
+
+  Mutex mutex_;
+  ConditionVariable wake_;
+  std::deque<std::shared_ptr<Lane>> ready_ QUARVEL_GUARDED_BY(mutex_);
+  // Every thread is counted in one of these. One that is being started or woken counts as active
+  // from the moment it is called, so nobody calls a second one for the same work.
+  std::size_t active_ QUARVEL_GUARDED_BY(mutex_) = 0;
+  std::size_t blocked_ QUARVEL_GUARDED_BY(mutex_) = 0;
+  std::size_t idle_ QUARVEL_GUARDED_BY(mutex_) = 0;
+  std::size_t called_ QUARVEL_GUARDED_BY(mutex_) = 0;  // of the active ones: not awake yet
+};
+
+}  // namespace quarvel

@@ -1,0 +1,126 @@
+#include <deque>
+#include <memory>
+#include <utility>
+#include <vector>
+
+#include "base/Mutex.h"
+#include "platform/WorkQueue.h"
+#include "platform/linux/work/Keeper.h"
+#include "platform/linux/work/Lane.h"
+#include "platform/linux/work/Pool.h"
+
+namespace quarvel {
+namespace {
+
+/// One block at a time, in order. Whoever adds to a lane that is at rest makes it ready; from then
+/// on adding costs its lock alone, until a thread has found nothing left.
+class SerialLane final : public Lane {
+ public:
+  SerialLane(std::string_view label, Pool& pool) : Lane(label), pool_(pool) {}
+
+  void add(WorkItem&& item) override {
+    {
+      const MutexLock lock(mutex_);
+      if (waiting_.capacity() == 0) waiting_.reserve(kFirstCapacity);
+      waiting_.push_back(std::move(item));
+      if (std::exchange(ready_, true)) return;
+    }
+    pool_.submit(shared_from_this());
+  }
+
+  bool takeTurn() override {
+    for (int blocks = 0; blocks < kBlocksPerTurn; ++blocks) {
+      if (next_ == batch_.size() && !takeBatch()) return false;
+      batch_[next_++].run();
+    }
+    return true;
+  }
+
+ private:
+  static constexpr std::size_t kFirstCapacity = 4;
+  static constexpr int kBlocksPerTurn = 128;
+
+  /// Takes what is waiting. When that is nothing the lane comes to rest, keeping no memory: there
+  /// are many at rest, and few at work.
+  bool takeBatch() {
+    batch_.clear();
+    next_ = 0;
+    std::vector<WorkItem> freed;
+    const MutexLock lock(mutex_);
+    std::swap(batch_, waiting_);
+    if (!batch_.empty()) return true;
+    ready_ = false;
+    return false;
+  }
+
+  Pool& pool_;
+  Mutex mutex_;
+  std::vector<WorkItem> waiting_ QUARVEL_GUARDED_BY(mutex_);
+  bool ready_ QUARVEL_GUARDED_BY(mutex_) = false;  // in the pool's line, or having its turn
+
+  // Of the thread that has the turn.
+  std::vector<WorkItem> batch_;
+  std::size_t next_ = 0;
+};
+
+/// Blocks in any order, several at once: every block is a turn.
+class ConcurrentLane final : public Lane {
+ public:
+  ConcurrentLane(std::string_view label, Pool& pool) : Lane(label), pool_(pool) {}
+
+  void add(WorkItem&& item) override {
+    {
+      const MutexLock lock(mutex_);
+      waiting_.push_back(std::move(item));
+    }
+    pool_.submit(shared_from_this());
+  }
+
+  bool takeTurn() override {
+    next().run();
+    return false;
+  }
+
+ private:
+  WorkItem next() {
+    const MutexLock lock(mutex_);
+    WorkItem item = std::move(waiting_.front());
+    waiting_.pop_front();
+    return item;
+  }
+
+  Pool& pool_;
+  Mutex mutex_;
+  std::deque<WorkItem> waiting_ QUARVEL_GUARDED_BY(mutex_);
+};
+
+class LaneQueue final : public WorkQueue {
+ public:
+  explicit LaneQueue(std::shared_ptr<Lane> lane) : lane_(std::move(lane)) {}
+
+  [[nodiscard]] std::string_view label() const override { return lane_->label(); }
+  void async(Block block) override { lane_->add({VoucherHold::current(), std::move(block)}); }
+  void after(std::chrono::milliseconds delay, Block block) override {
+    Keeper::instance().after(delay, lane_, std::move(block));
+  }
+  [[nodiscard]] bool isCurrent() const override { return Pool::currentLane() == lane_.get(); }
+
+ private:
+  const std::shared_ptr<Lane> lane_;
+};
+
+}  // namespace
+
+std::unique_ptr<WorkQueue> CreateSerialQueue(std::string_view label,
+                                             QualityOfService qualityOfService) {
+  return std::make_unique<LaneQueue>(
+      std::make_shared<SerialLane>(label, Pool::of(qualityOfService)));
+}
+
+WorkQueue& BackgroundQueue() {
+  static WorkQueue& queue = *new LaneQueue(
+      std::make_shared<ConcurrentLane>("background", Pool::of(QualityOfService::background)));
+  return queue;
+}
+
+}  // namespace quarvel
