@@ -50,7 +50,7 @@ LogHandle Scope() {
 
 microseconds TimerSpan(double seconds) {
   if (!(seconds > 0)) return microseconds::zero();  // NaN too
-  return std::chrono::duration_cast<microseconds>(
+  return std::chrono::round<microseconds>(
       std::min(std::chrono::duration<double>(seconds), kLongestTimer));
 }
 
@@ -233,7 +233,8 @@ void ZQReportingBlockThrottle::addMessageBlock(Block block, ReporterID reporterI
   const double seconds = determineSleepTime(message);
   std::shared_ptr<Wrapper> duplicate;
   {
-    // Looking and storing under one lock: of two callers with equal messages, one finds the other's.
+    // Looking and storing under one lock: of two callers with equal messages, one finds the
+    // other's.
     const MutexLock lock(timersMutex_);
     if (const auto pending = timersInFlight_.find(key); pending != timersInFlight_.end()) {
       duplicate = pending->second;
@@ -254,8 +255,8 @@ void ZQReportingBlockThrottle::addMessageBlock(Block block, ReporterID reporterI
 std::shared_ptr<ZQReportingBlockThrottle::Wrapper> ZQReportingBlockThrottle::makeWrapper(
     const std::string& key, Block block, double seconds) {
   auto wrapper = std::make_shared<Wrapper>(std::move(block));
-  // The wrapper owns the timer, so the timer must not own the wrapper. It fires on the worker, which
-  // holds the throttle.
+  // The wrapper owns the timer, so the timer must not own the wrapper. It fires on the worker,
+  // which holds the throttle.
   wrapper->setTimer(CreateRunLoopTimer(TimerSpan(seconds),
                                        [this, pending = std::weak_ptr<Wrapper>(wrapper), key] {
                                          if (const auto due = pending.lock()) fire(*due, key);
