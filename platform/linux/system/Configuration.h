@@ -53,8 +53,8 @@ struct Configuration {
   struct Limits {
     std::size_t messageBytes = 1'048'576;
     std::size_t replyBytes = 1'048'576;
-    std::chrono::seconds frame{10};
-    std::chrono::seconds stall{30};
+    std::chrono::milliseconds frame{10'000};
+    std::chrono::milliseconds stall{30'000};
     unsigned depth = 32;
     std::size_t queuedCalls = 256;
     std::size_t queuedBytes = 4'194'304;

@@ -1,0 +1,254 @@
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <initializer_list>
+#include <memory>
+#include <optional>
+#include <span>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include <quarvel/vocabulary.hpp>
+
+#include "base/Error.h"
+#include "base/Payload.h"
+#include "base/Value.h"
+
+namespace quarvel {
+
+/// The number under which a client knows its reporting session. The client chooses it; it is looked
+/// up across all clients. 0 names no session.
+using ReporterID = std::int64_t;
+
+// NOLINTBEGIN(google-explicit-constructor): both views are there to be converted to.
+
+/// What a call carries besides numbers: a dictionary in either of its forms, or nothing. A view for
+/// the length of one call; it owns nothing.
+class PayloadArgument {
+ public:
+  PayloadArgument(const Payload& payload) : payload_(&payload) {}
+  PayloadArgument(const Dictionary& dictionary) : dictionary_(&dictionary) {}
+  PayloadArgument(std::nullopt_t) {}
+
+  /// At most one of the two is not null.
+  [[nodiscard]] const Payload* payload() const { return payload_; }
+  [[nodiscard]] const Dictionary* dictionary() const { return dictionary_; }
+
+ private:
+  const Payload* payload_ = nullptr;
+  const Dictionary* dictionary_ = nullptr;
+};
+
+/// Whom a message is for: the sessions named, or every started session of every client. A view for
+/// the length of one call; it owns nothing.
+class Recipients {
+ public:
+  Recipients(const ReporterID& session) : sessions_({&session, 1}) {}
+  Recipients(std::initializer_list<ReporterID> sessions)
+      : sessions_(std::span(sessions.begin(), sessions.size())) {}
+  Recipients(const std::vector<ReporterID>& sessions) : sessions_(sessions) {}
+  /// When no session is started anywhere, the service sends the message on its own.
+  [[nodiscard]] static Recipients everyStartedSession() { return Recipients(); }
+
+  /// None: every started session.
+  [[nodiscard]] const std::optional<std::span<const ReporterID>>& sessions() const {
+    return sessions_;
+  }
+
+ private:
+  Recipients() = default;
+  std::optional<std::span<const ReporterID>> sessions_;
+};
+
+// NOLINTEND(google-explicit-constructor)
+
+/// A connection to the reporting service.
+///
+/// Threads: every function may be called from every thread. Calls reach the service in the order in
+/// which they were made. A call writes to the socket and returns; while the service holds this
+/// client back, it waits in there (back-pressure). Replies are given one at a time on a thread of
+/// the connection's own, in the order in which they arrive. Calls made from a reply never wait:
+/// they go out together when the replies that had arrived have been given.
+///
+/// Errors: what the service refuses is an error of its own ("tarnwick.audio.reporting" while
+/// reporting is switched off, "quarvel.connection" for a call that it does not know). What happens
+/// on this side is of domain `kErrorDomain`. When the connection is lost, every call that waits for
+/// its reply is answered with `Code::connectionLost`, and so is every later one; connecting again
+/// is the caller's to decide.
+///
+/// Lifetime: destroying the client closes the connection, which stops its sessions, and answers
+/// every call that still waits with `Code::connectionLost`; after that no reply is given.
+class Client {
+  class Channel;
+
+ public:
+  using ServiceType = vocabulary::ServiceType;
+  using Category = vocabulary::Category;
+  using MessageType = vocabulary::MessageType;
+
+  static constexpr std::string_view kErrorDomain = "quarvel.client";
+  enum class Code : std::int64_t {
+    unreachable = 1,  // `connect`: the reason says what is missing and what to do
+    connectionLost = 2,
+    timedOut = 3,        // a synchronous form waited as long as it was told to
+    wouldDeadlock = 4,   // a synchronous form was called from a reply
+    unexpectedReply = 5  // the service's reply is not of the kind that the operation has
+  };
+
+  /// What the service knows of a reporter ID.
+  struct Validity {
+    ReporterID reporterID = 0;  // 0: there is no such session
+    ServiceType serviceType = ServiceType::unknown;
+    [[nodiscard]] bool valid() const { return reporterID != 0; }
+  };
+
+  /// A call made without one is sent as a notification, which the service does not answer.
+  template <class T>
+  using Reply = std::function<void(Result<T>)>;
+
+  /// Connects to the service's socket; empty: `defaultSocketPath()`. Waits only while the service's
+  /// queue of new connections is full. Errors: `Code::unreachable`.
+  [[nodiscard]] static Result<Client> connect(std::string_view socketPath = {});
+
+  /// `$QUARVEL_SOCKET`; else reporting.sock in the first directory that has one of
+  /// `$RUNTIME_DIRECTORY`, `$XDG_RUNTIME_DIR/quarvel` (not for root) and /run/quarvel; when none
+  /// has, where this user's own service would put it.
+  [[nodiscard]] static std::string defaultSocketPath();
+
+  Client(Client&& other) noexcept;
+  Client& operator=(Client&& other) noexcept;
+  ~Client();
+
+  /// False once the connection is lost.
+  [[nodiscard]] bool connected() const;
+
+  // The service's operations, by the first keyword of their names.
+
+  /// Makes a session under `reporterID`; one that this client already has there is replaced without
+  /// being stopped. The reply is true.
+  void createReportingSession(ReporterID reporterID, Reply<bool> reply = {});
+
+  /// Says what the session's audio is for. Only this client's own session; the reply is true
+  /// whether or not there is one.
+  void setServiceType(ServiceType serviceType, ReporterID reportingSession, Reply<bool> reply = {});
+
+  /// Despite its name this fetches the service type's code; unknown when there is no such session.
+  void getServiceNameForReporterID(ReporterID reporterID, Reply<ServiceType> reply);
+
+  /// Merges `configuration` into the session's user information; a new value replaces an old one.
+  /// Nothing changes when it is absent. Only this client's own session; the reply is true whether
+  /// or not there is one.
+  void setConfiguration(PayloadArgument configuration, ReporterID reporterID,
+                        Reply<bool> reply = {});
+
+  /// Starts the session, whichever client's it is. `stopped` is answered with true **when the
+  /// session stops**, which may be hours later. It is never answered, before the connection ends,
+  /// when there is no such session or it is started already.
+  void startReportingSessionForID(ReporterID reporterID, Reply<bool> stopped = {});
+
+  /// Sends a message to the sessions named by `reportingIDs`, started or not, or to every started
+  /// one. The reply tells of the routing, not of the delivery.
+  void sendMessage(PayloadArgument payload, Category category, MessageType type,
+                   Recipients reportingIDs, Reply<std::monostate> reply = {});
+
+  /// Stops this client's own session; the reply is true whether or not there is one.
+  void stopReportingSessionForID(ReporterID reporterID, Reply<bool> reply = {});
+
+  /// Stops this client's own session if need be and forgets it; the reply is true whether or not
+  /// there is one.
+  void destroyReportingSession(ReporterID reporterID, Reply<bool> reply = {});
+
+  /// Asks whether any client has a session of this ID.
+  void reporterID(ReporterID reporterID, Reply<Validity> valid);
+
+  /// The IDs of every client's sessions.
+  void getAllReporters(Reply<std::vector<ReporterID>> reply);
+
+  /// Ends the service at once. It never replies: `reply` receives `Code::connectionLost` when the
+  /// service has gone, which here is success.
+  void killService(Reply<bool> reply = {});
+
+  /// Any operation by its full keyword name with its arguments in order: for tools, and for
+  /// operations that are newer than this library. A service without it answers with an error.
+  void call(std::string_view operation, std::span<const Value> arguments, Reply<Value> reply = {});
+
+  /// While one exists, calls gather and go out together, at the latest when there are 64 KiB of
+  /// them: one write to the socket instead of one a call. For a thread that has several messages at
+  /// hand. A synchronous form sends what has gathered.
+  class [[nodiscard]] Batch {
+   public:
+    explicit Batch(Client& client);
+    ~Batch();
+    Batch(const Batch&) = delete;
+    Batch& operator=(const Batch&) = delete;
+
+   private:
+    std::shared_ptr<Channel> channel_;
+  };
+
+  class Synchronous;
+
+  /// The operations in their synchronous forms, each of which waits for its reply: until the
+  /// connection is lost, or for `timeout` at most, after which it fails with `Code::timedOut` and a
+  /// reply that comes later is discarded.
+  [[nodiscard]] Synchronous sync(std::optional<std::chrono::milliseconds> timeout = std::nullopt);
+
+ private:
+  explicit Client(std::shared_ptr<Channel> channel);
+
+  template <class T, class... Arguments>
+  std::optional<std::uint32_t> send(std::string_view operation, Reply<T> reply,
+                                    const Arguments&... arguments);
+  std::optional<std::uint32_t> sendValues(std::string_view operation, Reply<Value> reply,
+                                          std::span<const Value> arguments);
+
+  std::shared_ptr<Channel> channel_;  // constant after construction; null when moved from
+};
+
+/// The synchronous forms: same operations, same arguments, and the reply as result. To be used at
+/// once and not kept: it refers to its client. Not from a reply (`Code::wouldDeadlock`).
+class Client::Synchronous {
+ public:
+  [[nodiscard]] Result<bool> createReportingSession(ReporterID reporterID);
+  [[nodiscard]] Result<bool> setServiceType(ServiceType serviceType, ReporterID reportingSession);
+  [[nodiscard]] Result<ServiceType> getServiceNameForReporterID(ReporterID reporterID);
+  [[nodiscard]] Result<bool> setConfiguration(PayloadArgument configuration, ReporterID reporterID);
+
+  /// Since a start is answered only when the session stops, this form waits until the service has
+  /// carried the start out, which it learns by asking for the ID's validity right behind it. True:
+  /// the session is there, so it is started now, or was so already; `stopped` is answered as in the
+  /// asynchronous form. False: there is no such session, and `stopped` will not be answered.
+  [[nodiscard]] Result<bool> startReportingSessionForID(ReporterID reporterID,
+                                                        Reply<bool> stopped = {});
+
+  [[nodiscard]] Outcome sendMessage(PayloadArgument payload, Category category, MessageType type,
+                                    Recipients reportingIDs);
+  [[nodiscard]] Result<bool> stopReportingSessionForID(ReporterID reporterID);
+  [[nodiscard]] Result<bool> destroyReportingSession(ReporterID reporterID);
+  [[nodiscard]] Result<Validity> reporterID(ReporterID reporterID);
+  [[nodiscard]] Result<std::vector<ReporterID>> getAllReporters();
+
+  /// Waits until the service has gone; success is that it has.
+  [[nodiscard]] Outcome killService();
+
+  /// A call that the service never answers (a second start) waits for the time-out, or for ever.
+  [[nodiscard]] Result<Value> call(std::string_view operation, std::span<const Value> arguments);
+
+ private:
+  friend class Client;
+  Synchronous(Client& client, std::optional<std::chrono::milliseconds> timeout)
+      : client_(client), timeout_(timeout) {}
+
+  template <class T, class... Arguments>
+  Result<T> ask(std::string_view operation, const Arguments&... arguments);
+  template <class T, class Send>
+  Result<T> wait(Send&& send);
+
+  Client& client_;
+  std::optional<std::chrono::milliseconds> timeout_;
+};
+
+}  // namespace quarvel

@@ -1,0 +1,132 @@
+#include "platform/linux/connection/CallDesk.h"
+
+#include <utility>
+
+#include "base/MessagePack.h"
+
+namespace quarvel {
+
+namespace {
+
+constexpr std::int64_t kResponse = 1;
+
+/// A buffer that has grown beyond this for a burst is not kept for the quiet that follows.
+constexpr std::size_t kKeptCapacity = 64 * 1024;
+
+void Empty(std::string& buffer) {
+  if (buffer.capacity() > kKeptCapacity) {
+    buffer = std::string();
+  } else {
+    buffer.clear();
+  }
+}
+
+}  // namespace
+
+CallDesk::CallDesk(const Configuration::Limits& limits, std::function<void()> wake)
+    : replyBytesLimit_(limits.replyBytes),
+      callsLimit_(limits.queuedCalls),
+      bytesLimit_(limits.queuedBytes),
+      wake_(std::move(wake)) {}
+
+template <class Encode>
+void CallDesk::reply(Encode encode) {
+  bool wakes = false;
+  {
+    MutexLock lock(mutex_);
+    if (refused_) return;
+    const std::size_t before = replies_.size();
+    MessagePackWriter writer(replies_);
+    writer.list(4);
+    writer.integer(kResponse);
+    encode(writer);
+    const std::size_t added = replies_.size() - before;
+    const std::size_t held = repliesHeld_.fetch_add(added);
+    // A client that does not read is watched from the moment on at which too much is held for it.
+    const bool passesLimit = held < replyBytesLimit_ && held + added >= replyBytesLimit_;
+    wakes = !std::exchange(wakeRequested_, true) || passesLimit;
+  }
+  if (wakes) wake_();
+}
+
+void CallDesk::result(std::uint32_t messageID, const Value& value) {
+  reply([&](MessagePackWriter& writer) {
+    writer.unsignedInteger(messageID);
+    writer.nil();
+    writer.value(value);
+  });
+}
+
+void CallDesk::error(std::uint32_t messageID, const Error& error) {
+  reply([&](MessagePackWriter& writer) {
+    writer.unsignedInteger(messageID);
+    writer.dictionary(3);
+    writer.string("domain");
+    writer.string(error.domain);
+    writer.string("code");
+    writer.integer(error.code);
+    writer.string("userInfo");
+    writer.value(error.userInfo);
+    writer.nil();
+  });
+}
+
+bool CallDesk::takeReplies(std::string& sent) {
+  Empty(sent);
+  MutexLock lock(mutex_);
+  std::swap(sent, replies_);
+  wakeRequested_ = !sent.empty();
+  return wakeRequested_;
+}
+
+void CallDesk::refuseReplies() {
+  MutexLock lock(mutex_);
+  refused_ = true;
+  replies_ = std::string();
+  repliesHeld_ = 0;
+}
+
+void CallDesk::begin(std::size_t bytes) {
+  calls_.fetch_add(1);
+  bytes_.fetch_add(bytes);
+}
+
+void CallDesk::done(std::size_t bytes) {
+  calls_.fetch_sub(1);
+  bytes_.fetch_sub(bytes);
+  if (waiting_ && halfIsDone() && waiting_.exchange(false)) wake_();
+}
+
+bool CallDesk::mustWaitForRoom() {
+  if (!waiting_ && !isFull()) return false;
+  // Said before looking once more: a call that is done in between either is seen here or sees it.
+  waiting_ = true;
+  if (!halfIsDone()) return true;
+  waiting_ = false;
+  return false;
+}
+
+bool CallDesk::isFull() const {
+  return calls_ >= callsLimit_ || bytes_ >= bytesLimit_;
+}
+
+bool CallDesk::halfIsDone() const {
+  return calls_ <= callsLimit_ / 2 && bytes_ <= bytesLimit_ / 2;
+}
+
+Call::Call(std::shared_ptr<CallDesk> desk, std::optional<std::uint32_t> messageID,
+           std::size_t bytes)
+    : desk_(std::move(desk)),
+      bytes_(bytes),
+      messageID_(messageID.value_or(0)),
+      answered_(!messageID.has_value()) {}
+
+void Call::result(Value value) {
+  if (isFirstAnswer()) desk_->result(messageID_, value);
+}
+
+void Call::error(const Error& error) {
+  if (isFirstAnswer()) desk_->error(messageID_, error);
+}
+
+}  // namespace quarvel

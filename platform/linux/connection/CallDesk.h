@@ -1,0 +1,104 @@
+#pragma once
+
+#include <atomic>
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "base/Mutex.h"
+#include "platform/Reply.h"
+#include "platform/linux/system/Configuration.h"
+#include "platform/linux/work/Voucher.h"
+
+namespace quarvel {
+
+/// What a connection shares with the calls that it has taken in: the replies they give and the
+/// count of those still being worked on. Owned by the connection and its calls, so it outlives a
+/// connection whose calls are kept for a late reply; it then holds no memory worth mentioning.
+///
+/// Any thread, except where the I/O thread is named.
+class CallDesk {
+ public:
+  /// `wake` brings the I/O thread to the connection, from any thread: replies lie here, or there is
+  /// room for calls again. Called without a lock held, once for all the replies of a batch.
+  CallDesk(const Configuration::Limits& limits, std::function<void()> wake);
+
+  // Replies.
+
+  void result(std::uint32_t messageID, const Value& value);
+  void error(std::uint32_t messageID, const Error& error);
+  /// I/O thread. Exchanges `sent`, all of which has been written, for the replies given since the
+  /// last time; false when there are none, and the next reply will wake.
+  bool takeReplies(std::string& sent);
+  /// I/O thread. So many bytes have been written.
+  void repliesWritten(std::size_t bytes) { repliesHeld_ -= bytes; }
+  /// Bytes given and not yet written.
+  [[nodiscard]] std::size_t repliesHeld() const {
+    return repliesHeld_.load(std::memory_order_relaxed);
+  }
+  /// The client will read no more: replies vanish from now on.
+  void refuseReplies();
+
+  // Calls being worked on.
+
+  /// I/O thread. A call of so many bytes is taken in.
+  void begin(std::size_t bytes);
+  /// All work that came of it is done.
+  void done(std::size_t bytes);
+  /// I/O thread. Whether no further call may be taken in; if so, `wake` is called when half of the
+  /// limit is done.
+  [[nodiscard]] bool mustWaitForRoom();
+
+ private:
+  template <class Encode>
+  void reply(Encode encode);
+  [[nodiscard]] bool isFull() const;
+  [[nodiscard]] bool halfIsDone() const;
+
+  // Constant after construction.
+  const std::size_t replyBytesLimit_;
+  const std::size_t callsLimit_;
+  const std::size_t bytesLimit_;
+  const std::function<void()> wake_;
+
+  Mutex mutex_;
+  std::string replies_ QUARVEL_GUARDED_BY(mutex_);
+  bool wakeRequested_ QUARVEL_GUARDED_BY(mutex_) = false;
+  bool refused_ QUARVEL_GUARDED_BY(mutex_) = false;
+  std::atomic<std::size_t> repliesHeld_{0};
+
+  std::atomic<std::size_t> calls_{0};
+  std::atomic<std::size_t> bytes_{0};
+  std::atomic<bool> waiting_{false};  // the I/O thread wants to hear of room
+};
+
+/// One call: where its reply goes and what stands for the work that came of it.
+class Call final : public ReplySink, public Voucher {
+ public:
+  /// `messageID`: none for a notification, whose reply is discarded.
+  Call(std::shared_ptr<CallDesk> desk, std::optional<std::uint32_t> messageID, std::size_t bytes);
+
+  void result(Value value) override;
+  void error(const Error& error) override;
+  [[nodiscard]] std::size_t bytes() const override { return bytes_; }
+
+ protected:
+  void completed() override { desk_->done(bytes_); }
+
+ private:
+  [[nodiscard]] bool isFirstAnswer() {
+    return !answered_.exchange(true, std::memory_order_relaxed);
+  }
+
+  // Constant after construction.
+  const std::shared_ptr<CallDesk> desk_;
+  const std::size_t bytes_;
+  const std::uint32_t messageID_;
+
+  std::atomic<bool> answered_;
+};
+
+}  // namespace quarvel

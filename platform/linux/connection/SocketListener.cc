@@ -1,0 +1,189 @@
+#include "platform/linux/connection/SocketListener.h"
+
+#include <sys/socket.h>
+
+#include <asio/executor_work_guard.hpp>
+#include <asio/io_context.hpp>
+#include <asio/posix/stream_descriptor.hpp>
+#include <asio/post.hpp>
+#include <asio/signal_set.hpp>
+#include <asio/steady_timer.hpp>
+#include <cerrno>
+#include <string>
+#include <system_error>
+#include <unordered_set>
+#include <utility>
+
+#include "base/Format.h"
+#include "platform/Log.h"
+#include "platform/linux/connection/SocketConnection.h"
+
+namespace quarvel {
+
+namespace {
+
+/// Descriptors run out for the whole process or system, so there may be some again although none of
+/// our connections has ended.
+constexpr std::chrono::seconds kRetryAccepting{1};
+
+}  // namespace
+
+/// The listener's side of the event loop: accepts, counts, ends. All of it belongs to the I/O
+/// thread, except what `SocketListener` calls on any.
+class SocketListener::Loop {
+ public:
+  Loop(ListeningSocket socket, Options options)
+      : options_(std::move(options)),
+        context_(std::make_shared<ConnectionContext>(options_.limits)),
+        busy_(context_->io.get_executor()),
+        listeningSocket_(std::move(socket)),
+        socket_(context_->io, listeningSocket_.releaseDescriptor().release()),
+        retryTimer_(context_->io),
+        signals_(context_->io) {
+    for (const int signal : options_.endSignals) signals_.add(signal);
+    context_->connectionEnded = [this](const std::shared_ptr<SocketConnection>& connection) {
+      connections_.erase(connection);
+      if (heldBack_ && !ended_) acceptSoon();
+    };
+  }
+
+  void setDelegate(std::shared_ptr<ServiceListenerDelegate> delegate) {
+    delegate_ = std::move(delegate);
+  }
+
+  void run(SocketListener& listener) {
+    listener_ = &listener;
+    if (!options_.endSignals.empty()) {
+      signals_.async_wait([this](asio::error_code error, int) {
+        if (!error) end();
+      });
+    }
+    acceptSoon();
+    context_->io.run();
+    for (const auto& step : options_.atEnd) step();
+  }
+
+  void requestEnd() {
+    asio::post(context_->io, [this] { end(); });
+  }
+
+ private:
+  void acceptSoon() {
+    asio::post(context_->io, [this] { acceptWaiting(); });
+  }
+
+  void acceptWaiting() {
+    if (accepting_ || ended_) return;
+    for (;;) {
+      if (connections_.size() >= options_.limits.connections) {
+        holdBack(fmt::format("there are {} connections already", connections_.size()));
+        return;
+      }
+      UniqueDescriptor client(
+          ::accept4(socket_.native_handle(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
+      if (client) {
+        welcome(std::move(client));
+      } else if (errno == EAGAIN) {
+        heldBack_ = false;
+        break;
+      } else if (errno != EINTR && errno != ECONNABORTED && errno != EPROTO) {
+        holdBack(std::generic_category().message(errno));
+        retryLater();
+        return;
+      }
+    }
+    accepting_ = true;
+    socket_.async_wait(asio::posix::stream_descriptor::wait_read, [this](asio::error_code error) {
+      accepting_ = false;
+      if (!error) acceptWaiting();
+    });
+  }
+
+  /// Accepts no more until a connection ends; said once, however long it lasts.
+  void holdBack(const std::string& reason) {
+    ZQ_FUNCTION("-[SocketListener holdBack:]");
+    if (std::exchange(heldBack_, true)) return;
+    ZQ_LOG(nullptr, error, "no further client is accepted until one has gone: {}", reason);
+  }
+
+  void retryLater() {
+    retryTimer_.expires_after(kRetryAccepting);
+    retryTimer_.async_wait([this](asio::error_code error) {
+      if (!error) acceptWaiting();
+    });
+  }
+
+  void welcome(UniqueDescriptor client) {
+    ZQ_FUNCTION("-[SocketListener welcome:]");
+    const auto connection = SocketConnection::create(context_, std::move(client), ++lastNumber_);
+    if (connection == nullptr) {
+      ZQ_LOG(nullptr, error, "a client is turned away: the kernel cannot watch its socket");
+      return;
+    }
+    connections_.insert(connection);
+    if (delegate_ == nullptr || !delegate_->shouldAcceptNewConnection(*listener_, connection)) {
+      connection->refuse();
+    }
+  }
+
+  void end() {
+    if (std::exchange(ended_, true)) return;
+    listeningSocket_.removeFile();
+    asio::error_code ignored;
+    socket_.close(ignored);
+    retryTimer_.cancel();
+    signals_.cancel(ignored);
+    // Each takes itself out of the set.
+    const std::vector<std::shared_ptr<SocketConnection>> connections(connections_.begin(),
+                                                                     connections_.end());
+    for (const auto& connection : connections) connection->endInOrder();
+    busy_.reset();
+  }
+
+  // Constant once the listener serves.
+  const Options options_;
+  const std::shared_ptr<ConnectionContext> context_;
+  std::shared_ptr<ServiceListenerDelegate> delegate_;
+  SocketListener* listener_ = nullptr;
+
+  // The I/O thread's.
+  asio::executor_work_guard<asio::io_context::executor_type> busy_;  // until the end
+  ListeningSocket listeningSocket_;
+  asio::posix::stream_descriptor socket_;
+  asio::steady_timer retryTimer_;
+  asio::signal_set signals_;
+  std::unordered_set<std::shared_ptr<SocketConnection>> connections_;
+  std::uint64_t lastNumber_ = 0;
+  bool accepting_ = false;  // waits for a client
+  bool heldBack_ = false;   // clients wait, but there is no room
+  bool ended_ = false;
+};
+
+SocketListener::SocketListener(std::unique_ptr<Loop> loop) : loop_(std::move(loop)) {}
+
+SocketListener::~SocketListener() = default;
+
+Result<std::unique_ptr<SocketListener>> SocketListener::create(ListeningSocket socket,
+                                                               Options options) {
+  try {
+    return std::unique_ptr<SocketListener>(
+        new SocketListener(std::make_unique<Loop>(std::move(socket), std::move(options))));
+  } catch (const std::system_error& error) {
+    return Error::because("quarvel.listener", 2,
+                          fmt::format("the event loop cannot be set up: {}", error.what()));
+  }
+}
+
+void SocketListener::setDelegate(std::shared_ptr<ServiceListenerDelegate> delegate) {
+  loop_->setDelegate(std::move(delegate));
+}
+
+void SocketListener::resume() {
+  loop_->run(*this);
+}
+
+void SocketListener::requestEnd() {
+  loop_->requestEnd();
+}
+
+}  // namespace quarvel

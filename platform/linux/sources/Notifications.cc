@@ -1,0 +1,29 @@
+#include "platform/Notifications.h"
+
+#include <utility>
+
+#include "platform/linux/sources/NotificationCenter.h"
+#include "platform/linux/system/Directories.h"
+
+namespace quarvel {
+
+namespace {
+
+NotificationCenter& processCenter() {
+  static NotificationCenter& center =
+      *new NotificationCenter(Directories::process().runtime / "notify", DirectoryWatch::process());
+  return center;
+}
+
+}  // namespace
+
+std::int32_t RegisterForNotification(std::string_view name, NotificationToken& token,
+                                     WorkQueue& queue, NotificationHandler handler) {
+  return processCenter().add(name, token, queue, std::move(handler));
+}
+
+std::int32_t PostNotification(std::string_view name) {
+  return processCenter().post(name);
+}
+
+}  // namespace quarvel

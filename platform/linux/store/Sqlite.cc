@@ -1,0 +1,185 @@
+#include "platform/linux/store/Sqlite.h"
+
+#include <sqlite3.h>
+
+namespace quarvel {
+
+void SqliteStatement::Finalize::operator()(sqlite3_stmt* statement) const {
+  sqlite3_finalize(statement);
+}
+
+SqliteStatement& SqliteStatement::bind(int parameter, std::int64_t integer) {
+  sqlite3_bind_int64(statement_.get(), parameter, integer);
+  return *this;
+}
+
+SqliteStatement& SqliteStatement::bind(int parameter, double real) {
+  sqlite3_bind_double(statement_.get(), parameter, real);
+  return *this;
+}
+
+SqliteStatement& SqliteStatement::bind(int parameter, std::string_view text) {
+  // A null pointer would bind NULL, and a view of nothing may hold one.
+  sqlite3_bind_text64(statement_.get(), parameter, text.empty() ? "" : text.data(), text.size(),
+                      nullptr, SQLITE_UTF8);
+  return *this;
+}
+
+SqliteStatement& SqliteStatement::bind(int parameter, std::nullptr_t) {
+  sqlite3_bind_null(statement_.get(), parameter);
+  return *this;
+}
+
+bool SqliteStatement::run() {
+  Step step = Step::row;
+  while (step == Step::row) step = this->step();
+  return step == Step::done;
+}
+
+SqliteStatement::Step SqliteStatement::step() {
+  switch (sqlite3_step(statement_.get())) {
+    case SQLITE_ROW:
+      return Step::row;
+    case SQLITE_DONE:
+      reset();
+      return Step::done;
+    default:
+      reset();
+      return Step::failed;
+  }
+}
+
+void SqliteStatement::reset() { sqlite3_reset(statement_.get()); }
+
+std::int64_t SqliteStatement::integer(int column) const {
+  return sqlite3_column_int64(statement_.get(), column);
+}
+
+std::string_view SqliteStatement::text(int column) const {
+  const unsigned char* octets = sqlite3_column_text(statement_.get(), column);
+  if (octets == nullptr) return {};
+  return {reinterpret_cast<const char*>(octets),
+          static_cast<std::size_t>(sqlite3_column_bytes(statement_.get(), column))};
+}
+
+void SqliteConnection::Close::operator()(sqlite3* connection) const {
+  sqlite3_close_v2(connection);
+}
+
+bool SqliteConnection::open(const std::filesystem::path& path, const std::string& vfs) {
+  sqlite3* connection = nullptr;
+  const int result = sqlite3_open_v2(path.c_str(), &connection,
+                                SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_EXRESCODE,
+                                vfs.empty() ? nullptr : vfs.c_str());
+  connection_.reset(connection);
+  if (result != SQLITE_OK) return false;
+  sqlite3_busy_timeout(connection, 250);
+  sqlite3_wal_hook(
+      connection,
+      [](void* pages, sqlite3*, const char*, int logPages) {
+        *static_cast<int*>(pages) = logPages;
+        return SQLITE_OK;
+      },
+      logPages_.get());
+  return true;
+}
+
+bool SqliteConnection::execute(const char* statements) {
+  return sqlite3_exec(connection_.get(), statements, nullptr, nullptr, nullptr) == SQLITE_OK;
+}
+
+bool SqliteConnection::prepare(SqliteStatement& statement, std::string_view sql) {
+  sqlite3_stmt* prepared = nullptr;
+  const int result =
+      sqlite3_prepare_v3(connection_.get(), sql.data(), static_cast<int>(sql.size()),
+                         SQLITE_PREPARE_PERSISTENT, &prepared, nullptr);
+  statement = SqliteStatement(prepared);
+  return result == SQLITE_OK;
+}
+
+std::optional<std::int64_t> SqliteConnection::integer(std::string_view sql) {
+  SqliteStatement statement;
+  if (!prepare(statement, sql) || statement.step() != SqliteStatement::Step::row) {
+    return std::nullopt;
+  }
+  return statement.integer(0);
+}
+
+std::optional<std::string> SqliteConnection::text(std::string_view sql) {
+  SqliteStatement statement;
+  if (!prepare(statement, sql) || statement.step() != SqliteStatement::Step::row) {
+    return std::nullopt;
+  }
+  return std::string(statement.text(0));
+}
+
+std::int64_t SqliteConnection::changes() const { return sqlite3_changes64(connection_.get()); }
+
+void SqliteConnection::rollBack() {
+  rolledBackFault_ = fault();
+  rolledBackMessage_ = message();
+  if (sqlite3_get_autocommit(connection_.get()) == 0) {
+    sqlite3_exec(connection_.get(), "ROLLBACK", nullptr, nullptr, nullptr);
+  }
+}
+
+bool SqliteConnection::isReadOnly() const {
+  return sqlite3_db_readonly(connection_.get(), "main") != 0;
+}
+
+SqliteConnection::Checkpoint SqliteConnection::checkpoint() {
+  return checkpoint(SQLITE_CHECKPOINT_PASSIVE);
+}
+
+SqliteConnection::Checkpoint SqliteConnection::checkpointAndTruncate() {
+  return checkpoint(SQLITE_CHECKPOINT_TRUNCATE);
+}
+
+SqliteConnection::Checkpoint SqliteConnection::checkpoint(int mode) {
+  int logPages = -1;
+  int movedPages = -1;
+  const int result =
+      sqlite3_wal_checkpoint_v2(connection_.get(), "main", mode, &logPages, &movedPages);
+  if (result != SQLITE_OK) return {};
+  return {true, logPages == movedPages};
+}
+
+bool SqliteConnection::syncLog() {
+  sqlite3_file* log = nullptr;
+  const int found =
+      sqlite3_file_control(connection_.get(), "main", SQLITE_FCNTL_JOURNAL_POINTER, &log);
+  if (found != SQLITE_OK) return false;
+  if (log == nullptr || log->pMethods == nullptr) return true;
+  return log->pMethods->xSync(log, SQLITE_SYNC_NORMAL) == SQLITE_OK;
+}
+
+SqliteFault SqliteConnection::fault() const {
+  const SqliteFault fault = currentFault();
+  return fault == SqliteFault::none ? rolledBackFault_ : fault;
+}
+
+std::string SqliteConnection::message() const {
+  return currentFault() == SqliteFault::none && rolledBackFault_ != SqliteFault::none
+             ? rolledBackMessage_
+             : sqlite3_errmsg(connection_.get());
+}
+
+SqliteFault SqliteConnection::currentFault() const {
+  switch (sqlite3_errcode(connection_.get()) & 0xff) {
+    case SQLITE_OK:
+    case SQLITE_ROW:
+    case SQLITE_DONE:
+      return SqliteFault::none;
+    case SQLITE_ERROR:
+      return SqliteFault::statement;
+    case SQLITE_FULL:
+      return SqliteFault::diskFull;
+    case SQLITE_CORRUPT:
+    case SQLITE_NOTADB:
+      return SqliteFault::corrupt;
+    default:
+      return SqliteFault::other;
+  }
+}
+
+}  // namespace quarvel

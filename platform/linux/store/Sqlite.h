@@ -1,0 +1,113 @@
+#pragma once
+
+#include <cstdint>
+#include <filesystem>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "base/Error.h"
+
+struct sqlite3;
+struct sqlite3_stmt;
+
+namespace quarvel {
+
+/// Why SQLite did not do something, as far as anybody above can act on it.
+enum class SqliteFault : std::uint8_t {
+  none,
+  diskFull,
+  corrupt,
+  statement,  // it makes no sense to this database: a table is missing, say
+  other,
+};
+
+/// A prepared statement. One thread at a time; must not outlive its connection.
+class SqliteStatement {
+ public:
+  enum class Step : std::uint8_t { row, done, failed };
+
+  SqliteStatement() = default;
+  explicit SqliteStatement(sqlite3_stmt* prepared) : statement_(prepared) {}
+
+  // Parameters count from 1. Text is not copied: it must live until the statement has run.
+  SqliteStatement& bind(int parameter, std::int64_t integer);
+  SqliteStatement& bind(int parameter, double real);
+  SqliteStatement& bind(int parameter, std::string_view text);
+  SqliteStatement& bind(int parameter, std::nullptr_t);
+
+  /// Runs to the end, whatever rows there are, and makes ready for the next run. False when it
+  /// failed: the connection says why.
+  bool run();
+  /// Moves to the next row. After `done` and `failed` the statement is ready for the next run;
+  /// after `row`, `reset` makes it so.
+  Step step();
+  void reset();
+
+  // The current row's columns, counted from 0. The text is valid until the next step.
+  [[nodiscard]] std::int64_t integer(int column) const;
+  [[nodiscard]] std::string_view text(int column) const;
+
+ private:
+  struct Finalize {
+    void operator()(sqlite3_stmt* statement) const;
+  };
+  std::unique_ptr<sqlite3_stmt, Finalize> statement_;
+};
+
+/// A connection to one database file. One thread at a time.
+class SqliteConnection {
+ public:
+  SqliteConnection() = default;
+
+  /// Opens for reading and writing; `path` must be a file that exists. `vfs` empty: the default one.
+  /// False when it failed: `fault` and `message` say why.
+  bool open(const std::filesystem::path& path, const std::string& vfs);
+
+  /// Runs statements without parameters, rows ignored. False when one failed.
+  bool execute(const char* statements);
+  /// The statement is unusable (every run fails) when this failed, and `sql` must not.
+  [[nodiscard]] bool prepare(SqliteStatement& statement, std::string_view sql);
+  /// The first column of the first row; none when there is no row or on failure.
+  [[nodiscard]] std::optional<std::int64_t> integer(std::string_view sql);
+  [[nodiscard]] std::optional<std::string> text(std::string_view sql);
+
+  /// How many rows the last INSERT, UPDATE or DELETE changed.
+  [[nodiscard]] std::int64_t changes() const;
+  /// Ends the transaction under way, if there still is one: some failures end it themselves.
+  void rollBack();
+  [[nodiscard]] bool isReadOnly() const;
+
+  struct Checkpoint {
+    bool ok = false;
+    bool complete = false;  // every frame of the log is in the database file, and both are synced
+  };
+  /// Moves what readers allow from the write-ahead log into the database file; never waits for one.
+  Checkpoint checkpoint();
+  /// As `checkpoint`, then cuts the log to nothing; waits for readers as long as the busy time-out.
+  Checkpoint checkpointAndTruncate();
+  /// Syncs the write-ahead log: everything committed is on the medium, and nothing new is written.
+  /// A failure does not show in `fault` and `message`.
+  bool syncLog();
+  /// Pages in the write-ahead log after the last commit.
+  [[nodiscard]] int logPages() const { return *logPages_; }
+
+  // About the last call that failed, also when it was rolled back since.
+  [[nodiscard]] SqliteFault fault() const;
+  [[nodiscard]] std::string message() const;
+
+ private:
+  Checkpoint checkpoint(int mode);
+  [[nodiscard]] SqliteFault currentFault() const;
+
+  struct Close {
+    void operator()(sqlite3* connection) const;
+  };
+  std::unique_ptr<int> logPages_ = std::make_unique<int>(0);  // where the commit hook writes
+  SqliteFault rolledBackFault_ = SqliteFault::none;
+  std::string rolledBackMessage_;
+  std::unique_ptr<sqlite3, Close> connection_;
+};
+
+}  // namespace quarvel

@@ -1,0 +1,120 @@
+#include "platform/linux/store/StoreQueue.h"
+
+#include "platform/linux/store/StoreError.h"
+
+namespace quarvel {
+
+void StoreQueue::Tally::add(const StoreRow& row) {
+  ++rows;
+  bytes += StoreBatch::bytes(row);
+  if (StoreBatch::isCounted(row)) ++counted;
+}
+
+bool StoreQueue::hasRoom() const {
+  return outstanding_.rows < maximumRows_ && outstanding_.bytes < maximumBytes_;
+}
+
+void StoreQueue::awaitRoom() {
+  if (closed_ || hasRoom()) return;
+  ++heldBack_;
+  while (!closed_ && !hasRoom()) roomCame_.wait(mutex_);
+  --heldBack_;
+}
+
+Error StoreQueue::refuse(std::uint64_t counted) {
+  counters_.accepted += counted;
+  counters_.refused += counted;
+  return StoreError(StoreErrorCode::closed, "The telemetry store is closed.");
+}
+
+void StoreQueue::appended() {
+  const StoreRow& row = waiting_.rows().back();
+  outstanding_.add(row);
+  if (StoreBatch::isCounted(row)) {
+    ++counters_.accepted;
+    ++counters_.waiting;
+  }
+  if (writerWaits_) rowsCame_.notifyOne();
+}
+
+void StoreQueue::close() {
+  MutexLock lock(mutex_);
+  closed_ = true;
+  rowsCame_.notifyAll();
+  roomCame_.notifyAll();
+  closing_.notifyAll();
+}
+
+bool StoreQueue::isClosed() const {
+  MutexLock lock(mutex_);
+  return closed_;
+}
+
+StoreQueue::Take StoreQueue::take(StoreBatch& batch, std::optional<Instant> deadline) {
+  MutexLock lock(mutex_);
+  while (waiting_.rows().empty()) {
+    if (closed_) return Take::closed;
+    writerWaits_ = true;
+    bool inTime = true;
+    if (deadline) {
+      inTime = rowsCame_.waitUntil(mutex_, *deadline);
+    } else {
+      rowsCame_.wait(mutex_);
+    }
+    writerWaits_ = false;
+    if (!inTime && waiting_.rows().empty() && !closed_) return Take::deadline;
+  }
+  std::swap(waiting_, batch);
+  batch.isLast = closed_;
+  return Take::rows;
+}
+
+bool StoreQueue::waitForClose(Instant deadline) {
+  MutexLock lock(mutex_);
+  while (!closed_) {
+    if (!closing_.waitUntil(mutex_, deadline)) break;
+  }
+  return closed_;
+}
+
+void StoreQueue::release(const Tally& tally) {
+  outstanding_.rows -= tally.rows;
+  outstanding_.bytes -= tally.bytes;
+  outstanding_.counted -= tally.counted;
+  counters_.waiting -= tally.counted;
+  if (heldBack_ > 0 && hasRoom()) roomCame_.notifyAll();
+}
+
+bool StoreQueue::committed(const Tally& tally) {
+  MutexLock lock(mutex_);
+  counters_.stored += tally.counted;
+  release(tally);
+  return waiting_.rows().empty();
+}
+
+void StoreQueue::lost(const Tally& tally) {
+  MutexLock lock(mutex_);
+  counters_.lost += tally.counted;
+  release(tally);
+}
+
+void StoreQueue::restart(std::uint64_t stored, std::uint64_t droppedByRetention) {
+  MutexLock lock(mutex_);
+  counters_.accepted += stored + droppedByRetention;
+  counters_.accepted -= counters_.stored + counters_.droppedByRetention;
+  counters_.stored = stored;
+  counters_.droppedByRetention = droppedByRetention;
+}
+
+void StoreQueue::droppedByRetention(std::uint64_t rows) {
+  MutexLock lock(mutex_);
+  counters_.stored -= rows;
+  counters_.droppedByRetention += rows;
+}
+
+StoreCounters StoreQueue::counters() const {
+  MutexLock lock(mutex_);
+  return counters_;
+}
+
+}  // namespace quarvel

@@ -1,0 +1,119 @@
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <initializer_list>
+#include <optional>
+#include <string_view>
+#include <utility>
+
+#include "base/Error.h"
+#include "base/Mutex.h"
+#include "platform/linux/store/StoreBatch.h"
+
+namespace quarvel {
+
+/// What has become of the rows (messages and events) that were offered to the store, since it was
+/// made. accepted = stored + waiting + droppedByRetention + refused + lost.
+struct StoreCounters {
+  std::uint64_t accepted = 0;
+  std::uint64_t stored = 0;  // in the database now
+  std::uint64_t waiting = 0;
+  std::uint64_t droppedByRetention = 0;
+  std::uint64_t refused = 0;  // since opening: the sender got an error
+  std::uint64_t lost = 0;     // since opening: the store was closed while the disk took nothing
+};
+
+/// Between any number of senders and the store's writer: bounded, first come, first served. A row
+/// counts against the bounds until it is committed or lost.
+class StoreQueue {
+ public:
+  using Instant = StoreBatch::Instant;
+
+  StoreQueue(std::size_t maximumRows, std::size_t maximumBytes)
+      : maximumRows_(maximumRows), maximumBytes_(maximumBytes) {}
+
+  /// Any thread. Holds the caller back while either bound is reached, so that the bound on bytes may
+  /// be passed by one row. Errors: the queue is closed, also while the caller was held back.
+  template <class Row>
+  Outcome push(Row&& row, std::initializer_list<std::string_view> texts) QUARVEL_EXCLUDES(mutex_) {
+    MutexLock lock(mutex_);
+    awaitRoom();
+    if (closed_) return refuse(1);
+    append(std::forward<Row>(row), texts);
+    return Success();
+  }
+
+  /// As `push`, but never holds the caller back: for the few rows that everything else rests on.
+  template <class Row>
+  Outcome pushAtOnce(Row&& row, std::initializer_list<std::string_view> texts)
+      QUARVEL_EXCLUDES(mutex_) {
+    MutexLock lock(mutex_);
+    if (closed_) return refuse(0);
+    append(std::forward<Row>(row), texts);
+    return Success();
+  }
+
+  /// Takes no more rows and wakes everybody. Any thread.
+  void close() QUARVEL_EXCLUDES(mutex_);
+  [[nodiscard]] bool isClosed() const QUARVEL_EXCLUDES(mutex_);
+
+  // The rest is the writer's.
+
+  enum class Take : std::uint8_t { rows, deadline, closed };
+  /// Exchanges the rows that wait for the empty `batch`. Waits for rows until `deadline`, if there is
+  /// one; `closed` once the queue is closed and empty.
+  Take take(StoreBatch& batch, std::optional<Instant> deadline) QUARVEL_EXCLUDES(mutex_);
+  /// Waits until `deadline`, whatever is queued meanwhile; returns early, and true, when closed.
+  [[nodiscard]] bool waitForClose(Instant deadline) QUARVEL_EXCLUDES(mutex_);
+
+  struct Tally {
+    std::size_t rows = 0;
+    std::size_t bytes = 0;
+    std::size_t counted = 0;
+
+    void add(const StoreRow& row);
+  };
+  // Makes room: rows that were taken are now in the database, or lost.
+
+  /// Returns whether no rows wait.
+  bool committed(const Tally& tally) QUARVEL_EXCLUDES(mutex_);
+  void lost(const Tally& tally) QUARVEL_EXCLUDES(mutex_);
+
+  /// Counts from what the opened database holds, and what has been removed from it.
+  void restart(std::uint64_t stored, std::uint64_t droppedByRetention) QUARVEL_EXCLUDES(mutex_);
+  void droppedByRetention(std::uint64_t rows) QUARVEL_EXCLUDES(mutex_);
+
+  [[nodiscard]] StoreCounters counters() const QUARVEL_EXCLUDES(mutex_);
+
+ private:
+  [[nodiscard]] bool hasRoom() const QUARVEL_REQUIRES(mutex_);
+  void awaitRoom() QUARVEL_REQUIRES(mutex_);
+  Error refuse(std::uint64_t counted) QUARVEL_REQUIRES(mutex_);
+  void release(const Tally& tally) QUARVEL_REQUIRES(mutex_);
+
+  template <class Row>
+  void append(Row&& row, std::initializer_list<std::string_view> texts) QUARVEL_REQUIRES(mutex_) {
+    if (waiting_.rows().empty()) waiting_.queuedAt = std::chrono::steady_clock::now();
+    waiting_.append(std::forward<Row>(row), texts);
+    appended();
+  }
+  void appended() QUARVEL_REQUIRES(mutex_);
+
+  const std::size_t maximumRows_;
+  const std::size_t maximumBytes_;
+
+  mutable Mutex mutex_;
+  ConditionVariable rowsCame_;  // for the writer
+  ConditionVariable roomCame_;  // for senders
+  ConditionVariable closing_;   // for the writer while it waits for room on the disk
+  bool closed_ QUARVEL_GUARDED_BY(mutex_) = false;
+  bool writerWaits_ QUARVEL_GUARDED_BY(mutex_) = false;
+  std::size_t heldBack_ QUARVEL_GUARDED_BY(mutex_) = 0;
+  StoreBatch waiting_ QUARVEL_GUARDED_BY(mutex_);
+  Tally outstanding_ QUARVEL_GUARDED_BY(mutex_);  // queued, or taken and not yet committed
+  StoreCounters counters_ QUARVEL_GUARDED_BY(mutex_);
+};
+
+}  // namespace quarvel

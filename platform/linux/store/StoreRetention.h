@@ -1,0 +1,83 @@
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "base/Date.h"
+#include "platform/linux/store/Sqlite.h"
+#include "platform/linux/store/StoreTables.h"
+
+namespace quarvel {
+
+/// Keeps the store within its bounds by removing the oldest rows, in steps so small that rows on
+/// their way in hardly notice. Rows that a remote backend has not yet had go last, but they go.
+///
+/// The file holds its bound because room is made before a batch comes in, and because SQLite takes
+/// freed pages again before it lets the file grow. A file that is too large all the same (the bound
+/// was lowered) is vacuumed page by page. The write-ahead log comes on top, a few megabytes.
+///
+/// Part of the `StoreDatabase`, whose connection it uses; the writer's thread.
+class StoreRetention {
+ public:
+  struct Bounds {
+    std::uint64_t maximumBytes = 268'435'456;
+    /// The backends whose cursors say which rows have been exported; with none, no row waits.
+    std::vector<std::string> remoteBackends;
+  };
+
+  /// `connection` and `lastIDs`, which are those committed, must outlive this.
+  StoreRetention(Bounds bounds, SqliteConnection& connection, const StoreIDs& lastIDs)
+      : bounds_(std::move(bounds)), connection_(connection), lastIDs_(lastIDs) {}
+
+  /// Once, with the last agent session of earlier runs of the service. False when it failed.
+  [[nodiscard]] bool prepare(std::int64_t lastEarlierSession, Date now);
+
+  enum class Progress : std::uint8_t { nothingToDo, more, failed };
+  /// One step, in a transaction of its own, towards a file in which rows of about `incomingBytes`
+  /// have room and, when `expired` is given, no row is older than that.
+  [[nodiscard]] Progress step(std::uint64_t incomingBytes, std::optional<Date> expired);
+
+  /// Rows that the steps since the last call removed, and how many of them had not been exported.
+  struct Removed {
+    std::uint64_t rows = 0;
+    std::uint64_t notExported = 0;
+  };
+  [[nodiscard]] Removed takeRemoved() { return std::exchange(removed_, {}); }
+
+ private:
+  struct Statements {
+    SqliteStatement oldest, remove;
+  };
+  /// The rows that one step may remove from one table: the oldest, up to an id.
+  struct Window {
+    std::int64_t lastID = 0;
+    std::int64_t lastTime = 0;  // of its last row when there are rows behind it, else the end of time
+    std::int64_t exportedThrough = 0;
+  };
+
+  Progress makeRoom(std::uint64_t bytes);
+  /// Removes rows up to `through`, oldest first; with `spare`, only those that have been exported.
+  Progress removeOldest(std::uint64_t bytes, std::int64_t through, bool spare);
+  bool removeWithin(const PerStoreTable<Window>& windows, std::int64_t through, Removed& removed);
+  bool removeSessions(std::int64_t through);
+  bool record(std::int64_t removed);
+  std::optional<Window> window(StoreTable table, std::uint64_t bytes, bool spare);
+  std::optional<std::int64_t> exportedThrough(StoreTable table);
+  std::optional<std::int64_t> value(SqliteStatement& statement);
+
+  const Bounds bounds_;
+  SqliteConnection& connection_;
+  const StoreIDs& lastIDs_;
+  std::int64_t lastEarlierSession_ = 0;
+  std::int64_t openedAt_ = 0;  // microseconds
+  std::uint64_t pageBytes_ = 0;
+  PerStoreTable<Statements> statements_;
+  SqliteStatement pages_, freePages_, cursor_, removeSessions_, keepLastID_, countDropped_;
+  Removed removed_;
+};
+
+}  // namespace quarvel

@@ -1,0 +1,85 @@
+#include "platform/linux/store/TelemetryStore.h"
+
+#include <pthread.h>
+
+#include <utility>
+
+#include "platform/linux/store/StoreDatabase.h"
+#include "platform/linux/store/StoreWriter.h"
+
+namespace quarvel {
+
+namespace {
+
+Date SystemDate() {
+  return std::chrono::floor<std::chrono::microseconds>(std::chrono::system_clock::now());
+}
+
+}  // namespace
+
+Result<std::unique_ptr<TelemetryStore>> TelemetryStore::open(Options options) {
+  if (!options.clock) options.clock = SystemDate;
+  const StoreWriter::Options writerOptions{
+      {options.path, options.vfs, {options.maximumBytes, options.remoteBackends}},
+      options.sync,
+      options.maximumAge,
+      options.clock};
+  auto database = StoreDatabase::open(writerOptions.database, options.clock());
+  if (!database) return database.error();
+  const StoreDatabase& opened = *database.value();
+  std::unique_ptr<TelemetryStore> store(
+      new TelemetryStore(options, opened.lastAgentSession()));
+  store->queue_.restart(opened.storedAtOpening(), opened.droppedAtOpening());
+  store->writer_ =
+      std::make_unique<StoreWriter>(writerOptions, std::move(database.value()), store->queue_);
+  MutexLock lock(store->closing_);
+  store->thread_ = std::thread([writer = store->writer_.get()] {
+    pthread_setname_np(pthread_self(), "quarvel.store");
+    writer->run();
+  });
+  return store;
+}
+
+TelemetryStore::TelemetryStore(const Options& options, std::int64_t lastAgentSession)
+    : clock_(options.clock),
+      queue_(options.queueRows, options.queueBytes),
+      lastAgentSession_(lastAgentSession) {}
+
+TelemetryStore::~TelemetryStore() { close(); }
+
+Result<std::int64_t> TelemetryStore::addAgentSession(const AgentSession& session) {
+  const std::int64_t id = ++lastAgentSession_;
+  Outcome added = queue_.pushAtOnce(
+      AgentSessionRow{id, session.sessionID, session.clientType, session.clientVersion,
+                      session.batchEvent, session.userInfo, clock_()},
+      {session.hierarchyToken, session.clientName, session.serviceName});
+  if (!added) return added.error();
+  return id;
+}
+
+Outcome TelemetryStore::addMessage(const Message& message) {
+  return queue_.push(MessageRow{message.agentSession, message.sessionID, message.category,
+                                message.type, message.payload, clock_()},
+                     {message.clientName, message.serviceName});
+}
+
+Outcome TelemetryStore::addAnalyticsEvent(std::string_view name, const Payload& payload) {
+  return queue_.push(AnalyticsEventRow{payload, clock_()}, {name});
+}
+
+Outcome TelemetryStore::addPowerEvent(std::int32_t domain, std::string_view name,
+                                      const Payload& payload) {
+  return queue_.push(PowerEventRow{domain, payload, clock_()}, {name});
+}
+
+Outcome TelemetryStore::flush(std::int64_t agentSession, FlushCompletion completion) {
+  return queue_.pushAtOnce(FlushRow{agentSession, std::move(completion)}, {});
+}
+
+void TelemetryStore::close() {
+  queue_.close();
+  MutexLock lock(closing_);
+  if (thread_.joinable()) thread_.join();
+}
+
+}  // namespace quarvel

@@ -1,0 +1,62 @@
+#pragma once
+
+#include <optional>
+#include <utility>
+
+#include "Statistics/Service/ZQReportingServiceDelegate.h"
+#include "tests/platform/Simulation.h"
+
+namespace quarvel {
+
+/// A client of the service, with the protocol's operations by name.
+class Client : public SimulatedClient {
+ public:
+  explicit Client(SimulatedClient client) : SimulatedClient(std::move(client)) {}
+
+  Call create(ReporterID id) { return call("createReportingSession:reply:", {id}); }
+  Call setServiceType(std::uint16_t type, ReporterID id) {
+    return call("setServiceType:reportingSession:reply:", {type, id});
+  }
+  Call serviceType(ReporterID id) { return call("getServiceNameForReporterID:reply:", {id}); }
+  Call configure(Dictionary configuration, ReporterID id) {
+    return call("setConfiguration:forReporterID:reply:", {std::move(configuration), id});
+  }
+  Call start(ReporterID id) { return call("startReportingSessionForID:reply:", {id}); }
+  /// To the sessions of `ids`, or a broadcast.
+  Call send(Dictionary payload, std::uint32_t category = 3, std::uint16_t type = 1,
+            std::optional<List> ids = std::nullopt) {
+    return call("sendMessage:withCategory:andType:forReportingIDs:reply:",
+                {std::move(payload), category, type, ids ? Value(*std::move(ids)) : Value()});
+  }
+  Call stop(ReporterID id) { return call("stopReportingSessionForID:reply:", {id}); }
+  Call destroy(ReporterID id) { return call("destroyReportingSession:reply:", {id}); }
+  Call valid(ReporterID id) { return call("reporterID:valid:", {id}); }
+  Call reporters() { return call("getAllReporters:", {}); }
+  Call kill() { return call("killService:", {}); }
+
+  void createStarted(ReporterID id) {
+    create(id);
+    start(id);
+  }
+};
+
+/// The whole service on the simulated platform, as its process entry sets it up.
+struct RunningService {
+  explicit RunningService(std::uint64_t seed) : simulation(seed) {
+    ProcessServiceListener().setDelegate(ZQReportingServiceDelegate::create());
+    ProcessServiceListener().resume();
+  }
+
+  /// Connects a client and runs until it is registered, so that clients are in the order of their
+  /// connecting.
+  [[nodiscard]] Client connect(std::int32_t pid) {
+    Client client(simulation.listener.connect(pid));
+    simulation.run();
+    return client;
+  }
+  void run() { simulation.run(); }
+
+  Simulation simulation;
+};
+
+}  // namespace quarvel

@@ -1,0 +1,420 @@
+#include "Statistics/Service/ZQReportingSession.h"
+
+#include <gmock/gmock.h>
+
+#include "tests/platform/Simulation.h"
+
+namespace quarvel {
+namespace {
+
+using testing::ElementsAre;
+using testing::ElementsAreArray;
+using testing::IsEmpty;
+
+/// A session whose owner is the test: it alone runs while the simulation does not, and so stands in
+/// for the `ServerQueue`.
+struct Owner {
+  explicit Owner(std::uint64_t seed, std::uint16_t serviceType = 0) : simulation(seed) {
+    holdServerQueue();
+    session->setServiceType(serviceType);
+    simulation.log.lines.clear();
+    simulation.journal.clear();
+  }
+  static void holdServerQueue() QUARVEL_ASSERT_CAPABILITY(serverQueueRole) {}
+
+  void start() {
+    holdServerQueue();
+    session->start();
+  }
+  void stop() {
+    holdServerQueue();
+    session->stop();
+  }
+  void send(const Dictionary& payload = {{"a", 1}}, std::uint32_t category = 3,
+            std::uint16_t type = 1, bool sync = false) {
+    holdServerQueue();
+    session->sendMessage(Payload(payload), category, type, sync,
+                         [this](const std::optional<Error>& error) { sent.push_back(error); });
+  }
+  /// A start reply that counts in `ended`.
+  void awaitEnd() {
+    struct Counter : ReplySink {
+      explicit Counter(std::vector<Value>& counted) : ended(counted) {}
+      void result(Value value) override { ended.push_back(std::move(value)); }
+      void error(const Error&) override { ADD_FAILURE(); }
+      std::vector<Value>& ended;
+    };
+    holdServerQueue();
+    session->setTransactionCompleteBlock(BoolReply(std::make_shared<Counter>(ended)));
+  }
+  /// The ids of the messages in the history.
+  [[nodiscard]] std::vector<std::string> history() const {
+    std::vector<std::string> ids;
+    session->aggregatedPayloadData()->forEach([&](const PayloadHistory::Entry& entry) {
+      if (const auto* message = std::get_if<SentMessage>(&entry)) ids.push_back(message->messageID);
+    });
+    return ids;
+  }
+  [[nodiscard]] std::vector<std::string> errors() const { return simulation.log.texts("error"); }
+  /// What reached the agent inside its one session.
+  [[nodiscard]] const std::vector<SimulatedAgent::Message>& delivered() const {
+    return simulation.agent.sessions.at(0).messages;
+  }
+
+  Simulation simulation;
+  std::shared_ptr<ZQReportingSession> session = ZQReportingSession::initWithID(7, {42});
+  std::vector<std::optional<Error>> sent;  // the replies to `send`
+  std::vector<Value> ended;
+};
+
+std::string Line(const char* level, const char* function, const char* message) {
+  return std::string(level) + " zqrr " + function + ": " + message;
+}
+const char* const kStart = "-[ZQReportingSession start]";
+const char* const kStop = "-[ZQReportingSession stop]";
+const char* const kSend = "-[ZQReportingSession sendMessage:category:type:sync:reply:]";
+const char* const kSendSingle =
+    "+[ZQReportingSession sendSingleMessage:category:type:serviceType:userInfo:reply:]";
+const char* const kWait = "ZQReportingUtilityWait";
+
+TEST(Session, StartSetsUpAnAgentSessionWithWhatIsConfiguredByThen) {
+  for (const auto seed : Seeds()) {
+    Owner owner(seed, kServiceTypeTelephony);
+    owner.session->setConfiguration(Dictionary{{"app", "Phone"}, {"version", 1}});
+    owner.session->setConfiguration(Dictionary{{"version", 2}});
+    owner.session->updateDefaults(std::nullopt);
+    owner.start();
+    // The user information is shared with the set-up, which has not begun; the service name is not.
+    owner.session->updateDefaults(Dictionary{{"ClientName", "renamed"}});
+    owner.holdServerQueue();
+    owner.session->setServiceType(kServiceTypeAlarms);
+    owner.simulation.run();
+
+    const SimulatedAgent& agent = owner.simulation.agent;
+    ASSERT_EQ(agent.sessions.size(), 1U);
+    EXPECT_THAT(agent.tokenParents, ElementsAre(std::nullopt));
+    EXPECT_EQ(agent.sessions[0].info, (Dictionary{{"ClientType", 19},
+                                                  {"ClientVersion", 2.0},
+                                                  {"SessionID", 7},
+                                                  {"BatchEvent", true},
+                                                  {"HierarchyToken", agent.tokens.at(0)}}));
+    EXPECT_EQ(agent.sessions[0].userInfo, (Dictionary{{"ClientName", "renamed"},
+                                                      {"ServiceName", "telephony_session"},
+                                                      {"app", "Phone"},
+                                                      {"version", 2}}));
+    EXPECT_THAT(agent.sessions[0].frameworksToCheck, IsEmpty());
+    EXPECT_EQ(owner.session->serviceName(), "alarms");
+    EXPECT_FALSE(owner.session->relmReportingSessionStarted());
+  }
+}
+
+TEST(Session, MessagesWaitForTheBackendsUpToNineSeconds) {
+  struct Case {
+    const char* name;
+    std::optional<Scheduler::Duration> answersAfter;
+    bool found;
+    std::optional<Scheduler::Duration> deliveredAt;
+    std::vector<std::string> errors;
+  };
+  const std::string none =
+      Line("error", kStart, "No backends found, this session won't get sent to the server");
+  const std::string timeOut = Line("error", kWait, "failed to find backend");
+  const std::string dropped = Line("error", kSend, "No valid RelmReportingSession");
+  const Case kCases[] = {
+      {"at once", 0s, true, 0s, {}},
+      {"just in time", 9s - 1us, true, 9s - 1us, {}},
+      {"just too late", 9s + 1us, true, std::nullopt, {timeOut, dropped}},
+      {"never", std::nullopt, true, std::nullopt, {timeOut, dropped}},
+      {"none found", 1s, false, std::nullopt, {none, timeOut, dropped}},
+  };
+  for (const Case& each : kCases) {
+    for (const auto seed : Seeds()) {
+      SCOPED_TRACE(each.name);
+      Owner owner(seed);
+      SimulatedAgent& agent = owner.simulation.agent;
+      agent.answers = each.answersAfter.has_value();
+      agent.answersAfter = each.answersAfter.value_or(0s);
+      if (!each.found) agent.backends.reset();
+      owner.start();
+      owner.send();
+      EXPECT_THAT(owner.sent, ElementsAre(std::nullopt));  // whatever becomes of it
+      owner.simulation.run();
+
+      EXPECT_THAT(owner.errors(), ElementsAreArray(each.errors));
+      EXPECT_EQ(agent.sessions.at(0).released, !each.deliveredAt);
+      ASSERT_EQ(owner.delivered().size(), each.deliveredAt ? 1U : 0U);
+      if (each.deliveredAt) {
+        EXPECT_EQ(owner.delivered()[0].at, *each.deliveredAt);
+      }
+      EXPECT_FALSE(owner.session->relmReportingSessionStarted());
+      EXPECT_THAT(owner.history(), ElementsAre("Playback_Start_1"));
+    }
+  }
+}
+
+TEST(Session, StopFlushesBehindWhatWasSentAndAnswersTheStartAtOnce) {
+  for (const auto seed : Seeds()) {
+    Owner owner(seed);
+    owner.simulation.agent.answersAfter = 5s;
+    owner.start();
+    owner.awaitEnd();
+    owner.send({{"sent", "while started"}});
+    owner.stop();
+    EXPECT_THAT(owner.ended, ElementsAre(Value(true)));
+    EXPECT_EQ(owner.session->aggregatedPayloadData(), nullptr);
+    owner.send({{"sent", "after the stop"}});
+    owner.simulation.run();
+
+    EXPECT_THAT(owner.simulation.journal.lines({"agent 1"}),
+                ElementsAre("agent 1 created", "agent 1 message 0x3 0x1", "agent 1 flush",
+                            "agent 1 released"));
+    EXPECT_THAT(owner.simulation.agent.sessions[0].flushes, ElementsAre(5s));
+    ASSERT_EQ(owner.simulation.agent.singleMessages.size(), 1U);
+    EXPECT_EQ(owner.simulation.agent.singleMessages[0].message.payload,
+              Payload(Dictionary{{"sent", "after the stop"}}));
+    EXPECT_THAT(owner.errors(), IsEmpty());
+  }
+}
+
+TEST(Session, StartsAndStopsRepeat) {
+  for (const auto seed : Seeds()) {
+    Owner owner(seed);
+    owner.simulation.log.verbose = {"zqrr"};
+    owner.awaitEnd();
+    owner.stop();
+    EXPECT_THAT(owner.ended, IsEmpty()) << "stopped before it was started";
+    owner.start();
+    owner.start();
+    owner.send();
+    owner.send();
+    EXPECT_THAT(owner.history(), ElementsAre("Playback_Start_1", "Playback_Start_2"));
+    owner.stop();
+    owner.stop();
+    EXPECT_THAT(owner.ended, ElementsAre(Value(true)));
+    owner.start();
+    owner.send();
+    EXPECT_THAT(owner.history(), ElementsAre("Playback_Start_3")) << "counts run on";
+    owner.stop();
+    EXPECT_THAT(owner.ended, ElementsAre(Value(true), Value(true)));
+    EXPECT_THAT(owner.simulation.journal.lines({"log", "trace"}),
+                ElementsAre("log " + Line("debug", kStop, "ending session 7"),
+                            "log " + Line("debug", kStart, "starting session owned by 7"),
+                            "trace 0x2104282c",
+                            "log " + Line("debug", kStart, "starting session owned by 7"),
+                            "log " + Line("info", kStart, "7 is already started"),
+                            "log " + Line("debug", kSend, "sending message for session owned by 7"),
+                            "trace 0x21042838",
+                            "log " + Line("debug", kSend, "sending message for session owned by 7"),
+                            "trace 0x21042838", "log " + Line("debug", kStop, "ending session 7"),
+                            "log " + Line("debug", kStop, "ending session 7"), "trace 0x21042830",
+                            "log " + Line("debug", kStop, "ending session 7"),
+                            "log " + Line("debug", kStart, "starting session owned by 7"),
+                            "trace 0x2104282c",
+                            "log " + Line("debug", kSend, "sending message for session owned by 7"),
+                            "trace 0x21042838", "log " + Line("debug", kStop, "ending session 7"),
+                            "log " + Line("debug", kStop, "ending session 7"), "trace 0x21042830"));
+    owner.simulation.run();
+    EXPECT_EQ(owner.simulation.agent.tokens.size(), 2U);
+    ASSERT_EQ(owner.simulation.agent.sessions.size(), 2U);
+    EXPECT_EQ(owner.simulation.agent.sessions[0].messages.size(), 2U);
+    EXPECT_EQ(owner.simulation.agent.sessions[1].messages.size(), 1U);
+  }
+}
+
+TEST(Session, OfTypeTestNeverTouchesTheAgent) {
+  for (const auto seed : Seeds()) {
+    Owner owner(seed, kServiceTypeTest);
+    owner.start();
+    owner.awaitEnd();
+    owner.send();
+    owner.stop();
+    owner.simulation.run();
+    EXPECT_THAT(owner.ended, ElementsAre(Value(true)));
+    EXPECT_THAT(owner.simulation.agent.tokens, IsEmpty());
+    EXPECT_THAT(owner.simulation.journal.lines({"agent"}), IsEmpty());
+    EXPECT_THAT(owner.simulation.log.texts(),
+                ElementsAre(Line("info", kSend, "transactions aren't allowed on this platform")));
+  }
+}
+
+TEST(Session, AnnouncesItsLifeAndKeepsItsQueuedWorkWhenItIsDropped) {
+  for (const auto seed : Seeds()) {
+    Owner owner(seed);
+    owner.start();
+    owner.send();
+    owner.session.reset();
+    owner.simulation.run();
+    EXPECT_EQ(owner.delivered().size(), 1U);
+    EXPECT_THAT(owner.simulation.agent.sessions[0].flushes, IsEmpty());
+    EXPECT_TRUE(owner.simulation.agent.sessions[0].released);
+    EXPECT_EQ(owner.simulation.log.texts().back(),
+              Line("info", "-[ZQReportingSession dealloc]", "deallocing this session 7"));
+    ASSERT_FALSE(owner.simulation.trace.empty());
+    EXPECT_EQ(owner.simulation.trace.front().code, 0x21042828U);
+    EXPECT_EQ(owner.simulation.trace.back().code, 0x21042834U);
+    for (const TraceEvent& event : owner.simulation.trace) {
+      EXPECT_THAT(event.arguments, ElementsAre(0, 0, 0, 0));
+    }
+  }
+}
+
+TEST(Session, LogsAFailedFlushAndKeepsQuietAboutAFailedSend) {
+  for (const auto seed : Seeds()) {
+    Owner owner(seed);
+    owner.simulation.agent.sendError = Error::because("agent", 3, "full");
+    owner.simulation.agent.flushError = Error::because("agent", 4, "gone");
+    owner.simulation.log.verbose = {"zqrr"};
+    owner.start();
+    owner.send();
+    owner.simulation.run();
+    EXPECT_EQ(owner.simulation.journal.lines({"agent 1 message"}).size(), 1U);
+    EXPECT_THAT(owner.simulation.log.texts("debug"),
+                ElementsAre(Line("debug", kStart, "starting session owned by 7"),
+                            Line("debug", kSend, "sending message for session owned by 7")));
+    EXPECT_THAT(owner.errors(), IsEmpty());
+    owner.stop();
+    owner.simulation.run();
+    EXPECT_THAT(owner.errors(), ElementsAre(Line("error", kStop, "flush error agent 4: gone")));
+    EXPECT_TRUE(owner.simulation.agent.sessions[0].released);
+  }
+}
+
+TEST(Delivery, RewritesBlanksInItsOwnKeysOnly) {
+  for (const auto seed : Seeds()) {
+    Owner owner(seed);
+    owner.start();
+    owner.send({{"two words", "two words"},
+                {7, 1},
+                {"nested", Dictionary{{"inner key", 2}}},
+                {"a b", "first"},
+                {"a_b", "last"}});
+    owner.simulation.run();
+    ASSERT_EQ(owner.delivered().size(), 1U);
+    EXPECT_EQ(owner.delivered()[0].payload.root().toDictionary(),
+              (Dictionary{{"two_words", "two words"},
+                          {7, 1},
+                          {"nested", Dictionary{{"inner key", 2}}},
+                          {"a_b", "last"}}));
+  }
+}
+
+TEST(Delivery, CountsEachKindForItselfAndKeepsOrder) {
+  for (const auto seed : Seeds()) {
+    Owner owner(seed);
+    owner.start();
+    owner.send({{"n", 1}}, 0x10000003, 1);
+    owner.send({{"n", 2}}, 0x10000003, 2, true);
+    owner.send({{"n", 3}}, 0x10000003, 1, true);
+    owner.send({{"n", 4}}, 0xffffffff, 0xffff);
+    EXPECT_THAT(owner.history(), ElementsAre("DSP_Playback_Start_1", "DSP_Playback_Stop_1",
+                                             "DSP_Playback_Start_2", "Undefined_Unknown_1"));
+    EXPECT_EQ(owner.sent.size(), 4U) << "answered before delivery, synchronous or not";
+    EXPECT_THAT(owner.simulation.agent.sessions, IsEmpty());
+    owner.simulation.run();
+    EXPECT_THAT(owner.simulation.journal.lines({"agent 1 message"}),
+                ElementsAre("agent 1 message 0x3 0x1", "agent 1 message 0x3 0x2",
+                            "agent 1 message 0x3 0x1", "agent 1 message 0xffff 0xffff"));
+    std::vector<std::int64_t> numbers;
+    for (const auto& message : owner.delivered()) {
+      numbers.push_back(*message.payload.find("n")->integer());
+    }
+    EXPECT_THAT(numbers, ElementsAre(1, 2, 3, 4));
+  }
+}
+
+TEST(Delivery, VerboseLinesFollowAMessage) {
+  for (const auto seed : Seeds()) {
+    Owner owner(seed);
+    owner.simulation.log.verbose = {"zqrr"};
+    owner.start();
+    owner.simulation.run();
+    owner.simulation.log.lines.clear();
+    owner.send({{"a key", 1}}, 0x10000003);
+    owner.simulation.run();
+    EXPECT_THAT(owner.simulation.log.texts(),
+                ElementsAre(Line("debug", kSend, "sending message for session owned by 7"),
+                            Line("debug", kSend,
+                                 "RelmReportingAgent <RelmReportingSession 1> : message "
+                                 "{\"a key\":1} : category 268435459 : type 1")));
+
+    owner.stop();
+    owner.simulation.run();
+    owner.simulation.log.lines.clear();
+    owner.send({{"a key", 1}}, 0x10000003);
+    owner.simulation.run();
+    EXPECT_THAT(
+        owner.simulation.log.texts(),
+        ElementsAre(
+            Line("debug", kSend, "sending message for session owned by 7"),
+            Line("debug", kSend, "session not started, will send as a single message"),
+            Line("debug", kSendSingle, "sending single message after delta 0 for service 0"),
+            Line("debug", kSendSingle, "sending single message"),
+            Line("debug", kSendSingle, "message {\"a_key\":1} : category 268435459 : type 1")));
+  }
+}
+
+TEST(SingleMessage, CarriesItsServiceTypeAndNothingOfTheUserInformation) {
+  for (const auto seed : Seeds()) {
+    Owner owner(seed, kServiceTypeTelephony);
+    owner.session->setConfiguration(Dictionary{{"app", "Phone"}});
+    owner.send({{"a key", 1}}, 0x10000003);
+    owner.simulation.run();
+    const auto& singles = owner.simulation.agent.singleMessages;
+    ASSERT_EQ(singles.size(), 1U);
+    EXPECT_EQ(singles[0].info,
+              (Dictionary{{"ClientType", 19}, {"ClientVersion", 2.0}, {"SessionID", -1}}));
+    EXPECT_EQ(singles[0].userInfo,
+              (Dictionary{{"ClientName", "tarnwick.quarvel"}, {"ServiceName", "telephony"}}));
+    EXPECT_EQ(singles[0].message.category, 3);
+    EXPECT_EQ(singles[0].message.payload.root().toDictionary(), (Dictionary{{"a_key", 1}}));
+    EXPECT_THAT(owner.simulation.journal.lines({"trace"}),
+                ElementsAre("trace 0x21042838", "trace 0x21042838"));
+    EXPECT_THAT(owner.history(), ElementsAre("DSP_Playback_Start_1"));
+  }
+}
+
+TEST(SingleMessage, OnlyAlarmsAreSpreadOverAMinute) {
+  for (const auto seed : Seeds()) {
+    for (const std::uint32_t drawn : {0U, 59U}) {
+      Simulation simulation(seed);
+      simulation.random.always = drawn;
+      const auto sendOne = [](std::uint16_t serviceType) {
+        ZQReportingSession::sendSingleMessage(Payload(), 1, serviceType, serviceType, std::nullopt,
+                                              nullptr);
+      };
+      sendOne(kServiceTypeAlarms);
+      sendOne(kServiceTypeStandalone);
+      simulation.run();
+      EXPECT_THAT(simulation.random.bounds, ElementsAre(60));
+      std::map<std::uint16_t, Scheduler::Duration> sentAt;
+      for (const auto& single : simulation.agent.singleMessages) {
+        sentAt[single.message.type] = single.message.at;
+      }
+      EXPECT_EQ(sentAt.at(kServiceTypeAlarms), std::chrono::seconds(drawn));
+      EXPECT_EQ(sentAt.at(kServiceTypeStandalone), 0s);
+    }
+  }
+}
+
+TEST(SingleMessage, IsAnsweredWithTheAgentsError) {
+  for (const auto seed : Seeds()) {
+    for (const auto& error :
+         {std::optional<Error>(), std::optional(Error::because("agent", 3, "full"))}) {
+      Simulation simulation(seed);
+      simulation.agent.singleMessageError = error;
+      std::vector<std::optional<Error>> replies;
+      ZQReportingSession::sendSingleMessage(
+          std::nullopt, 1, 0, 0, Dictionary{{"ignored", true}},
+          [&](const std::optional<Error>& reply) { replies.push_back(reply); });
+      simulation.run();
+      EXPECT_THAT(replies, ElementsAre(error));
+      EXPECT_EQ(simulation.log.texts(),
+                error ? std::vector{Line("error", kSendSingle,
+                                         "sendOneMessageWithSessionInfo agent 3: full")}
+                      : std::vector<std::string>());
+    }
+  }
+}
+
+}  // namespace
+}  // namespace quarvel

@@ -1,0 +1,221 @@
+"""Starts the installed service in directories of its own, and speaks to it as any client may."""
+
+import contextlib
+import json
+import os
+import pathlib
+import signal
+import socket
+import sqlite3
+import struct
+import subprocess
+import tempfile
+import time
+import unittest
+
+import msgpack
+
+PREFIX = pathlib.Path(os.environ["QUARVEL_PREFIX"])
+# How long something may take that normally takes no time: machines that test are slow at times.
+PATIENCE = float(os.environ.get("QUARVEL_TEST_PATIENCE", "60"))
+
+
+def eventually(condition, what):
+    """Waits for a condition that another process brings about."""
+    deadline = time.monotonic() + PATIENCE
+    while True:
+        result = condition()
+        if result:
+            return result
+        if time.monotonic() > deadline:
+            raise AssertionError(f"never came about: {what}")
+        time.sleep(0.01)
+
+
+class Service:
+    """A running quarveld; a context manager that ends it in order."""
+
+    def __init__(self, configuration="", directory=None, wrapper=()):
+        self._temporary = None if directory else tempfile.TemporaryDirectory(prefix="quarvel-test-")
+        self.directory = pathlib.Path(directory or self._temporary.name)
+        for name in ("run", "state", "etc/preferences", "diagnostics"):
+            (self.directory / name).mkdir(parents=True, exist_ok=True)
+        (self.directory / "etc/quarvel.toml").write_text(configuration)
+        self.environment = dict(
+            os.environ,
+            RUNTIME_DIRECTORY=str(self.directory / "run"),
+            STATE_DIRECTORY=str(self.directory / "state"),
+            CONFIGURATION_DIRECTORY=str(self.directory / "etc"),
+            QUARVEL_DIAGNOSTICS_PREFIX=str(self.directory / "diagnostics"),
+        )
+        for inherited in ("QUARVEL_SOCKET", "LISTEN_FDS", "LISTEN_PID", "JOURNAL_STREAM"):
+            self.environment.pop(inherited, None)
+        self.socket = self.directory / "run/reporting.sock"
+        self.log_path = self.directory / "log"
+        self._wrapper = list(wrapper)
+        self.process = None
+
+    def start(self):
+        with open(self.log_path, "ab") as log:
+            self.process = subprocess.Popen(
+                [*self._wrapper, PREFIX / "sbin/quarveld"], env=self.environment, stderr=log
+            )
+        def up():
+            if self.process.poll() is not None:
+                raise AssertionError(f"quarveld ended: {self.log()}")
+            with contextlib.suppress(OSError):
+                Client(self).close()
+                return True
+        eventually(up, "the service accepts clients")
+        return self
+
+    def end(self, how=signal.SIGTERM):
+        """Returns the exit status."""
+        if self.process.poll() is None:
+            self.process.send_signal(how)
+        return self.process.wait(PATIENCE)
+
+    def __enter__(self):
+        return self.start()
+
+    def __exit__(self, *_):
+        try:
+            status = self.end()
+        finally:
+            if self.process.poll() is None:
+                self.process.kill()
+                self.process.wait()
+            if self._temporary:
+                log = self.log()
+                self._temporary.cleanup()
+        if "ERROR: " in log and "Sanitizer" in log:
+            raise AssertionError(log)
+        self.status = status
+
+    def log(self):
+        return self.log_path.read_text(errors="replace") if self.log_path.exists() else ""
+
+    def rows(self, query, *arguments):
+        path = self.directory / "state/telemetry.db"
+        with contextlib.closing(sqlite3.connect(f"file:{path}?mode=ro", uri=True)) as database:
+            database.row_factory = sqlite3.Row
+            return database.execute(query, arguments).fetchall()
+
+    def count(self, query, *arguments):
+        return self.rows(f"SELECT count(*) FROM {query}", *arguments)[0][0]
+
+    def wait_for_rows(self, count, query, *arguments):
+        eventually(lambda: self.count(query, *arguments) >= count, f"{count} rows of {query}")
+        return self.rows(f"SELECT * FROM {query}", *arguments)
+
+    def ctl(self, *arguments, **options):
+        return subprocess.run(
+            [PREFIX / "bin/quarvelctl", *map(str, arguments)],
+            env=self.environment, capture_output=True, text=True, timeout=PATIENCE, **options
+        )
+
+    def prefer(self, **values):
+        """Writes the service's preferences; they take effect when it is notified."""
+        lines = [f"{key} = {json.dumps(value)}\n" for key, value in values.items()]
+        path = self.directory / "etc/preferences/tarnwick.quarvel.toml"
+        path.write_text("".join(lines))
+
+    def notify(self, name="tarnwick.quarvel.reporting"):
+        path = self.directory / "run/notify" / name
+        path.touch()
+        os.utime(path)
+
+
+class Client:
+    """One connection. `call` waits for the reply; `send` does not."""
+
+    def __init__(self, service):
+        self._socket = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
+        self._socket.settimeout(PATIENCE)
+        self._socket.connect(str(service.socket))
+        self._unpacker = msgpack.Unpacker(raw=False, timestamp=3)
+        self._next = 0
+        self.replies = {}
+
+    def close(self):
+        self._socket.close()
+
+    def write(self, data):
+        self._socket.sendall(data)
+
+    def send(self, method, *arguments):
+        self._next += 1
+        self.write(msgpack.packb([0, self._next, method, list(arguments)]))
+        return self._next
+
+    def receive(self):
+        """Reads until one more reply is there; returns its id, or None at the end of the stream."""
+        while True:
+            for kind, identifier, error, result in self._unpacker:
+                assert kind == 1 and identifier not in self.replies
+                self.replies[identifier] = (error, result)
+                return identifier
+            data = self._socket.recv(65536)
+            if not data:
+                return None
+            self._unpacker.feed(data)
+
+    def wait(self, identifier):
+        while identifier not in self.replies:
+            if self.receive() is None:
+                raise AssertionError(f"the connection ended without reply {identifier}")
+        error, result = self.replies[identifier]
+        if error is not None:
+            raise CallError(error)
+        return result
+
+    def call(self, method, *arguments):
+        return self.wait(self.send(method, *arguments))
+
+    def start_session(self, reporter, service_type=None, configuration=None):
+        """Creates and starts; returns the id of the start call, which is answered at the stop."""
+        self.call("createReportingSession:reply:", reporter)
+        if service_type is not None:
+            self.call("setServiceType:reportingSession:reply:", service_type, reporter)
+        if configuration is not None:
+            self.call("setConfiguration:forReporterID:reply:", configuration, reporter)
+        started = self.send("startReportingSessionForID:reply:", reporter)
+        self.call("reporterID:valid:", reporter)  # so the start has been carried out
+        return started
+
+    def message(self, payload, reporters, category=3, kind=1):
+        return self.call(
+            "sendMessage:withCategory:andType:forReportingIDs:reply:", payload, category, kind, reporters
+        )
+
+    def stop_session(self, reporter):
+        return self.call("stopReportingSessionForID:reply:", reporter)
+
+    def until_end(self):
+        """Reads to the end of the stream; a reset is an end too."""
+        with contextlib.suppress(ConnectionResetError):
+            while self.receive() is not None:
+                pass
+
+
+class CallError(Exception):
+    def __init__(self, error):
+        super().__init__(str(error))
+        self.domain, self.code = error["domain"], error["code"]
+        self.reason = error["userInfo"].get("reason", "")
+
+
+class ServiceTest(unittest.TestCase):
+    def service(self, configuration="", **options):
+        service = Service(configuration, **options)
+        self.enterContext(service) if hasattr(self, "enterContext") else self._enter(service)
+        return service
+
+    def _enter(self, context):
+        context.__enter__()
+        self.addCleanup(context.__exit__, None, None, None)
+
+    def client(self, service):
+        client = Client(service)
+        self.addCleanup(client.close)
+        return client

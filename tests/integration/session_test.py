@@ -1,0 +1,258 @@
+"""A client's sessions, from its socket to the store, with the installed service."""
+
+import json
+import os
+import subprocess
+import sys
+import unittest
+
+from harness import PATIENCE, PREFIX, CallError, Client, Service, ServiceTest, eventually
+
+NO_BACKENDS = "[agent]\nbackends = []\n"
+
+
+class Sessions(ServiceTest):
+    def test_every_message_of_a_session_is_in_the_store(self):
+        service = self.service()
+        client = self.client(service)
+        started = client.start_session(77, 2, {"HostApplicationDisplayID": "org.example.phone"})
+        for number in range(300):
+            client.message({"call number": number, "route": "Receiver"}, [77], 0x40000007, 1)
+        self.assertNotIn(started, client.replies, "a start is answered at the stop")
+        client.stop_session(77)
+        self.assertIs(client.wait(started), True)
+        eventually(lambda: service.count("agent_session WHERE flushed_at IS NOT NULL"), "a flush")
+        session = service.rows("SELECT * FROM agent_session")[0]
+        self.assertEqual(session["session_id"], 77)
+        self.assertEqual((session["client_type"], session["client_version"]), (19, 2.0))
+        self.assertEqual(session["service_name"], "telephony_session")
+        self.assertEqual(
+            json.loads(session["user_info"])["HostApplicationDisplayID"], "org.example.phone")
+        messages = service.rows("SELECT * FROM message WHERE agent_session = ? ORDER BY id", session["id"])
+        self.assertEqual(len(messages), 301, "and the summary")
+        for number, message in enumerate(messages[:-1]):
+            self.assertEqual(json.loads(message["payload"]), {"call_number": number, "route": "Receiver"})
+            self.assertEqual((message["category"], message["type"]), (7, 1))
+        summary = json.loads(messages[-1]["payload"])
+        self.assertEqual((messages[-1]["category"], messages[-1]["type"]), (0xFFFF, 0xFFFF))
+        self.assertEqual(summary["ZQ_Session_Summary_Event"], "2")
+        self.assertEqual(json.loads(summary["Routing_RouteChange_Start_300"])["call_number"], 299)
+        self.assertEqual(service.count("analytics_event WHERE name = 'tarnwick.quarvel.Routing_RouteChange.Start'"), 300)
+        client.close()
+        uptime = service.wait_for_rows(
+            1, "analytics_event WHERE name LIKE '%uptime' AND payload LIKE '%python%'")[0]
+        self.assertGreater(json.loads(uptime["payload"])["seconds"], 0)
+
+    def test_messages_outside_a_session_go_one_by_one(self):
+        service = self.service()
+        client = self.client(service)
+        client.message({"EngineOnTime": 1.5, "zqreporting_timestamp": 7}, None)
+        client.call("createReportingSession:reply:", 5)
+        client.call("setServiceType:reportingSession:reply:", 3, 5)
+        client.message({"EngineOnTime": 2.5, "zqreporting_timestamp": 8}, [5])
+        rows = service.wait_for_rows(2, "message")
+        self.assertEqual({(row["agent_session"], row["session_id"], row["service_name"]) for row in rows},
+                         {(None, -1, "standalone"), (None, -1, "haptics")})
+        power = service.wait_for_rows(1, "power_event")
+        self.assertEqual([(row["domain"], row["name"], json.loads(row["payload"])) for row in power],
+                         [(28, "Fennor_Haptics",
+                           {"EngineOnDuration": 2.5, "ApplicationName": "Unknown", "TimestampEnd": 8})])
+
+    def test_a_thousand_sessions_wait_for_backends_and_nobody_else_does(self):
+        service = self.service(NO_BACKENDS)
+        waiting = self.client(service)
+        other = self.client(service)
+        for reporter in range(1, 1001):
+            waiting.send("createReportingSession:reply:", reporter)
+            waiting.send("startReportingSessionForID:reply:", reporter)
+        while len(waiting.replies) < 1000:
+            waiting.receive()
+        failed = lambda: service.log().count("failed to find backend")
+        calls = 0
+        while failed() == 0:
+            self.assertEqual(other.call("reporterID:valid:", 5)["reporterID"], 5)
+            calls += 1
+        self.assertGreater(calls, 90, "in nine seconds, calls that take far less than 100 ms each")
+        eventually(lambda: failed() == 1000, "all sessions gave up")
+        lines = [line for line in service.log().splitlines() if "find backend" in line]
+        begun = sorted(line[11:26] for line in lines if "waiting for" in line)
+        ended = sorted(line[11:26] for line in lines if "failed to" in line)
+        self.assertEqual((len(begun), len(ended)), (1000, 1000))
+        self.assertGreaterEqual(seconds_between(begun[0], ended[0]), 9)
+        self.assertLess(seconds_between(begun[-1], ended[-1]), 20, "side by side, not one by one")
+
+    def test_an_idle_service_never_wakes_up(self):
+        service = self.service()
+        clients = [self.client(service) for _ in range(100)]
+        for number, client in enumerate(clients):
+            client.start_session(number + 1)
+        switches = lambda: sum(
+            int(line.split()[1])
+            for task in os.listdir(f"/proc/{service.process.pid}/task")
+            for line in open(f"/proc/{service.process.pid}/task/{task}/status")
+            if line.startswith("voluntary"))
+        settled = lambda: (switches(), eventually(lambda: True, ""), wait_a_while(), switches())
+        eventually(lambda: (lambda s: s[0] == s[3])(settled()), "two seconds without a wake-up")
+
+    def test_the_same_in_another_language_and_from_a_script(self):
+        service = self.service()
+        example = subprocess.run(
+            ["/usr/bin/python3", PREFIX / "share/doc/quarvel/examples/client.py", service.socket],
+            capture_output=True, text=True, timeout=PATIENCE)
+        self.assertEqual(example.returncode, 0, example.stderr)
+        script = "\n".join(json.dumps(line) for line in (
+            {"call": "createReportingSession:reply:", "args": [9]},
+            {"expect": True},
+            {"call": "startReportingSessionForID:reply:", "args": [9], "wait": False},
+            {"call": "sendMessage:withCategory:andType:forReportingIDs:reply:", "args": [{"a": 1}, 3, 1, [9]]},
+            {"call": "stopReportingSessionForID:reply:", "args": [9]},
+            {"call": "reporterID:valid:", "args": [9]},
+            {"expect": {"reporterID": 9, "serviceType": 65535}}))
+        played = service.ctl("run", "-", input=script)
+        self.assertEqual(played.returncode, 0, played.stderr)
+        self.assertEqual([json.loads(line)["call"] for line in played.stdout.splitlines()],
+                         ["createReportingSession:reply:",
+                          "sendMessage:withCategory:andType:forReportingIDs:reply:",
+                          "startReportingSessionForID:reply:", "stopReportingSessionForID:reply:",
+                          "reporterID:valid:"])
+        self.assertEqual(service.count("message WHERE session_id = 9"), 2)
+        wrong = service.ctl("run", "-", input=script.replace("65535", "7"))
+        self.assertEqual(wrong.returncode, 1)
+
+
+class Hostility(ServiceTest):
+    MALFORMED = {
+        "no MessagePack": b"\xc1",
+        "no call": b"\x01",
+        "a response": b"\x94\x01\x01\xc0\xc0",
+        "a list longer than a message may be": b"\xdd\xff\xff\xff\xff",
+        "a string longer than a message may be": b"\x94\x00\x01\xdb\x7f\xff\xff\xff",
+        "nested too deep": b"\x94\x00\x01\xa1x" + b"\x91" * 100,
+    }
+    SEND = "sendMessage:withCategory:andType:forReportingIDs:reply:"
+    WRONG = [
+        (1, ("sendTelegram:", 1)),
+        (2, ("createReportingSession:reply:",)),
+        (2, ("createReportingSession:reply:", "seven")),
+        (2, ("createReportingSession:reply:", 2**63)),
+        (2, ("setServiceType:reportingSession:reply:", 65536, 1)),
+        (2, ("setServiceType:reportingSession:reply:", -1, 1)),
+        (2, (SEND, {1.5: 1}, 3, 1, None)),
+        (2, (SEND, [], 3, 1, None)),
+        (2, (SEND, {}, 3, 1, [1, "two"])),
+        (2, (SEND, {"k": b"bytes", "n": {b"bytes": 1}}, 3, 1, None)),
+    ]
+
+    def test_what_is_malformed_ends_its_own_connection_only(self):
+        service = self.service("[limits]\nframe_seconds = 1\n")
+        polite = self.client(service)
+        started = polite.start_session(1)
+        for name, data in {**self.MALFORMED, "a frame that never ends": b"\x94\x00"}.items():
+            with self.subTest(name):
+                hostile = self.client(service)
+                hostile.start_session(2)
+                hostile.write(data)
+                hostile.until_end()
+                polite.message({"after": name}, [1])
+        for code, call in self.WRONG:
+            with self.subTest(call=call), self.assertRaises(CallError) as wrong:
+                polite.call(*call)
+            self.assertEqual((wrong.exception.domain, wrong.exception.code), ("quarvel.connection", code))
+            self.assertTrue(wrong.exception.reason)
+        eventually(lambda: polite.call("getAllReporters:") == [1], "the sessions of those that went are gone")
+        self.assertNotIn(started, polite.replies)
+        polite.stop_session(1)
+        polite.wait(started)
+        self.assertEqual(service.wait_for_rows(8, "message WHERE session_id = 1")[0]["payload"],
+                         '{"after":"no MessagePack"}')
+
+
+class Ends(ServiceTest):
+    def test_an_orderly_end_loses_nothing(self):
+        service = self.service()
+        client = self.client(service)
+        client.call("createReportingSession:reply:", 4)
+        client.call("setServiceType:reportingSession:reply:", 4, 4)
+        for number in range(50):
+            client.message({"alarm": number}, [4])
+        client.start_session(6)
+        client.message({"in": "session"}, [6])
+        self.assertEqual(service.end(), 0)
+        self.assertEqual(service.count("message WHERE service_name = 'alarms'"), 50,
+                         "what waited for its delay is sent before the end")
+        self.assertEqual(service.count("message WHERE session_id = 6"), 2, "and the session's summary")
+        self.assertEqual(service.count("agent_session WHERE flushed_at IS NOT NULL"), 1)
+        self.assertFalse(service.socket.exists())
+
+    def test_a_kill_keeps_what_was_accepted(self):
+        service = self.service()
+        client = self.client(service)
+        client.start_session(1)
+        for number in range(100):
+            client.message({"n": number}, [1])
+        killed = service.ctl("kill")
+        self.assertEqual(killed.returncode, 0, killed.stderr)
+        self.assertEqual(service.process.wait(PATIENCE), 2)
+        self.assertIn("DESTROYING SERVICE", service.log())
+        rows = service.count("message")
+        service.start()
+        self.assertEqual(service.count("message"), rows, "what was committed stays")
+
+    def test_what_cannot_start_says_why(self):
+        def refuse(service, *words):
+            ended = subprocess.run([PREFIX / "sbin/quarveld"], env=service.environment,
+                                   capture_output=True, text=True, timeout=PATIENCE)
+            self.assertEqual(ended.returncode, 1, ended.stderr)
+            errors = [line for line in ended.stderr.splitlines() if " error " in line or "quarveld:" in line]
+            self.assertEqual(len(errors), 1, ended.stderr)
+            for word in words:
+                self.assertIn(word, errors[0])
+
+        running = self.service()
+        second = Service()
+        second.environment["QUARVEL_SOCKET"] = str(running.socket)
+        refuse(second, str(running.socket))
+        self.client(running).call("getAllReporters:")
+
+        later = Service()
+        with later:
+            pass
+        path = self.enterTemporary()
+        newer = Service(directory=path)
+        with newer:
+            pass
+        subprocess.run([sys.executable, "-c",
+                        f"import sqlite3; sqlite3.connect('{path}/state/telemetry.db').execute('PRAGMA user_version = 99')"],
+                       check=True)
+        refuse(newer, "telemetry.db", "99")
+
+        wrong = Service('[limits]\ndepth = "deep"\n')
+        refuse(wrong, "quarvel.toml", "depth")
+
+        unwritable = Service()
+        (unwritable.directory / "file").write_text("")
+        unwritable.environment["STATE_DIRECTORY"] = str(unwritable.directory / "file/state")
+        refuse(unwritable, "file/state")
+
+    def enterTemporary(self):
+        import tempfile
+        directory = tempfile.TemporaryDirectory(prefix="quarvel-test-")
+        self.addCleanup(directory.cleanup)
+        return directory.name
+
+
+def seconds_between(earlier, later):
+    """Of two times of day, "14:25:01.123456"."""
+    def seconds(text):
+        hours, minutes, rest = text.split(":")
+        return int(hours) * 3600 + int(minutes) * 60 + float(rest)
+    return (seconds(later) - seconds(earlier)) % 86400
+
+
+def wait_a_while():
+    import time
+    time.sleep(2)
+
+
+if __name__ == "__main__":
+    unittest.main(verbosity=2)

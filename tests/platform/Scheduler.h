@@ -1,0 +1,135 @@
+#pragma once
+
+#include <atomic>
+#include <chrono>
+#include <cstdint>
+#include <deque>
+#include <map>
+#include <memory>
+#include <optional>
+#include <random>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "base/Block.h"
+#include "base/Date.h"
+#include "base/Mutex.h"
+
+namespace quarvel {
+
+/// Thrown in a simulated thread whose life is over: the process exited, or the simulation ends.
+struct ThreadEnded {};
+
+/// Runs simulated threads one at a time in virtual time. Each lives on a thread of its own from a
+/// pool, and exactly one of them, or the test, holds the baton; whoever has to wait hands it to
+/// another that is ready, chosen by the seed. Time moves only when nobody is ready, and then
+/// straight to the next deadline.
+///
+/// Ownership: everything but the baton itself belongs to whoever holds the baton.
+class Scheduler {
+ public:
+  using Duration = std::chrono::microseconds;
+
+  /// A queue of blocks. Outlives its handle for as long as it has blocks to run.
+  struct Queue {
+    Queue(std::string label, bool isSerial) : name(std::move(label)), serial(isSerial) {}
+    std::string name;
+    bool serial;
+    bool busy = false;         // serial: a block is ready or running
+    std::deque<Block> blocks;  // serial: those behind it
+  };
+
+  explicit Scheduler(std::uint64_t seed);
+  /// Ends every simulated thread where it waits, and destroys the blocks that have not run.
+  ~Scheduler();
+  Scheduler(const Scheduler&) = delete;
+  Scheduler& operator=(const Scheduler&) = delete;
+
+  // For the test, outside simulated threads.
+
+  /// Runs until nothing is ready and nobody waits for a time. Somebody who waits for a signal then
+  /// waits for ever: that is a failure, and so is a simulation without an end.
+  void run();
+  /// Runs for that long and leaves the clock there, however early nothing was left to do. Waiting
+  /// for a signal at its end is no failure.
+  void runFor(Duration duration);
+  void runUntil(Duration elapsed);
+  /// What ran, in order: the name of the thread or queue at every choice. For comparing runs.
+  [[nodiscard]] const std::vector<std::string>& choices() const { return choices_; }
+
+  // From anywhere.
+
+  /// Virtual time since the simulation began.
+  [[nodiscard]] Duration elapsed() const { return elapsed_; }
+  [[nodiscard]] Date wallClock() const { return Date{} + elapsed_ + wallOffset_; }
+  void setWallClock(Date date) { wallOffset_ = date - Date{} - elapsed_; }
+  /// A number below `bound`, by the seed.
+  [[nodiscard]] std::uint64_t choose(std::uint64_t bound) { return random_() % bound; }
+
+  /// Starts a simulated thread.
+  void spawn(std::string name, Block body);
+  [[nodiscard]] std::shared_ptr<Queue> makeQueue(std::string name, bool serial);
+  void enqueue(const std::shared_ptr<Queue>& queue, Block block);
+  /// Runs `action` once nobody is ready and the time has come. It must not wait.
+  void after(Duration delay, Block action);
+  [[nodiscard]] bool isCurrent(const Queue& queue) const;
+  /// A point where another thread may go on instead of this one. Never while a `Mutex` is held.
+  void mayYield();
+  /// No simulated thread runs any more: the process has exited or the simulation is ending.
+  [[nodiscard]] bool stopped() const { return stopped_; }
+  /// Stops everything, as the end of the process does.
+  void stop() { stopped_ = true; }
+
+  // For what simulated threads wait on.
+
+  class Thread;
+  /// The running simulated thread; null in the test.
+  [[nodiscard]] Thread* current() const;
+  /// Gives the baton up until `wake`, or until the wall clock reads `deadline`; false for the
+  /// latter. `reason` says what for, to whom it waits in vain. In a simulated thread only.
+  bool park(const char* reason, std::optional<Date> deadline = std::nullopt);
+  /// Makes a parked thread ready; does nothing to one that is not parked.
+  void wake(Thread& thread);
+  [[nodiscard]] static bool isParked(const Thread& thread);
+  void sleep(Duration duration);
+
+ private:
+  // What can run next: a thread that goes on, or a block that begins (on a queue or its own).
+  struct Ready {
+    Thread* thread = nullptr;
+    std::string name;
+    std::shared_ptr<Queue> queue;
+    Block block;
+  };
+
+  Thread& next(Thread* idle);
+  bool advanceTime();
+  void wakeOverdue();
+  void runJob(Thread& thread);
+  void live(Thread& thread);
+  void handOver(Thread& to) QUARVEL_EXCLUDES(baton_);
+  void awaitTurn(Thread& thread) QUARVEL_EXCLUDES(baton_);
+  void runFromTest(std::optional<Duration> until);
+  [[nodiscard]] std::string waiting() const;
+
+  const std::uint64_t seed_;  // constant after construction
+  std::mt19937_64 random_;
+  Duration elapsed_{0};
+  Duration wallOffset_;
+  std::optional<Duration> until_;  // of the current run
+  bool stopped_ = false;
+  bool endless_ = false;
+  std::vector<Ready> ready_;
+  std::multimap<Duration, Block> timers_;
+  std::vector<std::unique_ptr<Thread>> threads_;
+  std::vector<Thread*> idle_;
+  std::unique_ptr<Thread> test_;
+  std::vector<std::weak_ptr<Queue>> queues_;
+  std::vector<std::string> choices_;
+
+  Mutex baton_;
+  std::atomic<std::uint64_t> handOvers_{0};
+};
+
+}  // namespace quarvel

@@ -1,0 +1,80 @@
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "base/Error.h"
+#include "base/Value.h"
+#include "platform/ServiceListener.h"
+#include "tests/platform/Scheduler.h"
+
+namespace quarvel {
+
+class SimulatedConnection;
+
+/// One call of a client and everything that was answered to it, later answers too.
+struct RecordedCall {
+  std::string method;
+  std::vector<Value> results;
+  std::vector<Error> errors;
+  /// When each answer came.
+  std::vector<Scheduler::Duration> answeredAt;
+  /// Why the call did not reach the exported object.
+  std::optional<std::string> fault;
+};
+
+/// A process that calls the service: the far end of a connection. Its calls are made on the
+/// connection's own simulated thread, in order, once the connection serves. Copies are the same
+/// client; dropping one does not disconnect.
+class SimulatedClient {
+ public:
+  using Call = std::shared_ptr<const RecordedCall>;
+
+  explicit SimulatedClient(const std::shared_ptr<SimulatedConnection>& connection);
+
+  /// Sends `arguments`, as MessagePack, to the exported operation `method`.
+  Call call(std::string method, const List& arguments);
+  /// Breaks the protocol: interruption, then invalidation.
+  void interrupt();
+  /// Goes away: invalidation alone.
+  void disconnect();
+
+  /// How log lines print the connection.
+  [[nodiscard]] const std::string& description() const { return description_; }
+  // For asserting that nobody keeps them alive.
+  [[nodiscard]] std::weak_ptr<ClientConnection> connection() const;
+  [[nodiscard]] std::weak_ptr<ExportedObject> exportedObject() const { return *exportedObject_; }
+
+ private:
+  std::weak_ptr<SimulatedConnection> connection_;
+  std::shared_ptr<const std::weak_ptr<ExportedObject>> exportedObject_;
+  std::string description_;
+};
+
+/// The process's listener.
+class SimulatedListener final : public ServiceListener {
+ public:
+  /// A process connects. The delegate is asked on a platform thread, in the next run.
+  SimulatedClient connect(std::int32_t processIdentifier);
+  [[nodiscard]] bool resumed() const { return resumed_; }
+
+  void setDelegate(std::shared_ptr<ServiceListenerDelegate> delegate) override;
+  /// Returns at once, since the test has the main thread.
+  void resume() override;
+
+  /// For connections: the facility lets go of one.
+  void drop(const SimulatedConnection& connection);
+  /// For the end of the simulation: lets go of everything.
+  void release();
+
+ private:
+  std::shared_ptr<ServiceListenerDelegate> delegate_;
+  std::shared_ptr<Scheduler::Queue> queue_;
+  std::vector<std::shared_ptr<SimulatedConnection>> connections_;
+  bool resumed_ = false;
+};
+
+}  // namespace quarvel

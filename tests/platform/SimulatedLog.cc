@@ -1,0 +1,76 @@
+#include "tests/platform/SimulatedLog.h"
+
+#include <algorithm>
+#include <memory>
+
+#include "tests/platform/Simulation.h"
+
+namespace quarvel {
+
+namespace {
+
+std::vector<const LogScope*>& Scopes() {
+  static std::vector<const LogScope*> scopes;
+  return scopes;
+}
+
+const char* LevelName(LogLevel level) {
+  switch (level) {
+    case LogLevel::error:
+      return "error";
+    case LogLevel::standard:
+      return "default";
+    case LogLevel::info:
+      return "info";
+    case LogLevel::debug:
+      return "debug";
+  }
+  return "";
+}
+
+}  // namespace
+
+const std::vector<const LogScope*>& RegisteredLogScopes() {
+  return Scopes();
+}
+
+std::string LogLine::text() const {
+  return fmt::format("{} {} {}: {}", LevelName(level), scope, function, message);
+}
+
+std::vector<std::string> SimulatedLog::texts(std::string_view prefix) const {
+  std::vector<std::string> texts;
+  for (const LogLine& line : lines) {
+    if (std::string text = line.text(); text.starts_with(prefix)) texts.push_back(std::move(text));
+  }
+  return texts;
+}
+
+LogHandle ZQLogRegister(std::uint32_t code, std::string_view scope, std::string_view subsystem,
+                        std::string_view verboseKey, int options, int levelMask) {
+  const auto known = std::ranges::find(Scopes(), code, &LogScope::code);
+  if (known != Scopes().end()) return *known;
+  static std::vector<std::unique_ptr<LogScope>> owned;
+  return Scopes().emplace_back(
+      owned
+          .emplace_back(new LogScope{code, std::string(scope), std::string(subsystem),
+                                     std::string(verboseKey), options, levelMask})
+          .get());
+}
+
+bool ZQLogEnabled(LogLevel level, LogHandle scope) {
+  if (level != LogLevel::debug) return true;
+  return scope != nullptr && Simulation::current().log.verbose.contains(scope->name);
+}
+
+void ZQLogWrite(LogHandle scope, LogLevel level, const char* file, int line, const char* function,
+                std::string_view message) {
+  Simulation& simulation = Simulation::current();
+  if (simulation.scheduler.stopped()) return;
+  EXPECT_TRUE(ZQLogEnabled(level, scope)) << "written without asking: " << message;
+  simulation.log.lines.push_back({level, scope == nullptr ? "[default]" : scope->name, file, line,
+                                  function, std::string(message)});
+  simulation.note("log " + simulation.log.lines.back().text());
+}
+
+}  // namespace quarvel

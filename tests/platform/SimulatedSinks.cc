@@ -1,0 +1,25 @@
+#include "tests/platform/SimulatedSinks.h"
+
+#include <fmt/format.h>
+
+#include "platform/Ohmrik.h"
+#include "platform/Vistrel.h"
+#include "tests/platform/Simulation.h"
+
+namespace quarvel {
+
+void VistrelSendEventLazy(std::string_view name, const std::function<Payload()>& payload) {
+  Simulation& simulation = Simulation::current();
+  simulation.note(fmt::format("vistrel {}", name));
+  if (!simulation.vistrel.wanted) return;
+  simulation.vistrel.events.push_back({std::string(name), payload(), simulation.elapsed()});
+}
+
+void OhmrikLogRegisteredEvent(std::int32_t domain, std::string_view name, const Payload& record,
+                              std::nullptr_t) {
+  Simulation& simulation = Simulation::current();
+  simulation.note(fmt::format("ohmrik {}", name));
+  simulation.ohmrik.records.push_back({domain, std::string(name), record, simulation.elapsed()});
+}
+
+}  // namespace quarvel

@@ -1,0 +1,75 @@
+#include "tests/platform/SimulatedSystem.h"
+
+#include <fmt/format.h>
+
+#include "platform/DeviceProperties.h"
+#include "platform/Process.h"
+#include "platform/Random.h"
+#include "platform/Trace.h"
+#include "tests/platform/Simulation.h"
+
+namespace quarvel {
+
+std::uint32_t SimulatedRandom::below(std::uint32_t bound) {
+  bounds.push_back(bound);
+  const std::uint32_t drawn = always ? *always : static_cast<std::uint32_t>(random_() % bound);
+  EXPECT_LT(drawn, bound);
+  return drawn;
+}
+
+std::uint32_t RandomBelow(std::uint32_t bound) {
+  return Simulation::current().random.below(bound);
+}
+
+void EmitKernelTrace(std::uint32_t code, std::uint64_t first, std::uint64_t second,
+                     std::uint64_t third, std::uint64_t fourth) {
+  Simulation& simulation = Simulation::current();
+  simulation.trace.push_back({code, {first, second, third, fourth}});
+  simulation.note(fmt::format("trace {:#x}", code));
+}
+
+std::int32_t OwnProcessIdentifier() {
+  return Simulation::current().process.ownIdentifier;
+}
+
+std::string OwnProcessName() {
+  return Simulation::current().process.ownName;
+}
+
+std::optional<std::string> ProcessCommandName(std::int32_t processIdentifier) {
+  EXPECT_GE(processIdentifier, 1);
+  const auto& table = Simulation::current().process.table;
+  const auto found = table.find(processIdentifier);
+  return found == table.end() ? std::nullopt : std::optional(found->second);
+}
+
+void ExitProcess(int status) {
+  Simulation& simulation = Simulation::current();
+  simulation.note(fmt::format("exit {}", status));
+  simulation.process.exitStatus = status;
+  simulation.scheduler.stop();
+  throw ThreadEnded{};
+}
+
+namespace {
+
+template <class T>
+std::optional<T> DeviceProperty(std::string_view name) {
+  const auto& properties = Simulation::current().deviceProperties;
+  const auto found = properties.find(name);
+  if (found == properties.end()) return std::nullopt;
+  const T* value = std::get_if<T>(&found->second);
+  return value == nullptr ? std::nullopt : std::optional(*value);
+}
+
+}  // namespace
+
+std::optional<bool> DevicePropertyBoolean(std::string_view name) {
+  return DeviceProperty<bool>(name);
+}
+
+std::optional<std::int64_t> DevicePropertyInteger(std::string_view name) {
+  return DeviceProperty<std::int64_t>(name);
+}
+
+}  // namespace quarvel

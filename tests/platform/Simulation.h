@@ -1,0 +1,90 @@
+#pragma once
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <cstdint>
+#include <map>
+#include <string>
+#include <string_view>
+#include <variant>
+#include <vector>
+
+#include "platform/WorkQueue.h"
+#include "tests/platform/Printers.h"
+#include "tests/platform/Scheduler.h"
+#include "tests/platform/Seeds.h"
+#include "tests/platform/SimulatedAgent.h"
+#include "tests/platform/SimulatedListener.h"
+#include "tests/platform/SimulatedLog.h"
+#include "tests/platform/SimulatedSinks.h"
+#include "tests/platform/SimulatedSystem.h"
+
+namespace quarvel {
+
+using namespace std::chrono_literals;  // NOLINT(google-build-using-namespace): durations in tests
+
+/// Everything that reached the platform, of whatever kind, a line each in the order it came. For
+/// asserting an order across kinds; each kind's own recorder has the details.
+class Journal {
+ public:
+  /// The lines that begin with one of `prefixes`.
+  [[nodiscard]] std::vector<std::string> lines(std::initializer_list<std::string_view> prefixes = {
+                                                   ""}) const;
+  void clear() { lines_.clear(); }
+  void note(std::string line) { lines_.push_back(std::move(line)); }
+
+ private:
+  std::vector<std::string> lines_;
+};
+
+/// The simulated platform, one a test: stands behind every header of `platform/` from its
+/// construction to its destruction. What is declared after it in a test is destroyed before it.
+///
+/// The test arranges (switches, connections, threads), runs, and asserts on what was recorded;
+/// nothing happens between two runs. Every failure names the seed.
+class Simulation {
+ public:
+  struct CreatedQueue {
+    std::string label;
+    QualityOfService qualityOfService;
+  };
+
+  explicit Simulation(std::uint64_t seed);
+  ~Simulation();
+  Simulation(const Simulation&) = delete;
+  Simulation& operator=(const Simulation&) = delete;
+
+  [[nodiscard]] static Simulation& current();
+
+  void run() { scheduler.run(); }
+  void runFor(Scheduler::Duration duration) { scheduler.runFor(duration); }
+  void spawn(std::string name, Block body) { scheduler.spawn(std::move(name), std::move(body)); }
+  [[nodiscard]] Scheduler::Duration elapsed() const { return scheduler.elapsed(); }
+
+  /// For recorders: notes a line unless the process is over.
+  void note(std::string line) {
+    if (!scheduler.stopped()) journal.note(std::move(line));
+  }
+
+  /// Switch: waits in a `Condition` may end without a signal, at a moment chosen by the seed.
+  bool spuriousWakeUps = false;
+  std::vector<CreatedQueue> queues;
+  std::map<std::string, std::variant<bool, std::int64_t>, std::less<>> deviceProperties;
+
+  Journal journal;
+  SimulatedLog log;
+  std::vector<TraceEvent> trace;
+  SimulatedRandom random;
+  SimulatedProcess process;
+  SimulatedVistrel vistrel;
+  SimulatedOhmrik ohmrik;
+  SimulatedAgent agent;
+  SimulatedListener listener;
+  Scheduler scheduler;
+
+ private:
+  const testing::ScopedTrace seedTrace_;
+};
+
+}  // namespace quarvel

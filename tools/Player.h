@@ -1,0 +1,48 @@
+#pragma once
+
+#include <cstddef>
+#include <memory>
+#include <optional>
+#include <set>
+#include <string>
+
+#include <quarvel/client.hpp>
+
+#include "base/Mutex.h"
+#include "tools/Script.h"
+
+namespace quarvel {
+
+/// Plays a script on one connection and prints each reply as a JSON line when it arrives. The
+/// functions are for one thread; replies come on the client's.
+class Player {
+ public:
+  explicit Player(Client client);
+
+  /// Errors: an expectation that is not met, a connection that is lost.
+  [[nodiscard]] Outcome play(const script::Step& step);
+  /// Waits for the replies that are still to come: every call's, and the start's of each session
+  /// that the script has stopped, for at most ten seconds after its last line.
+  [[nodiscard]] Outcome finish();
+
+ private:
+  /// What the replies tell the script; shared with the callbacks.
+  struct Replies {
+    Mutex mutex;
+    ConditionVariable changed;
+    std::size_t outstanding QUARVEL_GUARDED_BY(mutex) = 0;  // without starts
+    std::multiset<std::int64_t> starts QUARVEL_GUARDED_BY(mutex);
+    std::optional<Value> last QUARVEL_GUARDED_BY(mutex);
+  };
+
+  [[nodiscard]] Outcome playCall(const script::Call& call);
+  [[nodiscard]] Outcome playExpect(const script::Expect& expect);
+  [[nodiscard]] Outcome checkConnection() const;
+
+  const std::shared_ptr<Replies> replies_ = std::make_shared<Replies>();
+  std::set<std::int64_t> stopped_;  // sessions whose start is due to be answered
+  bool killed_ = false;
+  Client client_;
+};
+
+}  // namespace quarvel

@@ -1,0 +1,200 @@
+#include "tools/Store.h"
+
+#include <fmt/format.h>
+#include <poll.h>
+#include <sqlite3.h>
+#include <sys/inotify.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <utility>
+#include <vector>
+
+namespace quarvel {
+namespace {
+
+constexpr std::int64_t kApplication = 0x51525654;
+constexpr std::int64_t kVersion = 1;
+constexpr int kBusyMilliseconds = 5'000;
+
+Error Failed(std::string reason) {
+  return Error::because("quarvel.store", 1, std::move(reason));
+}
+
+std::string FilePath(std::string path) {
+  if (std::error_code error; std::filesystem::is_directory(path, error)) path += "/telemetry.db";
+  return path;
+}
+
+/// A prepared statement, row by row.
+class Statement {
+ public:
+  Statement(sqlite3* database, std::string_view sql) : database_(database) {
+    status_ = sqlite3_prepare_v2(database, sql.data(), static_cast<int>(sql.size()), &statement_,
+                                 nullptr);
+  }
+  ~Statement() { sqlite3_finalize(statement_); }
+  Statement(const Statement&) = delete;
+  Statement& operator=(const Statement&) = delete;
+
+  void bind(int index, std::int64_t number) { sqlite3_bind_int64(statement_, index, number); }
+  [[nodiscard]] bool next() {
+    if (status_ == SQLITE_OK || status_ == SQLITE_ROW) status_ = sqlite3_step(statement_);
+    return status_ == SQLITE_ROW;
+  }
+  /// When there are no more rows: whether that was the end.
+  [[nodiscard]] Outcome outcome() const {
+    if (status_ == SQLITE_DONE) return Success();
+    return Failed(fmt::format("The store {} cannot be read: {}.",
+                              sqlite3_db_filename(database_, "main"), sqlite3_errmsg(database_)));
+  }
+
+  [[nodiscard]] bool isNull(int column) const {
+    return sqlite3_column_type(statement_, column) == SQLITE_NULL;
+  }
+  [[nodiscard]] std::int64_t integer(int column) const {
+    return sqlite3_column_int64(statement_, column);
+  }
+  [[nodiscard]] Date date(int column) const {
+    return Date(std::chrono::microseconds(integer(column)));
+  }
+  [[nodiscard]] std::string text(int column) const {
+    const unsigned char* text = sqlite3_column_text(statement_, column);
+    if (text == nullptr) return {};
+    return {reinterpret_cast<const char*>(text),
+            static_cast<std::size_t>(sqlite3_column_bytes(statement_, column))};
+  }
+
+ private:
+  sqlite3* database_;
+  sqlite3_stmt* statement_ = nullptr;
+  int status_;
+};
+
+Result<std::int64_t> Number(sqlite3* database, std::string_view sql) {
+  Statement statement(database, sql);
+  if (statement.next()) return statement.integer(0);
+  return statement.outcome().error();
+}
+
+}  // namespace
+
+std::string StoreReader::defaultPath() {
+  const auto environment = [](const char* name) {
+    const char* value = std::getenv(name);
+    return std::string(value == nullptr ? "" : value);
+  };
+  std::vector<std::string> candidates;
+  if (const std::string own = environment("STATE_DIRECTORY"); !own.empty()) {
+    candidates.push_back(own.substr(0, own.find(':')));
+  }
+  if (::geteuid() != 0) {
+    const std::string user = environment("XDG_STATE_HOME");
+    candidates.push_back((user.empty() ? environment("HOME") + "/.local/state" : user) +
+                         "/quarvel");
+  }
+  candidates.emplace_back("/var/lib/quarvel");
+  for (std::string& directory : candidates) {
+    directory += "/telemetry.db";
+    if (::access(directory.c_str(), F_OK) == 0) return directory;
+  }
+  return candidates.front();
+}
+
+void StoreReader::Close::operator()(sqlite3* database) const {
+  sqlite3_close(database);
+}
+
+StoreReader::StoreReader(std::unique_ptr<sqlite3, Close> database)
+    : database_(std::move(database)) {}
+
+Result<StoreReader> StoreReader::open(std::string path) {
+  path = FilePath(std::move(path));
+  if (::access(path.c_str(), F_OK) != 0) {
+    return Failed(
+        fmt::format("There is no store {}. The service makes it when it first starts; if it keeps "
+                    "it elsewhere, name it with --store.",
+                    path));
+  }
+  sqlite3* opened = nullptr;
+  const int status = sqlite3_open_v2(path.c_str(), &opened, SQLITE_OPEN_READONLY, nullptr);
+  StoreReader reader(std::unique_ptr<sqlite3, Close>{opened});
+  if (status != SQLITE_OK) {
+    return Failed(
+        fmt::format("The store {} cannot be opened: {}. It belongs to the service's user "
+                    "and group; join that group, or read it as root.",
+                    path, sqlite3_errmsg(opened)));
+  }
+  sqlite3_busy_timeout(opened, kBusyMilliseconds);
+  const auto application = Number(opened, "PRAGMA application_id");
+  if (!application) return application.error();
+  const auto version = Number(opened, "PRAGMA user_version");
+  if (!version) return version.error();
+  if (application.value() != kApplication) {
+    return Failed(fmt::format("{} is not a telemetry store.", path));
+  }
+  if (version.value() > kVersion) {
+    return Failed(
+        fmt::format("The store {} is of version {}, and this tool reads up to {}: use the "
+                    "quarvelctl that came with the service.",
+                    path, version.value(), kVersion));
+  }
+  return reader;
+}
+
+Outcome StoreReader::sessions(const std::function<void(StoredSession)>& each) {
+  Statement rows(
+      database_.get(),
+      "SELECT s.id, s.session_id, s.service_name, s.user_info, s.opened_at, s.flushed_at,"
+      " ifnull(m.messages, 0) FROM agent_session s LEFT JOIN"
+      " (SELECT agent_session, count(*) messages FROM message GROUP BY agent_session) m"
+      " ON m.agent_session = s.id ORDER BY s.id");
+  while (rows.next()) {
+    each({rows.integer(0), rows.integer(1), rows.text(2), rows.text(3), rows.date(4),
+          rows.isNull(5) ? std::nullopt : std::optional(rows.date(5)), rows.integer(6)});
+  }
+  return rows.outcome();
+}
+
+Outcome StoreReader::messages(const MessageQuery& query,
+                              const std::function<void(StoredMessage)>& each) {
+  std::string sql =
+      "SELECT id, agent_session, session_id, service_name, category, type, payload, sent_at"
+      " FROM message WHERE id > ?1";
+  if (query.reporterID) sql += " AND session_id = ?2";
+  if (query.last) sql = "SELECT * FROM (" + sql + " ORDER BY id DESC LIMIT ?3)";
+  sql += " ORDER BY id";
+  Statement rows(database_.get(), sql);
+  rows.bind(1, query.afterID);
+  if (query.reporterID) rows.bind(2, *query.reporterID);
+  if (query.last) rows.bind(3, static_cast<std::int64_t>(*query.last));
+  while (rows.next()) {
+    each({rows.integer(0), rows.isNull(1) ? std::nullopt : std::optional(rows.integer(1)),
+          rows.integer(2), rows.text(3), static_cast<std::uint16_t>(rows.integer(4)),
+          static_cast<std::uint16_t>(rows.integer(5)), rows.text(6), rows.date(7)});
+  }
+  return rows.outcome();
+}
+
+StoreWatch::StoreWatch(const std::string& path)
+    : watch_(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK)) {
+  // The directory, since the write-ahead log beside the store comes and goes.
+  const auto directory = std::filesystem::absolute(FilePath(path)).parent_path();
+  if (watch_ >= 0) ::inotify_add_watch(watch_, directory.c_str(), IN_MODIFY | IN_CREATE);
+}
+
+StoreWatch::~StoreWatch() {
+  if (watch_ >= 0) ::close(watch_);
+}
+
+void StoreWatch::wait() {
+  constexpr int kSecond = 1'000;
+  pollfd changed{watch_, POLLIN, 0};
+  ::poll(&changed, 1, kSecond);
+  char events[4'096];
+  while (::read(watch_, events, sizeof events) > 0) {
+  }
+}
+
+}  // namespace quarvel

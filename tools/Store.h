@@ -1,0 +1,91 @@
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "base/Date.h"
+#include "base/Error.h"
+
+struct sqlite3;
+
+namespace quarvel {
+
+/// One agent session in the store.
+struct StoredSession {
+  std::int64_t id;
+  std::int64_t reporterID;
+  std::string serviceName;
+  std::string userInfo;  // JSON
+  Date openedAt;
+  std::optional<Date> flushedAt;  // none: still open, or the service ended before
+  std::int64_t messages;
+};
+
+/// One message in the store.
+struct StoredMessage {
+  std::int64_t id;
+  std::optional<std::int64_t> agentSession;  // none: a single message
+  std::int64_t reporterID;                   // -1 for a single message
+  std::string serviceName;
+  std::uint16_t category;
+  std::uint16_t type;
+  std::string payload;  // JSON
+  Date sentAt;
+};
+
+/// The service's store, opened for reading only; it may be written meanwhile. For one thread.
+/// Errors: domain "quarvel.store", with a reason that says what to do.
+class StoreReader {
+ public:
+  /// Which messages: after `afterID`, of one session, and only the last so many of them.
+  struct MessageQuery {
+    std::int64_t afterID = 0;
+    std::optional<std::int64_t> reporterID;
+    std::optional<std::uint64_t> last;
+  };
+
+  /// telemetry.db in the first directory that has one of `$STATE_DIRECTORY`,
+  /// `$XDG_STATE_HOME/quarvel` or ~/.local/state/quarvel (not for root) and /var/lib/quarvel; when
+  /// none has, where this user's own service would put it.
+  [[nodiscard]] static std::string defaultPath();
+  /// Takes the file, or the directory that holds telemetry.db.
+  [[nodiscard]] static Result<StoreReader> open(std::string path);
+
+  /// In the order in which they were opened.
+  [[nodiscard]] Outcome sessions(const std::function<void(StoredSession)>& each);
+  /// In the order in which they were stored.
+  [[nodiscard]] Outcome messages(const MessageQuery& query,
+                                 const std::function<void(StoredMessage)>& each);
+
+ private:
+  struct Close {
+    void operator()(sqlite3* database) const;
+  };
+  explicit StoreReader(std::unique_ptr<sqlite3, Close> database);
+
+  std::unique_ptr<sqlite3, Close> database_;
+};
+
+/// Wakes when something is written to a store.
+class StoreWatch {
+ public:
+  /// `path` as `StoreReader` takes it.
+  explicit StoreWatch(const std::string& path);
+  ~StoreWatch();
+  StoreWatch(const StoreWatch&) = delete;
+  StoreWatch& operator=(const StoreWatch&) = delete;
+
+  /// Returns soon after a write, and at the latest after a second: rows can be read only a moment
+  /// after the file has changed.
+  void wait();
+
+ private:
+  const int watch_;  // an inotify descriptor, or -1
+};
+
+}  // namespace quarvel

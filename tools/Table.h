@@ -1,0 +1,38 @@
+#pragma once
+
+#include <cstddef>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "tools/Terminal.h"
+
+namespace quarvel {
+
+/// Rows under a heading, printed to standard output in portions: columns are as wide as the widest
+/// cell so far. On a terminal the last column is cut where the line ends.
+class Table {
+ public:
+  struct Column {
+    std::string_view heading;
+    bool toTheRight = false;  // numbers
+  };
+
+  Table(std::vector<Column> columns, const Terminal& terminal);
+
+  /// As many cells as there are columns.
+  void add(std::vector<std::string> row);
+  /// Prints the rows added since the last time, the heading before the first.
+  void print();
+
+ private:
+  void printLine(const std::vector<std::string>& cells, bool heading);
+
+  const std::vector<Column> columns_;
+  const Terminal terminal_;
+  std::vector<std::size_t> widths_;
+  std::vector<std::vector<std::string>> rows_;
+  bool begun_ = false;
+};
+
+}  // namespace quarvel
