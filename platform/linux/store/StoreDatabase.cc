@@ -93,14 +93,17 @@ bool StoreDatabase::readLastIDs() {
 bool StoreDatabase::write(const StoreBatch& batch, std::size_t first, std::size_t last,
                           Safety safety, Date now) {
   now_ = Microseconds(now);
+  bool changesFile = false;
   bool written = begin(safety);
   for (std::size_t i = first; written && i < last; ++i) {
     written =
         std::visit([this, &batch](const auto& row) { return insert(batch, row); }, batch.rows()[i]);
+    changesFile = changesFile || connection_.changes() > 0;
   }
   if (written && commit_.run()) {
     committedIDs_ = lastIDs_;
-    return true;
+    // A commit of nothing, as of the flush of a session whose row is gone, syncs nothing either.
+    return changesFile || safety == Safety::normal || sync();
   }
   connection_.rollBack();
   lastIDs_ = committedIDs_;

@@ -82,8 +82,8 @@ void StoreWriter::write(const StoreBatch& batch) {
     const std::size_t last = std::min(first + kRowsPerCommit, rows);
     StoreQueue::Tally tally;
     for (std::size_t i = first; i < last; ++i) tally.add(batch.rows()[i]);
-    makeRoom(tally);
-    if (!writeRows(batch, first, last)) {
+    if (!gaveUp_) makeRoom(tally);
+    if (gaveUp_ || !writeRows(batch, first, last)) {
       lose(batch, first);
       return;
     }
@@ -147,6 +147,7 @@ void StoreWriter::completeFlushes(const StoreBatch& batch, std::size_t first, st
 }
 
 void StoreWriter::lose(const StoreBatch& batch, std::size_t first) {
+  gaveUp_ = true;
   StoreQueue::Tally tally;
   for (std::size_t i = first; i < batch.rows().size(); ++i) tally.add(batch.rows()[i]);
   queue_.lost(tally);
@@ -206,6 +207,7 @@ void StoreWriter::failed() {
   if (!database_ || database_->fault() != SqliteFault::corrupt) return;
   const std::string reason = database_->message();
   database_.reset();
+  unsyncedSince_.reset();
   if (Outcome aside = SetStoreAside(options_.database.path, options_.clock(), reason); !aside) {
     failure_ = aside.error();
   }

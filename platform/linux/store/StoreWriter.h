@@ -72,6 +72,7 @@ class StoreWriter {
   std::unique_ptr<StoreDatabase> database_;  // null while a new file could not be begun
   Error failure_;                            // of the last attempt
   Minutely failureLine_;
+  bool gaveUp_ = false;  // the store was closed while it took no rows
   std::optional<Instant>
       unsyncedSince_;      // when the oldest row was queued that a power cut would take
   bool retaining_ = true;  // there may be rows to remove
