@@ -11,11 +11,9 @@
 #include "base/Error.h"
 #include "base/Value.h"
 
-namespace quarvel {
-
 /// A script of calls: JSON Lines, an object a line. Empty lines and lines that begin with "#" are
 /// left out.
-namespace script {
+namespace quarvel::script {
 
 /// {"call": "<full keyword name>", "args": […], "wait": true or false}
 struct Call {
@@ -36,16 +34,17 @@ struct Expect {
   Value value;
 };
 
+using Action = std::variant<Call, Sleep, Expect>;
+
 struct Step {
   std::size_t line;  // counted from 1
-  std::variant<Call, Sleep, Expect> action;
+  Action action;
 };
 
-/// Reads one line of a script. Errors: domain "quarvel.script", with a reason.
-[[nodiscard]] Result<std::variant<Call, Sleep, Expect>> Parse(std::string_view line);
+/// Reads one line of a script. Errors: domain "quarvel.script" or "quarvel.json", with a reason.
+[[nodiscard]] Result<Action> Parse(std::string_view line);
 
 /// Whether a line is left out.
 [[nodiscard]] bool IsLeftOut(std::string_view line);
 
-}  // namespace script
-}  // namespace quarvel
+}  // namespace quarvel::script
