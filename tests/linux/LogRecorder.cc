@@ -15,9 +15,12 @@ std::vector<testing::LogRecorder::Line> lines QUARVEL_GUARDED_BY(linesMutex);
 
 }  // namespace
 
-bool ZQLogEnabled(LogLevel, LogHandle) { return true; }
+bool ZQLogEnabled(LogLevel, LogHandle) {
+  return true;
+}
 
-void ZQLogWrite(LogHandle, LogLevel level, const char*, int, const char*, std::string_view message) {
+void ZQLogWrite(LogHandle, LogLevel level, const char*, int, const char*,
+                std::string_view message) {
   MutexLock lock(linesMutex);
   lines.push_back({level, std::string(message)});
   lineAdded.notifyAll();

@@ -29,7 +29,9 @@ std::string Hexadecimal(const RandomBits& bits) {
 
 }  // namespace
 
-std::string NewSecureToken() { return Hexadecimal(NewRandomBits()); }
+std::string NewSecureToken() {
+  return Hexadecimal(NewRandomBits());
+}
 
 std::string NewUuid() {
   RandomBits bits = NewRandomBits();

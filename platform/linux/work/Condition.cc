@@ -28,7 +28,8 @@ Waits& waits() {
   return instance;
 }
 
-// Later ones would overflow when the wait counts in nanoseconds.
+// Beyond these the wait, which counts in nanoseconds, would overflow.
+constexpr Date kEarliestDeadline{};
 constexpr Date kLatestDeadline{std::chrono::sys_days{std::chrono::year{2200} / 1 / 1}};
 
 class LinuxCondition final : public Condition, public std::enable_shared_from_this<LinuxCondition> {
@@ -50,7 +51,7 @@ class LinuxCondition final : public Condition, public std::enable_shared_from_th
     bool woken = false;
     {
       const BlockingScope blocking;
-      woken = changed_.waitUntil(mutex_, std::min(deadline, kLatestDeadline));
+      woken = changed_.waitUntil(mutex_, std::clamp(deadline, kEarliestDeadline, kLatestDeadline));
     }
     const MutexLock lock(waits().mutex);
     place.splice(place.end(), waits().waiting, self);
