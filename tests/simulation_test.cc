@@ -156,7 +156,7 @@ TEST(Scheduler, ADeadlockIsAFailureThatNamesTheSeedAndWhoWaits) {
   Simulation simulation(7);
   const auto condition = CreateCondition();
   const auto queue = CreateSerialQueue("the queue", QualityOfService::utility);
-  queue->async([&]() QUARVEL_NO_THREAD_SAFETY_ANALYSIS {
+  queue->async([condition]() QUARVEL_NO_THREAD_SAFETY_ANALYSIS {
     condition->lock();
     condition->lock();
   });
@@ -171,7 +171,7 @@ TEST(Scheduler, TheEndReleasesWhatWaitsAndWhatNeverRan) {
       Simulation simulation(seed);
       const auto condition = CreateCondition();
       const auto queue = CreateSerialQueue("serial", QualityOfService::utility);
-      queue->async([&condition, held] {
+      queue->async([condition, held] {
         const BasicMutexLock<Condition> lock(*condition);
         (void)condition->waitUntil(CurrentDate() + 9s);
         ADD_FAILURE() << "went on after the end";
