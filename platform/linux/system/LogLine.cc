@@ -7,6 +7,8 @@
 #include <ctime>
 #include <iterator>
 
+#include "base/Mutex.h"
+
 namespace quarvel {
 namespace {
 
@@ -36,9 +38,13 @@ struct LocalSecond {
 const LocalSecond& localSecond(std::time_t second) {
   thread_local LocalSecond local;
   if (local.second == second) return local;
-  tzset();  // the device may have travelled
   std::tm time{};
-  localtime_r(&second, &time);
+  {
+    static Mutex& zone = *new Mutex;
+    const MutexLock lock(zone);
+    tzset();  // the device may have travelled
+    localtime_r(&second, &time);
+  }
   local.second = second;
   std::strftime(local.text, sizeof local.text, "%Y-%m-%dT%H:%M:%S", &time);
   const long minutes = std::abs(time.tm_gmtoff) / 60;
