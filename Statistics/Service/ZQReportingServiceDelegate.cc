@@ -105,6 +105,7 @@ std::shared_ptr<ZQReportingServiceDelegate> ZQReportingServiceDelegate::create()
                               "reporting_server_verbose", 1, 31);
   auto delegate = std::make_shared<ZQReportingServiceDelegate>(Private{});
   delegate->listenForDefaultsNotification();
+  delegate->driverUtility_.emplace();
   return delegate;
 }
 

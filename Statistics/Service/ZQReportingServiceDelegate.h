@@ -150,11 +150,11 @@ class ZQReportingServiceDelegate final
   [[nodiscard]] std::shared_ptr<ZQReportingSession> findReportingSessionForID(
       ReporterID reporterID) override QUARVEL_REQUIRES(serverQueueRole);
   [[nodiscard]] DriverSnapShot getSnapShot() override QUARVEL_REQUIRES(serverQueueRole) {
-    return driverUtility_.getSnapShot();
+    return driverUtility_->getSnapShot();
   }
   [[nodiscard]] std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
       const std::optional<DriverSnapShot>& snapShot) override QUARVEL_REQUIRES(serverQueueRole) {
-    return driverUtility_.getDriverStatisticsRelativeToSnapShot(snapShot);
+    return driverUtility_->getDriverStatisticsRelativeToSnapShot(snapShot);
   }
   void removeClient(const ZQReportingServerInstance& client) override
       QUARVEL_REQUIRES(serverQueueRole);
@@ -172,7 +172,7 @@ class ZQReportingServiceDelegate final
   Clients clients_ QUARVEL_GUARDED_BY(serverQueueRole);
   std::optional<Dictionary> defaults_ QUARVEL_GUARDED_BY(serverQueueRole);
   NotificationToken defaultsToken_ = 0;  // constant once notifications can come
-  ZQReportingDriverUtility driverUtility_;
+  std::optional<ZQReportingDriverUtility> driverUtility_;  // present and constant after `create`
 };
 
 /// The short name of a client's process; none when it cannot be told. From any thread.

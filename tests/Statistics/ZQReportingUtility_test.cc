@@ -98,14 +98,6 @@ TEST(Vocabulary, TheHostApplicationIsWhateverValueThereIs) {
   }
 }
 
-TEST(Vocabulary, TheInternalBuildFlagIsAskedForOnce) {
-  Simulation simulation(1);
-  simulation.deviceProperties["InternalBuild"] = true;
-  EXPECT_TRUE(ZQReportingUtilityIsInternalBuild());
-  simulation.deviceProperties["InternalBuild"] = false;
-  EXPECT_TRUE(ZQReportingUtilityIsInternalBuild());
-}
-
 // A wait of nine seconds, and somebody who touches its condition now and then.
 struct Wait {
   explicit Wait(std::uint64_t seed) : simulation(seed) {

@@ -1,16 +1,20 @@
 #include "tests/platform/Seeds.h"
 
+#include <gtest/gtest.h>
+
 #include <cstdlib>
-#include <numeric>
 
 namespace quarvel {
 
-std::vector<std::uint64_t> Seeds() {
-  if (const char* one = std::getenv("QUARVEL_SEED")) return {std::strtoull(one, nullptr, 10)};
+bool SeedRange::Iterator::operator==(std::default_sentinel_t) const {
+  return left_ == 0 || testing::Test::HasFailure();
+}
+
+SeedRange Seeds() {
+  constexpr std::size_t kByDefault = 20;
+  if (const char* one = std::getenv("QUARVEL_SEED")) return {std::strtoull(one, nullptr, 10), 1};
   const char* count = std::getenv("QUARVEL_SEEDS");
-  std::vector<std::uint64_t> seeds(count != nullptr ? std::strtoul(count, nullptr, 10) : 20);
-  std::iota(seeds.begin(), seeds.end(), 1U);
-  return seeds;
+  return {1, count == nullptr ? kByDefault : std::strtoul(count, nullptr, 10)};
 }
 
 }  // namespace quarvel

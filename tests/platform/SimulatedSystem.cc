@@ -3,6 +3,7 @@
 #include <fmt/format.h>
 
 #include "platform/DeviceProperties.h"
+#include "platform/FileSystem.h"
 #include "platform/Process.h"
 #include "platform/Random.h"
 #include "platform/Trace.h"
@@ -70,6 +71,62 @@ std::optional<bool> DevicePropertyBoolean(std::string_view name) {
 
 std::optional<std::int64_t> DevicePropertyInteger(std::string_view name) {
   return DeviceProperty<std::int64_t>(name);
+}
+
+void SimulatedOrientation::turn(Handlers SimulatedOrientation::*kind, Orientation orientation) {
+  Simulation::current().spawn("orientation", [this, kind, orientation] {
+    const Handlers handlers = this->*kind;
+    for (const auto& [callbackID, handler] : handlers) {
+      if ((this->*kind).contains(callbackID)) handler(orientation);
+    }
+  });
+}
+
+namespace {
+
+SimulatedOrientation& TheOrientation() {
+  return Simulation::current().orientation;
+}
+
+void Remove(SimulatedOrientation::Handlers& handlers, std::string_view callbackID) {
+  const auto found = handlers.find(callbackID);
+  if (found != handlers.end()) handlers.erase(found);
+}
+
+}  // namespace
+
+void RegisterDeviceOrientationHandler(std::string_view callbackID, OrientationHandler handler) {
+  TheOrientation().device.insert_or_assign(std::string(callbackID), std::move(handler));
+}
+
+void UnregisterDeviceOrientationHandler(std::string_view callbackID) {
+  Remove(TheOrientation().device, callbackID);
+}
+
+void RegisterUIOrientationHandler(std::string_view callbackID, OrientationHandler handler) {
+  TheOrientation().ui.insert_or_assign(std::string(callbackID), std::move(handler));
+}
+
+void UnregisterUIOrientationHandler(std::string_view callbackID) {
+  Remove(TheOrientation().ui, callbackID);
+}
+
+std::string DiagnosticsPath(std::string_view path) {
+  return Simulation::current().files.diagnosticsPrefix + std::string(path);
+}
+
+Outcome CreateDirectory(std::string_view path, std::uint32_t permissions) {
+  SimulatedFiles& files = Simulation::current().files;
+  if (files.directoryError) return *files.directoryError;
+  files.directories.emplace(path, permissions);
+  return Success();
+}
+
+Outcome WriteFileAtomically(std::string_view path, std::string_view content) {
+  SimulatedFiles& files = Simulation::current().files;
+  if (files.writeError) return *files.writeError;
+  files.files.insert_or_assign(std::string(path), content);
+  return Success();
 }
 
 }  // namespace quarvel

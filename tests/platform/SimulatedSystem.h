@@ -8,6 +8,9 @@
 #include <string>
 #include <vector>
 
+#include "base/Error.h"
+#include "platform/Orientation.h"
+
 namespace quarvel {
 
 struct TraceEvent {
@@ -38,6 +41,32 @@ struct SimulatedProcess {
   std::map<std::int32_t, std::string> table;
   /// With what status the process has exited. Nothing runs or is recorded after that.
   std::optional<int> exitStatus;
+};
+
+/// The orientation facility. Changes are told on a platform thread; handlers must not wait there.
+class SimulatedOrientation {
+ public:
+  using Handlers = std::map<std::string, OrientationHandler, std::less<>>;
+  Handlers device;
+  Handlers ui;
+
+  void turnDevice(Orientation orientation) { turn(&SimulatedOrientation::device, orientation); }
+  void turnUI(Orientation orientation) { turn(&SimulatedOrientation::ui, orientation); }
+
+ private:
+  void turn(Handlers SimulatedOrientation::*kind, Orientation orientation);
+};
+
+struct SimulatedFiles {
+  /// Path to content.
+  std::map<std::string, std::string, std::less<>> files;
+  /// Path to permissions.
+  std::map<std::string, std::uint32_t, std::less<>> directories;
+
+  // Switches.
+  std::string diagnosticsPrefix;
+  std::optional<Error> directoryError;
+  std::optional<Error> writeError;
 };
 
 }  // namespace quarvel

@@ -1,6 +1,9 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <ctime>
+#include <iomanip>
+#include <sstream>
 #include <vector>
 
 #include "platform/Clock.h"
@@ -125,6 +128,18 @@ std::shared_ptr<Condition> CreateCondition() {
 
 Date CurrentDate() {
   return TheScheduler().wallClock();
+}
+
+std::string LocalDateText(Date date, const char* pattern) {
+  const std::chrono::seconds offset = Simulation::current().localOffset;
+  const auto local = std::chrono::floor<std::chrono::seconds>(date + offset);
+  const std::time_t seconds = local.time_since_epoch().count();
+  std::tm calendar{};
+  gmtime_r(&seconds, &calendar);
+  calendar.tm_gmtoff = offset.count();
+  std::ostringstream text;
+  text << std::put_time(&calendar, pattern);
+  return text.str();
 }
 
 }  // namespace quarvel

@@ -29,7 +29,10 @@ Simulation::Simulation(std::uint64_t seed)
 
 Simulation::~Simulation() {
   scheduler.stop();
+  // Whatever these hold may still use the rest of the platform as it goes.
   listener.release();
+  notifications.release();
+  orientation = {};
 }
 
 Simulation& Simulation::current() {

@@ -17,8 +17,10 @@
 #include "tests/platform/SimulatedAgent.h"
 #include "tests/platform/SimulatedListener.h"
 #include "tests/platform/SimulatedLog.h"
+#include "tests/platform/SimulatedSettings.h"
 #include "tests/platform/SimulatedSinks.h"
 #include "tests/platform/SimulatedSystem.h"
+#include "tests/platform/SimulatedTallix.h"
 
 namespace quarvel {
 
@@ -39,7 +41,8 @@ class Journal {
 };
 
 /// The simulated platform, one a test: stands behind every header of `platform/` from its
-/// construction to its destruction. What is declared after it in a test is destroyed before it.
+/// construction to its destruction. What is declared after it in a test is destroyed before it, so
+/// a thread that may still wait at the end must share what it uses: it unwinds at the destruction.
 ///
 /// The test arranges (switches, connections, threads), runs, and asserts on what was recorded;
 /// nothing happens between two runs. Every failure names the seed.
@@ -69,6 +72,8 @@ class Simulation {
 
   /// Switch: waits in a `Condition` may end without a signal, at a moment chosen by the seed.
   bool spuriousWakeUps = false;
+  /// How far local time is ahead of UTC.
+  std::chrono::seconds localOffset{3600};
   std::vector<CreatedQueue> queues;
   std::map<std::string, std::variant<bool, std::int64_t>, std::less<>> deviceProperties;
 
@@ -80,6 +85,11 @@ class Simulation {
   SimulatedVistrel vistrel;
   SimulatedOhmrik ohmrik;
   SimulatedAgent agent;
+  SimulatedPreferences preferences;
+  SimulatedNotifications notifications;
+  SimulatedTallix tallix;
+  SimulatedOrientation orientation;
+  SimulatedFiles files;
   SimulatedListener listener;
   Scheduler scheduler;
 

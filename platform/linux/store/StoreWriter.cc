@@ -71,7 +71,8 @@ std::optional<StoreWriter::Instant> StoreWriter::nextDeadline() const {
 void StoreWriter::atDeadline() {
   if (unsyncedSince_ && steady_clock::now() >= *unsyncedSince_ + syncAfter_) syncTail();
   if (!retaining_) return;
-  const auto expired = ageing_ ? std::optional(options_.clock() - options_.maximumAge) : std::nullopt;
+  const auto expired =
+      ageing_ ? std::optional(options_.clock() - options_.maximumAge) : std::nullopt;
   if (!retain(0, expired)) retaining_ = ageing_ = false;
 }
 
@@ -81,8 +82,8 @@ void StoreWriter::write(const StoreBatch& batch) {
     const std::size_t last = std::min(first + kRowsPerCommit, rows);
     StoreQueue::Tally tally;
     for (std::size_t i = first; i < last; ++i) tally.add(batch.rows()[i]);
-    makeRoom(tally);
-    if (!writeRows(batch, first, last)) {
+    if (!gaveUp_) makeRoom(tally);
+    if (gaveUp_ || !writeRows(batch, first, last)) {
       lose(batch, first);
       return;
     }
@@ -134,9 +135,8 @@ bool StoreWriter::needsFullCommit(const StoreBatch& batch, std::size_t first,
   if (steady_clock::now() >= unsyncedSince_.value_or(batch.queuedAt) + syncAfter_) return true;
   const auto rows = batch.rows().begin();
   return std::any_of(rows + static_cast<std::ptrdiff_t>(first),
-                     rows + static_cast<std::ptrdiff_t>(last), [](const StoreRow& row) {
-                       return std::holds_alternative<FlushRow>(row);
-                     });
+                     rows + static_cast<std::ptrdiff_t>(last),
+                     [](const StoreRow& row) { return std::holds_alternative<FlushRow>(row); });
 }
 
 void StoreWriter::completeFlushes(const StoreBatch& batch, std::size_t first, std::size_t last,
@@ -147,12 +147,10 @@ void StoreWriter::completeFlushes(const StoreBatch& batch, std::size_t first, st
 }
 
 void StoreWriter::lose(const StoreBatch& batch, std::size_t first) {
-  ZQ_FUNCTION("StoreWriter::lose");
+  gaveUp_ = true;
   StoreQueue::Tally tally;
   for (std::size_t i = first; i < batch.rows().size(); ++i) tally.add(batch.rows()[i]);
   queue_.lost(tally);
-  ZQ_LOG(nullptr, error, "The telemetry store {} was closed while it took no rows: {} rows are lost.",
-         options_.database.path.string(), tally.counted);
   completeFlushes(batch, first, batch.rows().size(), failure_);
 }
 
@@ -190,7 +188,8 @@ bool StoreWriter::retain(std::uint64_t incomingBytes, std::optional<Date> expire
 void StoreWriter::reportRemoved(bool now) {
   ZQ_FUNCTION("StoreWriter::reportRemoved");
   if (!now || removedNotExported_ == 0) return;
-  ZQ_LOG(nullptr, error, "The telemetry store {} is full or too old: {} rows were removed that no backend has had.",
+  ZQ_LOG(nullptr, error,
+         "The telemetry store {} is full or too old: {} rows were removed that no backend has had.",
          options_.database.path.string(), std::exchange(removedNotExported_, 0));
 }
 
@@ -198,8 +197,8 @@ void StoreWriter::failed() {
   ZQ_FUNCTION("StoreWriter::failed");
   if (database_) {
     const bool full = database_->fault() == SqliteFault::diskFull;
-    failure_ = StoreError(full ? StoreErrorCode::diskFull : StoreErrorCode::failed,
-                          database_->message());
+    failure_ =
+        StoreError(full ? StoreErrorCode::diskFull : StoreErrorCode::failed, database_->message());
   }
   if (failureLine_.due()) {
     ZQ_LOG(nullptr, error, "The telemetry store {} takes no rows: {}. Trying again; {} rows wait.",
@@ -208,6 +207,7 @@ void StoreWriter::failed() {
   if (!database_ || database_->fault() != SqliteFault::corrupt) return;
   const std::string reason = database_->message();
   database_.reset();
+  unsyncedSince_.reset();
   if (Outcome aside = SetStoreAside(options_.database.path, options_.clock(), reason); !aside) {
     failure_ = aside.error();
   }
@@ -225,7 +225,12 @@ bool StoreWriter::reopen() {
 }
 
 void StoreWriter::finish() {
+  ZQ_FUNCTION("StoreWriter::finish");
   if (unsyncedSince_) syncTail();
+  if (const std::uint64_t lost = queue_.counters().lost; lost > 0) {
+    ZQ_LOG(nullptr, error, "The telemetry store {} was closed while it took no rows: {} are lost.",
+           options_.database.path.string(), lost);
+  }
   reportRemoved(true);
   database_.reset();
 }

@@ -72,9 +72,11 @@ class StoreWriter {
   std::unique_ptr<StoreDatabase> database_;  // null while a new file could not be begun
   Error failure_;                            // of the last attempt
   Minutely failureLine_;
-  std::optional<Instant> unsyncedSince_;  // when the oldest row was queued that a power cut would take
-  bool retaining_ = true;                 // there may be rows to remove
-  bool ageing_ = true;                    // ... because of their age
+  bool gaveUp_ = false;  // the store was closed while it took no rows
+  std::optional<Instant>
+      unsyncedSince_;      // when the oldest row was queued that a power cut would take
+  bool retaining_ = true;  // there may be rows to remove
+  bool ageing_ = true;     // ... because of their age
   Instant nextAgeing_;
   std::uint64_t removedNotExported_ = 0;  // and not yet reported
   Minutely removedLine_;

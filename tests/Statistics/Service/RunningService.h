@@ -1,5 +1,6 @@
 #pragma once
 
+#include <functional>
 #include <optional>
 #include <utility>
 
@@ -42,7 +43,11 @@ class Client : public SimulatedClient {
 
 /// The whole service on the simulated platform, as its process entry sets it up.
 struct RunningService {
-  explicit RunningService(std::uint64_t seed) : simulation(seed) {
+  /// `prepare` arranges what the service finds when it begins.
+  explicit RunningService(
+      std::uint64_t seed, const std::function<void(Simulation&)>& prepare = [](Simulation&) {})
+      : simulation(seed) {
+    prepare(simulation);
     ProcessServiceListener().setDelegate(ZQReportingServiceDelegate::create());
     ProcessServiceListener().resume();
   }
@@ -53,6 +58,12 @@ struct RunningService {
     Client client(simulation.listener.connect(pid));
     simulation.run();
     return client;
+  }
+  /// Gives the service's preferences domain these entries, and says so.
+  void changePreferences(Dictionary entries) {
+    simulation.preferences["tarnwick.quarvel"] = std::move(entries);
+    simulation.notifications.post("tarnwick.quarvel.reporting");
+    simulation.run();
   }
   void run() { simulation.run(); }
 

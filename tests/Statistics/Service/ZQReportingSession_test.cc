@@ -166,8 +166,8 @@ TEST(Session, StopFlushesBehindWhatWasSentAndAnswersTheStartAtOnce) {
     owner.simulation.run();
 
     EXPECT_THAT(owner.simulation.journal.lines({"agent 1"}),
-                ElementsAre("agent 1 created", "agent 1 message 0x3 0x1", "agent 1 flush",
-                            "agent 1 released"));
+                ElementsAre("agent 1 created", "agent 1 message 0x3 0x1",
+                            "agent 1 message 0xffff 0xffff", "agent 1 flush", "agent 1 released"));
     EXPECT_THAT(owner.simulation.agent.sessions[0].flushes, ElementsAre(5s));
     ASSERT_EQ(owner.simulation.agent.singleMessages.size(), 1U);
     EXPECT_EQ(owner.simulation.agent.singleMessages[0].message.payload,
@@ -177,6 +177,16 @@ TEST(Session, StopFlushesBehindWhatWasSentAndAnswersTheStartAtOnce) {
 }
 
 TEST(Session, StartsAndStopsRepeat) {
+  const auto log = [](auto... line) { return "log " + Line(line...); };
+  using Lines = std::vector<std::string>;
+  const Lines starting = {log("debug", kStart, "starting session owned by 7")};
+  const Lines started = {"trace 0x2104282c"};
+  const Lines already = {log("info", kStart, "7 is already started")};
+  const Lines message = {log("debug", kSend, "sending message for session owned by 7"),
+                         "trace 0x21042838"};
+  const Lines ending = {log("debug", kStop, "ending session 7")};
+  const Lines stopping = {"trace 0x21042830",
+                          log("default", kStop, "sending summary event for reporter 7")};
   for (const auto seed : Seeds()) {
     Owner owner(seed);
     owner.simulation.log.verbose = {"zqrr"};
@@ -196,28 +206,19 @@ TEST(Session, StartsAndStopsRepeat) {
     EXPECT_THAT(owner.history(), ElementsAre("Playback_Start_3")) << "counts run on";
     owner.stop();
     EXPECT_THAT(owner.ended, ElementsAre(Value(true), Value(true)));
-    EXPECT_THAT(owner.simulation.journal.lines({"log", "trace"}),
-                ElementsAre("log " + Line("debug", kStop, "ending session 7"),
-                            "log " + Line("debug", kStart, "starting session owned by 7"),
-                            "trace 0x2104282c",
-                            "log " + Line("debug", kStart, "starting session owned by 7"),
-                            "log " + Line("info", kStart, "7 is already started"),
-                            "log " + Line("debug", kSend, "sending message for session owned by 7"),
-                            "trace 0x21042838",
-                            "log " + Line("debug", kSend, "sending message for session owned by 7"),
-                            "trace 0x21042838", "log " + Line("debug", kStop, "ending session 7"),
-                            "log " + Line("debug", kStop, "ending session 7"), "trace 0x21042830",
-                            "log " + Line("debug", kStop, "ending session 7"),
-                            "log " + Line("debug", kStart, "starting session owned by 7"),
-                            "trace 0x2104282c",
-                            "log " + Line("debug", kSend, "sending message for session owned by 7"),
-                            "trace 0x21042838", "log " + Line("debug", kStop, "ending session 7"),
-                            "log " + Line("debug", kStop, "ending session 7"), "trace 0x21042830"));
+
+    Lines expected;
+    for (const Lines& lines :
+         {ending, starting, started, starting, already, message, message, ending, ending, stopping,
+          message, ending, starting, started, message, ending, ending, stopping, message}) {
+      expected.insert(expected.end(), lines.begin(), lines.end());
+    }
+    EXPECT_EQ(owner.simulation.journal.lines({"log", "trace"}), expected);
     owner.simulation.run();
     EXPECT_EQ(owner.simulation.agent.tokens.size(), 2U);
     ASSERT_EQ(owner.simulation.agent.sessions.size(), 2U);
-    EXPECT_EQ(owner.simulation.agent.sessions[0].messages.size(), 2U);
-    EXPECT_EQ(owner.simulation.agent.sessions[1].messages.size(), 1U);
+    EXPECT_EQ(owner.simulation.agent.sessions[0].messages.size(), 3U);
+    EXPECT_EQ(owner.simulation.agent.sessions[1].messages.size(), 2U);
   }
 }
 
@@ -233,7 +234,9 @@ TEST(Session, OfTypeTestNeverTouchesTheAgent) {
     EXPECT_THAT(owner.simulation.agent.tokens, IsEmpty());
     EXPECT_THAT(owner.simulation.journal.lines({"agent"}), IsEmpty());
     EXPECT_THAT(owner.simulation.log.texts(),
-                ElementsAre(Line("info", kSend, "transactions aren't allowed on this platform")));
+                ElementsAre(Line("default", kStop, "sending summary event for reporter 7"),
+                            Line("info", kSend, "transactions aren't allowed on this platform"),
+                            Line("info", kSend, "transactions aren't allowed on this platform")));
   }
 }
 

@@ -1,0 +1,475 @@
+#include "Statistics/Service/ZQReportingBlockThrottle.h"
+
+#include <gmock/gmock.h>
+
+#include <cmath>
+#include <limits>
+#include <set>
+
+#include "tests/platform/Simulation.h"
+
+namespace quarvel {
+namespace {
+
+using testing::ElementsAre;
+using testing::ElementsAreArray;
+using testing::IsEmpty;
+using testing::SizeIs;
+
+constexpr auto kInstant = std::chrono::microseconds(1);
+/// How long the idle worker pauses between two looks.
+constexpr auto kPause = std::chrono::milliseconds(100);
+
+const char* const kBlacklist = "_comparison_field_blacklist";
+const char* const kSeconds = "_throttle_seconds";
+
+Payload Delayed(Value seconds) {
+  return Payload(Dictionary{{kSeconds, std::move(seconds)}});
+}
+
+std::string Key(const Payload& payload) {
+  return ZQReportingBlockThrottle::buildMessageKey(payload, 7, 3, 1);
+}
+
+/// A throttle whose blocks say when they ran.
+struct Throttled {
+  explicit Throttled(std::uint64_t seed) : simulation(seed) {}
+
+  /// Adds a message whose block is called `name`; from a simulated thread or the test.
+  void add(std::string name, const Payload& message = Payload(), ReporterID reporterID = 7,
+           std::uint32_t category = 3, std::uint32_t type = 1) {
+    const auto token = std::make_shared<int>();
+    blocks[name] = token;
+    throttle->addMessageBlock(
+        [this, name, token] {
+          ran.push_back({name, simulation.elapsed()});
+        },
+        reporterID, message, category, type);
+  }
+  /// From a caller's thread, when the time has come.
+  void addAt(Scheduler::Duration time, const std::string& name,
+             const Payload& message = Payload()) {
+    simulation.spawn("caller " + name, [this, time, name, message] {
+      SleepThread(time - simulation.elapsed());
+      add(name, message);
+    });
+  }
+  void runUntil(Scheduler::Duration elapsed) { simulation.scheduler.runUntil(elapsed); }
+  [[nodiscard]] bool isAlive(const std::string& name) { return !blocks[name].expired(); }
+  [[nodiscard]] std::vector<std::string> names() const {
+    std::vector<std::string> names;
+    for (const auto& [name, time] : ran) names.push_back(name);
+    return names;
+  }
+  /// A moment that is any as far as the worker's pauses go.
+  [[nodiscard]] Scheduler::Duration anyMoment() {
+    return kPause + Scheduler::Duration(simulation.scheduler.choose(300'000));
+  }
+
+  using Run = std::pair<std::string, Scheduler::Duration>;
+
+  Simulation simulation;
+  std::vector<Run> ran;
+  std::map<std::string, std::weak_ptr<int>> blocks;
+  std::shared_ptr<ZQReportingBlockThrottle> throttle = ZQReportingBlockThrottle::init();
+};
+
+TEST(MessageKey, HasKeysSortedAndValuesInTheirTextualForm) {
+  EXPECT_EQ(Key(Payload()), "reporterID|7|Playback|Start");
+  const Dictionary inner = {{"z", 1.5}, {"b", List{true, nullptr}}, {12, "12"}};
+  const Payload payload(Dictionary{{"text", "as it |stands\""},
+                                   {"systemuptime_sec", 17},
+                                   {"Upper", inner},
+                                   {9, -3},
+                                   {"list", List{"a", Date{}}}});
+  EXPECT_EQ(ZQReportingBlockThrottle::buildMessageKey(payload, -1, 0x1000'0003, 0xffff'ffff),
+            R"(9|-3|Upper|{"12":"12","b":[true,null],"z":1.5}|)"
+            R"(list|["a","1970-01-01T00:00:00.000000Z"]|systemuptime_sec|^|)"
+            R"(text|as it |stands"|reporterID|-1|DSP_Playback|Undefined)");
+}
+
+TEST(MessageKey, MessagesAreEqualWhenWhatIsComparedIs) {
+  struct Row {
+    const char* name;
+    Dictionary one;
+    Dictionary other;
+    bool equal;
+  };
+  const Row rows[] = {
+      {"order of keys", {{"a", 1}, {"b", 2}}, {{"b", 2}, {"a", 1}}, true},
+      {"order of inner keys",
+       {{"a", List{Dictionary{{"x", 1}, {"y", 2}}}}},
+       {{"a", List{Dictionary{{"y", 2}, {"x", 1}}}}},
+       true},
+      {"inner value", {{"a", Dictionary{{"x", 1}}}}, {{"a", Dictionary{{"x", 2}}}}, false},
+      {"order of a list", {{"a", List{1, 2}}}, {{"a", List{2, 1}}}, false},
+      {"value", {{"a", 1}}, {{"a", 2}}, false},
+      {"system uptime", {{"systemuptime_sec", 1}}, {{"systemuptime_sec", "2"}}, true},
+      {"process uptime", {{"processuptime_ms", 1}}, {{"processuptime_ms", 2}}, true},
+      {"timestamp", {{"zqreporting_timestamp", 1}}, {{"zqreporting_timestamp", 2}}, true},
+      {"delay", {{kSeconds, 1}}, {{kSeconds, 2}}, true},
+      {"system uptime absent", {{"systemuptime_sec", 1}}, {}, false},
+      {"process uptime absent", {{"processuptime_ms", 1}}, {}, false},
+      {"timestamp absent", {{"zqreporting_timestamp", 1}}, {}, false},
+      {"delay absent", {{kSeconds, 1}}, {}, false},
+      {"listed key",
+       {{"a", 1}, {"b", 2}, {kBlacklist, List{"b"}}},
+       {{"a", 1}, {"b", 3}, {kBlacklist, List{"b", 5, nullptr}}},
+       true},
+      {"key beside a listed one",
+       {{"a", 1}, {"b", 2}, {kBlacklist, List{"b"}}},
+       {{"a", 2}, {"b", 2}, {kBlacklist, List{"b"}}},
+       false},
+      {"listed by one only",
+       {{"b", 2}, {kBlacklist, List{"b"}}},
+       {{"b", 2}, {kBlacklist, List{}}},
+       false},
+      {"listed number", {{4, 1}, {kBlacklist, List{4}}}, {{4, 2}, {kBlacklist, List{4}}}, true},
+      {"key named without a list",
+       {{"b", 2}, {kBlacklist, "b"}},
+       {{"b", 3}, {kBlacklist, "b"}},
+       false},
+      {"key of a dictionary in place of a list",
+       {{"b", 2}, {kBlacklist, Dictionary{{"b", "b"}}}},
+       {{"b", 3}, {kBlacklist, Dictionary{{"b", "b"}}}},
+       false},
+      {"volume and its time",
+       {{"Volume", 1}, {"VolumeOperationTime", 10}},
+       {{"Volume", 2}, {"VolumeOperationTime", nullptr}},
+       true},
+      {"volume alone", {{"Volume", 1}}, {{"Volume", 2}}, false},
+      {"volume time alone", {{"VolumeOperationTime", 1}}, {{"VolumeOperationTime", 2}}, false},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.name);
+    EXPECT_EQ(Key(Payload(row.one)) == Key(Payload(row.other)), row.equal)
+        << Key(Payload(row.one)) << "\n"
+        << Key(Payload(row.other));
+  }
+}
+
+TEST(MessageKey, EqualNumbersInDifferentEncodingsAreEqual) {
+  const auto shortest =
+      Payload::from(PayloadValue("\x81\xa1"
+                                 "a\x05"));
+  const auto wide =
+      Payload::from(PayloadValue("\x81\xd9\x01"
+                                 "a\xd1\x00\x05"));
+  ASSERT_TRUE(shortest && wide);
+  EXPECT_EQ(Key(shortest.value()), Key(wide.value()));
+}
+
+TEST(SleepTime, IsWhatThePayloadAsksForWithinBounds) {
+  struct Row {
+    Value asked;
+    double seconds;
+    const char* rejected;
+  };
+  const Row rows[] = {
+      {2, 2.0, nullptr},
+      {4.9, 4.900000095367432, nullptr},  // single precision
+      {4.99, 4.989999771118164, nullptr},
+      {0, 0.0, nullptr},
+      {-1, -1.0, nullptr},
+      {-0.25, -0.25, nullptr},
+      {true, 1.0, nullptr},
+      {5, 0.5, "Rejecting large throttle time. {time=5, max=5.000000}"},
+      {6.5, 0.5, "Rejecting large throttle time. {time=6.5, max=5.000000}"},
+      {std::numeric_limits<std::uint64_t>::max(), 0.5,
+       "Rejecting large throttle time. {time=18446744073709551615, max=5.000000}"},
+      {std::numeric_limits<double>::infinity(), 0.5,
+       "Rejecting large throttle time. {time=\"Infinity\", max=5.000000}"},
+      {"2", 0.5, "Rejecting non XoNumber value of throttle time. {time=2}"},
+      {List{2}, 0.5, "Rejecting non XoNumber value of throttle time. {time=[2]}"},
+      {nullptr, 0.5, "Rejecting non XoNumber value of throttle time. {time=(null)}"},
+  };
+  Simulation simulation(1);
+  EXPECT_EQ(ZQReportingBlockThrottle::determineSleepTime(Payload()), 0.5);
+  for (const Row& row : rows) {
+    simulation.log.lines.clear();
+    EXPECT_EQ(ZQReportingBlockThrottle::determineSleepTime(Delayed(row.asked)), row.seconds);
+    std::vector<std::string> expected;
+    if (row.rejected != nullptr) {
+      expected.push_back(
+          std::string("info zqrr +[ZQReportingBlockThrottle determineSleepTime:]: ") +
+          row.rejected);
+    }
+    EXPECT_THAT(simulation.log.texts(), ElementsAreArray(expected));
+  }
+}
+
+// A delay is met exactly unless it ends before the idle worker next looks.
+TEST(BlockThrottle, RunsAMessageWhenItsDelayIsOverAndNoSooner) {
+  struct Row {
+    Value asked;
+    Scheduler::Duration delay;
+  };
+  const Row rows[] = {{2, 2s}, {4.5, 4500ms}, {0.125, 125ms},     {"none", 500ms}, {0.03, 30ms},
+                      {0, 0s}, {-1, 0s},      {std::nan(""), 0s}, {-1e300, 0s},    {6, 500ms}};
+  for (const auto seed : Seeds()) {
+    for (const Row& row : rows) {
+      Throttled throttled(seed);
+      const auto added = throttled.anyMoment();
+      throttled.runUntil(added);
+      throttled.add("a", Delayed(row.asked));
+      if (row.delay > 0s) throttled.runUntil(added + row.delay - kInstant);
+      EXPECT_THAT(throttled.ran, IsEmpty());
+      EXPECT_THAT(throttled.throttle->timersInFlight(), SizeIs(1));
+      throttled.runUntil(added + std::max<Scheduler::Duration>(row.delay, kPause));
+      EXPECT_THAT(throttled.names(), ElementsAre("a")) << row.delay.count();
+      EXPECT_FALSE(throttled.isAlive("a"));
+      EXPECT_THAT(throttled.throttle->timersInFlight(), IsEmpty());
+      throttled.simulation.runFor(20s);
+      EXPECT_THAT(throttled.ran, SizeIs(1));
+    }
+  }
+}
+
+TEST(BlockThrottle, OfABurstTheLastRunsOnceOneDelayAfterIt) {
+  for (const auto seed : Seeds()) {
+    Throttled throttled(seed);
+    throttled.simulation.log.verbose = {"zqrr"};
+    Scheduler::Duration last = throttled.anyMoment();
+    throttled.addAt(last, "0");
+    const std::vector<std::string> older = {"0", "1", "2", "3", "4"};
+    for (int i = 1; i <= 5; ++i) {
+      last += Scheduler::Duration(1 + throttled.simulation.scheduler.choose(499'999));
+      throttled.addAt(last, std::to_string(i));
+    }
+    throttled.runUntil(last + 500ms - kInstant);
+    EXPECT_THAT(throttled.ran, IsEmpty());
+    EXPECT_TRUE(std::ranges::none_of(older, [&](auto& name) { return throttled.isAlive(name); }));
+    EXPECT_THAT(throttled.throttle->timersInFlight(), SizeIs(1));
+    EXPECT_THAT(
+        throttled.simulation.log.texts("debug zqrr -[ZQReportingBlockThrottle addMessageBlock:"
+                                       "reporterID:message:category:type:]: Dropping duplicate "
+                                       "message for reporterID|7|Playback|Start"),
+        SizeIs(5));
+    throttled.simulation.runFor(kInstant);
+    EXPECT_THAT(throttled.ran, ElementsAre(Throttled::Run("5", last + 500ms)));
+
+    // The burst is over: an equal message is a new one.
+    throttled.add("6");
+    throttled.simulation.runFor(500ms);
+    EXPECT_THAT(throttled.names(), ElementsAre("5", "6"));
+  }
+}
+
+TEST(BlockThrottle, ALaterMessageBringsItsOwnDelay) {
+  for (const auto seed : Seeds()) {
+    Throttled throttled(seed);
+    throttled.addAt(0s, "a", Delayed(4));
+    throttled.addAt(1s, "b", Delayed(0.25));
+    throttled.addAt(2s, "c", Delayed(0.25));
+    throttled.addAt(2100ms, "d", Delayed(4));
+    throttled.addAt(3s, "e", Delayed(-1));
+    throttled.runUntil(10s);
+    EXPECT_THAT(throttled.ran, ElementsAre(Throttled::Run("b", 1250ms), Throttled::Run("e", 3s)));
+  }
+}
+
+TEST(BlockThrottle, ReporterCategoryAndTypeKeepMessagesApart) {
+  for (const auto seed : Seeds()) {
+    Throttled throttled(seed);
+    throttled.add("first");
+    throttled.add("reporter", Payload(), 8);
+    throttled.add("category", Payload(), 7, 4);
+    throttled.add("type", Payload(), 7, 3, 2);
+    throttled.add("payload", Payload(Dictionary{{"a", 1}}));
+    throttled.runUntil(500ms);
+    EXPECT_THAT(throttled.names(),
+                testing::UnorderedElementsAre("first", "reporter", "category", "type", "payload"));
+  }
+}
+
+// The worker looks for new messages only when none is left on its run loop.
+TEST(BlockThrottle, AMessageThatComesWhileOthersWaitIsTakenUpAfterThem) {
+  for (const auto seed : Seeds()) {
+    Throttled throttled(seed);
+    throttled.add("long", Delayed(4.5));
+    throttled.runUntil(1s);
+    throttled.add("short", Payload(Dictionary{{"a", 1}}));
+    EXPECT_THAT(throttled.throttle->unscheduledTimerKeys(),
+                ElementsAre("a|1|reporterID|7|Playback|Start"));
+    throttled.runUntil(4500ms + kPause - kInstant);
+    EXPECT_THAT(throttled.names(), ElementsAre("long"));
+    throttled.runUntil(4500ms + kPause);
+    EXPECT_THAT(throttled.names(), ElementsAre("long", "short"));
+  }
+}
+
+TEST(BlockThrottle, CallersThatMeetLoseNothingButDuplicates) {
+  for (const auto seed : Seeds()) {
+    Throttled throttled(seed);
+    for (const char* name : {"a0", "a1", "a2", "b0", "b1", "c0"}) {
+      throttled.addAt(200ms, name, Payload(Dictionary{{"kind", std::string(name, 1)}}));
+    }
+    throttled.runUntil(3s);
+    std::set<char> kinds;
+    for (const auto& name : throttled.names()) kinds.insert(name.front());
+    EXPECT_THAT(throttled.ran, SizeIs(3)) << "one of each kind";
+    EXPECT_THAT(kinds, ElementsAre('a', 'b', 'c'));
+    for (const auto& [name, block] : throttled.blocks) EXPECT_TRUE(block.expired()) << name;
+  }
+}
+
+// At the very moment of the firing the message may be a duplicate still or a new one already.
+TEST(BlockThrottle, OfAMessageAndTheFiringOfAnEqualOneNeitherOrderRunsABlockTwice) {
+  std::set<std::vector<Throttled::Run>> outcomes;
+  for (const auto seed : Seeds()) {
+    Throttled throttled(seed);
+    throttled.addAt(0s, "older");
+    throttled.addAt(500ms, "newer");
+    throttled.runUntil(5s);
+    outcomes.insert(throttled.ran);
+    EXPECT_THAT(throttled.throttle->timersInFlight(), IsEmpty());
+  }
+  const std::vector<std::vector<Throttled::Run>> allowed = {
+      {{"older", 500ms}},
+      {{"newer", 500ms}},
+      {{"newer", 1s}},
+      {{"older", 500ms}, {"newer", 1s}},
+  };
+  for (const auto& outcome : outcomes) EXPECT_THAT(allowed, testing::Contains(outcome));
+}
+
+TEST(BlockThrottle, BlocksRunOneAtATimeAndMayAddMessages) {
+  for (const auto seed : Seeds()) {
+    Throttled throttled(seed);
+    int running = 0;
+    for (int i = 0; i < 3; ++i) {
+      throttled.throttle->addMessageBlock(
+          [&, i] {
+            EXPECT_EQ(++running, 1);
+            SleepThread(50ms);
+            if (i == 0) throttled.add("again", Payload(), 0);
+            --running;
+          },
+          i, Payload(), 3, 1);
+    }
+    throttled.throttle->addMessageBlock(Block(), 9, Payload(), 3, 1);
+    throttled.runUntil(2s);
+    EXPECT_THAT(throttled.names(), ElementsAre("again"));
+  }
+}
+
+/// A caller that waits for completion, from `begun` on.
+struct Completion {
+  Completion(Throttled& throttled, Scheduler::Duration begun) {
+    throttled.simulation.spawn("waiter", [this, &throttled, begun] {
+      SleepThread(begun);
+      throttled.throttle->waitForCompletion();
+      over = throttled.simulation.elapsed();
+    });
+  }
+  std::optional<Scheduler::Duration> over;
+};
+
+constexpr const char* kWaitPrefix = " zqrr -[ZQReportingBlockThrottle waitForCompletion]: ";
+
+TEST(WaitForCompletion, ReturnsAtItsFirstLookThatFindsNothingPending) {
+  struct Row {
+    const char* name;
+    std::optional<double> delay;
+    Scheduler::Duration over;
+  };
+  const Row rows[] = {{"nothing pending", std::nullopt, 0s},
+                      {"one pause", 0.3, 500ms},
+                      {"two pauses", 0.7, 1s},
+                      {"the last pause", 4.75, 5s}};
+  for (const auto seed : Seeds()) {
+    for (const Row& row : rows) {
+      SCOPED_TRACE(row.name);
+      Throttled throttled(seed);
+      if (row.delay) throttled.add("a", Delayed(*row.delay));
+      const Completion completion(throttled, 0s);
+      throttled.runUntil(10s);
+      EXPECT_EQ(completion.over, row.over);
+      EXPECT_THAT(throttled.simulation.log.texts("default"), IsEmpty());
+    }
+  }
+}
+
+TEST(WaitForCompletion, GivesUpAfterFiveSecondsAndLeavesWhatIsPending) {
+  for (const auto seed : Seeds()) {
+    Throttled throttled(seed);
+    throttled.add("a", Delayed(4.9));
+    throttled.add("other", Delayed(4.9), 8);
+    throttled.addAt(3s, "b", Delayed(4.9));
+    const Completion completion(throttled, 1s);
+    throttled.runUntil(6s - kInstant);
+    EXPECT_EQ(completion.over, std::nullopt);
+    throttled.runUntil(7900ms - kInstant);
+    EXPECT_EQ(completion.over, 6s);
+    EXPECT_THAT(throttled.names(), ElementsAre("other"));
+    throttled.runUntil(7900ms);
+    EXPECT_THAT(throttled.names(), ElementsAre("other", "b"));
+  }
+}
+
+TEST(WaitForCompletion, SaysWhatItWaitsForAndTheWorkerWhatItDoes) {
+  Throttled throttled(1);
+  throttled.simulation.log.verbose = {"zqrr"};
+  throttled.add("a", Delayed(4));
+  throttled.runUntil(50ms);
+  throttled.addAt(50ms, "b", Payload(Dictionary{{"a", 1}, {kSeconds, 4.9}}));
+  throttled.addAt(3s, "c", Delayed(4));
+  const Completion completion(throttled, 100ms);
+  throttled.runUntil(6s);
+  const std::string wait = kWaitPrefix;
+  EXPECT_THAT(
+      throttled.simulation.log.texts("info"),
+      ElementsAre("info" + wait + "waitForCompletion. timersInFlight=2 unscheduledTimerKeys=1"));
+  EXPECT_THAT(
+      throttled.simulation.log.texts("debug" + wait),
+      ElementsAre("debug" + wait + "Waiting up to 5 seconds for blockThrottle queue to be empty."));
+  EXPECT_THAT(throttled.simulation.log.texts("default"),
+              ElementsAre("default" + wait +
+                          "Giving up on waiting for completion after 5 seconds. timersInFlight=2"));
+
+  const std::string worker = "debug zqrr -[ZQReportingBlockThrottle init]: ";
+  EXPECT_THAT(throttled.simulation.log.texts(worker),
+              ElementsAre(worker + "calling workingRunLoop run from inside thread block"));
+  throttled.runUntil(7s + kPause);
+  EXPECT_THAT(throttled.simulation.log.texts(worker),
+              ElementsAre(worker + "calling workingRunLoop run from inside thread block",
+                          worker + "sleeping in thread",
+                          worker + "calling workingRunLoop run from inside thread block",
+                          worker + "sleeping in thread"));
+}
+
+TEST(BlockThrottle, EndsItsWorkerWhenToldToAndIsThenReleased) {
+  for (const auto seed : Seeds()) {
+    Throttled throttled(seed);
+    throttled.add("taken up", Delayed(2));
+    throttled.runUntil(1s);
+    throttled.add("too late", Payload(Dictionary{{"a", 1}}));
+    throttled.throttle->setShouldKeepRunning(false);
+    throttled.throttle->setQueueThread(nullptr);
+    throttled.simulation.run();  // would never end while the worker goes on
+    EXPECT_THAT(throttled.names(), ElementsAre("taken up"));
+    EXPECT_THAT(throttled.throttle->timersInFlight(), SizeIs(1));
+    const std::weak_ptr released = throttled.throttle;
+    throttled.throttle.reset();
+    EXPECT_TRUE(released.expired());
+    EXPECT_FALSE(throttled.isAlive("too late"));
+  }
+}
+
+TEST(BlockThrottle, AMessageTakenOutOfTheMapNeverRuns) {
+  for (const auto seed : Seeds()) {
+    Throttled throttled(seed);
+    throttled.add("taken up");
+    throttled.runUntil(200ms);
+    throttled.add("unscheduled", Payload(Dictionary{{"a", 1}}));
+    throttled.throttle->setTimersInFlight({});
+    EXPECT_FALSE(throttled.isAlive("unscheduled"));
+    throttled.runUntil(1s);
+    throttled.add("next");
+    throttled.runUntil(1500ms);
+    EXPECT_THAT(throttled.names(), ElementsAre("next"));
+  }
+}
+
+}  // namespace
+}  // namespace quarvel

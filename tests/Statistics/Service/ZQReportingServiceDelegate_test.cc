@@ -1,0 +1,180 @@
+#include "Statistics/Service/ZQReportingServiceDelegate.h"
+
+#include <gmock/gmock.h>
+
+#include <algorithm>
+
+#include "tests/Statistics/Service/RunningService.h"
+
+namespace quarvel {
+namespace {
+
+using testing::Contains;
+using testing::ElementsAre;
+using testing::IsEmpty;
+using testing::Not;
+using testing::StartsWith;
+using Lines = std::vector<std::string>;
+
+const Value kYes(true);
+const Value kUnknown(65535);
+const std::string kDelegate = "-[ZQReportingServiceDelegate ";
+const std::string kInstance = "-[ZQReportingServerInstance ";
+
+TEST(ServiceDelegate, IsSetUpInOrder) {
+  RunningService service(1);
+  const auto& queues = service.simulation.queues;
+  ASSERT_EQ(queues.size(), 1U);
+  EXPECT_EQ(queues[0].label, "tarnwick.quarvel.reporting.server");
+  EXPECT_EQ(queues[0].qualityOfService, QualityOfService::userInteractive);
+  const auto lines = service.simulation.log.texts();
+  ASSERT_GE(lines.size(), 2U);
+  EXPECT_EQ(lines[0],
+            "default zqrs " + kDelegate + "listenForDefaultsNotification]: notify setup result 0");
+  EXPECT_EQ(lines[1],
+            "info zqrd -[ZQReportingDriverUtility init]: creating tallixing driver utility");
+  EXPECT_EQ(service.simulation.log.lines[0].file, "ZQReportingServiceDelegate.cc");
+}
+
+TEST(ServiceDelegate, RegistersItsLogScopes) {
+  RunningService service(1);
+  service.connect(42).create(7);
+  service.run();
+  std::map<std::string, std::pair<std::uint32_t, std::string>> scopes;
+  for (const LogScope* scope : RegisteredLogScopes()) {
+    if (scope->subsystem != "tarnwick.quarvel") continue;
+    scopes[scope->name] = {scope->code, scope->verboseKey};
+    EXPECT_EQ(scope->options, 1);
+    EXPECT_EQ(scope->levelMask, 31);
+  }
+  EXPECT_THAT(scopes,
+              ElementsAre(std::pair("zqrd", std::pair(0x7a717264U, "reporting_driver_verbose")),
+                          std::pair("zqrr", std::pair(0x7a717272U, "reporting_session_verbose")),
+                          std::pair("zqrs", std::pair(0x7a717273U, "reporting_server_verbose"))));
+}
+
+TEST(ServiceDelegate, AcceptsWhoeverComes) {
+  for (const auto seed : Seeds()) {
+    RunningService service(seed);
+    service.simulation.log.lines.clear();
+    Client client = service.connect(-1);
+    const auto created = client.create(7);
+    service.run();
+    EXPECT_THAT(created->results, ElementsAre(kYes));
+    const auto lines = service.simulation.log.texts("default");
+    EXPECT_EQ(lines[0],
+              "default zqrs " + kDelegate +
+                  "listener:shouldAcceptNewConnection:]: newConnection: " + client.description());
+    EXPECT_EQ(lines[1], "default zqrs " + kInstance +
+                            "initWithPID:delegate:]: new client with pid 18446744073709551615");
+  }
+}
+
+TEST(ServiceDelegate, NamesAProcessByItsIdentifier) {
+  Simulation simulation(1);
+  simulation.process.ownIdentifier = 100;
+  simulation.process.ownName = "quarveld";
+  simulation.process.table = {{1, "init"}, {100, "not asked"}, {42, "player"}};
+  const std::pair<std::int32_t, std::optional<std::string>> kNames[] = {
+      {100, "quarveld"}, {42, "player"},    {1, "init"},
+      {43, {}},          {0, std::nullopt}, {-1, std::nullopt}};
+  for (const auto& [pid, name] : kNames) EXPECT_EQ(ProcessNameForPID(pid), name) << pid;
+}
+
+TEST(ServiceDelegate, SearchesClientsInTheOrderOfAcceptance) {
+  for (const auto seed : Seeds()) {
+    RunningService service(seed);
+    Client first = service.connect(41);
+    Client second = service.connect(42);
+    Client asking = service.connect(43);
+    second.create(7);
+    second.setServiceType(2, 7);
+    service.run();
+    first.create(7);
+    first.setServiceType(1, 7);
+    service.run();
+    service.simulation.log.lines.clear();
+    const auto third = asking.serviceType(7);
+    const auto own = second.serviceType(7);
+    const auto nobody = asking.serviceType(8);
+    const auto zero = asking.valid(0);
+    service.run();
+    EXPECT_THAT(third->results, ElementsAre(Value(1)));
+    EXPECT_THAT(own->results, ElementsAre(Value(2)));
+    EXPECT_THAT(nobody->results, ElementsAre(kUnknown));
+    EXPECT_THAT(zero->results,
+                ElementsAre(Value(Dictionary{{"reporterID", 0}, {"serviceType", 65535}})));
+    const std::string search = " zqrs " + kDelegate + "findReportingSessionForID:]: ";
+    EXPECT_THAT(service.simulation.log.texts("info"),
+                ElementsAre("info" + search + "found reporting session 7 for client 41"));
+    EXPECT_THAT(service.simulation.log.texts("error"),
+                ElementsAre("error" + search + "failed to find reporting session 8"));
+  }
+}
+
+TEST(ServiceDelegate, EndsAClientOnceAndLetsItGo) {
+  for (const auto seed : Seeds()) {
+    for (const bool interrupted : {true, false}) {
+      RunningService service(seed);
+      Client client = service.connect(42);
+      client.create(6);
+      const auto start = client.start(7);
+      client.createStarted(7);
+      const auto started = client.start(8);
+      client.createStarted(8);
+      service.run();
+      EXPECT_THAT(start->results, IsEmpty());
+      service.simulation.journal.clear();
+      if (interrupted) {
+        client.interrupt();
+      } else {
+        client.disconnect();
+      }
+      service.run();
+      EXPECT_EQ(service.simulation.journal.lines({"reply start"}).size(), 2U);
+      EXPECT_EQ(service.simulation.journal.lines({"trace 0x21042830"}).size(), 2U);
+      const auto ofClient = [&](const std::string& line) {
+        return std::ranges::count(service.simulation.journal.lines(), "log default zqrs " + line);
+      };
+      EXPECT_EQ(ofClient(kDelegate + "listener:shouldAcceptNewConnection:]: InterruptionHandler: "
+                                     "connection exited"),
+                interrupted ? 1 : 0);
+      EXPECT_EQ(
+          ofClient(kInstance + "handleConnectionError]: removing 42 from the server client list"),
+          1);
+      EXPECT_EQ(ofClient(kInstance + "dealloc]: dealloc 42 from the server client list"), 1);
+      EXPECT_TRUE(client.exportedObject().expired());
+      EXPECT_TRUE(client.connection().expired());
+      EXPECT_EQ(service.simulation.journal.lines({"trace 0x21042834"}).size(), 3U);
+      for (const auto& session : service.simulation.agent.sessions) {
+        EXPECT_EQ(session.flushes.size(), 1U);
+        EXPECT_TRUE(session.released);
+      }
+    }
+  }
+}
+
+TEST(ServiceDelegate, AClientThatIsGoneAtOnceLeavesNothingBehind) {
+  for (const auto seed : Seeds()) {
+    RunningService service(seed);
+    Client brief(service.simulation.listener.connect(41));
+    brief.create(7);
+    brief.disconnect();
+    service.run();
+    EXPECT_TRUE(brief.exportedObject().expired());
+    Client other = service.connect(42);
+    const auto reporters = other.reporters();
+    other.send({});
+    service.run();
+    EXPECT_THAT(reporters->results, ElementsAre(Value(List{})));
+    EXPECT_EQ(service.simulation.log
+                  .texts("default zqrs " + kInstance +
+                         "sendMessage:withCategory:andType:forReportingIDs:reply:]: sessions for "
+                         "client")
+                  .size(),
+              1U);
+  }
+}
+
+}  // namespace
+}  // namespace quarvel

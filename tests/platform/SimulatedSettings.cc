@@ -1,0 +1,59 @@
+#include "tests/platform/SimulatedSettings.h"
+
+#include "platform/Preferences.h"
+#include "tests/platform/Simulation.h"
+
+namespace quarvel {
+
+PreferencesDomain OpenPreferencesDomain(std::string_view name) {
+  const auto& preferences = Simulation::current().preferences;
+  const auto found = preferences.find(name);
+  return found == preferences.end() ? PreferencesDomain() : PreferencesDomain(found->second);
+}
+
+void SimulatedNotifications::post(std::string_view name) {
+  for (const auto& registration : registrations_) {
+    if (registration->name != name || registration->pending) continue;
+    registration->pending = true;
+    deliver(registration, registration->token);
+  }
+}
+
+void SimulatedNotifications::deliverForeign(std::string_view name) {
+  for (const auto& registration : registrations_) {
+    if (registration->name == name) deliver(registration, registration->token + 1);
+  }
+}
+
+void SimulatedNotifications::deliver(const std::shared_ptr<Registration>& registration,
+                                     NotificationToken token) {
+  registration->queue->async([registration, token] {
+    registration->pending = false;
+    registration->handler(token);
+  });
+}
+
+NotificationToken SimulatedNotifications::add(std::string name, WorkQueue& queue,
+                                              NotificationHandler handler) {
+  const auto token = static_cast<NotificationToken>(registrations_.size() * 100 + 100);
+  registrations_.push_back(std::make_shared<Registration>(
+      Registration{std::move(name), token, &queue, std::move(handler)}));
+  return token;
+}
+
+std::int32_t RegisterForNotification(std::string_view name, NotificationToken& token,
+                                     WorkQueue& queue, NotificationHandler handler) {
+  SimulatedNotifications& notifications = Simulation::current().notifications;
+  token = 0;
+  if (notifications.registrationStatus == 0) {
+    token = notifications.add(std::string(name), queue, std::move(handler));
+  }
+  return notifications.registrationStatus;
+}
+
+std::int32_t PostNotification(std::string_view name) {
+  Simulation::current().notifications.post(name);
+  return 0;
+}
+
+}  // namespace quarvel

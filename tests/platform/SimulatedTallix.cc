@@ -1,0 +1,122 @@
+#include "tests/platform/SimulatedTallix.h"
+
+#include <algorithm>
+
+#include "platform/Tallix.h"
+#include "tests/platform/Simulation.h"
+
+namespace quarvel {
+
+class TallixChannelSet {
+ public:
+  std::vector<std::size_t> channels;  // indices of the published ones
+};
+
+class TallixSubscription {
+ public:
+  TallixChannels channels;
+};
+
+class TallixChannelSample {
+ public:
+  SimulatedTallix::Name name;
+  std::int64_t value;
+};
+
+class TallixSampleSet {
+ public:
+  std::vector<TallixChannelSample> samples;
+};
+
+namespace {
+
+SimulatedTallix& Tallix() {
+  return Simulation::current().tallix;
+}
+
+bool Matches(const std::optional<std::string_view>& wanted, const SimulatedTallix::Name& name) {
+  return !wanted || (name && *wanted == *name);
+}
+
+}  // namespace
+
+TallixChannels TallixCopyChannelsInGroup(std::optional<std::string_view> group,
+                                         std::optional<std::string_view> subgroup,
+                                         std::optional<Error>& error) {
+  if (Tallix().channelsError) error = Tallix().channelsError;
+  auto found = std::make_shared<TallixChannelSet>();
+  for (std::size_t i = 0; i < Tallix().channels.size(); ++i) {
+    const SimulatedTallix::Channel& channel = Tallix().channels[i];
+    if (Matches(group, channel.group) && Matches(subgroup, channel.subgroup)) {
+      found->channels.push_back(i);
+    }
+  }
+  const bool known = std::ranges::any_of(Tallix().emptyGroups, [&](const auto& each) {
+    return Matches(group, each.first) && Matches(subgroup, each.second);
+  });
+  if (found->channels.empty() && !known) return nullptr;
+  return found;
+}
+
+std::int32_t TallixGetChannelCount(const TallixChannelSet& channels) {
+  return static_cast<std::int32_t>(channels.channels.size());
+}
+
+std::shared_ptr<TallixSubscription> TallixCreateSubscription(const TallixChannels& channels,
+                                                             TallixChannels& subscribedChannels) {
+  // A set of its own, so that sampling with the set that was looked up is noticed.
+  subscribedChannels = std::make_shared<TallixChannelSet>(*channels);
+  return std::make_shared<TallixSubscription>(TallixSubscription{subscribedChannels});
+}
+
+TallixSamples TallixCreateSamples(TallixSubscription& subscription,
+                                  const TallixChannels& subscribedChannels,
+                                  std::optional<Error>& error) {
+  EXPECT_EQ(subscription.channels, subscribedChannels);
+  if (Tallix().samplesError) {
+    error = Tallix().samplesError;
+    return nullptr;
+  }
+  auto samples = std::make_shared<TallixSampleSet>();
+  for (const std::size_t i : subscribedChannels->channels) {
+    const SimulatedTallix::Channel& channel = Tallix().channels[i];
+    samples->samples.push_back({channel.name, channel.value});
+  }
+  return samples;
+}
+
+TallixSamples TallixCreateSamplesDelta(const TallixSamples& earlier, const TallixSamples& later,
+                                       std::optional<Error>& error) {
+  if (earlier == nullptr) {
+    error =
+        Error{kTallixErrorDomain, static_cast<std::int64_t>(TallixErrorCode::noEarlierSamples), {}};
+    return nullptr;
+  }
+  if (Tallix().deltaError) {
+    error = Tallix().deltaError;
+    return nullptr;
+  }
+  auto delta = std::make_shared<TallixSampleSet>(*later);
+  for (std::size_t i = 0; i < delta->samples.size(); ++i) {
+    delta->samples[i].value -= earlier->samples.at(i).value;
+  }
+  return delta;
+}
+
+void TallixIterate(const TallixSampleSet& samples,
+                   const std::function<int(const TallixChannelSample&)>& visitor) {
+  for (const TallixChannelSample& sample : samples.samples) {
+    if (visitor(sample) != 0) return;
+  }
+}
+
+std::optional<std::string_view> TallixChannelGetChannelName(const TallixChannelSample& sample) {
+  if (!sample.name) return std::nullopt;
+  return *sample.name;
+}
+
+std::int64_t TallixSimpleGetIntegerValue(const TallixChannelSample& sample) {
+  return sample.value;
+}
+
+}  // namespace quarvel

@@ -1,0 +1,33 @@
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "base/Error.h"
+
+namespace quarvel {
+
+/// The driver statistics facility.
+struct SimulatedTallix {
+  using Name = std::optional<std::string>;
+  struct Channel {
+    Name group;
+    Name subgroup;
+    Name name;
+    std::int64_t value = 0;
+  };
+  /// What is published now. Channels may change their values but not vanish.
+  std::vector<Channel> channels;
+  /// Groups, with subgroups, that are known although they publish nothing.
+  std::vector<std::pair<Name, Name>> emptyGroups;
+
+  // Switches.
+  std::optional<Error> channelsError;  // the channels are returned all the same
+  std::optional<Error> samplesError;
+  std::optional<Error> deltaError;
+};
+
+}  // namespace quarvel
