@@ -116,9 +116,8 @@ Outcome Player::finish() {
     MutexLock lock(replies_->mutex);
     const auto due = [this](std::int64_t session) { return stopped_.contains(session); };
     while (replies_->outstanding > 0) replies_->changed.wait(replies_->mutex);
-    const auto& starts = replies_->starts;
     bool inTime = true;
-    while (inTime && std::any_of(starts.begin(), starts.end(), due)) {
+    while (inTime && std::any_of(replies_->starts.begin(), replies_->starts.end(), due)) {
       inTime = replies_->changed.waitUntil(replies_->mutex, deadline);
     }
   }

@@ -89,7 +89,7 @@ class TestDelegate final : public ServiceListenerDelegate {
     connection->setInterruptionHandler([object] { Journal::shared().add("interrupted"); });
     connection->setInvalidationHandler([object] { Journal::shared().add("invalidated"); });
     connection->resume();
-    return true;
+    return service_.accepts;
   }
 
  private:

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <atomic>
 #include <chrono>
 #include <cstdint>
 #include <deque>
@@ -124,6 +125,8 @@ class Service {
   /// Returns when the listener has.
   void end();
 
+  /// What the delegate answers from now on.
+  std::atomic<bool> accepts = true;
   const std::shared_ptr<Ledger> ledger = std::make_shared<Ledger>();
   /// Of each connection, in order of acceptance; to be read when its end has been heard of.
   std::vector<std::weak_ptr<ClientConnection>> connections;

@@ -12,6 +12,7 @@
 
 #include "platform/Tallix.h"
 #include "platform/linux/sources/TallixFacility.h"
+#include "platform/linux/sources/TallixSampling.h"
 #include "tests/linux/LogRecorder.h"
 #include "tests/linux/TemporaryDirectory.h"
 

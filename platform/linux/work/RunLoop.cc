@@ -74,11 +74,11 @@ class LinuxRunLoop final : public RunLoop {
   }
 
   /// Puts a timer where its new fire date belongs.
-  void move(const LinuxTimer& timer) QUARVEL_REQUIRES(timersMutex) {
+  void move(LinuxTimer& timer) QUARVEL_REQUIRES(timersMutex) {
     auto node = timers_.extract(timer.place_);
     node.key() = timer.fireDate_;
-    // The place itself stays valid: it points to the node.
-    if (timers_.insert(std::move(node)) == timers_.begin()) changed_.notifyOne();
+    timer.place_ = timers_.insert(std::move(node));
+    if (timer.place_ == timers_.begin()) changed_.notifyOne();
   }
 
   /// Lets go of a timer.

@@ -1,0 +1,86 @@
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <memory>
+#include <random>
+#include <thread>
+#include <vector>
+
+#include "Statistics/Service/ZQReportingBlockThrottle.h"
+#include "platform/Clock.h"
+#include "platform/DeviceProperties.h"
+
+namespace quarvel {
+
+// What else of the platform the throttle's folder refers to.
+LogHandle ZQLogRegister(std::uint32_t, std::string_view, std::string_view, std::string_view, int,
+                        int) {
+  return nullptr;
+}
+Date CurrentDate() {
+  return Date{};
+}
+std::optional<bool> DevicePropertyBoolean(std::string_view) {
+  return std::nullopt;
+}
+
+namespace {
+
+using namespace std::chrono_literals;  // NOLINT(google-build-using-namespace): durations in tests
+
+/// Counts the blocks that are alive.
+class Token {
+ public:
+  explicit Token(std::atomic<int>& alive) : alive_(alive) { ++alive_; }
+  ~Token() { --alive_; }
+  Token(const Token&) = delete;
+  Token& operator=(const Token&) = delete;
+
+ private:
+  std::atomic<int>& alive_;
+};
+
+// On real threads, so that the thread sanitizer sees what a simulation with one baton hides.
+TEST(BlockThrottleOnThreads, CallersThatRaceWithTheFiringLoseAndRepeatNothing) {
+  constexpr std::size_t kCallers = 4;
+  constexpr std::size_t kMessages = 4'000;
+  constexpr std::size_t kKinds = 64;
+  std::vector<std::atomic<int>> runs(kCallers * kMessages);
+  std::vector<std::atomic<int>> runsOfKind(kKinds);
+  std::atomic<int> running = 0;
+  std::atomic<int> alive = 0;
+  const auto throttle = ZQReportingBlockThrottle::init();
+  std::vector<std::thread> callers;
+  for (std::size_t caller = 0; caller < kCallers; ++caller) {
+    callers.emplace_back([&, caller] {
+      std::minstd_rand random(static_cast<std::uint32_t>(caller) + 1);
+      for (std::size_t i = 0; i < kMessages; ++i) {
+        const std::size_t kind = random() % kKinds;
+        const double seconds = static_cast<double>(random() % 100) * 1e-4 - 1e-3;
+        throttle->addMessageBlock(
+            [&, token = std::make_unique<Token>(alive), id = caller * kMessages + i, kind] {
+              EXPECT_EQ(++running, 1);
+              ++runs[id];
+              ++runsOfKind[kind];
+              --running;
+            },
+            7, Payload(Dictionary{{"kind", kind}, {"_throttle_seconds", seconds}}), 3, 1);
+        std::this_thread::sleep_for(100us);
+      }
+    });
+  }
+  for (std::thread& caller : callers) caller.join();
+  throttle->waitForCompletion();
+  throttle->setShouldKeepRunning(false);
+  EXPECT_TRUE(throttle->timersInFlight().empty());
+  EXPECT_TRUE(throttle->unscheduledTimerKeys().empty());
+  // The last block leaves the map before it runs.
+  for (int pauses = 0; alive > 0 && pauses < 1'000; ++pauses) std::this_thread::sleep_for(10ms);
+  EXPECT_EQ(alive, 0) << "blocks neither run nor replaced";
+  for (const auto& count : runs) EXPECT_LE(count, 1);
+  for (const auto& count : runsOfKind) EXPECT_GE(count, 1);
+}
+
+}  // namespace
+}  // namespace quarvel

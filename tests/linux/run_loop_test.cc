@@ -1,0 +1,233 @@
+#include "platform/RunLoop.h"
+
+#include <gmock/gmock.h>
+#include <pthread.h>
+#include <sys/resource.h>
+
+#include <atomic>
+#include <future>
+#include <random>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "platform/WorkQueue.h"
+
+namespace quarvel {
+namespace {
+
+using namespace std::chrono_literals;  // NOLINT(google-build-using-namespace): durations in tests
+using testing::ElementsAre;
+using Clock = std::chrono::steady_clock;
+
+/// Longer than any of these tests takes on the slowest machine.
+constexpr auto kNever = 1h;
+
+/// A worker thread and when its body has ended.
+class Worker {
+ public:
+  explicit Worker(Block body) {
+    auto thread = CreateWorkerThread("tarnwick.test.worker",
+                                     [body = std::move(body), ended = std::move(ended_)]() mutable {
+                                       body();
+                                       ended.set_value();
+                                     });
+    thread->start();
+    // The handle goes; the thread runs on.
+  }
+  ~Worker() { await(); }
+  Worker(const Worker&) = delete;
+  Worker& operator=(const Worker&) = delete;
+
+  void await() {
+    if (done_.valid()) done_.get();
+  }
+
+ private:
+  std::promise<void> ended_;
+  std::future<void> done_ = ended_.get_future();
+};
+
+std::shared_ptr<RunLoopTimer> AddTimer(std::chrono::microseconds interval, Block block) {
+  auto timer = CreateRunLoopTimer(interval, std::move(block));
+  RunLoop::current().addTimer(timer);
+  return timer;
+}
+
+TEST(RunLoop, FiresTimersInTheOrderOfTheirDatesAndReturnsWhenNoneIsLeft) {
+  std::vector<std::string> fired;
+  const auto early = CreateRunLoopTimer(-1s, [&] { fired.push_back("overdue"); });
+  Worker([&] {
+    const auto begun = Clock::now();
+    const auto note = [&fired, begun](const char* name, std::chrono::milliseconds date) {
+      return [&fired, begun, name, date] {
+        fired.push_back(name);
+        EXPECT_GE(Clock::now() - begun, date);
+      };
+    };
+    AddTimer(60ms, note("60", 60ms));
+    AddTimer(20ms, note("20", 20ms));
+    AddTimer(40ms, [&] {
+      fired.push_back("40");
+      AddTimer(0ms, note("added by 40", 40ms));
+    });
+    RunLoop::current().addTimer(early);
+    RunLoop::current().addTimer(early);
+    RunLoop::current().run();
+    EXPECT_THAT(fired, ElementsAre("overdue", "20", "40", "added by 40", "60"));
+    RunLoop::current().addTimer(early);  // no longer valid
+    early->fireAfter(0s);
+    RunLoop::current().run();
+  }).await();
+  EXPECT_EQ(fired.size(), 5U);
+}
+
+// Each of these would take an hour if the waiting run loop did not notice.
+TEST(RunLoop, NoticesWhatAnotherThreadDoesToItsTimers) {
+  std::promise<std::shared_ptr<RunLoopTimer>> first;
+  std::promise<std::shared_ptr<RunLoopTimer>> second;
+  std::vector<std::string> fired;
+  const auto token = std::make_shared<int>();
+  Worker worker([&] {
+    first.set_value(AddTimer(kNever, [&] { fired.push_back("moved ahead"); }));
+    RunLoop::current().run();
+    fired.push_back("first run over");
+    second.set_value(AddTimer(kNever, [&, token] { fired.push_back("invalidated"); }));
+    RunLoop::current().run();
+    fired.push_back("second run over");
+  });
+  const auto moved = first.get_future().get();
+  std::this_thread::sleep_for(20ms);
+  moved->fireAfter(0s);
+  const auto invalidated = second.get_future().get();
+  std::this_thread::sleep_for(20ms);
+  invalidated->invalidate();
+  EXPECT_EQ(token.use_count(), 1) << "the block is destroyed by then";
+  worker.await();
+  EXPECT_THAT(fired, ElementsAre("moved ahead", "first run over", "second run over"));
+}
+
+TEST(RunLoop, ATimerThatIsMovedAwayDoesNotFireAtItsOldDate) {
+  Worker([] {
+    const auto begun = Clock::now();
+    const auto timer =
+        AddTimer(20ms, [begun] { EXPECT_GE(Clock::now() - begun, 100ms) << "fired too early"; });
+    AddTimer(10ms, [timer] { timer->fireAfter(100ms); });
+    RunLoop::current().run();
+  });
+}
+
+TEST(RunLoop, WaitsWithoutWakingUp) {
+  Worker([] {
+    const auto switches = [] {
+      rusage usage{};
+      getrusage(RUSAGE_THREAD, &usage);
+      return usage.ru_nvcsw;
+    };
+    AddTimer(300ms, [] {});
+    const long before = switches();
+    RunLoop::current().run();
+    EXPECT_LE(switches() - before, 3);
+  });
+}
+
+TEST(RunLoop, WhatIsStillOnItWhenItsThreadEndsNeverFires) {
+  const auto token = std::make_shared<int>();
+  std::shared_ptr<RunLoopTimer> timer;
+  std::atomic<bool> fired = false;
+  Worker([&] { timer = AddTimer(0s, [&fired, token] { fired = true; }); }).await();
+  timer->fireAfter(0s);
+  timer->invalidate();
+  EXPECT_FALSE(fired);
+  EXPECT_EQ(token.use_count(), 1);
+}
+
+// Each timer is moved and invalidated by several threads while its run loop fires.
+TEST(RunLoop, ATimerFiresOnceAtMostWhateverOtherThreadsDoToIt) {
+  constexpr std::size_t kTimers = 400;
+  constexpr std::uint32_t kThreads = 3;
+  std::vector<std::shared_ptr<RunLoopTimer>> timers;
+  std::vector<int> fired(kTimers);
+  std::vector<std::weak_ptr<int>> blocks;
+  for (std::size_t i = 0; i < kTimers; ++i) {
+    const auto token = std::make_shared<int>();
+    blocks.push_back(token);
+    timers.push_back(CreateRunLoopTimer(kNever, [&fired, i, token] { ++fired[i]; }));
+  }
+  std::vector<std::thread> others;
+  {
+    Worker worker([&] {
+      for (const auto& timer : timers) RunLoop::current().addTimer(timer);
+      RunLoop::current().run();
+    });
+    for (std::uint32_t seed = 0; seed < kThreads; ++seed) {
+      others.emplace_back([&, seed] {
+        std::minstd_rand random(seed + 1);
+        for (std::size_t i = 0; i < 4 * kTimers; ++i) {
+          const std::size_t chosen = random() % kTimers;
+          if (chosen % 4 == 0) {
+            timers[chosen]->invalidate();
+          } else {
+            timers[chosen]->fireAfter(std::chrono::microseconds(random() % 2000));
+          }
+        }
+        for (std::size_t i = 0; i < kTimers; ++i) {
+          if (i % 4 != 0) timers[i]->fireAfter(0s);
+        }
+        for (std::size_t i = 0; i < kTimers; i += 4) timers[i]->invalidate();
+      });
+    }
+    for (std::thread& other : others) other.join();
+  }
+  for (std::size_t i = 0; i < kTimers; ++i) {
+    EXPECT_EQ(fired[i], i % 4 == 0 ? 0 : 1) << i;
+    EXPECT_TRUE(blocks[i].expired()) << i;
+  }
+}
+
+TEST(WorkerThread, ShowsItsNameAndDestroysItsBodyWhenItEnds) {
+  std::promise<std::string> shown;
+  const auto token = std::make_shared<int>();
+  const std::weak_ptr<int> body = token;
+  {
+    const auto unstarted = CreateWorkerThread("unstarted", [token] { FAIL() << *token; });
+  }
+  std::future<void> destroyed;
+  struct Last {
+    std::promise<void> gone;
+    ~Last() { gone.set_value(); }
+  };
+  auto last = std::make_shared<Last>();
+  destroyed = last->gone.get_future();
+  CreateWorkerThread("tarnwick.test.worker", [&shown, last = std::move(last)] {
+    char name[16] = "";
+    pthread_getname_np(pthread_self(), name, sizeof(name));
+    shown.set_value(name);
+  })->start();
+  EXPECT_EQ(shown.get_future().get(), "test.worker");
+  destroyed.get();
+  EXPECT_EQ(body.use_count(), 1);
+}
+
+// The class of the server queue runs one block at a time, yet a sleeper lends its place.
+TEST(SleepThread, OfAQueuesBlockHoldsUpNoOtherQueue) {
+  const auto sleepers = CreateSerialQueue("sleepers", QualityOfService::userInteractive);
+  const auto others = CreateSerialQueue("others", QualityOfService::userInteractive);
+  std::atomic<bool> awake = false;
+  std::promise<void> asleep;
+  std::promise<bool> otherRan;
+  std::promise<void> over;
+  sleepers->async([&] {
+    asleep.set_value();
+    SleepThread(2s);
+    awake = true;
+    over.set_value();
+  });
+  asleep.get_future().get();
+  others->async([&] { otherRan.set_value(!awake); });
+  EXPECT_TRUE(otherRan.get_future().get());
+  over.get_future().get();
+}
+
+}  // namespace
+}  // namespace quarvel
