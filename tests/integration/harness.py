@@ -80,17 +80,16 @@ class Service:
 
     def __exit__(self, *_):
         try:
-            status = self.end()
+            self.end()
         finally:
             if self.process.poll() is None:
                 self.process.kill()
                 self.process.wait()
+            log = self.log()
             if self._temporary:
-                log = self.log()
                 self._temporary.cleanup()
-        if "ERROR: " in log and "Sanitizer" in log:
+        if "Sanitizer" in log or "runtime error:" in log:
             raise AssertionError(log)
-        self.status = status
 
     def log(self):
         return self.log_path.read_text(errors="replace") if self.log_path.exists() else ""

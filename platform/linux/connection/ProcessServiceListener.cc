@@ -52,6 +52,8 @@ Result<std::unique_ptr<SocketListener>> OpenListener() {
 
   Result<ListeningSocket> socket = OpenListeningSocket();
   if (!socket) return std::move(socket.error());
+  // With the socket ours, so that no second service touches the store of one that runs.
+  if (Outcome store = OpenProcessTelemetryStore(); !store) return std::move(store.error());
   return SocketListener::create(std::move(socket.value()), std::move(options));
 }
 
@@ -64,9 +66,6 @@ std::unique_ptr<SocketListener> OpenListenerOrExit() {
     ZQ_LOG(nullptr, error, "the service cannot start: {}", listener.error().description());
     ExitProcess(1);
   }
-  // After the socket: of two services that start at once, the one that may not listen has not
-  // touched the other's store.
-  static_cast<void>(ProcessTelemetryStore());
   FollowVerbosePreferences();
   return std::move(listener.value());
 }

@@ -1,6 +1,7 @@
 #include "platform/linux/store/ProcessStore.h"
 
 #include <filesystem>
+#include <system_error>
 #include <utility>
 
 #include "platform/Clock.h"
@@ -15,12 +16,18 @@ namespace quarvel {
 
 namespace {
 
-std::shared_ptr<TelemetryStore> OpenOrExit() {
-  ZQ_FUNCTION("ProcessTelemetryStore");
+using Opened = Result<std::shared_ptr<TelemetryStore>>;
+
+Opened OpenAsConfigured() {
   const Configuration& configuration = Configuration::process();
   TelemetryStore::Options options;
-  options.path = configuration.store.path.empty() ? Directories::process().state / "telemetry.db"
-                                                  : configuration.store.path;
+  options.path = configuration.store.path;
+  if (options.path.empty()) {
+    // The state directory is the service's own to make; one that somebody named is not.
+    std::error_code failure;
+    std::filesystem::create_directories(Directories::process().state, failure);
+    options.path = Directories::process().state / "telemetry.db";
+  }
   options.sync = configuration.store.sync;
   options.maximumBytes = configuration.store.maximumBytes;
   options.maximumAge = configuration.store.maximumAge;
@@ -29,22 +36,33 @@ std::shared_ptr<TelemetryStore> OpenOrExit() {
   }
   options.clock = CurrentDate;
   auto store = TelemetryStore::open(std::move(options));
-  if (!store) {
-    ZQ_LOG(nullptr, error, "the service cannot start: {}", store.error().description());
-    ExitProcess(1);
-  }
-  return std::move(store.value());
+  if (!store) return store.error();
+  return std::shared_ptr<TelemetryStore>(std::move(store.value()));
+}
+
+const Opened& OpenedStore() {
+  static const Opened& opened = *[] {
+    const auto* result = new Opened(OpenAsConfigured());
+    if (*result) AtProcessExit([result] { result->value()->close(); });
+    return result;
+  }();
+  return opened;
 }
 
 }  // namespace
 
+Outcome OpenProcessTelemetryStore() {
+  if (!OpenedStore()) return OpenedStore().error();
+  return Success();
+}
+
 const std::shared_ptr<TelemetryStore>& ProcessTelemetryStore() {
-  static const auto& store = *[] {
-    const auto* opened = new std::shared_ptr<TelemetryStore>(OpenOrExit());
-    AtProcessExit([opened] { (*opened)->close(); });
-    return opened;
-  }();
-  return store;
+  ZQ_FUNCTION("ProcessTelemetryStore");
+  if (!OpenedStore()) {
+    ZQ_LOG(nullptr, error, "the service cannot go on: {}", OpenedStore().error().description());
+    ExitProcess(1);
+  }
+  return OpenedStore().value();
 }
 
 }  // namespace quarvel

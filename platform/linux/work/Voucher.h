@@ -56,9 +56,7 @@ class VoucherHold {
   VoucherHold(const VoucherHold&) = delete;
   VoucherHold& operator=(const VoucherHold&) = delete;
   ~VoucherHold() {
-    if (!voucher_) return;
-    if (direct_ && LastOf(voucher_->directHolds_)) voucher_->carriedOut();
-    if (LastOf(voucher_->holds_)) voucher_->completed();
+    if (voucher_) voucher_->release(direct_);
   }
 
   [[nodiscard]] const std::shared_ptr<Voucher>& voucher() const { return voucher_; }
@@ -74,12 +72,7 @@ class VoucherHold {
  private:
   VoucherHold(std::shared_ptr<Voucher> voucher, bool direct)
       : voucher_(std::move(voucher)), direct_(direct) {
-    if (!voucher_) return;
-    voucher_->holds_.fetch_add(1, std::memory_order_relaxed);
-    if (direct_) voucher_->directHolds_.fetch_add(1, std::memory_order_relaxed);
-  }
-  static bool LastOf(std::atomic<std::uint32_t>& holds) {
-    return holds.fetch_sub(1, std::memory_order_acq_rel) == 1;
+    if (voucher_) voucher_->hold(direct_);
   }
 
   std::shared_ptr<Voucher> voucher_;
