@@ -243,6 +243,7 @@ void OrientationSensor::want(bool wanted) {
   wanted_ = wanted;
   if (wanted) ++attempts_;
   if (!running_) {
+    if (!wanted) return;
     wakeDescriptor_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
     const int status = StartThread("tarnwick.quarvel.sensor", 0, [this] { run(); });
     if (status != 0) {

@@ -34,8 +34,10 @@ TallixSubscription::TallixSubscription(const TallixChannelSet& channels) {
         contents, [](const DriverChannel* channel) { return channel->pattern.has_value(); });
     CounterFile file(path, report ? CounterFile::Extent::lines : CounterFile::Extent::oneInteger);
     if (const int status = file.open(); status != 0) {
-      ZQ_LOG(nullptr, error, "driver channel {} is left out: {}", contents.front()->description(),
-             std::generic_category().message(status));
+      for (const DriverChannel* channel : contents) {
+        ZQ_LOG(nullptr, error, "driver channel {} is left out: {}", channel->description(),
+               std::generic_category().message(status));
+      }
       continue;
     }
     opened.emplace(path, sources_.size());
