@@ -33,11 +33,11 @@ def eventually(condition, what):
 
 
 class Service:
-    """A running quarveld; a context manager that ends it in order."""
+    """A quarveld with directories of its own."""
 
-    def __init__(self, configuration="", directory=None, wrapper=()):
-        self._temporary = None if directory else tempfile.TemporaryDirectory(prefix="quarvel-test-")
-        self.directory = pathlib.Path(directory or self._temporary.name)
+    def __init__(self, configuration="", wrapper=()):
+        self._directory = tempfile.TemporaryDirectory(prefix="quarvel-test-")
+        self.directory = pathlib.Path(self._directory.name)
         for name in ("run", "state", "etc/preferences", "diagnostics"):
             (self.directory / name).mkdir(parents=True, exist_ok=True)
         (self.directory / "etc/quarvel.toml").write_text(configuration)
@@ -75,21 +75,19 @@ class Service:
             self.process.send_signal(how)
         return self.process.wait(PATIENCE)
 
-    def __enter__(self):
-        return self.start()
-
-    def __exit__(self, *_):
+    def finish(self):
+        """Ends it and looks whether a sanitizer has spoken."""
         try:
             self.end()
         finally:
             if self.process.poll() is None:
                 self.process.kill()
                 self.process.wait()
-            log = self.log()
-            if self._temporary:
-                self._temporary.cleanup()
-        if "Sanitizer" in log or "runtime error:" in log:
-            raise AssertionError(log)
+        if "Sanitizer" in self.log() or "runtime error:" in self.log():
+            raise AssertionError(self.log())
+
+    def tidy(self):
+        self._directory.cleanup()
 
     def log(self):
         return self.log_path.read_text(errors="replace") if self.log_path.exists() else ""
@@ -131,7 +129,11 @@ class Client:
     def __init__(self, service):
         self._socket = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
         self._socket.settimeout(PATIENCE)
-        self._socket.connect(str(service.socket))
+        try:
+            self._socket.connect(str(service.socket))
+        except OSError:
+            self._socket.close()
+            raise
         self._unpacker = msgpack.Unpacker(raw=False, timestamp=3)
         self._next = 0
         self.replies = {}
@@ -205,14 +207,17 @@ class CallError(Exception):
 
 
 class ServiceTest(unittest.TestCase):
-    def service(self, configuration="", **options):
+    def prepared(self, configuration="", **options):
+        """A service that is not started yet; its directory goes with the test."""
         service = Service(configuration, **options)
-        self.enterContext(service) if hasattr(self, "enterContext") else self._enter(service)
+        self.addCleanup(service.tidy)
         return service
 
-    def _enter(self, context):
-        context.__enter__()
-        self.addCleanup(context.__exit__, None, None, None)
+    def service(self, configuration="", **options):
+        service = self.prepared(configuration, **options)
+        service.start()
+        self.addCleanup(service.finish)
+        return service
 
     def client(self, service):
         client = Client(service)

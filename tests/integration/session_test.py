@@ -5,11 +5,10 @@ import json
 import pathlib
 import sqlite3
 import subprocess
-import tempfile
 import time
 import unittest
 
-from harness import PATIENCE, PREFIX, CallError, Service, ServiceTest, eventually
+from harness import PATIENCE, PREFIX, CallError, ServiceTest, eventually
 
 NO_BACKENDS = "[agent]\nbackends = []\n"
 
@@ -217,23 +216,21 @@ class Ends(ServiceTest):
                 self.assertIn(word, errors[0])
 
         running = self.service()
-        second = Service()
+        second = self.prepared()
         second.environment["QUARVEL_SOCKET"] = str(running.socket)
         refuse(second, str(running.socket))
         self.client(running).call("getAllReporters:")
 
-        with tempfile.TemporaryDirectory(prefix="quarvel-test-") as path:
-            newer = Service(directory=path)
-            with newer:
-                pass
-            with contextlib.closing(sqlite3.connect(newer.directory / "state/telemetry.db")) as store:
-                store.execute("PRAGMA user_version = 99")
-            refuse(newer, "telemetry.db", "99")
+        newer = self.service()
+        newer.end()
+        with contextlib.closing(sqlite3.connect(newer.directory / "state/telemetry.db")) as store:
+            store.execute("PRAGMA user_version = 99")
+        refuse(newer, "telemetry.db", "99")
 
-        wrong = Service('[limits]\ndepth = "deep"\n')
+        wrong = self.prepared('[limits]\ndepth = "deep"\n')
         refuse(wrong, "quarvel.toml", "depth")
 
-        unwritable = Service()
+        unwritable = self.prepared()
         (unwritable.directory / "file").write_text("")
         unwritable.environment["STATE_DIRECTORY"] = str(unwritable.directory / "file/state")
         refuse(unwritable, "file/state")
