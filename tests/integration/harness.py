@@ -60,13 +60,14 @@ class Service:
             self.process = subprocess.Popen(
                 [*self._wrapper, PREFIX / "sbin/quarveld"], env=self.environment, stderr=log
             )
+
         def up():
             if self.process.poll() is not None:
                 raise AssertionError(f"quarveld ended: {self.log()}")
-            with contextlib.suppress(OSError):
-                Client(self).close()
-                return True
-        eventually(up, "the service accepts clients")
+            with contextlib.suppress(OSError), contextlib.closing(Client(self)) as client:
+                return client.call("getAllReporters:") is not None
+
+        eventually(up, "the service answers")
         return self
 
     def end(self, how=signal.SIGTERM):
