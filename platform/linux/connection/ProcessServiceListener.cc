@@ -10,7 +10,6 @@
 #include "platform/Process.h"
 #include "platform/ServiceListener.h"
 #include "platform/linux/connection/SocketListener.h"
-#include "platform/linux/store/ProcessStore.h"
 #include "platform/linux/system/Configuration.h"
 #include "platform/linux/system/Directories.h"
 #include "platform/linux/work/Work.h"
@@ -51,8 +50,6 @@ Result<std::unique_ptr<SocketListener>> OpenListener() {
 
   Result<ListeningSocket> socket = OpenListeningSocket();
   if (!socket) return std::move(socket.error());
-  // With the socket ours, so that no second service touches the store of one that runs.
-  if (Outcome store = OpenProcessTelemetryStore(); !store) return std::move(store.error());
   return SocketListener::create(std::move(socket.value()), std::move(options));
 }
 
