@@ -283,6 +283,7 @@ class RecordedVoucher final : public Voucher {
   [[nodiscard]] std::size_t bytes() const override { return size_; }
 
  private:
+  void carriedOut() override { ++carriedOut_; }
   void completed() override {
     ++completions_;
     completions_.notify_all();
@@ -304,7 +305,7 @@ TEST(VoucherTest, CompletesOnceAfterTheLastBlockThatCameOfIt) {
   std::latch last(1);
   {
     const VoucherHold hold(voucherOf(1, completions));
-    const VoucherScope scope(hold);
+    const VoucherScope scope(VoucherScope::Of::call, hold);
     server->async([&] {
       for (int i = 0; i < 100; ++i) {
         session->async([&] { BackgroundQueue().async([&] { afterwards += completions; }); });
@@ -336,7 +337,7 @@ TEST(VoucherTest, DelayedBlockLetsItsCallCompleteAndRunsUnderItAgain) {
   std::latch ran(1);
   {
     const VoucherHold hold(voucher);
-    const VoucherScope scope(hold);
+    const VoucherScope scope(VoucherScope::Of::call, hold);
     queue->after(20ms, [&] {
       EXPECT_EQ(completions, 1);
       EXPECT_EQ(VoucherHold::current().voucher(), voucher);
@@ -355,7 +356,7 @@ TEST(VoucherTest, DelayedBlocksBeyondTheBoundHoldTheirCalls) {
   const auto queue = serverQueue();
   const auto delay = [&](std::chrono::milliseconds time, std::shared_ptr<Voucher> voucher) {
     const VoucherHold hold(std::move(voucher));
-    const VoucherScope scope(hold);
+    const VoucherScope scope(VoucherScope::Of::call, hold);
     queue->after(time, [] {});
   };
   delay(20ms, voucherOf(Keeper::kUnheldBytes, within));

@@ -10,6 +10,8 @@
 #include "platform/Process.h"
 #include "platform/ServiceListener.h"
 #include "platform/linux/connection/SocketListener.h"
+#include "platform/linux/sources/VerbosePreferences.h"
+#include "platform/linux/store/ProcessStore.h"
 #include "platform/linux/system/Configuration.h"
 #include "platform/linux/system/Directories.h"
 #include "platform/linux/work/Work.h"
@@ -62,6 +64,10 @@ std::unique_ptr<SocketListener> OpenListenerOrExit() {
     ZQ_LOG(nullptr, error, "the service cannot start: {}", listener.error().description());
     ExitProcess(1);
   }
+  // After the socket: of two services that start at once, the one that may not listen has not
+  // touched the other's store.
+  static_cast<void>(ProcessTelemetryStore());
+  FollowVerbosePreferences();
   return std::move(listener.value());
 }
 

@@ -188,7 +188,7 @@ void SocketConnection::dispatch(const Request& request, std::size_t frameBytes) 
     for (const PayloadValue argument : request.params.items()) arguments_.push_back(argument);
     desk_->begin(frameBytes);
     const VoucherHold hold(call);
-    const VoucherScope scope(hold);
+    const VoucherScope scope(VoucherScope::Of::call, hold);
     if (auto wrong = method->invoke(*method, *object_, arguments_, call)) {
       error = BadArgumentsError(std::move(*wrong));
     }

@@ -1,6 +1,8 @@
 #include "platform/Clock.h"
 
 #include <ctime>
+#include <iomanip>
+#include <sstream>
 
 namespace quarvel {
 
@@ -13,8 +15,9 @@ std::string LocalDateText(Date date, const char* pattern) {
       std::chrono::system_clock::to_time_t(std::chrono::floor<std::chrono::seconds>(date));
   std::tm local{};
   localtime_r(&seconds, &local);
-  char text[256];
-  return {text, std::strftime(text, sizeof text, pattern, &local)};
+  std::ostringstream text;
+  text << std::put_time(&local, pattern);
+  return text.str();
 }
 
 }  // namespace quarvel

@@ -11,7 +11,8 @@ namespace quarvel {
 /// Stands for one call of a client for as long as any work that came of it is still to be done.
 /// A block that is queued while a voucher is current holds it until the block has run, and so do
 /// the blocks that this one queues; so a connection knows how much of what it took in is still
-/// waiting anywhere, without the blocks knowing of connections.
+/// waiting anywhere, without the blocks knowing of connections. It is told twice: when the call
+/// itself has been carried out, and when nothing that came of it is left.
 class Voucher {
  public:
   virtual ~Voucher() = default;
@@ -43,18 +44,21 @@ class Voucher {
 class VoucherHold {
  public:
   VoucherHold() = default;
-  explicit VoucherHold(std::shared_ptr<Voucher> voucher) : voucher_(std::move(voucher)) {
-    if (voucher_) voucher_->hold();
-  }
-  VoucherHold(VoucherHold&& other) noexcept : voucher_(std::move(other.voucher_)) {}
+  /// The call's own hold.
+  explicit VoucherHold(std::shared_ptr<Voucher> voucher) : VoucherHold(std::move(voucher), true) {}
+  VoucherHold(VoucherHold&& other) noexcept
+      : voucher_(std::move(other.voucher_)), direct_(other.direct_) {}
   VoucherHold& operator=(VoucherHold&& other) noexcept {
     std::swap(voucher_, other.voucher_);
+    std::swap(direct_, other.direct_);
     return *this;
   }
   VoucherHold(const VoucherHold&) = delete;
   VoucherHold& operator=(const VoucherHold&) = delete;
   ~VoucherHold() {
-    if (voucher_) voucher_->release();
+    if (!voucher_) return;
+    if (direct_ && LastOf(voucher_->directHolds_)) voucher_->carriedOut();
+    if (LastOf(voucher_->holds_)) voucher_->completed();
   }
 
   [[nodiscard]] const std::shared_ptr<Voucher>& voucher() const { return voucher_; }
@@ -62,21 +66,40 @@ class VoucherHold {
 
   /// A further hold on the voucher that is current on this thread; empty when none is.
   [[nodiscard]] static VoucherHold current();
+  /// A further hold for work that came of a block.
+  [[nodiscard]] static VoucherHold indirect(std::shared_ptr<Voucher> voucher) {
+    return VoucherHold(std::move(voucher), false);
+  }
 
  private:
+  VoucherHold(std::shared_ptr<Voucher> voucher, bool direct)
+      : voucher_(std::move(voucher)), direct_(direct) {
+    if (!voucher_) return;
+    voucher_->holds_.fetch_add(1, std::memory_order_relaxed);
+    if (direct_) voucher_->directHolds_.fetch_add(1, std::memory_order_relaxed);
+  }
+  static bool LastOf(std::atomic<std::uint32_t>& holds) {
+    return holds.fetch_sub(1, std::memory_order_acq_rel) == 1;
+  }
+
   std::shared_ptr<Voucher> voucher_;
+  bool direct_ = false;
 };
 
 /// Makes a voucher (or none) current on this thread for a scope.
 class VoucherScope {
  public:
-  explicit VoucherScope(const VoucherHold& hold);
+  /// Who runs in the scope: the call itself, whose blocks are part of carrying it out, or a block,
+  /// whose further blocks are not.
+  enum class Of : std::uint8_t { call, block };
+  VoucherScope(Of of, const VoucherHold& hold);
   ~VoucherScope();
   VoucherScope(const VoucherScope&) = delete;
   VoucherScope& operator=(const VoucherScope&) = delete;
 
  private:
   const VoucherHold* previous_;
+  Of previousOf_;
 };
 
 }  // namespace quarvel
