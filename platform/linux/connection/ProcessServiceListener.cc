@@ -52,8 +52,6 @@ Result<std::unique_ptr<SocketListener>> OpenListener() {
 
   Result<ListeningSocket> socket = OpenListeningSocket();
   if (!socket) return std::move(socket.error());
-  // With the socket ours, so that no second service touches the store of one that runs.
-  if (Outcome store = OpenProcessTelemetryStore(); !store) return std::move(store.error());
   return SocketListener::create(std::move(socket.value()), std::move(options));
 }
 

@@ -16,9 +16,8 @@ namespace quarvel {
 
 namespace {
 
-using Opened = Result<std::shared_ptr<TelemetryStore>>;
-
-Opened OpenAsConfigured() {
+std::shared_ptr<TelemetryStore> OpenOrExit() {
+  ZQ_FUNCTION("ProcessTelemetryStore");
   const Configuration& configuration = Configuration::process();
   TelemetryStore::Options options;
   options.path = configuration.store.path;
@@ -36,33 +35,22 @@ Opened OpenAsConfigured() {
   }
   options.clock = CurrentDate;
   auto store = TelemetryStore::open(std::move(options));
-  if (!store) return store.error();
-  return std::shared_ptr<TelemetryStore>(std::move(store.value()));
-}
-
-const Opened& OpenedStore() {
-  static const Opened& opened = *[] {
-    const auto* result = new Opened(OpenAsConfigured());
-    if (*result) AtProcessExit([result] { result->value()->close(); });
-    return result;
-  }();
-  return opened;
+  if (!store) {
+    ZQ_LOG(nullptr, error, "the service cannot start: {}", store.error().description());
+    ExitProcess(1);
+  }
+  return std::move(store.value());
 }
 
 }  // namespace
 
-Outcome OpenProcessTelemetryStore() {
-  if (!OpenedStore()) return OpenedStore().error();
-  return Success();
-}
-
 const std::shared_ptr<TelemetryStore>& ProcessTelemetryStore() {
-  ZQ_FUNCTION("ProcessTelemetryStore");
-  if (!OpenedStore()) {
-    ZQ_LOG(nullptr, error, "the service cannot go on: {}", OpenedStore().error().description());
-    ExitProcess(1);
-  }
-  return OpenedStore().value();
+  static const auto& store = *[] {
+    const auto* opened = new std::shared_ptr<TelemetryStore>(OpenOrExit());
+    AtProcessExit([opened] { (*opened)->close(); });
+    return opened;
+  }();
+  return store;
 }
 
 }  // namespace quarvel
