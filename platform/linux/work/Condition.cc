@@ -69,8 +69,8 @@ class LinuxCondition final : public Condition, public std::enable_shared_from_th
     ++waiters_;
     bool inTime = true;
     while (signals_ == 0 && inTime) {
-      const Date end = std::clamp(std::min(deadline, waits().latest.load()), kEarliestDeadline,
-                                  kLatestDeadline);
+      const Date end =
+          std::clamp(std::min(deadline, waits().latest.load()), kEarliestDeadline, kLatestDeadline);
       changed_.waitUntil(mutex_, end);
       inTime = std::chrono::system_clock::now() < std::min(deadline, waits().latest.load());
     }

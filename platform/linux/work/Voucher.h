@@ -20,8 +20,12 @@ class Voucher {
   [[nodiscard]] virtual std::size_t bytes() const = 0;
 
  protected:
-  /// Called once, when the last hold goes, on whatever thread that is. Must not block. A hold that
-  /// is taken later (a delayed block's, `Keeper`) has no effect.
+  // Each is called once, on whatever thread it comes to pass on. Must not block.
+
+  /// The call, and the blocks that it queued itself, have run.
+  virtual void carriedOut() = 0;
+  /// The last hold has gone; after `carriedOut`. A hold that is taken later (a delayed block's,
+  /// `Keeper`) has no effect.
   virtual void completed() = 0;
 
  private:
@@ -29,15 +33,20 @@ class Voucher {
 
   static constexpr std::uint32_t kCompleted = std::uint32_t{1} << 31;
 
-  void hold() { holds_.fetch_add(1, std::memory_order_relaxed); }
-  void release() {
+  void hold(bool direct) {
+    holds_.fetch_add(1, std::memory_order_relaxed);
+    if (direct) directHolds_.fetch_add(1, std::memory_order_relaxed);
+  }
+  void release(bool direct) {
+    if (direct && directHolds_.fetch_sub(1, std::memory_order_acq_rel) == 1) carriedOut();
     if (holds_.fetch_sub(1, std::memory_order_acq_rel) != 1) return;
     // Somebody may take hold again just now, and then it is theirs to complete.
     std::uint32_t none = 0;
     if (holds_.compare_exchange_strong(none, kCompleted, std::memory_order_acq_rel)) completed();
   }
 
-  std::atomic<std::uint32_t> holds_{0};  // plus kCompleted, once it has
+  std::atomic<std::uint32_t> holds_{0};        // plus kCompleted, once it has
+  std::atomic<std::uint32_t> directHolds_{0};  // the call's own, and its own blocks'
 };
 
 /// Keeps a voucher open. May be empty.
@@ -56,9 +65,7 @@ class VoucherHold {
   VoucherHold(const VoucherHold&) = delete;
   VoucherHold& operator=(const VoucherHold&) = delete;
   ~VoucherHold() {
-    if (!voucher_) return;
-    if (direct_ && LastOf(voucher_->directHolds_)) voucher_->carriedOut();
-    if (LastOf(voucher_->holds_)) voucher_->completed();
+    if (voucher_) voucher_->release(direct_);
   }
 
   [[nodiscard]] const std::shared_ptr<Voucher>& voucher() const { return voucher_; }
@@ -68,18 +75,13 @@ class VoucherHold {
   [[nodiscard]] static VoucherHold current();
   /// A further hold for work that came of a block.
   [[nodiscard]] static VoucherHold indirect(std::shared_ptr<Voucher> voucher) {
-    return VoucherHold(std::move(voucher), false);
+    return {std::move(voucher), false};
   }
 
  private:
   VoucherHold(std::shared_ptr<Voucher> voucher, bool direct)
       : voucher_(std::move(voucher)), direct_(direct) {
-    if (!voucher_) return;
-    voucher_->holds_.fetch_add(1, std::memory_order_relaxed);
-    if (direct_) voucher_->directHolds_.fetch_add(1, std::memory_order_relaxed);
-  }
-  static bool LastOf(std::atomic<std::uint32_t>& holds) {
-    return holds.fetch_sub(1, std::memory_order_acq_rel) == 1;
+    if (voucher_) voucher_->hold(direct_);
   }
 
   std::shared_ptr<Voucher> voucher_;
