@@ -2,13 +2,13 @@
 
 #include <poll.h>
 #include <pthread.h>
-#include <signal.h>
 #include <sys/eventfd.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
+#include <csignal>
 #include <cstring>
 #include <type_traits>
 #include <utility>
@@ -149,7 +149,7 @@ void Client::Channel::sendGathered() {
   if (!writing_) write(true);
 }
 
-std::optional<std::uint32_t> Client::Channel::await(AnyReply reply) {
+std::optional<std::uint32_t> Client::Channel::await(AnyReply&& reply) {
   if (reply.index() == 0) return std::nullopt;
   // A call that is never answered keeps its number when the numbers have gone round.
   while (!pending_.try_emplace(nextCall_, std::move(reply)).second) ++nextCall_;

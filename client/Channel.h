@@ -62,7 +62,7 @@ class __attribute__((visibility("hidden"))) Client::Channel
 
   enum class Written { all, some, failed };
 
-  std::optional<std::uint32_t> await(AnyReply reply) QUARVEL_REQUIRES(mutex_);
+  std::optional<std::uint32_t> await(AnyReply&& reply) QUARVEL_REQUIRES(mutex_);
   void sendWhatIsDue(bool gather) QUARVEL_REQUIRES(mutex_);
   void write(bool mayWait) QUARVEL_REQUIRES(mutex_);
   [[nodiscard]] Written writeSending(bool mayWait);

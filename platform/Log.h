@@ -22,7 +22,8 @@ using LogHandle = const LogScope*;
 /// Registers a scope. Called once a scope; calling again with the same `code` yields the same
 /// handle. `code`: the scope's four characters, the first in the most significant byte. The texts
 /// must be string literals. `verboseKey` is the key, in the preferences domain `subsystem`, that
-/// switches the scope's verbose lines on; the facility follows it by itself.
+/// switches the scope's verbose lines on; the facility follows it by itself. Bit n of `levelMask`
+/// admits the level of number n.
 [[nodiscard]] LogHandle ZQLogRegister(std::uint32_t code, std::string_view scope,
                                       std::string_view subsystem, std::string_view verboseKey,
                                       int options, int levelMask);

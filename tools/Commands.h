@@ -18,7 +18,7 @@ struct Options {
 
 struct MessageOptions {
   std::optional<std::int64_t> session;
-  std::optional<std::uint64_t> last;
+  std::optional<std::int64_t> last;
   bool follow = false;
 };
 

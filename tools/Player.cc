@@ -44,6 +44,11 @@ std::optional<std::int64_t> SessionOf(const script::Call& call) {
 
 Player::Player(Client client) : client_(std::move(client)) {}
 
+Player::~Player() {
+  MutexLock lock(replies_->mutex);
+  replies_->closing = true;
+}
+
 Outcome Player::play(const script::Step& step) {
   if (const auto* call = std::get_if<script::Call>(&step.action)) return playCall(*call);
   if (const auto* expect = std::get_if<script::Expect>(&step.action)) return playExpect(*expect);
@@ -71,13 +76,14 @@ Outcome Player::playCall(const script::Call& call) {
                [replies = replies_, call, start, session, given](const Result<Value>& reply) {
                  const Value value = reply ? reply.value() : AsValue(reply.error());
                  MutexLock lock(replies->mutex);
+                 if (replies->closing) return;
                  PrintReply(call, reply.ok(), value);
                  if (start) {
                    replies->starts.erase(replies->starts.find(*session));
                  } else {
                    --replies->outstanding;
                  }
-                 replies->last = value;
+                 if (call.wait) replies->last = value;
                  *given = true;
                  replies->changed.notifyAll();
                });
@@ -91,7 +97,7 @@ Outcome Player::playCall(const script::Call& call) {
 
 Outcome Player::playExpect(const script::Expect& expect) {
   MutexLock lock(replies_->mutex);
-  if (!replies_->last) return Failed("Nothing has been replied yet that could be expected.");
+  if (!replies_->last) return Failed("No reply has been waited for yet that could be expected.");
   // As printed, so that a script can expect what it has seen.
   const std::string last = JsonText(*replies_->last);
   const auto printed = ValueFromJson(last);
@@ -110,9 +116,8 @@ Outcome Player::finish() {
     MutexLock lock(replies_->mutex);
     const auto due = [this](std::int64_t session) { return stopped_.contains(session); };
     while (replies_->outstanding > 0) replies_->changed.wait(replies_->mutex);
-    const auto& starts = replies_->starts;
     bool inTime = true;
-    while (inTime && std::any_of(starts.begin(), starts.end(), due)) {
+    while (inTime && std::any_of(replies_->starts.begin(), replies_->starts.end(), due)) {
       inTime = replies_->changed.waitUntil(replies_->mutex, deadline);
     }
   }

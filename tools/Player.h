@@ -18,6 +18,10 @@ namespace quarvel {
 class Player {
  public:
   explicit Player(Client client);
+  /// Closes the connection; what is answered only because of that is not printed.
+  ~Player();
+  Player(const Player&) = delete;
+  Player& operator=(const Player&) = delete;
 
   /// Errors: an expectation that is not met, a connection that is lost.
   [[nodiscard]] Outcome play(const script::Step& step);
@@ -32,7 +36,8 @@ class Player {
     ConditionVariable changed;
     std::size_t outstanding QUARVEL_GUARDED_BY(mutex) = 0;  // without starts
     std::multiset<std::int64_t> starts QUARVEL_GUARDED_BY(mutex);
-    std::optional<Value> last QUARVEL_GUARDED_BY(mutex);
+    std::optional<Value> last QUARVEL_GUARDED_BY(mutex);  // of those waited for
+    bool closing QUARVEL_GUARDED_BY(mutex) = false;
   };
 
   [[nodiscard]] Outcome playCall(const script::Call& call);

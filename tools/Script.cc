@@ -54,7 +54,7 @@ Result<Value> Sent(const Value& written) {
   if (dictionary == nullptr) return written;
   if (const Value* date = dictionary->find("$date"); date != nullptr && dictionary->size() == 1) {
     const auto read = date->string() ? DateFromText(*date->string()) : std::nullopt;
-    if (!read) return Wrong("\"$date\" takes a text such as \"2026-01-31T14:25:01.5Z\".");
+    if (!read) return Wrong(R"("$date" takes a text such as "2026-01-31T14:25:01.5Z".)");
     return Value(*read);
   }
   if (const Value* bytes = dictionary->find("$bytes");
@@ -81,7 +81,7 @@ std::optional<Error> WrongKey(const Dictionary& line, std::initializer_list<Key>
   return std::nullopt;
 }
 
-Result<std::variant<Call, Sleep, Expect>> ParseCall(const Dictionary& line, const Value& name) {
+Result<Action> ParseCall(const Dictionary& line, const Value& name) {
   if (auto wrong = WrongKey(line, {"call", "args", "wait"})) return *wrong;
   if (name.string() == nullptr) return Wrong("\"call\" takes an operation's full keyword name.");
   const Value* arguments = line.find("args");
@@ -109,7 +109,7 @@ bool IsLeftOut(std::string_view line) {
   return first == std::string_view::npos || line[first] == '#';
 }
 
-Result<std::variant<Call, Sleep, Expect>> Parse(std::string_view line) {
+Result<Action> Parse(std::string_view line) {
   auto json = ValueFromJson(line);
   if (!json) return std::move(json.error());
   const Dictionary* object = json.value().dictionary();

@@ -11,18 +11,16 @@
 #include "base/Error.h"
 #include "base/Value.h"
 
-namespace quarvel {
-
 /// A script of calls: JSON Lines, an object a line. Empty lines and lines that begin with "#" are
 /// left out.
-namespace script {
+namespace quarvel::script {
 
 /// {"call": "<full keyword name>", "args": […], "wait": true or false}
 struct Call {
   std::string operation;
   List arguments;  // as written, for printing
   List values;     // as sent: {"$date": "<RFC 3339>"} is a date, {"$bytes": "<base64>"} bytes
-  bool wait;       // for the reply, before the next line
+  bool wait;  // for the reply, before the next line; a start is not waited for unless it says so
 };
 
 /// {"sleep": seconds}
@@ -30,21 +28,23 @@ struct Sleep {
   std::chrono::duration<double> duration;
 };
 
-/// {"expect": value}: what the last reply must have been
+/// {"expect": value}: what the last reply that was waited for must have been, as it was printed: a
+/// result, or an error's dictionary. Replies that come in between, such as a start's, do not count.
 struct Expect {
   Value value;
 };
 
+using Action = std::variant<Call, Sleep, Expect>;
+
 struct Step {
   std::size_t line;  // counted from 1
-  std::variant<Call, Sleep, Expect> action;
+  Action action;
 };
 
-/// Reads one line of a script. Errors: domain "quarvel.script", with a reason.
-[[nodiscard]] Result<std::variant<Call, Sleep, Expect>> Parse(std::string_view line);
+/// Reads one line of a script. Errors: domain "quarvel.script" or "quarvel.json", with a reason.
+[[nodiscard]] Result<Action> Parse(std::string_view line);
 
 /// Whether a line is left out.
 [[nodiscard]] bool IsLeftOut(std::string_view line);
 
-}  // namespace script
-}  // namespace quarvel
+}  // namespace quarvel::script

@@ -168,7 +168,7 @@ Outcome StoreReader::messages(const MessageQuery& query,
   Statement rows(database_.get(), sql);
   rows.bind(1, query.afterID);
   if (query.reporterID) rows.bind(2, *query.reporterID);
-  if (query.last) rows.bind(3, static_cast<std::int64_t>(*query.last));
+  if (query.last) rows.bind(3, *query.last);
   while (rows.next()) {
     each({rows.integer(0), rows.isNull(1) ? std::nullopt : std::optional(rows.integer(1)),
           rows.integer(2), rows.text(3), static_cast<std::uint16_t>(rows.integer(4)),

@@ -46,7 +46,7 @@ class StoreReader {
   struct MessageQuery {
     std::int64_t afterID = 0;
     std::optional<std::int64_t> reporterID;
-    std::optional<std::uint64_t> last;
+    std::optional<std::int64_t> last;
   };
 
   /// telemetry.db in the first directory that has one of `$STATE_DIRECTORY`,

@@ -20,16 +20,23 @@ using vocabulary::NameOf;
 // Rows are printed in portions of this many, so that a store of any size is read in little memory.
 constexpr std::size_t kPortion = 1'000;
 
-// For people: local time, milliseconds.
+// For people: local time; no year, since nothing is kept that long.
 std::string LocalTime(Date date) {
   const auto seconds = std::chrono::floor<std::chrono::seconds>(date);
   const std::time_t time = std::chrono::system_clock::to_time_t(seconds);
   std::tm local{};
   ::localtime_r(&time, &local);
   char text[32];
-  std::strftime(text, sizeof text, "%Y-%m-%d %H:%M:%S", &local);
+  std::strftime(text, sizeof text, "%m-%d %H:%M:%S", &local);
   const auto milliseconds = std::chrono::floor<std::chrono::milliseconds>(date - seconds).count();
   return fmt::format("{}.{:03}", text, milliseconds);
+}
+
+// For people, who see from the session's column what is in one.
+std::string Service(std::string_view name) {
+  constexpr std::string_view kSuffix = "_session";
+  if (name.ends_with(kSuffix)) name.remove_suffix(kSuffix.size());
+  return std::string(name);
 }
 
 std::string Application(const std::string& userInfo) {
@@ -81,7 +88,7 @@ std::vector<std::string> Row(const StoredSession& session) {
     const std::chrono::duration<double> seconds = *session.flushedAt - session.openedAt;
     duration = fmt::format("{:.3f} s", seconds.count());
   }
-  return {fmt::format("{}", session.reporterID), session.serviceName,
+  return {fmt::format("{}", session.reporterID), Service(session.serviceName),
           LocalTime(session.openedAt),           duration,
           fmt::format("{}", session.messages),   Application(session.userInfo)};
 }
@@ -89,14 +96,10 @@ std::vector<std::string> Row(const StoredSession& session) {
 std::vector<std::string> Row(const StoredMessage& message) {
   return {LocalTime(message.sentAt),
           message.agentSession ? fmt::format("{}", message.reporterID) : "single",
-          message.serviceName,
+          Service(message.serviceName),
           NameOf(Category(message.category)),
           std::string(NameOf(static_cast<MessageType>(message.type))),
           message.payload};
-}
-
-Result<StoreReader> Open(const std::string& path) {
-  return StoreReader::open(path);
 }
 
 std::string PathOf(const Options& options) {
@@ -106,7 +109,7 @@ std::string PathOf(const Options& options) {
 }  // namespace
 
 Outcome Sessions(const Options& options) {
-  auto store = Open(PathOf(options));
+  auto store = StoreReader::open(PathOf(options));
   if (!store) return std::move(store.error());
   Table table({{"SESSION", true},
                {"SERVICE"},
@@ -128,7 +131,7 @@ Outcome Sessions(const Options& options) {
 
 Outcome Messages(const Options& options, const MessageOptions& which) {
   const std::string path = PathOf(options);
-  auto store = Open(path);
+  auto store = StoreReader::open(path);
   if (!store) return std::move(store.error());
   Table table({{"SENT"}, {"SESSION", true}, {"SERVICE"}, {"CATEGORY"}, {"TYPE"}, {"PAYLOAD"}},
               Terminal::standardOutput());

@@ -61,7 +61,8 @@ int main(int argumentCount, char** arguments) {
   CLI::App* messages =
       add("messages", "list the messages in the store", [&] { return Messages(options, which); });
   messages->add_option("--session", which.session, "only this reporter ID's; -1: single messages");
-  messages->add_option("--last", which.last, "only so many, the last ones");
+  messages->add_option("--last", which.last, "only so many, the last ones")
+      ->check(CLI::PositiveNumber);
   messages->add_flag("--follow", which.follow, "go on with messages as they are stored");
 
   try {

@@ -72,6 +72,10 @@ struct SentCase {
   const char* frame;
 };
 
+void PrintTo(const SentCase& sent, std::ostream* out) {
+  *out << sent.frame;
+}
+
 class SentCall : public ClientTest, public ::testing::WithParamInterface<SentCase> {};
 
 TEST_P(SentCall, HasItsFrame) {

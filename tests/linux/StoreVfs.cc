@@ -21,8 +21,12 @@ StoreVfs& Instance() {
   return instance;
 }
 
-File* Self(sqlite3_file* file) { return reinterpret_cast<File*>(file); }
-sqlite3_file* Real(sqlite3_file* file) { return Self(file)->real; }
+File* Self(sqlite3_file* file) {
+  return reinterpret_cast<File*>(file);
+}
+sqlite3_file* Real(sqlite3_file* file) {
+  return Self(file)->real;
+}
 
 int Write(sqlite3_file* file, const void* bytes, int count, sqlite3_int64 offset) {
   const bool isLog = Self(file)->isLog;
@@ -48,7 +52,9 @@ int Forward(sqlite3_file* file, Arguments... arguments) {
   return (Real(file)->pMethods->*Method)(Real(file), arguments...);
 }
 
-void Barrier(sqlite3_file* file) { Real(file)->pMethods->xShmBarrier(Real(file)); }
+void Barrier(sqlite3_file* file) {
+  Real(file)->pMethods->xShmBarrier(Real(file));
+}
 
 constexpr sqlite3_io_methods kMethods{
     .iVersion = 2,

@@ -41,7 +41,8 @@ class Journal {
 };
 
 /// The simulated platform, one a test: stands behind every header of `platform/` from its
-/// construction to its destruction. What is declared after it in a test is destroyed before it.
+/// construction to its destruction. What is declared after it in a test is destroyed before it, so
+/// a thread that may still wait at the end must share what it uses: it unwinds at the destruction.
 ///
 /// The test arranges (switches, connections, threads), runs, and asserts on what was recorded;
 /// nothing happens between two runs. Every failure names the seed.

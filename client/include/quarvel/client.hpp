@@ -51,7 +51,7 @@ class Recipients {
       : sessions_(std::span(sessions.begin(), sessions.size())) {}
   Recipients(const std::vector<ReporterID>& sessions) : sessions_(sessions) {}
   /// When no session is started anywhere, the service sends the message on its own.
-  [[nodiscard]] static Recipients everyStartedSession() { return Recipients(); }
+  [[nodiscard]] static Recipients everyStartedSession() { return {}; }
 
   /// None: every started session.
   [[nodiscard]] const std::optional<std::span<const ReporterID>>& sessions() const {

@@ -91,9 +91,17 @@ void CallDesk::begin(std::size_t bytes) {
   bytes_.fetch_add(bytes);
 }
 
-void CallDesk::done(std::size_t bytes) {
+void CallDesk::carriedOut() {
   calls_.fetch_sub(1);
+  wakeIfHalfIsDone();
+}
+
+void CallDesk::done(std::size_t bytes) {
   bytes_.fetch_sub(bytes);
+  wakeIfHalfIsDone();
+}
+
+void CallDesk::wakeIfHalfIsDone() {
   if (waiting_ && halfIsDone() && waiting_.exchange(false)) wake_();
 }
 

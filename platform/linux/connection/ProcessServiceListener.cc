@@ -10,6 +10,8 @@
 #include "platform/Process.h"
 #include "platform/ServiceListener.h"
 #include "platform/linux/connection/SocketListener.h"
+#include "platform/linux/sources/VerbosePreferences.h"
+#include "platform/linux/store/ProcessStore.h"
 #include "platform/linux/system/Configuration.h"
 #include "platform/linux/system/Directories.h"
 #include "platform/linux/work/Work.h"
@@ -62,6 +64,7 @@ std::unique_ptr<SocketListener> OpenListenerOrExit() {
     ZQ_LOG(nullptr, error, "the service cannot start: {}", listener.error().description());
     ExitProcess(1);
   }
+  FollowVerbosePreferences();
   return std::move(listener.value());
 }
 

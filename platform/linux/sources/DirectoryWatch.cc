@@ -1,6 +1,5 @@
 #include "platform/linux/sources/DirectoryWatch.h"
 
-#include <pthread.h>
 #include <sys/inotify.h>
 #include <unistd.h>
 
@@ -11,6 +10,7 @@
 #include <utility>
 
 #include "platform/Log.h"
+#include "platform/linux/work/Thread.h"
 
 namespace quarvel {
 
@@ -27,30 +27,24 @@ DirectoryWatch& DirectoryWatch::process() {
 }
 
 DirectoryWatch::~DirectoryWatch() {
-  int descriptor = -1;
-  {
-    const MutexLock lock(mutex_);
-    if (descriptor_ < 0) return;
-    ending_ = true;
-    descriptor = descriptor_;
-  }
+  const MutexLock lock(mutex_);
+  if (descriptor_ < 0) return;
+  ending_ = true;
   // Giving up a watch is news too: it wakes the thread.
-  inotify_rm_watch(descriptor, inotify_add_watch(descriptor, "/", IN_DELETE_SELF));
-  thread_.join();
-  ::close(descriptor);
+  inotify_rm_watch(descriptor_, inotify_add_watch(descriptor_, "/", IN_DELETE_SELF));
+  while (running_) ended_.wait(mutex_);
+  ::close(descriptor_);
 }
 
 int DirectoryWatch::start() {
   if (descriptor_ >= 0) return 0;
   descriptor_ = inotify_init1(IN_CLOEXEC);
   if (descriptor_ < 0) return errno;
-  try {
-    thread_ = std::thread([this, descriptor = descriptor_] { run(descriptor); });
-  } catch (const std::system_error& failure) {
-    ::close(std::exchange(descriptor_, -1));
-    return failure.code().value();
-  }
-  return 0;
+  const int status = StartThread("tarnwick.quarvel.watch", 0,
+                                 [this, descriptor = descriptor_] { run(descriptor); });
+  running_ = status == 0;
+  if (!running_) ::close(std::exchange(descriptor_, -1));
+  return status;
 }
 
 int DirectoryWatch::add(const std::filesystem::path& directory, Handler handler) {
@@ -90,8 +84,14 @@ bool DirectoryWatch::forget(int identifier) {
 }
 
 void DirectoryWatch::run(int descriptor) {
+  reportUntilEnd(descriptor);
+  const MutexLock lock(mutex_);
+  running_ = false;
+  ended_.notifyAll();
+}
+
+void DirectoryWatch::reportUntilEnd(int descriptor) {
   ZQ_FUNCTION("DirectoryWatch");
-  pthread_setname_np(pthread_self(), "quarvel.watch");
   alignas(inotify_event) std::array<char, 4096> events{};
   for (;;) {
     const ssize_t length = ::read(descriptor, events.data(), events.size());

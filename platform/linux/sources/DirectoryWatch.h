@@ -4,7 +4,6 @@
 #include <functional>
 #include <memory>
 #include <string_view>
-#include <thread>
 #include <vector>
 
 #include "base/Mutex.h"
@@ -42,6 +41,7 @@ class DirectoryWatch {
 
   [[nodiscard]] int start() QUARVEL_REQUIRES(mutex_);
   void run(int descriptor);
+  void reportUntilEnd(int descriptor);
   void report(int identifier, std::string_view file);
   /// A directory was removed. Returns whether the watch itself is to end.
   [[nodiscard]] bool forget(int identifier);
@@ -49,8 +49,9 @@ class DirectoryWatch {
   Mutex mutex_;
   int descriptor_ QUARVEL_GUARDED_BY(mutex_) = -1;
   bool ending_ QUARVEL_GUARDED_BY(mutex_) = false;
+  bool running_ QUARVEL_GUARDED_BY(mutex_) = false;  // the thread
+  ConditionVariable ended_;                          // it no longer runs
   std::vector<Watched> watched_ QUARVEL_GUARDED_BY(mutex_);
-  std::thread thread_;  // begun under mutex_, ended by the destructor
 };
 
 }  // namespace quarvel

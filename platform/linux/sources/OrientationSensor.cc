@@ -1,7 +1,6 @@
 #include "platform/linux/sources/OrientationSensor.h"
 
 #include <poll.h>
-#include <pthread.h>
 #include <sys/eventfd.h>
 #include <systemd/sd-bus.h>
 #include <unistd.h>
@@ -16,6 +15,7 @@
 #include <utility>
 
 #include "platform/Log.h"
+#include "platform/linux/work/Thread.h"
 
 namespace quarvel {
 
@@ -220,13 +220,11 @@ class OrientationSensor::Connection {
 };
 
 OrientationSensor::~OrientationSensor() {
-  if (!thread_.joinable()) return;
-  {
-    const MutexLock lock(mutex_);
-    ending_ = true;
-  }
+  const MutexLock lock(mutex_);
+  if (!running_) return;
+  ending_ = true;
   eventfd_write(wakeDescriptor_, 1);
-  thread_.join();
+  while (running_) ended_.wait(mutex_);
   ::close(wakeDescriptor_);
 }
 
@@ -240,14 +238,20 @@ void OrientationSensor::end(OrientationKind kind) {
 }
 
 void OrientationSensor::want(bool wanted) {
-  {
-    const MutexLock lock(mutex_);
-    wanted_ = wanted;
-    if (wanted) ++attempts_;
-  }
-  if (!thread_.joinable()) {
+  ZQ_FUNCTION("OrientationSensor");
+  const MutexLock lock(mutex_);
+  wanted_ = wanted;
+  if (wanted) ++attempts_;
+  if (!running_) {
+    if (!wanted) return;
     wakeDescriptor_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
-    thread_ = std::thread([this] { run(); });
+    const int status = StartThread("tarnwick.quarvel.sensor", 0, [this] { run(); });
+    if (status != 0) {
+      ZQ_LOG(nullptr, error, "no device orientation, no thread: {}", statusText(-status));
+      ::close(wakeDescriptor_);
+      return;
+    }
+    running_ = true;
   }
   eventfd_write(wakeDescriptor_, 1);
 }
@@ -265,7 +269,13 @@ void OrientationSensor::wait(const Connection* connection) const {
 }
 
 void OrientationSensor::run() {
-  pthread_setname_np(pthread_self(), "quarvel.sensor");
+  followUntilEnd();
+  const MutexLock lock(mutex_);
+  running_ = false;
+  ended_.notifyAll();
+}
+
+void OrientationSensor::followUntilEnd() {
   Complaint complaint;
   std::unique_ptr<Connection> connection;
   unsigned attempted = 0;

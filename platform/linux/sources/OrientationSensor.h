@@ -2,7 +2,6 @@
 
 #include <optional>
 #include <string_view>
-#include <thread>
 
 #include "base/Mutex.h"
 #include "platform/linux/sources/OrientationCenter.h"
@@ -29,6 +28,7 @@ class OrientationSensor final : public OrientationSource {
 
   void want(bool wanted);
   void run();
+  void followUntilEnd();
   void wait(const Connection* connection) const;
 
   OrientationCenter& center_;
@@ -36,8 +36,9 @@ class OrientationSensor final : public OrientationSource {
   bool wanted_ QUARVEL_GUARDED_BY(mutex_) = false;
   unsigned attempts_ QUARVEL_GUARDED_BY(mutex_) = 0;  // first registrations so far
   bool ending_ QUARVEL_GUARDED_BY(mutex_) = false;
-  int wakeDescriptor_ = -1;  // constant once the thread runs
-  std::thread thread_;       // begun under the center's lock, ended by the destructor
+  bool running_ QUARVEL_GUARDED_BY(mutex_) = false;  // the thread
+  ConditionVariable ended_;                          // it no longer runs
+  int wakeDescriptor_ = -1;                          // constant once the thread runs
 };
 
 /// The proxy's word for an orientation: "normal", "bottom-up", "left-up", "right-up"; unknown for

@@ -20,7 +20,8 @@ class PreferencesStore {
 
   explicit PreferencesStore(std::filesystem::path directory) : directory_(std::move(directory)) {}
 
-  /// As `OpenPreferencesDomain`. A file that stays wrong is logged once, until it changes.
+  /// As `OpenPreferencesDomain`. The same fault is logged once, until the file was right
+  /// again.
   [[nodiscard]] PreferencesDomain open(std::string_view name);
 
  private:

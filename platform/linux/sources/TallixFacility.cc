@@ -2,7 +2,6 @@
 
 #include <fmt/format.h>
 
-#include <algorithm>
 #include <map>
 #include <system_error>
 #include <tuple>
@@ -16,10 +15,6 @@ namespace quarvel {
 namespace {
 
 namespace fs = std::filesystem;
-
-Error tallixError(TallixErrorCode code, std::string reason) {
-  return Error::because(kTallixErrorDomain, static_cast<std::int64_t>(code), std::move(reason));
-}
 
 bool matches(std::optional<std::string_view> wanted, std::string_view name) {
   return !wanted || *wanted == name;
@@ -68,7 +63,7 @@ class TreeSearch {
       if (!name.starts_with('.') && IsUtf8(name)) visit(*entry, name);
     }
     if (failure && !error) {
-      error = tallixError(TallixErrorCode::unreadableGroups,
+      error = TallixError(TallixErrorCode::unreadableGroups,
                           fmt::format("{}: {}", directory.native(), failure.message()));
     }
   }
@@ -97,11 +92,6 @@ class TreeSearch {
 };
 
 }  // namespace
-
-std::string DriverChannel::description() const {
-  return fmt::format("{}/{}{}{} ({})", group, subgroup, subgroup.empty() ? "" : "/", name,
-                     file.native());
-}
 
 TallixFacility::TallixFacility(const Configuration::Tallix& configuration)
     : root_(configuration.root) {
@@ -136,62 +126,6 @@ TallixChannels TallixFacility::channelsInGroup(std::optional<std::string_view> g
   channels.reserve(search.found.size());
   for (auto& [position, channel] : search.found) channels.push_back(std::move(channel));
   return std::make_shared<const TallixChannelSet>(std::move(channels));
-}
-
-TallixSubscription::TallixSubscription(const TallixChannelSet& channels) {
-  ZQ_FUNCTION("TallixCreateSubscription");
-  const MutexLock lock(mutex_);
-  std::map<fs::path, std::vector<const DriverChannel*>> files;
-  for (const DriverChannel& channel : channels.channels) files[channel.file].push_back(&channel);
-
-  std::map<fs::path, std::size_t> opened;
-  for (const auto& [path, contents] : files) {
-    const bool report = std::ranges::any_of(
-        contents, [](const DriverChannel* channel) { return channel->pattern.has_value(); });
-    CounterFile file(path, report ? CounterFile::Extent::lines : CounterFile::Extent::oneInteger);
-    if (const int status = file.open(); status != 0) {
-      ZQ_LOG(nullptr, error, "driver channel {} is left out: {}", contents.front()->description(),
-             std::generic_category().message(status));
-      continue;
-    }
-    opened.emplace(path, sources_.size());
-    sources_.push_back({std::move(file), {}});
-  }
-
-  std::vector<DriverChannel> subscribed;
-  for (const DriverChannel& channel : channels.channels) {
-    const auto source = opened.find(channel.file);
-    if (source == opened.end()) continue;
-    sources_[source->second].channels.push_back(subscribed.size());
-    subscribed.push_back(channel);
-  }
-  subscribed_ = std::make_shared<const TallixChannelSet>(std::move(subscribed));
-}
-
-Result<TallixSamples> TallixSubscription::sample() {
-  const MutexLock lock(mutex_);
-  const std::vector<DriverChannel>& channels = subscribed_->channels;
-  std::vector<std::int64_t> values(channels.size());
-  for (Source& source : sources_) {
-    std::string_view content;
-    if (const int status = source.file.read(buffer_, content); status != 0) {
-      return tallixError(
-          TallixErrorCode::channelUnreadable,
-          fmt::format("driver channel {}: {}", channels[source.channels.front()].description(),
-                      std::generic_category().message(status)));
-    }
-    for (const std::size_t index : source.channels) {
-      const DriverChannel& channel = channels[index];
-      const std::string_view text = channel.pattern ? channel.pattern->find(content) : content;
-      if (const auto fault = CounterFromText(text, values[index])) {
-        return tallixError(*fault, fmt::format("driver channel {} holds {}", channel.description(),
-                                               *fault == TallixErrorCode::noInteger
-                                                   ? "no decimal integer"
-                                                   : "an integer beyond signed 64 bits"));
-      }
-    }
-  }
-  return TallixSamples(std::make_shared<const TallixSampleSet>(subscribed_, std::move(values)));
 }
 
 }  // namespace quarvel

@@ -4,6 +4,7 @@
 #include <sys/random.h>
 
 #include <array>
+#include <cerrno>
 #include <cstdint>
 #include <cstdlib>
 #include <string_view>
@@ -29,7 +30,10 @@ std::string Hexadecimal(const RandomBits& bits) {
 
 }  // namespace
 
-std::string NewSecureToken() { return Hexadecimal(NewRandomBits()); }
+std::string NewHierarchyToken(const std::optional<std::string>& parent) {
+  const std::string own = Hexadecimal(NewRandomBits());
+  return parent ? *parent + "." + own : own;
+}
 
 std::string NewUuid() {
   RandomBits bits = NewRandomBits();

@@ -1,12 +1,15 @@
 #pragma once
 
+#include <optional>
 #include <string>
 
 namespace quarvel {
 
-/// 128 random bits that nobody can guess, as 32 hexadecimal digits. May wait for the kernel's random
-/// numbers early in the life of the device, never later.
-[[nodiscard]] std::string NewSecureToken();
+// May wait for the kernel's random numbers early in the life of the device, never later.
+
+/// 128 random bits that nobody can guess, as 32 hexadecimal digits; behind the parent's token and a
+/// full stop when there is one.
+[[nodiscard]] std::string NewHierarchyToken(const std::optional<std::string>& parent);
 
 /// A random UUID (RFC 9562, version 4), in lower case.
 [[nodiscard]] std::string NewUuid();

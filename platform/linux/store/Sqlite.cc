@@ -49,7 +49,9 @@ SqliteStatement::Step SqliteStatement::step() {
   }
 }
 
-void SqliteStatement::reset() { sqlite3_reset(statement_.get()); }
+void SqliteStatement::reset() {
+  sqlite3_reset(statement_.get());
+}
 
 std::int64_t SqliteStatement::integer(int column) const {
   return sqlite3_column_int64(statement_.get(), column);
@@ -68,12 +70,15 @@ void SqliteConnection::Close::operator()(sqlite3* connection) const {
 
 bool SqliteConnection::open(const std::filesystem::path& path, const std::string& vfs) {
   sqlite3* connection = nullptr;
-  const int result = sqlite3_open_v2(path.c_str(), &connection,
-                                SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_EXRESCODE,
-                                vfs.empty() ? nullptr : vfs.c_str());
+  const int result =
+      sqlite3_open_v2(path.c_str(), &connection,
+                      SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_EXRESCODE,
+                      vfs.empty() ? nullptr : vfs.c_str());
   connection_.reset(connection);
   if (result != SQLITE_OK) return false;
   sqlite3_busy_timeout(connection, 250);
+  // What is corrupt, or not ours, stays as it was found.
+  sqlite3_db_config(connection, SQLITE_DBCONFIG_NO_CKPT_ON_CLOSE, 1, nullptr);
   sqlite3_wal_hook(
       connection,
       [](void* pages, sqlite3*, const char*, int logPages) {
@@ -90,9 +95,8 @@ bool SqliteConnection::execute(const char* statements) {
 
 bool SqliteConnection::prepare(SqliteStatement& statement, std::string_view sql) {
   sqlite3_stmt* prepared = nullptr;
-  const int result =
-      sqlite3_prepare_v3(connection_.get(), sql.data(), static_cast<int>(sql.size()),
-                         SQLITE_PREPARE_PERSISTENT, &prepared, nullptr);
+  const int result = sqlite3_prepare_v3(connection_.get(), sql.data(), static_cast<int>(sql.size()),
+                                        SQLITE_PREPARE_PERSISTENT, &prepared, nullptr);
   statement = SqliteStatement(prepared);
   return result == SQLITE_OK;
 }
@@ -113,7 +117,9 @@ std::optional<std::string> SqliteConnection::text(std::string_view sql) {
   return std::string(statement.text(0));
 }
 
-std::int64_t SqliteConnection::changes() const { return sqlite3_changes64(connection_.get()); }
+std::int64_t SqliteConnection::changes() const {
+  return sqlite3_changes64(connection_.get());
+}
 
 void SqliteConnection::rollBack() {
   rolledBackFault_ = fault();
@@ -123,25 +129,18 @@ void SqliteConnection::rollBack() {
   }
 }
 
-bool SqliteConnection::isReadOnly() const {
-  return sqlite3_db_readonly(connection_.get(), "main") != 0;
-}
-
-SqliteConnection::Checkpoint SqliteConnection::checkpoint() {
-  return checkpoint(SQLITE_CHECKPOINT_PASSIVE);
-}
-
-SqliteConnection::Checkpoint SqliteConnection::checkpointAndTruncate() {
-  return checkpoint(SQLITE_CHECKPOINT_TRUNCATE);
-}
-
-SqliteConnection::Checkpoint SqliteConnection::checkpoint(int mode) {
+bool SqliteConnection::checkpoint() {
   int logPages = -1;
   int movedPages = -1;
-  const int result =
-      sqlite3_wal_checkpoint_v2(connection_.get(), "main", mode, &logPages, &movedPages);
-  if (result != SQLITE_OK) return {};
-  return {true, logPages == movedPages};
+  const int result = sqlite3_wal_checkpoint_v2(connection_.get(), "main", SQLITE_CHECKPOINT_PASSIVE,
+                                               &logPages, &movedPages);
+  return result == SQLITE_OK && logPages == movedPages;
+}
+
+void SqliteConnection::checkpointAtClose() {
+  sqlite3_wal_checkpoint_v2(connection_.get(), "main", SQLITE_CHECKPOINT_TRUNCATE, nullptr,
+                            nullptr);
+  sqlite3_db_config(connection_.get(), SQLITE_DBCONFIG_NO_CKPT_ON_CLOSE, 0, nullptr);
 }
 
 bool SqliteConnection::syncLog() {

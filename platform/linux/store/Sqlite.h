@@ -61,8 +61,8 @@ class SqliteConnection {
  public:
   SqliteConnection() = default;
 
-  /// Opens for reading and writing; `path` must be a file that exists. `vfs` empty: the default one.
-  /// False when it failed: `fault` and `message` say why.
+  /// Opens for reading and writing; `path` must be a file that exists. `vfs` empty: the default
+  /// one. False when it failed: `fault` and `message` say why.
   bool open(const std::filesystem::path& path, const std::string& vfs);
 
   /// Runs statements without parameters, rows ignored. False when one failed.
@@ -77,16 +77,13 @@ class SqliteConnection {
   [[nodiscard]] std::int64_t changes() const;
   /// Ends the transaction under way, if there still is one: some failures end it themselves.
   void rollBack();
-  [[nodiscard]] bool isReadOnly() const;
 
-  struct Checkpoint {
-    bool ok = false;
-    bool complete = false;  // every frame of the log is in the database file, and both are synced
-  };
   /// Moves what readers allow from the write-ahead log into the database file; never waits for one.
-  Checkpoint checkpoint();
-  /// As `checkpoint`, then cuts the log to nothing; waits for readers as long as the busy time-out.
-  Checkpoint checkpointAndTruncate();
+  /// True when that was everything: then every commit is on the medium.
+  bool checkpoint();
+  /// Before closing: moves the whole log as far as readers let it (it waits for them as long as the
+  /// busy time-out) and lets closing remove it.
+  void checkpointAtClose();
   /// Syncs the write-ahead log: everything committed is on the medium, and nothing new is written.
   /// A failure does not show in `fault` and `message`.
   bool syncLog();
@@ -98,7 +95,6 @@ class SqliteConnection {
   [[nodiscard]] std::string message() const;
 
  private:
-  Checkpoint checkpoint(int mode);
   [[nodiscard]] SqliteFault currentFault() const;
 
   struct Close {

@@ -6,9 +6,15 @@ namespace {
 
 constexpr std::size_t kKeptText = 1 << 20;  // after a burst of long texts the rest is given back
 
-const Payload* PayloadOf(const AgentSessionRow& row) { return &row.userInfo; }
-const Payload* PayloadOf(const FlushRow&) { return nullptr; }
-const Payload* PayloadOf(const auto& row) { return &row.payload; }
+const Payload* PayloadOf(const AgentSessionRow& row) {
+  return &row.userInfo;
+}
+const Payload* PayloadOf(const FlushRow&) {
+  return nullptr;
+}
+const Payload* PayloadOf(const auto& row) {
+  return &row.payload;
+}
 
 }  // namespace
 

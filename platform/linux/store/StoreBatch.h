@@ -78,8 +78,9 @@ struct FlushRow {
 using StoreRow =
     std::variant<AgentSessionRow, MessageRow, AnalyticsEventRow, PowerEventRow, FlushRow>;
 
-/// Rows in the order in which they were queued. Their texts stand one after the other in one string,
-/// which is emptied and filled again with the batch, so that a row costs no allocation of its own.
+/// Rows in the order in which they were queued. Their texts stand one after the other in one
+/// string, which is emptied and filled again with the batch, so that a row costs no allocation of
+/// its own.
 class StoreBatch {
  public:
   using Instant = std::chrono::steady_clock::time_point;

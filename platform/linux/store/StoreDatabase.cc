@@ -20,7 +20,9 @@ constexpr int kLogPagesWhenIdle = 1024;
 constexpr int kLogPagesBetweenBatches = 4096;
 constexpr std::size_t kKeptJson = 1 << 20;
 
-std::int64_t Microseconds(Date date) { return date.time_since_epoch().count(); }
+std::int64_t Microseconds(Date date) {
+  return date.time_since_epoch().count();
+}
 
 }  // namespace
 
@@ -41,15 +43,17 @@ StoreDatabase::StoreDatabase(SqliteConnection connection, StoreRetention::Bounds
     : connection_(std::move(connection)),
       retention_(std::move(bounds), connection_, committedIDs_) {}
 
-StoreDatabase::~StoreDatabase() { connection_.checkpointAndTruncate(); }
+StoreDatabase::~StoreDatabase() {
+  if (fault() != SqliteFault::corrupt) connection_.checkpointAtClose();
+}
 
 bool StoreDatabase::prepare(Date now) {
-  return connection_.prepare(begin_, "BEGIN IMMEDIATE") &&
-         connection_.prepare(commit_, "COMMIT") &&
-         connection_.prepare(insertAgentSession_,
-                             "INSERT INTO agent_session(id, session_id, client_type, client_version,"
-                             " batch_event, hierarchy_token, client_name, service_name, user_info,"
-                             " opened_at) VALUES(?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9, ?10)") &&
+  return connection_.prepare(begin_, "BEGIN IMMEDIATE") && connection_.prepare(commit_, "COMMIT") &&
+         connection_.prepare(
+             insertAgentSession_,
+             "INSERT INTO agent_session(id, session_id, client_type, client_version,"
+             " batch_event, hierarchy_token, client_name, service_name, user_info,"
+             " opened_at) VALUES(?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9, ?10)") &&
          connection_.prepare(insertMessage_,
                              "INSERT INTO message(id, agent_session, session_id, client_name,"
                              " service_name, category, type, payload, sent_at)"
@@ -89,14 +93,17 @@ bool StoreDatabase::readLastIDs() {
 bool StoreDatabase::write(const StoreBatch& batch, std::size_t first, std::size_t last,
                           Safety safety, Date now) {
   now_ = Microseconds(now);
+  bool changesFile = false;
   bool written = begin(safety);
   for (std::size_t i = first; written && i < last; ++i) {
-    written = std::visit([this, &batch](const auto& row) { return insert(batch, row); },
-                         batch.rows()[i]);
+    written =
+        std::visit([this, &batch](const auto& row) { return insert(batch, row); }, batch.rows()[i]);
+    changesFile = changesFile || connection_.changes() > 0;
   }
   if (written && commit_.run()) {
     committedIDs_ = lastIDs_;
-    return true;
+    // A commit of nothing, as of the flush of a session whose row is gone, syncs nothing either.
+    return changesFile || safety == Safety::normal || sync();
   }
   connection_.rollBack();
   lastIDs_ = committedIDs_;
@@ -183,7 +190,7 @@ bool StoreDatabase::checkpointIfDue(bool idle) {
     return false;
   }
   checkpointedPages_ = logPages;
-  return connection_.checkpoint().complete;
+  return connection_.checkpoint();
 }
 
 }  // namespace quarvel

@@ -41,8 +41,8 @@ class StoreDatabase {
   /// Writes rows `first` to `last` - 1 of a batch in one transaction.
   [[nodiscard]] bool write(const StoreBatch& batch, std::size_t first, std::size_t last,
                            Safety safety, Date now);
-  /// Makes all earlier commits as safe as a full one. Only the log is synced: a transaction to carry
-  /// a full commit would wear the medium for nothing.
+  /// Makes all earlier commits as safe as a full one. Only the log is synced: a transaction to
+  /// carry a full commit would wear the medium for nothing.
   [[nodiscard]] bool sync() { return connection_.syncLog(); }
 
   /// Moves the write-ahead log into the database file once it has grown enough: past a little when
@@ -56,7 +56,8 @@ class StoreDatabase {
   [[nodiscard]] std::int64_t lastAgentSession() const {
     return committedIDs_[StoreTable::agentSession];
   }
-  /// The counted rows as of opening: in the file, and removed from it by retention since it was made.
+  /// The counted rows as of opening: in the file, and removed from it by retention since it was
+  /// made.
   [[nodiscard]] std::uint64_t storedAtOpening() const { return storedAtOpening_; }
   [[nodiscard]] std::uint64_t droppedAtOpening() const { return droppedAtOpening_; }
 

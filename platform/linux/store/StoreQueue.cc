@@ -1,6 +1,7 @@
 #include "platform/linux/store/StoreQueue.h"
 
 #include "platform/linux/store/StoreError.h"
+#include "platform/linux/work/BlockingScope.h"
 
 namespace quarvel {
 
@@ -16,6 +17,7 @@ bool StoreQueue::hasRoom() const {
 
 void StoreQueue::awaitRoom() {
   if (closed_ || hasRoom()) return;
+  const BlockingScope blocking;
   ++heldBack_;
   while (!closed_ && !hasRoom()) roomCame_.wait(mutex_);
   --heldBack_;

@@ -34,8 +34,8 @@ class StoreQueue {
   StoreQueue(std::size_t maximumRows, std::size_t maximumBytes)
       : maximumRows_(maximumRows), maximumBytes_(maximumBytes) {}
 
-  /// Any thread. Holds the caller back while either bound is reached, so that the bound on bytes may
-  /// be passed by one row. Errors: the queue is closed, also while the caller was held back.
+  /// Any thread. Holds the caller back while either bound is reached, so that the bound on bytes
+  /// may be passed by one row. Errors: the queue is closed, also while the caller was held back.
   template <class Row>
   Outcome push(Row&& row, std::initializer_list<std::string_view> texts) QUARVEL_EXCLUDES(mutex_) {
     MutexLock lock(mutex_);
@@ -62,8 +62,8 @@ class StoreQueue {
   // The rest is the writer's.
 
   enum class Take : std::uint8_t { rows, deadline, closed };
-  /// Exchanges the rows that wait for the empty `batch`. Waits for rows until `deadline`, if there is
-  /// one; `closed` once the queue is closed and empty.
+  /// Exchanges the rows that wait for the empty `batch`. Waits for rows until `deadline`, if there
+  /// is one; `closed` once the queue is closed and empty.
   Take take(StoreBatch& batch, std::optional<Instant> deadline) QUARVEL_EXCLUDES(mutex_);
   /// Waits until `deadline`, whatever is queued meanwhile; returns early, and true, when closed.
   [[nodiscard]] bool waitForClose(Instant deadline) QUARVEL_EXCLUDES(mutex_);

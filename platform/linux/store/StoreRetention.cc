@@ -17,8 +17,8 @@ constexpr const char* TimeColumn(StoreTable table) {
   return table == StoreTable::message ? "sent_at" : "recorded_at";
 }
 
-/// A session's row goes after its last message: nothing is sent after the flush, nor in this run for
-/// a session that an earlier run never flushed.
+/// A session's row goes after its last message: nothing is sent after the flush, nor in this run
+/// for a session that an earlier run never flushed.
 constexpr const char* kRemoveSessions =
     "DELETE FROM agent_session WHERE id <= (SELECT min(id) + 4096 FROM agent_session)"
     " AND coalesce(flushed_at, CASE WHEN id <= ?1 THEN ?2 END) < "
@@ -73,7 +73,7 @@ StoreRetention::Progress StoreRetention::step(std::uint64_t incomingBytes,
     progress = connection_.execute(kVacuumStep) ? Progress::more : Progress::failed;
   }
   if (progress != Progress::nothingToDo || !expired) return progress;
-  return removeOldest(kStepBytes, expired->time_since_epoch().count(), false);
+  return removeOldest(kStepBytes, expired->time_since_epoch().count() - 1, false);
 }
 
 StoreRetention::Progress StoreRetention::makeRoom(std::uint64_t bytes) {

@@ -55,7 +55,8 @@ class StoreRetention {
   /// The rows that one step may remove from one table: the oldest, up to an id.
   struct Window {
     std::int64_t lastID = 0;
-    std::int64_t lastTime = 0;  // of its last row when there are rows behind it, else the end of time
+    std::int64_t lastTime =
+        0;  // of its last row when there are rows behind it, else the end of time
     std::int64_t exportedThrough = 0;
   };
 

@@ -55,8 +55,8 @@ Error Inaccessible(const std::filesystem::path& path, int errorNumber, std::stri
                                 std::generic_category().message(errorNumber), remedy));
 }
 
-/// Makes the file when there is none, and says clearly what is wrong when it cannot be used: SQLite's
-/// own answer to all of these is "unable to open database file".
+/// Makes the file when there is none, and says clearly what is wrong when it cannot be used:
+/// SQLite's own answer to all of these is "unable to open database file".
 Outcome MakeFile(const std::filesystem::path& path) {
   const int made = ::open(path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, 0640);
   if (made >= 0) {
@@ -76,29 +76,30 @@ Outcome MakeFile(const std::filesystem::path& path) {
         path, errno,
         fmt::format("Let the service write to {}, or set path in [store].", directory));
   }
+  struct stat status {};
+  if (::stat(path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) {
+    return Inaccessible(path, EEXIST, "It must be a file: move away what is there.");
+  }
   if (::access(path.c_str(), R_OK | W_OK) != 0) {
-    return Inaccessible(path, errno,
-                        "Let the service read and write it, or set path in [store].");
+    return Inaccessible(path, errno, "Let the service read and write it, or set path in [store].");
   }
   if (::access(path.parent_path().empty() ? "." : directory.c_str(), W_OK | X_OK) != 0) {
     // The write-ahead log stands beside the file.
-    return Inaccessible(path, errno,
-                        fmt::format("Let the service write to {} too.", directory));
+    return Inaccessible(path, errno, fmt::format("Let the service write to {} too.", directory));
   }
   return Success();
 }
 
 Error Failed(const std::filesystem::path& path, const SqliteConnection& connection) {
-  return StoreError(
-      connection.fault() == SqliteFault::diskFull ? StoreErrorCode::diskFull
-                                                  : StoreErrorCode::failed,
-      fmt::format("The telemetry store {} cannot be opened: {}.", path.string(),
-                  connection.message()));
+  return StoreError(connection.fault() == SqliteFault::diskFull ? StoreErrorCode::diskFull
+                                                                : StoreErrorCode::failed,
+                    fmt::format("The telemetry store {} cannot be opened: {}.", path.string(),
+                                connection.message()));
 }
 
 bool CreateTables(SqliteConnection& connection) {
-  // Incremental, so that a file can be made smaller step by step when its bound is lowered. It has to
-  // be set before there is a table.
+  // Incremental, so that a file can be made smaller step by step when its bound is lowered. It has
+  // to be set before there is a table.
   return connection.execute("PRAGMA auto_vacuum = INCREMENTAL; BEGIN IMMEDIATE") &&
          connection.execute(kTables) &&
          connection.execute(
@@ -142,14 +143,15 @@ Outcome BringToVersion(const std::filesystem::path& path, SqliteConnection& conn
 /// Looks at both ends of every table. A full check of the file would take seconds; what it could
 /// find beyond this is found, and dealt with in the same way, when it is met.
 bool IsSound(SqliteConnection& connection) {
-  return connection.integer("SELECT count(value) FROM meta WHERE key = 'store_id'").value_or(0) == 1 &&
+  return connection.integer("SELECT count(value) FROM meta WHERE key = 'store_id'").value_or(0) ==
+             1 &&
          std::ranges::all_of(
              std::array{"agent_session", "message", "analytics_event", "power_event"},
              [&connection](const char* table) {
-               const std::string ends =
-                   fmt::format("SELECT ifnull((SELECT min(id) FROM {0}), 0) <= "
-                               "ifnull((SELECT max(id) FROM {0}), 0)",
-                               table);
+               const std::string ends = fmt::format(
+                   "SELECT ifnull((SELECT min(id) FROM {0}), 0) <= "
+                   "ifnull((SELECT max(id) FROM {0}), 0)",
+                   table);
                return connection.integer(ends).has_value();
              });
 }
@@ -189,7 +191,8 @@ Outcome SetStoreAside(const std::filesystem::path& path, Date now, const std::st
       return Inaccessible(from, errno, "It is corrupt: move it away.");
     }
   }
-  ZQ_LOG(nullptr, error, "The telemetry store {} is corrupt ({}). It is kept as {}, and a new one begun.",
+  ZQ_LOG(nullptr, error,
+         "The telemetry store {} is corrupt ({}). It is kept as {}, and a new one begun.",
          path.string(), reason, aside.string());
   return Success();
 }

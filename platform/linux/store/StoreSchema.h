@@ -10,8 +10,8 @@
 
 namespace quarvel {
 
-/// Opens the store's file and brings it to this version of the schema: makes a new one when there is
-/// none, sets a corrupt one aside and makes a new one then. Logs what it did. Errors: domain
+/// Opens the store's file and brings it to this version of the schema: makes a new one when there
+/// is none, sets a corrupt one aside and makes a new one then. Logs what it did. Errors: domain
 /// "quarvel.store", each with a reason that says what to do; the file is left as it was.
 /// `now` names what is set aside.
 [[nodiscard]] Result<SqliteConnection> OpenStore(const std::filesystem::path& path,

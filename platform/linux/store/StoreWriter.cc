@@ -71,7 +71,8 @@ std::optional<StoreWriter::Instant> StoreWriter::nextDeadline() const {
 void StoreWriter::atDeadline() {
   if (unsyncedSince_ && steady_clock::now() >= *unsyncedSince_ + syncAfter_) syncTail();
   if (!retaining_) return;
-  const auto expired = ageing_ ? std::optional(options_.clock() - options_.maximumAge) : std::nullopt;
+  const auto expired =
+      ageing_ ? std::optional(options_.clock() - options_.maximumAge) : std::nullopt;
   if (!retain(0, expired)) retaining_ = ageing_ = false;
 }
 
@@ -81,8 +82,8 @@ void StoreWriter::write(const StoreBatch& batch) {
     const std::size_t last = std::min(first + kRowsPerCommit, rows);
     StoreQueue::Tally tally;
     for (std::size_t i = first; i < last; ++i) tally.add(batch.rows()[i]);
-    makeRoom(tally);
-    if (!writeRows(batch, first, last)) {
+    if (!gaveUp_) makeRoom(tally);
+    if (gaveUp_ || !writeRows(batch, first, last)) {
       lose(batch, first);
       return;
     }
@@ -102,7 +103,7 @@ bool StoreWriter::writeRows(const StoreBatch& batch, std::size_t first, std::siz
   std::chrono::milliseconds backOff = kFirstBackOff;
   bool closing = false;
   while (!tryToWrite(batch, first, last)) {
-    failed();
+    failed(database_ ? databaseError() : failure_);
     if (closing) return false;
     closing = queue_.waitForClose(steady_clock::now() + backOff);
     backOff = std::min(backOff * 2, kLongestBackOff);
@@ -134,9 +135,8 @@ bool StoreWriter::needsFullCommit(const StoreBatch& batch, std::size_t first,
   if (steady_clock::now() >= unsyncedSince_.value_or(batch.queuedAt) + syncAfter_) return true;
   const auto rows = batch.rows().begin();
   return std::any_of(rows + static_cast<std::ptrdiff_t>(first),
-                     rows + static_cast<std::ptrdiff_t>(last), [](const StoreRow& row) {
-                       return std::holds_alternative<FlushRow>(row);
-                     });
+                     rows + static_cast<std::ptrdiff_t>(last),
+                     [](const StoreRow& row) { return std::holds_alternative<FlushRow>(row); });
 }
 
 void StoreWriter::completeFlushes(const StoreBatch& batch, std::size_t first, std::size_t last,
@@ -147,19 +147,17 @@ void StoreWriter::completeFlushes(const StoreBatch& batch, std::size_t first, st
 }
 
 void StoreWriter::lose(const StoreBatch& batch, std::size_t first) {
-  ZQ_FUNCTION("StoreWriter::lose");
+  gaveUp_ = true;
   StoreQueue::Tally tally;
   for (std::size_t i = first; i < batch.rows().size(); ++i) tally.add(batch.rows()[i]);
   queue_.lost(tally);
-  ZQ_LOG(nullptr, error, "The telemetry store {} was closed while it took no rows: {} rows are lost.",
-         options_.database.path.string(), tally.counted);
   completeFlushes(batch, first, batch.rows().size(), failure_);
 }
 
 void StoreWriter::syncTail() {
   unsyncedSince_.reset();
   if (database_->sync()) return;
-  failed();
+  failed(StoreError(StoreErrorCode::failed, "the write-ahead log cannot be synced"));
   unsyncedSince_ = steady_clock::now();
 }
 
@@ -175,7 +173,7 @@ void StoreWriter::makeRoom(const StoreQueue::Tally& incoming) {
 bool StoreWriter::retain(std::uint64_t incomingBytes, std::optional<Date> expired) {
   if (!database_) return false;
   const auto progress = database_->retention().step(incomingBytes, expired);
-  if (progress == StoreRetention::Progress::failed) failed();
+  if (progress == StoreRetention::Progress::failed) failed(databaseError());
   if (!database_) return false;
   const auto removed = database_->retention().takeRemoved();
   if (removed.rows > 0) {
@@ -190,24 +188,27 @@ bool StoreWriter::retain(std::uint64_t incomingBytes, std::optional<Date> expire
 void StoreWriter::reportRemoved(bool now) {
   ZQ_FUNCTION("StoreWriter::reportRemoved");
   if (!now || removedNotExported_ == 0) return;
-  ZQ_LOG(nullptr, error, "The telemetry store {} is full or too old: {} rows were removed that no backend has had.",
+  ZQ_LOG(nullptr, error,
+         "The telemetry store {} is full or too old: {} rows were removed that no backend has had.",
          options_.database.path.string(), std::exchange(removedNotExported_, 0));
 }
 
-void StoreWriter::failed() {
+Error StoreWriter::databaseError() const {
+  const bool full = database_->fault() == SqliteFault::diskFull;
+  return StoreError(full ? StoreErrorCode::diskFull : StoreErrorCode::failed, database_->message());
+}
+
+void StoreWriter::failed(Error error) {
   ZQ_FUNCTION("StoreWriter::failed");
-  if (database_) {
-    const bool full = database_->fault() == SqliteFault::diskFull;
-    failure_ = StoreError(full ? StoreErrorCode::diskFull : StoreErrorCode::failed,
-                          database_->message());
-  }
+  failure_ = std::move(error);
   if (failureLine_.due()) {
-    ZQ_LOG(nullptr, error, "The telemetry store {} takes no rows: {}. Trying again; {} rows wait.",
+    ZQ_LOG(nullptr, error, "The telemetry store {} fails: {}. Trying again; {} rows wait.",
            options_.database.path.string(), failure_.description(), queue_.counters().waiting);
   }
   if (!database_ || database_->fault() != SqliteFault::corrupt) return;
   const std::string reason = database_->message();
   database_.reset();
+  unsyncedSince_.reset();
   if (Outcome aside = SetStoreAside(options_.database.path, options_.clock(), reason); !aside) {
     failure_ = aside.error();
   }
@@ -225,7 +226,12 @@ bool StoreWriter::reopen() {
 }
 
 void StoreWriter::finish() {
+  ZQ_FUNCTION("StoreWriter::finish");
   if (unsyncedSince_) syncTail();
+  if (const std::uint64_t lost = queue_.counters().lost; lost > 0) {
+    ZQ_LOG(nullptr, error, "The telemetry store {} was closed while it took no rows: {} are lost.",
+           options_.database.path.string(), lost);
+  }
   reportRemoved(true);
   database_.reset();
 }

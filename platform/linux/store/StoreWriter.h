@@ -62,7 +62,9 @@ class StoreWriter {
   /// One step of retention. False when there is nothing more to do.
   bool retain(std::uint64_t incomingBytes, std::optional<Date> expired);
   void reportRemoved(bool now);
-  void failed();
+  [[nodiscard]] Error databaseError() const;
+  /// Reports, and begins a new file when this one turns out to be corrupt.
+  void failed(Error error);
   [[nodiscard]] bool reopen();
   void finish();
 
@@ -72,9 +74,11 @@ class StoreWriter {
   std::unique_ptr<StoreDatabase> database_;  // null while a new file could not be begun
   Error failure_;                            // of the last attempt
   Minutely failureLine_;
-  std::optional<Instant> unsyncedSince_;  // when the oldest row was queued that a power cut would take
-  bool retaining_ = true;                 // there may be rows to remove
-  bool ageing_ = true;                    // ... because of their age
+  bool gaveUp_ = false;  // the store was closed while it took no rows
+  std::optional<Instant>
+      unsyncedSince_;      // when the oldest row was queued that a power cut would take
+  bool retaining_ = true;  // there may be rows to remove
+  bool ageing_ = true;     // ... because of their age
   Instant nextAgeing_;
   std::uint64_t removedNotExported_ = 0;  // and not yet reported
   Minutely removedLine_;

@@ -27,8 +27,7 @@ Result<std::unique_ptr<TelemetryStore>> TelemetryStore::open(Options options) {
   auto database = StoreDatabase::open(writerOptions.database, options.clock());
   if (!database) return database.error();
   const StoreDatabase& opened = *database.value();
-  std::unique_ptr<TelemetryStore> store(
-      new TelemetryStore(options, opened.lastAgentSession()));
+  std::unique_ptr<TelemetryStore> store(new TelemetryStore(options, opened.lastAgentSession()));
   store->queue_.restart(opened.storedAtOpening(), opened.droppedAtOpening());
   store->writer_ =
       std::make_unique<StoreWriter>(writerOptions, std::move(database.value()), store->queue_);
@@ -45,7 +44,9 @@ TelemetryStore::TelemetryStore(const Options& options, std::int64_t lastAgentSes
       queue_(options.queueRows, options.queueBytes),
       lastAgentSession_(lastAgentSession) {}
 
-TelemetryStore::~TelemetryStore() { close(); }
+TelemetryStore::~TelemetryStore() {
+  close();
+}
 
 Result<std::int64_t> TelemetryStore::addAgentSession(const AgentSession& session) {
   const std::int64_t id = ++lastAgentSession_;

@@ -27,29 +27,29 @@ class StoreWriter;
 ///
 /// Everything queued since the last commit goes into one transaction, so that a row alone is
 /// committed at once and many rows share the cost of a commit. A committed row survives the end of
-/// the process; after at most `Options::sync` it survives a power cut. While the disk is full or the
-/// database fails, nothing that was taken is lost: the writer tries again until it succeeds, and
-/// senders wait when the queue is full. An idle store does nothing.
+/// the process; after at most `Options::sync` it survives a power cut. While the disk is full or
+/// the database fails, nothing that was taken is lost: the writer tries again until it succeeds,
+/// and senders wait when the queue is full. An idle store does nothing.
 ///
 /// All operations may be called from any thread. Errors have the domain "quarvel.store" and a
 /// `StoreErrorCode`.
 class TelemetryStore {
  public:
   struct Options {
-    std::filesystem::path path;
+    std::filesystem::path path{};
     /// A row is on the medium at most this long after it was queued; 0: with its commit.
     std::chrono::milliseconds sync{1000};
     std::uint64_t maximumBytes = 268'435'456;
     std::chrono::days maximumAge{14};
     /// Backends that read the store: rows they have not had are removed last.
-    std::vector<std::string> remoteBackends;
+    std::vector<std::string> remoteBackends{};
     /// Bounds of the queue; senders beyond them are held back.
     std::size_t queueRows = 8192;
     std::size_t queueBytes = 8 << 20;
     /// Name of the SQLite file layer; empty: the default one.
-    std::string vfs;
+    std::string vfs{};
     /// Says what time rows carry and how old they are; empty: the system's clock.
-    std::function<Date()> clock;
+    std::function<Date()> clock{};
   };
 
   /// Opens the store, making it when there is none and setting a corrupt one aside, and starts the
@@ -64,7 +64,7 @@ class TelemetryStore {
     std::int64_t clientType = 0;
     double clientVersion = 0;  // finite
     bool batchEvent = false;
-    std::string_view hierarchyToken, clientName, serviceName;
+    std::string_view hierarchyToken{}, clientName{}, serviceName{};
     const Payload& userInfo;
   };
   /// Adds a session and returns its id. Never held back.
@@ -73,7 +73,7 @@ class TelemetryStore {
   struct Message {
     std::optional<std::int64_t> agentSession;  // none: a message of no session
     std::int64_t sessionID = 0;
-    std::string_view clientName, serviceName;
+    std::string_view clientName{}, serviceName{};
     std::uint16_t category = 0;
     std::uint16_t type = 0;
     const Payload& payload;
@@ -85,8 +85,8 @@ class TelemetryStore {
 
   /// Called once, on the writer's thread: be brief, and do not close the store.
   using FlushCompletion = std::function<void(const std::optional<Error>& error)>;
-  /// Makes everything added before safe from a power cut and marks the session as flushed. Never held
-  /// back. When this returns an error, `completion` is not called.
+  /// Makes everything added before safe from a power cut and marks the session as flushed. Never
+  /// held back. When this returns an error, `completion` is not called.
   Outcome flush(std::int64_t agentSession, FlushCompletion completion);
 
   /// Commits and syncs what was added, ends the writer and closes the file; refuses everything from

@@ -16,6 +16,9 @@ struct Directories {
   std::filesystem::path diagnosticsPrefix;
 
   [[nodiscard]] static const Directories& process();
+
+  /// Reads the environment; `root` chooses the fall-backs.
+  [[nodiscard]] static Directories fromEnvironment(bool root);
 };
 
 }  // namespace quarvel

@@ -1,0 +1,56 @@
+#include "platform/linux/store/ProcessStore.h"
+
+#include <filesystem>
+#include <system_error>
+#include <utility>
+
+#include "platform/Clock.h"
+#include "platform/Log.h"
+#include "platform/Process.h"
+#include "platform/linux/store/TelemetryAgent.h"
+#include "platform/linux/system/Configuration.h"
+#include "platform/linux/system/Directories.h"
+#include "platform/linux/system/ProcessExit.h"
+
+namespace quarvel {
+
+namespace {
+
+std::shared_ptr<TelemetryStore> OpenOrExit() {
+  ZQ_FUNCTION("ProcessTelemetryStore");
+  const Configuration& configuration = Configuration::process();
+  TelemetryStore::Options options;
+  options.path = configuration.store.path;
+  if (options.path.empty()) {
+    // The state directory is the service's own to make; one that somebody named is not.
+    std::error_code failure;
+    std::filesystem::create_directories(Directories::process().state, failure);
+    options.path = Directories::process().state / "telemetry.db";
+  }
+  options.sync = configuration.store.sync;
+  options.maximumBytes = configuration.store.maximumBytes;
+  options.maximumAge = configuration.store.maximumAge;
+  for (const std::string& backend : configuration.agent.backends) {
+    if (backend != kStoreBackend) options.remoteBackends.push_back(backend);
+  }
+  options.clock = CurrentDate;
+  auto store = TelemetryStore::open(std::move(options));
+  if (!store) {
+    ZQ_LOG(nullptr, error, "the service cannot start: {}", store.error().description());
+    ExitProcess(1);
+  }
+  return std::move(store.value());
+}
+
+}  // namespace
+
+const std::shared_ptr<TelemetryStore>& ProcessTelemetryStore() {
+  static const auto& store = *[] {
+    const auto* opened = new std::shared_ptr<TelemetryStore>(OpenOrExit());
+    AtProcessExit([opened] { (*opened)->close(); });
+    return opened;
+  }();
+  return store;
+}
+
+}  // namespace quarvel

@@ -1,0 +1,48 @@
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+#include <deque>
+#include <optional>
+#include <utility>
+
+#include "base/Mutex.h"
+
+namespace quarvel {
+
+/// What other threads hand to a test, in their order.
+template <class T>
+class Collected {
+ public:
+  void add(T item) {
+    const MutexLock lock(mutex_);
+    items_.push_back(std::move(item));
+    added_.notifyAll();
+  }
+  /// The next one, waiting for it; none when it did not come within a time that means never.
+  std::optional<T> next() {
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+    const MutexLock lock(mutex_);
+    while (items_.empty()) {
+      if (!added_.waitUntil(mutex_, deadline)) return std::nullopt;
+    }
+    std::optional<T> item(std::move(items_.front()));
+    items_.pop_front();
+    return item;
+  }
+  std::size_t size() {
+    const MutexLock lock(mutex_);
+    return items_.size();
+  }
+  void clear() {
+    const MutexLock lock(mutex_);
+    items_.clear();
+  }
+
+ private:
+  Mutex mutex_;
+  ConditionVariable added_;
+  std::deque<T> items_ QUARVEL_GUARDED_BY(mutex_);
+};
+
+}  // namespace quarvel

@@ -1,0 +1,293 @@
+#include "tests/linux/ConnectionFixture.h"
+
+#include <fmt/format.h>
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <stdlib.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <cstring>
+#include <utility>
+
+#include "base/Json.h"
+#include "base/MessagePack.h"
+#include "platform/Log.h"
+
+namespace quarvel {
+
+// The log of this program: error lines go to the journal.
+bool ZQLogEnabled(LogLevel level, LogHandle) {
+  return level == LogLevel::error;
+}
+void ZQLogWrite(LogHandle, LogLevel, const char*, int, const char*, std::string_view message) {
+  Journal::shared().add(fmt::format("error: {}", message));
+}
+
+namespace {
+
+/// The exported object: operations that answer at once, later, at length or not at all.
+class TestService final : public ExportedObject {
+ public:
+  explicit TestService(std::shared_ptr<Ledger> ledger) : ledger_(std::move(ledger)) {}
+
+  void echo(std::int64_t number, Reply<std::int64_t> reply) {
+    ledger_->arrived(number);
+    reply(number);
+  }
+  void twice(std::int64_t number, Reply<std::int64_t> reply) {
+    reply(number);
+    reply(number + 1);
+  }
+  void never(Reply<bool>) {}
+  void refuse(ErrorReply reply) { reply(Error{"test", 9, {{"why", "because"}}}); }
+  void keep(std::int64_t number, Reply<std::int64_t> reply) {
+    ledger_->keep(number, std::move(reply));
+  }
+  void make(std::int64_t number, std::uint32_t size, Reply<std::string> reply) {
+    ledger_->arrived(number);
+    reply(std::string(size, 'x'));
+  }
+  void describe(std::optional<Payload> payload, std::uint16_t code,
+                std::optional<std::vector<std::int64_t>> list, Reply<std::string> reply) {
+    reply(fmt::format("{} {} {}", payload ? JsonText(*payload) : "none", code,
+                      list ? std::to_string(list->size()) : "none"));
+  }
+
+ private:
+  const std::shared_ptr<Ledger> ledger_;
+};
+
+constexpr std::array kTestMethods{
+    Exported<&TestService::echo>("echo:reply:"),
+    Exported<&TestService::twice>("twice:reply:"),
+    Exported<&TestService::never>("never:"),
+    Exported<&TestService::refuse>("refuse:"),
+    Exported<&TestService::keep>("keep:reply:"),
+    Exported<&TestService::make>("make:size:reply:"),
+    Exported<&TestService::describe>("describe:code:list:reply:"),
+};
+constexpr ExportedInterface kTestInterface{"TestProtocol", kTestMethods};
+
+class TestDelegate final : public ServiceListenerDelegate {
+ public:
+  explicit TestDelegate(Service& service) : service_(service) {}
+
+  bool shouldAcceptNewConnection(ServiceListener&,
+                                 const std::shared_ptr<ClientConnection>& connection) override {
+    const auto object = std::make_shared<TestService>(service_.ledger);
+    service_.connections.push_back(connection);
+    service_.objects.push_back(object);
+    EXPECT_EQ(connection->processIdentifier(), ::getpid());
+    connection->setExportedInterface(kTestInterface);
+    connection->setExportedObject(object);
+    // Holding the object, as a careless delegate might, must not keep anything alive.
+    connection->setInterruptionHandler([object] { Journal::shared().add("interrupted"); });
+    connection->setInvalidationHandler([object] { Journal::shared().add("invalidated"); });
+    connection->resume();
+    return service_.accepts;
+  }
+
+ private:
+  Service& service_;
+};
+
+ListeningSocket ListenAt(const std::filesystem::path& path) {
+  Result<ListeningSocket> socket = ListeningSocket::listeningAt(path);
+  EXPECT_TRUE(socket) << socket.error().description();
+  return std::move(socket.value());
+}
+
+}  // namespace
+
+Journal& Journal::shared() {
+  static Journal journal;
+  return journal;
+}
+
+void Journal::add(std::string entry) {
+  MutexLock lock(mutex_);
+  entries_.push_back(std::move(entry));
+  changed_.notifyAll();
+}
+
+void Journal::clear() {
+  MutexLock lock(mutex_);
+  entries_.clear();
+}
+
+std::vector<std::string> Journal::entries() {
+  MutexLock lock(mutex_);
+  return entries_;
+}
+
+std::size_t Journal::count(std::string_view part) {
+  MutexLock lock(mutex_);
+  return countLocked(part);
+}
+
+std::size_t Journal::countLocked(std::string_view part) {
+  return static_cast<std::size_t>(std::ranges::count_if(entries_, [part](const std::string& entry) {
+    return entry.find(part) != std::string::npos;
+  }));
+}
+
+bool Journal::waitFor(std::string_view part, std::size_t times) {
+  const auto deadline = std::chrono::steady_clock::now() + kPatience;
+  MutexLock lock(mutex_);
+  while (countLocked(part) < times) {
+    if (!changed_.waitUntil(mutex_, deadline)) return false;
+  }
+  return true;
+}
+
+void Ledger::arrived(std::int64_t number) {
+  MutexLock lock(mutex_);
+  numbers_.push_back(number);
+  changed_.notifyAll();
+}
+
+void Ledger::keep(std::int64_t number, Reply<std::int64_t> reply) {
+  MutexLock lock(mutex_);
+  numbers_.push_back(number);
+  kept_.push_back({number, std::move(reply), VoucherHold::current()});
+  largestKept_ = std::max(largestKept_, kept_.size());
+  changed_.notifyAll();
+}
+
+std::optional<Ledger::Kept> Ledger::takeKept() {
+  MutexLock lock(mutex_);
+  if (kept_.empty()) return std::nullopt;
+  std::optional<Kept> first = std::move(kept_.front());
+  kept_.pop_front();
+  return first;
+}
+
+std::vector<std::int64_t> Ledger::numbers() {
+  MutexLock lock(mutex_);
+  return numbers_;
+}
+
+std::size_t Ledger::largestKept() {
+  MutexLock lock(mutex_);
+  return largestKept_;
+}
+
+bool Ledger::waitForArrivals(std::size_t count) {
+  const auto deadline = std::chrono::steady_clock::now() + kPatience;
+  MutexLock lock(mutex_);
+  while (numbers_.size() < count) {
+    if (!changed_.waitUntil(mutex_, deadline)) return false;
+  }
+  return true;
+}
+
+TemporaryDirectory::TemporaryDirectory() {
+  std::string pattern = (std::filesystem::temp_directory_path() / "quarvel-XXXXXX").native();
+  EXPECT_NE(::mkdtemp(pattern.data()), nullptr);
+  path_ = pattern;
+}
+
+TemporaryDirectory::~TemporaryDirectory() {
+  std::filesystem::remove_all(path_);
+}
+
+Client::Client() : socket_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
+  const timeval patience{kPatience.count(), 0};
+  ::setsockopt(socket_.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+  ::setsockopt(socket_.get(), SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
+}
+
+void Client::connect(const std::filesystem::path& service) {
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::strncpy(address.sun_path, service.c_str(), sizeof address.sun_path - 1);
+  EXPECT_EQ(::connect(socket_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address),
+            0)
+      << std::strerror(errno);
+}
+
+bool Client::send(std::string_view bytes) {
+  while (!bytes.empty()) {
+    const ssize_t count = ::send(socket_.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL);
+    if (count <= 0) return false;
+    bytes.remove_prefix(static_cast<std::size_t>(count));
+  }
+  return true;
+}
+
+bool Client::call(std::uint32_t messageID, std::string_view method, List arguments) {
+  return send(CallBytes(messageID, method, std::move(arguments)));
+}
+
+std::string Client::response() {
+  MessagePackScanner scanner(std::size_t{1} << 30, MessagePackScanner::kDeepest);
+  for (;;) {
+    const std::string_view rest = std::string_view(received_).substr(taken_);
+    if (scanner.scan(rest) == MessagePackScanner::Progress::complete) {
+      taken_ += scanner.length();
+      return JsonText(PayloadValue(rest.data()).toValue());
+    }
+    received_.erase(0, taken_);
+    taken_ = 0;
+    char bytes[64 * 1024];
+    const ssize_t count = ::recv(socket_.get(), bytes, sizeof bytes, 0);
+    if (count < 0 && errno == EAGAIN) return "nothing came";
+    if (count <= 0) return "end";
+    received_.append(bytes, static_cast<std::size_t>(count));
+  }
+}
+
+bool Client::hearsNothing() {
+  pollfd descriptor{socket_.get(), POLLIN, 0};
+  return ::poll(&descriptor, 1, 0) == 0 && taken_ == received_.size();
+}
+
+bool Client::isServed() {
+  return call(4242, "echo:reply:", {kServedNumber}) && response() == "[1,4242,null,-1000]";
+}
+
+void Client::stopSending() {
+  ::shutdown(socket_.get(), SHUT_WR);
+}
+
+std::string CallBytes(std::optional<std::uint32_t> messageID, std::string_view method,
+                      const List& arguments) {
+  std::string bytes;
+  MessagePackWriter writer(bytes);
+  writer.list(messageID ? 4 : 3);
+  writer.integer(messageID ? 0 : 2);
+  if (messageID) writer.unsignedInteger(*messageID);
+  writer.string(method);
+  writer.value(Value(arguments));
+  return bytes;
+}
+
+Service::Service(const Configuration::Limits& limits, std::optional<ListeningSocket> socket,
+                 NotBegun) {
+  Journal::shared().clear();
+  SocketListener::Options options;
+  options.limits = limits;
+  options.atEnd.emplace_back([] { Journal::shared().add("ended"); });
+  auto listener = SocketListener::create(socket ? std::move(*socket) : ListenAt(socketPath()),
+                                         std::move(options));
+  EXPECT_TRUE(listener);
+  listener_ = std::move(listener.value());
+  listener_->setDelegate(std::make_shared<TestDelegate>(*this));
+}
+
+void Service::begin() {
+  thread_ = std::thread([this] { listener_->resume(); });
+}
+
+void Service::end() {
+  if (!thread_.joinable()) return;
+  requestEnd();
+  thread_.join();
+}
+
+}  // namespace quarvel

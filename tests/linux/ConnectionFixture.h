@@ -1,0 +1,152 @@
+#pragma once
+
+#include <atomic>
+#include <chrono>
+#include <cstdint>
+#include <deque>
+#include <filesystem>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <thread>
+#include <utility>
+#include <vector>
+
+#include "base/Mutex.h"
+#include "base/Payload.h"
+#include "base/Value.h"
+#include "platform/linux/connection/SocketListener.h"
+#include "platform/linux/work/Voucher.h"
+
+namespace quarvel {
+
+/// No test passes because of it; it only ends those that fail.
+inline constexpr std::chrono::seconds kPatience{60};
+
+/// What happened, in order: error lines of the log and what the handlers were told.
+class Journal {
+ public:
+  /// The one that this program's log is written to.
+  static Journal& shared();
+
+  void add(std::string entry);
+  void clear();
+  std::vector<std::string> entries();
+  std::size_t count(std::string_view part);
+  /// Waits until so many entries contain `part`.
+  bool waitFor(std::string_view part, std::size_t times = 1);
+
+ private:
+  std::size_t countLocked(std::string_view part) QUARVEL_REQUIRES(mutex_);
+
+  Mutex mutex_;
+  ConditionVariable changed_;
+  std::vector<std::string> entries_ QUARVEL_GUARDED_BY(mutex_);
+};
+
+/// What the exported objects of one service have been asked, and the calls they are still working
+/// on.
+class Ledger {
+ public:
+  struct Kept {
+    std::int64_t number;
+    Reply<std::int64_t> reply;
+    VoucherHold work;
+  };
+
+  void arrived(std::int64_t number);
+  /// As `arrived`; the call stays under way until taken and dropped.
+  void keep(std::int64_t number, Reply<std::int64_t> reply);
+  std::optional<Kept> takeKept();
+  std::vector<std::int64_t> numbers();
+  std::size_t largestKept();
+  bool waitForArrivals(std::size_t count);
+
+ private:
+  Mutex mutex_;
+  ConditionVariable changed_;
+  std::vector<std::int64_t> numbers_ QUARVEL_GUARDED_BY(mutex_);
+  std::deque<Kept> kept_ QUARVEL_GUARDED_BY(mutex_);
+  std::size_t largestKept_ QUARVEL_GUARDED_BY(mutex_) = 0;
+};
+
+/// A directory of its own for one test.
+class TemporaryDirectory {
+ public:
+  TemporaryDirectory();
+  ~TemporaryDirectory();
+  [[nodiscard]] const std::filesystem::path& path() const { return path_; }
+
+ private:
+  std::filesystem::path path_;
+};
+
+/// A client's end: writes bytes, reads responses.
+class Client {
+ public:
+  /// Not connected yet; has its descriptor.
+  Client();
+  explicit Client(const std::filesystem::path& service) : Client() { connect(service); }
+  void connect(const std::filesystem::path& service);
+
+  /// Sends all of it, waiting for the service to take it. False when the service has hung up.
+  bool send(std::string_view bytes);
+  bool call(std::uint32_t messageID, std::string_view method, List arguments);
+  /// The next response as JSON text; "end" when the service has hung up.
+  std::string response();
+  /// Whether there is nothing to read at this moment.
+  bool hearsNothing();
+  /// Calls echo with this number and says whether the answer, and nothing else, came back.
+  static constexpr std::int64_t kServedNumber = -1000;
+  bool isServed();
+  void stopSending();
+  void hangUp() { socket_ = UniqueDescriptor(); }
+
+ private:
+  UniqueDescriptor socket_;
+  std::string received_;
+  std::size_t taken_ = 0;
+};
+
+/// The bytes of a call; without an id, of a notification.
+std::string CallBytes(std::optional<std::uint32_t> messageID, std::string_view method,
+                      const List& arguments);
+
+/// A listener that serves on a thread of its own from `begin` to `end`.
+class Service {
+ public:
+  /// Begun. Listens at `socketPath` unless a socket is given.
+  explicit Service(const Configuration::Limits& limits = {},
+                   std::optional<ListeningSocket> socket = std::nullopt)
+      : Service(limits, std::move(socket), NotBegun()) {
+    begin();
+  }
+  /// Clients can connect, but nobody looks at them yet.
+  struct NotBegun {};
+  explicit Service(NotBegun notBegun) : Service({}, std::nullopt, notBegun) {}
+  ~Service() { end(); }
+
+  Client connect() { return Client(socketPath()); }
+  [[nodiscard]] std::filesystem::path socketPath() const { return directory_.path() / "socket"; }
+  void begin();
+  /// Returns when the listener has.
+  void end();
+  void requestEnd() { listener_->requestEnd(); }
+
+  /// What the delegate answers from now on.
+  std::atomic<bool> accepts = true;
+  const std::shared_ptr<Ledger> ledger = std::make_shared<Ledger>();
+  /// Of each connection, in order of acceptance; to be read when its end has been heard of.
+  std::vector<std::weak_ptr<ClientConnection>> connections;
+  std::vector<std::weak_ptr<ExportedObject>> objects;
+
+ private:
+  Service(const Configuration::Limits& limits, std::optional<ListeningSocket> socket, NotBegun);
+
+  TemporaryDirectory directory_;
+  std::unique_ptr<SocketListener> listener_;
+  std::thread thread_;
+};
+
+}  // namespace quarvel

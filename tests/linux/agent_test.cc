@@ -1,0 +1,149 @@
+#include "platform/linux/store/TelemetryAgent.h"
+
+#include <gmock/gmock.h>
+
+#include <future>
+#include <limits>
+#include <thread>
+
+#include "platform/linux/store/AnalyticsEventSink.h"
+#include "platform/linux/store/SecureRandom.h"
+#include "platform/linux/store/StoreError.h"
+#include "tests/linux/StoreFixture.h"
+
+namespace quarvel::testing {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::MatchesRegex;
+using ::testing::Optional;
+using ::testing::StartsWith;
+using Backends = std::optional<std::vector<std::string>>;
+
+class AgentTest : public StoreFixture {
+ protected:
+  std::shared_ptr<TelemetryStore> store_ = open({.clock = [] { return Date{}; }});
+  const Dictionary sessionInfo_{{kRelmReportingSessionInfoClientType, 19},
+                                {kRelmReportingSessionInfoClientVersion, 2.0},
+                                {kRelmReportingSessionInfoSessionID, 42},
+                                {kRelmReportingSessionInfoBatchEvent, true},
+                                {kRelmReportingSessionInfoHierarchyToken, "token"}};
+  const Dictionary userInfo_{{kRelmReportingUserInfoClientName, "tarnwick.quarvel"},
+                             {kRelmReportingUserInfoServiceName, "telephony_session"},
+                             {"Route", "speaker"}};
+  const Payload payload_{Dictionary{{"n", 1}}};
+
+  static Backends configuredBackends(RelmReportingSession& session) {
+    std::promise<std::pair<Backends, std::thread::id>> found;
+    session.startConfiguration([&found](const Backends& backends) {
+      found.set_value({backends, std::this_thread::get_id()});
+    });
+    const auto [backends, thread] = found.get_future().get();
+    EXPECT_NE(thread, std::this_thread::get_id());
+    return backends;
+  }
+  static std::optional<Error> flush(RelmReportingSession& session) {
+    std::promise<std::optional<Error>> done;
+    session.flushMessages([&done](const std::optional<Error>& error) { done.set_value(error); });
+    return done.get_future().get();
+  }
+};
+
+TEST_F(AgentTest, ASessionsMessagesCarryWhatItWasCreatedWith) {
+  TelemetryAgent agent(store_, {"store"});
+  auto session = agent.createAgentSession(sessionInfo_, userInfo_);
+  ASSERT_TRUE(session->agentSendMessage(0xffff, 3, payload_));
+  EXPECT_EQ(flush(*session), std::nullopt);
+  EXPECT_EQ(value("SELECT count(flushed_at) FROM agent_session"), "1");
+  session.reset();
+  Dictionary single{{kRelmReportingSessionInfoClientType, 19},
+                    {kRelmReportingSessionInfoSessionID, -1}};
+  ASSERT_TRUE(agent.sendOneMessage(single, userInfo_, 5, 6, payload_));
+  store_->close();
+  EXPECT_THAT(
+      rows("SELECT * FROM agent_session"),
+      ElementsAre(
+          "1|42|19|2.0|1|token|tarnwick.quarvel|telephony_session|"
+          R"({"ClientName":"tarnwick.quarvel","ServiceName":"telephony_session","Route":"speaker"}|0|0)"));
+  EXPECT_THAT(rows("SELECT agent_session, session_id, client_name, service_name, category, type, "
+                   "payload FROM message"),
+              ElementsAre(R"(1|42|tarnwick.quarvel|telephony_session|65535|3|{"n":1})",
+                          R"(-|-1|tarnwick.quarvel|telephony_session|5|6|{"n":1})"));
+}
+
+// A row that the database would refuse, for a NULL say, would stop every row behind it.
+TEST_F(AgentTest, MissingAndMisshapenInformationStillMakesARow) {
+  TelemetryAgent agent(store_, {"store"});
+  const Dictionary odd{
+      {kRelmReportingSessionInfoClientType, "nineteen"},
+      {kRelmReportingSessionInfoClientVersion, std::numeric_limits<double>::quiet_NaN()},
+      {kRelmReportingSessionInfoBatchEvent, 1},
+      {5, nullptr}};
+  const auto first = agent.createAgentSession({}, {});
+  const auto second = agent.createAgentSession(odd, {{kRelmReportingUserInfoClientName, 7}});
+  ASSERT_TRUE(agent.sendOneMessage({}, {}, 0, 0, Payload()));
+  EXPECT_EQ(flush(*second), std::nullopt);
+  EXPECT_THAT(rows("SELECT * FROM agent_session"),
+              ElementsAre("1|-1|0|0.0|0||||{}|0|-", R"(2|-1|0|0.0|0||||{"ClientName":7}|0|0)"));
+  EXPECT_THAT(rows("SELECT session_id, client_name, payload FROM message"), ElementsAre("-1||{}"));
+}
+
+TEST_F(AgentTest, ConfigurationFindsTheBackendsThatCanTakeDataNow) {
+  const auto found = [this](std::vector<std::string> configured) {
+    TelemetryAgent agent(store_, std::move(configured));
+    return configuredBackends(*agent.createAgentSession(sessionInfo_, userInfo_));
+  };
+  EXPECT_THAT(found({"store"}), Optional(ElementsAre("store")));
+  EXPECT_EQ(found({}), std::nullopt);
+  store_->close();
+  EXPECT_EQ(found({"store"}), std::nullopt);
+}
+
+TEST_F(AgentTest, AClosedStoreIsAnErrorForEveryOperation) {
+  TelemetryAgent agent(store_, {"store"});
+  const auto before = agent.createAgentSession(sessionInfo_, userInfo_);
+  store_->close();
+  const auto after = agent.createAgentSession(sessionInfo_, userInfo_);
+  for (const auto& session : {before, after}) {
+    const Outcome sent = session->agentSendMessage(1, 1, payload_);
+    ASSERT_FALSE(sent);
+    EXPECT_THAT(sent.error().description(), StartsWith("quarvel.store 1: "));
+    EXPECT_EQ(flush(*session), sent.error());
+  }
+  EXPECT_FALSE(agent.sendOneMessage(sessionInfo_, userInfo_, 1, 1, payload_));
+}
+
+TEST_F(AgentTest, TokensAreDifferentAndBelowTheirParents) {
+  const std::string parent = NewHierarchyToken(std::nullopt);
+  EXPECT_THAT(parent, MatchesRegex("[0-9a-f]{32}"));
+  EXPECT_NE(parent, NewHierarchyToken(std::nullopt));
+  EXPECT_THAT(NewHierarchyToken(parent), StartsWith(parent + "."));
+}
+
+TEST_F(AgentTest, AnUnwantedAnalyticsEventIsNeverBuilt) {
+  const struct {
+    const char* name;
+    std::vector<std::string> wanted;
+    std::vector<std::string> kept;
+  } cases[] = {{"all", {"*"}, {"a.haptics.x", "a.music.y", "b"}},
+               {"none", {}, {}},
+               {"some", {"a.*.[xz]", "?"}, {"a.haptics.x", "b"}}};
+  for (const auto& wanted : cases) {
+    SCOPED_TRACE(wanted.name);
+    AnalyticsEventSink sink(store_, wanted.wanted);
+    std::vector<std::string> built;
+    for (const std::string name : {"a.haptics.x", "a.music.y", "b"}) {
+      sink.sendEventLazy(name, [&] {
+        built.push_back(name);
+        return payload_;
+      });
+    }
+    EXPECT_EQ(built, wanted.kept);
+  }
+  store_->close();
+  EXPECT_THAT(rows("SELECT name FROM analytics_event ORDER BY id"),
+              ElementsAre("a.haptics.x", "a.music.y", "b", "a.haptics.x", "b"));
+}
+
+}  // namespace
+}  // namespace quarvel::testing

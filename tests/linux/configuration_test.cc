@@ -1,0 +1,320 @@
+#include "platform/linux/system/Configuration.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <string>
+#include <vector>
+
+#include "platform/DeviceProperties.h"
+#include "platform/linux/system/Directories.h"
+
+namespace quarvel {
+namespace {
+
+namespace fs = std::filesystem;
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::IsEmpty;
+
+class ConfigurationTest : public testing::Test {
+ protected:
+  void SetUp() override {
+    std::string name = testing::TempDir() + "configurationXXXXXX";
+    directory_ = mkdtemp(name.data());
+  }
+  void TearDown() override { fs::remove_all(directory_); }
+
+  Result<Configuration> read(const std::string& text) {
+    std::ofstream(file()) << text;
+    warnings_.clear();
+    return Configuration::read(file(), warnings_);
+  }
+  [[nodiscard]] fs::path file() const { return directory_ / "quarvel.toml"; }
+
+  fs::path directory_;
+  std::vector<std::string> warnings_;
+};
+
+TEST_F(ConfigurationTest, EveryKeyReachesItsPlace) {
+  const Result<Configuration> result = read(R"(
+[device]
+InternalBuild = true
+DeviceClassNumber = 7
+Model = "Marl"
+[log]
+level = "info"
+[store]
+path = "/data/t.db"
+sync_ms = 0
+max_bytes = 1048576
+max_age_days = 3
+[agent]
+backends = ["otlp", "store"]
+export = false
+drain_rows_per_second = 5
+nats.servers = ["one"]
+[agent.otlp]
+endpoint = "two"
+[analytics]
+wanted = ["tarnwick.*", "other"]
+[tallix]
+root = "/sys/tallix"
+[[tallix.channel]]
+group = "g"
+subgroup = "s"
+name = "n"
+file = "/proc/x"
+pattern = "p"
+[[tallix.channel]]
+group = "g2"
+name = "n2"
+file = "/proc/y"
+[orientation]
+source = "iio"
+[limits]
+message_bytes = 2048
+reply_bytes = 4096
+frame_seconds = 1
+stall_seconds = 2
+depth = 128
+queued_calls = 3
+queued_bytes = 8192
+connections = 4
+)");
+  ASSERT_TRUE(result.ok()) << result.error().description();
+  EXPECT_THAT(warnings_, IsEmpty());
+  const Configuration& read = result.value();
+  EXPECT_EQ(std::get<bool>(read.device.at("InternalBuild")), true);
+  EXPECT_EQ(std::get<std::int64_t>(read.device.at("DeviceClassNumber")), 7);
+  EXPECT_EQ(std::get<std::string>(read.device.at("Model")), "Marl");
+  EXPECT_EQ(read.logLevel, LogLevel::info);
+  EXPECT_EQ(read.store.path, "/data/t.db");
+  EXPECT_EQ(read.store.sync.count(), 0);
+  EXPECT_EQ(read.store.maximumBytes, 1048576U);
+  EXPECT_EQ(read.store.maximumAge.count(), 3);
+  EXPECT_THAT(read.agent.backends, ElementsAre("otlp", "store"));
+  EXPECT_FALSE(read.agent.exports);
+  EXPECT_EQ(read.agent.drainRowsPerSecond, 5U);
+  EXPECT_THAT(read.analyticsWanted, ElementsAre("tarnwick.*", "other"));
+  EXPECT_EQ(read.tallix.root, "/sys/tallix");
+  ASSERT_EQ(read.tallix.channels.size(), 2U);
+  EXPECT_EQ(read.tallix.channels[0].subgroup, "s");
+  EXPECT_EQ(read.tallix.channels[0].pattern, "p");
+  EXPECT_EQ(read.tallix.channels[1].group, "g2");
+  EXPECT_EQ(read.tallix.channels[1].name, "n2");
+  EXPECT_EQ(read.tallix.channels[1].file, "/proc/y");
+  EXPECT_EQ(read.orientation, Configuration::OrientationSource::iio);
+  EXPECT_EQ(read.limits.messageBytes, 2048U);
+  EXPECT_EQ(read.limits.replyBytes, 4096U);
+  EXPECT_EQ(read.limits.frame.count(), 1);
+  EXPECT_EQ(read.limits.stall.count(), 2);
+  EXPECT_EQ(read.limits.depth, 128U);
+  EXPECT_EQ(read.limits.queuedCalls, 3U);
+  EXPECT_EQ(read.limits.queuedBytes, 8192U);
+  EXPECT_EQ(read.limits.connections, 4U);
+}
+
+TEST_F(ConfigurationTest, AbsentFileAndAbsentKeysLeaveTheDefaults) {
+  std::vector<std::string> warnings;
+  for (const fs::path& absent : {directory_ / "none.toml", directory_ / "none" / "quarvel.toml"}) {
+    EXPECT_TRUE(Configuration::read(absent, warnings).ok()) << absent;
+  }
+  const Result<Configuration> partial = read("[limits]\ndepth = 1\n[agent]\nbackends = []\n");
+  ASSERT_TRUE(partial.ok());
+  EXPECT_EQ(partial.value().limits.depth, 1U);
+  EXPECT_EQ(partial.value().limits.connections, 4096U);
+  EXPECT_THAT(partial.value().agent.backends, IsEmpty());
+}
+
+TEST_F(ConfigurationTest, WrongValueNamesFileLineKeyAndWhatIsAllowed) {
+  struct Fault {
+    const char* text;
+    const char* said;
+  };
+  const Fault faults[] = {
+      {"[limits]\ndepth = 129", ":2: limits.depth must be an integer from 1 to 128, but is 129."},
+      {"[limits]\n\ndepth = 0", ":3: limits.depth must be an integer from 1 to 128, but is 0."},
+      {"[limits]\ndepth = '9'", ":2: limits.depth must be an integer from 1 to 128, but is \"9\"."},
+      {"[store]\nsync_ms = -1", ":2: store.sync_ms must be an integer from 0 to 60000, but is -1."},
+      {"[store]\nsync_ms = 1.5", "but is the real 1.5."},
+      {"[store]\nmax_bytes = 5",
+       "store.max_bytes must be an integer of at least 1048576, but is 5."},
+      {"[store]\npath = 5", ":2: store.path must be a string, a path, but is 5."},
+      {"[log]\nlevel = 'loud'",
+       ":2: log.level must be one of \"error\", \"default\", \"info\", \"debug\", but is "
+       "\"loud\"."},
+      {"[agent]\nbackends = 'store'", ":2: agent.backends must be a list of"},
+      {"[agent]\nbackends = [\n'store',\n'kafka']", ":4: agent.backends[1] must be"},
+      {"[agent]\nbackends = ['store', 'store']", "each at most once, but is \"store\"."},
+      {"[agent]\nexport = 1", ":2: agent.export must be true or false, but is 1."},
+      {"[agent]\nnats = 1", ":2: agent.nats must be a table, but is 1."},
+      {"[analytics]\nwanted = ['']", ":2: analytics.wanted[0] must be"},
+      {"[device]\nA = 2026-01-31", ":2: device.A must be a boolean, an integer or a string"},
+      {"\nstore = []", ":2: store must be a table, but is a list."},
+      {"[tallix.channel]\nname = 'n'",
+       ":1: tallix.channel must be tables, each [[tallix.channel]]"},
+      {"[[tallix.channel]]\ngroup = 'g'\nname = 'n'", ":1: tallix.channel.file is missing."},
+      {"[orientation]\nsource = 'compass'", ":2: orientation.source must be one of"},
+      {"[limits]\nframe_seconds = 0", ":2: limits.frame_seconds must be"},
+      {"[limits]\ndepth = ", ":2: "},
+      {"[limits]\ndepth = 1\ndepth = 2", ":3: "},
+  };
+  for (const Fault& fault : faults) {
+    const Result<Configuration> result = read(fault.text);
+    ASSERT_FALSE(result.ok()) << fault.text;
+    EXPECT_EQ(result.error().domain, "quarvel.configuration");
+    EXPECT_THAT(result.error().description(), HasSubstr(file().native() + ":")) << fault.text;
+    EXPECT_THAT(result.error().description(), HasSubstr(fault.said)) << fault.text;
+  }
+}
+
+TEST_F(ConfigurationTest, UnknownKeysAreWarningsOnly) {
+  const Result<Configuration> result = read(
+      "top = 1\n[limits]\ndepht = 5\n[agent.nats]\nmine = 1\n[[tallix.channel]]\n"
+      "group='g'\nname='n'\nfile='f'\nfiel='f'\n");
+  ASSERT_TRUE(result.ok());
+  EXPECT_THAT(warnings_, testing::UnorderedElementsAre(
+                             file().native() + ":1: top is no key of ours.",
+                             file().native() + ":3: limits.depht is no key of ours.",
+                             file().native() + ":10: tallix.channel.fiel is no key of ours."));
+}
+
+TEST_F(ConfigurationTest, FileThatCannotBeReadIsAnErrorNotAnAbsentOne) {
+  fs::create_directory(file());
+  const Result<Configuration> result = Configuration::read(file(), warnings_);
+  ASSERT_FALSE(result.ok());
+  EXPECT_THAT(result.error().description(), HasSubstr("Is a directory"));
+}
+
+using ConfigurationDeathTest = ConfigurationTest;
+
+TEST_F(ConfigurationDeathTest, ProcessWithWrongValueSaysSoAndEndsWithOne) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_EXIT(
+      {
+        std::ofstream(file()) << "[limits]\ndepth = 0\n";
+        setenv("CONFIGURATION_DIRECTORY", directory_.c_str(), 1);
+        static_cast<void>(Configuration::process());
+      },
+      testing::ExitedWithCode(1), HasSubstr("quarvel.toml:2: limits.depth must be"));
+  EXPECT_EXIT(
+      {
+        std::ofstream(file()) << "[device]\nInternalBuild = true\nDeviceClassNumber = 4\n[lgo]\n";
+        setenv("CONFIGURATION_DIRECTORY", directory_.c_str(), 1);
+        const bool right = DevicePropertyBoolean("InternalBuild") == true &&
+                           DevicePropertyInteger("DeviceClassNumber") == 4 &&
+                           !DevicePropertyInteger("InternalBuild") &&
+                           !DevicePropertyBoolean("Absent");
+        std::exit(right ? 0 : 1);
+      },
+      testing::ExitedWithCode(0), HasSubstr("quarvel.toml:4: lgo is no key of ours."));
+}
+
+using Variables = std::map<std::string, std::string>;
+
+class Environment {
+ public:
+  explicit Environment(const Variables& variables) {
+    for (const char* name : kNames) {
+      const char* const value = std::getenv(name);
+      if (value != nullptr) before_.emplace(name, value);
+      unsetenv(name);
+    }
+    for (const auto& [name, value] : variables) setenv(name.c_str(), value.c_str(), 1);
+  }
+  ~Environment() {
+    for (const char* name : kNames) unsetenv(name);
+    for (const auto& [name, value] : before_) setenv(name.c_str(), value.c_str(), 1);
+  }
+  Environment(const Environment&) = delete;
+  Environment& operator=(const Environment&) = delete;
+
+ private:
+  static constexpr const char* kNames[] = {"RUNTIME_DIRECTORY",
+                                           "STATE_DIRECTORY",
+                                           "CONFIGURATION_DIRECTORY",
+                                           "XDG_RUNTIME_DIR",
+                                           "XDG_STATE_HOME",
+                                           "XDG_CONFIG_HOME",
+                                           "HOME",
+                                           "QUARVEL_SOCKET",
+                                           "QUARVEL_DIAGNOSTICS_PREFIX"};
+  Variables before_;
+};
+
+TEST(DirectoriesTest, FirstThatAppliesIsTaken) {
+  struct Case {
+    const char* name;
+    Variables variables;
+    bool root;
+    const char* runtime;
+    const char* state;
+    const char* configuration;
+    const char* socket;
+  };
+  const Case cases[] = {
+      {"systemd, even for root",
+       {{"RUNTIME_DIRECTORY", "/r/a:/r/b"},
+        {"STATE_DIRECTORY", "/s"},
+        {"CONFIGURATION_DIRECTORY", "/c"},
+        {"XDG_RUNTIME_DIR", "/x"}},
+       true,
+       "/r/a",
+       "/s",
+       "/c",
+       "/r/a/reporting.sock"},
+      {"root",
+       {{"XDG_RUNTIME_DIR", "/x"}, {"XDG_STATE_HOME", "/x"}, {"HOME", "/root"}},
+       true,
+       "/run/quarvel",
+       "/var/lib/quarvel",
+       "/etc/quarvel",
+       "/run/quarvel/reporting.sock"},
+      {"user with XDG",
+       {{"XDG_RUNTIME_DIR", "/x/r"}, {"XDG_STATE_HOME", "/x/s"}, {"XDG_CONFIG_HOME", "/x/c"}},
+       false,
+       "/x/r/quarvel",
+       "/x/s/quarvel",
+       "/x/c/quarvel",
+       "/x/r/quarvel/reporting.sock"},
+      {"user without, relative and empty ones ignored",
+       {{"HOME", "/home/u"},
+        {"XDG_RUNTIME_DIR", "/x/r"},
+        {"XDG_STATE_HOME", "s"},
+        {"XDG_CONFIG_HOME", ""},
+        {"STATE_DIRECTORY", ""}},
+       false,
+       "/x/r/quarvel",
+       "/home/u/.local/state/quarvel",
+       "/home/u/.config/quarvel",
+       "/x/r/quarvel/reporting.sock"},
+      {"socket elsewhere",
+       {{"RUNTIME_DIRECTORY", "/r"}, {"QUARVEL_SOCKET", "/tmp/s"}},
+       true,
+       "/r",
+       "/var/lib/quarvel",
+       "/etc/quarvel",
+       "/tmp/s"},
+  };
+  for (const Case& each : cases) {
+    SCOPED_TRACE(each.name);
+    const Environment environment(each.variables);
+    const Directories directories = Directories::fromEnvironment(each.root);
+    EXPECT_EQ(directories.runtime, each.runtime);
+    EXPECT_EQ(directories.state, each.state);
+    EXPECT_EQ(directories.configuration, each.configuration);
+    EXPECT_EQ(directories.socket, each.socket);
+    EXPECT_EQ(directories.diagnosticsPrefix, "");
+  }
+  const Environment environment(Variables{{"QUARVEL_DIAGNOSTICS_PREFIX", "/tmp/p"}});
+  EXPECT_EQ(Directories::fromEnvironment(false).diagnosticsPrefix, "/tmp/p");
+}
+
+}  // namespace
+}  // namespace quarvel

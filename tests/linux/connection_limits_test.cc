@@ -1,0 +1,203 @@
+// Clients that are too fast, too slow or too many: bounded, held back, and never at others' cost.
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/resource.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <numeric>
+#include <string>
+#include <thread>
+
+#include "tests/linux/ConnectionFixture.h"
+
+namespace quarvel {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+using namespace std::chrono_literals;
+
+std::vector<std::int64_t> Numbers(std::size_t count) {
+  std::vector<std::int64_t> numbers(count);
+  std::iota(numbers.begin(), numbers.end(), 0);
+  return numbers;
+}
+
+TEST(ConnectionLimits, AClientThatIsTooFastWaitsAndLosesNothing) {
+  Configuration::Limits byCalls;
+  byCalls.queuedCalls = 8;
+  Configuration::Limits byBytes;
+  byBytes.queuedBytes = 8 * CallBytes(100, "keep:reply:", {100}).size();
+  for (const Configuration::Limits& limits : {byCalls, byBytes}) {
+    constexpr std::size_t kCalls = 100;
+    Service service(limits);
+    Client client = service.connect();
+    std::string bytes;
+    for (std::size_t i = 0; i < kCalls; ++i) {
+      bytes += CallBytes(static_cast<std::uint32_t>(100 + i), "keep:reply:", {i});
+    }
+    ASSERT_TRUE(client.send(bytes));
+    ASSERT_TRUE(service.ledger->waitForArrivals(8));
+    EXPECT_TRUE(service.connect().isServed()) << "only the fast client waits";
+
+    // Worked off on another thread; each reply is given before its work is done.
+    std::thread worker([&] {
+      for (std::size_t done = 0; done < kCalls;) {
+        if (auto kept = service.ledger->takeKept()) {
+          kept->reply(kept->number);
+          ++done;
+        } else {
+          service.ledger->waitForArrivals(done + 2);  // the other client's call counts too
+        }
+      }
+    });
+    for (std::size_t i = 0; i < kCalls; ++i) {
+      ASSERT_THAT(client.response(), HasSubstr(",null," + std::to_string(i) + "]"));
+    }
+    worker.join();
+    std::vector<std::int64_t> arrived = service.ledger->numbers();
+    EXPECT_EQ(arrived.at(8), Client::kServedNumber)
+        << "more than eight calls were taken in before one was done";
+    arrived.erase(arrived.begin() + 8);
+    EXPECT_EQ(arrived, Numbers(kCalls));
+    EXPECT_LE(service.ledger->largestKept(), 9U);
+  }
+}
+
+TEST(ConnectionLimits, AClientThatReadsLateIsHeldBackAndGetsEveryReply) {
+  constexpr std::size_t kCalls = 300;
+  Configuration::Limits limits;
+  limits.replyBytes = 64 * 1024;
+  Service service(limits);
+  Client client = service.connect();
+  std::string bytes;
+  for (std::size_t i = 0; i < kCalls; ++i) {
+    bytes += CallBytes(static_cast<std::uint32_t>(i), "make:size:reply:", {i, 16 * 1024});
+  }
+  ASSERT_TRUE(client.send(bytes));
+  Client bystander = service.connect();
+  ASSERT_TRUE(bystander.isServed());
+  // What the kernel takes and `replyBytes` hold is far from all.
+  ASSERT_TRUE(bystander.isServed());
+  EXPECT_LT(service.ledger->numbers().size(), kCalls / 2);
+  for (std::size_t i = 0; i < kCalls; ++i) {
+    ASSERT_EQ(client.response().substr(0, 12 + std::to_string(i).size()),
+              "[1," + std::to_string(i) + ",null,\"xx");
+  }
+  EXPECT_TRUE(Journal::shared().entries().empty());
+}
+
+TEST(ConnectionLimits, AClientThatNeverReadsIsDisconnected) {
+  Configuration::Limits limits;
+  limits.replyBytes = 64 * 1024;
+  limits.stall = 50ms;
+  Service service(limits);
+  Client bystander = service.connect();
+  Client client = service.connect();
+  std::string bytes;
+  for (int i = 0; i < 300; ++i) bytes += CallBytes(1, "make:size:reply:", {i, 16 * 1024});
+  ASSERT_TRUE(client.send(bytes));
+  ASSERT_TRUE(Journal::shared().waitFor("invalidated"));
+  EXPECT_THAT(Journal::shared().entries(),
+              ElementsAre("error: client " + std::to_string(::getpid()) +
+                              " is disconnected: it does not read its replies",
+                          "invalidated"));
+  EXPECT_TRUE(bystander.isServed());
+}
+
+TEST(ConnectionLimits, RepliesThatComeLaterCountToo) {
+  Configuration::Limits limits;
+  limits.replyBytes = 1024;
+  limits.stall = 1ms;
+  limits.queuedCalls = 10'000;
+  Service service(limits);
+  Client bystander = service.connect();
+  Client client = service.connect();
+  constexpr std::size_t kCalls = 2000;  // their replies are more than a socket takes unread
+  for (std::size_t i = 0; i < kCalls; ++i) ASSERT_TRUE(client.call(1, "keep:reply:", {1 << 30}));
+  ASSERT_TRUE(service.ledger->waitForArrivals(kCalls));
+  // One by one, so that writing has come to a halt well before too much is held.
+  while (auto kept = service.ledger->takeKept()) {
+    kept->reply(kept->number);
+    ASSERT_TRUE(bystander.isServed());
+  }
+  EXPECT_TRUE(Journal::shared().waitFor("does not read its replies"));
+}
+
+TEST(ConnectionLimits, AMessageThatIsNeverCompletedEndsItsConnection) {
+  Configuration::Limits limits;
+  limits.frame = 50ms;
+  Service service(limits);
+  Client bystander = service.connect();
+  Client client = service.connect();
+  ASSERT_TRUE(bystander.isServed());
+  const std::string call = CallBytes(1, "echo:reply:", {1});
+  ASSERT_TRUE(client.send(call + call.substr(0, 5)));
+  EXPECT_EQ(client.response(), "[1,1,null,1]");
+  EXPECT_EQ(client.response(), "end");
+  ASSERT_TRUE(Journal::shared().waitFor("invalidated"));
+  EXPECT_THAT(Journal::shared().entries(),
+              ElementsAre(HasSubstr("is disconnected: a message was begun"), "invalidated"));
+  EXPECT_TRUE(bystander.isServed()) << "a client with nothing to say has no deadline";
+}
+
+TEST(ConnectionLimits, AMessageThatTheServiceHoldsBackHasNoDeadline) {
+  Configuration::Limits limits;
+  limits.frame = 1ms;
+  limits.queuedCalls = 1;
+  Service service(limits);
+  Client client = service.connect();
+  Client other = service.connect();
+  const std::string keep = CallBytes(1, "keep:reply:", {1});
+  ASSERT_TRUE(client.send(keep + keep + CallBytes(2, "echo:reply:", {2}).substr(0, 5)));
+  ASSERT_TRUE(service.ledger->waitForArrivals(1));
+  // The other's message times out meanwhile.
+  ASSERT_TRUE(other.send(keep.substr(0, 5)));
+  EXPECT_EQ(other.response(), "end");
+  service.ledger->takeKept()->reply(1);
+  EXPECT_EQ(client.response(), "[1,1,null,1]");
+}
+
+TEST(ConnectionLimits, BeyondTheLimitClientsWaitUntilOneHasGone) {
+  Configuration::Limits limits;
+  limits.connections = 2;
+  Service service(limits);
+  Client first = service.connect();
+  Client second = service.connect();
+  ASSERT_TRUE(first.isServed());
+  ASSERT_TRUE(second.isServed());
+  Client third = service.connect();
+  ASSERT_TRUE(third.call(1, "echo:reply:", {1}));
+  ASSERT_TRUE(second.isServed());
+  EXPECT_TRUE(third.hearsNothing());
+  first.hangUp();
+  EXPECT_EQ(third.response(), "[1,1,null,1]");
+  EXPECT_EQ(Journal::shared().count("no further client is accepted"), 1U);
+}
+
+TEST(ConnectionLimits, WithoutDescriptorsClientsWaitUntilThereAreSome) {
+  Service service;
+  Client first = service.connect();
+  Client second = service.connect();
+  ASSERT_TRUE(first.isServed());
+  ASSERT_TRUE(second.isServed());
+  // Made before, so that only the service runs out.
+  Client third;
+  rlimit before{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &before), 0);
+  const rlimit none{0, before.rlim_max};
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &none), 0);
+  third.connect(service.socketPath());
+  ASSERT_TRUE(third.call(1, "echo:reply:", {1}));
+  EXPECT_TRUE(Journal::shared().waitFor("no further client is accepted"));
+  EXPECT_TRUE(second.isServed());
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &before), 0);
+  first.hangUp();
+  EXPECT_EQ(third.response(), "[1,1,null,1]");
+  EXPECT_EQ(Journal::shared().count("no further client is accepted"), 1U) << "said once";
+}
+
+}  // namespace
+}  // namespace quarvel

@@ -1,0 +1,492 @@
+#include "platform/linux/store/TelemetryStore.h"
+
+#include <gmock/gmock.h>
+#include <sys/stat.h>
+
+#include <atomic>
+#include <fstream>
+#include <future>
+#include <limits>
+#include <set>
+#include <thread>
+
+#include "platform/linux/store/StoreError.h"
+#include "tests/linux/LogRecorder.h"
+#include "tests/linux/StoreFixture.h"
+#include "tests/linux/StoreVfs.h"
+
+namespace quarvel::testing {
+namespace {
+
+using ::testing::AllOf;
+using ::testing::ElementsAre;
+using ::testing::Field;
+using ::testing::HasSubstr;
+using ::testing::MatchesRegex;
+using namespace std::chrono_literals;
+
+class StoreTest : public StoreFixture {
+ protected:
+  StoreTest() { LogRecorder::take(); }
+
+  static Payload payload(std::int64_t number) { return Payload(Dictionary{{"n", number}}); }
+  static Outcome send(TelemetryStore& store, std::int64_t number, std::int64_t sessionID = 7) {
+    return store.addMessage({std::nullopt, sessionID, "client", "service", 1, 2, payload(number)});
+  }
+  static Outcome send(TelemetryStore& store, const Payload& payload) {
+    return store.addMessage({std::nullopt, 7, "client", "service", 1, 2, payload});
+  }
+  static void sendAndAwait(TelemetryStore& store, std::int64_t number) {
+    const std::uint64_t before = store.counters().stored;
+    ASSERT_TRUE(send(store, number));
+    Await([&] { return store.counters().stored > before; });
+  }
+  static std::vector<std::string> errorLines() {
+    std::vector<std::string> messages;
+    for (const LogRecorder::Line& line : LogRecorder::take()) {
+      if (line.level == LogLevel::error) messages.push_back(line.message);
+    }
+    return messages;
+  }
+  std::uintmax_t fileBytes() const { return std::filesystem::file_size(path_); }
+};
+
+MATCHER(IsBalanced, "accepted = stored + waiting + dropped") {
+  return arg.accepted == arg.stored + arg.waiting + arg.droppedByRetention + arg.refused + arg.lost;
+}
+
+TEST_F(StoreTest, KeepsEachKindOfRowWithAllItWasGiven) {
+  Date now{1'000'000us};
+  auto store = open({.clock = [&now] { return now; }});
+  const Payload info(Dictionary{{"HostApplicationDisplayID", "app"}});
+  const auto session =
+      store->addAgentSession({-5, 19, 2.0, true, "token", "client", "music_session", info});
+  ASSERT_TRUE(session);
+  ASSERT_TRUE(store->addMessage(
+      {session.value(), -5, "client", "music_session", 0xffff, 65535, payload(1)}));
+  ASSERT_TRUE(store->addMessage({std::nullopt, -1, "client", "alarms", 3, 4, payload(2)}));
+  ASSERT_TRUE(store->addAnalyticsEvent("an.event", payload(3)));
+  ASSERT_TRUE(store->addPowerEvent(-28, "", payload(4)));
+  store->close();
+
+  EXPECT_THAT(rows("SELECT * FROM agent_session"),
+              ElementsAre("1|-5|19|2.0|1|token|client|music_session|"
+                          R"({"HostApplicationDisplayID":"app"}|1000000|-)"));
+  EXPECT_THAT(rows("SELECT * FROM message"),
+              ElementsAre(R"(1|1|-5|client|music_session|65535|65535|{"n":1}|1000000)",
+                          R"(2|-|-1|client|alarms|3|4|{"n":2}|1000000)"));
+  EXPECT_THAT(rows("SELECT * FROM analytics_event"), ElementsAre(R"(1|an.event|{"n":3}|1000000)"));
+  EXPECT_THAT(rows("SELECT * FROM power_event"), ElementsAre(R"(1|-28||{"n":4}|1000000)"));
+}
+
+TEST_F(StoreTest, WritesPayloadsAsJsonThatKeepsOrderAndKinds) {
+  auto store = open();
+  const Payload odd(Dictionary{{"z", Date{1'234'567us}},
+                               {"a", Bytes{std::string("\0\xff", 2)}},
+                               {-3, std::numeric_limits<double>::quiet_NaN()},
+                               {"inf", -std::numeric_limits<double>::infinity()},
+                               {"big", std::numeric_limits<std::uint64_t>::max()},
+                               {"list", List{Value(true), Value(nullptr), Value(2.5)}},
+                               {"text", "\"\n\xc3\xa4"}});
+  ASSERT_TRUE(send(*store, odd));
+  ASSERT_TRUE(send(*store, Payload()));
+  store->close();
+  EXPECT_THAT(rows("SELECT payload FROM message ORDER BY id"),
+              ElementsAre(R"({"z":"1970-01-01T00:00:01.234567Z","a":"AP8=","-3":"NaN",)"
+                          R"("inf":"-Infinity","big":18446744073709551615,"list":[true,null,2.5],)"
+                          "\"text\":\"\\\"\\n\xc3\xa4\"}",
+                          "{}"));
+}
+
+TEST_F(StoreTest, SaysWhatItIsAndGoesOnWhereItEnded) {
+  const mode_t mask = umask(0077);
+  auto store = open();
+  umask(mask);
+  struct stat status {};
+  ASSERT_EQ(stat(path_.c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 0777, 0640U);
+  EXPECT_EQ(value("PRAGMA application_id"), std::to_string(0x51525654));
+  EXPECT_EQ(value("PRAGMA user_version"), "1");
+  EXPECT_EQ(value("PRAGMA journal_mode"), "wal");
+  const std::string storeID = value("SELECT value FROM meta WHERE key = 'store_id'");
+  EXPECT_THAT(storeID,
+              MatchesRegex("[0-9a-f]{8}-[0-9a-f]{4}-4[0-9a-f]{3}-[89ab][0-9a-f]{3}-[0-9a-f]{12}"));
+  const Payload info;
+  ASSERT_TRUE(store->addAgentSession({1, 19, 2.0, true, "t", "c", "s", info}));
+  ASSERT_TRUE(send(*store, 1));
+  store.reset();
+
+  store = open();
+  EXPECT_EQ(store->addAgentSession({1, 19, 2.0, true, "t", "c", "s", info}).value(), 2);
+  ASSERT_TRUE(send(*store, 2));
+  EXPECT_EQ(store->counters().accepted, 2U);
+  store.reset();
+  EXPECT_EQ(value("SELECT value FROM meta WHERE key = 'store_id'"), storeID);
+  EXPECT_THAT(rows("SELECT id, payload FROM message ORDER BY id"),
+              ElementsAre(R"(1|{"n":1})", R"(2|{"n":2})"));
+  EXPECT_FALSE(std::filesystem::exists(path_.string() + "-wal")) << "a closed store is one file";
+}
+
+// A store that cannot be used is left alone, and the reason says what to do.
+TEST_F(StoreTest, RefusesWhatIsNotItsOwnAndSaysWhatToDo) {
+  open().reset();
+  const auto refusal = [](const std::filesystem::path& path) {
+    TelemetryStore::Options options;
+    options.path = path;
+    const auto store = TelemetryStore::open(options);
+    return store ? "opened" : store.error().description();
+  };
+  execute("PRAGMA user_version = 2");
+  EXPECT_THAT(refusal(path_),
+              AllOf(HasSubstr("quarvel.store 5"), HasSubstr("version 2"), HasSubstr("Install")));
+  EXPECT_EQ(value("PRAGMA user_version"), "2");
+  execute("PRAGMA user_version = 1; PRAGMA application_id = 5");
+  EXPECT_THAT(refusal(path_), AllOf(HasSubstr("quarvel.store 6"), HasSubstr("another program")));
+  EXPECT_THAT(refusal(directory_ / "no" / "telemetry.db"),
+              AllOf(HasSubstr("quarvel.store 4"), HasSubstr("Make the directory")));
+  EXPECT_THAT(refusal("/sys/telemetry.db"),
+              AllOf(HasSubstr("quarvel.store 4"), HasSubstr("Let the service write to /sys")));
+  EXPECT_THAT(refusal(directory_), HasSubstr("quarvel.store 4"));
+  EXPECT_THAT(errorLines(), ::testing::IsEmpty());
+}
+
+struct Damage {
+  const char* name;
+  void (*inflict)(const std::filesystem::path& path);
+};
+
+class DamagedStoreTest : public StoreTest, public ::testing::WithParamInterface<Damage> {};
+
+TEST_P(DamagedStoreTest, IsKeptAsideAndANewOneBegun) {
+  auto store = open();
+  ASSERT_TRUE(send(*store, 1));
+  store.reset();
+  GetParam().inflict(path_);
+  std::ofstream(path_.string() + "-wal") << "left over";
+
+  store = open({.clock = [] { return Date{1'700'000'000s}; }});
+  ASSERT_TRUE(send(*store, 2));
+  EXPECT_EQ(store->counters().accepted, 1U);
+  store.reset();
+  EXPECT_THAT(rows("SELECT payload FROM message"), ElementsAre(R"({"n":2})"));
+  const std::string aside = path_.string() + ".corrupt-20231114T221320.000000Z";
+  EXPECT_TRUE(std::filesystem::exists(aside));
+  EXPECT_TRUE(std::filesystem::exists(aside + "-wal"));
+  EXPECT_THAT(errorLines(), ElementsAre(HasSubstr(aside)));
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Damages, DamagedStoreTest,
+    ::testing::Values(
+        Damage{"NoDatabase",
+               [](const auto& path) { std::ofstream(path) << std::string(9999, 'x'); }},
+        Damage{"CutShort", [](const auto& path) { std::filesystem::resize_file(path, 8192); }},
+        Damage{"PagesOverwritten",
+               [](const auto& path) {
+                 std::fstream file(path, std::ios::in | std::ios::out | std::ios::binary);
+                 file.seekp(4096);
+                 file << std::string(std::filesystem::file_size(path) - 4096, '\x5a');
+               }}),
+    [](const auto& row) { return row.param.name; });
+
+TEST_F(StoreTest, CorruptionMetLaterLosesNoRowOnItsWay) {
+  Date now{0us};
+  TelemetryStore::Options options{.clock = [&now] { return now; }};
+  auto store = open(options);
+  for (int i = 0; i < 20'000; ++i) ASSERT_TRUE(send(*store, i));
+  store.reset();
+  {
+    std::fstream file(path_, std::ios::in | std::ios::out | std::ios::binary);
+    file.seekp(40 * 4096);
+    file << std::string(40 * 4096, '\x5a');
+  }
+  now += 20 * 24h;  // so that retention will walk over the damage
+  store = open(options);
+  Await(
+      [&] { return std::filesystem::exists(path_.string() + ".corrupt-19700121T000000.000000Z"); });
+  ASSERT_TRUE(send(*store, -1));
+  store->close();
+  EXPECT_THAT(rows("SELECT payload FROM message"), ElementsAre(R"({"n":-1})"));
+  EXPECT_EQ(store->counters().stored, 1U);
+  EXPECT_THAT(store->counters(), IsBalanced());
+}
+
+TEST_F(StoreTest, OneTransactionTakesWhatGatheredAndNoMoreThan1024Rows) {
+  StoreVfs& vfs = StoreVfs::fresh();
+  auto store = open({.vfs = StoreVfs::kName});
+  const int before = vfs.counts().commits;
+  for (int i = 0; i < 3; ++i) sendAndAwait(*store, i);
+  EXPECT_EQ(vfs.counts().commits, before + 3) << "alone, a row is committed at once";
+
+  vfs.hold();
+  ASSERT_TRUE(send(*store, 3));
+  vfs.awaitHeld();
+  for (int i = 0; i < 2500; ++i) ASSERT_TRUE(send(*store, i));
+  vfs.release();
+  Await([&] { return store->counters().waiting == 0; });
+  EXPECT_EQ(vfs.counts().commits, before + 3 + 1 + 3);
+}
+
+TEST_F(StoreTest, HoldsSendersBackAtItsBoundsAndKeepsEveryRow) {
+  const Payload large(Dictionary{{"text", std::string(100'000, 'x')}});
+  struct {
+    const char* bound;
+    std::size_t rows, bytes;
+    Payload payload;
+    std::uint64_t waiting;
+  } const cases[] = {{"rows", 100, 8 << 20, payload(1), 100},
+                     {"bytes", 8192, 1'000'000, large, 10}};
+  for (const auto& bounded : cases) {
+    SCOPED_TRACE(bounded.bound);
+    StoreVfs& vfs = StoreVfs::fresh();
+    auto store =
+        open({.queueRows = bounded.rows, .queueBytes = bounded.bytes, .vfs = StoreVfs::kName});
+    vfs.hold();
+    const auto before = store->counters();
+    std::thread sender([&] {
+      for (int i = 0; i < 300; ++i) ASSERT_TRUE(send(*store, bounded.payload));
+    });
+    Await([&] { return store->counters().waiting == bounded.waiting; });
+    const Payload info;
+    EXPECT_TRUE(store->addAgentSession({1, 19, 2.0, true, "t", "c", "s", info}))
+        << "is not held back";
+    EXPECT_EQ(store->counters().waiting, bounded.waiting);
+    vfs.release();
+    sender.join();
+    store->close();
+    EXPECT_EQ(store->counters().stored, before.stored + 300);
+  }
+}
+
+TEST_F(StoreTest, AFullDiskDelaysRowsAndLosesNone) {
+  StoreVfs& vfs = StoreVfs::fresh();
+  auto store = open({.queueRows = 50, .vfs = StoreVfs::kName});
+  vfs.setFull(true);
+  std::thread sender([&] {
+    for (int i = 0; i < 200; ++i) ASSERT_TRUE(send(*store, i));
+  });
+  vfs.awaitRefusedWrites(3);
+  Await([&] { return store->counters().waiting == 50; });
+  EXPECT_THAT(errorLines(), ElementsAre(AllOf(HasSubstr("fails"), HasSubstr("full"))))
+      << "one line however often it is tried";
+  vfs.setFull(false);
+  sender.join();
+  store->close();
+  EXPECT_THAT(store->counters(), AllOf(IsBalanced(), Field(&StoreCounters::stored, 200)));
+  EXPECT_EQ(
+      value(
+          "SELECT count(*) || ' ' || max(id) || ' ' || sum(payload ->> 'n' = id - 1) FROM message"),
+      "200 200 200");
+}
+
+TEST_F(StoreTest, ClosingOnAFullDiskCountsWhatIsLost) {
+  StoreVfs& vfs = StoreVfs::fresh();
+  auto store = open({.queueRows = 5, .vfs = StoreVfs::kName});
+  sendAndAwait(*store, 0);
+  vfs.setFull(true);
+  for (int i = 1; i <= 5; ++i) ASSERT_TRUE(send(*store, i));
+  std::promise<std::optional<Error>> flushed;
+  ASSERT_TRUE(store->flush(1, [&](const auto& error) { flushed.set_value(error); }));
+  auto heldBack = std::async(std::launch::async, [&] { return send(*store, 6); });
+  vfs.awaitRefusedWrites(1);
+  store->close();
+
+  EXPECT_THAT(flushed.get_future().get()->description(), HasSubstr("quarvel.store 2"));
+  const Outcome refused = heldBack.get();
+  ASSERT_FALSE(refused);
+  EXPECT_EQ(refused.error().code, static_cast<std::int64_t>(StoreErrorCode::closed));
+  EXPECT_THAT(store->counters(),
+              AllOf(IsBalanced(), Field(&StoreCounters::stored, 1), Field(&StoreCounters::lost, 5),
+                    Field(&StoreCounters::refused, 1)));
+  EXPECT_THAT(errorLines(), ElementsAre(HasSubstr("fails"), HasSubstr("5 are lost")));
+}
+
+TEST_F(StoreTest, AFlushCoversEverythingBeforeItWithOneSync) {
+  StoreVfs& vfs = StoreVfs::fresh();
+  auto store = open({.sync = 24h, .vfs = StoreVfs::kName, .clock = [] { return Date{5us}; }});
+  const Payload info;
+  const std::int64_t session =
+      store->addAgentSession({1, 19, 2.0, true, "t", "c", "s", info}).value();
+  for (int i = 0; i < 100; ++i) sendAndAwait(*store, i);
+  const int unsynced = vfs.counts().logSyncs;
+  EXPECT_LE(unsynced, 1) << "only a new log's head is synced";
+
+  std::promise<std::vector<std::string>> seen;
+  ASSERT_TRUE(send(*store, 100));
+  ASSERT_TRUE(store->flush(session, [&](const std::optional<Error>& error) {
+    EXPECT_EQ(error, std::nullopt);
+    seen.set_value(rows("SELECT flushed_at, (SELECT count(*) FROM message) FROM agent_session"));
+  }));
+  EXPECT_THAT(seen.get_future().get(), ElementsAre("5|101"));
+  EXPECT_GT(vfs.counts().logSyncs, unsynced);
+}
+
+TEST_F(StoreTest, SyncsWithEachCommitOrOnceTheIntervalIsOver) {
+  StoreVfs& vfs = StoreVfs::fresh();
+  auto store = open({.sync = 0ms, .vfs = StoreVfs::kName});
+  sendAndAwait(*store, 0);
+  const StoreVfs::Counts before = vfs.counts();
+  for (int i = 0; i < 20; ++i) sendAndAwait(*store, i);
+  EXPECT_EQ(vfs.counts().logSyncs - before.logSyncs, 20);
+  store.reset();
+
+  StoreVfs::fresh();
+  store = open({.sync = 200ms, .vfs = StoreVfs::kName});
+  sendAndAwait(*store, 0);
+  const int commits = vfs.counts().commits;
+  vfs.awaitLogSyncs(2);  // the new log's head, and what nobody asked for but the interval
+  EXPECT_EQ(vfs.counts().commits, commits) << "a sync writes nothing";
+}
+
+TEST_F(StoreTest, ClosesOnceWithEverythingSafeAndRefusesAfterwards) {
+  StoreVfs& vfs = StoreVfs::fresh();
+  auto store = open({.sync = 24h, .vfs = StoreVfs::kName});
+  vfs.hold();
+  for (int i = 0; i < 3000; ++i) ASSERT_TRUE(send(*store, i));
+  std::thread other([&] { store->close(); });
+  Await([&] { return !store->isOpen(); });
+  const Outcome late = send(*store, 3000);
+  vfs.release();
+  store->close();
+  other.join();
+
+  ASSERT_FALSE(late);
+  EXPECT_EQ(late.error().domain, kStoreErrorDomain);
+  EXPECT_FALSE(store->flush(1, [](const auto&) { FAIL() << "was refused"; }));
+  EXPECT_THAT(store->counters(), AllOf(IsBalanced(), Field(&StoreCounters::stored, 3000),
+                                       Field(&StoreCounters::refused, 1)));
+  EXPECT_EQ(value("SELECT count(*) FROM message"), "3000");
+  EXPECT_GE(vfs.counts().logSyncs, 2);
+}
+
+TEST_F(StoreTest, ManySendersLoseNothingAndEachKeepsItsOrder) {
+  constexpr int kSenders = 4;
+  constexpr int kRows = 5000;
+  auto store = open({.queueRows = 512});
+  std::vector<std::thread> senders;
+  for (int sender = 0; sender < kSenders; ++sender) {
+    senders.emplace_back([&store, sender] {
+      for (int i = 0; i < kRows; ++i) ASSERT_TRUE(send(*store, i, sender));
+    });
+  }
+  for (std::thread& sender : senders) sender.join();
+  store->close();
+  EXPECT_THAT(store->counters(),
+              AllOf(IsBalanced(), Field(&StoreCounters::stored, kSenders * kRows)));
+  EXPECT_EQ(
+      value("SELECT count(*) FROM (SELECT payload ->> 'n' AS n, row_number()"
+            " OVER (PARTITION BY session_id ORDER BY id) AS nth FROM message) WHERE n = nth - 1"),
+      std::to_string(kSenders * kRows));
+}
+
+class StoreRetentionTest : public StoreTest {
+ protected:
+  static constexpr std::uint64_t kBound = 2 << 20;
+
+  void fill(TelemetryStore& store, int rows) {
+    const Payload padded(Dictionary{{"text", std::string(400, 'x')}});
+    for (int i = 0; i < rows; ++i) {
+      now_ = now_.load() + 1s;
+      ASSERT_TRUE(send(store, padded));
+      if (i % 10 != 0) continue;
+      ASSERT_TRUE(store.addPowerEvent(28, "event", padded));
+    }
+  }
+  TelemetryStore::Options options() {
+    return {.maximumBytes = kBound, .clock = [this] { return now_.load(); }};
+  }
+
+  std::atomic<Date> now_{Date{0us}};
+};
+
+TEST_F(StoreRetentionTest, TheOldestRowsMakeRoomForNewOnes) {
+  auto store = open(options());
+  fill(*store, 20'000);
+  store->close();
+  EXPECT_LE(fileBytes(), kBound);
+  EXPECT_GT(fileBytes(), kBound * 3 / 4) << "no more goes than must";
+  const StoreCounters counters = store->counters();
+  EXPECT_THAT(counters, AllOf(IsBalanced(), Field(&StoreCounters::accepted, 22'000)));
+  EXPECT_EQ(value("SELECT (SELECT count(*) FROM message) + (SELECT count(*) FROM power_event)"),
+            std::to_string(counters.stored));
+  // The ages at which the tables begin are those of one and the same cut.
+  EXPECT_EQ(value("SELECT max(id) FROM message"), "20000");
+  EXPECT_EQ(value("SELECT abs((SELECT min(sent_at) FROM message) - (SELECT min(recorded_at) FROM "
+                  "power_event))"
+                  " <= 11000000"),
+            "1");
+  EXPECT_EQ(value("SELECT value FROM meta WHERE key = 'dropped.retention'"),
+            std::to_string(counters.droppedByRetention));
+
+  const StoreCounters again = open(options())->counters();
+  EXPECT_EQ(again.accepted, counters.accepted);
+  EXPECT_EQ(again.stored, counters.stored);
+}
+
+TEST_F(StoreRetentionTest, RowsThatNoBackendHasHadGoLastAndAreReported) {
+  auto limited = options();
+  limited.remoteBackends = {"nats"};
+  auto store = open(limited);
+  fill(*store, 2000);
+  store.reset();
+  execute(
+      "INSERT INTO backend_cursor VALUES('nats', 'message', 1000), ('nats', 'power_event', 200)");
+  store = open(limited);
+  fill(*store, 2300);
+  store->close();
+  EXPECT_GT(store->counters().droppedByRetention, 0U);
+  EXPECT_EQ(value("SELECT count(*) FROM message WHERE id > 1000"), "3300");
+  EXPECT_EQ(value("SELECT count(*) FROM power_event WHERE id > 200"), "230");
+  EXPECT_THAT(errorLines(), ::testing::IsEmpty());
+
+  store = open(limited);
+  fill(*store, 10'000);
+  store->close();
+  EXPECT_LE(fileBytes(), kBound);
+  EXPECT_THAT(errorLines(),
+              ::testing::Contains(HasSubstr("rows were removed that no backend has had")));
+}
+
+TEST_F(StoreRetentionTest, AFileAboveALoweredBoundShrinks) {
+  auto wide = options();
+  wide.maximumBytes = 64 << 20;
+  auto store = open(wide);
+  fill(*store, 20'000);
+  store.reset();
+  ASSERT_GT(fileBytes(), kBound * 2);
+  store = open(options());
+  Await([&] { return std::stoull(value("PRAGMA page_count")) * 4096 <= kBound; });
+  store.reset();
+  EXPECT_LE(fileBytes(), kBound);
+}
+
+TEST_F(StoreRetentionTest, RowsPastTheirAgeGoAtOpeningAndTheirIDsAreNotGivenAgain) {
+  auto store = open(options());
+  const Payload info;
+  const std::int64_t flushed =
+      store->addAgentSession({1, 19, 2.0, true, "t", "c", "s", info}).value();
+  std::promise<void> done;
+  ASSERT_TRUE(store->flush(flushed, [&done](const auto&) { done.set_value(); }));
+  done.get_future().wait();
+  fill(*store, 1000);
+  store.reset();
+  now_ = Date{14 * 24h + 500s};
+  store = open(options());
+  Await([&] { return value("SELECT min(id) FROM message") == "500"; });
+  EXPECT_EQ(value("SELECT count(*) FROM agent_session"), "0");
+  store.reset();
+  now_ = Date{15 * 24h};
+  store = open(options());
+  Await([&] { return store->counters().stored == 0; });
+  store.reset();
+
+  store = open(options());
+  EXPECT_EQ(store->counters().accepted, 1100U);
+  ASSERT_TRUE(send(*store, 1));
+  EXPECT_EQ(store->addAgentSession({1, 19, 2.0, true, "t", "c", "s", info}).value(), 2);
+  store.reset();
+  EXPECT_EQ(value("SELECT id FROM message"), "1001");
+}
+
+}  // namespace
+}  // namespace quarvel::testing

@@ -1,0 +1,76 @@
+#include <gtest/gtest.h>
+#include <pthread.h>
+#include <unistd.h>
+
+#include <array>
+#include <cmath>
+#include <fstream>
+#include <iterator>
+#include <string>
+#include <thread>
+
+#include "platform/Process.h"
+#include "platform/Random.h"
+#include "platform/Trace.h"
+
+namespace quarvel {
+namespace {
+
+// Folding 2^32 numbers onto this bound without care makes the lowest third twice as likely.
+TEST(RandomTest, IsUniformWhereTheBoundDoesNotDivideTheRange) {
+  constexpr std::uint32_t kThird = std::uint32_t{1} << 30;
+  constexpr int kDraws = 200'000;
+  std::array<int, 3> thirds{};
+  for (int i = 0; i < kDraws; ++i) ++thirds.at(RandomBelow(3 * kThird) / kThird);
+  for (const int count : thirds) EXPECT_NEAR(count, kDraws / 3, 7 * std::sqrt(kDraws * 2 / 9.0));
+}
+
+TEST(RandomTest, StaysBelowItsBoundAndReachesAllOfIt) {
+  EXPECT_EQ(RandomBelow(1), 0U);
+  std::array<bool, 60> seen{};
+  for (int i = 0; i < 10'000; ++i) seen.at(RandomBelow(60)) = true;
+  for (const bool each : seen) EXPECT_TRUE(each);
+}
+
+TEST(RandomTest, ThreadsDrawDifferentNumbers) {
+  std::array<std::uint32_t, 4> first{};
+  const auto draw = [&first] {
+    for (std::uint32_t& each : first) each = RandomBelow(~std::uint32_t{0});
+  };
+  draw();
+  const auto own = first;
+  std::thread(draw).join();
+  EXPECT_NE(own, first);
+}
+
+TEST(ProcessTest, NamesProcessesByTheirShortCommandName) {
+  EXPECT_EQ(OwnProcessIdentifier(), getpid());
+  EXPECT_EQ(OwnProcessName(), "system_test");
+  EXPECT_EQ(ProcessCommandName(getpid()), "system_test");
+  EXPECT_EQ(ProcessCommandName(0), std::nullopt);
+  EXPECT_EQ(ProcessCommandName(-5), std::nullopt);
+  EXPECT_EQ(ProcessCommandName(0x7fffffff), std::nullopt);
+}
+
+TEST(ProcessTest, NameThatIsNoTextIsNone) {
+  std::thread([] {
+    pthread_setname_np(pthread_self(), "caf\xc3\xa9 x\n");
+    EXPECT_EQ(ProcessCommandName(gettid()), "caf\xc3\xa9 x\n");
+    pthread_setname_np(pthread_self(), "\xff\xfe");
+    EXPECT_EQ(ProcessCommandName(gettid()), std::nullopt);
+  }).join();
+}
+
+TEST(TraceTest, ProbeCanBeFoundByTracingTools) {
+  EmitKernelTrace(0x21042814);
+  std::ifstream program("/proc/self/exe", std::ios::binary);
+  const std::string bytes(std::istreambuf_iterator<char>(program), {});
+  std::string provider = "quarvel";
+  provider += '\0';
+  provider += "event";
+  provider += '\0';
+  EXPECT_NE(bytes.find(provider), std::string::npos);
+}
+
+}  // namespace
+}  // namespace quarvel

@@ -1,0 +1,208 @@
+"""quarvelctl as people and programs use it: as a process, against a socket and a store."""
+
+import datetime
+import json
+import os
+import pathlib
+import pty
+import sqlite3
+import subprocess
+import sys
+import tempfile
+import unittest
+
+from fake_service import FakeService, KILL, REPORTERS, START, STOP, VALID
+
+QUARVELCTL = sys.argv.pop(1)
+SCHEMA = """
+PRAGMA journal_mode = WAL; PRAGMA application_id = 0x51525654; PRAGMA user_version = 1;
+CREATE TABLE agent_session(id INTEGER PRIMARY KEY, session_id INTEGER NOT NULL,
+  client_type INTEGER NOT NULL, client_version REAL NOT NULL, batch_event INTEGER NOT NULL,
+  hierarchy_token TEXT NOT NULL, client_name TEXT NOT NULL, service_name TEXT NOT NULL,
+  user_info TEXT NOT NULL, opened_at INTEGER NOT NULL, flushed_at INTEGER);
+CREATE TABLE message(id INTEGER PRIMARY KEY, agent_session INTEGER REFERENCES agent_session(id),
+  session_id INTEGER NOT NULL, client_name TEXT NOT NULL, service_name TEXT NOT NULL,
+  category INTEGER NOT NULL, type INTEGER NOT NULL, payload TEXT NOT NULL, sent_at INTEGER NOT NULL);
+"""
+NOON = 1_769_860_800_000_000  # 2026-01-31T12:00:00Z
+
+
+class ToolTest(unittest.TestCase):
+    def setUp(self):
+        self.directory = tempfile.TemporaryDirectory(prefix="quarvelctl-")
+        self.addCleanup(self.directory.cleanup)
+        self.root = pathlib.Path(self.directory.name)
+        self.environment = {"PATH": os.environ["PATH"], "TZ": "UTC",
+                            "QUARVEL_SOCKET": str(self.root / "reporting.sock"),
+                            "STATE_DIRECTORY": str(self.root)}
+
+    def ctl(self, *arguments, stdin=""):
+        """Status, standard output's lines, standard error."""
+        ran = subprocess.run([QUARVELCTL, *map(str, arguments)], input=stdin, text=True,
+                             capture_output=True, env=self.environment, timeout=60, check=False)
+        return ran.returncode, ran.stdout.splitlines(), ran.stderr
+
+
+class ServiceTest(ToolTest):
+    def setUp(self):
+        super().setUp()
+        self.service = FakeService(self.environment["QUARVEL_SOCKET"], {7: 2, -8: 4242})
+        self.addCleanup(self.service.close)
+
+    def run_script(self, *steps):
+        """Status, replies, standard error."""
+        status, lines, error = self.ctl("run", "-", stdin="".join(json.dumps(step) + "\n" for step in steps))
+        return status, [json.loads(line) for line in lines], error
+
+    def test_replies_are_printed_as_they_arrive_and_a_start_does_not_hold_up(self):
+        status, replies, error = self.run_script(
+            {"call": START, "args": [7]}, {"call": STOP, "args": [7]}, {"call": VALID, "args": [7]},
+            {"expect": {"serviceType": 2, "reporterID": 7}}, {"sleep": 0},
+            {"call": REPORTERS, "wait": False})
+        self.assertEqual((status, error), (0, ""))
+        self.assertEqual([reply["call"] for reply in replies], [STOP, START, VALID, REPORTERS])
+        self.assertEqual(replies[1], {"call": START, "args": [7], "result": True})
+        self.assertEqual(replies[3]["result"], [7, -8])
+
+    def test_a_start_that_is_never_answered_does_not_hang_the_script(self):
+        status, replies, _ = self.run_script({"call": START, "args": [9]})
+        self.assertEqual((status, replies), (0, []))
+
+    def test_what_json_lacks_can_be_sent(self):
+        arguments = [{"At": {"$date": "2026-01-31T12:00:00.25Z"}, "Raw": {"$bytes": "AP8="},
+                      "Kept": {"$date": 1, "other": 2}}, 2**63, -1, 1.5, None]
+        status, replies, _ = self.run_script({"call": "anything", "args": arguments})
+        self.assertEqual((status, replies[0]["args"]), (0, arguments))
+        at = datetime.datetime(2026, 1, 31, 12, 0, 0, 250_000, datetime.timezone.utc)
+        self.assertEqual(self.service.calls, [["anything", [
+            {"At": at, "Raw": b"\0\xff", "Kept": {"$date": 1, "other": 2}}, 2**63, -1, 1.5, None]]])
+
+    def test_an_expectation_that_fails_names_its_line(self):
+        status, _, error = self.run_script({"call": "anything"}, {"expect": True}, {"call": "unknown"},
+                                           {"expect": True})
+        self.assertEqual(status, 1)
+        self.assertIn("standard input:4: The last reply is {\"domain\":\"quarvel.connection\"", error)
+
+    def test_killing_ends_the_script_in_order(self):
+        status, replies, _ = self.run_script({"call": START, "args": [7]}, {"call": KILL})
+        self.assertEqual(status, 0)
+        self.assertEqual({reply["error"]["domain"] for reply in replies}, {"quarvel.client"})
+        self.assertEqual(self.ctl("kill")[:2], (0, ["The service has ended."]))
+
+    def test_nothing_is_played_of_a_file_with_a_fault(self):
+        faults = [("{\"call\": 7}", "keyword name"), ("{\"call\": \"x\", \"args\": {}}", "a list"),
+                  ("{\"call\": \"x\", \"wiat\": true}", "\"wiat\""), ("{\"sleep\": -1}", "seconds"),
+                  ("{\"call\": \"x\", \"args\": [{\"$date\": \"noon\"}]}", "$date"),
+                  ("{\"call\": \"x\", \"args\": [{\"$bytes\": \"?\"}]}", "$bytes"),
+                  ("[]", "A line is"), ("{", "script.jsonl:3: ")]
+        for line, reason in faults:
+            with self.subTest(line):
+                script = self.root / "script.jsonl"
+                script.write_text("# A comment, and a call that is right.\n{\"call\": \"x\"}\n" + line + "\n")
+                status, replies, error = self.ctl("run", script)
+                self.assertEqual((status, replies, self.service.calls), (1, [], []))
+                self.assertIn("script.jsonl:3: ", error)
+                self.assertIn(reason, error)
+
+    def test_reporters_and_validity(self):
+        self.assertEqual(self.ctl("reporters")[:2], (0, ["7", "-8"]))
+        self.assertEqual(self.ctl("reporters", "--json")[:2], (0, ["[7,-8]"]))
+        self.assertEqual(self.ctl("valid", 7)[:2],
+                         (0, ["7 is a reporting session of service type 2 (telephony)."]))
+        self.assertIn("(without a name)", self.ctl("valid", -8)[1][0])
+        status, lines, error = self.ctl("--json", "valid", 9)
+        self.assertEqual((status, json.loads(lines[0])["serviceTypeName"]), (1, "unknown"))
+        self.assertIn("No client has a reporting session 9.", error)
+
+
+class StoreTest(ToolTest):
+    def setUp(self):
+        super().setUp()
+        self.store = sqlite3.connect(self.root / "telemetry.db", isolation_level=None)
+        self.addCleanup(self.store.close)
+        self.store.executescript(SCHEMA)
+        info = json.dumps({"HostApplicationDisplayID": "org.example.dialer"})
+        for number, flushed in ((7, NOON + 1_500_000), (8, None)):
+            self.store.execute("INSERT INTO agent_session VALUES(NULL,?,19,2.0,1,'','tarnwick.quarvel',"
+                               "'telephony_session',?,?,?)", (number, info, NOON, flushed))
+        self.add_message(1, 7, 9, 0, {"Glitches": 3})
+        self.add_message(1, 7, 65535, 65535, {"Note": "é" * 200})
+        self.add_message(None, -1, 11, 4, {"Volume": 0.5})
+
+    def add_message(self, agent_session, session, category, kind, payload):
+        self.store.execute(
+            "INSERT INTO message VALUES(NULL,?,?,'tarnwick.quarvel','telephony_session',?,?,?,?)",
+            (agent_session, session, category, kind, json.dumps(payload, ensure_ascii=False), NOON + 1_000))
+
+    def test_sessions(self):
+        _, lines, _ = self.ctl("sessions")
+        self.assertEqual([line.split() for line in lines[1:]], [
+            ["7", "telephony", "01-31", "12:00:00.000", "1.500", "s", "2", "org.example.dialer"],
+            ["8", "telephony", "01-31", "12:00:00.000", "not", "ended", "0", "org.example.dialer"]])
+        _, lines, _ = self.ctl("sessions", "--json")
+        self.assertEqual([json.loads(line)["flushedAt"] for line in lines],
+                         ["2026-01-31T12:00:01.500000Z", None])
+
+    def test_messages(self):
+        _, lines, _ = self.ctl("messages", "--session", 7)
+        self.assertEqual(len(lines), 3)
+        self.assertRegex(lines[1], r"12:00:00\.001 +7 +telephony +Tallixing +Generic +\{\"Glitches\": 3\}$")
+        self.assertRegex(lines[2], r"Undefined +Unknown ")
+        self.assertRegex(self.ctl("messages", "--last", 1)[1][1], r" single .* Volume +Error ")
+        _, lines, _ = self.ctl("messages", "--session", -1, "--json")
+        self.assertEqual(json.loads(lines[0]), {
+            "id": 3, "agentSession": None, "session": -1, "service": "telephony_session", "category": 11,
+            "categoryName": "Volume", "type": 4, "typeName": "Error",
+            "sentAt": "2026-01-31T12:00:00.001000Z", "payload": {"Volume": 0.5}})
+
+    def test_a_terminal_gets_lines_that_fit_and_colour(self):
+        master, slave = pty.openpty()
+        subprocess.run([QUARVELCTL, "messages"], stdout=slave, env=self.environment, timeout=60, check=True)
+        os.close(slave)
+        lines = os.read(master, 65536).decode().splitlines()
+        os.close(master)
+        self.assertTrue(lines[0].startswith("\x1b[1mSENT"))
+        self.assertEqual([len(line) for line in lines[1:] if "é" in line], [80])
+
+    def test_following_prints_what_is_stored_later(self):
+        with subprocess.Popen([QUARVELCTL, "messages", "--last", "1", "--follow", "--json"], text=True,
+                              stdout=subprocess.PIPE, env=self.environment) as following:
+            try:
+                self.assertEqual(json.loads(following.stdout.readline())["id"], 3)
+                for number in (4, 5):
+                    self.add_message(2, 8, 1, 1, {"Number": number})
+                    self.assertEqual(json.loads(following.stdout.readline())["payload"], {"Number": number})
+            finally:
+                following.terminate()
+
+
+class RefusalTest(ToolTest):
+    def test_what_is_not_there_says_what_to_do(self):
+        for arguments, reason in ((["reporters"], "The service is not running"), (["sessions"], "--store"),
+                                  (["run", "none.jsonl"], "none.jsonl cannot be read")):
+            status, lines, error = self.ctl(*arguments)
+            self.assertEqual((status, lines), (1, []))
+            self.assertIn(reason, error)
+
+    def test_what_is_no_store_of_this_version_is_left_alone(self):
+        for statement, reason in (("PRAGMA user_version = 2", "is of version 2"),
+                                  ("PRAGMA application_id = 7", "is not a telemetry store")):
+            path = self.root / "telemetry.db"
+            store = sqlite3.connect(path)
+            store.executescript(SCHEMA + statement)
+            store.close()
+            status, _, error = self.ctl("messages")
+            self.assertEqual(status, 1)
+            self.assertIn(reason, error)
+            path.unlink()
+        (self.root / "text.db").write_text("Not a database, but long enough to be taken for one. " * 20)
+        self.assertIn("cannot be read", self.ctl("messages", "--store", self.root / "text.db")[2])
+
+    def test_wrong_usage_is_told_from_failure(self):
+        for arguments in ([], ["nonsense"], ["valid"], ["valid", "seven"], ["messages", "--last", "-1"]):
+            self.assertEqual(self.ctl(*arguments)[0], 2, arguments)
+        self.assertEqual(self.ctl("--help")[0], 0)
+
+
+if __name__ == "__main__":
+    unittest.main()
