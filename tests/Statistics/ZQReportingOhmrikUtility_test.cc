@@ -49,8 +49,12 @@ TEST(Vistrel, EveryMessageIsAnEventOfTheSessionsApplication) {
 TEST(Vistrel, UnknownCodesHaveNamesToo) {
   Sinks sinks;
   sinks.offer({}, 0x00050001, 77);
+  sinks.simulation.vistrel.wanted = false;
+  sinks.offer({}, 12, 65535);
   EXPECT_THAT(sinks.simulation.journal.lines(),
-              ElementsAre("vistrel tarnwick.quarvel._Generic.Undefined"));
+              ElementsAre("vistrel tarnwick.quarvel._Generic.Undefined",
+                          "vistrel tarnwick.quarvel.Undefined.Unknown"));
+  EXPECT_EQ(sinks.simulation.vistrel.events.size(), 1U);
 }
 
 TEST(Ohmrik, AnEngineOnTimeIsAllItTakes) {

@@ -213,7 +213,7 @@ TEST_F(StoreTest, CorruptionMetLaterLosesNoRowOnItsWay) {
 
 TEST_F(StoreTest, OneTransactionTakesWhatGatheredAndNoMoreThan1024Rows) {
   StoreVfs& vfs = StoreVfs::fresh();
-  auto store = open({.vfs = StoreVfs::kName});
+  auto store = open({.queueRows = 4000, .vfs = StoreVfs::kName});
   const int before = vfs.counts().commits;
   for (int i = 0; i < 3; ++i) sendAndAwait(*store, i);
   EXPECT_EQ(vfs.counts().commits, before + 3) << "alone, a row is committed at once";
@@ -340,7 +340,7 @@ TEST_F(StoreTest, SyncsWithEachCommitOrOnceTheIntervalIsOver) {
 
 TEST_F(StoreTest, ClosesOnceWithEverythingSafeAndRefusesAfterwards) {
   StoreVfs& vfs = StoreVfs::fresh();
-  auto store = open({.sync = 24h, .vfs = StoreVfs::kName});
+  auto store = open({.sync = 24h, .queueRows = 4000, .vfs = StoreVfs::kName});
   vfs.hold();
   for (int i = 0; i < 3000; ++i) ASSERT_TRUE(send(*store, i));
   std::thread other([&] { store->close(); });

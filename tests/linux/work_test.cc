@@ -266,7 +266,7 @@ TEST(DelayTest, RunsNotBeforeItsTimeAndInDueOrder) {
   };
   std::latch allQueued(1);
   queue->async([&allQueued] { allQueued.wait(); });
-  at(60ms, "last");
+  at(400ms, "last");
   at(40ms, "first");
   at(40ms, "second");
   at(-1ms, "at once");
@@ -343,7 +343,7 @@ TEST(VoucherTest, DelayedBlockLetsItsCallCompleteAndRunsUnderItAgain) {
   {
     const VoucherHold hold(voucher);
     const VoucherScope scope(VoucherScope::Of::call, hold);
-    queue->after(20ms, [&] {
+    queue->after(300ms, [&] {
       EXPECT_EQ(completions, 1);
       EXPECT_EQ(VoucherHold::current().voucher(), voucher);
       queue->async([&] { ran.count_down(); });
@@ -364,10 +364,10 @@ TEST(VoucherTest, DelayedBlocksBeyondTheBoundHoldTheirCalls) {
     const VoucherScope scope(VoucherScope::Of::call, hold);
     queue->after(time, [] {});
   };
-  delay(20ms, voucherOf(Keeper::kUnheldBytes, within));
-  delay(20ms, voucherOf(1, within));
+  delay(300ms, voucherOf(Keeper::kUnheldBytes, within));
+  delay(300ms, voucherOf(1, within));
   EXPECT_EQ(within, 2);
-  delay(20ms, voucherOf(1, beyond));
+  delay(300ms, voucherOf(1, beyond));
   EXPECT_EQ(beyond, 0);
   beyond.wait(0);
   EXPECT_EQ(beyond, 1);

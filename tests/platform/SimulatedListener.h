@@ -59,7 +59,6 @@ class SimulatedListener final : public ServiceListener {
  public:
   /// A process connects. The delegate is asked on a platform thread, in the next run.
   SimulatedClient connect(std::int32_t processIdentifier);
-  [[nodiscard]] bool resumed() const { return resumed_; }
 
   void setDelegate(std::shared_ptr<ServiceListenerDelegate> delegate) override;
   /// Returns at once, since the test has the main thread.

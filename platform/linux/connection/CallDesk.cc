@@ -11,7 +11,7 @@ namespace {
 constexpr std::int64_t kResponse = 1;
 
 /// A buffer that has grown beyond this for a burst is not kept for the quiet that follows.
-constexpr std::size_t kKeptCapacity = 64 * 1024;
+constexpr std::size_t kKeptCapacity = std::size_t{64} * 1024;
 
 void Empty(std::string& buffer) {
   if (buffer.capacity() > kKeptCapacity) {

@@ -36,8 +36,7 @@ SocketConnection::SocketConnection(std::shared_ptr<ConnectionContext> context, s
 
 std::shared_ptr<SocketConnection> SocketConnection::create(
     std::shared_ptr<ConnectionContext> context, UniqueDescriptor socket, std::uint64_t number) {
-  const std::shared_ptr<SocketConnection> connection(
-      new SocketConnection(std::move(context), number));
+  std::shared_ptr<SocketConnection> connection(new SocketConnection(std::move(context), number));
   asio::error_code error;
   connection->socket_.assign(socket.get(), error);
   if (error) return nullptr;

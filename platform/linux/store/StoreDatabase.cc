@@ -14,10 +14,9 @@ namespace quarvel {
 
 namespace {
 
-// In pages of 4 KiB. The larger the log, the fewer syncs and the more often a page is overwritten
-// before it has to be moved; but what is moved at once holds up the rows behind it.
-constexpr int kLogPagesWhenIdle = 1024;
-constexpr int kLogPagesBetweenBatches = 4096;
+// In pages of 4 KiB. A longer log needs fewer syncs, but what is moved at once holds up the rows
+// behind it, and pages that the system has cached are cheaper than new ones.
+constexpr int kLogPages = 1024;
 constexpr std::size_t kKeptJson = 1 << 20;
 
 std::int64_t Microseconds(Date date) {
@@ -182,13 +181,11 @@ std::string_view StoreDatabase::json(const Payload& payload) {
   return json_;
 }
 
-bool StoreDatabase::checkpointIfDue(bool idle) {
+bool StoreDatabase::checkpointIfDue() {
   const int logPages = connection_.logPages();
   // The log began again, or a reader has kept it from doing so: then what was moved is still there.
   if (logPages < checkpointedPages_) checkpointedPages_ = 0;
-  if (logPages - checkpointedPages_ < (idle ? kLogPagesWhenIdle : kLogPagesBetweenBatches)) {
-    return false;
-  }
+  if (logPages - checkpointedPages_ < kLogPages) return false;
   checkpointedPages_ = logPages;
   return connection_.checkpoint();
 }

@@ -45,9 +45,9 @@ class StoreDatabase {
   /// carry a full commit would wear the medium for nothing.
   [[nodiscard]] bool sync() { return connection_.syncLog(); }
 
-  /// Moves the write-ahead log into the database file once it has grown enough: past a little when
-  /// no row waits (`idle`), past more between batches. True when this made every commit safe.
-  bool checkpointIfDue(bool idle);
+  /// Moves the write-ahead log into the database file once it has grown to a few megabytes. True
+  /// when this made every commit safe.
+  bool checkpointIfDue();
   /// Does so at once: on a full disk this may give the log's own space back.
   void checkpoint() { connection_.checkpoint(); }
 

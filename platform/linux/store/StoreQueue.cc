@@ -87,11 +87,10 @@ void StoreQueue::release(const Tally& tally) {
   if (heldBack_ > 0 && hasRoom()) roomCame_.notifyAll();
 }
 
-bool StoreQueue::committed(const Tally& tally) {
+void StoreQueue::committed(const Tally& tally) {
   MutexLock lock(mutex_);
   counters_.stored += tally.counted;
   release(tally);
-  return waiting_.rows().empty();
 }
 
 void StoreQueue::lost(const Tally& tally) {

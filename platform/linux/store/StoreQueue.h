@@ -76,9 +76,7 @@ class StoreQueue {
     void add(const StoreRow& row);
   };
   // Makes room: rows that were taken are now in the database, or lost.
-
-  /// Returns whether no rows wait.
-  bool committed(const Tally& tally) QUARVEL_EXCLUDES(mutex_);
+  void committed(const Tally& tally) QUARVEL_EXCLUDES(mutex_);
   void lost(const Tally& tally) QUARVEL_EXCLUDES(mutex_);
 
   /// Counts from what the opened database holds, and what has been removed from it.

@@ -87,9 +87,9 @@ void StoreWriter::write(const StoreBatch& batch) {
       lose(batch, first);
       return;
     }
-    const bool idle = queue_.committed(tally);
+    queue_.committed(tally);
     completeFlushes(batch, first, last, std::nullopt);
-    if (database_->checkpointIfDue(idle)) unsyncedSince_.reset();
+    if (database_->checkpointIfDue()) unsyncedSince_.reset();
     first = last;
   }
   if (steady_clock::now() >= nextAgeing_) {

@@ -43,8 +43,9 @@ class TelemetryStore {
     std::chrono::days maximumAge{14};
     /// Backends that read the store: rows they have not had are removed last.
     std::vector<std::string> remoteBackends{};
-    /// Bounds of the queue; senders beyond them are held back.
-    std::size_t queueRows = 8192;
+    /// Bounds of the queue; senders beyond them are held back. So few rows that under any load one
+    /// is committed within 10 ms of being queued, but for a slow medium.
+    std::size_t queueRows = 2048;
     std::size_t queueBytes = 8 << 20;
     /// Name of the SQLite file layer; empty: the default one.
     std::string vfs{};

@@ -128,14 +128,15 @@ TEST(Routing, ABroadcastThatNobodyTakesGoesOutAloneButAnEmptyListGoesNowhere) {
     EXPECT_THAT(service.simulation.agent.singleMessages, IsEmpty());
 
     service.simulation.log.lines.clear();
-    const auto alone = client.send(kWithEngineTime, 0x10000003, 1);
+    const auto alone = client.send({{"EngineOnTime", 3}, {"a key", 1}}, 0x10000003, 1);
     service.run();
     EXPECT_THAT(alone->results, ElementsAre(Value()));
     ASSERT_EQ(service.simulation.agent.singleMessages.size(), 1U);
     const auto& single = service.simulation.agent.singleMessages[0];
     EXPECT_EQ(*single.userInfo.find("ServiceName"), Value("standalone"));
     EXPECT_EQ(single.message.category, 3);
-    EXPECT_EQ(single.message.payload.root().toDictionary(), kWithEngineTime);
+    EXPECT_EQ(single.message.payload.root().toDictionary(),
+              (Dictionary{{"EngineOnTime", 3}, {"a_key", 1}}));
     EXPECT_THAT(service.simulation.vistrel.events, IsEmpty());
     EXPECT_THAT(service.simulation.ohmrik.records, IsEmpty());
     EXPECT_EQ(service.simulation.log.texts().back(),
@@ -174,6 +175,28 @@ TEST(Routing, SwitchedOffRefusesEveryMessageAndHidesOtherClientsSessions) {
     service.run();
     EXPECT_THAT(accepted->results, ElementsAre(Value()));
     EXPECT_THAT(MessagesOfAgentSessions(service), ElementsAre(1)) << "it was never stopped";
+  }
+}
+
+TEST(Routing, AnAgentWithoutRoomHoldsNobodyUpButTheDeliveries) {
+  for (const auto seed : Seeds()) {
+    RunningService service(seed);
+    Client client = service.connect(41);
+    client.createStarted(7);
+    service.run();
+    service.simulation.agent.full = true;
+    const auto named = client.send({{"n", 1}}, 3, 1, List{7});
+    const auto broadcast = client.send({{"n", 2}});
+    const auto stop = client.stop(7);
+    service.simulation.runFor(1s);
+    EXPECT_THAT(named->results, ElementsAre(Value()));
+    EXPECT_THAT(broadcast->results, ElementsAre(Value()));
+    EXPECT_THAT(stop->results, ElementsAre(kYes));
+    EXPECT_THAT(MessagesOfAgentSessions(service), ElementsAre(0));
+    service.simulation.agent.full = false;
+    service.run();
+    EXPECT_THAT(MessagesOfAgentSessions(service), ElementsAre(3)) << "with the summary";
+    EXPECT_THAT(service.simulation.agent.singleMessages, IsEmpty());
   }
 }
 

@@ -47,6 +47,7 @@ TEST(Session, StartSetsUpAnAgentSessionWithWhatIsConfiguredByThen) {
                                                       {"app", "Phone"},
                                                       {"version", 2}}));
     EXPECT_THAT(agent.sessions[0].frameworksToCheck, IsEmpty());
+    EXPECT_EQ(agent.sessions[0].configurations, 1U);
     EXPECT_EQ(owner.session->serviceName(), "alarms");
     EXPECT_FALSE(owner.session->relmReportingSessionStarted());
   }
@@ -164,6 +165,14 @@ TEST(Session, StartsAndStopsRepeat) {
     EXPECT_EQ(owner.simulation.agent.sessions[0].messages.size(), 3U);
     EXPECT_EQ(owner.simulation.agent.sessions[1].messages.size(), 2U);
   }
+}
+
+TEST(Session, AStartBeginsANewHistory) {
+  SessionOwner owner(1);
+  owner.send();
+  EXPECT_THAT(owner.history(), ElementsAre("Playback_Start_1"));
+  owner.start();
+  EXPECT_THAT(owner.history(), IsEmpty());
 }
 
 TEST(Session, OfTypeTestNeverTouchesTheAgent) {
