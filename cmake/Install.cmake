@@ -5,6 +5,7 @@ include(CMakePackageConfigHelpers)
 if(TARGET quarveld)
   install(TARGETS quarveld RUNTIME DESTINATION ${CMAKE_INSTALL_SBINDIR} COMPONENT service)
 endif()
+install(DIRECTORY examples/ DESTINATION ${CMAKE_INSTALL_DOCDIR}/examples COMPONENT service)
 install(TARGETS quarvelctl RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR} COMPONENT service)
 install(TARGETS quarvel EXPORT quarvel LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR} COMPONENT client)
 

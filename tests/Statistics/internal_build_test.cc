@@ -1,19 +1,132 @@
 #include <gmock/gmock.h>
 
-#include "Statistics/ZQReportingUtility.h"
-#include "tests/platform/Simulation.h"
+#include "tests/Statistics/Service/SessionOwner.h"
 
-// A program of its own: whether the build is an internal one is asked once a process.
+// What internal builds do besides. A program of its own, since a process asks only once whether it
+// belongs to one.
 
 namespace quarvel {
 namespace {
 
-TEST(InternalBuild, IsAskedForOnce) {
-  Simulation simulation(1);
-  simulation.deviceProperties["InternalBuild"] = true;
-  EXPECT_TRUE(ZQReportingUtilityIsInternalBuild());
-  simulation.deviceProperties["InternalBuild"] = false;
-  EXPECT_TRUE(ZQReportingUtilityIsInternalBuild());
+using testing::ElementsAre;
+using testing::IsEmpty;
+using testing::Pair;
+
+struct InternalBuild : testing::Test {
+  // Says yes to whoever asks first; what later simulations say is not asked for any more.
+  static void SetUpTestSuite() {
+    Simulation simulation(1);
+    simulation.deviceProperties["InternalBuild"] = true;
+    ASSERT_TRUE(ZQReportingUtilityIsInternalBuild());
+    simulation.deviceProperties["InternalBuild"] = false;
+    ASSERT_TRUE(ZQReportingUtilityIsInternalBuild());
+  }
+};
+
+const std::string kDirectory =
+    "/private/var/mobile/Library/Logs/Faultkeep/DiagnosticLogs/Audio/Reporting";
+
+TEST_F(InternalBuild, WritesTheHistoryOfARun) {
+  struct Case {
+    Dictionary userInfo;
+    std::uint16_t serviceType;
+    const char* name;
+  };
+  const Case kCases[] = {
+      {{{"HostApplicationDisplayID", "Music"}}, 7, "Music-longformaudio"},
+      {{}, 65535, "unknown-unknown"},
+      {{{"HostApplicationDisplayID", "../up"}}, 2, ".._up-telephony"},
+  };
+  for (const Case& each : kCases) {
+    SessionOwner owner(1, each.serviceType);
+    owner.simulation.files.diagnosticsPrefix = "/prefix";
+    owner.session->setConfiguration(each.userInfo);
+    owner.start();
+    owner.send({{"a b", List{1, 2.5}}});
+    owner.simulation.runFor(1s);
+    owner.stop();
+    ASSERT_THAT(owner.simulation.files.files,
+                ElementsAre(Pair(
+                    "/prefix" + kDirectory + "/20260131-142641+0100-quarvel-" + each.name + ".json",
+                    testing::HasSubstr("\n"))));
+    const auto content = ValueFromJson(owner.simulation.files.files.begin()->second);
+    ASSERT_TRUE(content.ok());
+    EXPECT_EQ(content.value(),
+              Value(List{each.userInfo,
+                         Dictionary{{"Playback_Start_1", Dictionary{{"a_b", List{1, 2.5}}}}}}));
+    EXPECT_THAT(owner.simulation.files.directories,
+                ElementsAre(Pair("/prefix" + kDirectory, 0777)));
+  }
+}
+
+TEST_F(InternalBuild, AFileThatCannotBeWrittenCostsTheSummaryNothing) {
+  SessionOwner owner(1);
+  owner.simulation.files.directoryError = Error::because("files", 13, "no");
+  owner.simulation.files.writeError = Error::because("files", 2, "nowhere");
+  owner.start();
+  owner.send();
+  owner.stop();
+  owner.simulation.run();
+  EXPECT_EQ(owner.delivered().size(), 2U);
+  const std::string function = "error zqrr -[ZQReportingSession createSummaryEventForSession]: ";
+  EXPECT_THAT(owner.errors(), ElementsAre(function + "can't create logging directory at " +
+                                              kDirectory + ": files 13: no",
+                                          function + "jsonOutput writeToURL: files 2: nowhere"));
+}
+
+TEST_F(InternalBuild, OrientationIsFollowedForSomeServiceTypesAndDevices) {
+  struct Case {
+    std::uint16_t serviceType;
+    std::optional<std::int64_t> deviceClass;
+    bool followed;
+  };
+  const Case kCases[] = {{7, 1, true},  {2, 1, true},  {7, std::nullopt, true}, {7, 6, false},
+                         {2, 6, false}, {8, 1, false}, {65535, 1, false}};
+  for (const Case& each : kCases) {
+    SCOPED_TRACE(each.serviceType);
+    SessionOwner owner(1, each.serviceType);
+    if (each.deviceClass) {
+      owner.simulation.deviceProperties["DeviceClassNumber"] = *each.deviceClass;
+    }
+    owner.start();
+    const std::size_t expected = each.followed ? 1 : 0;
+    EXPECT_EQ(owner.simulation.orientation.device.count("ZQReportingService 7"), expected);
+    EXPECT_EQ(owner.simulation.orientation.ui.count("ZQReportingService 7"), expected);
+    owner.stop();
+    EXPECT_THAT(owner.simulation.orientation.device, IsEmpty());
+    EXPECT_THAT(owner.simulation.orientation.ui, IsEmpty());
+  }
+}
+
+TEST_F(InternalBuild, OrientationChangesAreInTheHistoryToTheMillisecond) {
+  for (const auto seed : Seeds()) {
+    SessionOwner owner(seed, kServiceTypeTelephony);
+    owner.simulation.log.verbose = {"zqrr"};
+    owner.session->setConfiguration(Dictionary{{"HostApplicationDisplayID", "Phone"}});
+    owner.start();
+    owner.simulation.runFor(1234560us);
+    owner.simulation.log.lines.clear();
+    owner.simulation.orientation.turnDevice(Orientation::landscapeLeft);
+    owner.simulation.runFor(1s);
+    owner.simulation.orientation.turnUI(Orientation::portrait);
+    owner.simulation.runFor(0s);
+    std::vector<Dictionary> entries;
+    owner.session->aggregatedPayloadData()->forEach([&](const PayloadHistory::Entry& entry) {
+      entries.push_back(std::get<Dictionary>(entry));
+    });
+    EXPECT_THAT(
+        entries,
+        ElementsAre(
+            Dictionary{{"device_orientation", "landscapeLeft"}, {"device_orientation_time", 1.235}},
+            Dictionary{{"ui_orientation", "portrait"}, {"ui_orientation_time", 2.235}}));
+    const std::string line =
+        "debug zqrr -[ZQReportingSession start]_block_invoke: Orientation handler callback ";
+    EXPECT_THAT(owner.simulation.log.texts(),
+                ElementsAre(line + "mode=device orientation=\"landscapeLeft\" app=\"Phone\", "
+                                   "time=1.235, id=\"ZQReportingService 7\"",
+                            line + "mode=ui orientation=\"portrait\" app=\"Phone\", time=2.235, "
+                                   "id=\"ZQReportingService 7\""));
+  }
 }
 
 }  // namespace

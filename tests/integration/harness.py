@@ -33,11 +33,11 @@ def eventually(condition, what):
 
 
 class Service:
-    """A running quarveld; a context manager that ends it in order."""
+    """A quarveld with directories of its own."""
 
-    def __init__(self, configuration="", directory=None, wrapper=()):
-        self._temporary = None if directory else tempfile.TemporaryDirectory(prefix="quarvel-test-")
-        self.directory = pathlib.Path(directory or self._temporary.name)
+    def __init__(self, configuration="", wrapper=()):
+        self._directory = tempfile.TemporaryDirectory(prefix="quarvel-test-")
+        self.directory = pathlib.Path(self._directory.name)
         for name in ("run", "state", "etc/preferences", "diagnostics"):
             (self.directory / name).mkdir(parents=True, exist_ok=True)
         (self.directory / "etc/quarvel.toml").write_text(configuration)
@@ -60,13 +60,14 @@ class Service:
             self.process = subprocess.Popen(
                 [*self._wrapper, PREFIX / "sbin/quarveld"], env=self.environment, stderr=log
             )
+
         def up():
             if self.process.poll() is not None:
                 raise AssertionError(f"quarveld ended: {self.log()}")
-            with contextlib.suppress(OSError):
-                Client(self).close()
-                return True
-        eventually(up, "the service accepts clients")
+            with contextlib.suppress(OSError), contextlib.closing(Client(self)) as client:
+                return client.call("getAllReporters:") is not None
+
+        eventually(up, "the service answers")
         return self
 
     def end(self, how=signal.SIGTERM):
@@ -75,22 +76,19 @@ class Service:
             self.process.send_signal(how)
         return self.process.wait(PATIENCE)
 
-    def __enter__(self):
-        return self.start()
-
-    def __exit__(self, *_):
+    def finish(self):
+        """Ends it and looks whether a sanitizer has spoken."""
         try:
-            status = self.end()
+            self.end()
         finally:
             if self.process.poll() is None:
                 self.process.kill()
                 self.process.wait()
-            if self._temporary:
-                log = self.log()
-                self._temporary.cleanup()
-        if "ERROR: " in log and "Sanitizer" in log:
-            raise AssertionError(log)
-        self.status = status
+        if "Sanitizer" in self.log() or "runtime error:" in self.log():
+            raise AssertionError(self.log())
+
+    def tidy(self):
+        self._directory.cleanup()
 
     def log(self):
         return self.log_path.read_text(errors="replace") if self.log_path.exists() else ""
@@ -132,7 +130,11 @@ class Client:
     def __init__(self, service):
         self._socket = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
         self._socket.settimeout(PATIENCE)
-        self._socket.connect(str(service.socket))
+        try:
+            self._socket.connect(str(service.socket))
+        except OSError:
+            self._socket.close()
+            raise
         self._unpacker = msgpack.Unpacker(raw=False, timestamp=3)
         self._next = 0
         self.replies = {}
@@ -206,14 +208,17 @@ class CallError(Exception):
 
 
 class ServiceTest(unittest.TestCase):
-    def service(self, configuration="", **options):
+    def prepared(self, configuration="", **options):
+        """A service that is not started yet; its directory goes with the test."""
         service = Service(configuration, **options)
-        self.enterContext(service) if hasattr(self, "enterContext") else self._enter(service)
+        self.addCleanup(service.tidy)
         return service
 
-    def _enter(self, context):
-        context.__enter__()
-        self.addCleanup(context.__exit__, None, None, None)
+    def service(self, configuration="", **options):
+        service = self.prepared(configuration, **options)
+        service.start()
+        self.addCleanup(service.finish)
+        return service
 
     def client(self, service):
         client = Client(service)

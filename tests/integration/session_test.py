@@ -1,12 +1,14 @@
 """A client's sessions, from its socket to the store, with the installed service."""
 
+import contextlib
 import json
-import os
+import pathlib
+import sqlite3
 import subprocess
-import sys
+import time
 import unittest
 
-from harness import PATIENCE, PREFIX, CallError, Client, Service, ServiceTest, eventually
+from harness import PATIENCE, PREFIX, CallError, ServiceTest, eventually
 
 NO_BACKENDS = "[agent]\nbackends = []\n"
 
@@ -86,13 +88,18 @@ class Sessions(ServiceTest):
         clients = [self.client(service) for _ in range(100)]
         for number, client in enumerate(clients):
             client.start_session(number + 1)
-        switches = lambda: sum(
-            int(line.split()[1])
-            for task in os.listdir(f"/proc/{service.process.pid}/task")
-            for line in open(f"/proc/{service.process.pid}/task/{task}/status")
-            if line.startswith("voluntary"))
-        settled = lambda: (switches(), eventually(lambda: True, ""), wait_a_while(), switches())
-        eventually(lambda: (lambda s: s[0] == s[3])(settled()), "two seconds without a wake-up")
+
+        def switches():
+            tasks = pathlib.Path(f"/proc/{service.process.pid}/task").iterdir()
+            lines = [line for task in tasks for line in (task / "status").read_text().splitlines()]
+            return sum(int(line.split()[1]) for line in lines if line.startswith("voluntary"))
+
+        def stays_asleep():
+            before = switches()
+            time.sleep(2)
+            return switches() == before
+
+        eventually(stays_asleep, "two seconds without a wake-up")
 
     def test_the_same_in_another_language_and_from_a_script(self):
         service = self.service()
@@ -209,36 +216,24 @@ class Ends(ServiceTest):
                 self.assertIn(word, errors[0])
 
         running = self.service()
-        second = Service()
+        second = self.prepared()
         second.environment["QUARVEL_SOCKET"] = str(running.socket)
         refuse(second, str(running.socket))
         self.client(running).call("getAllReporters:")
 
-        later = Service()
-        with later:
-            pass
-        path = self.enterTemporary()
-        newer = Service(directory=path)
-        with newer:
-            pass
-        subprocess.run([sys.executable, "-c",
-                        f"import sqlite3; sqlite3.connect('{path}/state/telemetry.db').execute('PRAGMA user_version = 99')"],
-                       check=True)
+        newer = self.service()
+        newer.end()
+        with contextlib.closing(sqlite3.connect(newer.directory / "state/telemetry.db")) as store:
+            store.execute("PRAGMA user_version = 99")
         refuse(newer, "telemetry.db", "99")
 
-        wrong = Service('[limits]\ndepth = "deep"\n')
+        wrong = self.prepared('[limits]\ndepth = "deep"\n')
         refuse(wrong, "quarvel.toml", "depth")
 
-        unwritable = Service()
+        unwritable = self.prepared()
         (unwritable.directory / "file").write_text("")
         unwritable.environment["STATE_DIRECTORY"] = str(unwritable.directory / "file/state")
         refuse(unwritable, "file/state")
-
-    def enterTemporary(self):
-        import tempfile
-        directory = tempfile.TemporaryDirectory(prefix="quarvel-test-")
-        self.addCleanup(directory.cleanup)
-        return directory.name
 
 
 def seconds_between(earlier, later):
@@ -247,11 +242,6 @@ def seconds_between(earlier, later):
         hours, minutes, rest = text.split(":")
         return int(hours) * 3600 + int(minutes) * 60 + float(rest)
     return (seconds(later) - seconds(earlier)) % 86400
-
-
-def wait_a_while():
-    import time
-    time.sleep(2)
 
 
 if __name__ == "__main__":

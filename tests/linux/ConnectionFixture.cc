@@ -267,7 +267,8 @@ std::string CallBytes(std::optional<std::uint32_t> messageID, std::string_view m
   return bytes;
 }
 
-Service::Service(const Configuration::Limits& limits, std::optional<ListeningSocket> socket) {
+Service::Service(const Configuration::Limits& limits, std::optional<ListeningSocket> socket,
+                 NotBegun) {
   Journal::shared().clear();
   SocketListener::Options options;
   options.limits = limits;
@@ -277,12 +278,15 @@ Service::Service(const Configuration::Limits& limits, std::optional<ListeningSoc
   EXPECT_TRUE(listener);
   listener_ = std::move(listener.value());
   listener_->setDelegate(std::make_shared<TestDelegate>(*this));
+}
+
+void Service::begin() {
   thread_ = std::thread([this] { listener_->resume(); });
 }
 
 void Service::end() {
   if (!thread_.joinable()) return;
-  listener_->requestEnd();
+  requestEnd();
   thread_.join();
 }
 

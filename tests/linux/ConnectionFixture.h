@@ -10,6 +10,7 @@
 #include <string>
 #include <string_view>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "base/Mutex.h"
@@ -112,18 +113,26 @@ class Client {
 std::string CallBytes(std::optional<std::uint32_t> messageID, std::string_view method,
                       const List& arguments);
 
-/// A listener that serves on a thread of its own until `end`.
+/// A listener that serves on a thread of its own from `begin` to `end`.
 class Service {
  public:
-  /// Listens at `socketPath` unless a socket is given.
+  /// Begun. Listens at `socketPath` unless a socket is given.
   explicit Service(const Configuration::Limits& limits = {},
-                   std::optional<ListeningSocket> socket = std::nullopt);
+                   std::optional<ListeningSocket> socket = std::nullopt)
+      : Service(limits, std::move(socket), NotBegun()) {
+    begin();
+  }
+  /// Clients can connect, but nobody looks at them yet.
+  struct NotBegun {};
+  explicit Service(NotBegun notBegun) : Service({}, std::nullopt, notBegun) {}
   ~Service() { end(); }
 
   Client connect() { return Client(socketPath()); }
   [[nodiscard]] std::filesystem::path socketPath() const { return directory_.path() / "socket"; }
+  void begin();
   /// Returns when the listener has.
   void end();
+  void requestEnd() { listener_->requestEnd(); }
 
   /// What the delegate answers from now on.
   std::atomic<bool> accepts = true;
@@ -133,6 +142,8 @@ class Service {
   std::vector<std::weak_ptr<ExportedObject>> objects;
 
  private:
+  Service(const Configuration::Limits& limits, std::optional<ListeningSocket> socket, NotBegun);
+
   TemporaryDirectory directory_;
   std::unique_ptr<SocketListener> listener_;
   std::thread thread_;

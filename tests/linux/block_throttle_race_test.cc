@@ -1,3 +1,4 @@
+#include <fmt/format.h>
 #include <gtest/gtest.h>
 
 #include <atomic>
@@ -5,6 +6,7 @@
 #include <memory>
 #include <random>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "Statistics/Service/ZQReportingBlockThrottle.h"
@@ -50,7 +52,7 @@ TEST(BlockThrottleOnThreads, CallersThatRaceWithTheFiringLoseAndRepeatNothing) {
   std::vector<std::atomic<int>> runsOfKind(kKinds);
   std::atomic<int> running = 0;
   std::atomic<int> alive = 0;
-  const auto throttle = ZQReportingBlockThrottle::init();
+  auto throttle = ZQReportingBlockThrottle::init();
   std::vector<std::thread> callers;
   for (std::size_t caller = 0; caller < kCallers; ++caller) {
     callers.emplace_back([&, caller] {
@@ -65,7 +67,8 @@ TEST(BlockThrottleOnThreads, CallersThatRaceWithTheFiringLoseAndRepeatNothing) {
               ++runsOfKind[kind];
               --running;
             },
-            7, Payload(Dictionary{{"kind", kind}, {"_throttle_seconds", seconds}}), 3, 1);
+            7, Payload(Dictionary{{"kind", fmt::to_string(kind)}, {"_throttle_seconds", seconds}}),
+            3, 1);
         std::this_thread::sleep_for(100us);
       }
     });
@@ -75,8 +78,9 @@ TEST(BlockThrottleOnThreads, CallersThatRaceWithTheFiringLoseAndRepeatNothing) {
   throttle->setShouldKeepRunning(false);
   EXPECT_TRUE(throttle->timersInFlight().empty());
   EXPECT_TRUE(throttle->unscheduledTimerKeys().empty());
-  // The last block leaves the map before it runs.
-  for (int pauses = 0; alive > 0 && pauses < 1'000; ++pauses) std::this_thread::sleep_for(10ms);
+  // The last block leaves the map before it runs; the worker goes last of all.
+  const std::weak_ptr released = std::exchange(throttle, nullptr);
+  while (!released.expired()) std::this_thread::sleep_for(10ms);
   EXPECT_EQ(alive, 0) << "blocks neither run nor replaced";
   for (const auto& count : runs) EXPECT_LE(count, 1);
   for (const auto& count : runsOfKind) EXPECT_GE(count, 1);

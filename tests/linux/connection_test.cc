@@ -278,5 +278,16 @@ TEST(Connection, EndsInOrderWithCallsUnderWay) {
   while (auto kept = service.ledger->takeKept()) kept->reply(0);  // too late, and harmless
 }
 
+TEST(Connection, HearsWhoCameBeforeTheEnd) {
+  Service service{Service::NotBegun()};
+  Client client = service.connect();
+  ASSERT_TRUE(client.call(1, "echo:reply:", {1}));
+  service.requestEnd();
+  service.begin();
+  service.end();
+  EXPECT_EQ(client.response(), "[1,1,null,1]");
+  EXPECT_EQ(client.response(), "end");
+}
+
 }  // namespace
 }  // namespace quarvel

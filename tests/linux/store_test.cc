@@ -267,7 +267,7 @@ TEST_F(StoreTest, AFullDiskDelaysRowsAndLosesNone) {
   });
   vfs.awaitRefusedWrites(3);
   Await([&] { return store->counters().waiting == 50; });
-  EXPECT_THAT(errorLines(), ElementsAre(AllOf(HasSubstr("takes no rows"), HasSubstr("full"))))
+  EXPECT_THAT(errorLines(), ElementsAre(AllOf(HasSubstr("fails"), HasSubstr("full"))))
       << "one line however often it is tried";
   vfs.setFull(false);
   sender.join();
@@ -298,7 +298,7 @@ TEST_F(StoreTest, ClosingOnAFullDiskCountsWhatIsLost) {
   EXPECT_THAT(store->counters(),
               AllOf(IsBalanced(), Field(&StoreCounters::stored, 1), Field(&StoreCounters::lost, 5),
                     Field(&StoreCounters::refused, 1)));
-  EXPECT_THAT(errorLines(), ElementsAre(HasSubstr("takes no rows"), HasSubstr("5 are lost")));
+  EXPECT_THAT(errorLines(), ElementsAre(HasSubstr("fails"), HasSubstr("5 are lost")));
 }
 
 TEST_F(StoreTest, AFlushCoversEverythingBeforeItWithOneSync) {

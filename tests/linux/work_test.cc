@@ -282,8 +282,12 @@ class RecordedVoucher final : public Voucher {
       : size_(size), completions_(completions) {}
   [[nodiscard]] std::size_t bytes() const override { return size_; }
 
+  std::atomic<int> carriedOutTimes{0};
+
  private:
+  void carriedOut() override { ++carriedOutTimes; }
   void completed() override {
+    EXPECT_EQ(carriedOutTimes, 1);
     ++completions_;
     completions_.notify_all();
   }
@@ -292,7 +296,7 @@ class RecordedVoucher final : public Voucher {
   std::atomic<int>& completions_;
 };
 
-std::shared_ptr<Voucher> voucherOf(std::size_t size, std::atomic<int>& completions) {
+std::shared_ptr<RecordedVoucher> voucherOf(std::size_t size, std::atomic<int>& completions) {
   return std::make_shared<RecordedVoucher>(size, completions);
 }
 
@@ -302,9 +306,10 @@ TEST(VoucherTest, CompletesOnceAfterTheLastBlockThatCameOfIt) {
   const auto session = utilityQueue();
   std::atomic<int> afterwards{0};
   std::latch last(1);
+  const auto voucher = voucherOf(1, completions);
   {
-    const VoucherHold hold(voucherOf(1, completions));
-    const VoucherScope scope(hold);
+    const VoucherHold hold(voucher);
+    const VoucherScope scope(VoucherScope::Of::call, hold);
     server->async([&] {
       for (int i = 0; i < 100; ++i) {
         session->async([&] { BackgroundQueue().async([&] { afterwards += completions; }); });
@@ -316,7 +321,8 @@ TEST(VoucherTest, CompletesOnceAfterTheLastBlockThatCameOfIt) {
     });
   }
   finish(*server);
-  EXPECT_EQ(completions, 0);
+  EXPECT_EQ(voucher->carriedOutTimes, 1) << "what the call queued itself has run";
+  EXPECT_EQ(completions, 0) << "what came of that has not";
   last.count_down();
   completions.wait(0);
   finish(*session);
@@ -336,7 +342,7 @@ TEST(VoucherTest, DelayedBlockLetsItsCallCompleteAndRunsUnderItAgain) {
   std::latch ran(1);
   {
     const VoucherHold hold(voucher);
-    const VoucherScope scope(hold);
+    const VoucherScope scope(VoucherScope::Of::call, hold);
     queue->after(20ms, [&] {
       EXPECT_EQ(completions, 1);
       EXPECT_EQ(VoucherHold::current().voucher(), voucher);
@@ -355,7 +361,7 @@ TEST(VoucherTest, DelayedBlocksBeyondTheBoundHoldTheirCalls) {
   const auto queue = serverQueue();
   const auto delay = [&](std::chrono::milliseconds time, std::shared_ptr<Voucher> voucher) {
     const VoucherHold hold(std::move(voucher));
-    const VoucherScope scope(hold);
+    const VoucherScope scope(VoucherScope::Of::call, hold);
     queue->after(time, [] {});
   };
   delay(20ms, voucherOf(Keeper::kUnheldBytes, within));

@@ -11,7 +11,7 @@ namespace {
 constexpr std::int64_t kResponse = 1;
 
 /// A buffer that has grown beyond this for a burst is not kept for the quiet that follows.
-constexpr std::size_t kKeptCapacity = 64 * 1024;
+constexpr std::size_t kKeptCapacity = std::size_t{64} * 1024;
 
 void Empty(std::string& buffer) {
   if (buffer.capacity() > kKeptCapacity) {
@@ -91,9 +91,17 @@ void CallDesk::begin(std::size_t bytes) {
   bytes_.fetch_add(bytes);
 }
 
-void CallDesk::done(std::size_t bytes) {
+void CallDesk::carriedOut() {
   calls_.fetch_sub(1);
+  wakeIfHalfIsDone();
+}
+
+void CallDesk::done(std::size_t bytes) {
   bytes_.fetch_sub(bytes);
+  wakeIfHalfIsDone();
+}
+
+void CallDesk::wakeIfHalfIsDone() {
   if (waiting_ && halfIsDone() && waiting_.exchange(false)) wake_();
 }
 

@@ -46,6 +46,8 @@ class CallDesk {
 
   /// I/O thread. A call of so many bytes is taken in.
   void begin(std::size_t bytes);
+  /// It has been carried out, though work that came of it may go on.
+  void carriedOut();
   /// All work that came of it is done.
   void done(std::size_t bytes);
   /// I/O thread. Whether no further call may be taken in; if so, `wake` is called when half of the
@@ -55,6 +57,7 @@ class CallDesk {
  private:
   template <class Encode>
   void reply(Encode encode);
+  void wakeIfHalfIsDone();
   [[nodiscard]] bool isFull() const;
   [[nodiscard]] bool halfIsDone() const;
 
@@ -70,8 +73,8 @@ class CallDesk {
   bool refused_ QUARVEL_GUARDED_BY(mutex_) = false;
   std::atomic<std::size_t> repliesHeld_{0};
 
-  std::atomic<std::size_t> calls_{0};
-  std::atomic<std::size_t> bytes_{0};
+  std::atomic<std::size_t> calls_{0};  // not carried out
+  std::atomic<std::size_t> bytes_{0};  // of calls of which anything is still to be done
   std::atomic<bool> waiting_{false};  // the I/O thread wants to hear of room
 };
 
@@ -86,6 +89,7 @@ class Call final : public ReplySink, public Voucher {
   [[nodiscard]] std::size_t bytes() const override { return bytes_; }
 
  protected:
+  void carriedOut() override { desk_->carriedOut(); }
   void completed() override { desk_->done(bytes_); }
 
  private:

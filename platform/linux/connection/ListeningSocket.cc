@@ -10,7 +10,6 @@
 
 #include <cerrno>
 #include <cstring>
-#include <optional>
 #include <string>
 #include <system_error>
 #include <utility>
@@ -111,13 +110,13 @@ Result<ListeningSocket> ListeningSocket::listeningAt(const std::filesystem::path
     return SystemFailure(path, "cannot be bound");
   }
   struct stat status {};
-  if (::chmod(path.c_str(), kSocketMode) != 0 || ::lstat(path.c_str(), &status) != 0 ||
-      ::listen(socket.descriptor(), SOMAXCONN) != 0) {
-    return SystemFailure(path, "cannot be listened at");
-  }
+  if (::lstat(path.c_str(), &status) != 0) return SystemFailure(path, "cannot be looked at");
   socket.path_ = path;
   socket.device_ = status.st_dev;
   socket.inode_ = status.st_ino;
+  if (::chmod(path.c_str(), kSocketMode) != 0 || ::listen(socket.descriptor(), SOMAXCONN) != 0) {
+    return SystemFailure(path, "cannot be listened at");
+  }
   return socket;
 }
 
@@ -125,13 +124,14 @@ ListeningSocket::~ListeningSocket() {
   removeFile();
 }
 
-void ListeningSocket::removeFile() {
-  if (path_.empty()) return;
+bool ListeningSocket::removeFile() {
+  if (path_.empty()) return false;
   struct stat status {};
   if (::lstat(path_.c_str(), &status) == 0 && status.st_dev == device_ && status.st_ino == inode_) {
     ::unlink(path_.c_str());
   }
   path_.clear();
+  return true;
 }
 
 }  // namespace quarvel

@@ -28,8 +28,9 @@ class ListeningSocket {
   [[nodiscard]] int descriptor() const { return descriptor_.get(); }
   /// Gives the descriptor away; the file stays this object's to remove.
   [[nodiscard]] UniqueDescriptor releaseDescriptor() { return std::move(descriptor_); }
-  /// Removes the socket file if `listeningAt` made it and it is still the same.
-  void removeFile();
+  /// Removes the socket file if it is still the one that `listeningAt` made. False when it made
+  /// none.
+  bool removeFile();
 
  private:
   ListeningSocket() = default;

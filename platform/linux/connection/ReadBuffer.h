@@ -14,7 +14,7 @@ namespace quarvel {
 class ReadBuffer {
  public:
   /// No smaller block is ever taken; what a read of a busy client brings.
-  static constexpr std::size_t kSmallest = 32 * 1024;
+  static constexpr std::size_t kSmallest = std::size_t{32} * 1024;
 
   [[nodiscard]] std::string_view bytes() const { return {block_.get() + begin_, end_ - begin_}; }
   [[nodiscard]] bool empty() const { return begin_ == end_; }

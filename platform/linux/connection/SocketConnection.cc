@@ -2,6 +2,7 @@
 
 #include <sys/socket.h>
 
+#include <asio/dispatch.hpp>
 #include <asio/post.hpp>
 #include <cerrno>
 #include <utility>
@@ -35,8 +36,7 @@ SocketConnection::SocketConnection(std::shared_ptr<ConnectionContext> context, s
 
 std::shared_ptr<SocketConnection> SocketConnection::create(
     std::shared_ptr<ConnectionContext> context, UniqueDescriptor socket, std::uint64_t number) {
-  const std::shared_ptr<SocketConnection> connection(
-      new SocketConnection(std::move(context), number));
+  std::shared_ptr<SocketConnection> connection(new SocketConnection(std::move(context), number));
   asio::error_code error;
   connection->socket_.assign(socket.get(), error);
   if (error) return nullptr;
@@ -77,7 +77,8 @@ std::string SocketConnection::description() const {
 }
 
 void SocketConnection::resume() {
-  asio::post(context_->io, [weak = weak_from_this()] {
+  // At once on the I/O thread, so that an end of the service finds it resumed.
+  asio::dispatch(context_->io, [weak = weak_from_this()] {
     if (const auto self = weak.lock()) {
       self->resumed_ = true;
       self->proceed();
@@ -188,7 +189,7 @@ void SocketConnection::dispatch(const Request& request, std::size_t frameBytes) 
     for (const PayloadValue argument : request.params.items()) arguments_.push_back(argument);
     desk_->begin(frameBytes);
     const VoucherHold hold(call);
-    const VoucherScope scope(hold);
+    const VoucherScope scope(VoucherScope::Of::call, hold);
     if (auto wrong = method->invoke(*method, *object_, arguments_, call)) {
       error = BadArgumentsError(std::move(*wrong));
     }

@@ -9,10 +9,13 @@
 #include <asio/signal_set.hpp>
 #include <asio/steady_timer.hpp>
 #include <cerrno>
+#include <chrono>
+#include <cstdint>
 #include <string>
 #include <system_error>
 #include <unordered_set>
 #include <utility>
+#include <vector>
 
 #include "base/Format.h"
 #include "platform/Log.h"
@@ -73,11 +76,20 @@ class SocketListener::Loop {
   }
 
   void acceptWaiting() {
-    if (accepting_ || ended_) return;
+    if (accepting_ || ended_ || !acceptAll()) return;
+    accepting_ = true;
+    socket_.async_wait(asio::posix::stream_descriptor::wait_read, [this](asio::error_code error) {
+      accepting_ = false;
+      if (!error) acceptWaiting();
+    });
+  }
+
+  /// False when some had to be left waiting.
+  bool acceptAll() {
     for (;;) {
       if (connections_.size() >= options_.limits.connections) {
         holdBack(fmt::format("there are {} connections already", connections_.size()));
-        return;
+        return false;
       }
       UniqueDescriptor client(
           ::accept4(socket_.native_handle(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
@@ -85,18 +97,13 @@ class SocketListener::Loop {
         welcome(std::move(client));
       } else if (errno == EAGAIN) {
         heldBack_ = false;
-        break;
+        return true;
       } else if (errno != EINTR && errno != ECONNABORTED && errno != EPROTO) {
         holdBack(std::generic_category().message(errno));
         retryLater();
-        return;
+        return false;
       }
     }
-    accepting_ = true;
-    socket_.async_wait(asio::posix::stream_descriptor::wait_read, [this](asio::error_code error) {
-      accepting_ = false;
-      if (!error) acceptWaiting();
-    });
   }
 
   /// Accepts no more until a connection ends; said once, however long it lasts.
@@ -128,7 +135,8 @@ class SocketListener::Loop {
 
   void end() {
     if (std::exchange(ended_, true)) return;
-    listeningSocket_.removeFile();
+    // Who came before the end is heard; at an inherited socket they wait for the next service.
+    if (listeningSocket_.removeFile()) (void)acceptAll();
     asio::error_code ignored;
     socket_.close(ignored);
     retryTimer_.cancel();

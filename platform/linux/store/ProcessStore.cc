@@ -1,6 +1,7 @@
 #include "platform/linux/store/ProcessStore.h"
 
 #include <filesystem>
+#include <system_error>
 #include <utility>
 
 #include "platform/Clock.h"
@@ -19,8 +20,13 @@ std::shared_ptr<TelemetryStore> OpenOrExit() {
   ZQ_FUNCTION("ProcessTelemetryStore");
   const Configuration& configuration = Configuration::process();
   TelemetryStore::Options options;
-  options.path = configuration.store.path.empty() ? Directories::process().state / "telemetry.db"
-                                                  : configuration.store.path;
+  options.path = configuration.store.path;
+  if (options.path.empty()) {
+    // The state directory is the service's own to make; one that somebody named is not.
+    std::error_code failure;
+    std::filesystem::create_directories(Directories::process().state, failure);
+    options.path = Directories::process().state / "telemetry.db";
+  }
   options.sync = configuration.store.sync;
   options.maximumBytes = configuration.store.maximumBytes;
   options.maximumAge = configuration.store.maximumAge;

@@ -129,16 +129,12 @@ void SqliteConnection::rollBack() {
   }
 }
 
-bool SqliteConnection::isReadOnly() const {
-  return sqlite3_db_readonly(connection_.get(), "main") != 0;
-}
-
-SqliteConnection::Checkpoint SqliteConnection::checkpoint() {
+bool SqliteConnection::checkpoint() {
   int logPages = -1;
   int movedPages = -1;
   const int result = sqlite3_wal_checkpoint_v2(connection_.get(), "main", SQLITE_CHECKPOINT_PASSIVE,
                                                &logPages, &movedPages);
-  return {result == SQLITE_OK, result == SQLITE_OK && logPages == movedPages};
+  return result == SQLITE_OK && logPages == movedPages;
 }
 
 void SqliteConnection::checkpointAtClose() {

@@ -77,14 +77,10 @@ class SqliteConnection {
   [[nodiscard]] std::int64_t changes() const;
   /// Ends the transaction under way, if there still is one: some failures end it themselves.
   void rollBack();
-  [[nodiscard]] bool isReadOnly() const;
 
-  struct Checkpoint {
-    bool ok = false;
-    bool complete = false;  // every frame of the log is in the database file, and both are synced
-  };
   /// Moves what readers allow from the write-ahead log into the database file; never waits for one.
-  Checkpoint checkpoint();
+  /// True when that was everything: then every commit is on the medium.
+  bool checkpoint();
   /// Before closing: moves the whole log as far as readers let it (it waits for them as long as the
   /// busy time-out) and lets closing remove it.
   void checkpointAtClose();

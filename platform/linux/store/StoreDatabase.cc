@@ -190,7 +190,7 @@ bool StoreDatabase::checkpointIfDue(bool idle) {
     return false;
   }
   checkpointedPages_ = logPages;
-  return connection_.checkpoint().complete;
+  return connection_.checkpoint();
 }
 
 }  // namespace quarvel

@@ -103,7 +103,7 @@ bool StoreWriter::writeRows(const StoreBatch& batch, std::size_t first, std::siz
   std::chrono::milliseconds backOff = kFirstBackOff;
   bool closing = false;
   while (!tryToWrite(batch, first, last)) {
-    failed();
+    failed(database_ ? databaseError() : failure_);
     if (closing) return false;
     closing = queue_.waitForClose(steady_clock::now() + backOff);
     backOff = std::min(backOff * 2, kLongestBackOff);
@@ -157,7 +157,7 @@ void StoreWriter::lose(const StoreBatch& batch, std::size_t first) {
 void StoreWriter::syncTail() {
   unsyncedSince_.reset();
   if (database_->sync()) return;
-  failed();
+  failed(StoreError(StoreErrorCode::failed, "the write-ahead log cannot be synced"));
   unsyncedSince_ = steady_clock::now();
 }
 
@@ -173,7 +173,7 @@ void StoreWriter::makeRoom(const StoreQueue::Tally& incoming) {
 bool StoreWriter::retain(std::uint64_t incomingBytes, std::optional<Date> expired) {
   if (!database_) return false;
   const auto progress = database_->retention().step(incomingBytes, expired);
-  if (progress == StoreRetention::Progress::failed) failed();
+  if (progress == StoreRetention::Progress::failed) failed(databaseError());
   if (!database_) return false;
   const auto removed = database_->retention().takeRemoved();
   if (removed.rows > 0) {
@@ -193,15 +193,16 @@ void StoreWriter::reportRemoved(bool now) {
          options_.database.path.string(), std::exchange(removedNotExported_, 0));
 }
 
-void StoreWriter::failed() {
+Error StoreWriter::databaseError() const {
+  const bool full = database_->fault() == SqliteFault::diskFull;
+  return StoreError(full ? StoreErrorCode::diskFull : StoreErrorCode::failed, database_->message());
+}
+
+void StoreWriter::failed(Error error) {
   ZQ_FUNCTION("StoreWriter::failed");
-  if (database_) {
-    const bool full = database_->fault() == SqliteFault::diskFull;
-    failure_ =
-        StoreError(full ? StoreErrorCode::diskFull : StoreErrorCode::failed, database_->message());
-  }
+  failure_ = std::move(error);
   if (failureLine_.due()) {
-    ZQ_LOG(nullptr, error, "The telemetry store {} takes no rows: {}. Trying again; {} rows wait.",
+    ZQ_LOG(nullptr, error, "The telemetry store {} fails: {}. Trying again; {} rows wait.",
            options_.database.path.string(), failure_.description(), queue_.counters().waiting);
   }
   if (!database_ || database_->fault() != SqliteFault::corrupt) return;

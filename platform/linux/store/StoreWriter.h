@@ -62,7 +62,9 @@ class StoreWriter {
   /// One step of retention. False when there is nothing more to do.
   bool retain(std::uint64_t incomingBytes, std::optional<Date> expired);
   void reportRemoved(bool now);
-  void failed();
+  [[nodiscard]] Error databaseError() const;
+  /// Reports, and begins a new file when this one turns out to be corrupt.
+  void failed(Error error);
   [[nodiscard]] bool reopen();
   void finish();
 

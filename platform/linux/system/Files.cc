@@ -58,7 +58,7 @@ Outcome CreateDirectory(std::string_view path, std::uint32_t permissions) {
   fs::path directory(path);
   if (!directory.has_filename()) directory = directory.parent_path();
   std::error_code failure;
-  fs::create_directories(directory.parent_path(), failure);
+  if (directory.has_parent_path()) fs::create_directories(directory.parent_path(), failure);
   if (failure) return fileError(directory.parent_path(), failure.value());
   if (mkdir(directory.c_str(), static_cast<mode_t>(permissions)) == 0) {
     // The process's mask has taken its part of them.

@@ -7,6 +7,8 @@
 #include <ctime>
 #include <iterator>
 
+#include "base/Mutex.h"
+
 namespace quarvel {
 namespace {
 
@@ -24,26 +26,31 @@ std::string_view levelName(LogLevel level) {
   return "debug";
 }
 
-/// A second of local time: "2026-01-31T14:25:01" and "+01:00".
+/// A second of local time: "2026-01-31T14:25:01" and "+01:00". Without a destructor, since a thread
+/// may log after its other thread-locals have gone.
 struct LocalSecond {
   std::time_t second = -1;
-  std::string text;
-  std::string offset;
+  char text[32] = "";
+  char offset[16] = "";
 };
 
 /// Kept a thread: local time is looked up once a second, not once a line.
 const LocalSecond& localSecond(std::time_t second) {
   thread_local LocalSecond local;
   if (local.second == second) return local;
-  tzset();  // the device may have travelled
   std::tm time{};
-  localtime_r(&second, &time);
+  {
+    static Mutex& zone = *new Mutex;
+    const MutexLock lock(zone);
+    tzset();  // the device may have travelled
+    localtime_r(&second, &time);
+  }
   local.second = second;
-  local.text = fmt::format("{:04}-{:02}-{:02}T{:02}:{:02}:{:02}", time.tm_year + 1900,
-                           time.tm_mon + 1, time.tm_mday, time.tm_hour, time.tm_min, time.tm_sec);
+  std::strftime(local.text, sizeof local.text, "%Y-%m-%dT%H:%M:%S", &time);
   const long minutes = std::abs(time.tm_gmtoff) / 60;
-  local.offset =
-      fmt::format("{}{:02}:{:02}", time.tm_gmtoff < 0 ? '-' : '+', minutes / 60, minutes % 60);
+  *fmt::format_to_n(local.offset, sizeof local.offset - 1, "{}{:02}:{:02}",
+                    time.tm_gmtoff < 0 ? '-' : '+', minutes / 60, minutes % 60)
+       .out = '\0';
   return local;
 }
 

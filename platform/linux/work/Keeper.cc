@@ -98,7 +98,7 @@ void Keeper::run() {
 }
 
 void Keeper::deliver(Delayed delayed) {
-  if (!delayed.held) delayed.held = VoucherHold(std::move(delayed.voucher));
+  if (!delayed.held) delayed.held = VoucherHold::indirect(std::move(delayed.voucher));
   delayed.lane->add({std::move(delayed.held), std::move(delayed.block)});
 }
 

@@ -17,7 +17,7 @@ struct WorkItem {
   /// Runs the block, destroys it, and only then lets the voucher go.
   void run() {
     {
-      const VoucherScope scope(voucher);
+      const VoucherScope scope(VoucherScope::Of::block, voucher);
       block();
       block = Block();
     }

@@ -11,7 +11,8 @@ namespace quarvel {
 /// Stands for one call of a client for as long as any work that came of it is still to be done.
 /// A block that is queued while a voucher is current holds it until the block has run, and so do
 /// the blocks that this one queues; so a connection knows how much of what it took in is still
-/// waiting anywhere, without the blocks knowing of connections.
+/// waiting anywhere, without the blocks knowing of connections. It is told twice: when the call
+/// itself has been carried out, and when nothing that came of it is left.
 class Voucher {
  public:
   virtual ~Voucher() = default;
@@ -19,8 +20,12 @@ class Voucher {
   [[nodiscard]] virtual std::size_t bytes() const = 0;
 
  protected:
-  /// Called once, when the last hold goes, on whatever thread that is. Must not block. A hold that
-  /// is taken later (a delayed block's, `Keeper`) has no effect.
+  // Each is called once, on whatever thread it comes to pass on. Must not block.
+
+  /// The call, and the blocks that it queued itself, have run.
+  virtual void carriedOut() = 0;
+  /// The last hold has gone; after `carriedOut`. A hold that is taken later (a delayed block's,
+  /// `Keeper`) has no effect.
   virtual void completed() = 0;
 
  private:
@@ -28,33 +33,39 @@ class Voucher {
 
   static constexpr std::uint32_t kCompleted = std::uint32_t{1} << 31;
 
-  void hold() { holds_.fetch_add(1, std::memory_order_relaxed); }
-  void release() {
+  void hold(bool direct) {
+    holds_.fetch_add(1, std::memory_order_relaxed);
+    if (direct) directHolds_.fetch_add(1, std::memory_order_relaxed);
+  }
+  void release(bool direct) {
+    if (direct && directHolds_.fetch_sub(1, std::memory_order_acq_rel) == 1) carriedOut();
     if (holds_.fetch_sub(1, std::memory_order_acq_rel) != 1) return;
     // Somebody may take hold again just now, and then it is theirs to complete.
     std::uint32_t none = 0;
     if (holds_.compare_exchange_strong(none, kCompleted, std::memory_order_acq_rel)) completed();
   }
 
-  std::atomic<std::uint32_t> holds_{0};  // plus kCompleted, once it has
+  std::atomic<std::uint32_t> holds_{0};        // plus kCompleted, once it has
+  std::atomic<std::uint32_t> directHolds_{0};  // the call's own, and its own blocks'
 };
 
 /// Keeps a voucher open. May be empty.
 class VoucherHold {
  public:
   VoucherHold() = default;
-  explicit VoucherHold(std::shared_ptr<Voucher> voucher) : voucher_(std::move(voucher)) {
-    if (voucher_) voucher_->hold();
-  }
-  VoucherHold(VoucherHold&& other) noexcept : voucher_(std::move(other.voucher_)) {}
+  /// The call's own hold.
+  explicit VoucherHold(std::shared_ptr<Voucher> voucher) : VoucherHold(std::move(voucher), true) {}
+  VoucherHold(VoucherHold&& other) noexcept
+      : voucher_(std::move(other.voucher_)), direct_(other.direct_) {}
   VoucherHold& operator=(VoucherHold&& other) noexcept {
     std::swap(voucher_, other.voucher_);
+    std::swap(direct_, other.direct_);
     return *this;
   }
   VoucherHold(const VoucherHold&) = delete;
   VoucherHold& operator=(const VoucherHold&) = delete;
   ~VoucherHold() {
-    if (voucher_) voucher_->release();
+    if (voucher_) voucher_->release(direct_);
   }
 
   [[nodiscard]] const std::shared_ptr<Voucher>& voucher() const { return voucher_; }
@@ -62,21 +73,35 @@ class VoucherHold {
 
   /// A further hold on the voucher that is current on this thread; empty when none is.
   [[nodiscard]] static VoucherHold current();
+  /// A further hold for work that came of a block.
+  [[nodiscard]] static VoucherHold indirect(std::shared_ptr<Voucher> voucher) {
+    return {std::move(voucher), false};
+  }
 
  private:
+  VoucherHold(std::shared_ptr<Voucher> voucher, bool direct)
+      : voucher_(std::move(voucher)), direct_(direct) {
+    if (voucher_) voucher_->hold(direct_);
+  }
+
   std::shared_ptr<Voucher> voucher_;
+  bool direct_ = false;
 };
 
 /// Makes a voucher (or none) current on this thread for a scope.
 class VoucherScope {
  public:
-  explicit VoucherScope(const VoucherHold& hold);
+  /// Who runs in the scope: the call itself, whose blocks are part of carrying it out, or a block,
+  /// whose further blocks are not.
+  enum class Of : std::uint8_t { call, block };
+  VoucherScope(Of of, const VoucherHold& hold);
   ~VoucherScope();
   VoucherScope(const VoucherScope&) = delete;
   VoucherScope& operator=(const VoucherScope&) = delete;
 
  private:
   const VoucherHold* previous_;
+  Of previousOf_;
 };
 
 }  // namespace quarvel

@@ -9,15 +9,12 @@
 namespace quarvel {
 namespace {
 
-using testing::Contains;
 using testing::ElementsAre;
 using testing::IsEmpty;
-using testing::Not;
 using testing::StartsWith;
 using Lines = std::vector<std::string>;
 
 const Value kYes(true);
-const Value kUnknown(65535);
 const std::string kDelegate = "-[ZQReportingServiceDelegate ";
 const std::string kInstance = "-[ZQReportingServerInstance ";
 
@@ -101,7 +98,7 @@ TEST(ServiceDelegate, SearchesClientsInTheOrderOfAcceptance) {
     service.run();
     EXPECT_THAT(third->results, ElementsAre(Value(1)));
     EXPECT_THAT(own->results, ElementsAre(Value(2)));
-    EXPECT_THAT(nobody->results, ElementsAre(kUnknown));
+    EXPECT_THAT(nobody->results, ElementsAre(Value(65535)));
     EXPECT_THAT(zero->results,
                 ElementsAre(Value(Dictionary{{"reporterID", 0}, {"serviceType", 65535}})));
     const std::string search = " zqrs " + kDelegate + "findReportingSessionForID:]: ";
@@ -173,6 +170,154 @@ TEST(ServiceDelegate, AClientThatIsGoneAtOnceLeavesNothingBehind) {
                          "client")
                   .size(),
               1U);
+  }
+}
+
+// The user information that a new session of `client` hands to the agent.
+Dictionary UserInfoAtStart(RunningService& service, Client& client, ReporterID id) {
+  client.start(id);
+  service.run();
+  return service.simulation.agent.sessions.back().userInfo;
+}
+
+TEST(Preferences, AreReadWhenTheyAreSaidToHaveChanged) {
+  const std::string function = " zqrs " + kDelegate + "listenForDefaultsNotification]: ";
+  const std::pair<Dictionary, const char*> kCases[] = {
+      {{}, "{\"disable_reporting\":0}"},
+      {{{"other", 1}, {"device_name", "Kitchen"}},
+       "{\"device_name\":\"Kitchen\",\"disable_reporting\":0}"},
+      {{{"disable_reporting", true}, {"device_name", 7}},
+       "{\"device_name\":\"7\",\"disable_reporting\":true}"},
+      {{{"disable_reporting", 1}, {"device_name", true}}, "{\"disable_reporting\":true}"},
+      {{{"disable_reporting", false}}, "{\"disable_reporting\":false}"},
+  };
+  for (const auto& [entries, defaults] : kCases) {
+    RunningService service(1);
+    service.simulation.log.lines.clear();
+    service.changePreferences(entries);
+    EXPECT_THAT(service.simulation.log.texts(),
+                ElementsAre("default" + function + "re-reading quarvel defaults",
+                            "info" + function + "defaults " + defaults));
+  }
+}
+
+TEST(Preferences, ChangeNothingBeforeThatOrByAForeignNotification) {
+  for (const auto seed : Seeds()) {
+    RunningService service(seed, [](Simulation& simulation) {
+      simulation.preferences["tarnwick.quarvel"] = {{"disable_reporting", true}};
+    });
+    Client client = service.connect(42);
+    service.simulation.log.lines.clear();
+    service.simulation.notifications.deliverForeign("tarnwick.quarvel.reporting");
+    service.run();
+    EXPECT_THAT(service.simulation.log.texts(), IsEmpty());
+    const auto sent = client.send({});
+    service.run();
+    EXPECT_THAT(sent->results, ElementsAre(Value()));
+  }
+}
+
+TEST(Preferences, ReachEverySessionThereIsAndStayInIt) {
+  for (const auto seed : Seeds()) {
+    RunningService service(seed);
+    Client client = service.connect(42);
+    client.create(7);
+    service.run();
+    service.changePreferences({{"device_name", "Kitchen"}});
+    client.create(8);
+    service.run();
+    service.changePreferences({});
+    client.create(9);
+    EXPECT_EQ(*UserInfoAtStart(service, client, 7).find("device_name"), Value("Kitchen"));
+    EXPECT_EQ(UserInfoAtStart(service, client, 8).find("device_name"), nullptr);
+    EXPECT_EQ(UserInfoAtStart(service, client, 9).size(), 2U);
+  }
+}
+
+TEST(Preferences, TheServiceRunsOnWithoutNotifications) {
+  RunningService service(
+      1, [](Simulation& simulation) { simulation.notifications.registrationStatus = 5; });
+  EXPECT_EQ(service.simulation.log.texts("default").at(0),
+            "default zqrs " + kDelegate + "listenForDefaultsNotification]: notify setup result 5");
+  const auto created = service.connect(42).create(7);
+  service.run();
+  EXPECT_THAT(created->results, ElementsAre(kYes));
+}
+
+TEST(ClientUptime, IsReportedWhenTheConnectionEnds) {
+  struct Case {
+    const char* name;
+    const char* process;  // none: unknown to the kernel
+    std::chrono::seconds clockStep;
+    std::optional<double> seconds;
+    Lines lines;
+  };
+  const Case kCases[] = {
+      {"a fraction is cut in the line only",
+       "player",
+       0s,
+       12.75,
+       {"InvalidationHandler: connection exited process=player uptime_sec=12"}},
+      {"the clock went back",
+       "player",
+       -60s,
+       47.25,
+       {"clientStartDate is in the past. clientpid=42 clientprocessname=player",
+        "InvalidationHandler: connection exited process=player uptime_sec=47"}},
+      {"a process without a name",
+       nullptr,
+       0s,
+       std::nullopt,
+       {"InvalidationHandler: connection exited process=(null) uptime_sec=12",
+        "clientProcessName is nil. clientpid=42"}},
+  };
+  const std::string function =
+      "default zqrs " + kDelegate + "listener:shouldAcceptNewConnection:]: ";
+  for (const Case& each : kCases) {
+    for (const auto seed : Seeds()) {
+      SCOPED_TRACE(each.name);
+      RunningService service(seed);
+      if (each.process != nullptr) service.simulation.process.table[42] = each.process;
+      Client client = service.connect(42);
+      service.simulation.runFor(12750ms);
+      service.simulation.scheduler.setWallClock(service.simulation.scheduler.wallClock() +
+                                                each.clockStep);
+      service.simulation.log.lines.clear();
+      client.disconnect();
+      service.run();
+      Lines lines = service.simulation.log.texts(function);
+      for (std::string& line : lines) line.erase(0, function.size());
+      EXPECT_EQ(lines, each.lines);
+      const auto& events = service.simulation.vistrel.events;
+      ASSERT_EQ(events.size(), each.seconds ? 1U : 0U);
+      if (each.seconds) {
+        EXPECT_EQ(events[0].name, "tarnwick.quarvel.zqreportingclientuptime");
+        EXPECT_EQ(events[0].payload.root().toDictionary(),
+                  (Dictionary{{"processName", each.process}, {"seconds", *each.seconds}}));
+      }
+    }
+  }
+}
+
+TEST(ClientUptime, OfAClientThatLeftBeforeItWasRegistered) {
+  for (const auto seed : Seeds()) {
+    RunningService service(seed);
+    service.simulation.process.table[42] = "player";
+    ServerQueue().async([&] { service.simulation.scheduler.sleep(1s); });
+    Client client(service.simulation.listener.connect(42));
+    client.disconnect();
+    service.run();
+    const std::string function =
+        "default zqrs " + kDelegate + "listener:shouldAcceptNewConnection:]: ";
+    const auto lines = service.simulation.log.texts(function);
+    EXPECT_THAT(lines,
+                ElementsAre(StartsWith(function + "newConnection: "),
+                            function + "clientStartDate is nil. clientpid=42 "
+                                       "clientprocessname=unknown",
+                            function + "InvalidationHandler: connection exited process=(null) "
+                                       "uptime_sec=-1",
+                            function + "clientProcessName is nil. clientpid=42"));
+    EXPECT_THAT(service.simulation.vistrel.events, IsEmpty());
   }
 }
 

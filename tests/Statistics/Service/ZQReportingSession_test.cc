@@ -2,7 +2,7 @@
 
 #include <gmock/gmock.h>
 
-#include "tests/platform/Simulation.h"
+#include "tests/Statistics/Service/SessionOwner.h"
 
 namespace quarvel {
 namespace {
@@ -10,62 +10,6 @@ namespace {
 using testing::ElementsAre;
 using testing::ElementsAreArray;
 using testing::IsEmpty;
-
-/// A session whose owner is the test: it alone runs while the simulation does not, and so stands in
-/// for the `ServerQueue`.
-struct Owner {
-  explicit Owner(std::uint64_t seed, std::uint16_t serviceType = 0) : simulation(seed) {
-    holdServerQueue();
-    session->setServiceType(serviceType);
-    simulation.log.lines.clear();
-    simulation.journal.clear();
-  }
-  static void holdServerQueue() QUARVEL_ASSERT_CAPABILITY(serverQueueRole) {}
-
-  void start() {
-    holdServerQueue();
-    session->start();
-  }
-  void stop() {
-    holdServerQueue();
-    session->stop();
-  }
-  void send(const Dictionary& payload = {{"a", 1}}, std::uint32_t category = 3,
-            std::uint16_t type = 1, bool sync = false) {
-    holdServerQueue();
-    session->sendMessage(Payload(payload), category, type, sync,
-                         [this](const std::optional<Error>& error) { sent.push_back(error); });
-  }
-  /// A start reply that counts in `ended`.
-  void awaitEnd() {
-    struct Counter : ReplySink {
-      explicit Counter(std::vector<Value>& counted) : ended(counted) {}
-      void result(Value value) override { ended.push_back(std::move(value)); }
-      void error(const Error&) override { ADD_FAILURE(); }
-      std::vector<Value>& ended;
-    };
-    holdServerQueue();
-    session->setTransactionCompleteBlock(BoolReply(std::make_shared<Counter>(ended)));
-  }
-  /// The ids of the messages in the history.
-  [[nodiscard]] std::vector<std::string> history() const {
-    std::vector<std::string> ids;
-    session->aggregatedPayloadData()->forEach([&](const PayloadHistory::Entry& entry) {
-      if (const auto* message = std::get_if<SentMessage>(&entry)) ids.push_back(message->messageID);
-    });
-    return ids;
-  }
-  [[nodiscard]] std::vector<std::string> errors() const { return simulation.log.texts("error"); }
-  /// What reached the agent inside its one session.
-  [[nodiscard]] const std::vector<SimulatedAgent::Message>& delivered() const {
-    return simulation.agent.sessions.at(0).messages;
-  }
-
-  Simulation simulation;
-  std::shared_ptr<ZQReportingSession> session = ZQReportingSession::initWithID(7, {42});
-  std::vector<std::optional<Error>> sent;  // the replies to `send`
-  std::vector<Value> ended;
-};
 
 std::string Line(const char* level, const char* function, const char* message) {
   return std::string(level) + " zqrr " + function + ": " + message;
@@ -79,7 +23,7 @@ const char* const kWait = "ZQReportingUtilityWait";
 
 TEST(Session, StartSetsUpAnAgentSessionWithWhatIsConfiguredByThen) {
   for (const auto seed : Seeds()) {
-    Owner owner(seed, kServiceTypeTelephony);
+    SessionOwner owner(seed, kServiceTypeTelephony);
     owner.session->setConfiguration(Dictionary{{"app", "Phone"}, {"version", 1}});
     owner.session->setConfiguration(Dictionary{{"version", 2}});
     owner.session->updateDefaults(std::nullopt);
@@ -130,7 +74,7 @@ TEST(Session, MessagesWaitForTheBackendsUpToNineSeconds) {
   for (const Case& each : kCases) {
     for (const auto seed : Seeds()) {
       SCOPED_TRACE(each.name);
-      Owner owner(seed);
+      SessionOwner owner(seed);
       SimulatedAgent& agent = owner.simulation.agent;
       agent.answers = each.answersAfter.has_value();
       agent.answersAfter = each.answersAfter.value_or(0s);
@@ -154,7 +98,7 @@ TEST(Session, MessagesWaitForTheBackendsUpToNineSeconds) {
 
 TEST(Session, StopFlushesBehindWhatWasSentAndAnswersTheStartAtOnce) {
   for (const auto seed : Seeds()) {
-    Owner owner(seed);
+    SessionOwner owner(seed);
     owner.simulation.agent.answersAfter = 5s;
     owner.start();
     owner.awaitEnd();
@@ -188,7 +132,7 @@ TEST(Session, StartsAndStopsRepeat) {
   const Lines stopping = {"trace 0x21042830",
                           log("default", kStop, "sending summary event for reporter 7")};
   for (const auto seed : Seeds()) {
-    Owner owner(seed);
+    SessionOwner owner(seed);
     owner.simulation.log.verbose = {"zqrr"};
     owner.awaitEnd();
     owner.stop();
@@ -224,7 +168,7 @@ TEST(Session, StartsAndStopsRepeat) {
 
 TEST(Session, OfTypeTestNeverTouchesTheAgent) {
   for (const auto seed : Seeds()) {
-    Owner owner(seed, kServiceTypeTest);
+    SessionOwner owner(seed, kServiceTypeTest);
     owner.start();
     owner.awaitEnd();
     owner.send();
@@ -242,7 +186,7 @@ TEST(Session, OfTypeTestNeverTouchesTheAgent) {
 
 TEST(Session, AnnouncesItsLifeAndKeepsItsQueuedWorkWhenItIsDropped) {
   for (const auto seed : Seeds()) {
-    Owner owner(seed);
+    SessionOwner owner(seed);
     owner.start();
     owner.send();
     owner.session.reset();
@@ -263,7 +207,7 @@ TEST(Session, AnnouncesItsLifeAndKeepsItsQueuedWorkWhenItIsDropped) {
 
 TEST(Session, LogsAFailedFlushAndKeepsQuietAboutAFailedSend) {
   for (const auto seed : Seeds()) {
-    Owner owner(seed);
+    SessionOwner owner(seed);
     owner.simulation.agent.sendError = Error::because("agent", 3, "full");
     owner.simulation.agent.flushError = Error::because("agent", 4, "gone");
     owner.simulation.log.verbose = {"zqrr"};
@@ -284,7 +228,7 @@ TEST(Session, LogsAFailedFlushAndKeepsQuietAboutAFailedSend) {
 
 TEST(Delivery, RewritesBlanksInItsOwnKeysOnly) {
   for (const auto seed : Seeds()) {
-    Owner owner(seed);
+    SessionOwner owner(seed);
     owner.start();
     owner.send({{"two words", "two words"},
                 {7, 1},
@@ -303,7 +247,7 @@ TEST(Delivery, RewritesBlanksInItsOwnKeysOnly) {
 
 TEST(Delivery, CountsEachKindForItselfAndKeepsOrder) {
   for (const auto seed : Seeds()) {
-    Owner owner(seed);
+    SessionOwner owner(seed);
     owner.start();
     owner.send({{"n", 1}}, 0x10000003, 1);
     owner.send({{"n", 2}}, 0x10000003, 2, true);
@@ -327,7 +271,7 @@ TEST(Delivery, CountsEachKindForItselfAndKeepsOrder) {
 
 TEST(Delivery, VerboseLinesFollowAMessage) {
   for (const auto seed : Seeds()) {
-    Owner owner(seed);
+    SessionOwner owner(seed);
     owner.simulation.log.verbose = {"zqrr"};
     owner.start();
     owner.simulation.run();
@@ -358,7 +302,7 @@ TEST(Delivery, VerboseLinesFollowAMessage) {
 
 TEST(SingleMessage, CarriesItsServiceTypeAndNothingOfTheUserInformation) {
   for (const auto seed : Seeds()) {
-    Owner owner(seed, kServiceTypeTelephony);
+    SessionOwner owner(seed, kServiceTypeTelephony);
     owner.session->setConfiguration(Dictionary{{"app", "Phone"}});
     owner.send({{"a key", 1}}, 0x10000003);
     owner.simulation.run();
@@ -416,6 +360,41 @@ TEST(SingleMessage, IsAnsweredWithTheAgentsError) {
                                          "sendOneMessageWithSessionInfo agent 3: full")}
                       : std::vector<std::string>());
     }
+  }
+}
+
+TEST(Summary, JoinsEveryKeysTextsAndLeavesTheUserInformationInFront) {
+  SessionOwner owner(1, kServiceTypeLongFormAudio);
+  owner.session->setConfiguration(Dictionary{{"app", "Music"}, {"n", 1.5}});
+  owner.holdServerQueue();
+  EXPECT_EQ(owner.session->createSummaryEventForSession(), std::nullopt);
+  owner.send({{"a b", List{1, "x"}}});
+  owner.send({{"a", true}});
+  Dictionary summary = {{"ZQ_Session_Summary_Event", "7"},
+                        {"Playback_Start_1", "{\"a_b\":[1,\"x\"]}"},
+                        {"Playback_Start_2", "{\"a\":true}"}};
+  EXPECT_EQ(owner.session->createSummaryEventForSession(), summary);
+  summary.merge({{"app", "Music"}, {"n", "1.5"}});
+  EXPECT_EQ(owner.session->createSummaryEventForSession(), summary);
+  summary.merge({{"app", "Music,Music"}, {"n", "1.5,1.5"}});
+  EXPECT_EQ(owner.session->createSummaryEventForSession(), summary);
+  EXPECT_THAT(owner.simulation.files.files, IsEmpty());
+}
+
+TEST(Summary, IsTheLastMessageOfARunThatSentAny) {
+  for (const auto seed : Seeds()) {
+    SessionOwner owner(seed);
+    owner.start();
+    owner.stop();
+    owner.start();
+    owner.send();
+    owner.stop();
+    owner.simulation.run();
+    EXPECT_THAT(owner.simulation.agent.sessions.at(0).messages, IsEmpty());
+    const auto& messages = owner.simulation.agent.sessions.at(1).messages;
+    ASSERT_EQ(messages.size(), 2U);
+    EXPECT_EQ(messages[1].payload.root().toDictionary(),
+              (Dictionary{{"ZQ_Session_Summary_Event", "0"}, {"Playback_Start_1", "{\"a\":1}"}}));
   }
 }
 

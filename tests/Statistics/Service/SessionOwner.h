@@ -1,0 +1,70 @@
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "Statistics/Service/ZQReportingSession.h"
+#include "tests/platform/Simulation.h"
+
+namespace quarvel {
+
+/// A session whose owner is the test: it alone runs while the simulation does not, and so stands in
+/// for the `ServerQueue`.
+struct SessionOwner {
+  explicit SessionOwner(std::uint64_t seed, std::uint16_t serviceType = 0) : simulation(seed) {
+    holdServerQueue();
+    session->setServiceType(serviceType);
+    simulation.log.lines.clear();
+    simulation.journal.clear();
+  }
+  static void holdServerQueue() QUARVEL_ASSERT_CAPABILITY(serverQueueRole) {}
+
+  void start() {
+    holdServerQueue();
+    session->start();
+  }
+  void stop() {
+    holdServerQueue();
+    session->stop();
+  }
+  void send(const Dictionary& payload = {{"a", 1}}, std::uint32_t category = 3,
+            std::uint16_t type = 1, bool sync = false) {
+    holdServerQueue();
+    session->sendMessage(Payload(payload), category, type, sync,
+                         [this](const std::optional<Error>& error) { sent.push_back(error); });
+  }
+  /// A start reply that counts in `ended`.
+  void awaitEnd() {
+    struct Counter : ReplySink {
+      explicit Counter(std::vector<Value>& counted) : ended(counted) {}
+      void result(Value value) override { ended.push_back(std::move(value)); }
+      void error(const Error&) override { ADD_FAILURE(); }
+      std::vector<Value>& ended;
+    };
+    holdServerQueue();
+    session->setTransactionCompleteBlock(BoolReply(std::make_shared<Counter>(ended)));
+  }
+  /// The ids of the messages in the history.
+  [[nodiscard]] std::vector<std::string> history() const {
+    std::vector<std::string> ids;
+    session->aggregatedPayloadData()->forEach([&](const PayloadHistory::Entry& entry) {
+      if (const auto* message = std::get_if<SentMessage>(&entry)) ids.push_back(message->messageID);
+    });
+    return ids;
+  }
+  [[nodiscard]] std::vector<std::string> errors() const { return simulation.log.texts("error"); }
+  /// What reached the agent inside its one session.
+  [[nodiscard]] const std::vector<SimulatedAgent::Message>& delivered() const {
+    return simulation.agent.sessions.at(0).messages;
+  }
+
+  Simulation simulation;
+  std::shared_ptr<ZQReportingSession> session = ZQReportingSession::initWithID(7, {42});
+  std::vector<std::optional<Error>> sent;  // the replies to `send`
+  std::vector<Value> ended;
+};
+
+}  // namespace quarvel
