@@ -122,7 +122,7 @@ class Sessions(ServiceTest):
                           "sendMessage:withCategory:andType:forReportingIDs:reply:",
                           "startReportingSessionForID:reply:", "stopReportingSessionForID:reply:",
                           "reporterID:valid:"])
-        self.assertEqual(service.count("message WHERE session_id = 9"), 2)
+        service.wait_for_rows(2, "message WHERE session_id = 9")
         wrong = service.ctl("run", "-", input=script.replace("65535", "7"))
         self.assertEqual(wrong.returncode, 1)
 

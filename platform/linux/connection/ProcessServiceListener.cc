@@ -64,6 +64,8 @@ std::unique_ptr<SocketListener> OpenListenerOrExit() {
     ZQ_LOG(nullptr, error, "the service cannot start: {}", listener.error().description());
     ExitProcess(1);
   }
+  // With the socket ours, so that a second service never touches the store of one that runs.
+  static_cast<void>(ProcessTelemetryStore());
   FollowVerbosePreferences();
   return std::move(listener.value());
 }
