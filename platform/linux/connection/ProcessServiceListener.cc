@@ -64,6 +64,9 @@ std::unique_ptr<SocketListener> OpenListenerOrExit() {
     ZQ_LOG(nullptr, error, "the service cannot start: {}", listener.error().description());
     ExitProcess(1);
   }
+  // After the socket: of two services that start at once, the one that may not listen has not
+  // touched the other's store.
+  static_cast<void>(ProcessTelemetryStore());
   FollowVerbosePreferences();
   return std::move(listener.value());
 }
