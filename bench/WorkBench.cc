@@ -12,6 +12,7 @@ namespace {
 class Counted final : public Voucher {
  public:
   [[nodiscard]] std::size_t bytes() const override { return 280; }
+  void carriedOut() override {}
   void completed() override {}
 };
 
@@ -27,7 +28,7 @@ void AsyncToSerialQueue(benchmark::State& state) {
     for (std::int64_t i = 0; i < kBlocks; ++i) {
       VoucherHold hold;
       if (state.range(0) != 0) hold = VoucherHold(std::make_shared<Counted>());
-      const VoucherScope scope(hold);
+      const VoucherScope scope(VoucherScope::Of::call, hold);
       for (std::int64_t pause = 0; pause < state.range(1); ++pause) benchmark::DoNotOptimize(pause);
       queue->async([&run] { ++run; });
     }

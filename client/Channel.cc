@@ -10,6 +10,7 @@
 #include <cerrno>
 #include <csignal>
 #include <cstring>
+#include <system_error>
 #include <type_traits>
 #include <utility>
 
@@ -79,25 +80,36 @@ Overloaded(Cases...) -> Overloaded<Cases...>;
 
 }  // namespace
 
-std::shared_ptr<Client::Channel> Client::Channel::serve(int socket) {
-  auto channel = std::make_shared<Channel>(socket);
-  // The program's signals are not for this thread.
+Result<std::shared_ptr<Client::Channel>> Client::Channel::serve(int socket) {
+  const auto refused = [](const char* what, int error) {
+    return Failure(Code::unreachable, std::string("This process may have no further ") + what +
+                                          ": " + std::strerror(error) + ".");
+  };
+  const auto channel = std::make_shared<Channel>(socket, ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+  if (channel->wake_ < 0) return refused("descriptor", errno);
+  // The program's signals are not for the reader thread.
   sigset_t all;
   sigset_t before;
   sigfillset(&all);
   pthread_sigmask(SIG_SETMASK, &all, &before);
-  channel->reader_ = std::thread([channel] { channel->read(); });
+  int error = 0;
+  try {
+    channel->reader_ = std::thread([channel] { channel->read(); });
+  } catch (const std::system_error& failure) {
+    error = failure.code().value();
+  }
   pthread_sigmask(SIG_SETMASK, &before, nullptr);
+  if (error != 0) return refused("thread", error);
   pthread_setname_np(channel->reader_.native_handle(), "quarvel.client");
   return channel;
 }
 
-Client::Channel::Channel(int socket)
-    : socket_(socket), wake_(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)), received_(kReadBytes) {}
+Client::Channel::Channel(int socket, int wake)
+    : socket_(socket), wake_(wake), received_(kReadBytes) {}
 
 Client::Channel::~Channel() {
   ::close(socket_);
-  ::close(wake_);
+  if (wake_ >= 0) ::close(wake_);
 }
 
 bool Client::Channel::connected() const {
@@ -112,6 +124,7 @@ bool Client::Channel::onReaderThread() const {
 void Client::Channel::close() {
   {
     MutexLock lock(mutex_);
+    if (!writing_ && !onReaderThread()) write(true);
     closing_ = true;
     changed_.notifyAll();
   }

@@ -28,9 +28,10 @@ class __attribute__((visibility("hidden"))) Client::Channel
       std::variant<std::monostate, Reply<bool>, Reply<ServiceType>, Reply<std::monostate>,
                    Reply<Validity>, Reply<std::vector<ReporterID>>, Reply<Value>>;
 
-  /// Takes a connected socket, and the thread that reads it begins.
-  [[nodiscard]] static std::shared_ptr<Channel> serve(int socket);
-  explicit Channel(int socket);
+  /// Takes a connected socket, and the thread that reads it begins. Errors: `Code::unreachable`,
+  /// when the process may have no further descriptor or thread.
+  [[nodiscard]] static Result<std::shared_ptr<Channel>> serve(int socket);
+  Channel(int socket, int wake);
   ~Channel();
 
   /// Sends one call; `encode` writes its arguments, `count` of them, and must not call back.
@@ -49,8 +50,8 @@ class __attribute__((visibility("hidden"))) Client::Channel
 
   [[nodiscard]] bool connected() const QUARVEL_EXCLUDES(mutex_);
   [[nodiscard]] bool onReaderThread() const;
-  /// Closes the connection and waits until every pending call is answered; called by the reader
-  /// thread itself it does not wait.
+  /// Sends what has gathered, closes the connection and waits until every pending call is answered;
+  /// called by the reader thread itself it does not wait.
   void close() QUARVEL_EXCLUDES(mutex_);
 
  private:

@@ -114,7 +114,9 @@ Result<Client> Client::connect(std::string_view socketPath) {
     return Failure(Code::unreachable, WhyUnreachable(path, error));
   }
   ::fcntl(socket, F_SETFL, ::fcntl(socket, F_GETFL) | O_NONBLOCK);
-  return Client(Channel::serve(socket));
+  auto channel = Channel::serve(socket);
+  if (!channel) return std::move(channel.error());
+  return Client(std::move(channel.value()));
 }
 
 }  // namespace quarvel

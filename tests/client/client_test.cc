@@ -325,12 +325,13 @@ TEST_F(ClientTest, CallsOfSeveralThreadsStayWholeAndInTheirOrder) {
   for (std::thread& thread : threads) thread.join();
 }
 
-TEST(ClientLifetimeTest, EndingAClientAnswersItsCallsBeforeItIsGone) {
+TEST(ClientLifetimeTest, EndingAClientSendsWhatGatheredAndAnswersItsCallsBeforeItIsGone) {
   FakeService service;
   int lost = 0;
   {
     auto client = Client::connect(service.path());
     service.accept();
+    const Client::Batch batch(client.value());
     for (int i = 0; i < 3; ++i) {
       client.value().createReportingSession(i, [&lost](const auto& reply) { lost += !reply.ok(); });
     }
@@ -338,6 +339,7 @@ TEST(ClientLifetimeTest, EndingAClientAnswersItsCallsBeforeItIsGone) {
     EXPECT_EQ(lost, 0);
   }
   EXPECT_EQ(lost, 3);
+  for (int i = 0; i < 3; ++i) EXPECT_TRUE(service.receive());
 }
 
 TEST(ClientLifetimeTest, AReplyMayEndItsClient) {

@@ -10,22 +10,8 @@
 #include <vector>
 
 #include "Statistics/Service/ZQReportingBlockThrottle.h"
-#include "platform/Clock.h"
-#include "platform/DeviceProperties.h"
 
 namespace quarvel {
-
-// What else of the platform the throttle's folder refers to.
-LogHandle ZQLogRegister(std::uint32_t, std::string_view, std::string_view, std::string_view, int,
-                        int) {
-  return nullptr;
-}
-Date CurrentDate() {
-  return Date{};
-}
-std::optional<bool> DevicePropertyBoolean(std::string_view) {
-  return std::nullopt;
-}
 
 namespace {
 

@@ -79,8 +79,9 @@ class Recipients {
 /// its reply is answered with `Code::connectionLost`, and so is every later one; connecting again
 /// is the caller's to decide.
 ///
-/// Lifetime: destroying the client closes the connection, which stops its sessions, and answers
-/// every call that still waits with `Code::connectionLost`; after that no reply is given.
+/// Lifetime: destroying the client sends what has gathered, closes the connection, which stops its
+/// sessions, and answers every call that still waits with `Code::connectionLost`; after that no
+/// reply is given. A reply may destroy its client; then the rest is answered when it has returned.
 class Client {
   class Channel;
 
