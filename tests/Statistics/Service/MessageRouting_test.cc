@@ -37,6 +37,7 @@ TEST(Routing, ByIdentifiersTheSinksComeFirstOnceAnOccurrence) {
     Client owner = service.connect(41);
     Client sender = service.connect(42);
     owner.createStarted(7);
+    sender.create(0);  // may be made, but 0 names nobody
     service.run();
     service.simulation.journal.clear();
     const auto sent = sender.send(kWithEngineTime, 3, 1, List{0, 7, 99, 7});

@@ -210,6 +210,12 @@ TEST(ServerInstance, AStopReportsWhatTheDriversCountedSinceTheStart) {
                 Contains("default zqrs " + kInstance +
                          "stopReportingSessionForID:reply:]: fetching driver logs "
                          "{\"Haptics_Stats_X\":3}"));
+    // The snapshot went with the first stop; without one the counters themselves are reported.
+    client.stop(7);
+    service.run();
+    ASSERT_EQ(service.simulation.agent.singleMessages.size(), 1U);
+    EXPECT_EQ(service.simulation.agent.singleMessages[0].message.payload.root().toDictionary(),
+              (Dictionary{{"Haptics_Stats_X", 8}, {"Speaker_Y", 5}}));
   }
 }
 
