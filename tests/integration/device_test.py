@@ -97,35 +97,31 @@ class Preferences(ServiceTest):
 
 class InternalBuild(ServiceTest):
     def test_the_history_is_written_with_its_orientations(self):
-        service = self.service('[device]\nInternalBuild = true\n[orientation]\nsource = "files"\n')
+        service = self.prepared('[device]\nInternalBuild = true\n[orientation]\nsource = "files"\n')
+        service.prefer(reporting_session_verbose=True)
+        service.start()
+        self.addCleanup(service.finish)
         client = self.client(service)
         client.start_session(1, 7, {"HostApplicationDisplayID": "../../Music"})
         client.message({"volume level": 0.5}, [1], 11, 3)
-        (service.directory / "run/device-orientation").write_text("landscapeLeft\n")
-        (service.directory / "run/ui-orientation").write_text("portrait\n")
-
-        def summary():
-            client.stop_session(1)
-            row = service.wait_for_rows(1, "message WHERE category = 65535 ORDER BY id DESC")[0]
-            keys = json.loads(row["payload"])
-            if "device_orientation" in keys and "ui_orientation" in keys:
-                return keys
-            client.start_session(1)
-            client.message({}, [1])
-            for name in ("device", "ui"):
-                file = service.directory / f"run/{name}-orientation"
-                file.write_text("faceUp\n" if "portrait" in file.read_text() else "portrait\n")
-            return None
-
-        keys = eventually(summary, "orientations in a summary")
-        self.assertEqual(keys["ZQ_Session_Summary_Event"], "7")
-        self.assertGreaterEqual(float(keys["device_orientation_time"].split(",")[0]), 0)
-        files = sorted((service.directory / HISTORY).iterdir())
-        self.assertRegex(files[0].name, r"^\d{8}-\d{6}[+-]\d{4}-quarvel-\.\._\.\._Music-longformaudio\.json$")
+        for mode in ("device", "ui"):
+            (service.directory / f"run/{mode}-orientation").write_text("landscapeLeft\n")
+            eventually(lambda: f'callback mode={mode} orientation="landscapeLeft" app="../../Music"'
+                       in service.log(), f"the {mode} handler is called")
+        client.stop_session(1)
+        row = service.wait_for_rows(1, "message WHERE category = 65535")[0]
+        summary = json.loads(row["payload"])
+        self.assertEqual((summary["ZQ_Session_Summary_Event"], summary["device_orientation"],
+                          summary["ui_orientation"]), ("7", "landscapeLeft", "landscapeLeft"))
+        self.assertGreaterEqual(float(summary["device_orientation_time"]), 0)
+        file, = (service.directory / HISTORY).iterdir()
+        self.assertRegex(file.name, r"^\d{8}-\d{6}[+-]\d{4}-quarvel-\.\._\.\._Music-longformaudio\.json$")
         self.assertEqual((service.directory / HISTORY).stat().st_mode & 0o777, 0o777)
-        history = json.loads(files[-1].read_text())
+        history = json.loads(file.read_text())
         self.assertEqual(history[0]["HostApplicationDisplayID"], "../../Music")
-        self.assertTrue(any("device_orientation" in entry for entry in history))
+        self.assertEqual(history[1], {"Volume_Setup_1": {"volume_level": 0.5}})
+        self.assertEqual([next(iter(entry)) for entry in history[2:]],
+                         ["device_orientation", "ui_orientation"])
 
     def test_without_a_bus_there_is_no_orientation_and_no_harm(self):
         service = self.prepared('[device]\nInternalBuild = true\n[orientation]\nsource = "iio"\n')
