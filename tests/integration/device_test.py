@@ -53,6 +53,7 @@ class Preferences(ServiceTest):
         service = self.service()
         client = self.client(service)
         client.start_session(1)
+        service.wait_for_rows(1, "agent_session")
 
         def refused():
             try:
