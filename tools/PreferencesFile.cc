@@ -9,7 +9,6 @@
 #include <cerrno>
 #include <cstdlib>
 #include <fstream>
-#include <iterator>
 #include <sstream>
 #include <utility>
 
@@ -108,7 +107,7 @@ Outcome WriteAll(int descriptor, std::string_view text) {
   return Success();
 }
 
-/// Mode and owner stay; a new file is for all to read.
+/// Its mode stays, and for root its owner; a new file is for all to read.
 Outcome WriteWhole(path file, std::string_view text) {
   std::error_code error;
   // The file that a link stands for, not the link.
@@ -121,9 +120,14 @@ Outcome WriteWhole(path file, std::string_view text) {
   if (descriptor < 0) return CannotBe(file, "written", errno);
   struct stat old {};
   const bool replaces = ::stat(file.c_str(), &old) == 0;
-  // Only root may give a file away, and who is not root owns it now.
-  if (replaces && ::fchown(descriptor, old.st_uid, old.st_gid) != 0) errno = 0;
-  const bool written = ::fchmod(descriptor, replaces ? old.st_mode & 07777 : 0644) == 0 &&
+  // Only root may give a file away; anybody else's becomes their own.
+  if (replaces && ::geteuid() == 0 && ::fchown(descriptor, old.st_uid, old.st_gid) != 0) {
+    const int refused = errno;
+    ::close(descriptor);
+    ::unlink(temporary.c_str());
+    return CannotBe(file, "written", refused);
+  }
+  const bool written = ::fchmod(descriptor, replaces ? old.st_mode & 0777 : 0644) == 0 &&
                        WriteAll(descriptor, text) && ::fsync(descriptor) == 0;
   const int fault = written ? 0 : errno;
   ::close(descriptor);
@@ -156,11 +160,14 @@ std::filesystem::path PreferencesFile::pathOf(std::string_view domain) {
 
 Result<PreferencesFile> PreferencesFile::open(std::filesystem::path path) {
   std::string text;
+  errno = 0;
   std::ifstream in(path, std::ios::binary);
-  const int fault = errno;
-  if (!in && fault != ENOENT) return CannotBe(path, "read", fault);
-  text.assign(std::istreambuf_iterator<char>(in), {});
-  if (in.bad()) return CannotBe(path, "read", EIO);
+  if (!in && errno != ENOENT) return CannotBe(path, "read", errno);
+  char piece[4'096];
+  while (in.read(piece, sizeof piece), in.gcount() > 0) {
+    text.append(piece, static_cast<std::size_t>(in.gcount()));
+  }
+  if (in.bad()) return CannotBe(path, "read", errno);
   auto table = Parsed(text, path);
   if (!table) return std::move(table.error());
   return PreferencesFile(std::move(path), std::move(text), EntriesOf(table.value()));

@@ -149,11 +149,10 @@ void PrintJson(const Run& run) {
   }
   List orientation;
   for (const OrientationChange& change : run.orientation) {
-    orientation.push_back(Dictionary{
-        {"kind", change.kind},
-        {"orientation", change.orientation},
-        {"seconds",
-         ValueFromJson(change.seconds).ok() ? ValueFromJson(change.seconds).value() : Value()}});
+    const auto seconds = ValueFromJson(change.seconds);
+    orientation.push_back(Dictionary{{"kind", change.kind},
+                                     {"orientation", change.orientation},
+                                     {"seconds", seconds ? seconds.value() : Value()}});
   }
   Dictionary summary{{"id", session.id},
                      {"session", session.reporterID},

@@ -289,6 +289,9 @@ class PreferencesTest(ToolTest):
                     status, lines, error = self.ctl("defaults", *arguments)
                     self.assertEqual((status, lines, self.file.read_text()), (1, [], content))
                     self.assertIn(f"{self.file}:2: ", error)
+        self.file.unlink()
+        self.file.mkdir()
+        self.assertIn(f"{self.file} cannot be read", self.ctl("defaults", "write", "key", "1")[2])
 
     def test_notifications(self):
         status, _, error = self.ctl("notify")
