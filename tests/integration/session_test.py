@@ -83,24 +83,6 @@ class Sessions(ServiceTest):
         self.assertGreaterEqual(seconds_between(begun[0], ended[0]), 9)
         self.assertLess(seconds_between(begun[-1], ended[-1]), 20, "side by side, not one by one")
 
-    def test_an_idle_service_never_wakes_up(self):
-        service = self.service()
-        clients = [self.client(service) for _ in range(100)]
-        for number, client in enumerate(clients):
-            client.start_session(number + 1)
-
-        def switches():
-            tasks = pathlib.Path(f"/proc/{service.process.pid}/task").iterdir()
-            lines = [line for task in tasks for line in (task / "status").read_text().splitlines()]
-            return sum(int(line.split()[1]) for line in lines if line.startswith("voluntary"))
-
-        def stays_asleep():
-            before = switches()
-            time.sleep(2)
-            return switches() == before
-
-        eventually(stays_asleep, "two seconds without a wake-up")
-
     def test_the_same_in_another_language_and_from_a_script(self):
         service = self.service()
         example = subprocess.run(
@@ -125,6 +107,26 @@ class Sessions(ServiceTest):
         service.wait_for_rows(2, "message WHERE session_id = 9")
         wrong = service.ctl("run", "-", input=script.replace("65535", "7"))
         self.assertEqual(wrong.returncode, 1)
+
+
+class Idle(ServiceTest):
+    def test_an_idle_service_never_wakes_up(self):
+        service = self.service()
+        clients = [self.client(service) for _ in range(100)]
+        for number, client in enumerate(clients):
+            client.start_session(number + 1)
+
+        def switches():
+            tasks = pathlib.Path(f"/proc/{service.process.pid}/task").iterdir()
+            lines = [line for task in tasks for line in (task / "status").read_text().splitlines()]
+            return sum(int(line.split()[1]) for line in lines if line.startswith("voluntary"))
+
+        def stays_asleep():
+            before = switches()
+            time.sleep(2)
+            return switches() == before
+
+        eventually(stays_asleep, "two seconds without a wake-up")
 
 
 class Hostility(ServiceTest):
