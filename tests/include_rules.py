@@ -20,7 +20,7 @@ RULES = [
     ("Statistics/", [r"base/\w+\.h", r"platform/\w+\.h", r"Statistics/.*"], [STANDARD, FMT]),
     ("client/", [r"base/\w+\.h", r"client/.*"], [STANDARD, SYSTEM, FMT, r"quarvel/.*"]),
     ("tools/", [r"base/\w+\.h", r"tools/.*"],
-     [STANDARD, SYSTEM, FMT, r"quarvel/.*", r"CLI/CLI\.hpp", r"sqlite3\.h"]),
+     [STANDARD, SYSTEM, FMT, r"quarvel/.*", r"CLI/CLI\.hpp", r"sqlite3\.h", r"toml\+\+/toml\.h"]),
     ("tests/", [ANYTHING], [ANYTHING]),
     ("bench/", [ANYTHING], [ANYTHING]),
 ]
@@ -72,6 +72,7 @@ ALLOWED = [
     ("Statistics/Service/main.cc", '"platform/ServiceListener.h"'),
     ("client/Channel.cc", "<sys/socket.h>"),
     ("tools/Store.cc", "<sqlite3.h>"),
+    ("tools/PreferencesFile.cc", "<toml++/toml.h>"),
     ("tests/platform/Scheduler.cc", '"platform/linux/work/Work.h"'),
 ]
 FORBIDDEN = [
@@ -87,6 +88,7 @@ FORBIDDEN = [
     ("client/Client.cc", '"platform/Clock.h"'),
     ("client/Client.cc", '"Statistics/ZQReportingUtility.h"'),
     ("client/Client.cc", "<CLI/CLI.hpp>"),
+    ("client/Client.cc", "<toml++/toml.h>"),
     ("tools/Store.cc", '"platform/linux/store/Store.h"'),
     ("tools/quarvelctl.cc", "<asio.hpp>"),
     ("elsewhere/File.cc", "<vector>"),

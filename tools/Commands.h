@@ -22,6 +22,22 @@ struct MessageOptions {
   bool follow = false;
 };
 
+struct EventOptions {
+  bool power = false;  // the power events instead of the analytics events
+  std::optional<std::int64_t> last;
+  bool follow = false;
+};
+
+struct DefaultsOptions {
+  std::string domain = "tarnwick.quarvel";
+  std::string key;  // of `DefaultsRead`: empty for all
+  std::string value;
+  bool string = false;  // the value is a string, whatever it looks like
+  bool notify = false;  // have the service read the change
+};
+
+inline constexpr const char* kReportingNotification = "tarnwick.quarvel.reporting";
+
 /// Plays a script; "-" is standard input, each line of which is played as it comes. A file is read
 /// whole first, so that nothing is played of one that has a fault.
 [[nodiscard]] Outcome Run(const Options& options, const std::string& file);
@@ -33,5 +49,16 @@ struct MessageOptions {
 
 [[nodiscard]] Outcome Sessions(const Options& options);
 [[nodiscard]] Outcome Messages(const Options& options, const MessageOptions& which);
+[[nodiscard]] Outcome Events(const Options& options, const EventOptions& which);
+/// What the latest run of this session was. Fails when the store has none.
+[[nodiscard]] Outcome Summary(const Options& options, std::int64_t reporterID);
+
+/// The preferences, as the service will read them. Reading or deleting a key that has no value
+/// fails.
+[[nodiscard]] Outcome DefaultsRead(const Options& options, const DefaultsOptions& which);
+[[nodiscard]] Outcome DefaultsWrite(const Options& options, const DefaultsOptions& which);
+[[nodiscard]] Outcome DefaultsDelete(const Options& options, const DefaultsOptions& which);
+/// Posts a notification. Fails when no service is there that takes one.
+[[nodiscard]] Outcome Notify(const Options& options, const std::string& name);
 
 }  // namespace quarvel::commands

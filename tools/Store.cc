@@ -39,6 +39,9 @@ class Statement {
   Statement& operator=(const Statement&) = delete;
 
   void bind(int index, std::int64_t number) { sqlite3_bind_int64(statement_, index, number); }
+  void bind(int index, const std::string& text) {
+    sqlite3_bind_text64(statement_, index, text.data(), text.size(), SQLITE_TRANSIENT, SQLITE_UTF8);
+  }
   [[nodiscard]] bool next() {
     if (status_ == SQLITE_OK || status_ == SQLITE_ROW) status_ = sqlite3_step(statement_);
     return status_ == SQLITE_ROW;
@@ -56,6 +59,7 @@ class Statement {
   [[nodiscard]] std::int64_t integer(int column) const {
     return sqlite3_column_int64(statement_, column);
   }
+  [[nodiscard]] double real(int column) const { return sqlite3_column_double(statement_, column); }
   [[nodiscard]] Date date(int column) const {
     return Date(std::chrono::microseconds(integer(column)));
   }
@@ -76,6 +80,12 @@ Result<std::int64_t> Number(sqlite3* database, std::string_view sql) {
   Statement statement(database, sql);
   if (statement.next()) return statement.integer(0);
   return statement.outcome().error();
+}
+
+// The rows of a table by their numbers, or only the last so many.
+std::string InOrder(std::string select, const std::optional<std::int64_t>& last) {
+  if (!last) return select + " ORDER BY id";
+  return fmt::format("SELECT * FROM ({} ORDER BY id DESC LIMIT {}) ORDER BY id", select, *last);
 }
 
 }  // namespace
@@ -146,13 +156,15 @@ Result<StoreReader> StoreReader::open(std::string path) {
 Outcome StoreReader::sessions(const std::function<void(StoredSession)>& each) {
   Statement rows(
       database_.get(),
-      "SELECT s.id, s.session_id, s.service_name, s.user_info, s.opened_at, s.flushed_at,"
+      "SELECT s.id, s.session_id, s.client_type, s.client_version, s.batch_event,"
+      " s.hierarchy_token, s.client_name, s.service_name, s.user_info, s.opened_at, s.flushed_at,"
       " ifnull(m.messages, 0) FROM agent_session s LEFT JOIN"
       " (SELECT agent_session, count(*) messages FROM message GROUP BY agent_session) m"
       " ON m.agent_session = s.id ORDER BY s.id");
   while (rows.next()) {
-    each({rows.integer(0), rows.integer(1), rows.text(2), rows.text(3), rows.date(4),
-          rows.isNull(5) ? std::nullopt : std::optional(rows.date(5)), rows.integer(6)});
+    each({rows.integer(0), rows.integer(1), rows.integer(2), rows.real(3), rows.integer(4) != 0,
+          rows.text(5), rows.text(6), rows.text(7), rows.text(8), rows.date(9),
+          rows.isNull(10) ? std::nullopt : std::optional(rows.date(10)), rows.integer(11)});
   }
   return rows.outcome();
 }
@@ -163,16 +175,34 @@ Outcome StoreReader::messages(const MessageQuery& query,
       "SELECT id, agent_session, session_id, service_name, category, type, payload, sent_at"
       " FROM message WHERE id > ?1";
   if (query.reporterID) sql += " AND session_id = ?2";
-  if (query.last) sql = "SELECT * FROM (" + sql + " ORDER BY id DESC LIMIT ?3)";
-  sql += " ORDER BY id";
-  Statement rows(database_.get(), sql);
+  if (query.agentSession) sql += " AND agent_session = ?3";
+  Statement rows(database_.get(), InOrder(std::move(sql), query.last));
   rows.bind(1, query.afterID);
   if (query.reporterID) rows.bind(2, *query.reporterID);
-  if (query.last) rows.bind(3, *query.last);
+  if (query.agentSession) rows.bind(3, *query.agentSession);
   while (rows.next()) {
     each({rows.integer(0), rows.isNull(1) ? std::nullopt : std::optional(rows.integer(1)),
           rows.integer(2), rows.text(3), static_cast<std::uint16_t>(rows.integer(4)),
           static_cast<std::uint16_t>(rows.integer(5)), rows.text(6), rows.date(7)});
+  }
+  return rows.outcome();
+}
+
+Outcome StoreReader::events(Events kind, const EventQuery& query,
+                            const std::function<void(StoredEvent)>& each) {
+  std::string sql = kind == Events::power
+                        ? "SELECT id, name, payload, recorded_at, domain FROM power_event"
+                        : "SELECT id, name, payload, recorded_at, NULL FROM analytics_event";
+  sql += " WHERE id > ?1";
+  if (query.since) sql += " AND recorded_at >= ?2";
+  if (query.name) sql += " AND name = ?3";
+  Statement rows(database_.get(), InOrder(std::move(sql), query.last));
+  rows.bind(1, query.afterID);
+  if (query.since) rows.bind(2, query.since->time_since_epoch().count());
+  if (query.name) rows.bind(3, *query.name);
+  while (rows.next()) {
+    each({rows.integer(0), rows.isNull(4) ? std::nullopt : std::optional(rows.integer(4)),
+          rows.text(1), rows.text(2), rows.date(3)});
   }
   return rows.outcome();
 }

@@ -19,6 +19,11 @@ namespace quarvel {
 struct StoredSession {
   std::int64_t id;
   std::int64_t reporterID;
+  std::int64_t clientType;
+  double clientVersion;
+  bool batchEvent;
+  std::string hierarchyToken;
+  std::string clientName;
   std::string serviceName;
   std::string userInfo;  // JSON
   Date openedAt;
@@ -38,6 +43,15 @@ struct StoredMessage {
   Date sentAt;
 };
 
+/// One analytics or power event in the store.
+struct StoredEvent {
+  std::int64_t id;
+  std::optional<std::int64_t> domain;  // a power event's
+  std::string name;
+  std::string payload;  // JSON
+  Date recordedAt;
+};
+
 /// The service's store, opened for reading only; it may be written meanwhile. For one thread.
 /// Errors: domain "quarvel.store", with a reason that says what to do.
 class StoreReader {
@@ -46,6 +60,16 @@ class StoreReader {
   struct MessageQuery {
     std::int64_t afterID = 0;
     std::optional<std::int64_t> reporterID;
+    std::optional<std::int64_t> agentSession;
+    std::optional<std::int64_t> last;
+  };
+  enum class Events { analytics, power };
+  /// Which events: after `afterID`, recorded at `since` or later, of one name, and only the last so
+  /// many of them.
+  struct EventQuery {
+    std::int64_t afterID = 0;
+    std::optional<Date> since;
+    std::optional<std::string> name;
     std::optional<std::int64_t> last;
   };
 
@@ -61,6 +85,9 @@ class StoreReader {
   /// In the order in which they were stored.
   [[nodiscard]] Outcome messages(const MessageQuery& query,
                                  const std::function<void(StoredMessage)>& each);
+  /// In the order in which they were stored.
+  [[nodiscard]] Outcome events(Events kind, const EventQuery& query,
+                               const std::function<void(StoredEvent)>& each);
 
  private:
   struct Close {

@@ -1,12 +1,12 @@
 #include <fmt/format.h>
 
 #include <cstdio>
-#include <ctime>
 
 #include <quarvel/vocabulary.hpp>
 
 #include "base/Json.h"
 #include "tools/Commands.h"
+#include "tools/Shown.h"
 #include "tools/Store.h"
 #include "tools/Table.h"
 
@@ -19,32 +19,6 @@ using vocabulary::NameOf;
 
 // Rows are printed in portions of this many, so that a store of any size is read in little memory.
 constexpr std::size_t kPortion = 1'000;
-
-// For people: local time; no year, since nothing is kept that long.
-std::string LocalTime(Date date) {
-  const auto seconds = std::chrono::floor<std::chrono::seconds>(date);
-  const std::time_t time = std::chrono::system_clock::to_time_t(seconds);
-  std::tm local{};
-  ::localtime_r(&time, &local);
-  char text[32];
-  std::strftime(text, sizeof text, "%m-%d %H:%M:%S", &local);
-  const auto milliseconds = std::chrono::floor<std::chrono::milliseconds>(date - seconds).count();
-  return fmt::format("{}.{:03}", text, milliseconds);
-}
-
-// For people, who see from the session's column what is in one.
-std::string Service(std::string_view name) {
-  constexpr std::string_view kSuffix = "_session";
-  if (name.ends_with(kSuffix)) name.remove_suffix(kSuffix.size());
-  return std::string(name);
-}
-
-std::string Application(const std::string& userInfo) {
-  const auto info = ValueFromJson(userInfo);
-  const Dictionary* entries = info ? info.value().dictionary() : nullptr;
-  const Value* application = entries ? entries->find("HostApplicationDisplayID") : nullptr;
-  return application && application->string() ? *application->string() : "";
-}
 
 template <class T>
 Value ValueOf(const std::optional<T>& stored) {
@@ -62,6 +36,11 @@ void PrintJson(const Dictionary& columns, std::string_view key, const std::strin
 void PrintJson(const StoredSession& session) {
   PrintJson({{"id", session.id},
              {"session", session.reporterID},
+             {"clientType", session.clientType},
+             {"clientVersion", session.clientVersion},
+             {"batchEvent", session.batchEvent},
+             {"hierarchyToken", session.hierarchyToken},
+             {"client", session.clientName},
              {"service", session.serviceName},
              {"openedAt", session.openedAt},
              {"flushedAt", ValueOf(session.flushedAt)},
@@ -82,28 +61,64 @@ void PrintJson(const StoredMessage& message) {
             "payload", message.payload);
 }
 
+void PrintJson(const StoredEvent& event) {
+  Dictionary columns{{"id", event.id}, {"name", event.name}, {"recordedAt", event.recordedAt}};
+  if (event.domain) columns.set("domain", *event.domain);
+  PrintJson(columns, "payload", event.payload);
+}
+
 std::vector<std::string> Row(const StoredSession& session) {
-  std::string duration = "not ended";
-  if (session.flushedAt) {
-    const std::chrono::duration<double> seconds = *session.flushedAt - session.openedAt;
-    duration = fmt::format("{:.3f} s", seconds.count());
-  }
-  return {fmt::format("{}", session.reporterID), Service(session.serviceName),
-          LocalTime(session.openedAt),           duration,
-          fmt::format("{}", session.messages),   Application(session.userInfo)};
+  return {fmt::format("{}", session.reporterID), ShownService(session.serviceName),
+          LocalTime(session.openedAt),           DurationOf(session),
+          fmt::format("{}", session.messages),   ApplicationOf(session.userInfo)};
 }
 
 std::vector<std::string> Row(const StoredMessage& message) {
   return {LocalTime(message.sentAt),
           message.agentSession ? fmt::format("{}", message.reporterID) : "single",
-          Service(message.serviceName),
+          ShownService(message.serviceName),
           NameOf(Category(message.category)),
           std::string(NameOf(static_cast<MessageType>(message.type))),
           message.payload};
 }
 
-std::string PathOf(const Options& options) {
-  return options.store.empty() ? StoreReader::defaultPath() : options.store;
+Table TableOf(StoreReader::Events kind) {
+  std::vector<Table::Column> columns{{"RECORDED"}, {"NAME"}, {"PAYLOAD"}};
+  if (kind == StoreReader::Events::power) columns.insert(columns.begin() + 1, {"DOMAIN", true});
+  return {std::move(columns), Terminal::standardOutput()};
+}
+
+std::vector<std::string> Row(const StoredEvent& event) {
+  std::vector<std::string> row{LocalTime(event.recordedAt), event.name, event.payload};
+  if (event.domain) row.insert(row.begin() + 1, fmt::format("{}", *event.domain));
+  return row;
+}
+
+/// Prints the rows that `read` gives, and when it is to follow those that come, which is for ever.
+/// `read(query, each)` is given a query that goes on after the last row it gave.
+template <class Query, class Read>
+Outcome PrintRows(const std::string& path, bool json, bool follow, Table table, Query query,
+                  const Read& read) {
+  const auto print = [&] {
+    std::size_t rows = 0;
+    auto outcome = read(query, [&](const auto& stored) {
+      query.afterID = stored.id;
+      if (json) return PrintJson(stored);
+      table.add(Row(stored));
+      if (++rows % kPortion == 0) table.print();
+    });
+    if (!json) table.print();
+    std::fflush(stdout);
+    return outcome;
+  };
+  if (!follow) return print();
+
+  StoreWatch watch(path);
+  for (;;) {
+    if (auto printed = print(); !printed) return printed;
+    query.last.reset();
+    watch.wait();
+  }
 }
 
 }  // namespace
@@ -133,29 +148,23 @@ Outcome Messages(const Options& options, const MessageOptions& which) {
   const std::string path = PathOf(options);
   auto store = StoreReader::open(path);
   if (!store) return std::move(store.error());
-  Table table({{"SENT"}, {"SESSION", true}, {"SERVICE"}, {"CATEGORY"}, {"TYPE"}, {"PAYLOAD"}},
-              Terminal::standardOutput());
-  StoreReader::MessageQuery query{0, which.session, which.last};
-  const auto print = [&] {
-    std::size_t rows = 0;
-    auto read = store.value().messages(query, [&](const StoredMessage& message) {
-      query.afterID = message.id;
-      if (options.json) return PrintJson(message);
-      table.add(Row(message));
-      if (++rows % kPortion == 0) table.print();
-    });
-    if (!options.json) table.print();
-    std::fflush(stdout);
-    return read;
-  };
-  if (!which.follow) return print();
+  return PrintRows(
+      path, options.json, which.follow,
+      Table({{"SENT"}, {"SESSION", true}, {"SERVICE"}, {"CATEGORY"}, {"TYPE"}, {"PAYLOAD"}},
+            Terminal::standardOutput()),
+      StoreReader::MessageQuery{0, which.session, std::nullopt, which.last},
+      [&](const auto& query, const auto& each) { return store.value().messages(query, each); });
+}
 
-  StoreWatch watch(path);
-  for (;;) {
-    if (auto read = print(); !read) return read;
-    query.last.reset();
-    watch.wait();
-  }
+Outcome Events(const Options& options, const EventOptions& which) {
+  const std::string path = PathOf(options);
+  auto store = StoreReader::open(path);
+  if (!store) return std::move(store.error());
+  const auto kind = which.power ? StoreReader::Events::power : StoreReader::Events::analytics;
+  return PrintRows(
+      path, options.json, which.follow, TableOf(kind),
+      StoreReader::EventQuery{0, std::nullopt, std::nullopt, which.last},
+      [&](const auto& query, const auto& each) { return store.value().events(kind, query, each); });
 }
 
 }  // namespace quarvel::commands

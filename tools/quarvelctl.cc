@@ -21,6 +21,13 @@ int Reported(const quarvel::Outcome& outcome) {
   return failed;
 }
 
+// For the names of files that lie in a directory of their own.
+std::string NotAName(const std::string& text) {
+  if (!text.empty() && text != "." && text != ".." && text.find('/') == std::string::npos)
+    return "";
+  return "\"" + text + "\" is no name: it may not be empty or have a \"/\" in it";
+}
+
 }  // namespace
 
 int main(int argumentCount, char** arguments) {
@@ -36,11 +43,15 @@ int main(int argumentCount, char** arguments) {
   app.add_option("--store", options.store, "the store, or the directory of its telemetry.db");
 
   std::function<quarvel::Outcome()> command;
-  const auto add = [&](const char* name, const char* description,
-                       std::function<quarvel::Outcome()> run) {
-    CLI::App* subcommand = app.add_subcommand(name, description);
+  const auto addTo = [&](CLI::App& parent, const char* name, const char* description,
+                         std::function<quarvel::Outcome()> run) {
+    CLI::App* subcommand = parent.add_subcommand(name, description);
     subcommand->callback([&command, run = std::move(run)] { command = run; });
     return subcommand;
+  };
+  const auto add = [&](const char* name, const char* description,
+                       std::function<quarvel::Outcome()> run) {
+    return addTo(app, name, description, std::move(run));
   };
 
   std::string file;
@@ -64,6 +75,49 @@ int main(int argumentCount, char** arguments) {
   messages->add_option("--last", which.last, "only so many, the last ones")
       ->check(CLI::PositiveNumber);
   messages->add_flag("--follow", which.follow, "go on with messages as they are stored");
+  EventOptions events;
+  EventOptions power{.power = true, .last = {}};
+  for (EventOptions* kind : {&events, &power}) {
+    CLI::App* subcommand = add(kind->power ? "power" : "events",
+                               kind->power ? "list the power events in the store"
+                                           : "list the analytics events in the store",
+                               [&options, kind] { return Events(options, *kind); });
+    subcommand->add_option("--last", kind->last, "only so many, the last ones")
+        ->check(CLI::PositiveNumber);
+    subcommand->add_flag("--follow", kind->follow, "go on with events as they are stored");
+  }
+  add("summary", "tell what the latest run of a session was",
+      [&] { return Summary(options, reporterID); })
+      ->add_option("ID", reporterID, "the reporter ID")
+      ->required();
+
+  DefaultsOptions entry;
+  CLI::App* defaults = app.add_subcommand("defaults", "read and change the service's preferences");
+  defaults->require_subcommand(1);
+  defaults->fallthrough();
+  defaults->add_option("--domain", entry.domain, "whose preferences")
+      ->capture_default_str()
+      ->check(NotAName);
+  addTo(*defaults, "read", "print one preference, or all that are set", [&] {
+    return DefaultsRead(options, entry);
+  })->add_option("KEY", entry.key, "which");
+  CLI::App* write =
+      addTo(*defaults, "write", "set a preference", [&] { return DefaultsWrite(options, entry); });
+  write->add_option("KEY", entry.key, "which")->required();
+  write->add_option("VALUE", entry.value, "true, false, a number or else a string")->required();
+  write->add_flag("--string", entry.string, "VALUE is a string, whatever it looks like");
+  CLI::App* erase = addTo(*defaults, "delete", "remove a preference",
+                          [&] { return DefaultsDelete(options, entry); });
+  erase->add_option("KEY", entry.key, "which")->required();
+  for (CLI::App* change : {write, erase}) {
+    change->add_flag("--notify", entry.notify, "make the service read the change at once");
+  }
+  std::string notification = kReportingNotification;
+  add("notify", "post a notification; without a name, the service reads its preferences again",
+      [&] { return Notify(options, notification); })
+      ->add_option("NAME", notification, "which")
+      ->capture_default_str()
+      ->check(NotAName);
 
   try {
     app.parse(argumentCount, arguments);

@@ -9,6 +9,7 @@ import sqlite3
 import subprocess
 import sys
 import tempfile
+import tomllib
 import unittest
 
 from fake_service import FakeService, KILL, REPORTERS, START, STOP, VALID
@@ -23,6 +24,10 @@ CREATE TABLE agent_session(id INTEGER PRIMARY KEY, session_id INTEGER NOT NULL,
 CREATE TABLE message(id INTEGER PRIMARY KEY, agent_session INTEGER REFERENCES agent_session(id),
   session_id INTEGER NOT NULL, client_name TEXT NOT NULL, service_name TEXT NOT NULL,
   category INTEGER NOT NULL, type INTEGER NOT NULL, payload TEXT NOT NULL, sent_at INTEGER NOT NULL);
+CREATE TABLE analytics_event(id INTEGER PRIMARY KEY, name TEXT NOT NULL, payload TEXT NOT NULL,
+  recorded_at INTEGER NOT NULL);
+CREATE TABLE power_event(id INTEGER PRIMARY KEY, domain INTEGER NOT NULL, name TEXT NOT NULL,
+  payload TEXT NOT NULL, recorded_at INTEGER NOT NULL);
 """
 NOON = 1_769_860_800_000_000  # 2026-01-31T12:00:00Z
 
@@ -34,7 +39,8 @@ class ToolTest(unittest.TestCase):
         self.root = pathlib.Path(self.directory.name)
         self.environment = {"PATH": os.environ["PATH"], "TZ": "UTC",
                             "QUARVEL_SOCKET": str(self.root / "reporting.sock"),
-                            "STATE_DIRECTORY": str(self.root)}
+                            "STATE_DIRECTORY": str(self.root),
+                            "CONFIGURATION_DIRECTORY": str(self.root / "etc")}
 
     def ctl(self, *arguments, stdin=""):
         """Status, standard output's lines, standard error."""
@@ -142,6 +148,11 @@ class StoreTest(ToolTest):
         _, lines, _ = self.ctl("sessions", "--json")
         self.assertEqual([json.loads(line)["flushedAt"] for line in lines],
                          ["2026-01-31T12:00:01.500000Z", None])
+        self.assertEqual(json.loads(lines[1]), {
+            "id": 2, "session": 8, "clientType": 19, "clientVersion": 2.0, "batchEvent": True,
+            "hierarchyToken": "", "client": "tarnwick.quarvel", "service": "telephony_session",
+            "openedAt": "2026-01-31T12:00:00.000000Z", "flushedAt": None, "messages": 0,
+            "userInfo": {"HostApplicationDisplayID": "org.example.dialer"}})
 
     def test_messages(self):
         _, lines, _ = self.ctl("messages", "--session", 7)
@@ -154,6 +165,62 @@ class StoreTest(ToolTest):
             "id": 3, "agentSession": None, "session": -1, "service": "telephony_session", "category": 11,
             "categoryName": "Volume", "type": 4, "typeName": "Error",
             "sentAt": "2026-01-31T12:00:00.001000Z", "payload": {"Volume": 0.5}})
+
+    def add_event(self, name, payload, seconds):
+        self.store.execute("INSERT INTO analytics_event VALUES(NULL,?,?,?)",
+                           (name, json.dumps(payload), NOON + round(seconds * 1e6)))
+
+    def test_events(self):
+        for number in range(3):
+            self.add_event(f"event{number}", {"Number": number}, number)
+        self.store.execute("INSERT INTO power_event VALUES(NULL,12,'power','{\"On\": true}',?)", (NOON,))
+        _, lines, _ = self.ctl("events", "--last", 2)
+        self.assertEqual([line.split()[2:] for line in lines],
+                         [["PAYLOAD"], ["event1", '{"Number":', "1}"], ["event2", '{"Number":', "2}"]])
+        self.assertEqual(json.loads(self.ctl("events", "--last", 1, "--json")[1][0]), {
+            "id": 3, "name": "event2", "recordedAt": "2026-01-31T12:00:02.000000Z", "payload": {"Number": 2}})
+        self.assertRegex(self.ctl("power")[1][1], r"12:00:00\.000 +12 +power +\{\"On\": true\}$")
+        self.assertEqual(json.loads(self.ctl("power", "--json")[1][0])["domain"], 12)
+
+    def test_a_summary_is_of_the_latest_run(self):
+        self.store.execute("INSERT INTO agent_session SELECT 9, session_id, client_type, client_version,"
+                           " batch_event, hierarchy_token, client_name, service_name, user_info, ?, ?"
+                           " FROM agent_session WHERE id = 1", (NOON + 2_000_000, NOON + 5_500_000))
+        for _ in range(2):
+            self.add_message(9, 7, 7, 1, {"Route": "Earpiece"})
+        self.add_message(9, 7, 9, 0, {"Codec_Underruns": 4})
+        self.add_message(9, 7, 65535, 65535, {
+            "device_orientation": "portrait,landscapeLeft", "device_orientation_time": "0.0,1.25",
+            "ui_orientation": "portrait", "ui_orientation_time": "0.5"})
+        status, lines, _ = self.ctl("summary", 7, "--json")
+        summary = json.loads(lines[0])
+        self.assertEqual((status, summary["earlierRuns"], summary["seconds"], summary["flushed"]), (0, 1, 3.5, True))
+        self.assertEqual([(row["categoryName"], row["typeName"], row["count"]) for row in summary["messages"]],
+                         [("RouteChange", "Start", 2), ("Tallixing", "Generic", 1), ("Undefined", "Unknown", 1)])
+        self.assertEqual(summary["driverStatistics"], {"Codec_Underruns": 4})
+        self.assertEqual([tuple(change.values()) for change in summary["orientation"]],
+                         [("device", "portrait", 0.0), ("device", "landscapeLeft", 1.25), ("ui", "portrait", 0.5)])
+        text = "\n".join(self.ctl("summary", 7)[1])
+        for shown in ("Session +7, its run 2", "Application +org.example.dialer", "Duration +3.500 s",
+                      "2 +RouteChange +Start", "Codec_Underruns +4", "1.25 s +device +landscapeLeft"):
+            self.assertRegex(text, shown)
+        self.assertRegex("\n".join(self.ctl("summary", 8)[1]), "Duration +not ended\nFlushed +no")
+        self.assertIn("no run of a session 99", self.ctl("summary", 99)[2])
+
+    def test_a_client_s_uptime_is_told_only_when_it_can_be_no_other_s(self):
+        event = "tarnwick.quarvel.zqreportingclientuptime"
+
+        def uptime():
+            return json.loads(self.ctl("summary", 7, "--json")[1][0]).get("clientUptime")
+        self.add_event(event, {"processName": "left before the end", "seconds": 9.0}, 1)
+        self.add_event(event, {"processName": "came after the start", "seconds": 1.0}, 2)
+        self.add_event(event, {"processName": "unknown", "seconds": -1}, 2)
+        self.add_event("another", {"processName": "another", "seconds": 9.0}, 2)
+        self.assertIsNone(uptime())
+        self.add_event(event, {"processName": "dialer", "seconds": 2.5}, 2)
+        self.assertEqual(uptime(), {"processName": "dialer", "seconds": 2.5})
+        self.add_event(event, {"processName": "player", "seconds": 60.0}, 3)
+        self.assertIsNone(uptime())
 
     def test_a_terminal_gets_lines_that_fit_and_colour(self):
         master, slave = pty.openpty()
@@ -174,6 +241,71 @@ class StoreTest(ToolTest):
                     self.assertEqual(json.loads(following.stdout.readline())["payload"], {"Number": number})
             finally:
                 following.terminate()
+
+
+class PreferencesTest(ToolTest):
+    def setUp(self):
+        super().setUp()
+        self.file = self.root / "etc" / "preferences" / "tarnwick.quarvel.toml"
+
+    def test_values_are_written_read_and_deleted(self):
+        for text, value in (("true", True), ("-5", -5), ("1.5", 1.5), ("a \"b\" \\ é", "a \"b\" \\ é"),
+                            ("", ""), ("two\nlines", "two\nlines"), ("1.5.2", "1.5.2"), ("nan", "nan")):
+            with self.subTest(text):
+                status, lines, error = self.ctl("defaults", "write", "a key", text)
+                self.assertEqual((status, error), (0, ""))
+                self.assertIn("quarvelctl notify", lines[0])
+                self.assertEqual(tomllib.loads(self.file.read_text()), {"a key": value})
+                self.assertEqual(json.loads(self.ctl("defaults", "read", "a key", "--json")[1][0]), value)
+        self.ctl("defaults", "write", "a key", "7", "--string")
+        self.assertEqual(self.ctl("defaults", "read", "--json")[1], ['{"a key":"7"}'])
+        self.assertEqual(self.ctl("defaults", "delete", "a key")[0], 0)
+        for command in ("read", "delete"):
+            status, _, error = self.ctl("defaults", command, "a key")
+            self.assertEqual(status, 1)
+            self.assertIn("is not set in " + str(self.file), error)
+        self.ctl("defaults", "write", "key", "text", "--domain", "org.example")
+        self.assertEqual(self.file.with_name("org.example.toml").read_text().split(), ["key", "=", '"text"'])
+        self.assertEqual(self.ctl("defaults", "--domain", "org.example", "read", "key")[1], ["text"])
+
+    def test_a_change_leaves_the_rest_of_the_file_alone(self):
+        self.file.parent.mkdir(parents=True)
+        self.file.write_text('# Ours.\ndevice_name = """\nlong\none"""\n\n# Why.\n"odd key" = 1\nlast = 2  # kept')
+        self.file.chmod(0o640)
+        self.ctl("defaults", "write", "device_name", "short")
+        self.ctl("defaults", "delete", "odd key")
+        self.ctl("defaults", "write", "new.key", "true")
+        self.assertEqual(self.file.read_text().replace("'", '"'),
+                         '# Ours.\ndevice_name = "short"\n\n# Why.\nlast = 2  # kept\n"new.key" = true\n')
+        self.assertEqual((self.file.stat().st_mode & 0o777, len(list(self.file.parent.iterdir()))), (0o640, 1))
+
+    def test_what_the_service_could_not_understand_is_not_touched(self):
+        self.file.parent.mkdir(parents=True)
+        for line in ("key = ", "key = [1]", "[table]", "a.b = 1"):
+            with self.subTest(line):
+                content = "first = 1\n" + line + "\n"
+                self.file.write_text(content)
+                for arguments in (["read"], ["write", "key", "1"], ["delete", "first"]):
+                    status, lines, error = self.ctl("defaults", *arguments)
+                    self.assertEqual((status, lines, self.file.read_text()), (1, [], content))
+                    self.assertIn(f"{self.file}:2: ", error)
+        self.file.unlink()
+        self.file.mkdir()
+        self.assertIn(f"{self.file} cannot be read", self.ctl("defaults", "write", "key", "1")[2])
+
+    def test_notifications(self):
+        status, _, error = self.ctl("notify")
+        self.assertEqual(status, 1)
+        self.assertIn("The service is not running", error)
+        notify = self.root / "notify"
+        notify.mkdir()
+        self.assertEqual(self.ctl("notify", "org.example.note")[0], 0)
+        self.assertEqual(self.ctl("defaults", "write", "key", "1", "--notify")[0], 0)
+        self.assertEqual({file.name for file in notify.iterdir()},
+                         {"org.example.note", "tarnwick.quarvel.reporting"})
+        os.utime(notify / "org.example.note", (1, 1))
+        self.ctl("notify", "org.example.note")
+        self.assertGreater((notify / "org.example.note").stat().st_mtime, 1)
 
 
 class RefusalTest(ToolTest):
@@ -199,7 +331,9 @@ class RefusalTest(ToolTest):
         self.assertIn("cannot be read", self.ctl("messages", "--store", self.root / "text.db")[2])
 
     def test_wrong_usage_is_told_from_failure(self):
-        for arguments in ([], ["nonsense"], ["valid"], ["valid", "seven"], ["messages", "--last", "-1"]):
+        for arguments in ([], ["nonsense"], ["valid"], ["valid", "seven"], ["messages", "--last", "-1"],
+                          ["events", "--last", "0"], ["summary"], ["defaults"], ["defaults", "write", "key"],
+                          ["notify", "../x"], ["notify", ""], ["defaults", "read", "--domain", "../x"]):
             self.assertEqual(self.ctl(*arguments)[0], 2, arguments)
         self.assertEqual(self.ctl("--help")[0], 0)
 
