@@ -28,10 +28,15 @@ std::optional<Number> Read(std::string_view text) {
   return number;
 }
 
-// What somebody means who types this.
+// What somebody means who types this. What a number would not keep as it is stays a string: 007,
+// and integers beyond 64 bits.
 Value Meant(const std::string& text) {
   if (text == "true" || text == "false") return text == "true";
+  const std::size_t first = text.starts_with('-') ? 1 : 0;
+  const bool padded = text.size() > first + 1 && text[first] == '0' && text[first + 1] != '.';
+  if (padded) return text;
   if (const auto integer = Read<std::int64_t>(text)) return *integer;
+  if (text.find_first_of(".eE") == std::string::npos) return text;
   if (const auto real = Read<double>(text); real && std::isfinite(*real)) return *real;
   return text;
 }

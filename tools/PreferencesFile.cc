@@ -12,6 +12,8 @@
 #include <sstream>
 #include <utility>
 
+#include "base/Utf8.h"
+
 namespace quarvel {
 namespace {
 
@@ -174,6 +176,10 @@ Result<PreferencesFile> PreferencesFile::open(std::filesystem::path path) {
 }
 
 Outcome PreferencesFile::set(const std::string& key, const Value& value) {
+  const std::string* string = value.string();
+  if (!IsUtf8(key) || (string && !IsUtf8(*string))) {
+    return Failed("A key or a string that is not UTF-8 cannot be kept.");
+  }
   const auto table = Parsed(text_, path_);
   if (!table) return table.error();
   auto [text, offset] = Without(text_, table.value(), key);
@@ -193,10 +199,9 @@ Outcome PreferencesFile::replace(std::string text, const std::string& key, const
     if (name != Key(key)) expected.set(name, kept);
   }
   if (value) expected.set(key, *value);
-  // A key or value that is not UTF-8 is found here, before it does harm.
+  // The text was changed by lines: it is written only when that did what was meant.
   const auto table = Parsed(text, path_);
-  if (!table) return Failed(fmt::format("\"{}\" cannot be set: keys and strings are UTF-8.", key));
-  if (EntriesOf(table.value()) != expected) {
+  if (!table || EntriesOf(table.value()) != expected) {
     return Failed(fmt::format("{} cannot be changed safely; edit it by hand.", path_.native()));
   }
   if (auto written = WriteWhole(path_, text); !written) return written;

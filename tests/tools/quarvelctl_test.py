@@ -250,13 +250,15 @@ class PreferencesTest(ToolTest):
 
     def test_values_are_written_read_and_deleted(self):
         for text, value in (("true", True), ("-5", -5), ("1.5", 1.5), ("a \"b\" \\ é", "a \"b\" \\ é"),
-                            ("", ""), ("two\nlines", "two\nlines"), ("1.5.2", "1.5.2"), ("nan", "nan")):
+                            ("", ""), ("two\nlines", "two\nlines"), ("1.5.2", "1.5.2"), ("nan", "nan"),
+                            ("007", "007"), ("-0.5", -0.5), (str(2**63 - 1), 2**63 - 1), (str(2**63), str(2**63))):
             with self.subTest(text):
                 status, lines, error = self.ctl("defaults", "write", "a key", text)
                 self.assertEqual((status, error), (0, ""))
                 self.assertIn("quarvelctl notify", lines[0])
                 self.assertEqual(tomllib.loads(self.file.read_text()), {"a key": value})
                 self.assertEqual(json.loads(self.ctl("defaults", "read", "a key", "--json")[1][0]), value)
+        self.assertIn("UTF-8", self.ctl("defaults", "write", "a key", "\udcff")[2])
         self.ctl("defaults", "write", "a key", "7", "--string")
         self.assertEqual(self.ctl("defaults", "read", "--json")[1], ['{"a key":"7"}'])
         self.assertEqual(self.ctl("defaults", "delete", "a key")[0], 0)
