@@ -171,7 +171,7 @@ class ZQReportingServiceDelegate final
   std::atomic<bool> reportingEnabled_ = true;
   Clients clients_ QUARVEL_GUARDED_BY(serverQueueRole);
   std::optional<Dictionary> defaults_ QUARVEL_GUARDED_BY(serverQueueRole);
-  NotificationToken defaultsToken_ = 0;  // constant once notifications can come
+  NotificationToken defaultsToken_ = 0;                    // constant once notifications can come
   std::optional<ZQReportingDriverUtility> driverUtility_;  // present and constant after `create`
 };
 

@@ -1,5 +1,6 @@
 // Whatever bytes come: the scanner finds the same end in one piece and in pieces, and what it lets
-// through can be walked, checked, rewritten and written as JSON, and comes back the same from a tree.
+// through can be walked, checked, rewritten and written as JSON, and comes back the same from a
+// tree.
 
 #include <algorithm>
 #include <cstdint>

@@ -75,7 +75,7 @@ class CallDesk {
 
   std::atomic<std::size_t> calls_{0};  // not carried out
   std::atomic<std::size_t> bytes_{0};  // of calls of which anything is still to be done
-  std::atomic<bool> waiting_{false};  // the I/O thread wants to hear of room
+  std::atomic<bool> waiting_{false};   // the I/O thread wants to hear of room
 };
 
 /// One call: where its reply goes and what stands for the work that came of it.
