@@ -27,10 +27,10 @@ struct Error {
 template <class T>
 class [[nodiscard]] Result {
  public:
-  Result(T value)
-      : result_(std::in_place_index<0>, std::move(value)) {}  // NOLINT(google-explicit-constructor)
-  Result(Error error)
-      : result_(std::in_place_index<1>, std::move(error)) {}  // NOLINT(google-explicit-constructor)
+  Result(T value)  // NOLINT(google-explicit-constructor)
+      : result_(std::in_place_index<0>, std::move(value)) {}
+  Result(Error error)  // NOLINT(google-explicit-constructor)
+      : result_(std::in_place_index<1>, std::move(error)) {}
 
   [[nodiscard]] bool ok() const { return result_.index() == 0; }
   explicit operator bool() const { return ok(); }

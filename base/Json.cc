@@ -240,8 +240,7 @@ class TreeBuilder : public rapidjson::BaseReaderHandler<rapidjson::UTF8<>, TreeB
   bool finish() {
     Container container = std::move(open_.back());
     open_.pop_back();
-    return std::visit([this](auto&& content) { return add(std::move(content)); },
-                      std::move(container.content));
+    return std::visit([this](auto& content) { return add(std::move(content)); }, container.content);
   }
 
   Value root_;

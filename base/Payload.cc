@@ -321,9 +321,8 @@ struct Inspection {
       case Value::Kind::date: {
         if (value.date()) return true;
         fault =
-            "an extension in it is not a timestamp (type -1) between the years 1 and 9999, the "
-            "only "
-            "extension allowed";
+            "an extension in it is not a timestamp (type -1) between the years 1 and 9999, "
+            "the only extension allowed";
         return false;
       }
       case Value::Kind::list: {

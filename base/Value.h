@@ -80,9 +80,9 @@ class Value {
   };
 
   Value() = default;
-  Value(std::nullptr_t) {}  // NOLINT(google-explicit-constructor)
-  Value(std::same_as<bool> auto boolean)
-      : value_(boolean) {}  // NOLINT(google-explicit-constructor)
+  Value(std::nullptr_t) {}                // NOLINT(google-explicit-constructor)
+  Value(std::same_as<bool> auto boolean)  // NOLINT(google-explicit-constructor)
+      : value_(boolean) {}
   template <IntegerNumber Integer>
   Value(Integer integer) {  // NOLINT(google-explicit-constructor)
     if (std::in_range<std::int64_t>(integer)) {
@@ -93,8 +93,8 @@ class Value {
   }
   Value(double real) : value_(real) {}                  // NOLINT(google-explicit-constructor)
   Value(std::string text) : value_(std::move(text)) {}  // NOLINT(google-explicit-constructor)
-  Value(std::string_view text)
-      : value_(std::string(text)) {}                      // NOLINT(google-explicit-constructor)
+  Value(std::string_view text)                          // NOLINT(google-explicit-constructor)
+      : value_(std::string(text)) {}
   Value(const char* text) : value_(std::string(text)) {}  // NOLINT(google-explicit-constructor)
   Value(Bytes bytes) : value_(std::move(bytes)) {}        // NOLINT(google-explicit-constructor)
   Value(Date date) : value_(date) {}                      // NOLINT(google-explicit-constructor)
