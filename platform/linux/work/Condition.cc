@@ -69,15 +69,18 @@ class LinuxCondition final : public Condition, public std::enable_shared_from_th
     ++waiters_;
     bool inTime = true;
     while (signals_ == 0 && inTime) {
-      const Date end =
-          std::clamp(std::min(deadline, waits().latest.load()), kEarliestDeadline, kLatestDeadline);
-      changed_.waitUntil(mutex_, end);
-      inTime = std::chrono::system_clock::now() < std::min(deadline, waits().latest.load());
+      changed_.waitUntil(mutex_, endOf(deadline));
+      inTime = std::chrono::system_clock::now() < endOf(deadline);
     }
     --waiters_;
     if (signals_ == 0) return false;
     --signals_;
     return true;
+  }
+
+  static Date endOf(Date deadline) {
+    return std::clamp(std::min(deadline, waits().latest.load()), kEarliestDeadline,
+                      kLatestDeadline);
   }
 
   Mutex mutex_;
