@@ -41,10 +41,15 @@ void ZQReportingOhmrikUtility::handleEvent(const std::optional<Payload>& event,
 void ZQReportingVistrelBridge::handleEvent(const std::optional<Payload>& event,
                                            std::uint32_t category, std::uint16_t type,
                                            const SharedDictionary& session) {
-  const std::string name =
-      fmt::format("tarnwick.quarvel.{}.{}", ZQReportingUtilityCategoryName(category),
-                  ZQReportingUtilityTypeName(type));
-  VistrelSendEventLazy(name, [&event, &session] {
+  // Most events are not wanted, so their names are put together without an allocation.
+  const CategoryNamePieces names = ZQReportingUtilityCategoryNamePieces(category);
+  fmt::memory_buffer name;
+  for (const std::string_view piece :
+       {std::string_view("tarnwick.quarvel."), names.component, names.kind, std::string_view("."),
+        ZQReportingUtilityTypeNameText(type)}) {
+    name.append(piece);
+  }
+  VistrelSendEventLazy({name.data(), name.size()}, [&event, &session] {
     return event.value_or(Payload()).setting(kHostApplicationDisplayID,
                                              ZQReportingUtilityHostApplicationID(session));
   });

@@ -27,37 +27,42 @@ constexpr std::array<std::string_view, 12> kServiceTypes = {
 std::string_view ComponentWord(std::uint32_t component) {
   switch (component) {
     case 0x0800'0000:
-      return "Session";
+      return "Session_";
     case 0x1000'0000:
-      return "DSP";
+      return "DSP_";
     case 0x2000'0000:
-      return "HAL";
+      return "HAL_";
     case 0x4000'0000:
-      return "Routing";
+      return "Routing_";
     case 0x8000'0000:
-      return "Toolbox";
+      return "Toolbox_";
     default:
-      return "";
+      return "_";
   }
 }
 
 }  // namespace
 
-std::string ZQReportingUtilityCategoryName(std::uint32_t category) {
-  std::string name;
-  if (category >= 0x1'0000 && category != 0xffff'ffff) {
-    name = ComponentWord(category & 0xffff'0000);
-    name += '_';
-  }
+CategoryNamePieces ZQReportingUtilityCategoryNamePieces(std::uint32_t category) {
+  const bool hasComponent = category >= 0x1'0000 && category != 0xffff'ffff;
   const std::uint32_t kind = category & 0xffff;
-  name += kCategoryKinds[kind < kCategoryKinds.size() ? kind : 0];
-  return name;
+  return {hasComponent ? ComponentWord(category & 0xffff'0000) : std::string_view(),
+          kCategoryKinds[kind < kCategoryKinds.size() ? kind : 0]};
+}
+
+std::string ZQReportingUtilityCategoryName(std::uint32_t category) {
+  const CategoryNamePieces pieces = ZQReportingUtilityCategoryNamePieces(category);
+  return std::string(pieces.component).append(pieces.kind);
+}
+
+std::string_view ZQReportingUtilityTypeNameText(std::int64_t type) {
+  const auto code = static_cast<std::uint32_t>(type);
+  if (code < kTypes.size()) return kTypes[code];
+  return code == 65535 ? "Unknown" : "Undefined";
 }
 
 std::string ZQReportingUtilityTypeName(std::int64_t type) {
-  const auto code = static_cast<std::uint32_t>(type);
-  if (code < kTypes.size()) return std::string(kTypes[code]);
-  return code == 65535 ? "Unknown" : "Undefined";
+  return std::string(ZQReportingUtilityTypeNameText(type));
 }
 
 std::string ZQReportingUtilityServiceTypeName(std::uint32_t serviceType) {

@@ -41,6 +41,16 @@ inline constexpr const char* kSubsystem = "tarnwick.quarvel";
 /// The name of a message type code, of which only the low 32 bits count; "Undefined" when unknown.
 [[nodiscard]] std::string ZQReportingUtilityTypeName(std::int64_t type);
 
+/// The same names in their constant pieces, for those who compose something longer: the component
+/// with its "_", empty when there is none, and the kind. Two codes have one name when both pieces
+/// are equal.
+struct CategoryNamePieces {
+  std::string_view component;
+  std::string_view kind;
+};
+[[nodiscard]] CategoryNamePieces ZQReportingUtilityCategoryNamePieces(std::uint32_t category);
+[[nodiscard]] std::string_view ZQReportingUtilityTypeNameText(std::int64_t type);
+
 /// The name of a service type; empty for a code that has none.
 [[nodiscard]] std::string ZQReportingUtilityServiceTypeName(std::uint32_t serviceType);
 

@@ -1,18 +1,34 @@
 #include "base/Date.h"
 
-#include <fmt/format.h>
+#include <algorithm>
+#include <cstdint>
 
 namespace quarvel {
 
-std::string DateText(Date date) {
+DateCharacters::DateCharacters(Date date) {
   using namespace std::chrono;
-  const auto day = floor<days>(date);
+  const Date shown = std::clamp(date, kEarliestDate, kLatestDate);
+  const auto day = floor<days>(shown);
   const year_month_day calendar(day);
-  const hh_mm_ss time(date - day);
-  return fmt::format("{:04}-{:02}-{:02}T{:02}:{:02}:{:02}.{:06}Z",
-                     static_cast<int>(calendar.year()), static_cast<unsigned>(calendar.month()),
-                     static_cast<unsigned>(calendar.day()), time.hours().count(),
-                     time.minutes().count(), time.seconds().count(), time.subseconds().count());
+  const hh_mm_ss time(shown - day);
+  char* at = characters_.data();
+  const auto put = [&at](auto number, std::size_t digits, char after) {
+    auto left = static_cast<std::uint32_t>(number);
+    for (std::size_t i = digits; i-- > 0; left /= 10) at[i] = static_cast<char>('0' + left % 10);
+    at[digits] = after;
+    at += digits + 1;
+  };
+  put(static_cast<int>(calendar.year()), 4, '-');
+  put(static_cast<unsigned>(calendar.month()), 2, '-');
+  put(static_cast<unsigned>(calendar.day()), 2, 'T');
+  put(time.hours().count(), 2, ':');
+  put(time.minutes().count(), 2, ':');
+  put(time.seconds().count(), 2, '.');
+  put(time.subseconds().count(), 6, 'Z');
+}
+
+std::string DateText(Date date) {
+  return std::string(DateCharacters(date));
 }
 
 namespace {

@@ -1,6 +1,8 @@
 #pragma once
 
+#include <array>
 #include <chrono>
+#include <cstddef>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -14,8 +16,21 @@ using Date = std::chrono::sys_time<std::chrono::microseconds>;
 inline constexpr Date kEarliestDate{std::chrono::seconds{-62'135'596'800}};
 inline constexpr Date kLatestDate{std::chrono::microseconds{253'402'300'799'999'999}};
 
-/// RFC 3339 in UTC with microseconds: "2026-01-31T13:25:01.123456Z".
+/// RFC 3339 in UTC with microseconds: "2026-01-31T13:25:01.123456Z". Of a date that has no such
+/// text, the nearest that has.
 [[nodiscard]] std::string DateText(Date date);
+
+/// `DateText` without an allocation.
+class DateCharacters {
+ public:
+  explicit DateCharacters(Date date);
+  operator std::string_view() const {  // NOLINT(google-explicit-constructor): it is a text
+    return {characters_.data(), characters_.size()};
+  }
+
+ private:
+  std::array<char, 27> characters_;
+};
 
 /// Reads RFC 3339 text with up to nine digits of a second (what is finer than a microsecond is cut
 /// off) and "Z" or a numeric offset. None when it is no such text.

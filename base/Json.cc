@@ -4,9 +4,13 @@
 #include <rapidjson/error/en.h>
 #include <rapidjson/prettywriter.h>
 #include <rapidjson/reader.h>
-#include <rapidjson/writer.h>
 
+#include <algorithm>
+#include <array>
+#include <charconv>
 #include <cmath>
+#include <cstring>
+#include <utility>
 #include <variant>
 
 #include "base/MessagePack.h"
@@ -28,8 +32,183 @@ class StringStream {
   std::string& out_;
 };
 
-using JsonWriter = rapidjson::Writer<StringStream>;
 using PrettyWriter = rapidjson::PrettyWriter<StringStream>;
+
+/// RFC 8259, section 7: these cannot stand in a text as they are.
+constexpr bool MustBeEscaped(char character) {
+  return static_cast<unsigned char>(character) < 0x20 || character == '"' || character == '\\';
+}
+
+/// The same of any of eight characters.
+constexpr bool MustAnyBeEscaped(std::uint64_t eight) {
+  constexpr std::uint64_t kOnes = 0x0101010101010101U;
+  constexpr std::uint64_t kHighBits = 0x8080808080808080U;
+  const auto anyBelow = [](std::uint64_t bytes, std::uint64_t bound) {
+    return (bytes - kOnes * bound) & ~bytes & kHighBits;
+  };
+  return (anyBelow(eight, 0x20) | anyBelow(eight ^ kOnes * '"', 1) |
+          anyBelow(eight ^ kOnes * '\\', 1)) != 0;
+}
+
+/// Copies a text that needs no escape; false when it does, and then what was copied is undefined.
+bool CopyPlain(std::string_view text, char* to) {
+  const std::size_t size = text.size();
+  if (size < sizeof(std::uint64_t)) {
+    for (std::size_t at = 0; at < size; ++at) {
+      if (MustBeEscaped(text[at])) return false;
+      to[at] = text[at];
+    }
+    return true;
+  }
+  const auto step = [&](std::size_t at) {
+    std::uint64_t eight = 0;
+    std::memcpy(&eight, text.data() + at, sizeof eight);
+    std::memcpy(to + at, &eight, sizeof eight);
+    return !MustAnyBeEscaped(eight);
+  };
+  // What the steps leave over is copied once more with the last one.
+  for (std::size_t at = 0; at + sizeof(std::uint64_t) < size; at += sizeof(std::uint64_t)) {
+    if (!step(at)) return false;
+  }
+  return step(size - sizeof(std::uint64_t));
+}
+
+/// Appends compact JSON to a string, with the interface of RapidJSON's writers. Every row of the
+/// store comes through here, and those take a text character by character, at several times the
+/// cost. What is in the string behind the JSON is undefined until the writer has gone.
+class CompactWriter {
+ public:
+  explicit CompactWriter(std::string& out) : out_(out), length_(out.size()) {}
+  ~CompactWriter() { out_.resize(length_); }
+  CompactWriter(const CompactWriter&) = delete;
+  CompactWriter& operator=(const CompactWriter&) = delete;
+
+  void Null() { plain("null"); }
+  void Bool(bool boolean) { plain(boolean ? "true" : "false"); }
+  void Int64(std::int64_t number) { integer(fmt::format_int(number)); }
+  void Uint64(std::uint64_t number) { integer(fmt::format_int(number)); }
+  void Double(double number) {
+    if (shortDecimal(number)) return;
+    std::array<char, 32> digits;
+    const auto* end = std::to_chars(digits.data(), digits.data() + digits.size(), number).ptr;
+    const std::string_view text(digits.data(), static_cast<std::size_t>(end - digits.data()));
+    plain(text);
+    // So that it is read back as what it is.
+    if (text.find_first_of(".e") == std::string_view::npos) written(copy(".0", room(2)));
+  }
+  void String(const char* text, rapidjson::SizeType length) { quote({text, length}, false); }
+  void Key(const char* text, rapidjson::SizeType length) { quote({text, length}, true); }
+  void StartObject() { open('{'); }
+  void EndObject() { close('}'); }
+  void StartArray() { open('['); }
+  void EndArray() { close(']'); }
+
+ private:
+  /// Where so many characters may be written; `written` takes the end of those that were.
+  char* room(std::size_t count) {
+    if (out_.size() - length_ < count) {
+      out_.resize(std::max(out_.capacity(), 2 * (length_ + count)));
+    }
+    return out_.data() + length_;
+  }
+  void written(const char* end) { length_ = static_cast<std::size_t>(end - out_.data()); }
+  static char* copy(std::string_view text, char* at) {
+    for (const char character : text) *at++ = character;
+    return at;
+  }
+  /// Room for a value of so many characters, behind its comma.
+  char* roomForValue(std::size_t count) {
+    char* const at = room(count + 1);
+    *at = ',';
+    return at + (std::exchange(separated_, false) ? 0 : 1);
+  }
+  void plain(std::string_view text) { written(copy(text, roomForValue(text.size()))); }
+  void integer(const fmt::format_int& digits) { plain({digits.data(), digits.size()}); }
+  void open(char bracket) {
+    plain({&bracket, 1});
+    separated_ = true;
+  }
+  void close(char bracket) {
+    written(copy({&bracket, 1}, room(1)));
+    separated_ = false;
+  }
+
+  /// Most measures have few decimals: a number that a short decimal stands for exactly needs no
+  /// search for its shortest text.
+  bool shortDecimal(double number) {
+    constexpr double kLargest = 1e9;
+    constexpr std::size_t kDecimals = 4;
+    if (!(std::abs(number) < kLargest) || (number == 0 && std::signbit(number))) return false;
+    double scale = 1;
+    for (std::size_t decimals = 0; decimals <= kDecimals; ++decimals, scale *= 10) {
+      const auto scaled = static_cast<std::int64_t>(number * scale + std::copysign(0.5, number));
+      // Both are exact, so this is the double nearest to the decimal.
+      if (static_cast<double>(scaled) / scale != number) continue;
+      const fmt::format_int whole(std::abs(scaled));
+      const std::string_view digits(whole.data(), whole.size());
+      const std::size_t before = digits.size() - std::min(digits.size(), decimals);
+      char* at = roomForValue(32);
+      if (scaled < 0) *at++ = '-';
+      at = before > 0 ? copy(digits.substr(0, before), at) : copy("0", at);
+      *at++ = '.';
+      for (std::size_t zeros = digits.size() - before; zeros < std::max<std::size_t>(decimals, 1);
+           ++zeros) {
+        *at++ = '0';
+      }
+      written(copy(digits.substr(before), at));
+      return true;
+    }
+    return false;
+  }
+
+  void quote(std::string_view text, bool isKey) {
+    char* at = roomForValue(text.size() + 3);
+    *at++ = '"';
+    if (CopyPlain(text, at)) {
+      at += text.size();
+    } else {
+      written(at);
+      // In pieces, so that a long text does not ask for room for the worst of all of it.
+      constexpr std::size_t kPiece = 4096;
+      for (; text.size() > kPiece; text.remove_prefix(kPiece)) escaped(text.substr(0, kPiece));
+      escaped(text);
+      at = room(2);
+    }
+    *at++ = '"';
+    if (isKey) *at++ = ':';
+    separated_ = isKey;
+    written(at);
+  }
+  void escaped(std::string_view text) {
+    char* at = room(6 * text.size());
+    for (const char character : text) {
+      if (MustBeEscaped(character)) {
+        at = escape(character, at);
+      } else {
+        *at++ = character;
+      }
+    }
+    written(at);
+  }
+  static char* escape(char character, char* at) {
+    constexpr std::string_view kNamed = "\"\\\b\f\n\r\t";
+    constexpr std::string_view kNames = "\"\\bfnrt";
+    constexpr std::string_view kHexadecimal = "0123456789ABCDEF";
+    *at++ = '\\';
+    if (const std::size_t named = kNamed.find(character); named != std::string_view::npos) {
+      *at++ = kNames[named];
+    } else {
+      at = std::ranges::copy(std::string_view("u00"), at).out;
+      *at++ = kHexadecimal[static_cast<unsigned char>(character) >> 4];
+      *at++ = kHexadecimal[static_cast<unsigned char>(character) & 0xf];
+    }
+    return at;
+  }
+
+  std::string& out_;
+  std::size_t length_;     // of `out_` that is written
+  bool separated_ = true;  // what comes next needs no comma in front
+};
 
 template <class Writer>
 void WriteText(Writer& writer, std::string_view text) {
@@ -71,120 +250,77 @@ std::string Base64(std::string_view octets) {
   return text;
 }
 
-template <class Writer>
-void Write(Writer& writer, PayloadValue value);
-template <class Writer>
-void Write(Writer& writer, const Dictionary& dictionary);
-
-template <class Writer>
-void WriteEntryKey(Writer& writer, PayloadValue key) {
-  if (const auto text = key.string()) {
-    WriteKey(writer, *text);
-  } else if (const auto number = key.integer()) {
-    WriteKey(writer, fmt::to_string(*number));
-  } else {
-    WriteKey(writer, fmt::to_string(key.unsignedInteger().value_or(0)));
-  }
+// What payloads and trees do not call alike.
+std::string_view OctetsOf(PayloadValue value) {
+  return *value.bytes();
+}
+std::string_view OctetsOf(const Value& value) {
+  return value.bytes()->octets;
+}
+auto ItemsOf(PayloadValue value) {
+  return value.items();
+}
+const List& ItemsOf(const Value& value) {
+  return *value.list();
+}
+auto EntriesOf(PayloadValue value) {
+  return value.entries();
+}
+const Dictionary& EntriesOf(const Value& value) {
+  return *value.dictionary();
 }
 
-template <class Writer>
-void WriteEntryKey(Writer& writer, const Key& key) {
-  if (const auto* text = key.string()) {
-    WriteKey(writer, *text);
-  } else if (const auto* number = key.integer()) {
-    WriteKey(writer, fmt::to_string(*number));
-  } else {
-    WriteKey(writer, fmt::to_string(*key.unsignedInteger()));
-  }
-}
+template <class Writer, class AnyValue>
+void Write(Writer& writer, const AnyValue& value);
 
-template <class Writer>
-void Write(Writer& writer, PayloadValue value) {
-  switch (value.kind()) {
-    case Value::Kind::nil:
-      writer.Null();
-      return;
-    case Value::Kind::boolean:
-      writer.Bool(*value.boolean());
-      return;
-    case Value::Kind::integer:
-      writer.Int64(*value.integer());
-      return;
-    case Value::Kind::unsignedInteger:
-      writer.Uint64(*value.unsignedInteger());
-      return;
-    case Value::Kind::real:
-      return WriteReal(writer, *value.real());
-    case Value::Kind::string:
-      return WriteText(writer, *value.string());
-    case Value::Kind::bytes:
-      return WriteText(writer, Base64(*value.bytes()));
-    case Value::Kind::date:
-      return WriteText(writer, DateText(value.date().value_or(Date{})));
-    case Value::Kind::list:
-      writer.StartArray();
-      for (const PayloadValue item : value.items()) Write(writer, item);
-      writer.EndArray();
-      return;
-    case Value::Kind::dictionary:
-      writer.StartObject();
-      for (const PayloadEntry& entry : value.entries()) {
-        WriteEntryKey(writer, entry.key);
-        Write(writer, entry.value);
-      }
-      writer.EndObject();
-      return;
-  }
-}
-
-template <class Writer>
-void Write(Writer& writer, const Value& value) {
-  switch (value.kind()) {
-    case Value::Kind::nil:
-      writer.Null();
-      return;
-    case Value::Kind::boolean:
-      writer.Bool(*value.boolean());
-      return;
-    case Value::Kind::integer:
-      writer.Int64(*value.integer());
-      return;
-    case Value::Kind::unsignedInteger:
-      writer.Uint64(*value.unsignedInteger());
-      return;
-    case Value::Kind::real:
-      return WriteReal(writer, *value.real());
-    case Value::Kind::string:
-      return WriteText(writer, *value.string());
-    case Value::Kind::bytes:
-      return WriteText(writer, Base64(value.bytes()->octets));
-    case Value::Kind::date:
-      return WriteText(writer, DateText(*value.date()));
-    case Value::Kind::list:
-      writer.StartArray();
-      for (const Value& item : *value.list()) Write(writer, item);
-      writer.EndArray();
-      return;
-    case Value::Kind::dictionary:
-      return Write(writer, *value.dictionary());
-  }
-}
-
-template <class Writer>
-void Write(Writer& writer, const Dictionary& dictionary) {
+template <class Writer, class Entries>
+void WriteEntries(Writer& writer, const Entries& entries) {
   writer.StartObject();
-  for (const auto& [key, value] : dictionary) {
-    WriteEntryKey(writer, key);
+  for (const auto& [key, value] : entries) {
+    if (const auto text = key.string()) {
+      WriteKey(writer, *text);
+    } else if (const auto number = key.integer()) {
+      WriteKey(writer, fmt::to_string(*number));
+    } else {
+      WriteKey(writer, fmt::to_string(*key.unsignedInteger()));
+    }
     Write(writer, value);
   }
   writer.EndObject();
 }
 
-template <class T>
-void Append(std::string& out, const T& value) {
-  StringStream stream(out);
-  JsonWriter writer(stream);
-  Write(writer, value);
+/// `value`: a `PayloadValue` or a `Value`.
+template <class Writer, class AnyValue>
+void Write(Writer& writer, const AnyValue& value) {
+  switch (value.kind()) {
+    case Value::Kind::nil:
+      writer.Null();
+      return;
+    case Value::Kind::boolean:
+      writer.Bool(*value.boolean());
+      return;
+    case Value::Kind::integer:
+      writer.Int64(*value.integer());
+      return;
+    case Value::Kind::unsignedInteger:
+      writer.Uint64(*value.unsignedInteger());
+      return;
+    case Value::Kind::real:
+      return WriteReal(writer, *value.real());
+    case Value::Kind::string:
+      return WriteText(writer, *value.string());
+    case Value::Kind::bytes:
+      return WriteText(writer, Base64(OctetsOf(value)));
+    case Value::Kind::date:
+      return WriteText(writer, DateCharacters(*value.date()));
+    case Value::Kind::list:
+      writer.StartArray();
+      for (const auto& item : ItemsOf(value)) Write(writer, item);
+      writer.EndArray();
+      return;
+    case Value::Kind::dictionary:
+      return WriteEntries(writer, EntriesOf(value));
+  }
 }
 
 /// Builds a tree from RapidJSON's events. Held on a stack of its own, so that nesting costs no
@@ -251,13 +387,16 @@ class TreeBuilder : public rapidjson::BaseReaderHandler<rapidjson::UTF8<>, TreeB
 }  // namespace
 
 void AppendJson(std::string& out, PayloadValue value) {
-  Append(out, value);
+  CompactWriter writer(out);
+  Write(writer, value);
 }
 void AppendJson(std::string& out, const Value& value) {
-  Append(out, value);
+  CompactWriter writer(out);
+  Write(writer, value);
 }
 void AppendJson(std::string& out, const Dictionary& dictionary) {
-  Append(out, dictionary);
+  CompactWriter writer(out);
+  WriteEntries(writer, dictionary);
 }
 
 std::string JsonText(const Payload& payload) {
@@ -306,7 +445,7 @@ void PrettyJsonWriter::value(PayloadValue value) {
   Write(implementation_->writer, value);
 }
 void PrettyJsonWriter::value(const Dictionary& dictionary) {
-  Write(implementation_->writer, dictionary);
+  WriteEntries(implementation_->writer, dictionary);
 }
 
 Result<std::string> PrettyJsonWriter::finish() {

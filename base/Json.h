@@ -14,7 +14,7 @@ namespace quarvel {
 // microseconds, bytes as base64, the numbers that JSON lacks as "NaN", "Infinity", "-Infinity".
 // Integer keys become their decimal text. Keys keep their order.
 
-/// Appends compact JSON.
+/// Appends compact JSON. A `PayloadValue` must be part of a `Payload`.
 void AppendJson(std::string& out, PayloadValue value);
 void AppendJson(std::string& out, const Value& value);
 void AppendJson(std::string& out, const Dictionary& dictionary);

@@ -29,29 +29,29 @@ MessagePackScanner::Progress MessagePackScanner::scan(std::string_view bytes) {
   // `position_` may lie beyond what has arrived: the rest of a string is skipped unread.
   while ((depth_ > 0 || position_ == 0) && position_ < bytes.size()) {
     const auto code = static_cast<unsigned char>(bytes[position_]);
-    const MessagePackForm form = MessagePackForm::of(code);
+    const MessagePackForm& form = MessagePackForm::of(code);
     if (form.kind == MessagePackForm::Kind::unused) {
       return fail(fmt::format("byte {} is 0xc1, which MessagePack never uses", position_));
     }
     const std::size_t arrived = bytes.size() - position_;
-    if (arrived < form.headBytes()) break;
+    if (arrived < form.headBytes) break;
     const std::uint64_t length = form.length(bytes.data() + position_);
     const bool container = form.isContainer();
     const std::uint64_t values =
         form.kind == MessagePackForm::Kind::dictionary ? 2 * length : length;
     // Each value takes a byte at least, so a container's count bounds its bytes from below.
-    const std::uint64_t needed = form.headBytes() + values;
+    const std::uint64_t needed = form.headBytes + values;
     if (needed > maximumBytes_ || position_ > maximumBytes_ - needed) {
       return fail(
           fmt::format("the value at byte {} needs {} bytes or more; a message has at most {}",
                       position_, needed, maximumBytes_));
     }
-    position_ += form.headBytes();
+    position_ += form.headBytes;
     if (!container) {
       position_ += length;
     } else if (depth_ == maximumDepth_) {
       return fail(fmt::format("the container at byte {} is nested deeper than {}",
-                              position_ - form.headBytes(), maximumDepth_));
+                              position_ - form.headBytes, maximumDepth_));
     } else {
       remaining_[depth_++] = values + 1;  // the container itself is counted off below
     }

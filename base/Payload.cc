@@ -9,7 +9,6 @@
 #include <vector>
 
 #include "base/MessagePack.h"
-#include "base/MessagePackForm.h"
 #include "base/Utf8.h"
 
 namespace quarvel {
@@ -18,80 +17,37 @@ namespace {
 
 using Form = MessagePackForm;
 
-const Form& FormAt(const char* value) {
-  return Form::of(static_cast<unsigned char>(*value));
-}
-
 /// What follows the head: the octets of a string, the first item of a list.
 const char* BodyOf(const char* value) {
-  return value + FormAt(value).headBytes();
-}
-
-/// The byte after the value.
-const char* AfterValue(const char* value) {
-  // Values still to be skipped; containers add theirs, so no recursion is needed.
-  for (std::uint64_t left = 1; left > 0; --left) {
-    const Form& form = FormAt(value);
-    const std::uint64_t length = form.length(value);
-    value += form.headBytes();
-    if (form.kind == Form::Kind::list) {
-      left += length;
-    } else if (form.kind == Form::Kind::dictionary) {
-      left += 2 * length;
-    } else {
-      value += length;
-    }
-  }
-  return value;
+  return value + Form::at(value).headBytes;
 }
 
 std::string_view Octets(const char* value) {
-  return {BodyOf(value), static_cast<std::size_t>(FormAt(value).length(value))};
+  return {BodyOf(value), static_cast<std::size_t>(Form::at(value).length(value))};
 }
 
 constexpr signed char kTimestampType = -1;
 
 bool IsTimestamp(const char* value) {
-  return FormAt(value).kind == Form::Kind::extension &&
+  return Form::at(value).kind == Form::Kind::extension &&
          static_cast<signed char>(*(BodyOf(value) - 1)) == kTimestampType;
 }
 
 }  // namespace
 
-PayloadValue::Kind PayloadValue::kind() const {
-  switch (FormAt(at_).kind) {
-    case Form::Kind::boolean:
-      return Kind::boolean;
-    case Form::Kind::integer:
-      return Kind::integer;
-    case Form::Kind::unsignedInteger:
-      return integer() ? Kind::integer : Kind::unsignedInteger;
-    case Form::Kind::real:
-      return Kind::real;
-    case Form::Kind::string:
-      return Kind::string;
-    case Form::Kind::bytes:
-      return Kind::bytes;
-    case Form::Kind::extension:
-      return Kind::date;
-    case Form::Kind::list:
-      return Kind::list;
-    case Form::Kind::dictionary:
-      return Kind::dictionary;
-    case Form::Kind::nil:
-    case Form::Kind::unused:
-      break;
-  }
-  return Kind::nil;
-}
+static_assert(static_cast<int>(Form::Kind::nil) == static_cast<int>(Value::Kind::nil) &&
+              static_cast<int>(Form::Kind::bytes) == static_cast<int>(Value::Kind::bytes) &&
+              static_cast<int>(Form::Kind::extension) == static_cast<int>(Value::Kind::date) &&
+              static_cast<int>(Form::Kind::dictionary) ==
+                  static_cast<int>(Value::Kind::dictionary));
 
 std::optional<bool> PayloadValue::boolean() const {
-  if (FormAt(at_).kind != Form::Kind::boolean) return std::nullopt;
+  if (Form::at(at_).kind != Form::Kind::boolean) return std::nullopt;
   return *at_ == '\xc3';
 }
 
 std::optional<std::int64_t> PayloadValue::integer() const {
-  const Form& form = FormAt(at_);
+  const Form& form = Form::at(at_);
   if (form.kind == Form::Kind::unsignedInteger) {
     const std::uint64_t number = *unsignedInteger();
     if (number > std::numeric_limits<std::int64_t>::max()) return std::nullopt;
@@ -106,7 +62,7 @@ std::optional<std::int64_t> PayloadValue::integer() const {
 }
 
 std::optional<std::uint64_t> PayloadValue::unsignedInteger() const {
-  const Form& form = FormAt(at_);
+  const Form& form = Form::at(at_);
   if (form.kind == Form::Kind::unsignedInteger) {
     return form.fixed == 0 ? static_cast<unsigned char>(*at_)
                            : Form::bigEndian(at_ + 1, form.fixed);
@@ -117,21 +73,11 @@ std::optional<std::uint64_t> PayloadValue::unsignedInteger() const {
 }
 
 std::optional<double> PayloadValue::real() const {
-  const Form& form = FormAt(at_);
+  const Form& form = Form::at(at_);
   if (form.kind != Form::Kind::real) return std::nullopt;
   const std::uint64_t bits = Form::bigEndian(at_ + 1, form.fixed);
   if (form.fixed == 4) return std::bit_cast<float>(static_cast<std::uint32_t>(bits));
   return std::bit_cast<double>(bits);
-}
-
-std::optional<std::string_view> PayloadValue::string() const {
-  if (FormAt(at_).kind != Form::Kind::string) return std::nullopt;
-  return Octets(at_);
-}
-
-std::optional<std::string_view> PayloadValue::bytes() const {
-  if (FormAt(at_).kind != Form::Kind::bytes) return std::nullopt;
-  return Octets(at_);
 }
 
 std::optional<Date> PayloadValue::date() const {
@@ -159,45 +105,11 @@ std::optional<Date> PayloadValue::date() const {
   return Date(seconds(count) + floor<microseconds>(nanoseconds(subsecond)));
 }
 
-std::size_t PayloadValue::count() const {
-  const Form& form = FormAt(at_);
-  return form.isContainer() ? static_cast<std::size_t>(form.length(at_)) : 0;
-}
-
-PayloadValue::Items PayloadValue::items() const {
-  return {BodyOf(at_), FormAt(at_).kind == Form::Kind::list ? count() : 0};
-}
-
-PayloadValue::Entries PayloadValue::entries() const {
-  return {BodyOf(at_), FormAt(at_).kind == Form::Kind::dictionary ? count() : 0};
-}
-
 std::optional<PayloadValue> PayloadValue::find(std::string_view key) const {
   for (const PayloadEntry& entry : entries()) {
     if (entry.key.string() == key) return entry.value;
   }
   return std::nullopt;
-}
-
-std::string_view PayloadValue::encoded() const {
-  return {at_, static_cast<std::size_t>(AfterValue(at_) - at_)};
-}
-
-PayloadValue::Items::Iterator& PayloadValue::Items::Iterator::operator++() {
-  if (--left_ > 0) at_ = AfterValue(at_);
-  return *this;
-}
-
-PayloadValue::Entries::Iterator::Iterator(const char* at, std::size_t left) : at_(at), left_(left) {
-  if (left_ > 0) value_ = AfterValue(at_);
-}
-
-PayloadValue::Entries::Iterator& PayloadValue::Entries::Iterator::operator++() {
-  if (--left_ > 0) {
-    at_ = AfterValue(value_);
-    value_ = AfterValue(at_);
-  }
-  return *this;
 }
 
 namespace {
@@ -267,88 +179,147 @@ namespace {
 
 constexpr const char* kEmptyDictionary = "\x80";
 
-/// Whether a dictionary, whose keys are strings or integers, may have equal keys; false is certain.
-/// A client's dictionary is small, so comparing each with each is cheapest; a large one may be
-/// meant to make that expensive.
-bool MayHaveEqualKeys(PayloadValue dictionary) {
-  constexpr std::size_t kSmall = 32;
-  const std::size_t count = dictionary.count();
-  if (count < 2) return false;
-  if (count > kSmall) {
-    std::unordered_set<std::string_view> texts;
-    std::unordered_set<std::uint64_t> numbers;
-    for (const PayloadEntry& entry : dictionary.entries()) {
-      if (const auto text = entry.key.string()) {
-        if (!texts.insert(*text).second) return true;
-      } else {
-        const auto number = entry.key.integer();
-        const std::uint64_t bits =
-            number ? static_cast<std::uint64_t>(*number) : *entry.key.unsignedInteger();
-        // Signed and unsigned numbers of the same bits are different keys, but so rare a meeting
-        // may as well take the slow path, which tells them apart.
-        if (!numbers.insert(bits).second) return true;
+/// The keys of one dictionary, to find equal ones. A client's dictionary is small, so comparing is
+/// cheapest; a large one may be meant to make that expensive.
+class SeenKeys {
+ public:
+  explicit SeenKeys(std::size_t count) : isSmall_(count <= kSmall) {}
+
+  /// Whether the key is new for certain.
+  bool add(std::string_view text) {
+    if (!isSmall_) return sets().texts.insert(text).second;
+    const auto at = [&text](std::size_t i) -> std::size_t {
+      return static_cast<unsigned char>(text[i]);
+    };
+    const std::size_t mark =
+        text.empty() ? 0 : text.size() + 7 * at(text.size() / 2) + 31 * at(text.size() - 1);
+    if (isMarked(mark)) {
+      for (std::size_t i = 0; i < count_; ++i) {
+        if (std::string_view(small_[i].text, small_[i].length) == text) return false;
       }
     }
-    return false;
+    small_[count_++] = {text.data(), text.size()};
+    return true;
   }
-  std::array<std::string_view, kSmall> keys;
-  std::size_t seen = 0;
-  for (const PayloadEntry& entry : dictionary.entries()) {
-    // A string and an integer never have the same bytes; an integer's two forms are two byte
-    // strings, so integers are compared in their shortest form.
-    const auto text = entry.key.string();
-    if (!text) return true;
-    for (std::size_t i = 0; i < seen; ++i) {
-      if (keys[i] == *text) return true;
+  bool add(PayloadValue integer) {
+    // Signed and unsigned numbers of the same bits are different keys, but so rare a meeting may as
+    // well take the slow path, which tells them apart.
+    const auto number = integer.integer();
+    return sets()
+        .numbers.insert(number ? static_cast<std::uint64_t>(*number) : *integer.unsignedInteger())
+        .second;
+  }
+
+ private:
+  static constexpr std::size_t kSmall = 32;
+
+  struct Span {
+    const char* text;
+    std::size_t length;
+  };
+  struct Sets {
+    std::unordered_set<std::string_view> texts;
+    std::unordered_set<std::uint64_t> numbers;
+  };
+
+  Sets& sets() {
+    if (!sets_) sets_.emplace();
+    return *sets_;
+  }
+
+  /// Marks, and says whether it was: two keys with different marks are different.
+  bool isMarked(std::size_t mark) {
+    std::uint64_t& word = marks_[mark / 64 % marks_.size()];
+    const std::uint64_t bit = std::uint64_t{1} << mark % 64;
+    const bool was = (word & bit) != 0;
+    word |= bit;
+    return was;
+  }
+
+  const bool isSmall_;
+  std::array<std::uint64_t, 4> marks_{};
+  std::array<Span, kSmall> small_;  // the first `count_`; the rest is not initialised
+  std::size_t count_ = 0;
+  std::optional<Sets> sets_;
+};
+
+/// Walks a well-formed value once: what makes it no payload, and whether it needs rewriting.
+class Inspection {
+ public:
+  /// The byte after the value; null at a fault.
+  const char* inspect(const char* value) {
+    const Form& form = Form::at(value);
+    switch (form.kind) {
+      case Form::Kind::string:
+        if (!IsUtf8(Octets(value))) return refuse(kNotUtf8);
+        break;
+      case Form::Kind::extension:
+        if (!PayloadValue(value).date()) {
+          return refuse(
+              "an extension in it is not a timestamp (type -1) between the years 1 and 9999, "
+              "the only extension allowed");
+        }
+        break;
+      case Form::Kind::list: {
+        const char* at = BodyOf(value);
+        for (std::uint64_t left = form.length(value); left > 0 && at != nullptr; --left) {
+          at = inspect(at);
+        }
+        return at;
+      }
+      case Form::Kind::dictionary:
+        return inspectEntries(value);
+      default:
+        break;
     }
-    keys[seen++] = *text;
+    return value + form.headBytes + form.length(value);
+  }
+
+  [[nodiscard]] const std::string& fault() const { return fault_; }
+  [[nodiscard]] bool mayHaveEqualKeys() const { return mayHaveEqualKeys_; }
+
+ private:
+  const char* inspectEntries(const char* dictionary) {
+    const std::uint64_t count = Form::at(dictionary).length(dictionary);
+    SeenKeys seen(static_cast<std::size_t>(count));
+    const char* at = BodyOf(dictionary);
+    for (std::uint64_t left = count; left > 0; --left) {
+      const PayloadValue key(at);
+      if (const auto text = key.string()) {
+        if (!IsUtf8(*text)) return refuse(kNotUtf8);
+        mayHaveEqualKeys_ |= !seen.add(*text);
+        at = text->data() + text->size();
+      } else if (key.isInteger()) {
+        mayHaveEqualKeys_ |= !seen.add(key);
+        at = AfterMessagePack(at);
+      } else {
+        return refuse("a key in it is neither a string nor an integer");
+      }
+      at = inspect(at);
+      if (at == nullptr) return nullptr;
+    }
+    return at;
+  }
+  const char* refuse(const char* fault) {
+    fault_ = fault;
+    return nullptr;
+  }
+
+  static constexpr const char* kNotUtf8 = "a string in it is not UTF-8";
+
+  std::string fault_;
+  bool mayHaveEqualKeys_ = false;
+};
+
+/// Whether a payload's own keys may be equal; false is certain.
+bool MayHaveEqualKeys(PayloadValue dictionary) {
+  SeenKeys seen(dictionary.count());
+  for (const PayloadEntry& entry : dictionary.entries()) {
+    const auto text = entry.key.string();
+    if (text ? !seen.add(*text) : !seen.add(entry.key)) return true;
   }
   return false;
 }
-
-/// What makes a well-formed value no payload, a sentence's end; and whether it needs rewriting.
-struct Inspection {
-  std::string fault;
-  bool mayHaveEqualKeys = false;
-
-  bool inspect(PayloadValue value) {
-    switch (value.kind()) {
-      case Value::Kind::string: {
-        if (IsUtf8(*value.string())) return true;
-        fault = "a string in it is not UTF-8";
-        return false;
-      }
-      case Value::Kind::date: {
-        if (value.date()) return true;
-        fault =
-            "an extension in it is not a timestamp (type -1) between the years 1 and 9999, "
-            "the only extension allowed";
-        return false;
-      }
-      case Value::Kind::list: {
-        for (const PayloadValue item : value.items()) {
-          if (!inspect(item)) return false;
-        }
-        return true;
-      }
-      case Value::Kind::dictionary: {
-        for (const PayloadEntry& entry : value.entries()) {
-          const Value::Kind keyKind = entry.key.kind();
-          if (keyKind != Value::Kind::string && keyKind != Value::Kind::integer &&
-              keyKind != Value::Kind::unsignedInteger) {
-            fault = "a key in it is neither a string nor an integer";
-            return false;
-          }
-          if (!inspect(entry.key) || !inspect(entry.value)) return false;
-        }
-        mayHaveEqualKeys = mayHaveEqualKeys || MayHaveEqualKeys(value);
-        return true;
-      }
-      default:
-        return true;
-    }
-  }
-};
 
 struct KeyHash {
   std::size_t operator()(const Key& key) const { return key.hash(); }
@@ -412,11 +383,12 @@ Result<Payload> Payload::from(PayloadValue dictionary) {
     return Error::because("quarvel.payload", 1, std::move(reason));
   };
   if (dictionary.kind() != Value::Kind::dictionary) return refuse("it is not a dictionary");
-  const std::string_view encoded = dictionary.encoded();
-  if (encoded.size() > std::numeric_limits<std::uint32_t>::max()) return refuse("it is over 4 GiB");
   Inspection inspection;
-  if (!inspection.inspect(dictionary)) return refuse(std::move(inspection.fault));
-  if (!inspection.mayHaveEqualKeys) return Payload(encoded);
+  const char* const end = inspection.inspect(dictionary.at_);
+  if (end == nullptr) return refuse(inspection.fault());
+  const std::string_view encoded(dictionary.at_, static_cast<std::size_t>(end - dictionary.at_));
+  if (encoded.size() > std::numeric_limits<std::uint32_t>::max()) return refuse("it is over 4 GiB");
+  if (!inspection.mayHaveEqualKeys()) return Payload(encoded);
   std::string rewritten;
   rewritten.reserve(encoded.size());
   MessagePackWriter writer(rewritten);

@@ -10,6 +10,7 @@
 #include <utility>
 
 #include "base/Error.h"
+#include "base/MessagePackForm.h"
 #include "base/Value.h"
 
 namespace quarvel {
@@ -28,8 +29,19 @@ class PayloadValue {
   explicit PayloadValue(const char* wellFormed) : at_(wellFormed) {}
 
   /// Extension values are dates: no other extension is allowed in a payload.
-  [[nodiscard]] Kind kind() const;
+  [[nodiscard]] Kind kind() const {
+    const MessagePackForm& form = MessagePackForm::at(at_);
+    // An unsigned integer is one only above the signed range.
+    if (form.kind == MessagePackForm::Kind::unsignedInteger) {
+      return form.fixed == 8 && at_[1] < 0 ? Kind::unsignedInteger : Kind::integer;
+    }
+    return static_cast<Kind>(form.kind);
+  }
   [[nodiscard]] bool isNil() const { return kind() == Kind::nil; }
+  [[nodiscard]] bool isInteger() const {
+    const MessagePackForm::Kind kind = MessagePackForm::at(at_).kind;
+    return kind == MessagePackForm::Kind::integer || kind == MessagePackForm::Kind::unsignedInteger;
+  }
 
   // Each is none when the value is of another kind. The integers accept every integer form whose
   // number fits.
@@ -37,26 +49,41 @@ class PayloadValue {
   [[nodiscard]] std::optional<std::int64_t> integer() const;
   [[nodiscard]] std::optional<std::uint64_t> unsignedInteger() const;
   [[nodiscard]] std::optional<double> real() const;
-  [[nodiscard]] std::optional<std::string_view> string() const;
-  [[nodiscard]] std::optional<std::string_view> bytes() const;
+  [[nodiscard]] std::optional<std::string_view> string() const {
+    return octets(MessagePackForm::Kind::string);
+  }
+  [[nodiscard]] std::optional<std::string_view> bytes() const {
+    return octets(MessagePackForm::Kind::bytes);
+  }
   [[nodiscard]] std::optional<Date> date() const;
 
   /// How many items a list, or entries a dictionary, holds; 0 for other kinds.
-  [[nodiscard]] std::size_t count() const;
+  [[nodiscard]] std::size_t count() const {
+    const MessagePackForm& form = MessagePackForm::at(at_);
+    return form.isContainer() ? static_cast<std::size_t>(form.length(at_)) : 0;
+  }
   /// For range-for over a list's values; empty for other kinds.
-  [[nodiscard]] Items items() const;
+  [[nodiscard]] inline Items items() const;
   /// For range-for over a dictionary's entries in the order received; empty for other kinds.
-  [[nodiscard]] Entries entries() const;
+  [[nodiscard]] inline Entries entries() const;
   /// A dictionary's value under a key; none for other kinds.
   [[nodiscard]] std::optional<PayloadValue> find(std::string_view key) const;
 
   /// The value's own MessagePack bytes.
-  [[nodiscard]] std::string_view encoded() const;
+  [[nodiscard]] std::string_view encoded() const {
+    return {at_, static_cast<std::size_t>(AfterMessagePack(at_) - at_)};
+  }
   /// The same value as a tree.
   [[nodiscard]] Value toValue() const;
   [[nodiscard]] Dictionary toDictionary() const;
 
  private:
+  [[nodiscard]] std::optional<std::string_view> octets(MessagePackForm::Kind kind) const {
+    const MessagePackForm& form = MessagePackForm::at(at_);
+    if (form.kind != kind) return std::nullopt;
+    return std::string_view(at_ + form.headBytes, static_cast<std::size_t>(form.length(at_)));
+  }
+
   friend class Payload;
   const char* at_;
 };
@@ -73,7 +100,10 @@ class PayloadValue::Items {
    public:
     Iterator(const char* at, std::size_t left) : at_(at), left_(left) {}
     PayloadValue operator*() const { return PayloadValue(at_); }
-    Iterator& operator++();
+    Iterator& operator++() {
+      if (--left_ > 0) at_ = AfterMessagePack(at_);
+      return *this;
+    }
     bool operator==(std::default_sentinel_t) const { return left_ == 0; }
 
    private:
@@ -93,9 +123,17 @@ class PayloadValue::Entries {
  public:
   class Iterator {
    public:
-    Iterator(const char* at, std::size_t left);
+    Iterator(const char* at, std::size_t left) : at_(at), left_(left) {
+      if (left_ > 0) value_ = AfterMessagePack(at_);
+    }
     PayloadEntry operator*() const { return {PayloadValue(at_), PayloadValue(value_)}; }
-    Iterator& operator++();
+    Iterator& operator++() {
+      if (--left_ > 0) {
+        at_ = AfterMessagePack(value_);
+        value_ = AfterMessagePack(at_);
+      }
+      return *this;
+    }
     bool operator==(std::default_sentinel_t) const { return left_ == 0; }
 
    private:
@@ -111,6 +149,16 @@ class PayloadValue::Entries {
   const char* first_;
   std::size_t count_;
 };
+
+PayloadValue::Items PayloadValue::items() const {
+  const MessagePackForm& form = MessagePackForm::at(at_);
+  return {at_ + form.headBytes, form.kind == MessagePackForm::Kind::list ? count() : 0};
+}
+
+PayloadValue::Entries PayloadValue::entries() const {
+  const MessagePackForm& form = MessagePackForm::at(at_);
+  return {at_ + form.headBytes, form.kind == MessagePackForm::Kind::dictionary ? count() : 0};
+}
 
 /// What a client sends: a dictionary as one immutable, shared block of its own MessagePack bytes.
 /// Its strings are UTF-8, its keys strings or integers, its dates have an RFC 3339 text, no key

@@ -6,9 +6,31 @@
 
 namespace quarvel {
 
+/// Whether a text is plain ASCII; a few instructions for the short texts that most are.
+[[nodiscard]] inline bool IsAscii(std::string_view text) {
+  constexpr std::uint64_t kHighBits = 0x8080808080808080U;
+  const auto load = [&text]<class Unsigned>(Unsigned bytes, std::size_t offset) -> std::uint64_t {
+    std::memcpy(&bytes, text.data() + offset, sizeof bytes);
+    return bytes;
+  };
+  const std::size_t size = text.size();
+  std::uint64_t all = 0;
+  // What the steps leave over is looked at again with the last step.
+  if (size >= 8) {
+    for (std::size_t at = 0; at + 8 < size; at += 8) all |= load(std::uint64_t{}, at);
+    all |= load(std::uint64_t{}, size - 8);
+  } else if (size >= 4) {
+    all = load(std::uint32_t{}, 0) | load(std::uint32_t{}, size - 4);
+  } else {
+    for (const char character : text) all |= static_cast<unsigned char>(character);
+  }
+  return (all & kHighBits) == 0;
+}
+
 /// Whether a text is well-formed UTF-8 (The Unicode Standard, table 3-7): no overlong forms, no
 /// surrogates, nothing above U+10FFFF.
 [[nodiscard]] inline bool IsUtf8(std::string_view text) {
+  if (IsAscii(text)) return true;
   const auto* at = reinterpret_cast<const unsigned char*>(text.data());
   const auto* const end = at + text.size();
   const auto continues = [&](std::ptrdiff_t offset, unsigned low = 0x80, unsigned high = 0xbf) {

@@ -3,6 +3,7 @@
 #include <chrono>
 #include <memory>
 #include <string_view>
+#include <utility>
 
 #include "base/Block.h"
 #include "base/ThreadAnnotations.h"
@@ -16,9 +17,10 @@ enum class QualityOfService { background = 9, utility = 17, userInteractive = 33
 /// touched only by blocks that run on it.
 ///
 /// An implementation guarantees:
-/// - `async` and `after` return at once, whatever the queue is doing; they never run the block
-///   themselves and never refuse it. They may be called from any thread, and from blocks.
-/// - A serial queue runs one block at a time, in the order of `async`; each sees the effects of the
+/// - `async`, `asyncBrief` and `after` return at once, whatever the queue is doing; they never run
+///   the block themselves and never refuse it. They may be called from any thread, and from blocks.
+/// - A serial queue runs one block at a time, in the order in which they came; each sees the
+/// effects of the
 ///   one before. A concurrent queue runs blocks in any order and several at once.
 /// - A block may wait in a `Condition`, or be held back inside a platform call: that delays its own
 ///   serial queue and nothing else.
@@ -33,6 +35,10 @@ class QUARVEL_CAPABILITY("queue") WorkQueue {
 
   [[nodiscard]] virtual std::string_view label() const = 0;
   virtual void async(Block block) = 0;
+  /// As `async`, for a block that takes microseconds and waits for nothing, except that it may be
+  /// held back for want of room. The platform may run it on a thread that must never wait, and then
+  /// lets it pass instead.
+  virtual void asyncBrief(Block block) { async(std::move(block)); }
   /// As `async`, `delay` from now. When the service ends in order, what still waits runs at once.
   virtual void after(std::chrono::milliseconds delay, Block block) = 0;
   /// Whether the calling thread is running a block of this queue.

@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <chrono>
 #include <cstdint>
+#include <functional>
 #include <utility>
 
 #include "Statistics/ZQReportingOhmrikUtility.h"
@@ -29,6 +30,9 @@ constexpr std::uint32_t kTraceSendMessage = 0x21042824;
 
 constexpr int kKilledStatus = 2;
 
+/// To so many sessions a message is routed in no time; a list may name a hundred thousand.
+constexpr std::size_t kFewTargets = 8;
+
 constexpr const char* kDefaultsNotification = "tarnwick.quarvel.reporting";
 constexpr const char* kDeviceName = "device_name";
 constexpr const char* kDisableReporting = "disable_reporting";
@@ -44,16 +48,25 @@ List ReporterIDList(const std::vector<ReporterID>& reporterIDs) {
   return {reporterIDs.begin(), reporterIDs.end()};
 }
 
-Value SessionDescriptions(const std::vector<std::shared_ptr<ZQReportingSession>>& sessions) {
-  List list;
-  for (const auto& session : sessions) list.emplace_back(session->description());
-  return list;
+/// As a log line prints the list of their descriptions. Written straight away: a client may have a
+/// hundred thousand, and every broadcast prints all of them.
+template <class Sessions, class Projection>
+std::string SessionDescriptions(const Sessions& sessions, Projection reporterID) {
+  std::string text = "[";
+  for (const auto& session : sessions) {
+    text += text.size() == 1 ? "\"" : ",\"";
+    ZQReportingSession::appendDescription(text, std::invoke(reporterID, session));
+    text += '"';
+  }
+  return text += ']';
 }
 
-Value SessionDescriptions(const ZQReportingServerInstance::SessionMap& sessions) {
-  List list;
-  for (const auto& [reporterID, session] : sessions) list.emplace_back(session->description());
-  return list;
+std::string SessionDescriptions(const std::vector<std::shared_ptr<ZQReportingSession>>& sessions) {
+  return SessionDescriptions(sessions, [](const auto& session) { return session->reporterID(); });
+}
+
+std::string SessionDescriptions(const ZQReportingServerInstance::SessionMap& sessions) {
+  return SessionDescriptions(sessions, &ZQReportingServerInstance::SessionMap::value_type::first);
 }
 
 /// Reports how long a client was connected. `instance` is null when it has gone already.
@@ -388,7 +401,7 @@ void ZQReportingServerInstance::destroyReportingSession(ReporterID reporterID, B
 void ZQReportingServerInstance::reporterID(ReporterID reporterID, DictionaryReply valid) {
   ZQ_FUNCTION("-[ZQReportingServerInstance reporterID:valid:]");
   ZQ_LOG(Scope(), debug, "validating reporter {}", reporterID);
-  ServerQueue().async([self = shared_from_this(), reporterID, valid = std::move(valid)] {
+  ServerQueue().asyncBrief([self = shared_from_this(), reporterID, valid = std::move(valid)] {
     AssertOnServerQueue();
     Dictionary validity = {{"reporterID", 0}, {"serviceType", kServiceTypeUnknown}};
     if (const auto session = self->findReportingSessionForID(reporterID, true)) {
@@ -428,8 +441,9 @@ void ZQReportingServerInstance::sendMessage(std::optional<Payload> payload, std:
       "-[ZQReportingServerInstance sendMessage:withCategory:andType:forReportingIDs:reply:]");
   ZQ_LOG(Scope(), debug, "sending message for reporter {}",
          reportingIDs ? Described(Value(ReporterIDList(*reportingIDs))) : kAbsentText);
-  ServerQueue().async([self = shared_from_this(), payload = std::move(payload), category, type,
-                       reportingIDs = std::move(reportingIDs), reply = std::move(reply)] {
+  const bool isBrief = reportingIDs && reportingIDs->size() <= kFewTargets;
+  Block route([self = shared_from_this(), payload = std::move(payload), category, type,
+               reportingIDs = std::move(reportingIDs), reply = std::move(reply)] {
     AssertOnServerQueue();
     EmitKernelTrace(kTraceSendMessage);
     const auto delegate = self->delegate_.lock();
@@ -443,15 +457,23 @@ void ZQReportingServerInstance::sendMessage(std::optional<Payload> payload, std:
     }
     reply(std::nullopt);
   });
+  if (isBrief) {
+    ServerQueue().asyncBrief(std::move(route));
+  } else {
+    ServerQueue().async(std::move(route));
+  }
 }
 
 void ZQReportingServerInstance::routeByIDs(const std::optional<Payload>& payload,
                                            std::uint32_t category, std::uint16_t type,
                                            const std::vector<ReporterID>& reportingIDs) {
   for (const ReporterID reporterID : reportingIDs) {
-    if (reporterID == 0) continue;
-    const auto session = findReportingSessionForID(reporterID, true);
-    if (session == nullptr) continue;
+    const auto session = reporterID == 0 ? nullptr : findReportingSessionForID(reporterID, true);
+    if (session == nullptr) {
+      CountAcceptedMessage();
+      CountDroppedMessage(MessageDrop::noSuchSession);
+      continue;
+    }
     ZQReportingVistrelBridge::handleEvent(payload, category, type, session->userInfo());
     ZQReportingOhmrikUtility::handleEvent(payload, category, type, session->userInfo());
     session->sendMessage(payload, category, type, nullptr);
@@ -467,13 +489,13 @@ void ZQReportingServerInstance::broadcast(ZQReportingServiceDelegateProtocol& de
   for (const auto& client : delegate.getAllClients()) {
     const auto& sessions = client->clientReportingSessionMap();
     ZQ_LOG(Scope(), standard, "sessions for client {} : {}", client->processIdentifier(),
-           Described(SessionDescriptions(sessions)));
+           SessionDescriptions(sessions));
     for (const auto& [reporterID, session] : sessions) {
       if (session->started()) active.push_back(session);
     }
   }
   ZQ_LOG(Scope(), standard, "active reporting sessions {} : {}", active.size(),
-         Described(SessionDescriptions(active)));
+         SessionDescriptions(active));
   if (active.empty()) {
     ZQ_LOG(Scope(), standard, "no active reporting sessions found, sending as standalone");
     ZQReportingSession::sendSingleMessage(payload, category, type, kServiceTypeStandalone,

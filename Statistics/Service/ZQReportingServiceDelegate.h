@@ -15,6 +15,7 @@
 #include "base/Date.h"
 #include "base/Mutex.h"
 #include "base/Value.h"
+#include "platform/Counters.h"
 #include "platform/Notifications.h"
 #include "platform/ServiceListener.h"
 
@@ -111,6 +112,7 @@ class ZQReportingServerInstance final
       QUARVEL_REQUIRES(serverQueueRole);
 
   const std::int32_t processIdentifier_;
+  const CountedAs counted_{Gauge::clients};
   const std::weak_ptr<ZQReportingServiceDelegateProtocol> delegate_;
 
   mutable Mutex clientMutex_;

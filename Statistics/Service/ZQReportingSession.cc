@@ -88,6 +88,19 @@ class SummaryText {
   std::unordered_map<std::string, std::size_t> index_;
 };
 
+Dictionary SummaryOf(const PayloadHistory& history, std::uint16_t serviceType) {
+  SummaryText texts;
+  texts.add(kSummaryKey, fmt::to_string(serviceType));
+  history.forEach(
+      [&texts](const MessageIdentity& identity, const Payload& payload) {
+        texts.add(identity.text(), JsonText(payload));
+      },
+      [&texts](const Dictionary& dictionary) {
+        for (const auto& [key, value] : dictionary) texts.add(key, Described(value));
+      });
+  return std::move(texts).dictionary();
+}
+
 /// A client's text as part of a file name: it can name no directory and leaves room for the rest.
 std::string FileNamePart(std::string text) {
   constexpr std::size_t kLongest = 128;
@@ -130,6 +143,19 @@ void SendOneMessage(const Payload& payload, std::uint32_t category, std::uint16_
   if (reply) reply(sent ? std::nullopt : std::optional(sent.error()));
 }
 
+void QueueSingleMessage(Payload payload, std::uint32_t category, std::uint16_t type,
+                        std::uint16_t serviceType, ZQReportingSession::SendReply reply) {
+  ZQ_FUNCTION("+[ZQReportingSession sendSingleMessage:category:type:serviceType:userInfo:reply:]");
+  const std::chrono::seconds delay(
+      serviceType == kServiceTypeAlarms ? RandomBelow(kLongestAlarmDelaySeconds + 1) : 0);
+  ZQ_LOG(Scope(), debug, "sending single message after delta {} for service {}", delay.count(),
+         serviceType);
+  BackgroundQueue().after(
+      delay, [payload = std::move(payload), category, type, serviceType, reply = std::move(reply)] {
+        SendOneMessage(payload, category, type, serviceType, reply);
+      });
+}
+
 }  // namespace
 
 std::shared_ptr<ZQReportingSession> ZQReportingSession::initWithID(
@@ -155,8 +181,8 @@ ZQReportingSession::~ZQReportingSession() {
   ZQ_LOG(Scope(), info, "deallocing this session {}", reporterID_);
 }
 
-std::string ZQReportingSession::description() const {
-  return fmt::format("<ZQReportingSession {}>", reporterID_);
+void ZQReportingSession::appendDescription(std::string& text, ReporterID reporterID) {
+  fmt::format_to(std::back_inserter(text), "<ZQReportingSession {}>", reporterID);
 }
 
 std::shared_ptr<PayloadHistory> ZQReportingSession::aggregatedPayloadData() const {
@@ -195,6 +221,7 @@ void ZQReportingSession::start() {
     return;
   }
   started_ = true;
+  countedAsStarted_.emplace(Gauge::startedSessions);
   setAggregatedPayloadData(std::make_shared<PayloadHistory>());
   EmitKernelTrace(kTraceStarted);
   if (shouldReportOrientation()) registerOrientationHandlers();
@@ -257,14 +284,36 @@ void ZQReportingSession::stop() {
   // something.
   ZQ_LOG(Scope(), debug, "ending session {}", reporterID_);
   EmitKernelTrace(kTraceStopping);
-  if (const auto summary = createSummaryEventForSession()) {
-    ZQ_LOG(Scope(), standard, "sending summary event for reporter {}", reporterID_);
-    sendMessage(Payload(*summary), kCategorySummary, kTypeSummary, true, nullptr);
-  }
+  sendSummary();
   relmReportingQueue_->async([self = shared_from_this()] { self->endAgent(); });
   setAggregatedPayloadData(nullptr);
   started_ = false;
+  countedAsStarted_.reset();
   transactionCompleteBlock_(true);
+}
+
+/// As one would expect, `createSummaryEventForSession` and `sendMessage`; but where no file shows
+/// when it is done, a history is condensed on the session's queue: a long one takes a second, and
+/// every client waits for this one.
+void ZQReportingSession::sendSummary() {
+  ZQ_FUNCTION("-[ZQReportingSession stop]");
+  const auto history = aggregatedPayloadData();
+  if (history == nullptr || history->empty()) return;
+  if (ZQReportingUtilityIsInternalBuild()) {
+    const Payload summary(*createSummaryEventForSession());
+    ZQ_LOG(Scope(), standard, "sending summary event for reporter {}", reporterID_);
+    sendMessage(summary, kCategorySummary, kTypeSummary, true, nullptr);
+    return;
+  }
+  ZQ_LOG(Scope(), standard, "sending summary event for reporter {}", reporterID_);
+  acceptMessage();
+  (void)nextIdentity(kCategorySummary, kTypeSummary);
+  EmitKernelTrace(kTraceMessageSent);
+  relmReportingQueue_->async(
+      [self = shared_from_this(), history, serviceType = serviceType_.load()] {
+        const Payload summary(SummaryOf(*history, serviceType));
+        self->deliver(EnrichPayload(summary), kCategorySummary, kTypeSummary, summary, true);
+      });
 }
 
 bool ZQReportingSession::shouldReportOrientation() const {
@@ -308,34 +357,24 @@ void ZQReportingSession::unregisterOrientationHandlers() {
 std::optional<Dictionary> ZQReportingSession::createSummaryEventForSession() {
   const auto history = aggregatedPayloadData();
   if (history == nullptr || history->empty()) return std::nullopt;
-  SummaryText texts;
-  texts.add(kSummaryKey, fmt::to_string(serviceType_.load()));
-  history->forEach([&texts](const PayloadHistory::Entry& entry) {
-    if (const auto* message = std::get_if<SentMessage>(&entry)) {
-      texts.add(message->messageID, JsonText(message->payload));
-    } else {
-      for (const auto& [key, value] : std::get<Dictionary>(entry)) texts.add(key, Described(value));
-    }
-  });
+  Dictionary summary = SummaryOf(*history, serviceType_);
   history->insertAtFront(userInfo_->copy());
   if (ZQReportingUtilityIsInternalBuild()) writeSummaryLogFile(*history);
-  return std::move(texts).dictionary();
+  return summary;
 }
 
 void ZQReportingSession::writeSummaryLogFile(const PayloadHistory& history) const {
   ZQ_FUNCTION("-[ZQReportingSession createSummaryEventForSession]");
   PrettyJsonWriter writer;
   writer.beginList();
-  history.forEach([&writer](const PayloadHistory::Entry& entry) {
-    if (const auto* message = std::get_if<SentMessage>(&entry)) {
-      writer.beginDictionary();
-      writer.key(message->messageID);
-      writer.value(message->payload.root());
-      writer.endDictionary();
-    } else {
-      writer.value(std::get<Dictionary>(entry));
-    }
-  });
+  history.forEach(
+      [&writer](const MessageIdentity& identity, const Payload& payload) {
+        writer.beginDictionary();
+        writer.key(identity.text());
+        writer.value(payload.root());
+        writer.endDictionary();
+      },
+      [&writer](const Dictionary& dictionary) { writer.value(dictionary); });
   writer.endList();
   const Result<std::string> json = writer.finish();
   if (!json) {
@@ -368,27 +407,40 @@ void ZQReportingSession::endAgent() {
   relmReportingSession_ = nullptr;
 }
 
+std::string MessageIdentity::text() const {
+  const CategoryNamePieces pieces = ZQReportingUtilityCategoryNamePieces(category);
+  return fmt::format("{}{}_{}_{}", pieces.component, pieces.kind,
+                     ZQReportingUtilityTypeNameText(type), number);
+}
+
+MessageIdentity ZQReportingSession::nextIdentity(std::uint32_t category, std::uint16_t type) {
+  const CategoryNamePieces pieces = ZQReportingUtilityCategoryNamePieces(category);
+  const MessageName name{pieces.component, pieces.kind, ZQReportingUtilityTypeNameText(type)};
+  auto count =
+      std::ranges::find(messageCounts_, name, &std::pair<MessageName, std::uint64_t>::first);
+  if (count == messageCounts_.end()) count = messageCounts_.emplace(count, name, 0);
+  return {++count->second, category, type};
+}
+
 std::string ZQReportingSession::messageIdForCategory(std::uint32_t category, std::uint16_t type) {
-  std::string id =
-      ZQReportingUtilityCategoryName(category) + '_' + ZQReportingUtilityTypeName(type);
-  const std::uint64_t count = ++messageTypeCounts_[id];
-  id += '_';
-  id += fmt::to_string(count);
-  return id;
+  return nextIdentity(category, type).text();
+}
+
+void ZQReportingSession::acceptMessage() const {
+  ZQ_FUNCTION("-[ZQReportingSession sendMessage:category:type:sync:reply:]");
+  ZQ_LOG(Scope(), debug, "sending message for session owned by {}", reporterID_);
+  CountAcceptedMessage();
 }
 
 void ZQReportingSession::sendMessage(const std::optional<Payload>& payload, std::uint32_t category,
                                      std::uint16_t type, bool /*sync*/, const SendReply& reply) {
-  ZQ_FUNCTION("-[ZQReportingSession sendMessage:category:type:sync:reply:]");
-  ZQ_LOG(Scope(), debug, "sending message for session owned by {}", reporterID_);
+  acceptMessage();
   const Payload original = payload.value_or(Payload());
   const Payload enriched = EnrichPayload(original);
-  std::string messageID = messageIdForCategory(category, type);
-  if (const auto history = aggregatedPayloadData()) {
-    history->append(SentMessage{std::move(messageID), enriched});
-  }
+  const MessageIdentity identity = nextIdentity(category, type);
+  if (const auto history = aggregatedPayloadData()) history->append(identity, enriched);
   EmitKernelTrace(kTraceMessageSent);
-  relmReportingQueue_->async(
+  relmReportingQueue_->asyncBrief(
       [self = shared_from_this(), enriched, category, type, original, wasStarted = started_] {
         self->deliver(enriched, category, type, original, wasStarted);
       });
@@ -406,14 +458,16 @@ void ZQReportingSession::deliver(const Payload& enriched, std::uint32_t category
   relmReportingQueue_->assertCurrent();
   if (!wasStarted) {
     ZQ_LOG(Scope(), debug, "session not started, will send as a single message");
-    sendSingleMessage(enriched, category, type, serviceType_, userInfo_->copy(), nullptr);
+    QueueSingleMessage(enriched, category, type, serviceType_, nullptr);
     return;
   }
   if (serviceType_ == kServiceTypeTest) {
+    CountDroppedMessage(MessageDrop::testServiceType);
     ZQ_LOG(Scope(), info, "transactions aren't allowed on this platform");
     return;
   }
   if (relmReportingSession_ == nullptr) {
+    CountDroppedMessage(MessageDrop::noAgentSession);
     ZQ_LOG(Scope(), error, "{}", "No valid RelmReportingSession");
     return;
   }
@@ -429,15 +483,8 @@ void ZQReportingSession::sendSingleMessage(const std::optional<Payload>& payload
                                            std::uint16_t serviceType,
                                            const std::optional<Dictionary>& /*userInfo*/,
                                            SendReply reply) {
-  ZQ_FUNCTION("+[ZQReportingSession sendSingleMessage:category:type:serviceType:userInfo:reply:]");
-  const std::chrono::seconds delay(
-      serviceType == kServiceTypeAlarms ? RandomBelow(kLongestAlarmDelaySeconds + 1) : 0);
-  ZQ_LOG(Scope(), debug, "sending single message after delta {} for service {}", delay.count(),
-         serviceType);
-  BackgroundQueue().after(delay, [payload = payload.value_or(Payload()), category, type,
-                                  serviceType, reply = std::move(reply)] {
-    SendOneMessage(payload, category, type, serviceType, reply);
-  });
+  CountAcceptedMessage();
+  QueueSingleMessage(payload.value_or(Payload()), category, type, serviceType, std::move(reply));
 }
 
 }  // namespace quarvel

@@ -1,12 +1,14 @@
 #pragma once
 
+#include <array>
 #include <atomic>
 #include <cstdint>
 #include <functional>
 #include <memory>
 #include <optional>
 #include <string>
-#include <unordered_map>
+#include <string_view>
+#include <utility>
 #include <vector>
 
 #include "Statistics/Service/PayloadHistory.h"
@@ -17,6 +19,7 @@
 #include "base/Error.h"
 #include "base/Mutex.h"
 #include "base/Payload.h"
+#include "platform/Counters.h"
 #include "platform/RelmReporting.h"
 #include "platform/Reply.h"
 #include "platform/WorkQueue.h"
@@ -121,13 +124,20 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
     transactionCompleteBlock_ = std::move(block);
   }
   /// For log lines: "<ZQReportingSession 7>".
-  [[nodiscard]] std::string description() const;
+  static void appendDescription(std::string& text, ReporterID reporterID);
 
  private:
+  /// The pieces of a category's and a type's names.
+  using MessageName = std::array<std::string_view, 3>;
+
+  [[nodiscard]] MessageIdentity nextIdentity(std::uint32_t category, std::uint16_t type)
+      QUARVEL_REQUIRES(serverQueueRole);
   void setUpAgent(const SharedDictionary& userInfo, const std::string& serviceName,
                   bool backendFound);
   void deliver(const Payload& enriched, std::uint32_t category, std::uint16_t type,
                const Payload& original, bool wasStarted);
+  void acceptMessage() const;
+  void sendSummary() QUARVEL_REQUIRES(serverQueueRole);
   void endAgent();
   void registerOrientationHandlers() QUARVEL_REQUIRES(serverQueueRole);
   void unregisterOrientationHandlers() QUARVEL_REQUIRES(serverQueueRole);
@@ -136,11 +146,14 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
 
   const ReporterID reporterID_;
   const std::vector<std::int32_t> processIdentifiers_;
+  const CountedAs counted_{Gauge::sessions};
 
+  std::optional<CountedAs> countedAsStarted_ QUARVEL_GUARDED_BY(serverQueueRole);
   bool started_ QUARVEL_GUARDED_BY(serverQueueRole) = false;
   std::string serviceName_ QUARVEL_GUARDED_BY(serverQueueRole) = "unknown";
-  /// Counts run on across a stop and a new start.
-  std::unordered_map<std::string, std::uint64_t> messageTypeCounts_
+  /// Counts run on across a stop and a new start. A session has messages of few names, and there
+  /// are few hundred in all.
+  std::vector<std::pair<MessageName, std::uint64_t>> messageCounts_
       QUARVEL_GUARDED_BY(serverQueueRole);
   std::optional<DriverSnapShot> driverSnapShot_ QUARVEL_GUARDED_BY(serverQueueRole);
   std::optional<std::string> orientationCallbackID_ QUARVEL_GUARDED_BY(serverQueueRole);

@@ -111,9 +111,9 @@ TEST_F(InternalBuild, OrientationChangesAreInTheHistoryToTheMillisecond) {
     owner.simulation.orientation.turnUI(Orientation::portrait);
     owner.simulation.runFor(0s);
     std::vector<Dictionary> entries;
-    owner.session->aggregatedPayloadData()->forEach([&](const PayloadHistory::Entry& entry) {
-      entries.push_back(std::get<Dictionary>(entry));
-    });
+    owner.session->aggregatedPayloadData()->forEach(
+        [](const MessageIdentity&, const Payload&) { ADD_FAILURE(); },
+        [&](const Dictionary& dictionary) { entries.push_back(dictionary); });
     EXPECT_THAT(
         entries,
         ElementsAre(

@@ -129,6 +129,31 @@ TEST(Json, WritesWhatItLacksAsText) {
   EXPECT_EQ(JsonText(Payload(values)), expected) << "both forms read alike";
 }
 
+TEST(Json, IsReadBackAsWhatItWas) {
+  List values;
+  for (const double number :
+       {0.0, -0.0, 48000.0, -0.5, 0.1 + 0.2, 11.6, 0.0001, -0.00012, 123456.7891, 999999999.9999,
+        1e9, 1e15, 1e16, -1e300, 5e-324, std::numeric_limits<double>::max(), 1.0 / 3}) {
+    values.emplace_back(number);
+  }
+  values.emplace_back(std::numeric_limits<std::int64_t>::min());
+  // Every character that needs an escape, at every place around the steps of eight.
+  for (std::size_t length = 0; length <= 20; ++length) {
+    for (std::size_t at = 0; at < length; ++at) {
+      for (const char character : {'\0', '\x1f', ' ', '"', '\\', '\x7f', '\n'}) {
+        std::string text(length, '!');
+        text[at] = character;
+        values.emplace_back(std::move(text));
+      }
+    }
+  }
+  values.emplace_back(std::string(5000, '"') + "\u20ac\u20ac\u20ac");
+  const Result<Value> read = ValueFromJson(JsonText(Value(values)));
+  ASSERT_TRUE(read);
+  EXPECT_EQ(read.value(), Value(values));
+  EXPECT_TRUE(std::signbit(*(*read.value().list())[1].real()));
+}
+
 TEST(Json, ComesBackAsATree) {
   const std::string text =
       R"({"a":[1,-2,18446744073709551615,2.5,true,null,{"b":"\u20ac"}],"c":{}})";

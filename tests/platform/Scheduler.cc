@@ -110,6 +110,7 @@ void Scheduler::spawn(std::string name, Block body) {
 std::shared_ptr<Scheduler::Queue> Scheduler::makeQueue(std::string name, bool serial) {
   auto queue = std::make_shared<Queue>(std::move(name), serial);
   queues_.push_back(queue);
+  queue->number = queues_.size();
   return queue;
 }
 
@@ -128,6 +129,11 @@ void Scheduler::after(Duration delay, Block action) {
 
 bool Scheduler::isCurrent(const Queue& queue) const {
   return currentThread != nullptr && currentThread->job.queue.get() == &queue;
+}
+
+std::size_t Scheduler::currentQueue() const {
+  const Queue* queue = currentThread == nullptr ? nullptr : currentThread->job.queue.get();
+  return queue == nullptr ? 0 : queue->number;
 }
 
 void Scheduler::mayYield() {

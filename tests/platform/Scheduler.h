@@ -35,6 +35,7 @@ class Scheduler {
   struct Queue {
     Queue(std::string label, bool isSerial) : name(std::move(label)), serial(isSerial) {}
     std::string name;
+    std::size_t number = 0;  // in the order of their making
     bool serial;
     bool busy = false;         // serial: a block is ready or running
     std::deque<Block> blocks;  // serial: those behind it
@@ -74,6 +75,8 @@ class Scheduler {
   /// Runs `action` once nobody is ready and the time has come. It must not wait.
   void after(Duration delay, Block action);
   [[nodiscard]] bool isCurrent(const Queue& queue) const;
+  /// The number of the queue whose block is running; 0 when none is.
+  [[nodiscard]] std::size_t currentQueue() const;
   /// A point where another thread may go on instead of this one. Never while a `Mutex` is held.
   void mayYield();
   /// No simulated thread runs any more: the process has exited or the simulation is ending.

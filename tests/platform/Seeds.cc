@@ -13,8 +13,11 @@ bool SeedRange::Iterator::operator==(std::default_sentinel_t) const {
 SeedRange Seeds() {
   constexpr std::size_t kByDefault = 20;
   if (const char* one = std::getenv("QUARVEL_SEED")) return {std::strtoull(one, nullptr, 10), 1};
+  constexpr std::size_t kByNight = 25;
   const char* count = std::getenv("QUARVEL_SEEDS");
-  return {1, count == nullptr ? kByDefault : std::strtoul(count, nullptr, 10)};
+  if (count == nullptr) return {1, kByDefault};
+  const std::size_t times = std::getenv("QUARVEL_NIGHTLY") == nullptr ? 1 : kByNight;
+  return {1, std::strtoul(count, nullptr, 10) * times};
 }
 
 }  // namespace quarvel

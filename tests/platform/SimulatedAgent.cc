@@ -30,6 +30,7 @@ class SimulatedAgentSession final : public RelmReportingSession {
   void startConfiguration(ConfigurationCompletion completion) override {
     ++record_.configurations;
     if (!Agent().answers) return;
+    if (Agent().backends) record_.foundAfter = Agent().answersAfter;
     Simulation& simulation = Simulation::current();
     simulation.scheduler.after(Agent().answersAfter, [&simulation, found = Agent().backends,
                                                       completion = std::move(completion)] {
@@ -42,6 +43,7 @@ class SimulatedAgentSession final : public RelmReportingSession {
     AwaitRoom();
     Simulation::current().note(
         fmt::format("agent {} message {:#x} {:#x}", number_, category, type));
+    offer({category, type, payload, Simulation::current().elapsed()});
     if (Agent().sendError) return *Agent().sendError;
     record_.messages.push_back({category, type, payload, Simulation::current().elapsed()});
     return Success();
@@ -49,6 +51,7 @@ class SimulatedAgentSession final : public RelmReportingSession {
 
   void flushMessages(FlushCompletion completion) override {
     Simulation& simulation = Simulation::current();
+    if (simulation.tells(Lie::flushLost)) return;
     simulation.note(fmt::format("agent {} flush", number_));
     record_.flushes.push_back(simulation.elapsed());
     simulation.spawn("agent", [completion = std::move(completion), error = Agent().flushError] {
@@ -61,6 +64,16 @@ class SimulatedAgentSession final : public RelmReportingSession {
   }
 
  private:
+  void offer(const SimulatedAgent::Message& message) {
+    Simulation& simulation = Simulation::current();
+    if (simulation.tells(Lie::messageLost)) return;
+    record_.offered.push_back(message);
+    if (simulation.tells(Lie::messageTwice)) record_.offered.push_back(message);
+    if (record_.offered.size() > 1 && simulation.tells(Lie::messagesSwapped)) {
+      std::swap(record_.offered.back(), record_.offered.front());
+    }
+  }
+
   SimulatedAgent::Session& record_;
   const std::size_t number_;
 };
@@ -80,6 +93,7 @@ std::shared_ptr<RelmReportingSession> RelmReporting::createAgentSession(
   record.info = sessionInfo;
   record.userInfo = userInfo;
   record.frameworksToCheck = frameworksToCheck;
+  record.queue = Simulation::current().scheduler.currentQueue();
   Simulation::current().note(fmt::format("agent {} created", Agent().sessions.size()));
   return std::make_shared<SimulatedAgentSession>(record, Agent().sessions.size());
 }
@@ -89,9 +103,14 @@ Outcome RelmReporting::sendOneMessage(const Dictionary& sessionInfo, const Dicti
                                       const Payload& payload) {
   AwaitRoom();
   Simulation::current().note(fmt::format("agent single {:#x} {:#x}", category, type));
-  if (Agent().singleMessageError) return *Agent().singleMessageError;
-  Agent().singleMessages.push_back(
-      {sessionInfo, userInfo, {category, type, payload, Simulation::current().elapsed()}});
+  SimulatedAgent::SingleMessage message{
+      sessionInfo, userInfo, {category, type, payload, Simulation::current().elapsed()}};
+  if (Simulation::current().tells(Lie::singleMessageLost)) return Success();
+  if (Agent().singleMessageError) {
+    Agent().refusedSingleMessages.push_back(std::move(message));
+    return *Agent().singleMessageError;
+  }
+  Agent().singleMessages.push_back(std::move(message));
   return Success();
 }
 

@@ -25,7 +25,13 @@ struct SimulatedAgent {
     Dictionary userInfo;
     std::vector<std::string> frameworksToCheck;
     std::vector<Message> messages;
+    /// Also those that were refused.
+    std::vector<Message> offered;
     std::size_t configurations = 0;
+    /// When a configuration found backends, after how long.
+    std::optional<Scheduler::Duration> foundAfter;
+    /// The number of the queue on which the session was made.
+    std::size_t queue = 0;
     std::vector<Scheduler::Duration> flushes;
     bool released = false;
   };
@@ -53,6 +59,7 @@ struct SimulatedAgent {
   std::vector<std::optional<RelmReportingToken>> tokenParents;
   std::deque<Session> sessions;  // references stay valid
   std::vector<SingleMessage> singleMessages;
+  std::vector<SingleMessage> refusedSingleMessages;
 };
 
 }  // namespace quarvel

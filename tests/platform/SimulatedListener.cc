@@ -16,7 +16,9 @@ class RecordingReply final : public ReplySink {
   explicit RecordingReply(std::shared_ptr<RecordedCall> call) : call_(std::move(call)) {}
 
   void result(Value value) override {
+    if (Simulation::current().tells(Lie::replyLost)) return;
     record(JsonText(value));
+    if (Simulation::current().tells(Lie::replyTwice)) call_->results.push_back(value);
     call_->results.push_back(std::move(value));
   }
   void error(const Error& error) override {
@@ -38,8 +40,9 @@ class RecordingReply final : public ReplySink {
 class SimulatedConnection final : public ClientConnection,
                                   public std::enable_shared_from_this<SimulatedConnection> {
  public:
-  explicit SimulatedConnection(std::int32_t processIdentifier)
+  SimulatedConnection(std::int32_t processIdentifier, std::size_t client)
       : processIdentifier_(processIdentifier),
+        client_(client),
         queue_(Simulation::current().scheduler.makeQueue("connection", true)) {}
 
   [[nodiscard]] std::int32_t processIdentifier() const override { return processIdentifier_; }
@@ -76,6 +79,7 @@ class SimulatedConnection final : public ClientConnection,
 
   void receive(const std::shared_ptr<RecordedCall>& call, const std::string& arguments) {
     if (object_ == nullptr) return;
+    note(Arrival::Kind::call, call);
     const ExportedMethod* method = interface_->find(call->method);
     if (method == nullptr) {
       call->fault = "unknown method " + call->method;
@@ -89,10 +93,16 @@ class SimulatedConnection final : public ClientConnection,
   void end(bool interrupted) {
     const auto interruptionHandler = std::exchange(interruptionHandler_, nullptr);
     const auto invalidationHandler = std::exchange(invalidationHandler_, nullptr);
+    if (invalidationHandler) note(Arrival::Kind::end);
     if (interrupted && interruptionHandler) interruptionHandler();
     if (invalidationHandler) invalidationHandler();
+    if (Simulation::current().tells(Lie::connectionKept)) return;
     object_.reset();
     Simulation::current().listener.drop(*this);
+  }
+
+  void note(Arrival::Kind kind, std::shared_ptr<const RecordedCall> call = nullptr) const {
+    Simulation::current().arrivals.push_back({kind, client_, std::move(call)});
   }
 
   const std::shared_ptr<std::weak_ptr<ExportedObject>> observedObject =
@@ -100,6 +110,7 @@ class SimulatedConnection final : public ClientConnection,
 
  private:
   const std::int32_t processIdentifier_;
+  const std::size_t client_;
   const std::shared_ptr<Scheduler::Queue> queue_;
   const ExportedInterface* interface_ = nullptr;
   std::shared_ptr<ExportedObject> object_;
@@ -117,6 +128,7 @@ SimulatedClient::SimulatedClient(const std::shared_ptr<SimulatedConnection>& con
 SimulatedClient::Call SimulatedClient::call(std::string method, const List& arguments) {
   auto call = std::make_shared<RecordedCall>();
   call->method = std::move(method);
+  call->arguments = arguments;
   std::string encoded;
   MessagePackWriter(encoded).value(Value(arguments));
   if (const auto connection = connection_.lock()) {
@@ -152,11 +164,12 @@ std::weak_ptr<ClientConnection> SimulatedClient::connection() const {
 }
 
 SimulatedClient SimulatedListener::connect(std::int32_t processIdentifier) {
-  const auto connection =
-      connections_.emplace_back(std::make_shared<SimulatedConnection>(processIdentifier));
+  const auto connection = connections_.emplace_back(
+      std::make_shared<SimulatedConnection>(processIdentifier, clients_++));
   Scheduler& scheduler = Simulation::current().scheduler;
   if (queue_ == nullptr) queue_ = scheduler.makeQueue("listener", true);
   scheduler.enqueue(queue_, [this, connection] {
+    connection->note(Arrival::Kind::connection);
     if (!resumed_ || !delegate_->shouldAcceptNewConnection(*this, connection)) drop(*connection);
   });
   return SimulatedClient(connection);

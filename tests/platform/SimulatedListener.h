@@ -18,12 +18,22 @@ class SimulatedConnection;
 /// One call of a client and everything that was answered to it, later answers too.
 struct RecordedCall {
   std::string method;
+  List arguments;
   std::vector<Value> results;
   std::vector<Error> errors;
   /// When each answer came.
   std::vector<Scheduler::Duration> answeredAt;
   /// Why the call did not reach the exported object.
   std::optional<std::string> fault;
+};
+
+/// Something that came to the service, noted at the moment at which its work is queued: what comes
+/// first is carried out first.
+struct Arrival {
+  enum class Kind : std::uint8_t { connection, call, end, notification };
+  Kind kind;
+  std::size_t client = 0;  // in the order of their connecting; not of a notification
+  std::shared_ptr<const RecordedCall> call;  // of a call
 };
 
 /// A process that calls the service: the far end of a connection. Its calls are made on the
@@ -73,6 +83,7 @@ class SimulatedListener final : public ServiceListener {
   std::shared_ptr<ServiceListenerDelegate> delegate_;
   std::shared_ptr<Scheduler::Queue> queue_;
   std::vector<std::shared_ptr<SimulatedConnection>> connections_;
+  std::size_t clients_ = 0;
   bool resumed_ = false;
 };
 

@@ -15,6 +15,7 @@ void SimulatedNotifications::post(std::string_view name) {
   for (const auto& registration : registrations_) {
     if (registration->name != name || registration->pending) continue;
     registration->pending = true;
+    Simulation::current().arrivals.push_back({Arrival::Kind::notification, 0, nullptr});
     deliver(registration, registration->token);
   }
 }

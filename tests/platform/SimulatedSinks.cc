@@ -11,7 +11,7 @@ namespace quarvel {
 void VistrelSendEventLazy(std::string_view name, const std::function<Payload()>& payload) {
   Simulation& simulation = Simulation::current();
   simulation.note(fmt::format("vistrel {}", name));
-  if (!simulation.vistrel.wanted) return;
+  if (!simulation.vistrel.wanted || simulation.tells(Lie::eventLost)) return;
   simulation.vistrel.events.push_back({std::string(name), payload(), simulation.elapsed()});
 }
 

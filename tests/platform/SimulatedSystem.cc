@@ -124,6 +124,8 @@ Outcome CreateDirectory(std::string_view path, std::uint32_t permissions) {
 
 Outcome WriteFileAtomically(std::string_view path, std::string_view content) {
   SimulatedFiles& files = Simulation::current().files;
+  const bool cut = Simulation::current().tells(Lie::historyCut);
+  files.writes.emplace_back(path, cut ? content.substr(0, content.size() / 2) : content);
   if (files.writeError) return *files.writeError;
   files.files.insert_or_assign(std::string(path), content);
   return Success();

@@ -60,6 +60,8 @@ class SimulatedOrientation {
 struct SimulatedFiles {
   /// Path to content.
   std::map<std::string, std::string, std::less<>> files;
+  /// Path and content of every write in order, also of those that failed.
+  std::vector<std::pair<std::string, std::string>> writes;
   /// Path to permissions.
   std::map<std::string, std::uint32_t, std::less<>> directories;
 

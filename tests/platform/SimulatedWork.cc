@@ -113,8 +113,9 @@ class SimulatedCondition final : public Condition {
 
 std::unique_ptr<WorkQueue> CreateSerialQueue(std::string_view label,
                                              QualityOfService qualityOfService) {
-  Simulation::current().queues.push_back({std::string(label), qualityOfService});
-  return std::make_unique<SimulatedWorkQueue>(TheScheduler().makeQueue(std::string(label), true));
+  auto queue = TheScheduler().makeQueue(std::string(label), true);
+  Simulation::current().queues.push_back({std::string(label), qualityOfService, queue->number});
+  return std::make_unique<SimulatedWorkQueue>(std::move(queue));
 }
 
 WorkQueue& BackgroundQueue() {

@@ -15,6 +15,7 @@
 #include "tests/platform/Scheduler.h"
 #include "tests/platform/Seeds.h"
 #include "tests/platform/SimulatedAgent.h"
+#include "tests/platform/SimulatedCounters.h"
 #include "tests/platform/SimulatedListener.h"
 #include "tests/platform/SimulatedLog.h"
 #include "tests/platform/SimulatedSettings.h"
@@ -40,6 +41,22 @@ class Journal {
   std::vector<std::string> lines_;
 };
 
+/// What the simulated platform can be told to get wrong, once, so that a test can show that its
+/// checks would notice.
+enum class Lie : std::uint8_t {
+  none,
+  messageLost,
+  messageTwice,
+  messagesSwapped,
+  singleMessageLost,
+  flushLost,
+  replyLost,
+  replyTwice,
+  historyCut,
+  eventLost,
+  connectionKept,
+};
+
 /// The simulated platform, one a test: stands behind every header of `platform/` from its
 /// construction to its destruction. What is declared after it in a test is destroyed before it, so
 /// a thread that may still wait at the end must share what it uses: it unwinds at the destruction.
@@ -51,6 +68,7 @@ class Simulation {
   struct CreatedQueue {
     std::string label;
     QualityOfService qualityOfService;
+    std::size_t number = 0;
   };
 
   explicit Simulation(std::uint64_t seed);
@@ -65,6 +83,12 @@ class Simulation {
   void spawn(std::string name, Block body) { scheduler.spawn(std::move(name), std::move(body)); }
   [[nodiscard]] Scheduler::Duration elapsed() const { return scheduler.elapsed(); }
 
+  /// For recorders: whether to tell `what`, which is told once.
+  [[nodiscard]] bool tells(Lie what) {
+    if (lie != what) return false;
+    lie = Lie::none;
+    return true;
+  }
   /// For recorders: notes a line unless the process is over.
   void note(std::string line) {
     if (!scheduler.stopped()) journal.note(std::move(line));
@@ -72,12 +96,16 @@ class Simulation {
 
   /// Switch: waits in a `Condition` may end without a signal, at a moment chosen by the seed.
   bool spuriousWakeUps = false;
+  /// Switch: what the platform gets wrong.
+  Lie lie = Lie::none;
   /// How far local time is ahead of UTC.
   std::chrono::seconds localOffset{3600};
   std::vector<CreatedQueue> queues;
   std::map<std::string, std::variant<bool, std::int64_t>, std::less<>> deviceProperties;
 
   Journal journal;
+  SimulatedCounters counters;
+  std::vector<Arrival> arrivals;
   SimulatedLog log;
   std::vector<TraceEvent> trace;
   SimulatedRandom random;

@@ -1,5 +1,6 @@
 #include "platform/linux/work/BlockingScope.h"
 
+#include "platform/linux/work/HelpScope.h"
 #include "platform/linux/work/Pool.h"
 
 namespace quarvel {
@@ -10,6 +11,13 @@ BlockingScope::BlockingScope() {
 
 BlockingScope::~BlockingScope() {
   Pool::endBlocking();
+}
+
+bool BlockingScope::isAllowed() {
+  HelpScope* const help = HelpScope::current();
+  if (help == nullptr) return true;
+  help->exhaust();
+  return false;
 }
 
 }  // namespace quarvel

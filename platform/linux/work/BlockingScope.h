@@ -12,6 +12,9 @@ class BlockingScope {
  public:
   BlockingScope();
   ~BlockingScope();
+  /// Whether the calling block may be held back at all. When not, the caller does without: it is
+  /// told once, since no further block is then run where this one is.
+  [[nodiscard]] static bool isAllowed();
   BlockingScope(const BlockingScope&) = delete;
   BlockingScope& operator=(const BlockingScope&) = delete;
 };

@@ -9,10 +9,13 @@
 
 namespace quarvel {
 
+class HelpScope;
+
 /// A block with the voucher under which it was queued.
 struct WorkItem {
   VoucherHold voucher;
   Block block;
+  bool isBrief = false;
 
   /// Runs the block, destroys it, and only then lets the voucher go.
   void run() {
@@ -40,6 +43,8 @@ class Lane : public std::enable_shared_from_this<Lane> {
   /// Runs a bounded number of blocks, so that other queues get their turn. Returns whether the lane
   /// wants another turn. On a pool's thread, once for each turn asked for.
   [[nodiscard]] virtual bool takeTurn() = 0;
+  /// The same on a thread that helps, as long as blocks are brief and `help` is not exhausted.
+  [[nodiscard]] virtual bool takeBriefTurn(HelpScope& help) = 0;
 
  private:
   const std::string_view label_;

@@ -25,11 +25,13 @@ thread_local Worker worker;
 }  // namespace
 
 Pool& Pool::of(QualityOfService qualityOfService) {
-  // Never destroyed: their threads outlive the end of main. The first class serves one queue only.
-  static Pool& userInteractive = *new Pool("user-interactive", 0, 1);
+  // Never destroyed: their threads outlive the end of main. The first class serves one queue, and
+  // the watchdog that looks whether that one moves. Many sessions may wait for their backends at
+  // once; what is held back on the background queue all waits for the same, the store's room.
+  static Pool& userInteractive = *new Pool("user-interactive", 0, 1, 8);
   static Pool& utility =
-      *new Pool("utility", 5, std::max<std::size_t>(2, std::thread::hardware_concurrency()));
-  static Pool& background = *new Pool("background", 10, 2);
+      *new Pool("utility", 5, std::max<std::size_t>(2, std::thread::hardware_concurrency()), 2048);
+  static Pool& background = *new Pool("background", 10, 2, 8);
   switch (qualityOfService) {
     case QualityOfService::background:
       return background;
@@ -41,8 +43,8 @@ Pool& Pool::of(QualityOfService qualityOfService) {
   return userInteractive;
 }
 
-Pool::Pool(std::string_view name, int nice, std::size_t width)
-    : name_(name), nice_(nice), width_(width) {}
+Pool::Pool(std::string_view name, int nice, std::size_t width, std::size_t mostHeldBack)
+    : name_(name), nice_(nice), width_(width), mostHeldBack_(mostHeldBack) {}
 
 void Pool::submit(std::shared_ptr<Lane> lane) {
   ActivityBegan();
@@ -57,6 +59,7 @@ void Pool::submit(std::shared_ptr<Lane> lane) {
 
 Pool::Help Pool::helpNeeded() {
   if (ready_.empty() || active_ >= width_) return Help::none;
+  if (idle_ == 0 && blocked_ > mostHeldBack_) return Help::none;
   ++active_;
   if (idle_ == 0) return Help::startThread;
   --idle_;
@@ -95,6 +98,13 @@ void Pool::startThread() {
 
 const Lane* Pool::currentLane() {
   return worker.lane;
+}
+
+bool Pool::takeTurnHere(Lane& lane, HelpScope& help) {
+  worker.lane = &lane;
+  const bool wantsAnother = lane.takeBriefTurn(help);
+  worker.lane = nullptr;
+  return wantsAnother;
 }
 
 void Pool::work() {

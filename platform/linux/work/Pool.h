@@ -21,8 +21,9 @@ class Pool {
  public:
   [[nodiscard]] static Pool& of(QualityOfService qualityOfService);
 
-  /// `width`: how many threads run blocks at once.
-  Pool(std::string_view name, int nice, std::size_t width);
+  /// `width`: how many threads run blocks at once. `mostHeldBack`: how many blocks that are held
+  /// back get another thread lent for theirs; beyond, work waits for one of them.
+  Pool(std::string_view name, int nice, std::size_t width, std::size_t mostHeldBack);
   Pool(const Pool&) = delete;
   Pool& operator=(const Pool&) = delete;
 
@@ -33,6 +34,10 @@ class Pool {
   /// Starts a thread that has been counted already. On the keeper's thread, whose nice value no
   /// pool undercuts.
   void startThread() QUARVEL_EXCLUDES(mutex_);
+
+  /// Gives the lane its turn on the calling thread, which belongs to no pool. Returns whether the
+  /// lane wants another turn.
+  [[nodiscard]] static bool takeTurnHere(Lane& lane, HelpScope& help);
 
   /// The lane whose block the calling thread is running; null when none.
   [[nodiscard]] static const Lane* currentLane();
@@ -53,6 +58,7 @@ class Pool {
   const std::string_view name_;
   const int nice_;
   const std::size_t width_;
+  const std::size_t mostHeldBack_;
 
   Mutex mutex_;
   ConditionVariable wake_;

@@ -5,6 +5,7 @@
 
 #include "base/Mutex.h"
 #include "platform/WorkQueue.h"
+#include "platform/linux/work/HelpScope.h"
 #include "platform/linux/work/Keeper.h"
 #include "platform/linux/work/Lane.h"
 #include "platform/linux/work/Pool.h"
@@ -19,13 +20,18 @@ class SerialLane final : public Lane {
   SerialLane(std::string_view label, Pool& pool) : Lane(label), pool_(pool) {}
 
   void add(WorkItem&& item) override {
+    HelpScope* const help = item.isBrief ? HelpScope::current() : nullptr;
     {
       const MutexLock lock(mutex_);
       if (waiting_.capacity() == 0) waiting_.reserve(kFirstCapacity);
       waiting_.push_back(std::move(item));
       if (std::exchange(ready_, true)) return;
     }
-    pool_.submit(shared_from_this());
+    if (help != nullptr) {
+      help->adopt(shared_from_this(), pool_);
+    } else {
+      pool_.submit(shared_from_this());
+    }
   }
 
   bool takeTurn() override {
@@ -34,6 +40,14 @@ class SerialLane final : public Lane {
       batch_[next_++].run();
     }
     return true;
+  }
+
+  bool takeBriefTurn(HelpScope& help) override {
+    for (;;) {
+      if (next_ == batch_.size() && !takeBatch()) return false;
+      if (!batch_[next_].isBrief || help.isExhausted()) return true;
+      batch_[next_++].run();
+    }
   }
 
  private:
@@ -80,6 +94,7 @@ class ConcurrentLane final : public Lane {
     next().run();
     return false;
   }
+  bool takeBriefTurn(HelpScope& /*help*/) override { return takeTurn(); }
 
  private:
   WorkItem next() {
@@ -100,6 +115,9 @@ class LaneQueue final : public WorkQueue {
 
   [[nodiscard]] std::string_view label() const override { return lane_->label(); }
   void async(Block block) override { lane_->add({VoucherHold::current(), std::move(block)}); }
+  void asyncBrief(Block block) override {
+    lane_->add({VoucherHold::current(), std::move(block), true});
+  }
   void after(std::chrono::milliseconds delay, Block block) override {
     Keeper::instance().after(delay, lane_, std::move(block));
   }

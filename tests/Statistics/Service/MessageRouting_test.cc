@@ -56,8 +56,10 @@ TEST(Routing, ByIdentifiersReachesASessionThatIsNotStarted) {
     Client client = service.connect(41);
     client.create(7);
     client.setServiceType(2, 7);
-    client.send(kWithEngineTime, 3, 1, List{7});
+    client.send(kWithEngineTime, 3, 1, List{7, 0, 8});
     service.run();
+    EXPECT_EQ(service.simulation.counters.accepted, 3U);
+    EXPECT_EQ(service.simulation.counters.of(MessageDrop::noSuchSession), 2U);
     ASSERT_EQ(service.simulation.agent.singleMessages.size(), 1U);
     EXPECT_EQ(*service.simulation.agent.singleMessages[0].userInfo.find("ServiceName"),
               Value("telephony"));
@@ -230,6 +232,11 @@ TEST(Routing, LosesAndReordersNothingWhateverTheInterleaving) {
       });
     }
     service.run();
+    const SimulatedCounters& counters = service.simulation.counters;
+    EXPECT_EQ(counters.accepted, clients.size() * (kMessages + 1));
+    EXPECT_EQ(counters.of(Gauge::clients), 2);
+    EXPECT_EQ(counters.of(Gauge::sessions), 2);
+    EXPECT_EQ(counters.of(Gauge::startedSessions), 0);
     for (const auto& start : starts) EXPECT_THAT(start->results, ElementsAre(kYes));
     ASSERT_EQ(service.simulation.agent.sessions.size(), clients.size());
     for (const auto& session : service.simulation.agent.sessions) {

@@ -50,9 +50,9 @@ struct SessionOwner {
   /// The ids of the messages in the history.
   [[nodiscard]] std::vector<std::string> history() const {
     std::vector<std::string> ids;
-    session->aggregatedPayloadData()->forEach([&](const PayloadHistory::Entry& entry) {
-      if (const auto* message = std::get_if<SentMessage>(&entry)) ids.push_back(message->messageID);
-    });
+    session->aggregatedPayloadData()->forEach(
+        [&](const MessageIdentity& identity, const Payload&) { ids.push_back(identity.text()); },
+        [](const Dictionary&) {});
     return ids;
   }
   [[nodiscard]] std::vector<std::string> errors() const { return simulation.log.texts("error"); }

@@ -91,6 +91,8 @@ TEST(Session, MessagesWaitForTheBackendsUpToNineSeconds) {
       if (each.deliveredAt) {
         EXPECT_EQ(owner.delivered()[0].at, *each.deliveredAt);
       }
+      EXPECT_EQ(owner.simulation.counters.of(MessageDrop::noAgentSession),
+                each.deliveredAt ? 0U : 1U);
       EXPECT_FALSE(owner.session->relmReportingSessionStarted());
       EXPECT_THAT(owner.history(), ElementsAre("Playback_Start_1"));
     }
@@ -186,6 +188,7 @@ TEST(Session, OfTypeTestNeverTouchesTheAgent) {
     EXPECT_THAT(owner.ended, ElementsAre(Value(true)));
     EXPECT_THAT(owner.simulation.agent.tokens, IsEmpty());
     EXPECT_THAT(owner.simulation.journal.lines({"agent"}), IsEmpty());
+    EXPECT_EQ(owner.simulation.counters.of(MessageDrop::testServiceType), 2U);
     EXPECT_THAT(owner.simulation.log.texts(),
                 ElementsAre(Line("default", kStop, "sending summary event for reporter 7"),
                             Line("info", kSend, "transactions aren't allowed on this platform"),
