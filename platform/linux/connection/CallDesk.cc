@@ -1,5 +1,6 @@
 #include "platform/linux/connection/CallDesk.h"
 
+#include <algorithm>
 #include <utility>
 
 #include "base/MessagePack.h"
@@ -9,6 +10,13 @@ namespace quarvel {
 namespace {
 
 constexpr std::int64_t kResponse = 1;
+
+// Half a turn that takes longer than this makes the next ones shorter; one that takes less, longer.
+constexpr std::chrono::microseconds kSlow{1000};
+constexpr std::chrono::microseconds kFast{250};
+
+/// What the store takes in a few milliseconds.
+constexpr std::size_t kMostBehind = 128;
 
 /// A buffer that has grown beyond this for a burst is not kept for the quiet that follows.
 constexpr std::size_t kKeptCapacity = std::size_t{64} * 1024;
@@ -27,7 +35,8 @@ CallDesk::CallDesk(const Configuration::Limits& limits, std::function<void()> wa
     : replyBytesLimit_(limits.replyBytes),
       callsLimit_(limits.queuedCalls),
       bytesLimit_(limits.queuedBytes),
-      wake_(std::move(wake)) {}
+      wake_(std::move(wake)),
+      turn_(std::min(limits.firstTurn, callsLimit_)) {}
 
 template <class Encode>
 void CallDesk::reply(Encode encode) {
@@ -87,6 +96,7 @@ void CallDesk::refuseReplies() {
 }
 
 void CallDesk::begin(std::size_t bytes) {
+  callsBegun_.fetch_add(1);
   calls_.fetch_add(1);
   bytes_.fetch_add(bytes);
 }
@@ -97,6 +107,7 @@ void CallDesk::carriedOut() {
 }
 
 void CallDesk::done(std::size_t bytes) {
+  callsDone_.fetch_add(1);
   bytes_.fetch_sub(bytes);
   wakeIfHalfIsDone();
 }
@@ -106,20 +117,42 @@ void CallDesk::wakeIfHalfIsDone() {
 }
 
 bool CallDesk::mustWaitForRoom() {
-  if (!waiting_ && !isFull()) return false;
+  if (!waiting_ && !isFull()) {
+    if (turnIsUsedUp_) adaptTurn();
+    return false;
+  }
+  if (calls_ >= turn_ && !std::exchange(turnIsUsedUp_, true)) {
+    usedUpAt_ = std::chrono::steady_clock::now();
+  }
   // Said before looking once more: a call that is done in between either is seen here or sees it.
   waiting_ = true;
   if (!halfIsDone()) return true;
   waiting_ = false;
+  if (turnIsUsedUp_) adaptTurn();
   return false;
 }
 
+void CallDesk::adaptTurn() {
+  turnIsUsedUp_ = false;
+  const auto took = std::chrono::steady_clock::now() - usedUpAt_;
+  const std::size_t turn = turn_.load(std::memory_order_relaxed);
+  if (took > kSlow) {
+    turn_ = std::max<std::size_t>(turn / 2, 1);
+  } else if (took < kFast) {
+    turn_ = std::min(turn * 2, callsLimit_);
+  }
+}
+
 bool CallDesk::isFull() const {
-  return calls_ >= callsLimit_ || bytes_ >= bytesLimit_;
+  return calls_ >= turn_ || bytes_ >= bytesLimit_ || isFullBehind();
+}
+
+bool CallDesk::isFullBehind() const {
+  return behind() >= excused_ + kMostBehind;
 }
 
 bool CallDesk::halfIsDone() const {
-  return calls_ <= callsLimit_ / 2 && bytes_ <= bytesLimit_ / 2;
+  return calls_ <= turn_ / 2 && bytes_ <= bytesLimit_ / 2 && behind() <= excused_ + kMostBehind / 2;
 }
 
 Call::Call(std::shared_ptr<CallDesk> desk, std::optional<std::uint32_t> messageID,

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <atomic>
+#include <chrono>
 #include <cstddef>
 #include <cstdint>
 #include <functional>
@@ -51,8 +52,14 @@ class CallDesk {
   /// All work that came of it is done.
   void done(std::size_t bytes);
   /// I/O thread. Whether no further call may be taken in; if so, `wake` is called when half of the
-  /// limit is done.
+  /// turn, of what may be behind, or of the limit on bytes, is done.
   [[nodiscard]] bool mustWaitForRoom();
+  /// I/O thread. Whether `mustWaitForRoom` was true and nothing has woken since.
+  [[nodiscard]] bool isWaiting() const { return waiting_; }
+  /// I/O thread, while it waits. When the number of calls done stays the same for long, those
+  /// behind wait for something slow, and the client shall not.
+  [[nodiscard]] std::size_t callsDone() const { return callsDone_; }
+  void excuseThoseBehind() { excused_ = behind(); }
 
  private:
   template <class Encode>
@@ -60,6 +67,9 @@ class CallDesk {
   void wakeIfHalfIsDone();
   [[nodiscard]] bool isFull() const;
   [[nodiscard]] bool halfIsDone() const;
+  [[nodiscard]] std::size_t behind() const { return callsBegun_ - callsDone_ - calls_; }
+  [[nodiscard]] bool isFullBehind() const;
+  void adaptTurn();
 
   // Constant after construction.
   const std::size_t replyBytesLimit_;
@@ -76,6 +86,20 @@ class CallDesk {
   std::atomic<std::size_t> calls_{0};  // not carried out
   std::atomic<std::size_t> bytes_{0};  // of calls of which anything is still to be done
   std::atomic<bool> waiting_{false};   // the I/O thread wants to hear of room
+
+  /// How many calls may be ahead of other clients' ones: as many as are carried out in about a
+  /// millisecond, whatever they cost, and no more than the limit. Written by the I/O thread.
+  std::atomic<std::size_t> turn_;
+  // Calls that have been carried out, and so answered, but of which something is still to be done:
+  // few, so that what is answered is soon in the store. Those that wait for something slow, such as
+  // a session's backends, are excused.
+  std::atomic<std::size_t> callsBegun_{0};
+  std::atomic<std::size_t> callsDone_{0};
+  std::atomic<std::size_t> excused_{0};
+
+  // The I/O thread's.
+  bool turnIsUsedUp_ = false;
+  std::chrono::steady_clock::time_point usedUpAt_;
 };
 
 /// One call: where its reply goes and what stands for the work that came of it.

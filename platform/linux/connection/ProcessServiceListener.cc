@@ -10,10 +10,14 @@
 #include "platform/Process.h"
 #include "platform/ServiceListener.h"
 #include "platform/linux/connection/SocketListener.h"
+#include "platform/linux/sources/StatusFile.h"
 #include "platform/linux/sources/VerbosePreferences.h"
 #include "platform/linux/store/ProcessStore.h"
+#include "platform/linux/store/export/ProcessErasures.h"
+#include "platform/linux/store/export/ProcessExporters.h"
 #include "platform/linux/system/Configuration.h"
 #include "platform/linux/system/Directories.h"
+#include "platform/linux/system/ServiceManager.h"
 #include "platform/linux/work/Work.h"
 
 namespace quarvel {
@@ -40,6 +44,10 @@ Result<std::unique_ptr<SocketListener>> OpenListener() {
   SocketListener::Options options;
   options.limits = Configuration::process().limits;
   options.endSignals = {SIGTERM, SIGINT};
+  options.atStart = TellManagerReady;
+  options.pulse = PingManager;
+  options.pulseInterval = ManagerPingInterval();
+  options.atEndBegun = TellManagerStopping;
   options.atEnd.emplace_back([] {
     ZQ_FUNCTION("ProcessServiceListener");
     if (!DrainWork(std::chrono::steady_clock::now() + kWorkMayTake)) {
@@ -66,7 +74,10 @@ std::unique_ptr<SocketListener> OpenListenerOrExit() {
   }
   // With the socket ours, so that a second service never touches the store of one that runs.
   static_cast<void>(ProcessTelemetryStore());
+  static_cast<void>(ProcessExporters());
+  AnswerErasureRequests();
   FollowVerbosePreferences();
+  AnswerStatusRequests();
   return std::move(listener.value());
 }
 

@@ -10,12 +10,16 @@
 #include "base/Format.h"
 #include "platform/Log.h"
 #include "platform/linux/connection/Request.h"
+#include "platform/linux/work/HelpScope.h"
 
 namespace quarvel {
 
 using std::chrono::steady_clock;
 
 namespace {
+
+/// The store commits far more often than this.
+constexpr std::chrono::milliseconds kSlowBehind{50};
 
 std::int32_t PeerProcessIdentifier(int socket) {
   ucred peer{};
@@ -32,7 +36,8 @@ SocketConnection::SocketConnection(std::shared_ptr<ConnectionContext> context, s
       socket_(context_->io),
       scanner_(context_->limits.messageBytes, context_->limits.depth),
       frameTimer_(context_->io),
-      stallTimer_(context_->io) {}
+      stallTimer_(context_->io),
+      behindTimer_(context_->io) {}
 
 std::shared_ptr<SocketConnection> SocketConnection::create(
     std::shared_ptr<ConnectionContext> context, UniqueDescriptor socket, std::uint64_t number) {
@@ -90,10 +95,24 @@ void SocketConnection::resume() {
 /// short calls it again.
 void SocketConnection::proceed() {
   if (!open_ || !resumed_ || reading_) return;
-  decode();
+  bool isLeft = false;
+  {
+    // Most calls are brief and find their queues at rest: they are carried out here.
+    HelpScope help;
+    isLeft = decode();
+    while (help.runOne()) {
+      if (open_) flush();
+    }
+  }
   if (!open_) return;
   if (mustWait()) {
     unwatchFrame();  // it is not the client that is slow
+    return;
+  }
+  if (isLeft) {
+    // What was carried out here has made room again. After the others' turn, so that nobody waits
+    // for one who sends without end.
+    asio::post(context_->io, [self = shared_from_this()] { self->proceed(); });
     return;
   }
   if (buffer_.empty()) {
@@ -114,15 +133,16 @@ void SocketConnection::proceed() {
                      });
 }
 
-void SocketConnection::decode() {
+/// Whether calls are left for which there is no room.
+bool SocketConnection::decode() {
   while (open_ && !buffer_.empty() && !mustWait()) {
     const std::string_view bytes = buffer_.bytes();
     switch (scanner_.scan(bytes)) {
       case MessagePackScanner::Progress::incomplete:
-        return;
+        return false;
       case MessagePackScanner::Progress::fault:
         breach(scanner_.fault());
-        return;
+        return false;
       case MessagePackScanner::Progress::complete:
         carryOut(bytes.substr(0, scanner_.length()));
         buffer_.consume(scanner_.length());
@@ -131,6 +151,7 @@ void SocketConnection::decode() {
         break;
     }
   }
+  return open_ && !buffer_.empty();
 }
 
 void SocketConnection::receive() {
@@ -142,12 +163,15 @@ void SocketConnection::receive() {
   proceed();
 }
 
-/// One read; false when the client has gone.
-bool SocketConnection::readAvailable() {
+/// One read: how many bytes there were; none when the client has gone.
+std::optional<std::size_t> SocketConnection::readAvailable() {
   const std::span<char> room = buffer_.room();
-  const ssize_t count = ::recv(socket_.native_handle(), room.data(), room.size(), MSG_DONTWAIT);
-  if (count > 0) buffer_.arrived(static_cast<std::size_t>(count));
-  return count > 0 || (count < 0 && (errno == EAGAIN || errno == EINTR));
+  const ssize_t count =
+      TEMP_FAILURE_RETRY(::recv(socket_.native_handle(), room.data(), room.size(), MSG_DONTWAIT));
+  if (count < 0 && errno == EAGAIN) return 0;
+  if (count <= 0) return std::nullopt;
+  buffer_.arrived(static_cast<std::size_t>(count));
+  return static_cast<std::size_t>(count);
 }
 
 /// Whether the client has to wait: for its calls to be worked off, or until it reads its replies.
@@ -161,7 +185,10 @@ bool SocketConnection::mustWait() {
       return true;
     }
   }
-  return desk_->mustWaitForRoom();
+  if (!desk_->mustWaitForRoom()) return false;
+  // Also when it is full of others yet: those are behind once they have been carried out.
+  watchThoseBehind();
+  return true;
 }
 
 void SocketConnection::carryOut(std::string_view frame) {
@@ -220,10 +247,13 @@ void SocketConnection::flush() {
       sent_ += static_cast<std::size_t>(count);
       desk_->repliesWritten(static_cast<std::size_t>(count));
     } else if (errno != EAGAIN && errno != EINTR && errno != ENOBUFS && errno != ENOMEM) {
-      // The client has gone. The socket is still read: what it sent before is to be carried out.
+      // The client hears no more. The socket is still read: what it sent before is to be carried
+      // out. Unless it has closed its end itself, it is to notice.
+      const bool hasClosed = errno == EPIPE;
       desk_->refuseReplies();
       sending_.clear();
       sent_ = 0;
+      if (!hasClosed) ::shutdown(socket_.native_handle(), SHUT_RD);
       return;
     }
     if (sent_ < sending_.size()) waitUntilWritable();
@@ -284,6 +314,18 @@ void SocketConnection::unwatchStall() {
   if (std::exchange(stallTimerRuns_, false)) stallTimer_.cancel();
 }
 
+/// Calls that wait for something slow do not hold back those that come after them for long.
+void SocketConnection::watchThoseBehind() {
+  if (std::exchange(behindTimerRuns_, true)) return;
+  behindTimer_.expires_after(kSlowBehind);
+  behindTimer_.async_wait([self = shared_from_this(), done = desk_->callsDone()](asio::error_code) {
+    self->behindTimerRuns_ = false;
+    if (!self->open_ || !self->desk_->isWaiting()) return;
+    if (self->desk_->callsDone() == done) self->desk_->excuseThoseBehind();
+    self->proceed();
+  });
+}
+
 void SocketConnection::breach(std::string_view fault) {
   ZQ_FUNCTION("-[SocketConnection breach:]");
   ZQ_LOG(nullptr, error, "client {} broke the protocol: {}", processIdentifier_, fault);
@@ -309,7 +351,7 @@ void SocketConnection::endInOrder() {
     lastWords_ = true;
     do {
       decode();
-    } while (open_ && readAvailable());
+    } while (open_ && readAvailable().value_or(0) > 0);
   }
   end(false);
 }
@@ -321,14 +363,19 @@ void SocketConnection::end(bool interrupted) {
   desk_->refuseReplies();
   unwatchFrame();
   unwatchStall();
+  behindTimer_.cancel();
   asio::error_code ignored;
   socket_.close(ignored);
 
   const auto interruptionHandler = std::exchange(interruptionHandler_, nullptr);
   const auto invalidationHandler = std::exchange(invalidationHandler_, nullptr);
-  if (interrupted && interruptionHandler) interruptionHandler();
-  if (invalidationHandler) invalidationHandler();
-  object_.reset();
+  {
+    const VoucherHold passage = context_->passages.begin(context_);
+    const VoucherScope scope(VoucherScope::Of::call, passage);
+    if (interrupted && interruptionHandler) interruptionHandler();
+    if (invalidationHandler) invalidationHandler();
+    object_.reset();
+  }
   context_->connectionEnded(shared_from_this());
 }
 

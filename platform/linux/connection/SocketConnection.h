@@ -7,6 +7,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -14,6 +15,7 @@
 #include "base/MessagePack.h"
 #include "platform/ClientConnection.h"
 #include "platform/linux/connection/CallDesk.h"
+#include "platform/linux/connection/Passages.h"
 #include "platform/linux/connection/ReadBuffer.h"
 #include "platform/linux/connection/UniqueDescriptor.h"
 #include "platform/linux/system/Configuration.h"
@@ -30,6 +32,7 @@ struct ConnectionContext {
 
   asio::io_context io{1};  // run by the I/O thread alone
   const Configuration::Limits limits;
+  Passages passages;
   /// Told, on the I/O thread, of each connection that has ended. Constant once the listener serves.
   std::function<void(const std::shared_ptr<SocketConnection>&)> connectionEnded;
 };
@@ -68,9 +71,9 @@ class SocketConnection final : public ClientConnection,
 
   // Reading.
   void proceed();
-  void decode();
+  bool decode();
   void receive();
-  [[nodiscard]] bool readAvailable();
+  [[nodiscard]] std::optional<std::size_t> readAvailable();
   [[nodiscard]] bool mustWait();
   void carryOut(std::string_view frame);
   void dispatch(const Request& request, std::size_t frameBytes);
@@ -86,6 +89,7 @@ class SocketConnection final : public ClientConnection,
   void unwatchFrame();
   void watchStall();
   void unwatchStall();
+  void watchThoseBehind();
 
   // Ends.
   void breach(std::string_view fault);
@@ -125,6 +129,8 @@ class SocketConnection final : public ClientConnection,
   std::chrono::steady_clock::time_point frameDeadline_;  // of the partial frame
   asio::steady_timer stallTimer_;
   bool stallTimerRuns_ = false;
+  asio::steady_timer behindTimer_;
+  bool behindTimerRuns_ = false;
 };
 
 }  // namespace quarvel

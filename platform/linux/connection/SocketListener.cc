@@ -11,6 +11,7 @@
 #include <cerrno>
 #include <chrono>
 #include <cstdint>
+#include <limits>
 #include <string>
 #include <system_error>
 #include <unordered_set>
@@ -29,6 +30,9 @@ namespace {
 /// our connections has ended.
 constexpr std::chrono::seconds kRetryAccepting{1};
 
+/// So many clients are welcomed before those who are there get their turn.
+constexpr int kAcceptedPerTurn = 16;
+
 }  // namespace
 
 /// The listener's side of the event loop: accepts, counts, ends. All of it belongs to the I/O
@@ -42,11 +46,14 @@ class SocketListener::Loop {
         listeningSocket_(std::move(socket)),
         socket_(context_->io, listeningSocket_.releaseDescriptor().release()),
         retryTimer_(context_->io),
+        pulseTimer_(context_->io),
         signals_(context_->io) {
     for (const int signal : options_.endSignals) signals_.add(signal);
+    // May come when this object has gone, but then nothing runs the loop any more.
+    context_->passages.wake = [this, &io = context_->io] { acceptSoon(io); };
     context_->connectionEnded = [this](const std::shared_ptr<SocketConnection>& connection) {
       connections_.erase(connection);
-      if (heldBack_ && !ended_) acceptSoon();
+      if (heldBack_ && !ended_) acceptSoon(context_->io);
     };
   }
 
@@ -61,7 +68,9 @@ class SocketListener::Loop {
         if (!error) end();
       });
     }
-    acceptSoon();
+    acceptSoon(context_->io);
+    if (options_.atStart) asio::post(context_->io, options_.atStart);
+    if (options_.pulseInterval > options_.pulseInterval.zero()) pulseLater();
     context_->io.run();
     for (const auto& step : options_.atEnd) step();
   }
@@ -71,37 +80,53 @@ class SocketListener::Loop {
   }
 
  private:
-  void acceptSoon() {
-    asio::post(context_->io, [this] { acceptWaiting(); });
+  void acceptSoon(asio::io_context& io) {
+    asio::post(io, [this] { acceptWaiting(); });
   }
 
   void acceptWaiting() {
-    if (accepting_ || ended_ || !acceptAll()) return;
-    accepting_ = true;
-    socket_.async_wait(asio::posix::stream_descriptor::wait_read, [this](asio::error_code error) {
-      accepting_ = false;
-      if (!error) acceptWaiting();
-    });
+    if (accepting_ || ended_) return;
+    switch (accept(kAcceptedPerTurn)) {
+      case Accepted::all:
+        accepting_ = true;
+        socket_.async_wait(asio::posix::stream_descriptor::wait_read,
+                           [this](asio::error_code error) {
+                             accepting_ = false;
+                             if (!error) acceptWaiting();
+                           });
+        break;
+      case Accepted::turn:
+        acceptSoon(context_->io);
+        break;
+      case Accepted::heldBack:
+        break;
+    }
   }
 
-  /// False when some had to be left waiting.
-  bool acceptAll() {
-    for (;;) {
+  /// What became of the clients who wait: all are accepted, as many as were to be, or no more may
+  /// be until somebody calls `acceptSoon`.
+  enum class Accepted { all, turn, heldBack };
+
+  Accepted accept(int most) {
+    for (int accepted = 0;;) {
+      if (accepted == most) return Accepted::turn;
+      if (!ended_ && context_->passages.areTooMany()) return Accepted::heldBack;
       if (connections_.size() >= options_.limits.connections) {
         holdBack(fmt::format("there are {} connections already", connections_.size()));
-        return false;
+        return Accepted::heldBack;
       }
       UniqueDescriptor client(
           ::accept4(socket_.native_handle(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
       if (client) {
+        ++accepted;
         welcome(std::move(client));
       } else if (errno == EAGAIN) {
         heldBack_ = false;
-        return true;
+        return Accepted::all;
       } else if (errno != EINTR && errno != ECONNABORTED && errno != EPROTO) {
         holdBack(std::generic_category().message(errno));
         retryLater();
-        return false;
+        return Accepted::heldBack;
       }
     }
   }
@@ -120,6 +145,15 @@ class SocketListener::Loop {
     });
   }
 
+  void pulseLater() {
+    pulseTimer_.expires_after(options_.pulseInterval);
+    pulseTimer_.async_wait([this](asio::error_code error) {
+      if (error || ended_) return;
+      options_.pulse();
+      pulseLater();
+    });
+  }
+
   void welcome(UniqueDescriptor client) {
     ZQ_FUNCTION("-[SocketListener welcome:]");
     const auto connection = SocketConnection::create(context_, std::move(client), ++lastNumber_);
@@ -128,6 +162,8 @@ class SocketListener::Loop {
       return;
     }
     connections_.insert(connection);
+    const VoucherHold passage = context_->passages.begin(context_);
+    const VoucherScope scope(VoucherScope::Of::call, passage);
     if (delegate_ == nullptr || !delegate_->shouldAcceptNewConnection(*listener_, connection)) {
       connection->refuse();
     }
@@ -135,11 +171,13 @@ class SocketListener::Loop {
 
   void end() {
     if (std::exchange(ended_, true)) return;
+    if (options_.atEndBegun) options_.atEndBegun();
     // Who came before the end is heard; at an inherited socket they wait for the next service.
-    if (listeningSocket_.removeFile()) (void)acceptAll();
+    if (listeningSocket_.removeFile()) (void)accept(std::numeric_limits<int>::max());
     asio::error_code ignored;
     socket_.close(ignored);
     retryTimer_.cancel();
+    pulseTimer_.cancel();
     signals_.cancel(ignored);
     // Each takes itself out of the set.
     const std::vector<std::shared_ptr<SocketConnection>> connections(connections_.begin(),
@@ -159,6 +197,7 @@ class SocketListener::Loop {
   ListeningSocket listeningSocket_;
   asio::posix::stream_descriptor socket_;
   asio::steady_timer retryTimer_;
+  asio::steady_timer pulseTimer_;
   asio::signal_set signals_;
   std::unordered_set<std::shared_ptr<SocketConnection>> connections_;
   std::uint64_t lastNumber_ = 0;

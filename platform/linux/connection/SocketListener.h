@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <functional>
 #include <memory>
 #include <vector>
@@ -19,6 +20,12 @@ class SocketListener final : public ServiceListener {
     Configuration::Limits limits;
     /// Signals that end the service in order; seen from construction on.
     std::vector<int> endSignals;
+    /// Called on the I/O thread, each when it is set: once clients are served; every
+    /// `pulseInterval` from then on, unless that is zero; when the end begins.
+    std::function<void()> atStart;
+    std::function<void()> pulse;
+    std::chrono::microseconds pulseInterval{0};
+    std::function<void()> atEndBegun;
     /// What is to be done when every connection has ended, in this order, on the I/O thread.
     std::vector<std::function<void()>> atEnd;
   };

@@ -10,6 +10,7 @@
 #include <utility>
 
 #include "platform/Log.h"
+#include "platform/linux/system/Files.h"
 #include "platform/linux/work/Thread.h"
 
 namespace quarvel {
@@ -48,9 +49,7 @@ int DirectoryWatch::start() {
 }
 
 int DirectoryWatch::add(const std::filesystem::path& directory, Handler handler) {
-  std::error_code failure;
-  std::filesystem::create_directories(directory, failure);
-  if (failure) return failure.value();
+  if (const int status = CreatePrivateDirectory(directory); status != 0) return status;
   const MutexLock lock(mutex_);
   if (const int status = start(); status != 0) return status;
   const int identifier = inotify_add_watch(descriptor_, directory.c_str(), kChanges);

@@ -7,17 +7,14 @@
 
 namespace quarvel {
 
-AnalyticsEventSink::AnalyticsEventSink(std::shared_ptr<TelemetryStore> store,
-                                       std::vector<std::string> wanted)
-    : store_(std::move(store)),
+AnalyticsEventSink::AnalyticsEventSink(EventPath& path, std::vector<std::string> wanted)
+    : path_(path),
       wanted_(std::move(wanted)),
       wantsAll_(std::ranges::find(wanted_, "*") != wanted_.end()) {}
 
 void AnalyticsEventSink::sendEventLazy(std::string_view name,
                                        const std::function<Payload()>& payload) {
-  if (!wants(name)) return;
-  // A refusal is counted by the store, and there is nobody else to tell.
-  (void)store_->addAnalyticsEvent(name, payload());
+  if (wants(name)) path_.addAnalyticsEvent(name, payload());
 }
 
 bool AnalyticsEventSink::wants(std::string_view name) const {

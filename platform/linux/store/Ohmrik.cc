@@ -6,8 +6,7 @@ namespace quarvel {
 
 void OhmrikLogRegisteredEvent(std::int32_t domain, std::string_view name, const Payload& record,
                               std::nullptr_t) {
-  // A refusal is counted by the store, and there is nobody else to tell.
-  (void)ProcessTelemetryStore()->addPowerEvent(domain, name, record);
+  ProcessEventPath().addPowerEvent(domain, name, record);
 }
 
 }  // namespace quarvel

@@ -1,15 +1,14 @@
 #include "platform/linux/store/ProcessStore.h"
 
-#include <filesystem>
-#include <system_error>
 #include <utility>
 
 #include "platform/Clock.h"
 #include "platform/Log.h"
 #include "platform/Process.h"
-#include "platform/linux/store/TelemetryAgent.h"
+#include "platform/linux/store/StoreStatus.h"
 #include "platform/linux/system/Configuration.h"
 #include "platform/linux/system/Directories.h"
+#include "platform/linux/system/Files.h"
 #include "platform/linux/system/ProcessExit.h"
 
 namespace quarvel {
@@ -23,16 +22,13 @@ std::shared_ptr<TelemetryStore> OpenOrExit() {
   options.path = configuration.store.path;
   if (options.path.empty()) {
     // The state directory is the service's own to make; one that somebody named is not.
-    std::error_code failure;
-    std::filesystem::create_directories(Directories::process().state, failure);
+    (void)CreatePrivateDirectory(Directories::process().state);
     options.path = Directories::process().state / "telemetry.db";
   }
   options.sync = configuration.store.sync;
   options.maximumBytes = configuration.store.maximumBytes;
   options.maximumAge = configuration.store.maximumAge;
-  for (const std::string& backend : configuration.agent.backends) {
-    if (backend != kStoreBackend) options.remoteBackends.push_back(backend);
-  }
+  options.remoteBackends = configuration.agent.remoteBackends();
   options.clock = CurrentDate;
   auto store = TelemetryStore::open(std::move(options));
   if (!store) {
@@ -47,10 +43,16 @@ std::shared_ptr<TelemetryStore> OpenOrExit() {
 const std::shared_ptr<TelemetryStore>& ProcessTelemetryStore() {
   static const auto& store = *[] {
     const auto* opened = new std::shared_ptr<TelemetryStore>(OpenOrExit());
+    DescribeInStatus(Status::process(), *opened);
     AtProcessExit([opened] { (*opened)->close(); });
     return opened;
   }();
   return store;
+}
+
+EventPath& ProcessEventPath() {
+  static EventPath& path = *new EventPath(ProcessTelemetryStore());
+  return path;
 }
 
 }  // namespace quarvel

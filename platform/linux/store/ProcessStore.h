@@ -2,6 +2,7 @@
 
 #include <memory>
 
+#include "platform/linux/store/EventPath.h"
 #include "platform/linux/store/TelemetryStore.h"
 
 namespace quarvel {
@@ -10,5 +11,8 @@ namespace quarvel {
 /// before it listens. When it cannot be opened, an error line says why and the process ends with
 /// status 1. Closed by `ExitProcess`, with everything that it has taken made safe; never destroyed.
 [[nodiscard]] const std::shared_ptr<TelemetryStore>& ProcessTelemetryStore();
+
+/// The way of events to it; never destroyed.
+[[nodiscard]] EventPath& ProcessEventPath();
 
 }  // namespace quarvel

@@ -1,8 +1,33 @@
 #include "platform/linux/store/Sqlite.h"
 
 #include <sqlite3.h>
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
 
 namespace quarvel {
+
+namespace {
+
+/// After a sync that failed the system takes what it could not write for written, so that the next
+/// sync succeeds and has made nothing safe. What is written once more is written for certain.
+bool WriteAgain(sqlite3_file& file) {
+  sqlite3_int64 size = 0;
+  if (file.pMethods->xFileSize(&file, &size) != SQLITE_OK) return false;
+  std::array<char, 65536> bytes{};
+  for (sqlite3_int64 at = 0; at < size;) {
+    const auto count =
+        static_cast<int>(std::min(size - at, static_cast<sqlite3_int64>(bytes.size())));
+    if (file.pMethods->xRead(&file, bytes.data(), count, at) != SQLITE_OK) return false;
+    if (file.pMethods->xWrite(&file, bytes.data(), count, at) != SQLITE_OK) return false;
+    at += count;
+  }
+  return true;
+}
+
+}  // namespace
 
 void SqliteStatement::Finalize::operator()(sqlite3_stmt* statement) const {
   sqlite3_finalize(statement);
@@ -27,6 +52,12 @@ SqliteStatement& SqliteStatement::bind(int parameter, std::string_view text) {
 
 SqliteStatement& SqliteStatement::bind(int parameter, std::nullptr_t) {
   sqlite3_bind_null(statement_.get(), parameter);
+  return *this;
+}
+
+SqliteStatement& SqliteStatement::bind(int parameter, const SqliteStatement& row, int column) {
+  sqlite3_bind_value(statement_.get(), parameter,
+                     sqlite3_column_value(row.statement_.get(), column));
   return *this;
 }
 
@@ -64,18 +95,40 @@ std::string_view SqliteStatement::text(int column) const {
           static_cast<std::size_t>(sqlite3_column_bytes(statement_.get(), column))};
 }
 
+double SqliteStatement::real(int column) const {
+  return sqlite3_column_double(statement_.get(), column);
+}
+
+bool SqliteStatement::isNull(int column) const {
+  return sqlite3_column_type(statement_.get(), column) == SQLITE_NULL;
+}
+
 void SqliteConnection::Close::operator()(sqlite3* connection) const {
   sqlite3_close_v2(connection);
 }
 
-bool SqliteConnection::open(const std::filesystem::path& path, const std::string& vfs) {
+bool SqliteConnection::open(const std::filesystem::path& path) {
   sqlite3* connection = nullptr;
   const int result =
       sqlite3_open_v2(path.c_str(), &connection,
-                      SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_EXRESCODE,
-                      vfs.empty() ? nullptr : vfs.c_str());
+                      SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_EXRESCODE, nullptr);
   connection_.reset(connection);
   if (result != SQLITE_OK) return false;
+  if (sqlite3_db_readonly(connection, "main") == 1) {
+    // SQLite's answer to a file that could not be opened for writing, were it but for a moment.
+    rolledBackFault_ = SqliteFault::other;
+    rolledBackMessage_ = "the file cannot be opened for writing";
+    return false;
+  }
+  struct stat status {};
+  if (::stat(path.c_str(), &status) != 0) {
+    rolledBackFault_ = SqliteFault::other;
+    rolledBackMessage_ = "the file cannot be looked at";
+    return false;
+  }
+  path_ = path;
+  device_ = status.st_dev;
+  inode_ = status.st_ino;
   sqlite3_busy_timeout(connection, 250);
   // What is corrupt, or not ours, stays as it was found.
   sqlite3_db_config(connection, SQLITE_DBCONFIG_NO_CKPT_ON_CLOSE, 1, nullptr);
@@ -124,22 +177,45 @@ std::int64_t SqliteConnection::changes() const {
 void SqliteConnection::rollBack() {
   rolledBackFault_ = fault();
   rolledBackMessage_ = message();
+  noteSyncFailure();
   if (sqlite3_get_autocommit(connection_.get()) == 0) {
     sqlite3_exec(connection_.get(), "ROLLBACK", nullptr, nullptr, nullptr);
   }
 }
 
-bool SqliteConnection::checkpoint() {
+void SqliteConnection::noteSyncFailure() {
+  if (sqlite3_extended_errcode(connection_.get()) == SQLITE_IOERR_FSYNC) logIsDoubtful_ = true;
+}
+
+bool SqliteConnection::moveLog(int mode) {
+  if (logIsDoubtful_ && !syncLog()) return false;
   int logPages = -1;
   int movedPages = -1;
-  const int result = sqlite3_wal_checkpoint_v2(connection_.get(), "main", SQLITE_CHECKPOINT_PASSIVE,
-                                               &logPages, &movedPages);
+  const int result =
+      sqlite3_wal_checkpoint_v2(connection_.get(), "main", mode, &logPages, &movedPages);
+  noteSyncFailure();
   return result == SQLITE_OK && logPages == movedPages;
 }
 
+bool SqliteConnection::checkpoint() {
+  return moveLog(SQLITE_CHECKPOINT_PASSIVE);
+}
+
+bool SqliteConnection::restartLog() {
+  if (!moveLog(SQLITE_CHECKPOINT_RESTART)) return false;
+  *logPages_ = 0;
+  return true;
+}
+
+bool SqliteConnection::emptyLog() {
+  if (!moveLog(SQLITE_CHECKPOINT_TRUNCATE)) return false;
+  *logPages_ = 0;
+  return true;
+}
+
 void SqliteConnection::checkpointAtClose() {
-  sqlite3_wal_checkpoint_v2(connection_.get(), "main", SQLITE_CHECKPOINT_TRUNCATE, nullptr,
-                            nullptr);
+  emptyLog();
+  if (logIsDoubtful_) return;
   sqlite3_db_config(connection_.get(), SQLITE_DBCONFIG_NO_CKPT_ON_CLOSE, 0, nullptr);
 }
 
@@ -149,7 +225,20 @@ bool SqliteConnection::syncLog() {
       sqlite3_file_control(connection_.get(), "main", SQLITE_FCNTL_JOURNAL_POINTER, &log);
   if (found != SQLITE_OK) return false;
   if (log == nullptr || log->pMethods == nullptr) return true;
-  return log->pMethods->xSync(log, SQLITE_SYNC_NORMAL) == SQLITE_OK;
+  if (logIsDoubtful_ && !WriteAgain(*log)) return false;
+  logIsDoubtful_ = log->pMethods->xSync(log, SQLITE_SYNC_NORMAL) != SQLITE_OK;
+  return !logIsDoubtful_;
+}
+
+bool SqliteConnection::hasMoved() const {
+  struct stat status {};
+  if (::stat(path_.c_str(), &status) != 0) return errno == ENOENT || errno == ENOTDIR;
+  return status.st_dev != device_ || status.st_ino != inode_;
+}
+
+bool SqliteConnection::copyTo(const std::filesystem::path& path) {
+  SqliteStatement copy;
+  return prepare(copy, "VACUUM INTO ?1") && copy.bind(1, std::string_view(path.native())).run();
 }
 
 SqliteFault SqliteConnection::fault() const {

@@ -1,5 +1,7 @@
 #pragma once
 
+#include <sys/types.h>
+
 #include <cstdint>
 #include <filesystem>
 #include <memory>
@@ -36,6 +38,8 @@ class SqliteStatement {
   SqliteStatement& bind(int parameter, double real);
   SqliteStatement& bind(int parameter, std::string_view text);
   SqliteStatement& bind(int parameter, std::nullptr_t);
+  /// A column of another statement's current row, of whatever kind.
+  SqliteStatement& bind(int parameter, const SqliteStatement& row, int column);
 
   /// Runs to the end, whatever rows there are, and makes ready for the next run. False when it
   /// failed: the connection says why.
@@ -48,6 +52,8 @@ class SqliteStatement {
   // The current row's columns, counted from 0. The text is valid until the next step.
   [[nodiscard]] std::int64_t integer(int column) const;
   [[nodiscard]] std::string_view text(int column) const;
+  [[nodiscard]] double real(int column) const;
+  [[nodiscard]] bool isNull(int column) const;
 
  private:
   struct Finalize {
@@ -61,9 +67,9 @@ class SqliteConnection {
  public:
   SqliteConnection() = default;
 
-  /// Opens for reading and writing; `path` must be a file that exists. `vfs` empty: the default
-  /// one. False when it failed: `fault` and `message` say why.
-  bool open(const std::filesystem::path& path, const std::string& vfs);
+  /// Opens for reading and writing; `path` must be a file that exists. False when it failed:
+  /// `fault` and `message` say why.
+  bool open(const std::filesystem::path& path);
 
   /// Runs statements without parameters, rows ignored. False when one failed.
   bool execute(const char* statements);
@@ -81,14 +87,30 @@ class SqliteConnection {
   /// Moves what readers allow from the write-ahead log into the database file; never waits for one.
   /// True when that was everything: then every commit is on the medium.
   bool checkpoint();
+  /// Has the write-ahead log begin again at its start, all of it moved; waits for readers as long
+  /// as the busy time-out. False when a reader still needs it.
+  bool restartLog();
   /// Before closing: moves the whole log as far as readers let it (it waits for them as long as the
   /// busy time-out) and lets closing remove it.
   void checkpointAtClose();
-  /// Syncs the write-ahead log: everything committed is on the medium, and nothing new is written.
-  /// A failure does not show in `fault` and `message`.
+  /// Moves the whole log into the database file and leaves none of it behind; waits for readers as
+  /// long as the busy time-out. False when one was longer.
+  bool emptyLog();
+  /// Syncs the write-ahead log: everything committed is on the medium, and nothing new is written,
+  /// but for what an earlier sync failed to write. A failure does not show in `fault` and
+  /// `message`.
   bool syncLog();
+  /// Whether a sync has failed and none has succeeded since: then commits and checkpoints must wait
+  /// until `syncLog` has succeeded.
+  [[nodiscard]] bool logIsDoubtful() const { return logIsDoubtful_; }
   /// Pages in the write-ahead log after the last commit.
   [[nodiscard]] int logPages() const { return *logPages_; }
+
+  /// Whether the file is no longer where it was opened: it was removed or renamed, or its directory
+  /// was.
+  [[nodiscard]] bool hasMoved() const;
+  /// Copies everything that is committed into the file `path`, which must be empty or not exist.
+  bool copyTo(const std::filesystem::path& path);
 
   // About the last call that failed, also when it was rolled back since.
   [[nodiscard]] SqliteFault fault() const;
@@ -96,11 +118,17 @@ class SqliteConnection {
 
  private:
   [[nodiscard]] SqliteFault currentFault() const;
+  void noteSyncFailure();
+  bool moveLog(int mode);
 
   struct Close {
     void operator()(sqlite3* connection) const;
   };
   std::unique_ptr<int> logPages_ = std::make_unique<int>(0);  // where the commit hook writes
+  std::filesystem::path path_;
+  dev_t device_ = 0;
+  ino_t inode_ = 0;
+  bool logIsDoubtful_ = false;
   SqliteFault rolledBackFault_ = SqliteFault::none;
   std::string rolledBackMessage_;
   std::unique_ptr<sqlite3, Close> connection_;

@@ -12,6 +12,12 @@ const Payload* PayloadOf(const AgentSessionRow& row) {
 const Payload* PayloadOf(const FlushRow&) {
   return nullptr;
 }
+const Payload* PayloadOf(const ExportedRow&) {
+  return nullptr;
+}
+const Payload* PayloadOf(const ErasureRow&) {
+  return nullptr;
+}
 const Payload* PayloadOf(const auto& row) {
   return &row.payload;
 }
@@ -36,8 +42,16 @@ std::size_t StoreBatch::bytes(const StoreRow& row) {
       row);
 }
 
+const std::function<void(const std::optional<Error>&)>* StoreBatch::completion(
+    const StoreRow& row) {
+  if (const auto* flush = std::get_if<FlushRow>(&row)) return &flush->completion;
+  if (const auto* exported = std::get_if<ExportedRow>(&row)) return &exported->completion;
+  return nullptr;
+}
+
 bool StoreBatch::isCounted(const StoreRow& row) {
-  return !std::holds_alternative<AgentSessionRow>(row) && !std::holds_alternative<FlushRow>(row);
+  return !std::holds_alternative<AgentSessionRow>(row) &&
+         !std::holds_alternative<ErasureRow>(row) && completion(row) == nullptr;
 }
 
 }  // namespace quarvel

@@ -15,6 +15,8 @@
 #include "base/Date.h"
 #include "base/Error.h"
 #include "base/Payload.h"
+#include "platform/linux/store/ExportRecord.h"
+#include "platform/linux/store/StoreErasure.h"
 
 namespace quarvel {
 
@@ -75,8 +77,22 @@ struct FlushRow {
   std::array<TextSpan, 0> texts{};
 };
 
-using StoreRow =
-    std::variant<AgentSessionRow, MessageRow, AnalyticsEventRow, PowerEventRow, FlushRow>;
+/// Not a row of its own either: moves a backend's cursor and writes the ledger.
+struct ExportedRow {
+  ExportRecord record;
+  std::function<void(const std::optional<Error>&)> completion;
+  std::array<TextSpan, 0> texts{};
+};
+
+/// Nor is this: has the writer begin an erasure once everything before it is committed.
+struct ErasureRow {
+  ErasureSelection selection;
+  std::function<void(const Result<std::int64_t>&)> completion;
+  std::array<TextSpan, 0> texts{};
+};
+
+using StoreRow = std::variant<AgentSessionRow, MessageRow, AnalyticsEventRow, PowerEventRow,
+                              FlushRow, ExportedRow, ErasureRow>;
 
 /// Rows in the order in which they were queued. Their texts stand one after the other in one
 /// string, which is emptied and filled again with the batch, so that a row costs no allocation of
@@ -105,6 +121,9 @@ class StoreBatch {
 
   /// What a row counts for in the bound on bytes.
   [[nodiscard]] static std::size_t bytes(const StoreRow& row);
+  /// The completion that waits for a row's commit; null for one that has none.
+  [[nodiscard]] static const std::function<void(const std::optional<Error>&)>* completion(
+      const StoreRow& row);
   /// Whether a row is one of those that are counted from acceptance to storage.
   [[nodiscard]] static bool isCounted(const StoreRow& row);
 

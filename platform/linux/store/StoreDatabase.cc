@@ -8,16 +8,35 @@
 
 #include "base/Json.h"
 #include "platform/linux/store/StoreError.h"
+#include "platform/linux/store/StoreFile.h"
+#include "platform/linux/store/StoreSalvage.h"
 #include "platform/linux/store/StoreSchema.h"
 
 namespace quarvel {
 
 namespace {
 
-// In pages of 4 KiB. A longer log needs fewer syncs, but what is moved at once holds up the rows
-// behind it, and pages that the system has cached are cheaper than new ones.
-constexpr int kLogPages = 1024;
 constexpr std::size_t kKeptJson = 1 << 20;
+constexpr int kLogsBeforeRestart = 4;
+constexpr std::uint64_t kLogPageBytes = 4096;
+
+/// As much as the file itself, but enough for readers that take their time.
+int LongestLogPages(const StoreDatabase::Options& options) {
+  const std::uint64_t pages = options.bounds.maximumBytes / kLogPageBytes;
+  const auto least = static_cast<std::uint64_t>(options.logPages) * 16;
+  return static_cast<int>(std::clamp<std::uint64_t>(pages, least, 1 << 30));
+}
+
+constexpr const char* kMoveCursor =
+    "INSERT INTO backend_cursor SELECT ?1, ?2, ?3"
+    " WHERE (SELECT value FROM meta WHERE key = 'store_id') = ?4"
+    " ON CONFLICT DO UPDATE SET exported_through = excluded.exported_through";
+constexpr const char* kWriteLedger =
+    "INSERT INTO export_log(backend, table_name, first_id, last_id, rows, bytes, outcome, at)"
+    " VALUES(?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8)";
+// Some eight megabytes of lines: a busy device's of years.
+constexpr const char* kTrimLedger =
+    "DELETE FROM export_log WHERE id <= (SELECT max(id) FROM export_log) - 100000";
 
 std::int64_t Microseconds(Date date) {
   return date.time_since_epoch().count();
@@ -25,28 +44,34 @@ std::int64_t Microseconds(Date date) {
 
 }  // namespace
 
-Result<std::unique_ptr<StoreDatabase>> StoreDatabase::open(const Options& options, Date now) {
-  Result<SqliteConnection> connection = OpenStore(options.path, options.vfs, now);
+Result<std::unique_ptr<StoreDatabase>> StoreDatabase::open(const Options& options, Date now,
+                                                           bool isSuspect) {
+  Result<SqliteConnection> connection = OpenStore(options.path, now, isSuspect);
   if (!connection) return connection.error();
   std::unique_ptr<StoreDatabase> database(
-      new StoreDatabase(std::move(connection.value()), options.bounds));
-  if (!database->prepare(now)) {
-    return StoreError(StoreErrorCode::failed,
-                      fmt::format("The telemetry store {} cannot be read: {}.",
-                                  options.path.string(), database->message()));
+      new StoreDatabase(std::move(connection.value()), options));
+  if (database->prepare(options, now)) return database;
+  if (database->fault() == SqliteFault::corrupt && !isSuspect) {
+    database.reset();
+    return open(options, now, true);
   }
-  return database;
+  return StoreError(StoreErrorCode::failed,
+                    fmt::format("The telemetry store {} cannot be read: {}.", options.path.string(),
+                                database->message()));
 }
 
-StoreDatabase::StoreDatabase(SqliteConnection connection, StoreRetention::Bounds bounds)
+StoreDatabase::StoreDatabase(SqliteConnection connection, const Options& options)
     : connection_(std::move(connection)),
-      retention_(std::move(bounds), connection_, committedIDs_) {}
+      logPages_(options.logPages),
+      longestLogPages_(LongestLogPages(options)),
+      retention_(options.bounds, connection_, committedIDs_) {}
 
 StoreDatabase::~StoreDatabase() {
-  if (fault() != SqliteFault::corrupt) connection_.checkpointAtClose();
+  // The log of a file that was taken away has a name that may be another's now.
+  if (fault() != SqliteFault::corrupt && !wasTakenAway()) connection_.checkpointAtClose();
 }
 
-bool StoreDatabase::prepare(Date now) {
+bool StoreDatabase::prepare(const Options& options, Date now) {
   return connection_.prepare(begin_, "BEGIN IMMEDIATE") && connection_.prepare(commit_, "COMMIT") &&
          connection_.prepare(
              insertAgentSession_,
@@ -65,10 +90,27 @@ bool StoreDatabase::prepare(Date now) {
                              " VALUES(?1, ?2, ?3, ?4, ?5)") &&
          connection_.prepare(markFlushed_,
                              "UPDATE agent_session SET flushed_at = ?2 WHERE id = ?1") &&
-         readLastIDs() && retention_.prepare(lastAgentSession(), now);
+         connection_.prepare(keepDrops_, "INSERT OR REPLACE INTO meta VALUES(?1, ?2)") &&
+         connection_.prepare(moveCursor_, kMoveCursor) &&
+         connection_.prepare(writeLedger_, kWriteLedger) &&
+         connection_.prepare(trimLedger_, kTrimLedger) && readLastIDs() && learn(options) &&
+         retention_.prepare(committedIDs_[StoreTable::agentSession], now);
+}
+
+bool StoreDatabase::learn(const Options& options) {
+  const bool knowsAll = std::ranges::all_of(kAllStoreTables, [&](StoreTable table) {
+    return committedIDs_[table] >= options.knownIDs[table];
+  });
+  if (knowsAll) return true;
+  StoreDrops drops;
+  for (const StoreDrop reason : {StoreDrop::retention, StoreDrop::erased}) {
+    drops[reason] = std::max(dropsAtOpening_[reason], options.knownDrops[reason]);
+  }
+  return SettleAccounts(connection_, options.knownIDs, drops) && readLastIDs();
 }
 
 bool StoreDatabase::readLastIDs() {
+  storeID_ = connection_.text("SELECT value FROM meta WHERE key = 'store_id'").value_or("");
   for (const StoreTable table : kAllStoreTables) {
     const auto lastID = connection_.integer(
         fmt::format("SELECT max(ifnull((SELECT max(id) FROM {}), 0),"
@@ -78,29 +120,39 @@ bool StoreDatabase::readLastIDs() {
     committedIDs_[table] = *lastID;
   }
   lastIDs_ = committedIDs_;
-  const auto dropped = connection_.integer(
-      fmt::format("SELECT ifnull((SELECT CAST(value AS INTEGER) FROM meta WHERE key = '{}'), 0)",
-                  kDroppedByRetentionKey));
-  if (!dropped) return false;
-  std::int64_t everStored = 0;
-  for (const StoreTable table : kCountedStoreTables) everStored += committedIDs_[table];
-  droppedAtOpening_ = static_cast<std::uint64_t>(*dropped);
-  storedAtOpening_ = static_cast<std::uint64_t>(std::max(everStored - *dropped, std::int64_t{0}));
+  std::int64_t stored = 0;
+  for (const StoreTable table : kCountedStoreTables) stored += committedIDs_[table];
+  for (std::size_t i = 0; i < kStoreDrops; ++i) {
+    const auto reason = static_cast<StoreDrop>(i);
+    const auto dropped = connection_.integer(
+        fmt::format("SELECT max(ifnull((SELECT CAST(value AS INTEGER) FROM meta WHERE key = '{}'),"
+                    " 0), 0)",
+                    StoreDropKey(reason)));
+    if (!dropped) return false;
+    dropsAtOpening_[reason] = static_cast<std::uint64_t>(*dropped);
+    if (std::ranges::find(kDropsFromStore, reason) != kDropsFromStore.end()) stored -= *dropped;
+  }
+  storedAtOpening_ = static_cast<std::uint64_t>(std::max(stored, std::int64_t{0}));
+  keptDrops_ = dropsAtOpening_;
   return true;
 }
 
 bool StoreDatabase::write(const StoreBatch& batch, std::size_t first, std::size_t last,
-                          Safety safety, Date now) {
+                          Safety safety, Date now, const StoreDrops& drops) {
   now_ = Microseconds(now);
   bool changesFile = false;
+  if (connection_.logIsDoubtful() && !sync()) return false;
+  logIsTooLong_ = connection_.logPages() >= longestLogPages_ && !connection_.restartLog();
+  if (logIsTooLong_) return false;
   bool written = begin(safety);
   for (std::size_t i = first; written && i < last; ++i) {
     written =
         std::visit([this, &batch](const auto& row) { return insert(batch, row); }, batch.rows()[i]);
     changesFile = changesFile || connection_.changes() > 0;
   }
-  if (written && commit_.run()) {
+  if (written && keepDrops(drops) && commit_.run()) {
     committedIDs_ = lastIDs_;
+    keptDrops_ = drops;
     // A commit of nothing, as of the flush of a session whose row is gone, syncs nothing either.
     return changesFile || safety == Safety::normal || sync();
   }
@@ -121,9 +173,10 @@ bool StoreDatabase::begin(Safety safety) {
 }
 
 bool StoreDatabase::insert(const StoreBatch& batch, const AgentSessionRow& row) {
+  const std::int64_t id = placed(row.id);
   std::int64_t& lastID = lastIDs_[StoreTable::agentSession];
-  lastID = std::max(lastID, row.id);
-  return insertAgentSession_.bind(1, row.id)
+  lastID = std::max(lastID, id);
+  return insertAgentSession_.bind(1, id)
       .bind(2, row.sessionID)
       .bind(3, row.clientType)
       .bind(4, row.clientVersion)
@@ -138,7 +191,7 @@ bool StoreDatabase::insert(const StoreBatch& batch, const AgentSessionRow& row) 
 
 bool StoreDatabase::insert(const StoreBatch& batch, const MessageRow& row) {
   if (row.agentSession) {
-    insertMessage_.bind(2, *row.agentSession);
+    insertMessage_.bind(2, placed(*row.agentSession));
   } else {
     insertMessage_.bind(2, nullptr);
   }
@@ -171,7 +224,62 @@ bool StoreDatabase::insert(const StoreBatch& batch, const PowerEventRow& row) {
 }
 
 bool StoreDatabase::insert(const StoreBatch&, const FlushRow& row) {
-  return markFlushed_.bind(1, row.agentSession).bind(2, now_).run();
+  return markFlushed_.bind(1, placed(row.agentSession)).bind(2, now_).run();
+}
+
+bool StoreDatabase::keepDrops(const StoreDrops& drops) {
+  return std::ranges::all_of(kDropsBeforeStore, [&](StoreDrop reason) {
+    if (drops[reason] == keptDrops_[reason]) return true;
+    const std::string key = StoreDropKey(reason);
+    return keepDrops_.bind(1, key).bind(2, static_cast<std::int64_t>(drops[reason])).run();
+  });
+}
+
+bool StoreDatabase::insert(const StoreBatch&, const ExportedRow& row) {
+  const ExportRecord& record = row.record;
+  const char* const table = StoreTableName(record.table);
+  // Of a store that was set aside meanwhile, in which the ids meant other rows.
+  const bool moved = moveCursor_.bind(1, record.backend)
+                         .bind(2, table)
+                         .bind(3, record.lastID)
+                         .bind(4, record.storeID)
+                         .run();
+  if (!moved || connection_.changes() == 0) return moved;
+  for (const ExportRecord::Line& line : record.lines) {
+    if (!writeLedger_.bind(1, record.backend)
+             .bind(2, table)
+             .bind(3, line.firstID)
+             .bind(4, line.lastID)
+             .bind(5, line.rows)
+             .bind(6, line.bytes)
+             .bind(7, line.outcome)
+             .bind(8, now_)
+             .run()) {
+      return false;
+    }
+  }
+  return trimLedger_.run();
+}
+
+Outcome StoreDatabase::putBack(const std::filesystem::path& path, Date now) {
+  const Result<std::filesystem::path> place = MakePlaceFor(path, now);
+  if (!place) return place.error();
+  if (connection_.copyTo(place.value())) return SyncStoreFile(place.value());
+  return StoreError(StoreErrorCode::failed, connection_.message());
+}
+
+std::int64_t StoreDatabase::placed(std::int64_t session) const {
+  if (session < kProvisionalSessions) return session;
+  return session - kProvisionalSessions + provisionalSessionsAfter_;
+}
+
+std::string StoreDatabase::message() const {
+  if (connection_.logIsDoubtful()) return "the write-ahead log cannot be synced";
+  if (logIsTooLong_) {
+    return "a program reads the store in one transaction for so long that its log has grown as "
+           "large as the store may be; end it";
+  }
+  return connection_.message();
 }
 
 std::string_view StoreDatabase::json(const Payload& payload) {
@@ -185,9 +293,12 @@ bool StoreDatabase::checkpointIfDue() {
   const int logPages = connection_.logPages();
   // The log began again, or a reader has kept it from doing so: then what was moved is still there.
   if (logPages < checkpointedPages_) checkpointedPages_ = 0;
-  if (logPages - checkpointedPages_ < kLogPages) return false;
+  if (logPages - checkpointedPages_ < logPages_) return false;
   checkpointedPages_ = logPages;
-  return connection_.checkpoint();
+  // A log that has grown several times as long is kept from beginning again by readers: new ones
+  // wait for this.
+  return logPages < logPages_ * kLogsBeforeRestart ? connection_.checkpoint()
+                                                   : connection_.restartLog();
 }
 
 }  // namespace quarvel

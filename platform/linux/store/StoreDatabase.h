@@ -11,6 +11,7 @@
 #include "base/Error.h"
 #include "platform/linux/store/Sqlite.h"
 #include "platform/linux/store/StoreBatch.h"
+#include "platform/linux/store/StoreCounters.h"
 #include "platform/linux/store/StoreRetention.h"
 #include "platform/linux/store/StoreTables.h"
 
@@ -23,13 +24,17 @@ class StoreDatabase {
  public:
   struct Options {
     std::filesystem::path path;
-    std::string vfs;  // empty: the default
     StoreRetention::Bounds bounds;
+    int logPages = 1024;  // as `TelemetryStore::Options::logPages`
+    /// What this process knows of the store from an earlier opening: ids that were given, rows that
+    /// were removed.
+    StoreIDs knownIDs{};
+    StoreDrops knownDrops{};
   };
 
   /// As `OpenStore`.
-  [[nodiscard]] static Result<std::unique_ptr<StoreDatabase>> open(const Options& options,
-                                                                   Date now);
+  [[nodiscard]] static Result<std::unique_ptr<StoreDatabase>> open(const Options& options, Date now,
+                                                                   bool isSuspect);
   StoreDatabase(const StoreDatabase&) = delete;
   StoreDatabase& operator=(const StoreDatabase&) = delete;
   /// Moves everything into the database file and removes the log, as far as readers let it.
@@ -38,9 +43,10 @@ class StoreDatabase {
   /// How safe a commit is: `normal` survives the end of the process, `full` a power cut, and makes
   /// everything before it as safe.
   enum class Safety : std::uint8_t { normal, full };
-  /// Writes rows `first` to `last` - 1 of a batch in one transaction.
+  /// Writes rows `first` to `last` - 1 of a batch in one transaction, and what has been dropped
+  /// before it reached the store.
   [[nodiscard]] bool write(const StoreBatch& batch, std::size_t first, std::size_t last,
-                           Safety safety, Date now);
+                           Safety safety, Date now, const StoreDrops& drops);
   /// Makes all earlier commits as safe as a full one. Only the log is synced: a transaction to
   /// carry a full commit would wear the medium for nothing.
   [[nodiscard]] bool sync() { return connection_.syncLog(); }
@@ -51,23 +57,39 @@ class StoreDatabase {
   /// Does so at once: on a full disk this may give the log's own space back.
   void checkpoint() { connection_.checkpoint(); }
 
+  /// Whether the file has been taken away; then nobody will find what is written to it.
+  [[nodiscard]] bool wasTakenAway() const { return connection_.hasMoved(); }
+  /// Puts all that is in a file that was taken away where it was, with its directory; beside what
+  /// is there now, as a store set aside. It is opened like any other then.
+  [[nodiscard]] Outcome putBack(const std::filesystem::path& path, Date now);
+
+  /// Says after which id the sessions get theirs that were added while the file could not be
+  /// opened.
+  void placeProvisionalSessions(std::int64_t after) { provisionalSessionsAfter_ = after; }
+  /// An erasure of rows up to these ids; must not outlive this.
+  [[nodiscard]] std::unique_ptr<StoreErasure> erasure(const ErasureSelection& selection,
+                                                      const StoreIDs& through, Date now) {
+    return std::make_unique<StoreErasure>(connection_, selection, through, committedIDs_, now);
+  }
+
   [[nodiscard]] StoreRetention& retention() { return retention_; }
 
-  [[nodiscard]] std::int64_t lastAgentSession() const {
-    return committedIDs_[StoreTable::agentSession];
-  }
-  /// The counted rows as of opening: in the file, and removed from it by retention since it was
-  /// made.
+  [[nodiscard]] const std::string& storeID() const { return storeID_; }
+  /// The last ids that have been committed.
+  [[nodiscard]] const StoreIDs& lastIDs() const { return committedIDs_; }
+  /// The counted rows as of opening: in the file, and what the file says of others.
   [[nodiscard]] std::uint64_t storedAtOpening() const { return storedAtOpening_; }
-  [[nodiscard]] std::uint64_t droppedAtOpening() const { return droppedAtOpening_; }
+  [[nodiscard]] const StoreDrops& dropsAtOpening() const { return dropsAtOpening_; }
 
   [[nodiscard]] SqliteFault fault() const { return connection_.fault(); }
-  [[nodiscard]] std::string message() const { return connection_.message(); }
+  [[nodiscard]] std::string message() const;
 
  private:
-  StoreDatabase(SqliteConnection connection, StoreRetention::Bounds bounds);
-  [[nodiscard]] bool prepare(Date now);
+  StoreDatabase(SqliteConnection connection, const Options& options);
+  [[nodiscard]] bool prepare(const Options& options, Date now);
   [[nodiscard]] bool readLastIDs();
+  /// Should the file know less than this process does, it learns it.
+  [[nodiscard]] bool learn(const Options& options);
 
   bool begin(Safety safety);
   bool insert(const StoreBatch& batch, const AgentSessionRow& row);
@@ -75,21 +97,32 @@ class StoreDatabase {
   bool insert(const StoreBatch& batch, const AnalyticsEventRow& row);
   bool insert(const StoreBatch& batch, const PowerEventRow& row);
   bool insert(const StoreBatch& batch, const FlushRow& row);
+  bool keepDrops(const StoreDrops& drops);
+  bool insert(const StoreBatch& batch, const ExportedRow& row);
+  bool insert(const StoreBatch&, const ErasureRow&) { return true; }
   std::string_view json(const Payload& payload);
+  [[nodiscard]] std::int64_t placed(std::int64_t session) const;
 
   SqliteConnection connection_;  // before the statements, which must not outlive it
   SqliteStatement begin_, commit_;
   SqliteStatement insertAgentSession_, insertMessage_, insertAnalyticsEvent_, insertPowerEvent_;
-  SqliteStatement markFlushed_;
+  SqliteStatement markFlushed_, keepDrops_;
+  SqliteStatement moveCursor_, writeLedger_, trimLedger_;
   Safety safety_ = Safety::normal;  // what the connection is set to
-  int checkpointedPages_ = 0;       // length of the log at the last checkpoint
-  StoreIDs lastIDs_;                // given, in the transaction under way too
+  const int logPages_;
+  const int longestLogPages_;
+  bool logIsTooLong_ = false;
+  int checkpointedPages_ = 0;  // length of the log at the last checkpoint
+  std::string storeID_;
+  StoreIDs lastIDs_;  // given, in the transaction under way too
   StoreIDs committedIDs_;
   StoreRetention retention_;
+  std::int64_t provisionalSessionsAfter_ = 0;
   std::int64_t now_ = 0;  // of the transaction under way, in microseconds
   std::string json_;      // of the row under way; kept for its capacity
   std::uint64_t storedAtOpening_ = 0;
-  std::uint64_t droppedAtOpening_ = 0;
+  StoreDrops dropsAtOpening_;
+  StoreDrops keptDrops_;  // of those that are dropped before they reach the store
 };
 
 }  // namespace quarvel

@@ -17,6 +17,7 @@ enum class StoreErrorCode : std::int64_t {
   inaccessible = 4,  // the file or its directory cannot be used
   laterVersion = 5,  // a later version of the service wrote the store
   foreign = 6,       // the file is the database of another program
+  corrupt = 7,       // its header contradicts what is in it
 };
 
 [[nodiscard]] inline Error StoreError(StoreErrorCode code, std::string reason) {

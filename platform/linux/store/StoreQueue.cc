@@ -1,5 +1,7 @@
 #include "platform/linux/store/StoreQueue.h"
 
+#include <algorithm>
+
 #include "platform/linux/store/StoreError.h"
 #include "platform/linux/work/BlockingScope.h"
 
@@ -16,7 +18,7 @@ bool StoreQueue::hasRoom() const {
 }
 
 void StoreQueue::awaitRoom() {
-  if (closed_ || hasRoom()) return;
+  if (closed_ || hasRoom() || !BlockingScope::isAllowed()) return;
   const BlockingScope blocking;
   ++heldBack_;
   while (!closed_ && !hasRoom()) roomCame_.wait(mutex_);
@@ -24,9 +26,19 @@ void StoreQueue::awaitRoom() {
 }
 
 Error StoreQueue::refuse(std::uint64_t counted) {
-  counters_.accepted += counted;
-  counters_.refused += counted;
+  dropAccepted(StoreDrop::refused, counted);
   return StoreError(StoreErrorCode::closed, "The telemetry store is closed.");
+}
+
+void StoreQueue::dropAccepted(StoreDrop reason, std::uint64_t rows) {
+  counters_.accepted += rows;
+  counters_.dropped[reason] += rows;
+}
+
+void StoreQueue::droppedOnItsWay(StoreDrop reason) {
+  MutexLock lock(mutex_);
+  dropAccepted(reason, 1);
+  arrived();
 }
 
 void StoreQueue::appended() {
@@ -41,6 +53,11 @@ void StoreQueue::appended() {
 
 void StoreQueue::close() {
   MutexLock lock(mutex_);
+  if (!closed_) {
+    const std::int64_t onTheirWay = onTheirWay_.exchange(0);
+    dropAccepted(StoreDrop::serviceEnded,
+                 static_cast<std::uint64_t>(std::max(onTheirWay, std::int64_t{0})));
+  }
   closed_ = true;
   rowsCame_.notifyAll();
   roomCame_.notifyAll();
@@ -95,27 +112,39 @@ void StoreQueue::committed(const Tally& tally) {
 
 void StoreQueue::lost(const Tally& tally) {
   MutexLock lock(mutex_);
-  counters_.lost += tally.counted;
+  counters_.dropped[StoreDrop::storeClosed] += tally.counted;
   release(tally);
 }
 
-void StoreQueue::restart(std::uint64_t stored, std::uint64_t droppedByRetention) {
+void StoreQueue::restart(std::uint64_t stored, const StoreDrops& kept) {
   MutexLock lock(mutex_);
-  counters_.accepted += stored + droppedByRetention;
-  counters_.accepted -= counters_.stored + counters_.droppedByRetention;
   counters_.stored = stored;
-  counters_.droppedByRetention = droppedByRetention;
+  for (const StoreDrop reason : kDropsFromStore) counters_.dropped[reason] = kept[reason];
+  for (const StoreDrop reason : kDropsBeforeStore) {
+    // What is here and not there has not been kept yet.
+    counters_.dropped[reason] = std::max(counters_.dropped[reason], kept[reason]);
+  }
+  counters_.accepted = stored + counters_.waiting + counters_.dropped.sum();
 }
 
-void StoreQueue::droppedByRetention(std::uint64_t rows) {
+void StoreQueue::droppedFromStore(StoreDrop reason, std::uint64_t rows) {
   MutexLock lock(mutex_);
   counters_.stored -= rows;
-  counters_.droppedByRetention += rows;
+  counters_.dropped[reason] += rows;
 }
 
 StoreCounters StoreQueue::counters() const {
   MutexLock lock(mutex_);
-  return counters_;
+  StoreCounters counters = counters_;
+  const auto onTheirWay = static_cast<std::uint64_t>(std::max(onTheirWay_.load(), std::int64_t{0}));
+  counters.accepted += onTheirWay;
+  counters.waiting += onTheirWay;
+  return counters;
+}
+
+StoreQueue::Tally StoreQueue::outstanding() const {
+  MutexLock lock(mutex_);
+  return outstanding_;
 }
 
 }  // namespace quarvel

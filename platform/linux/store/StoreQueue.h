@@ -1,5 +1,6 @@
 #pragma once
 
+#include <atomic>
 #include <chrono>
 #include <cstddef>
 #include <cstdint>
@@ -11,19 +12,9 @@
 #include "base/Error.h"
 #include "base/Mutex.h"
 #include "platform/linux/store/StoreBatch.h"
+#include "platform/linux/store/StoreCounters.h"
 
 namespace quarvel {
-
-/// What has become of the rows (messages and events) that were offered to the store, since it was
-/// made. accepted = stored + waiting + droppedByRetention + refused + lost.
-struct StoreCounters {
-  std::uint64_t accepted = 0;
-  std::uint64_t stored = 0;  // in the database now
-  std::uint64_t waiting = 0;
-  std::uint64_t droppedByRetention = 0;
-  std::uint64_t refused = 0;  // since opening: the sender got an error
-  std::uint64_t lost = 0;     // since opening: the store was closed while the disk took nothing
-};
 
 /// Between any number of senders and the store's writer: bounded, first come, first served. A row
 /// counts against the bounds until it is committed or lost.
@@ -35,7 +26,8 @@ class StoreQueue {
       : maximumRows_(maximumRows), maximumBytes_(maximumBytes) {}
 
   /// Any thread. Holds the caller back while either bound is reached, so that the bound on bytes
-  /// may be passed by one row. Errors: the queue is closed, also while the caller was held back.
+  /// may be passed by one row; but lets one pass that must not wait (`BlockingScope`). Errors: the
+  /// queue is closed, also while the caller was held back.
   template <class Row>
   Outcome push(Row&& row, std::initializer_list<std::string_view> texts) QUARVEL_EXCLUDES(mutex_) {
     MutexLock lock(mutex_);
@@ -43,6 +35,22 @@ class StoreQueue {
     if (closed_) return refuse(1);
     append(std::forward<Row>(row), texts);
     return Success();
+  }
+
+  /// As `push`, but where that would hold the caller back it does nothing and returns false. True
+  /// also when the queue is closed.
+  template <class Row>
+  [[nodiscard]] bool pushIfRoom(Row&& row, std::initializer_list<std::string_view> texts)
+      QUARVEL_EXCLUDES(mutex_) {
+    MutexLock lock(mutex_);
+    if (closed_) {
+      (void)refuse(1);
+    } else if (hasRoom()) {
+      append(std::forward<Row>(row), texts);
+    } else {
+      return false;
+    }
+    return true;
   }
 
   /// As `push`, but never holds the caller back: for the few rows that everything else rests on.
@@ -55,7 +63,16 @@ class StoreQueue {
     return Success();
   }
 
-  /// Takes no more rows and wakes everybody. Any thread.
+  // What never was a row. Any thread; never holds the caller back.
+
+  /// Counts a message that is on its way to the queue, until it has `arrived`: pushed, or refused.
+  void onItsWay() { ++onTheirWay_; }
+  void arrived() { --onTheirWay_; }
+  /// It will not arrive.
+  void droppedOnItsWay(StoreDrop reason) QUARVEL_EXCLUDES(mutex_);
+
+  /// Takes no more rows and wakes everybody; what is still on its way is counted as dropped. Any
+  /// thread.
   void close() QUARVEL_EXCLUDES(mutex_);
   [[nodiscard]] bool isClosed() const QUARVEL_EXCLUDES(mutex_);
 
@@ -79,16 +96,19 @@ class StoreQueue {
   void committed(const Tally& tally) QUARVEL_EXCLUDES(mutex_);
   void lost(const Tally& tally) QUARVEL_EXCLUDES(mutex_);
 
-  /// Counts from what the opened database holds, and what has been removed from it.
-  void restart(std::uint64_t stored, std::uint64_t droppedByRetention) QUARVEL_EXCLUDES(mutex_);
-  void droppedByRetention(std::uint64_t rows) QUARVEL_EXCLUDES(mutex_);
+  /// Counts from what the opened database holds, and from the drops that it keeps.
+  void restart(std::uint64_t stored, const StoreDrops& kept) QUARVEL_EXCLUDES(mutex_);
+  void droppedFromStore(StoreDrop reason, std::uint64_t rows) QUARVEL_EXCLUDES(mutex_);
 
   [[nodiscard]] StoreCounters counters() const QUARVEL_EXCLUDES(mutex_);
+  /// What counts against the bounds now.
+  [[nodiscard]] Tally outstanding() const QUARVEL_EXCLUDES(mutex_);
 
  private:
   [[nodiscard]] bool hasRoom() const QUARVEL_REQUIRES(mutex_);
   void awaitRoom() QUARVEL_REQUIRES(mutex_);
   Error refuse(std::uint64_t counted) QUARVEL_REQUIRES(mutex_);
+  void dropAccepted(StoreDrop reason, std::uint64_t rows) QUARVEL_REQUIRES(mutex_);
   void release(const Tally& tally) QUARVEL_REQUIRES(mutex_);
 
   template <class Row>
@@ -102,6 +122,8 @@ class StoreQueue {
   const std::size_t maximumRows_;
   const std::size_t maximumBytes_;
 
+  std::atomic<std::int64_t> onTheirWay_ = 0;
+
   mutable Mutex mutex_;
   ConditionVariable rowsCame_;  // for the writer
   ConditionVariable roomCame_;  // for senders
@@ -111,7 +133,8 @@ class StoreQueue {
   std::size_t heldBack_ QUARVEL_GUARDED_BY(mutex_) = 0;
   StoreBatch waiting_ QUARVEL_GUARDED_BY(mutex_);
   Tally outstanding_ QUARVEL_GUARDED_BY(mutex_);  // queued, or taken and not yet committed
-  StoreCounters counters_ QUARVEL_GUARDED_BY(mutex_);
+  StoreCounters counters_                         // without what is on its way
+      QUARVEL_GUARDED_BY(mutex_);
 };
 
 }  // namespace quarvel

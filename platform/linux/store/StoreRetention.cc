@@ -5,6 +5,8 @@
 #include <algorithm>
 #include <limits>
 
+#include "platform/linux/store/StoreCounters.h"
+
 namespace quarvel {
 
 namespace {
@@ -130,7 +132,8 @@ bool StoreRetention::record(std::int64_t removed) {
     const std::string key = LastIDKey(table);
     if (!keepLastID_.bind(1, key).bind(2, lastIDs_[table]).run()) return false;
   }
-  return countDropped_.bind(1, kDroppedByRetentionKey).bind(2, removed).run();
+  const std::string key = StoreDropKey(StoreDrop::retention);
+  return countDropped_.bind(1, key).bind(2, removed).run();
 }
 
 std::optional<StoreRetention::Window> StoreRetention::window(StoreTable table, std::uint64_t bytes,

@@ -1,18 +1,18 @@
 #include "platform/linux/store/StoreSchema.h"
 
-#include <fcntl.h>
 #include <fmt/format.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
 #include <algorithm>
-#include <array>
+#include <bit>
 #include <cerrno>
+#include <cstdint>
 #include <system_error>
 
-#include "platform/Log.h"
 #include "platform/linux/store/SecureRandom.h"
 #include "platform/linux/store/StoreError.h"
+#include "platform/linux/store/StoreFile.h"
+#include "platform/linux/store/StoreSalvage.h"
+#include "platform/linux/store/StoreTables.h"
 
 namespace quarvel {
 
@@ -49,47 +49,6 @@ CREATE TABLE export_log(
 CREATE TABLE meta(key TEXT PRIMARY KEY, value TEXT NOT NULL);
 )sql";
 
-Error Inaccessible(const std::filesystem::path& path, int errorNumber, std::string_view remedy) {
-  return StoreError(StoreErrorCode::inaccessible,
-                    fmt::format("The telemetry store {} cannot be used: {}. {}", path.string(),
-                                std::generic_category().message(errorNumber), remedy));
-}
-
-/// Makes the file when there is none, and says clearly what is wrong when it cannot be used:
-/// SQLite's own answer to all of these is "unable to open database file".
-Outcome MakeFile(const std::filesystem::path& path) {
-  const int made = ::open(path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, 0640);
-  if (made >= 0) {
-    // The process's mask may have taken bits away.
-    const bool moded = ::fchmod(made, 0640) == 0;
-    ::close(made);
-    if (moded) return Success();
-    return Inaccessible(path, errno, "The file system must keep permissions.");
-  }
-  const std::string directory = path.parent_path().string();
-  if (errno == ENOENT || errno == ENOTDIR) {
-    return Inaccessible(path, errno,
-                        fmt::format("Make the directory {}, or set path in [store].", directory));
-  }
-  if (errno != EEXIST) {
-    return Inaccessible(
-        path, errno,
-        fmt::format("Let the service write to {}, or set path in [store].", directory));
-  }
-  struct stat status {};
-  if (::stat(path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) {
-    return Inaccessible(path, EEXIST, "It must be a file: move away what is there.");
-  }
-  if (::access(path.c_str(), R_OK | W_OK) != 0) {
-    return Inaccessible(path, errno, "Let the service read and write it, or set path in [store].");
-  }
-  if (::access(path.parent_path().empty() ? "." : directory.c_str(), W_OK | X_OK) != 0) {
-    // The write-ahead log stands beside the file.
-    return Inaccessible(path, errno, fmt::format("Let the service write to {} too.", directory));
-  }
-  return Success();
-}
-
 Error Failed(const std::filesystem::path& path, const SqliteConnection& connection) {
   return StoreError(connection.fault() == SqliteFault::diskFull ? StoreErrorCode::diskFull
                                                                 : StoreErrorCode::failed,
@@ -109,6 +68,14 @@ bool CreateTables(SqliteConnection& connection) {
                  .c_str());
 }
 
+/// Whether the numbers are neither ours nor anybody's, but what one wrong bit makes of ours.
+bool HasDamagedHeader(std::int64_t application, std::int64_t version) {
+  constexpr std::int64_t kNoVersionYet = 10'000;
+  const auto difference = static_cast<std::uint64_t>(application ^ kApplicationID);
+  return std::has_single_bit(difference) ||
+         (difference == 0 && (version < 0 || version >= kNoVersionYet));
+}
+
 /// What the file is, and what it takes to make it a store of this version.
 Outcome BringToVersion(const std::filesystem::path& path, SqliteConnection& connection) {
   const auto application = connection.integer("PRAGMA application_id");
@@ -117,6 +84,9 @@ Outcome BringToVersion(const std::filesystem::path& path, SqliteConnection& conn
   if (!application || !version || !tables) return Failed(path, connection);
 
   const bool isNew = *application == 0 && *version == 0 && *tables == 0;
+  if (HasDamagedHeader(*application, *version)) {
+    return StoreError(StoreErrorCode::corrupt, "its header is damaged");
+  }
   if (!isNew && *application != kApplicationID) {
     return StoreError(StoreErrorCode::foreign,
                       fmt::format("{} is the database of another program. Set path in [store] to a "
@@ -140,32 +110,50 @@ Outcome BringToVersion(const std::filesystem::path& path, SqliteConnection& conn
   return Success();
 }
 
-/// Looks at both ends of every table. A full check of the file would take seconds; what it could
-/// find beyond this is found, and dealt with in the same way, when it is met.
-bool IsSound(SqliteConnection& connection) {
+/// How closely a file is looked at before it is used.
+enum class Look : std::uint8_t { brief, close };
+
+/// Looks at both ends of every table, or closely at every page, which takes a second for a few
+/// hundred megabytes. What a brief look does not find is dealt with in the same way when it is met.
+bool IsSound(SqliteConnection& connection, Look look) {
   return connection.integer("SELECT count(value) FROM meta WHERE key = 'store_id'").value_or(0) ==
              1 &&
-         std::ranges::all_of(
-             std::array{"agent_session", "message", "analytics_event", "power_event"},
-             [&connection](const char* table) {
-               const std::string ends = fmt::format(
-                   "SELECT ifnull((SELECT min(id) FROM {0}), 0) <= "
-                   "ifnull((SELECT max(id) FROM {0}), 0)",
-                   table);
-               return connection.integer(ends).has_value();
-             });
+         connection.text("PRAGMA encoding") == "UTF-8" &&
+         std::ranges::all_of(kAllStoreTables,
+                             [&connection](StoreTable table) {
+                               const std::string ends = fmt::format(
+                                   "SELECT ifnull((SELECT min(id) FROM {0}), 0) <= "
+                                   "ifnull((SELECT max(id) FROM {0}), 0)",
+                                   StoreTableName(table));
+                               return connection.integer(ends).has_value();
+                             }) &&
+         (look == Look::brief || connection.text("PRAGMA quick_check(1)") == "ok");
+}
+
+/// What costs milliseconds is always looked at closely; after an end that was not in order, when
+/// the log is still there, what costs a tenth of a second.
+Look LookFor(const std::filesystem::path& path, bool isSuspect) {
+  constexpr std::uintmax_t kAlwaysChecked = 4 << 20;
+  constexpr std::uintmax_t kCheckedWhenLeftBehind = 32 << 20;
+  std::error_code none;
+  const auto log = std::filesystem::file_size(path.string() + "-wal", none);
+  const bool wasLeftBehind = !none && log > 0;
+  const auto bytes = std::filesystem::file_size(path, none);
+  if (isSuspect) return Look::close;
+  const std::uintmax_t checked = wasLeftBehind ? kCheckedWhenLeftBehind : kAlwaysChecked;
+  return !none && bytes <= checked ? Look::close : Look::brief;
 }
 
 /// Whether a file that could not be used is corrupt. In one that is a store by its header
-/// (`isStore`), so is a table that is missing.
-bool IsCorrupt(SqliteFault fault, bool isStore) {
+/// (`opened`), so is a table that is missing, or pages that make no sense.
+bool IsCorrupt(SqliteFault fault, const Outcome& opened) {
   return fault == SqliteFault::corrupt ||
-         (isStore && (fault == SqliteFault::statement || fault == SqliteFault::none));
+         (!opened && opened.error().code == static_cast<std::int64_t>(StoreErrorCode::corrupt)) ||
+         (opened && (fault == SqliteFault::statement || fault == SqliteFault::none));
 }
 
-Outcome Open(const std::filesystem::path& path, const std::string& vfs,
-             SqliteConnection& connection) {
-  if (!connection.open(path, vfs)) return Failed(path, connection);
+Outcome Open(const std::filesystem::path& path, SqliteConnection& connection) {
+  if (!connection.open(path)) return Failed(path, connection);
   if (Outcome version = BringToVersion(path, connection); !version) return version;
   // Deleted rows are overwritten only where that costs no further page.
   if (!connection.execute("PRAGMA journal_mode = WAL; PRAGMA synchronous = NORMAL;"
@@ -173,42 +161,31 @@ Outcome Open(const std::filesystem::path& path, const std::string& vfs,
     return Failed(path, connection);
   }
   if (connection.text("PRAGMA journal_mode") != "wal") {
-    return Inaccessible(path, ENOTSUP, "Its file system must have shared memory and locks.");
+    return StoreUnusable(path, ENOTSUP, "Its file system must have shared memory and locks.");
   }
   return Success();
 }
 
 }  // namespace
 
-Outcome SetStoreAside(const std::filesystem::path& path, Date now, const std::string& reason) {
-  ZQ_FUNCTION("SetStoreAside");
-  std::string time = DateText(now);
-  std::erase_if(time, [](char character) { return character == '-' || character == ':'; });
-  const std::filesystem::path aside = fmt::format("{}.corrupt-{}", path.string(), time);
-  for (const char* suffix : {"", "-wal", "-shm"}) {
-    const std::string from = path.string() + suffix;
-    if (::rename(from.c_str(), (aside.string() + suffix).c_str()) != 0 && errno != ENOENT) {
-      return Inaccessible(from, errno, "It is corrupt: move it away.");
-    }
-  }
-  ZQ_LOG(nullptr, error,
-         "The telemetry store {} is corrupt ({}). It is kept as {}, and a new one begun.",
-         path.string(), reason, aside.string());
-  return Success();
-}
-
-Result<SqliteConnection> OpenStore(const std::filesystem::path& path, const std::string& vfs,
-                                   Date now) {
-  for (bool mayBeCorrupt = true;; mayBeCorrupt = false) {
-    if (Outcome file = MakeFile(path); !file) return file.error();
+Result<SqliteConnection> OpenStore(const std::filesystem::path& path, Date now, bool isSuspect) {
+  const Look look = LookFor(path, isSuspect);
+  // An error of the medium that passes may look like damage: what looks so twice is set aside.
+  for (int timesCorrupt = 0;;) {
+    if (Outcome file = MakeStoreFile(path, now); !file) return file.error();
     SqliteConnection connection;
-    const Outcome opened = Open(path, vfs, connection);
-    if (opened && IsSound(connection)) return connection;
-    if (!mayBeCorrupt || !IsCorrupt(connection.fault(), opened.ok())) {
+    const Outcome opened = Open(path, connection);
+    if (opened && IsSound(connection, look)) {
+      SalvageStoresSetAside(path, connection);
+      return connection;
+    }
+    if (!IsCorrupt(connection.fault(), opened) || ++timesCorrupt > 2) {
       return opened ? Failed(path, connection) : opened.error();
     }
-    const std::string reason =
-        connection.fault() == SqliteFault::none ? "no store_id" : connection.message();
+    if (timesCorrupt < 2) continue;
+    const std::string reason = connection.fault() == SqliteFault::none
+                                   ? "its content makes no sense"
+                                   : connection.message();
     connection = {};
     if (Outcome aside = SetStoreAside(path, now, reason); !aside) return aside.error();
   }

@@ -11,15 +11,12 @@
 namespace quarvel {
 
 /// Opens the store's file and brings it to this version of the schema: makes a new one when there
-/// is none, sets a corrupt one aside and makes a new one then. Logs what it did. Errors: domain
+/// is none, sets a corrupt one aside, makes a new one then and copies into it what can be read of
+/// the old one. Logs what it did. Errors: domain
 /// "quarvel.store", each with a reason that says what to do; the file is left as it was.
-/// `now` names what is set aside.
-[[nodiscard]] Result<SqliteConnection> OpenStore(const std::filesystem::path& path,
-                                                 const std::string& vfs, Date now);
-
-/// Renames the database at `path` and its side files, so that nothing of it is lost but a new one
-/// can be begun; says so in the log. No connection may be open.
-[[nodiscard]] Outcome SetStoreAside(const std::filesystem::path& path, Date now,
-                                    const std::string& reason);
+/// `now` names what is set aside. `isSuspect`: the file has been found to be corrupt, which a close
+/// look will find again.
+[[nodiscard]] Result<SqliteConnection> OpenStore(const std::filesystem::path& path, Date now,
+                                                 bool isSuspect);
 
 }  // namespace quarvel

@@ -22,6 +22,7 @@ class PerStoreTable {
  public:
   T& operator[](StoreTable table) { return each_[static_cast<std::size_t>(table)]; }
   const T& operator[](StoreTable table) const { return each_[static_cast<std::size_t>(table)]; }
+  bool operator==(const PerStoreTable&) const = default;
 
  private:
   std::array<T, kAllStoreTables.size()> each_{};
@@ -37,11 +38,22 @@ class PerStoreTable {
 /// came.
 using StoreIDs = PerStoreTable<std::int64_t>;
 
+/// How far a store is safe from a power cut. What lies beyond may yet be lost, and its ids given to
+/// other rows.
+struct StoreExtent {
+  std::string storeID;
+  StoreIDs lastIDs;
+
+  bool operator==(const StoreExtent&) const = default;
+};
+
+/// From here on are the ids of agent sessions that were added while nobody knew which ids the file
+/// has given; they are placed behind those when it is opened.
+inline constexpr std::int64_t kProvisionalSessions = std::int64_t{1} << 62;
+
 /// The key in `meta` under which a table's last id is kept once rows of it have been removed.
 [[nodiscard]] inline std::string LastIDKey(StoreTable table) {
   return std::string("last_id.") + StoreTableName(table);
 }
-/// The key in `meta` that counts the rows removed by retention.
-inline constexpr const char* kDroppedByRetentionKey = "dropped.retention";
 
 }  // namespace quarvel

@@ -8,7 +8,6 @@
 
 #include "platform/Log.h"
 #include "platform/linux/store/StoreError.h"
-#include "platform/linux/store/StoreSchema.h"
 
 namespace quarvel {
 
@@ -17,10 +16,10 @@ namespace {
 using std::chrono::steady_clock;
 
 constexpr std::size_t kRowsPerCommit = 1024;
-constexpr std::chrono::milliseconds kFirstBackOff{50};
 constexpr std::chrono::milliseconds kLongestBackOff{5000};
-constexpr std::chrono::hours kAgeingInterval{1};
+constexpr std::chrono::minutes kClockMayDrift{5};
 constexpr int kRetentionStepsPerCommit = 16;
+constexpr int kAttemptsPerConnection = 4;
 
 /// Early enough for the sync itself to end in time.
 std::chrono::milliseconds SyncAfter(std::chrono::milliseconds sync) {
@@ -37,14 +36,24 @@ bool StoreWriter::Minutely::due() {
 }
 
 StoreWriter::StoreWriter(Options options, std::unique_ptr<StoreDatabase> database,
-                         StoreQueue& queue)
+                         const std::optional<Error>& failure, StoreQueue& queue)
     : options_(std::move(options)),
       syncAfter_(SyncAfter(options_.sync)),
       queue_(queue),
       database_(std::move(database)),
-      nextAgeing_(steady_clock::now() + kAgeingInterval) {}
+      agedAt_(steady_clock::now()),
+      agedAtDate_(options_.clock()) {
+  if (database_) {
+    lastEarlierSession_ = database_->lastIDs()[StoreTable::agentSession];
+    queue_.restart(database_->storedAtOpening(), database_->dropsAtOpening());
+  } else {
+    failed(*failure);
+  }
+}
 
 void StoreWriter::run() {
+  // What a killed process left in the log may not be on the medium yet.
+  if (database_ && !options_.database.bounds.remoteBackends.empty()) syncTail();
   StoreBatch batch;
   for (;;) {
     switch (queue_.take(batch, nextDeadline())) {
@@ -63,13 +72,16 @@ void StoreWriter::run() {
 }
 
 std::optional<StoreWriter::Instant> StoreWriter::nextDeadline() const {
-  if (retaining_) return Instant{};
+  if (retaining_ || isSuspect_ || !erasures_.empty()) return Instant{};
   if (unsyncedSince_) return *unsyncedSince_ + syncAfter_;
   return std::nullopt;
 }
 
 void StoreWriter::atDeadline() {
+  // A new file is begun at once; should that fail, it is tried again when rows come.
+  if (std::exchange(isSuspect_, false) && !database_) (void)reopen(true);
   if (unsyncedSince_ && steady_clock::now() >= *unsyncedSince_ + syncAfter_) syncTail();
+  erase();
   if (!retaining_) return;
   const auto expired =
       ageing_ ? std::optional(options_.clock() - options_.maximumAge) : std::nullopt;
@@ -79,50 +91,69 @@ void StoreWriter::atDeadline() {
 void StoreWriter::write(const StoreBatch& batch) {
   const std::size_t rows = batch.rows().size();
   for (std::size_t first = 0; first < rows;) {
-    const std::size_t last = std::min(first + kRowsPerCommit, rows);
+    std::size_t last = first;
     StoreQueue::Tally tally;
-    for (std::size_t i = first; i < last; ++i) tally.add(batch.rows()[i]);
+    while (last < rows && tally.rows < kRowsPerCommit) {
+      const StoreRow& row = batch.rows()[last++];
+      tally.add(row);
+      // What was added after an erasure was asked for is none of its rows.
+      if (std::holds_alternative<ErasureRow>(row)) break;
+    }
     if (!gaveUp_) makeRoom(tally);
     if (gaveUp_ || !writeRows(batch, first, last)) {
       lose(batch, first);
       return;
     }
     queue_.committed(tally);
-    completeFlushes(batch, first, last, std::nullopt);
-    if (database_->checkpointIfDue()) unsyncedSince_.reset();
+    complete(batch, first, last, std::nullopt);
+    if (database_->checkpointIfDue()) allIsSafe();
+    erase();
     first = last;
   }
-  if (steady_clock::now() >= nextAgeing_) {
-    nextAgeing_ = steady_clock::now() + kAgeingInterval;
+  putBackIfTakenAway();
+  if (steady_clock::now() >= agedAt_ + options_.ageing) beginAgeing();
+}
+
+void StoreWriter::beginAgeing() {
+  ZQ_FUNCTION("StoreWriter::beginAgeing");
+  const Instant now = steady_clock::now();
+  const Date date = options_.clock();
+  const auto step = (date - std::exchange(agedAtDate_, date)) - (now - std::exchange(agedAt_, now));
+  if (step >= -kClockMayDrift && step <= kClockMayDrift) {
     retaining_ = ageing_ = true;
+    return;
   }
+  ZQ_LOG(
+      nullptr, standard,
+      "The clock was set by {} s: no row is removed for its age until it has run on for a while.",
+      std::chrono::floor<std::chrono::seconds>(step).count());
 }
 
 bool StoreWriter::writeRows(const StoreBatch& batch, std::size_t first, std::size_t last) {
-  ZQ_FUNCTION("StoreWriter::writeRows");
-  std::chrono::milliseconds backOff = kFirstBackOff;
+  std::chrono::milliseconds backOff = options_.firstBackOff;
   bool closing = false;
-  while (!tryToWrite(batch, first, last)) {
+  for (int attempts = 1; !tryToWrite(batch, first, last); ++attempts) {
     failed(database_ ? databaseError() : failure_);
     if (closing) return false;
     closing = queue_.waitForClose(steady_clock::now() + backOff);
     backOff = std::min(backOff * 2, kLongestBackOff);
     if (database_) database_->checkpoint();
+    // What does not go away by itself may be the connection's.
+    if (attempts % kAttemptsPerConnection == 0) close();
   }
-  if (backOff != kFirstBackOff) {
-    ZQ_LOG(nullptr, standard, "The telemetry store {} takes rows again.",
-           options_.database.path.string());
-  }
+  succeeded();
   return true;
 }
 
 bool StoreWriter::tryToWrite(const StoreBatch& batch, std::size_t first, std::size_t last) {
-  if (!database_ && !reopen()) return false;
+  if (!database_ && !reopen(std::exchange(isSuspect_, false))) return false;
   const bool full = needsFullCommit(batch, first, last);
   const auto safety = full ? StoreDatabase::Safety::full : StoreDatabase::Safety::normal;
-  if (!database_->write(batch, first, last, safety, options_.clock())) return false;
+  if (!database_->write(batch, first, last, safety, options_.clock(), queue_.counters().dropped)) {
+    return false;
+  }
   if (full) {
-    unsyncedSince_.reset();
+    allIsSafe();
   } else if (!unsyncedSince_) {
     unsyncedSince_ = batch.queuedAt;
   }
@@ -139,11 +170,66 @@ bool StoreWriter::needsFullCommit(const StoreBatch& batch, std::size_t first,
                      [](const StoreRow& row) { return std::holds_alternative<FlushRow>(row); });
 }
 
-void StoreWriter::completeFlushes(const StoreBatch& batch, std::size_t first, std::size_t last,
-                                  const std::optional<Error>& error) {
+void StoreWriter::followExtent(std::function<void(const StoreExtent&)> follower) {
+  MutexLock lock(following_);
+  extentFollower_ = std::move(follower);
+  if (extentFollower_) extentFollower_(extent_);
+}
+
+void StoreWriter::allIsSafe() {
+  unsyncedSince_.reset();
+  MutexLock lock(following_);
+  StoreExtent extent{database_->storeID(), database_->lastIDs()};
+  if (extent == extent_) return;
+  extent_ = std::move(extent);
+  if (extentFollower_) extentFollower_(extent_);
+}
+
+void StoreWriter::complete(const StoreBatch& batch, std::size_t first, std::size_t last,
+                           const std::optional<Error>& error) {
   for (std::size_t i = first; i < last; ++i) {
-    if (const auto* flush = std::get_if<FlushRow>(&batch.rows()[i])) flush->completion(error);
+    const StoreRow& row = batch.rows()[i];
+    if (const auto* completion = StoreBatch::completion(row)) (*completion)(error);
+    const auto* erasure = std::get_if<ErasureRow>(&row);
+    if (erasure != nullptr && error) erasure->completion(*error);
+    if (erasure != nullptr && !error) erasures_.push_back({*erasure, database_->lastIDs()});
   }
+}
+
+void StoreWriter::erase() {
+  ZQ_FUNCTION("StoreWriter::erase");
+  if (erasures_.empty()) return;
+  if (!database_ && !reopen(false)) return endErasure(failure_);
+  if (!erasure_) {
+    erasure_ = database_->erasure(erasures_.front().wanted.selection, erasures_.front().through,
+                                  options_.clock());
+  }
+  const auto progress = erasure_->step();
+  queue_.droppedFromStore(StoreDrop::erased, erasure_->takeCounted());
+  if (!unsyncedSince_) unsyncedSince_ = steady_clock::now();
+  switch (progress) {
+    case StoreErasure::Progress::more:
+      return;
+    case StoreErasure::Progress::failed:
+      failed(databaseError());
+      if (erasure_) endErasure(failure_);
+      return;
+    case StoreErasure::Progress::done:
+      break;
+  }
+  const std::int64_t rows = erasure_->rows();
+  ZQ_LOG(nullptr, standard, "{} rows were erased ({}).{}", rows,
+         erasures_.front().wanted.selection.description(),
+         erasure_->logRemains() ? " A reader keeps the log that still holds them." : "");
+  endErasure(rows);
+}
+
+void StoreWriter::endErasure(const Result<std::int64_t>& rows) {
+  erasure_.reset();
+  if (erasures_.empty()) return;
+  const ErasureRow ended = std::move(erasures_.front().wanted);
+  erasures_.pop_front();
+  ended.completion(rows);
 }
 
 void StoreWriter::lose(const StoreBatch& batch, std::size_t first) {
@@ -151,13 +237,17 @@ void StoreWriter::lose(const StoreBatch& batch, std::size_t first) {
   StoreQueue::Tally tally;
   for (std::size_t i = first; i < batch.rows().size(); ++i) tally.add(batch.rows()[i]);
   queue_.lost(tally);
-  completeFlushes(batch, first, batch.rows().size(), failure_);
+  complete(batch, first, batch.rows().size(), failure_);
 }
 
 void StoreWriter::syncTail() {
   unsyncedSince_.reset();
-  if (database_->sync()) return;
-  failed(StoreError(StoreErrorCode::failed, "the write-ahead log cannot be synced"));
+  if (!database_) return;
+  if (database_->sync()) {
+    succeeded();
+    return allIsSafe();
+  }
+  failed(databaseError());
   unsyncedSince_ = steady_clock::now();
 }
 
@@ -177,12 +267,26 @@ bool StoreWriter::retain(std::uint64_t incomingBytes, std::optional<Date> expire
   if (!database_) return false;
   const auto removed = database_->retention().takeRemoved();
   if (removed.rows > 0) {
-    queue_.droppedByRetention(removed.rows);
+    queue_.droppedFromStore(StoreDrop::retention, removed.rows);
     removedNotExported_ += removed.notExported;
-    reportRemoved(removedLine_.due());
+    if (removedNotExported_ > 0) reportRemoved(removedLine_.due());
     if (!unsyncedSince_) unsyncedSince_ = steady_clock::now();
   }
   return progress == StoreRetention::Progress::more;
+}
+
+void StoreWriter::putBackIfTakenAway() {
+  ZQ_FUNCTION("StoreWriter::putBackIfTakenAway");
+  if (!database_ || !database_->wasTakenAway()) return;
+  const Outcome back = database_->putBack(options_.database.path, options_.clock());
+  if (!back) {
+    // Its rows are in memory of nobody but this file: it stays open, and rows go on into it.
+    return failed(back.error());
+  }
+  ZQ_LOG(nullptr, error, "The telemetry store {} was taken away: all that was in it is put back.",
+         options_.database.path.string());
+  close();
+  if (reopen(false)) succeeded();
 }
 
 void StoreWriter::reportRemoved(bool now) {
@@ -201,39 +305,77 @@ Error StoreWriter::databaseError() const {
 void StoreWriter::failed(Error error) {
   ZQ_FUNCTION("StoreWriter::failed");
   failure_ = std::move(error);
+  failing_ = true;
+  setProblem(failure_.description());
   if (failureLine_.due()) {
     ZQ_LOG(nullptr, error, "The telemetry store {} fails: {}. Trying again; {} rows wait.",
            options_.database.path.string(), failure_.description(), queue_.counters().waiting);
   }
   if (!database_ || database_->fault() != SqliteFault::corrupt) return;
-  const std::string reason = database_->message();
-  database_.reset();
-  unsyncedSince_.reset();
-  if (Outcome aside = SetStoreAside(options_.database.path, options_.clock(), reason); !aside) {
-    failure_ = aside.error();
-  }
+  endErasure(failure_);
+  close();
+  isSuspect_ = true;
 }
 
-bool StoreWriter::reopen() {
-  auto database = StoreDatabase::open(options_.database, options_.clock());
+void StoreWriter::succeeded() {
+  ZQ_FUNCTION("StoreWriter::succeeded");
+  if (!std::exchange(failing_, false)) return;
+  setProblem(std::nullopt);
+  ZQ_LOG(nullptr, standard, "The telemetry store {} takes rows again.",
+         options_.database.path.string());
+}
+
+void StoreWriter::setProblem(std::optional<std::string> problem) {
+  MutexLock lock(problemMutex_);
+  problem_ = std::move(problem);
+}
+
+std::optional<std::string> StoreWriter::problem() const {
+  MutexLock lock(problemMutex_);
+  return problem_;
+}
+
+void StoreWriter::close() {
+  erasure_.reset();
+  if (database_) knownIDs_ = database_->lastIDs();
+  database_.reset();
+  unsyncedSince_.reset();
+}
+
+bool StoreWriter::reopen(bool isSuspect) {
+  StoreDatabase::Options options = options_.database;
+  options.knownIDs = knownIDs_;
+  options.knownDrops = queue_.counters().dropped;
+  auto database = StoreDatabase::open(options, options_.clock(), isSuspect);
   if (!database) {
     failure_ = database.error();
     return false;
   }
   database_ = std::move(database.value());
-  queue_.restart(database_->storedAtOpening(), database_->droppedAtOpening());
+  if (!lastEarlierSession_) lastEarlierSession_ = database_->lastIDs()[StoreTable::agentSession];
+  database_->placeProvisionalSessions(*lastEarlierSession_);
+  queue_.restart(database_->storedAtOpening(), database_->dropsAtOpening());
   return true;
 }
 
 void StoreWriter::finish() {
   ZQ_FUNCTION("StoreWriter::finish");
+  while (!erasures_.empty()) {
+    endErasure(StoreError(StoreErrorCode::closed, "The store was closed before all was erased."));
+  }
+  const StoreDrops drops = queue_.counters().dropped;
+  if (database_ && !gaveUp_ &&
+      !database_->write({}, 0, 0, StoreDatabase::Safety::full, options_.clock(), drops)) {
+    failed(databaseError());
+  }
   if (unsyncedSince_) syncTail();
-  if (const std::uint64_t lost = queue_.counters().lost; lost > 0) {
+  putBackIfTakenAway();
+  if (const std::uint64_t lost = drops[StoreDrop::storeClosed]; lost > 0) {
     ZQ_LOG(nullptr, error, "The telemetry store {} was closed while it took no rows: {} are lost.",
            options_.database.path.string(), lost);
   }
   reportRemoved(true);
-  database_.reset();
+  close();
 }
 
 }  // namespace quarvel

@@ -3,6 +3,7 @@
 #include <chrono>
 #include <cstddef>
 #include <cstdint>
+#include <deque>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -10,6 +11,7 @@
 
 #include "base/Date.h"
 #include "base/Error.h"
+#include "base/Mutex.h"
 #include "platform/linux/store/StoreDatabase.h"
 #include "platform/linux/store/StoreQueue.h"
 
@@ -23,15 +25,25 @@ class StoreWriter {
   struct Options {
     StoreDatabase::Options database;
     std::chrono::milliseconds sync{1000};
+    std::chrono::milliseconds firstBackOff{50};
     std::chrono::days maximumAge{14};
+    std::chrono::milliseconds ageing{std::chrono::hours{1}};
     std::function<Date()> clock;
   };
 
-  /// `queue` must outlive the writer.
-  StoreWriter(Options options, std::unique_ptr<StoreDatabase> database, StoreQueue& queue);
+  /// `database` is null when the file could not be opened, for the reason `failure`, and is to be
+  /// tried again. `queue` must outlive the writer.
+  StoreWriter(Options options, std::unique_ptr<StoreDatabase> database,
+              const std::optional<Error>& failure, StoreQueue& queue);
 
   /// Works until the queue is closed and empty, then closes the database.
   void run();
+
+  /// Why the store takes no rows now, or cannot make them safe; none while all is well. Any thread.
+  [[nodiscard]] std::optional<std::string> problem() const QUARVEL_EXCLUDES(problemMutex_);
+
+  /// As `TelemetryStore::followExtent`.
+  void followExtent(std::function<void(const StoreExtent&)> follower) QUARVEL_EXCLUDES(following_);
 
  private:
   using Instant = StoreQueue::Instant;
@@ -54,34 +66,65 @@ class StoreWriter {
   [[nodiscard]] bool tryToWrite(const StoreBatch& batch, std::size_t first, std::size_t last);
   [[nodiscard]] bool needsFullCommit(const StoreBatch& batch, std::size_t first,
                                      std::size_t last) const;
-  void completeFlushes(const StoreBatch& batch, std::size_t first, std::size_t last,
-                       const std::optional<Error>& error);
+  void complete(const StoreBatch& batch, std::size_t first, std::size_t last,
+                const std::optional<Error>& error);
   void lose(const StoreBatch& batch, std::size_t first);
+  /// Everything that was committed is on the medium now.
+  void allIsSafe() QUARVEL_EXCLUDES(following_);
+  void erase();
+  void endErasure(const Result<std::int64_t>& rows);
   void syncTail();
   void makeRoom(const StoreQueue::Tally& incoming);
+  /// Has rows past their age removed, unless the clock was set since that was last done: who sets
+  /// it forward by years must not empty the store, and a device without a clock of its own is told
+  /// the time some while after its start.
+  void beginAgeing();
   /// One step of retention. False when there is nothing more to do.
   bool retain(std::uint64_t incomingBytes, std::optional<Date> expired);
   void reportRemoved(bool now);
+  /// A file that was taken away still takes rows, but nobody would find them.
+  void putBackIfTakenAway();
   [[nodiscard]] Error databaseError() const;
-  /// Reports, and begins a new file when this one turns out to be corrupt.
+  /// Reports, and closes a file that turns out to be corrupt: opening it again deals with that.
   void failed(Error error);
-  [[nodiscard]] bool reopen();
+  void succeeded();
+  void setProblem(std::optional<std::string> problem) QUARVEL_EXCLUDES(problemMutex_);
+  void close();
+  [[nodiscard]] bool reopen(bool isSuspect);
   void finish();
 
   const Options options_;
   const std::chrono::milliseconds syncAfter_;
   StoreQueue& queue_;
-  std::unique_ptr<StoreDatabase> database_;  // null while a new file could not be begun
-  Error failure_;                            // of the last attempt
+  struct Erasure {
+    ErasureRow wanted;
+    StoreIDs through;
+  };
+  std::deque<Erasure> erasures_;                    // the first one is under way
+  std::unique_ptr<StoreDatabase> database_;         // null while the file cannot be opened
+  std::unique_ptr<StoreErasure> erasure_;           // on the database; null before its first step
+  StoreIDs knownIDs_;                               // of a file that was closed
+  bool isSuspect_ = false;                          // the file has been found to be corrupt
+  std::optional<std::int64_t> lastEarlierSession_;  // of before this store was opened
+  Error failure_;                                   // of the last attempt
+  bool failing_ = false;
   Minutely failureLine_;
   bool gaveUp_ = false;  // the store was closed while it took no rows
   std::optional<Instant>
       unsyncedSince_;      // when the oldest row was queued that a power cut would take
   bool retaining_ = true;  // there may be rows to remove
-  bool ageing_ = true;     // ... because of their age
-  Instant nextAgeing_;
+  bool ageing_ = false;    // ... because of their age
+  Instant agedAt_;         // when rows were last looked at for their age
+  Date agedAtDate_;        // ... by the clock
   std::uint64_t removedNotExported_ = 0;  // and not yet reported
   Minutely removedLine_;
+
+  mutable Mutex problemMutex_;
+  std::optional<std::string> problem_ QUARVEL_GUARDED_BY(problemMutex_);
+
+  Mutex following_;
+  StoreExtent extent_ QUARVEL_GUARDED_BY(following_);
+  std::function<void(const StoreExtent&)> extentFollower_ QUARVEL_GUARDED_BY(following_);
 };
 
 }  // namespace quarvel

@@ -2,7 +2,6 @@
 
 #include <fmt/format.h>
 
-#include <algorithm>
 #include <cmath>
 #include <optional>
 #include <string_view>
@@ -36,6 +35,12 @@ std::string_view TextIn(const Dictionary& dictionary, const char* key) {
                                                         : std::string_view();
 }
 
+Outcome HandOver(TelemetryStore& store, const TelemetryStore::Message& message) {
+  Outcome taken = store.addMessage(message);
+  store.arrived();
+  return taken;
+}
+
 }  // namespace
 
 class TelemetryAgent::Session final : public RelmReportingSession {
@@ -55,20 +60,18 @@ class TelemetryAgent::Session final : public RelmReportingSession {
 
   void startConfiguration(ConfigurationCompletion completion) override {
     core_->completions->async([core = core_, completion = std::move(completion)] {
-      std::vector<std::string> found;
-      if (core->store->isOpen()) {
-        std::ranges::copy_if(core->backends, std::back_inserter(found),
-                             [](const std::string& name) { return name == kStoreBackend; });
-      }
-      completion(found.empty() ? std::nullopt : std::optional(std::move(found)));
+      // The store is the queue of every backend: a remote engine that is down now only has a
+      // backlog.
+      const bool found = core->store->isOpen() && !core->backends.empty();
+      completion(found ? std::optional(core->backends) : std::nullopt);
     });
   }
 
   Outcome agentSendMessage(std::uint16_t category, std::uint16_t type,
                            const Payload& payload) override {
-    if (!id_) return id_.error();
-    return core_->store->addMessage(
-        {id_.value(), sessionID_, clientName_, serviceName_, category, type, payload});
+    // A store that has refused the session is closed, and counts this message as refused too.
+    return HandOver(*core_->store, {id_ ? std::optional(id_.value()) : std::nullopt, sessionID_,
+                                    clientName_, serviceName_, category, type, payload});
   }
 
   void flushMessages(FlushCompletion completion) override {
@@ -93,9 +96,10 @@ class TelemetryAgent::Session final : public RelmReportingSession {
 
 TelemetryAgent::TelemetryAgent(std::shared_ptr<TelemetryStore> store,
                                std::vector<std::string> backends)
+    // Not in the line of the sessions, where what they wait for would stand behind all of them.
     : core_(std::make_shared<const Core>(
           Core{std::move(store), std::move(backends),
-               CreateSerialQueue("tarnwick.quarvel.agent", QualityOfService::utility)})) {}
+               CreateSerialQueue("tarnwick.quarvel.agent", QualityOfService::userInteractive)})) {}
 
 std::shared_ptr<RelmReportingSession> TelemetryAgent::createAgentSession(
     const Dictionary& sessionInfo, const Dictionary& userInfo) {
@@ -105,10 +109,10 @@ std::shared_ptr<RelmReportingSession> TelemetryAgent::createAgentSession(
 Outcome TelemetryAgent::sendOneMessage(const Dictionary& sessionInfo, const Dictionary& userInfo,
                                        std::uint16_t category, std::uint16_t type,
                                        const Payload& payload) {
-  return core_->store->addMessage(
-      {std::nullopt, IntegerIn(sessionInfo, kRelmReportingSessionInfoSessionID, -1),
-       TextIn(userInfo, kRelmReportingUserInfoClientName),
-       TextIn(userInfo, kRelmReportingUserInfoServiceName), category, type, payload});
+  return HandOver(*core_->store,
+                  {std::nullopt, IntegerIn(sessionInfo, kRelmReportingSessionInfoSessionID, -1),
+                   TextIn(userInfo, kRelmReportingUserInfoClientName),
+                   TextIn(userInfo, kRelmReportingUserInfoServiceName), category, type, payload});
 }
 
 }  // namespace quarvel

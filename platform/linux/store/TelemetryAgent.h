@@ -15,10 +15,8 @@ namespace quarvel {
 
 class WorkQueue;
 
-/// The name of the backend that is the store itself.
-inline constexpr const char* kStoreBackend = "store";
-
-/// The telemetry agent: keeps sessions and their messages in the store. Any thread.
+/// The telemetry agent: keeps sessions and their messages in the store, where each message that it
+/// is given has been counted as on its way. Any thread.
 class TelemetryAgent {
  public:
   /// `backends`: the configured ones, in the order in which they are told to sessions.

@@ -5,6 +5,7 @@
 #include <utility>
 
 #include "platform/linux/store/StoreDatabase.h"
+#include "platform/linux/store/StoreError.h"
 #include "platform/linux/store/StoreWriter.h"
 
 namespace quarvel {
@@ -15,22 +16,31 @@ Date SystemDate() {
   return std::chrono::floor<std::chrono::microseconds>(std::chrono::system_clock::now());
 }
 
+/// Whether what keeps the file from being opened may go away by itself.
+bool MayPass(const Error& error) {
+  return error.code == static_cast<std::int64_t>(StoreErrorCode::diskFull) ||
+         error.code == static_cast<std::int64_t>(StoreErrorCode::failed);
+}
+
 }  // namespace
 
 Result<std::unique_ptr<TelemetryStore>> TelemetryStore::open(Options options) {
   if (!options.clock) options.clock = SystemDate;
   const StoreWriter::Options writerOptions{
-      {options.path, options.vfs, {options.maximumBytes, options.remoteBackends}},
+      {options.path, {options.maximumBytes, options.remoteBackends}, options.logPages},
       options.sync,
+      options.firstBackOff,
       options.maximumAge,
+      options.ageing,
       options.clock};
-  auto database = StoreDatabase::open(writerOptions.database, options.clock());
-  if (!database) return database.error();
-  const StoreDatabase& opened = *database.value();
-  std::unique_ptr<TelemetryStore> store(new TelemetryStore(options, opened.lastAgentSession()));
-  store->queue_.restart(opened.storedAtOpening(), opened.droppedAtOpening());
-  store->writer_ =
-      std::make_unique<StoreWriter>(writerOptions, std::move(database.value()), store->queue_);
+  auto database = StoreDatabase::open(writerOptions.database, options.clock(), false);
+  if (!database && !MayPass(database.error())) return database.error();
+  std::unique_ptr<TelemetryStore> store(
+      new TelemetryStore(options, database ? database.value()->lastIDs()[StoreTable::agentSession]
+                                           : kProvisionalSessions));
+  store->writer_ = std::make_unique<StoreWriter>(
+      writerOptions, database ? std::move(database.value()) : nullptr,
+      database ? std::nullopt : std::optional(database.error()), store->queue_);
   MutexLock lock(store->closing_);
   store->thread_ = std::thread([writer = store->writer_.get()] {
     pthread_setname_np(pthread_self(), "quarvel.store");
@@ -40,7 +50,8 @@ Result<std::unique_ptr<TelemetryStore>> TelemetryStore::open(Options options) {
 }
 
 TelemetryStore::TelemetryStore(const Options& options, std::int64_t lastAgentSession)
-    : clock_(options.clock),
+    : path_(options.path),
+      clock_(options.clock),
       queue_(options.queueRows, options.queueBytes),
       lastAgentSession_(lastAgentSession) {}
 
@@ -73,8 +84,35 @@ Outcome TelemetryStore::addPowerEvent(std::int32_t domain, std::string_view name
   return queue_.push(PowerEventRow{domain, payload, clock_()}, {name});
 }
 
+bool TelemetryStore::addAnalyticsEventIfRoom(std::string_view name, const Payload& payload) {
+  return queue_.pushIfRoom(AnalyticsEventRow{payload, clock_()}, {name});
+}
+
+bool TelemetryStore::addPowerEventIfRoom(std::int32_t domain, std::string_view name,
+                                         const Payload& payload) {
+  return queue_.pushIfRoom(PowerEventRow{domain, payload, clock_()}, {name});
+}
+
 Outcome TelemetryStore::flush(std::int64_t agentSession, FlushCompletion completion) {
   return queue_.pushAtOnce(FlushRow{agentSession, std::move(completion)}, {});
+}
+
+TelemetryStore::State TelemetryStore::state() const {
+  const StoreQueue::Tally outstanding = queue_.outstanding();
+  return {outstanding.rows, outstanding.bytes, writer_->problem()};
+}
+
+Outcome TelemetryStore::addExport(ExportRecord record, FlushCompletion completion) {
+  return queue_.pushAtOnce(ExportedRow{std::move(record), std::move(completion)}, {});
+}
+
+Outcome TelemetryStore::erase(ErasureSelection selection,
+                              std::function<void(const Result<std::int64_t>&)> completion) {
+  return queue_.pushAtOnce(ErasureRow{std::move(selection), std::move(completion)}, {});
+}
+
+void TelemetryStore::followExtent(std::function<void(const StoreExtent&)> follower) {
+  writer_->followExtent(std::move(follower));
 }
 
 void TelemetryStore::close() {

@@ -41,20 +41,28 @@ class TelemetryStore {
     std::chrono::milliseconds sync{1000};
     std::uint64_t maximumBytes = 268'435'456;
     std::chrono::days maximumAge{14};
+    /// How often, when rows come, old ones are looked for; until then the clock must have run on
+    /// without being set.
+    std::chrono::milliseconds ageing{std::chrono::hours{1}};
     /// Backends that read the store: rows they have not had are removed last.
     std::vector<std::string> remoteBackends{};
     /// Bounds of the queue; senders beyond them are held back. So few rows that under any load one
     /// is committed within 10 ms of being queued, but for a slow medium.
     std::size_t queueRows = 2048;
     std::size_t queueBytes = 8 << 20;
-    /// Name of the SQLite file layer; empty: the default one.
-    std::string vfs{};
+    /// How far the write-ahead log grows before it is moved into the file, in pages of 4 KiB. A
+    /// longer log needs fewer syncs, but what is moved at once holds up the rows behind it, and
+    /// pages that the system has cached are cheaper than new ones.
+    int logPages = 1024;
+    /// How long the writer waits before it tries again what failed; doubles up to 5 s.
+    std::chrono::milliseconds firstBackOff{50};
     /// Says what time rows carry and how old they are; empty: the system's clock.
     std::function<Date()> clock{};
   };
 
   /// Opens the store, making it when there is none and setting a corrupt one aside, and starts the
-  /// writer. An error says what to do; nothing has been changed then.
+  /// writer. An error says what to do; nothing has been changed then. What may pass, such as a full
+  /// disk, is none: rows wait in the queue until the file can be opened.
   [[nodiscard]] static Result<std::unique_ptr<TelemetryStore>> open(Options options);
   TelemetryStore(const TelemetryStore&) = delete;
   TelemetryStore& operator=(const TelemetryStore&) = delete;
@@ -83,6 +91,10 @@ class TelemetryStore {
   Outcome addMessage(const Message& message);
   Outcome addAnalyticsEvent(std::string_view name, const Payload& payload);
   Outcome addPowerEvent(std::int32_t domain, std::string_view name, const Payload& payload);
+  // As these two, but false, with nothing done, while there is no room.
+  [[nodiscard]] bool addAnalyticsEventIfRoom(std::string_view name, const Payload& payload);
+  [[nodiscard]] bool addPowerEventIfRoom(std::int32_t domain, std::string_view name,
+                                         const Payload& payload);
 
   /// Called once, on the writer's thread: be brief, and do not close the store.
   using FlushCompletion = std::function<void(const std::optional<Error>& error)>;
@@ -90,17 +102,43 @@ class TelemetryStore {
   /// held back. When this returns an error, `completion` is not called.
   Outcome flush(std::int64_t agentSession, FlushCompletion completion);
 
+  /// Records what a backend has been given; `completion` as for `flush`. Never held back. A record
+  /// about another store than this, which was set aside meanwhile, has no effect.
+  Outcome addExport(ExportRecord record, FlushCompletion completion);
+  /// Removes rows for good: of those that were added before, as `StoreErasure`. `completion` gets
+  /// how many they were, or why it was not finished; else as for `flush`. Never held back.
+  Outcome erase(ErasureSelection selection,
+                std::function<void(const Result<std::int64_t>&)> completion);
+  /// `follower` is told at once and whenever more has become safe from a power cut, on the writer's
+  /// thread, under a lock: be brief, and call nothing of the store. An empty one ends that; once
+  /// this returns, the earlier one is not called any more.
+  void followExtent(std::function<void(const StoreExtent&)> follower);
+
   /// Commits and syncs what was added, ends the writer and closes the file; refuses everything from
   /// now on. Returns when that is done, also when another thread began it. Rows that the disk still
   /// has no room for are lost then, and their number is logged.
   void close() QUARVEL_EXCLUDES(closing_);
 
+  // Messages before they are added: counted from their acceptance on, so that none disappears.
+  void onItsWay() { queue_.onItsWay(); }
+  void arrived() { queue_.arrived(); }
+  void droppedOnItsWay(StoreDrop reason) { queue_.droppedOnItsWay(reason); }
+
   [[nodiscard]] bool isOpen() const { return !queue_.isClosed(); }
   [[nodiscard]] StoreCounters counters() const { return queue_.counters(); }
+
+  struct State {
+    std::size_t queuedRows = 0;
+    std::size_t queuedBytes = 0;
+    std::optional<std::string> problem;  // why rows have to wait now
+  };
+  [[nodiscard]] State state() const;
+  [[nodiscard]] const std::filesystem::path& path() const { return path_; }
 
  private:
   TelemetryStore(const Options& options, std::int64_t lastAgentSession);
 
+  const std::filesystem::path path_;
   const std::function<Date()> clock_;
   StoreQueue queue_;  // locks itself
   std::atomic<std::int64_t> lastAgentSession_;

@@ -8,7 +8,7 @@ namespace quarvel {
 
 void VistrelSendEventLazy(std::string_view name, const std::function<Payload()>& payload) {
   static auto& sink =
-      *new AnalyticsEventSink(ProcessTelemetryStore(), Configuration::process().analyticsWanted);
+      *new AnalyticsEventSink(ProcessEventPath(), Configuration::process().analyticsWanted);
   sink.sendEventLazy(name, payload);
 }
 

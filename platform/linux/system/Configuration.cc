@@ -2,214 +2,31 @@
 
 #include <fcntl.h>
 #include <fmt/format.h>
-#include <fmt/ranges.h>
 #include <toml++/toml.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <cerrno>
-#include <concepts>
 #include <cstring>
-#include <initializer_list>
-#include <limits>
 #include <optional>
-#include <set>
 #include <utility>
 
 #include "platform/Log.h"
 #include "platform/Process.h"
+#include "platform/linux/system/ConfigurationSection.h"
 #include "platform/linux/system/Directories.h"
 #include "platform/linux/system/LogControl.h"
 
 namespace quarvel {
 namespace {
 
+using configuration::Findings;
+using configuration::kAnyPositive;
+using configuration::Section;
+
 constexpr std::string_view kFileName = "quarvel.toml";
 constexpr std::int64_t kMebibyte = 1024 * 1024;
 constexpr std::int64_t kGibibyte = 1024 * kMebibyte;
 constexpr std::int64_t kDaySeconds = 24 * 60 * 60;
-constexpr std::int64_t kAnyPositive = std::numeric_limits<std::int64_t>::max();
-
-/// A value as a person would write it, or what kind it is of.
-std::string described(const toml::node& node) {
-  if (const auto* integer = node.as_integer()) return fmt::format("{}", integer->get());
-  if (const auto* text = node.as_string()) return fmt::format("\"{}\"", text->get());
-  if (const auto* boolean = node.as_boolean()) return fmt::format("{}", boolean->get());
-  if (const auto* real = node.as_floating_point()) return fmt::format("the real {}", real->get());
-  if (node.is_array()) return "a list";
-  if (node.is_table()) return "a table";
-  return "a date or time";
-}
-
-/// What reading a file has found: its first fault, and the keys nobody knows.
-class Findings {
- public:
-  Findings(const std::filesystem::path& file, std::vector<std::string>& warnings)
-      : file_(file.native()), warnings_(warnings) {}
-
-  [[nodiscard]] const std::optional<Error>& error() const { return error_; }
-
-  void fault(std::string reason) {
-    if (!error_) error_ = Error::because("quarvel.configuration", 1, std::move(reason));
-  }
-  void syntaxFault(const toml::parse_error& fault) {
-    this->fault(fmt::format("{}:{}: {}", file_, fault.source().begin.line, fault.description()));
-  }
-  void wrongValue(const std::string& key, const toml::node& node, std::string_view allowed) {
-    fault(fmt::format("{}:{}: {} must be {}, but is {}.", file_, node.source().begin.line, key,
-                      allowed, described(node)));
-  }
-  void missingKey(const toml::node& table, const std::string& key) {
-    fault(fmt::format("{}:{}: {} is missing.", file_, table.source().begin.line, key));
-  }
-  void unknownKey(const std::string& key, const toml::key& place) {
-    warnings_.push_back(
-        fmt::format("{}:{}: {} is no key of ours.", file_, place.source().begin.line, key));
-  }
-
- private:
-  const std::string file_;
-  std::vector<std::string>& warnings_;
-  std::optional<Error> error_;
-};
-
-/// One table of the file, or none. Each key that is read is known; once the last has been, what is
-/// left over is not ours. An absent key leaves what it is read into as it was.
-class Section {
- public:
-  Section(Findings& findings, const toml::table* table, std::string name)
-      : findings_(findings), table_(table), name_(std::move(name)) {}
-  Section(const Section&) = delete;
-  Section& operator=(const Section&) = delete;
-
-  ~Section() {
-    if (table_ == nullptr) return;
-    for (const auto& [key, node] : *table_) {
-      if (!known_.contains(key.str())) findings_.unknownKey(path(key.str()), key);
-    }
-  }
-
-  void read(std::string_view key, bool& out) {
-    readAs<bool>(key, "true or false", [&](bool value) { out = value; });
-  }
-
-  void read(std::string_view key, std::string& out) {
-    readAs<std::string>(key, "a string", [&](const std::string& value) { out = value; });
-  }
-
-  void read(std::string_view key, std::filesystem::path& out) {
-    readAs<std::string>(key, "a string, a path", [&](const std::string& value) { out = value; });
-  }
-
-  /// An integer, or a duration by its count.
-  template <class Number>
-  void read(std::string_view key, std::int64_t least, std::int64_t most, Number& out) {
-    const std::string allowed = most == kAnyPositive
-                                    ? fmt::format("an integer of at least {}", least)
-                                    : fmt::format("an integer from {} to {}", least, most);
-    const toml::node* const node = find(key);
-    if (node == nullptr) return;
-    const auto* const integer = node->as_integer();
-    if (integer == nullptr || integer->get() < least || integer->get() > most) {
-      findings_.wrongValue(path(key), *node, allowed);
-    } else if constexpr (std::integral<Number>) {
-      out = static_cast<Number>(integer->get());
-    } else {
-      out = Number(static_cast<typename Number::rep>(integer->get()));
-    }
-  }
-
-  /// One of several names.
-  template <class Choice>
-  void read(std::string_view key,
-            std::initializer_list<std::pair<std::string_view, Choice>> choices, Choice& out) {
-    const toml::node* const node = find(key);
-    if (node == nullptr) return;
-    const auto* const text = node->as_string();
-    std::vector<std::string_view> names;
-    for (const auto& [name, choice] : choices) {
-      if (text != nullptr && text->get() == name) {
-        out = choice;
-        return;
-      }
-      names.push_back(name);
-    }
-    findings_.wrongValue(path(key), *node,
-                         fmt::format("one of \"{}\"", fmt::join(names, "\", \"")));
-  }
-
-  /// A list of strings, each of which `admits`.
-  template <class Admits>
-  void read(std::string_view key, std::string_view allowed, Admits admits,
-            std::vector<std::string>& out) {
-    const toml::node* const node = find(key);
-    if (node == nullptr) return;
-    const toml::array* const list = node->as_array();
-    if (list == nullptr) return findings_.wrongValue(path(key), *node, allowed);
-    std::vector<std::string> read;
-    for (const toml::node& item : *list) {
-      const auto* const text = item.as_string();
-      if (text == nullptr || !admits(text->get()) ||
-          std::ranges::find(read, text->get()) != read.end()) {
-        return findings_.wrongValue(fmt::format("{}[{}]", path(key), read.size()), item, allowed);
-      }
-      read.push_back(text->get());
-    }
-    out = std::move(read);
-  }
-
-  /// The table of a key, or none.
-  [[nodiscard]] const toml::table* table(std::string_view key) {
-    const toml::node* const node = find(key);
-    if (node == nullptr) return nullptr;
-    if (!node->is_table()) findings_.wrongValue(path(key), *node, "a table");
-    return node->as_table();
-  }
-
-  /// The tables of a key that may come several times, or none.
-  [[nodiscard]] std::vector<const toml::table*> tables(std::string_view key) {
-    const toml::node* const node = find(key);
-    if (node == nullptr) return {};
-    std::vector<const toml::table*> tables;
-    const toml::array* const list = node->as_array();
-    if (list == nullptr || !list->is_homogeneous(toml::node_type::table)) {
-      findings_.wrongValue(path(key), *node, "tables, each [[" + path(key) + "]]");
-      return {};
-    }
-    for (const toml::node& item : *list) tables.push_back(item.as_table());
-    return tables;
-  }
-
-  void require(std::string_view key, bool given) {
-    if (!given) findings_.missingKey(*table_, path(key));
-  }
-
- private:
-  [[nodiscard]] std::string path(std::string_view key) const {
-    return name_.empty() ? std::string(key) : fmt::format("{}.{}", name_, key);
-  }
-
-  const toml::node* find(std::string_view key) {
-    known_.emplace(key);
-    return table_ == nullptr ? nullptr : table_->get(key);
-  }
-
-  template <class Kind, class Take>
-  void readAs(std::string_view key, std::string_view allowed, Take take) {
-    const toml::node* const node = find(key);
-    if (node == nullptr) return;
-    if (const auto* const value = node->as<Kind>()) {
-      take(value->get());
-    } else {
-      findings_.wrongValue(path(key), *node, allowed);
-    }
-  }
-
-  Findings& findings_;
-  const toml::table* const table_;
-  const std::string name_;
-  std::set<std::string, std::less<>> known_;
-};
 
 void readDevice(Findings& findings, const toml::table* table, Configuration& out) {
   if (table == nullptr) return;
@@ -245,6 +62,74 @@ void readStore(Findings& findings, const toml::table* table, Configuration::Stor
   store.read("max_age_days", 1, 36'500, out.maximumAge);
 }
 
+bool isDeviceName(std::string_view name) {
+  constexpr std::string_view kAllowed =
+      "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789-_";
+  return name.size() <= 64 && name.find_first_not_of(kAllowed) == std::string_view::npos;
+}
+
+/// Whether `url` is `<scheme>://` and more, without blanks, a query or a fragment.
+bool isUrl(std::string_view url, std::initializer_list<std::string_view> schemes) {
+  for (const std::string_view scheme : schemes) {
+    if (!url.starts_with(scheme) || !url.substr(scheme.size()).starts_with("://")) continue;
+    const std::string_view rest = url.substr(scheme.size() + 3);
+    return !rest.empty() && rest.front() != '/' && rest.find_first_of(" \t\r\n?#") == url.npos;
+  }
+  return false;
+}
+
+bool isHeader(std::string_view name, std::string_view value) {
+  return !name.empty() && name.find_first_of(" \t\r\n:") == name.npos &&
+         value.find_first_of("\r\n") == value.npos;
+}
+
+void readTls(Section& section, Configuration::Tls& out) {
+  section.read("tls_ca", out.authority);
+  section.read("tls_certificate", out.certificate);
+  section.read("tls_key", out.key);
+  section.require("tls_key", !out.key.empty() || out.certificate.empty());
+  section.require("tls_certificate", !out.certificate.empty() || out.key.empty());
+}
+
+void readNats(Findings& findings, const toml::table* table, Configuration::Nats& out) {
+  Section nats(findings, table, "agent.nats");
+  nats.read(
+      "urls", "a list of addresses, each \"nats://…\" or \"tls://…\", none twice",
+      [](std::string_view url) {
+        return isUrl(url, {"nats", "tls"});
+      },
+      out.urls);
+  nats.require("urls", !out.urls.empty());
+  nats.read(
+      "stream", "a name without blanks, \".\", \"*\", \">\", \"/\" and \"\\\"",
+      [](std::string_view name) { return name.find_first_of(" \t\r\n.*>/\\") == name.npos; },
+      out.stream);
+  nats.read("create_stream", out.createStream);
+  nats.require("stream", !out.stream.empty() || !out.createStream);
+  nats.read("replicas", 1, 5, out.replicas);
+  nats.read("duplicate_window_seconds", 1, 30 * kDaySeconds, out.duplicateWindow);
+  nats.read("credentials", out.credentials);
+  readTls(nats, out.tls);
+  nats.read("acknowledge_seconds", 1, 600, out.acknowledge);
+  nats.read("gather_seconds", 0, kDaySeconds, out.gather);
+}
+
+void readOtlp(Findings& findings, const toml::table* table, Configuration::Otlp& out) {
+  Section otlp(findings, table, "agent.otlp");
+  otlp.read(
+      "endpoint", "an address, \"http://…\" or \"https://…\"",
+      [](std::string_view url) {
+        return isUrl(url, {"http", "https"});
+      },
+      out.endpoint);
+  otlp.read("headers", "a string without line breaks, for a header's name", isHeader, out.headers);
+  otlp.read("gzip", out.gzip);
+  readTls(otlp, out.tls);
+  otlp.read("connect_seconds", 1, 600, out.connect);
+  otlp.read("timeout_seconds", 1, 600, out.timeout);
+  otlp.read("gather_seconds", 0, kDaySeconds, out.gather);
+}
+
 void readAgent(Findings& findings, const toml::table* table, Configuration::Agent& out) {
   Section agent(findings, table, "agent");
   agent.read(
@@ -253,9 +138,10 @@ void readAgent(Findings& findings, const toml::table* table, Configuration::Agen
       out.backends);
   agent.read("export", out.exports);
   agent.read("drain_rows_per_second", 1, 1'000'000, out.drainRowsPerSecond);
-  // The exporters' own.
-  static_cast<void>(agent.table("nats"));
-  static_cast<void>(agent.table("otlp"));
+  agent.read("device", "a name of letters, digits, \"-\" and \"_\", 64 at most", isDeviceName,
+             out.device);
+  readNats(findings, agent.table("nats"), out.nats);
+  readOtlp(findings, agent.table("otlp"), out.otlp);
 }
 
 void readAnalytics(Findings& findings, const toml::table* table, Configuration& out) {
@@ -360,6 +246,17 @@ const Configuration& Configuration::process() {
   // Never destroyed: other threads may ask until the very end.
   static const Configuration& configuration = *new Configuration(readForProcess());
   return configuration;
+}
+
+Result<Configuration> Configuration::readAgain() {
+  std::vector<std::string> known;  // and told of, when the process began
+  return read(Directories::process().configuration / kFileName, known);
+}
+
+std::vector<std::string> Configuration::Agent::remoteBackends() const {
+  std::vector<std::string> remote = backends;
+  std::erase(remote, "store");
+  return remote;
 }
 
 Result<Configuration> Configuration::read(const std::filesystem::path& file,

@@ -29,10 +29,42 @@ struct Configuration {
     std::chrono::days maximumAge{14};
   } store;
 
+  /// Files in PEM; empty: the system's authorities, and no certificate of one's own.
+  struct Tls {
+    std::filesystem::path authority, certificate, key;
+  };
+  /// The backend "nats".
+  struct Nats {
+    std::vector<std::string> urls{"nats://localhost:4222"};
+    std::string stream = "QUARVEL";  // empty: whichever has the subject, and nobody checks
+    bool createStream = false;       // with the next two
+    int replicas = 3;
+    std::chrono::seconds duplicateWindow{120};
+    std::filesystem::path credentials;  // empty: none
+    Tls tls;
+    std::chrono::seconds acknowledge{10};  // how long acknowledgements may take
+    std::chrono::seconds gather{0};        // how long rows are collected before they are sent
+  };
+  /// The backend "otlp".
+  struct Otlp {
+    std::string endpoint = "http://localhost:4318";
+    std::map<std::string, std::string> headers;
+    bool gzip = true;
+    Tls tls;
+    std::chrono::seconds connect{5};
+    std::chrono::seconds timeout{10};  // of a whole request
+    std::chrono::seconds gather{0};
+  };
   struct Agent {
     std::vector<std::string> backends{"store"};
     bool exports = true;
     std::uint32_t drainRowsPerSecond = 2000;
+    std::string device;  // empty: the host's name
+    Nats nats;
+    Otlp otlp;
+
+    /// Those of `backends` that are fed from the store.
+    [[nodiscard]] std::vector<std::string> remoteBackends() const;
   } agent;
 
   std::vector<std::string> analyticsWanted{"*"};
@@ -59,12 +91,17 @@ struct Configuration {
     std::size_t queuedCalls = 256;
     std::size_t queuedBytes = 4'194'304;
     std::size_t connections = 4096;
+    /// Of the queued calls, how many a client has ahead of others to begin with. Not configured.
+    std::size_t firstTurn = 16;
   } limits;
 
   /// The process's configuration, read on first use. When the file has an error, says so on
   /// standard error (file, line, key, what is allowed) and ends the process with status 1. Unknown
   /// keys are warnings in the log.
   [[nodiscard]] static const Configuration& process();
+
+  /// Reads the process's file again, for what may change while it runs; `process` stays as it was.
+  [[nodiscard]] static Result<Configuration> readAgain();
 
   /// Reads one file; a missing file yields the defaults. `warnings` receives a sentence for each
   /// unknown key. Errors: domain "quarvel.configuration".

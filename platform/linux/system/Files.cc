@@ -1,3 +1,5 @@
+#include "platform/linux/system/Files.h"
+
 #include <fcntl.h>
 #include <fmt/format.h>
 #include <sys/stat.h>
@@ -26,12 +28,12 @@ Error fileError(const fs::path& path, int status) {
 
 /// A file of its own beside `path`: nobody else's is opened, nor what a link points to.
 /// Returns -1 with errno set when there can be none.
-int createBeside(std::string_view path, std::string& name) {
+int createBeside(std::string_view path, std::string& name, mode_t permissions) {
   static std::atomic<unsigned> number{0};
   int descriptor = -1;
   do {
     name = fmt::format("{}.{}-{}.new", path, getpid(), number++);
-    descriptor = ::open(name.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0644);
+    descriptor = ::open(name.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, permissions);
   } while (descriptor < 0 && errno == EEXIST);
   return descriptor;
 }
@@ -69,16 +71,50 @@ Outcome CreateDirectory(std::string_view path, std::uint32_t permissions) {
   return fs::is_directory(directory, failure) ? Success() : Outcome(fileError(directory, ENOTDIR));
 }
 
-Outcome WriteFileAtomically(std::string_view path, std::string_view content) {
+int SyncDirectory(const fs::path& directory) {
+  const int descriptor =
+      ::open(directory.empty() ? "." : directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  if (descriptor < 0) return errno;
+  const int status = fsync(descriptor) == 0 ? 0 : errno;
+  ::close(descriptor);
+  return status;
+}
+
+int CreatePrivateDirectory(const fs::path& directory) {
+  if (directory.empty() || ::access(directory.c_str(), F_OK) == 0) return 0;
+  const fs::path parent = directory.parent_path();
+  if (directory.has_filename()) {
+    if (const int status = CreatePrivateDirectory(parent); status != 0) return status;
+    if (mkdir(directory.c_str(), kPrivateDirectory) == 0) return SyncDirectory(parent);
+    return errno == EEXIST ? 0 : errno;
+  }
+  return CreatePrivateDirectory(parent);
+}
+
+namespace {
+
+Outcome writeAtomically(std::string_view path, std::string_view content, mode_t permissions,
+                        bool exactly) {
   std::string name;
-  const int descriptor = createBeside(path, name);
+  const int descriptor = createBeside(path, name, permissions);
   if (descriptor < 0) return fileError(path, errno);
-  int status = writeWhole(descriptor, content);
+  int status = exactly && fchmod(descriptor, permissions) != 0 ? errno : 0;
+  if (status == 0) status = writeWhole(descriptor, content);
   if (::close(descriptor) != 0 && status == 0) status = errno;
   if (status == 0 && rename(name.c_str(), std::string(path).c_str()) != 0) status = errno;
   if (status == 0) return Success();
   unlink(name.c_str());
   return fileError(path, status);
+}
+
+}  // namespace
+
+Outcome WriteFileAtomically(std::string_view path, std::string_view content) {
+  return writeAtomically(path, content, 0644, false);
+}
+
+Outcome WriteFileAtomically(std::string_view path, std::string_view content, mode_t permissions) {
+  return writeAtomically(path, content, permissions, true);
 }
 
 }  // namespace quarvel

@@ -1,0 +1,20 @@
+#pragma once
+
+#include <array>
+#include <atomic>
+#include <cstdint>
+#include <memory>
+
+#include "platform/linux/store/TelemetryStore.h"
+#include "platform/linux/system/Status.h"
+
+namespace quarvel {
+
+/// What the process has now, in the order of `Gauge`.
+using Gauges = std::array<std::atomic<std::int64_t>, 3>;
+[[nodiscard]] Gauges& ProcessGauges();
+
+/// Has the status tell of the store, its queue and its counters, and of the process's gauges.
+void DescribeInStatus(Status& status, std::shared_ptr<const TelemetryStore> store);
+
+}  // namespace quarvel
