@@ -1,60 +1,13 @@
 #include <quarvel/client.hpp>
 
-#include <concepts>
-#include <type_traits>
 #include <utility>
 
 #include "client/Channel.h"
 #include "client/Failure.h"
+#include "client/Operations.h"
 
 namespace quarvel {
 namespace {
-
-constexpr std::string_view kCreate = "createReportingSession:reply:";
-constexpr std::string_view kSetServiceType = "setServiceType:reportingSession:reply:";
-constexpr std::string_view kGetServiceName = "getServiceNameForReporterID:reply:";
-constexpr std::string_view kSetConfiguration = "setConfiguration:forReporterID:reply:";
-constexpr std::string_view kStart = "startReportingSessionForID:reply:";
-constexpr std::string_view kSendMessage = "sendMessage:withCategory:andType:forReportingIDs:reply:";
-constexpr std::string_view kStop = "stopReportingSessionForID:reply:";
-constexpr std::string_view kDestroy = "destroyReportingSession:reply:";
-constexpr std::string_view kValid = "reporterID:valid:";
-constexpr std::string_view kGetAll = "getAllReporters:";
-constexpr std::string_view kKill = "killService:";
-
-template <std::integral Integer>
-void Write(MessagePackWriter& writer, Integer number) {
-  writer.integer(number);
-}
-template <class Enumeration>
-requires std::is_enum_v<Enumeration>
-void Write(MessagePackWriter& writer, Enumeration code) {
-  writer.integer(static_cast<std::underlying_type_t<Enumeration>>(code));
-}
-void Write(MessagePackWriter& writer, vocabulary::Category category) {
-  writer.integer(category.code);
-}
-void Write(MessagePackWriter& writer, const PayloadArgument& argument) {
-  if (argument.payload() != nullptr) {
-    writer.encoded(argument.payload()->encoded());
-  } else if (argument.dictionary() != nullptr) {
-    writer.value(*argument.dictionary());
-  } else {
-    writer.nil();
-  }
-}
-void Write(MessagePackWriter& writer, const Recipients& recipients) {
-  if (!recipients.sessions()) return writer.nil();
-  writer.list(recipients.sessions()->size());
-  for (const ReporterID session : *recipients.sessions()) writer.integer(session);
-}
-
-// A reply that is an empty function is none: the call becomes a notification.
-template <class T, class AnyReply>
-AnyReply Wanted(Client::Reply<T> reply) {
-  if (!reply) return {};
-  return reply;
-}
 
 /// A reply that a thread waits for.
 template <class T>
@@ -66,11 +19,13 @@ class Awaited {
     given_.notifyAll();
   }
 
-  /// None when the time is over.
-  std::optional<Result<T>> wait(std::optional<std::chrono::milliseconds> timeout)
-      QUARVEL_EXCLUDES(mutex_) {
-    const auto deadline =
-        timeout ? std::optional(std::chrono::steady_clock::now() + *timeout) : std::nullopt;
+  [[nodiscard]] bool given() const QUARVEL_EXCLUDES(mutex_) {
+    MutexLock lock(mutex_);
+    return result_.has_value();
+  }
+
+  /// None when the time is over; without a deadline it never is.
+  std::optional<Result<T>> wait(std::optional<Poller::Time> deadline) QUARVEL_EXCLUDES(mutex_) {
     MutexLock lock(mutex_);
     while (!result_) {
       if (!deadline) {
@@ -83,7 +38,7 @@ class Awaited {
   }
 
  private:
-  Mutex mutex_;
+  mutable Mutex mutex_;
   ConditionVariable given_;
   std::optional<Result<T>> result_ QUARVEL_GUARDED_BY(mutex_);
 };
@@ -107,72 +62,69 @@ bool Client::connected() const {
   return channel_->connected();
 }
 
-template <class T, class... Arguments>
-std::optional<std::uint32_t> Client::send(std::string_view operation, Reply<T> reply,
-                                          const Arguments&... arguments) {
-  return channel_->send(operation, Wanted<T, Channel::AnyReply>(std::move(reply)),
-                        sizeof...(arguments),
-                        [&](MessagePackWriter& writer) { (Write(writer, arguments), ...); });
+int Client::descriptor() const {
+  return channel_->descriptor();
 }
 
-void Client::createReportingSession(ReporterID reporterID, Reply<bool> reply) {
-  send(kCreate, std::move(reply), reporterID);
+Client::Code Client::dispatch(std::optional<std::chrono::milliseconds> wait) {
+  const std::shared_ptr<Channel> channel = channel_;  // a reply may destroy the client
+  return channel->dispatch(Channel::DeadlineAfter(wait));
 }
 
-void Client::setServiceType(ServiceType serviceType, ReporterID reportingSession,
-                            Reply<bool> reply) {
-  send(kSetServiceType, std::move(reply), serviceType, reportingSession);
+Client::Code Client::createReportingSession(ReporterID reporterID, Reply<bool> reply) {
+  return channel_->send(operations::Create(reporterID), std::move(reply)).code;
 }
 
-void Client::getServiceNameForReporterID(ReporterID reporterID, Reply<ServiceType> reply) {
-  send(kGetServiceName, std::move(reply), reporterID);
+Client::Code Client::setServiceType(ServiceType serviceType, ReporterID reportingSession,
+                                    Reply<bool> reply) {
+  return channel_->send(operations::SetServiceType(serviceType, reportingSession), std::move(reply))
+      .code;
 }
 
-void Client::setConfiguration(PayloadArgument configuration, ReporterID reporterID,
-                              Reply<bool> reply) {
-  send(kSetConfiguration, std::move(reply), configuration, reporterID);
+Client::Code Client::getServiceNameForReporterID(ReporterID reporterID, Reply<ServiceType> reply) {
+  return channel_->send(operations::GetServiceName(reporterID), std::move(reply)).code;
 }
 
-void Client::startReportingSessionForID(ReporterID reporterID, Reply<bool> stopped) {
-  send(kStart, std::move(stopped), reporterID);
+Client::Code Client::setConfiguration(PayloadArgument configuration, ReporterID reporterID,
+                                      Reply<bool> reply) {
+  return channel_->send(operations::SetConfiguration(configuration, reporterID), std::move(reply))
+      .code;
 }
 
-void Client::sendMessage(PayloadArgument payload, Category category, MessageType type,
-                         Recipients reportingIDs, Reply<std::monostate> reply) {
-  send(kSendMessage, std::move(reply), payload, category, type, reportingIDs);
+Client::Code Client::startReportingSessionForID(ReporterID reporterID, Reply<bool> stopped) {
+  return channel_->send(operations::Start(reporterID), std::move(stopped)).code;
 }
 
-void Client::stopReportingSessionForID(ReporterID reporterID, Reply<bool> reply) {
-  send(kStop, std::move(reply), reporterID);
+Client::Code Client::sendMessage(PayloadArgument payload, Category category, MessageType type,
+                                 Recipients reportingIDs, Reply<std::monostate> reply) {
+  return channel_
+      ->send(operations::SendMessage(payload, category, type, reportingIDs), std::move(reply))
+      .code;
 }
 
-void Client::destroyReportingSession(ReporterID reporterID, Reply<bool> reply) {
-  send(kDestroy, std::move(reply), reporterID);
+Client::Code Client::stopReportingSessionForID(ReporterID reporterID, Reply<bool> reply) {
+  return channel_->send(operations::Stop(reporterID), std::move(reply)).code;
 }
 
-void Client::reporterID(ReporterID reporterID, Reply<Validity> valid) {
-  send(kValid, std::move(valid), reporterID);
+Client::Code Client::destroyReportingSession(ReporterID reporterID, Reply<bool> reply) {
+  return channel_->send(operations::Destroy(reporterID), std::move(reply)).code;
 }
 
-void Client::getAllReporters(Reply<std::vector<ReporterID>> reply) {
-  send(kGetAll, std::move(reply));
+Client::Code Client::reporterID(ReporterID reporterID, Reply<Validity> valid) {
+  return channel_->send(operations::Valid(reporterID), std::move(valid)).code;
 }
 
-void Client::killService(Reply<bool> reply) {
-  send(kKill, std::move(reply));
+Client::Code Client::getAllReporters(Reply<std::vector<ReporterID>> reply) {
+  return channel_->send(operations::GetAllReporters(), std::move(reply)).code;
 }
 
-void Client::call(std::string_view operation, std::span<const Value> arguments,
-                  Reply<Value> reply) {
-  sendValues(operation, std::move(reply), arguments);
+Client::Code Client::killService(Reply<bool> reply) {
+  return channel_->send(operations::KillService(), std::move(reply)).code;
 }
 
-std::optional<std::uint32_t> Client::sendValues(std::string_view operation, Reply<Value> reply,
-                                                std::span<const Value> arguments) {
-  return channel_->send(operation, Wanted<Value, Channel::AnyReply>(std::move(reply)),
-                        arguments.size(), [arguments](MessagePackWriter& writer) {
-                          for (const Value& argument : arguments) writer.value(argument);
-                        });
+Client::Code Client::call(std::string_view operation, std::span<const Value> arguments,
+                          Reply<Value> reply) {
+  return channel_->send(operations::AnyRequest{operation, arguments, {}}, std::move(reply)).code;
 }
 
 Client::Batch::Batch(Client& client) : channel_(client.channel_) {
@@ -186,44 +138,47 @@ Client::Synchronous Client::sync(std::optional<std::chrono::milliseconds> timeou
   return {*this, timeout};
 }
 
-template <class T, class Send>
-Result<T> Client::Synchronous::wait(Send&& send) {
-  Channel& channel = *client_.channel_;
-  if (channel.onReaderThread()) {
+template <class T, class Request>
+Result<T> Client::Synchronous::ask(const Request& request) {
+  const std::shared_ptr<Channel> channel = client_.channel_;  // see `dispatch`
+  const auto deadline = Channel::DeadlineAfter(timeout_);
+  if (channel->onDriver()) {
     return Failure(Code::wouldDeadlock,
                    "A reply cannot wait for another reply; use the asynchronous form there.");
   }
   const auto awaited = std::make_shared<Awaited<T>>();
-  const auto call = send([awaited](Result<T> result) { awaited->set(std::move(result)); });
-  channel.sendGathered();
-  if (auto result = awaited->wait(timeout_)) return *std::move(result);
-  channel.forget(*call);
+  const Channel::Sent sent = channel->send(
+      request, Reply<T>([awaited](Result<T> result) { awaited->set(std::move(result)); }));
+  channel->sendGathered();
+  if (channel->descriptor() >= 0) {
+    const bool driven = channel->driveUntil([&] { return awaited->given(); }, deadline);
+    if (!driven && !awaited->given()) {
+      if (sent.call) channel->forget(*sent.call);
+      return Failure(Code::wouldDeadlock, "Another thread dispatches; use the asynchronous form.");
+    }
+  }
+  if (auto result = awaited->wait(deadline)) return *std::move(result);
+  if (sent.call) channel->forget(*sent.call);
   return Failure(Code::timedOut, "The service has not replied in time.");
 }
 
-template <class T, class... Arguments>
-Result<T> Client::Synchronous::ask(std::string_view operation, const Arguments&... arguments) {
-  return wait<T>(
-      [&](Reply<T> reply) { return client_.send<T>(operation, std::move(reply), arguments...); });
-}
-
 Result<bool> Client::Synchronous::createReportingSession(ReporterID reporterID) {
-  return ask<bool>(kCreate, reporterID);
+  return ask<bool>(operations::Create(reporterID));
 }
 
 Result<bool> Client::Synchronous::setServiceType(ServiceType serviceType,
                                                  ReporterID reportingSession) {
-  return ask<bool>(kSetServiceType, serviceType, reportingSession);
+  return ask<bool>(operations::SetServiceType(serviceType, reportingSession));
 }
 
 Result<Client::ServiceType> Client::Synchronous::getServiceNameForReporterID(
     ReporterID reporterID) {
-  return ask<ServiceType>(kGetServiceName, reporterID);
+  return ask<ServiceType>(operations::GetServiceName(reporterID));
 }
 
 Result<bool> Client::Synchronous::setConfiguration(PayloadArgument configuration,
                                                    ReporterID reporterID) {
-  return ask<bool>(kSetConfiguration, configuration, reporterID);
+  return ask<bool>(operations::SetConfiguration(configuration, reporterID));
 }
 
 Result<bool> Client::Synchronous::startReportingSessionForID(ReporterID reporterID,
@@ -236,27 +191,27 @@ Result<bool> Client::Synchronous::startReportingSessionForID(ReporterID reporter
 
 Outcome Client::Synchronous::sendMessage(PayloadArgument payload, Category category,
                                          MessageType type, Recipients reportingIDs) {
-  return ask<std::monostate>(kSendMessage, payload, category, type, reportingIDs);
+  return ask<std::monostate>(operations::SendMessage(payload, category, type, reportingIDs));
 }
 
 Result<bool> Client::Synchronous::stopReportingSessionForID(ReporterID reporterID) {
-  return ask<bool>(kStop, reporterID);
+  return ask<bool>(operations::Stop(reporterID));
 }
 
 Result<bool> Client::Synchronous::destroyReportingSession(ReporterID reporterID) {
-  return ask<bool>(kDestroy, reporterID);
+  return ask<bool>(operations::Destroy(reporterID));
 }
 
 Result<Client::Validity> Client::Synchronous::reporterID(ReporterID reporterID) {
-  return ask<Validity>(kValid, reporterID);
+  return ask<Validity>(operations::Valid(reporterID));
 }
 
 Result<std::vector<ReporterID>> Client::Synchronous::getAllReporters() {
-  return ask<std::vector<ReporterID>>(kGetAll);
+  return ask<std::vector<ReporterID>>(operations::GetAllReporters());
 }
 
 Outcome Client::Synchronous::killService() {
-  auto killed = ask<bool>(kKill);
+  auto killed = ask<bool>(operations::KillService());
   if (killed) {
     return Failure(Code::unexpectedReply, "The service replied instead of ending.");
   }
@@ -269,9 +224,7 @@ Outcome Client::Synchronous::killService() {
 
 Result<Value> Client::Synchronous::call(std::string_view operation,
                                         std::span<const Value> arguments) {
-  return wait<Value>([&](Reply<Value> reply) {
-    return client_.sendValues(operation, std::move(reply), arguments);
-  });
+  return ask<Value>(operations::AnyRequest{operation, arguments, {}});
 }
 
 }  // namespace quarvel

@@ -11,6 +11,7 @@
 #include <utility>
 
 #include "client/Channel.h"
+#include "client/Connect.h"
 #include "client/Failure.h"
 
 namespace quarvel {
@@ -91,32 +92,42 @@ std::string Client::defaultSocketPath() {
   return candidates.front();
 }
 
-Result<Client> Client::connect(std::string_view socketPath) {
-  const std::string path = socketPath.empty() ? defaultSocketPath() : std::string(socketPath);
+Result<int> ConnectTo(const std::string& path, bool mayWait) {
   sockaddr_un address{};
   address.sun_family = AF_UNIX;
   if (path.size() >= sizeof address.sun_path) {
-    return Failure(Code::unreachable, "The socket's path may have " +
-                                          std::to_string(sizeof address.sun_path - 1) +
-                                          " bytes at most: " + path);
+    return Failure(Client::Code::unreachable, "The socket's path may have " +
+                                                  std::to_string(sizeof address.sun_path - 1) +
+                                                  " bytes at most: " + path);
   }
   std::memcpy(address.sun_path, path.data(), path.size());
 
-  const int socket = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  const int kind = SOCK_STREAM | SOCK_CLOEXEC | (mayWait ? 0 : SOCK_NONBLOCK);
+  const int socket = ::socket(AF_UNIX, kind, 0);
   if (socket < 0) {
-    return Failure(Code::unreachable,
+    return Failure(Client::Code::unreachable,
                    "This process can make no socket: " + std::string(std::strerror(errno)) + ".");
   }
   while (::connect(socket, reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) {
     if (errno == EINTR) continue;
     const int error = errno;
     ::close(socket);
-    return Failure(Code::unreachable, WhyUnreachable(path, error));
+    return Failure(Client::Code::unreachable, WhyUnreachable(path, error));
   }
-  ::fcntl(socket, F_SETFL, ::fcntl(socket, F_GETFL) | O_NONBLOCK);
-  auto channel = Channel::serve(socket);
+  if (mayWait) ::fcntl(socket, F_SETFL, ::fcntl(socket, F_GETFL) | O_NONBLOCK);
+  return socket;
+}
+
+Result<Client> Client::connect(const Options& options) {
+  auto channel = Channel::open(options);
   if (!channel) return std::move(channel.error());
   return Client(std::move(channel.value()));
+}
+
+Result<Client> Client::connect(std::string_view socketPath) {
+  Options options;
+  options.socketPath = socketPath;
+  return connect(options);
 }
 
 }  // namespace quarvel

@@ -1,0 +1,117 @@
+#pragma once
+
+#include <concepts>
+#include <span>
+#include <string_view>
+#include <tuple>
+#include <type_traits>
+
+#include <quarvel/client.hpp>
+
+#include "base/MessagePack.h"
+#include "client/Sessions.h"
+
+// The service's operations as they are called: name, arguments in order, and what outlives the
+// connection. All are views for the length of one call.
+
+namespace quarvel::operations {
+
+template <std::integral Integer>
+void Write(MessagePackWriter& writer, Integer number) {
+  writer.integer(number);
+}
+template <class Enumeration>
+requires std::is_enum_v<Enumeration>
+void Write(MessagePackWriter& writer, Enumeration code) {
+  writer.integer(static_cast<std::underlying_type_t<Enumeration>>(code));
+}
+inline void Write(MessagePackWriter& writer, vocabulary::Category category) {
+  writer.integer(category.code);
+}
+inline void Write(MessagePackWriter& writer, const PayloadArgument& argument) {
+  if (argument.payload() != nullptr) {
+    writer.encoded(argument.payload()->encoded());
+  } else if (argument.dictionary() != nullptr) {
+    writer.value(*argument.dictionary());
+  } else {
+    writer.nil();
+  }
+}
+inline void Write(MessagePackWriter& writer, const Recipients& recipients) {
+  if (!recipients.sessions()) return writer.nil();
+  writer.list(recipients.sessions()->size());
+  for (const ReporterID session : *recipients.sessions()) writer.integer(session);
+}
+
+template <class... Arguments>
+struct Request {
+  std::string_view operation;
+  SessionCall session;
+  std::tuple<const Arguments&...> arguments;
+
+  /// The arguments as the wire has them: a list.
+  void write(MessagePackWriter& writer) const {
+    writer.list(sizeof...(Arguments));
+    std::apply([&](const auto&... argument) { (Write(writer, argument), ...); }, arguments);
+  }
+};
+
+/// Any operation with any arguments.
+struct AnyRequest {
+  std::string_view operation;
+  std::span<const Value> arguments;
+  SessionCall session;
+
+  void write(MessagePackWriter& writer) const {
+    writer.list(arguments.size());
+    for (const Value& argument : arguments) writer.value(argument);
+  }
+};
+
+using Kind = SessionCall::Kind;
+
+inline Request<ReporterID> Create(const ReporterID& session) {
+  return {"createReportingSession:reply:", {Kind::create, session, {}, {}}, std::tie(session)};
+}
+inline Request<Client::ServiceType, ReporterID> SetServiceType(const Client::ServiceType& type,
+                                                               const ReporterID& session) {
+  return {"setServiceType:reportingSession:reply:",
+          {Kind::setServiceType, session, type, {}},
+          std::tie(type, session)};
+}
+inline Request<ReporterID> GetServiceName(const ReporterID& session) {
+  return {"getServiceNameForReporterID:reply:", {}, std::tie(session)};
+}
+inline Request<PayloadArgument, ReporterID> SetConfiguration(const PayloadArgument& configuration,
+                                                             const ReporterID& session) {
+  return {"setConfiguration:forReporterID:reply:",
+          {Kind::setConfiguration, session, {}, &configuration},
+          std::tie(configuration, session)};
+}
+inline Request<ReporterID> Start(const ReporterID& session) {
+  return {"startReportingSessionForID:reply:", {Kind::start, session, {}, {}}, std::tie(session)};
+}
+inline Request<PayloadArgument, vocabulary::Category, Client::MessageType, Recipients> SendMessage(
+    const PayloadArgument& payload, const vocabulary::Category& category,
+    const Client::MessageType& type, const Recipients& recipients) {
+  return {"sendMessage:withCategory:andType:forReportingIDs:reply:",
+          {},
+          std::tie(payload, category, type, recipients)};
+}
+inline Request<ReporterID> Stop(const ReporterID& session) {
+  return {"stopReportingSessionForID:reply:", {Kind::stop, session, {}, {}}, std::tie(session)};
+}
+inline Request<ReporterID> Destroy(const ReporterID& session) {
+  return {"destroyReportingSession:reply:", {Kind::destroy, session, {}, {}}, std::tie(session)};
+}
+inline Request<ReporterID> Valid(const ReporterID& session) {
+  return {"reporterID:valid:", {}, std::tie(session)};
+}
+inline Request<> GetAllReporters() {
+  return {"getAllReporters:", {}, {}};
+}
+inline Request<> KillService() {
+  return {"killService:", {}, {}};
+}
+
+}  // namespace quarvel::operations
