@@ -1,24 +1,16 @@
-#include <fcntl.h>
 #include <fmt/format.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
-#include <cerrno>
 #include <charconv>
 #include <cmath>
-#include <filesystem>
-
-#include <quarvel/client.hpp>
 
 #include "base/Json.h"
 #include "tools/Commands.h"
+#include "tools/Notification.h"
 #include "tools/PreferencesFile.h"
 #include "tools/Table.h"
 
 namespace quarvel::commands {
 namespace {
-
-using std::filesystem::path;
 
 template <class Number>
 std::optional<Number> Read(std::string_view text) {
@@ -60,36 +52,6 @@ Outcome Changed(const Options& options, const DefaultsOptions& which, const Pref
                which.notify ? "" : " \"quarvelctl notify\" makes the service read it.");
   }
   return which.notify ? Notify(options, kReportingNotification) : Success();
-}
-
-/// Where the service takes notifications: beside its socket, unless only the socket is elsewhere.
-path NotifyDirectory(const Options& options) {
-  const path socket = options.socket.empty() ? Client::defaultSocketPath() : options.socket;
-  const path beside = socket.parent_path() / "notify";
-  std::vector<path> candidates{beside};
-  if (const char* own = std::getenv("RUNTIME_DIRECTORY")) {
-    const std::string_view directories = own;
-    candidates.push_back(path(directories.substr(0, directories.find(':'))) / "notify");
-  }
-  if (const char* user = std::getenv("XDG_RUNTIME_DIR"); user && ::geteuid() != 0) {
-    candidates.push_back(path(user) / "quarvel/notify");
-  }
-  for (const path& candidate : candidates) {
-    if (::access(candidate.c_str(), F_OK) == 0) return candidate;
-  }
-  return beside;
-}
-
-std::string WhyNotPosted(const path& directory, int error) {
-  if (error == ENOENT || error == ENOTDIR) {
-    return fmt::format(
-        "The service is not running: there is no directory {}. It reads its preferences when it "
-        "starts; if its runtime directory is elsewhere, name it in RUNTIME_DIRECTORY.",
-        directory.native());
-  }
-  return fmt::format("{} cannot be written: {}.{}", directory.native(),
-                     std::generic_category().message(error),
-                     error == EACCES ? " Try it as root or as the service's user." : "");
 }
 
 }  // namespace
@@ -134,18 +96,11 @@ Outcome DefaultsDelete(const Options& options, const DefaultsOptions& which) {
 }
 
 Outcome Notify(const Options& options, const std::string& name) {
-  const path directory = NotifyDirectory(options);
-  const path file = directory / name;
-  const int posted =
-      ::open(file.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK, 0644);
-  if (posted < 0 || ::futimens(posted, nullptr) != 0) {
-    const int error = errno;
-    if (posted >= 0) ::close(posted);
-    return Error::because("quarvel.notification", 1, WhyNotPosted(directory, error));
-  }
-  ::close(posted);
+  const auto posted = Post(options, name);
+  if (!posted) return posted.error();
   if (options.json) {
-    fmt::print("{}\n", JsonText(Dictionary{{"notification", name}, {"file", file.native()}}));
+    fmt::print("{}\n",
+               JsonText(Dictionary{{"notification", name}, {"file", posted.value().native()}}));
   } else {
     fmt::print("{} is posted.\n", name);
   }

@@ -6,6 +6,7 @@
 #include <sys/inotify.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdlib>
 #include <filesystem>
 #include <utility>
@@ -25,6 +26,19 @@ Error Failed(std::string reason) {
 std::string FilePath(std::string path) {
   if (std::error_code error; std::filesystem::is_directory(path, error)) path += "/telemetry.db";
   return path;
+}
+
+/// A path as it stands in a URI.
+std::string UriPath(std::string_view path) {
+  std::string encoded;
+  for (const char byte : path) {
+    if (byte == '%' || byte == '?' || byte == '#') {
+      encoded += fmt::format("%{:02X}", static_cast<unsigned char>(byte));
+    } else {
+      encoded.push_back(byte);
+    }
+  }
+  return encoded;
 }
 
 /// A prepared statement, row by row.
@@ -109,58 +123,85 @@ std::string StoreReader::defaultPath() {
     directory += "/telemetry.db";
     if (::access(directory.c_str(), F_OK) == 0) return directory;
   }
-  return candidates.front();
+  // The installed service's may not be looked at by everybody; opening it says who may.
+  return errno == EACCES ? candidates.back() : candidates.front();
 }
 
 void StoreReader::Close::operator()(sqlite3* database) const {
   sqlite3_close(database);
 }
 
-StoreReader::StoreReader(std::unique_ptr<sqlite3, Close> database)
-    : database_(std::move(database)) {}
-
 Result<StoreReader> StoreReader::open(std::string path) {
   path = FilePath(std::move(path));
-  if (::access(path.c_str(), F_OK) != 0) {
+  if (::access(path.c_str(), F_OK) != 0 && errno != EACCES) {
     return Failed(
         fmt::format("There is no store {}. The service makes it when it first starts; if it keeps "
                     "it elsewhere, name it with --store.",
                     path));
   }
-  sqlite3* opened = nullptr;
-  const int status = sqlite3_open_v2(path.c_str(), &opened, SQLITE_OPEN_READONLY, nullptr);
-  StoreReader reader(std::unique_ptr<sqlite3, Close>{opened});
-  if (status != SQLITE_OK) {
-    return Failed(
-        fmt::format("The store {} cannot be opened: {}. It belongs to the service's user "
-                    "and group; join that group, or read it as root.",
-                    path, sqlite3_errmsg(opened)));
-  }
-  sqlite3_busy_timeout(opened, kBusyMilliseconds);
-  const auto application = Number(opened, "PRAGMA application_id");
+  StoreReader reader(std::move(path));
+  if (auto connected = reader.connect(); !connected) return std::move(connected.error());
+  const auto application = Number(reader.database_.get(), "PRAGMA application_id");
   if (!application) return application.error();
-  const auto version = Number(opened, "PRAGMA user_version");
+  const auto version = Number(reader.database_.get(), "PRAGMA user_version");
   if (!version) return version.error();
   if (application.value() != kApplication) {
-    return Failed(fmt::format("{} is not a telemetry store.", path));
+    return Failed(fmt::format("{} is not a telemetry store.", reader.path_));
   }
   if (version.value() > kVersion) {
     return Failed(
         fmt::format("The store {} is of version {}, and this tool reads up to {}: use the "
                     "quarvelctl that came with the service.",
-                    path, version.value(), kVersion));
+                    reader.path_, version.value(), kVersion));
   }
   return reader;
 }
 
-Outcome StoreReader::sessions(const std::function<void(StoredSession)>& each) {
+// SQLite wants its log beside the store. While no service runs there is none, and who may not write
+// there cannot make one; but then the store is whole and nobody writes it.
+Outcome StoreReader::connect() {
+  if (auto connected = connect(false); !connected) return connected;
+  if (Number(database_.get(), "PRAGMA schema_version")) return Success();
+  const int failure = sqlite3_errcode(database_.get());
+  const bool noLog = ::access((path_ + "-wal").c_str(), F_OK) != 0;
+  if (!noLog || (failure != SQLITE_CANTOPEN && failure != SQLITE_READONLY)) return Success();
+  return connect(true);
+}
+
+Outcome StoreReader::connect(bool atRest) {
+  std::string name = path_;
+  if (atRest) name = fmt::format("file:{}?immutable=1", UriPath(path_));
+  sqlite3* opened = nullptr;
+  const int status = sqlite3_open_v2(
+      name.c_str(), &opened, SQLITE_OPEN_READONLY | (atRest ? SQLITE_OPEN_URI : 0), nullptr);
+  database_.reset(opened);
+  atRest_ = atRest;
+  if (status != SQLITE_OK) {
+    return Failed(
+        fmt::format("The store {} cannot be opened: {}. It belongs to the service's user "
+                    "and group; join that group, or read it as root.",
+                    path_, sqlite3_errmsg(opened)));
+  }
+  sqlite3_busy_timeout(opened, kBusyMilliseconds);
+  return Success();
+}
+
+Outcome StoreReader::reconnect() {
+  return atRest_ ? connect() : Success();
+}
+
+Outcome StoreReader::sessions(const SessionQuery& query,
+                              const std::function<void(StoredSession)>& each) {
+  if (auto connected = reconnect(); !connected) return connected;
   Statement rows(
       database_.get(),
-      "SELECT s.id, s.session_id, s.client_type, s.client_version, s.batch_event,"
-      " s.hierarchy_token, s.client_name, s.service_name, s.user_info, s.opened_at, s.flushed_at,"
-      " ifnull(m.messages, 0) FROM agent_session s LEFT JOIN"
-      " (SELECT agent_session, count(*) messages FROM message GROUP BY agent_session) m"
-      " ON m.agent_session = s.id ORDER BY s.id");
+      InOrder("SELECT s.id, s.session_id, s.client_type, s.client_version, s.batch_event,"
+              " s.hierarchy_token, s.client_name, s.service_name, s.user_info, s.opened_at,"
+              " s.flushed_at, ifnull(m.messages, 0) FROM agent_session s LEFT JOIN"
+              " (SELECT agent_session, count(*) messages FROM message GROUP BY agent_session) m"
+              " ON m.agent_session = s.id WHERE s.opened_at >= ?1",
+              query.last));
+  rows.bind(1, query.since.value_or(kEarliestDate).time_since_epoch().count());
   while (rows.next()) {
     each({rows.integer(0), rows.integer(1), rows.integer(2), rows.real(3), rows.integer(4) != 0,
           rows.text(5), rows.text(6), rows.text(7), rows.text(8), rows.date(9),
@@ -171,15 +212,18 @@ Outcome StoreReader::sessions(const std::function<void(StoredSession)>& each) {
 
 Outcome StoreReader::messages(const MessageQuery& query,
                               const std::function<void(StoredMessage)>& each) {
+  if (auto connected = reconnect(); !connected) return connected;
   std::string sql =
       "SELECT id, agent_session, session_id, service_name, category, type, payload, sent_at"
       " FROM message WHERE id > ?1";
   if (query.reporterID) sql += " AND session_id = ?2";
   if (query.agentSession) sql += " AND agent_session = ?3";
+  if (query.since) sql += " AND sent_at >= ?4";
   Statement rows(database_.get(), InOrder(std::move(sql), query.last));
   rows.bind(1, query.afterID);
   if (query.reporterID) rows.bind(2, *query.reporterID);
   if (query.agentSession) rows.bind(3, *query.agentSession);
+  if (query.since) rows.bind(4, query.since->time_since_epoch().count());
   while (rows.next()) {
     each({rows.integer(0), rows.isNull(1) ? std::nullopt : std::optional(rows.integer(1)),
           rows.integer(2), rows.text(3), static_cast<std::uint16_t>(rows.integer(4)),
@@ -190,6 +234,7 @@ Outcome StoreReader::messages(const MessageQuery& query,
 
 Outcome StoreReader::events(Events kind, const EventQuery& query,
                             const std::function<void(StoredEvent)>& each) {
+  if (auto connected = reconnect(); !connected) return connected;
   std::string sql = kind == Events::power
                         ? "SELECT id, name, payload, recorded_at, domain FROM power_event"
                         : "SELECT id, name, payload, recorded_at, NULL FROM analytics_event";
@@ -203,6 +248,49 @@ Outcome StoreReader::events(Events kind, const EventQuery& query,
   while (rows.next()) {
     each({rows.integer(0), rows.isNull(4) ? std::nullopt : std::optional(rows.integer(4)),
           rows.text(1), rows.text(2), rows.date(3)});
+  }
+  return rows.outcome();
+}
+
+Outcome StoreReader::backends(const std::function<void(StoredBackend)>& each) {
+  // Ids come without gaps, but for rows that were erased.
+  Statement rows(
+      database_.get(),
+      "WITH tables(name, least, most) AS ("
+      " SELECT 'agent_session', (SELECT min(id) FROM agent_session), (SELECT max(id) FROM "
+      "agent_session) UNION ALL"
+      " SELECT 'message', (SELECT min(id) FROM message), (SELECT max(id) FROM message) UNION ALL"
+      " SELECT 'analytics_event', (SELECT min(id) FROM analytics_event), (SELECT max(id) FROM "
+      "analytics_event) UNION ALL"
+      " SELECT 'power_event', (SELECT min(id) FROM power_event), (SELECT max(id) FROM "
+      "power_event)),"
+      " names(name) AS (SELECT backend FROM backend_cursor UNION"
+      " SELECT backend FROM export_log WHERE backend != 'store')"
+      "SELECT n.name, (SELECT sum(max(0, t.most - max(t.least - 1, ifnull((SELECT exported_through"
+      " FROM backend_cursor c WHERE c.backend = n.name AND c.table_name = t.name), 0))))"
+      " FROM tables t WHERE t.most IS NOT NULL),"
+      " ifnull(sum(l.rows) FILTER (WHERE l.outcome NOT LIKE 'refused%'), 0),"
+      " ifnull(sum(l.rows) FILTER (WHERE l.outcome LIKE 'refused%'), 0),"
+      " max(l.at) FILTER (WHERE l.outcome NOT LIKE 'refused%')"
+      " FROM names n LEFT JOIN export_log l ON l.backend = n.name GROUP BY n.name ORDER BY n.name");
+  while (rows.next()) {
+    each({rows.text(0), rows.integer(1), rows.integer(2), rows.integer(3),
+          rows.isNull(4) ? std::nullopt : std::optional(rows.date(4))});
+  }
+  return rows.outcome();
+}
+
+Outcome StoreReader::exports(std::int64_t last, const std::function<void(StoredExport)>& each) {
+  Statement rows(database_.get(),
+                 InOrder("SELECT id, backend, table_name, first_id, last_id, rows, bytes, outcome,"
+                         " at FROM export_log",
+                         last));
+  const auto optional = [&rows](int column) {
+    return rows.isNull(column) ? std::nullopt : std::optional(rows.integer(column));
+  };
+  while (rows.next()) {
+    each({rows.integer(0), rows.text(1), rows.text(2), optional(3), optional(4), rows.integer(5),
+          rows.integer(6), rows.text(7), rows.date(8)});
   }
   return rows.outcome();
 }

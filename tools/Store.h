@@ -52,13 +52,42 @@ struct StoredEvent {
   Date recordedAt;
 };
 
-/// The service's store, opened for reading only; it may be written meanwhile. For one thread.
+/// A backend that has been given rows, or that was refused some.
+struct StoredBackend {
+  std::string name;
+  std::int64_t backlog = 0;  // rows
+  std::int64_t exported = 0;
+  std::int64_t refused = 0;
+  std::optional<Date> acknowledgedAt;
+};
+
+/// A line of the ledger: rows that left the device, that an engine refused, or that were erased.
+struct StoredExport {
+  std::int64_t id;
+  std::string backend;  // "store": erased
+  std::string table;
+  std::optional<std::int64_t> firstID, lastID;
+  std::int64_t rows;
+  std::int64_t bytes;
+  std::string outcome;
+  Date at;
+};
+
+/// The service's store, opened for reading only; it may be written meanwhile, and the service may
+/// start and end. For one thread.
 /// Errors: domain "quarvel.store", with a reason that says what to do.
 class StoreReader {
  public:
-  /// Which messages: after `afterID`, of one session, and only the last so many of them.
+  /// Which sessions: opened at `since` or later, and only the last so many of them.
+  struct SessionQuery {
+    std::optional<Date> since;
+    std::optional<std::int64_t> last;
+  };
+  /// Which messages: after `afterID`, sent at `since` or later, of one session, and only the last
+  /// so many of them.
   struct MessageQuery {
     std::int64_t afterID = 0;
+    std::optional<Date> since;
     std::optional<std::int64_t> reporterID;
     std::optional<std::int64_t> agentSession;
     std::optional<std::int64_t> last;
@@ -81,10 +110,15 @@ class StoreReader {
   [[nodiscard]] static Result<StoreReader> open(std::string path);
 
   /// In the order in which they were opened.
-  [[nodiscard]] Outcome sessions(const std::function<void(StoredSession)>& each);
+  [[nodiscard]] Outcome sessions(const SessionQuery& query,
+                                 const std::function<void(StoredSession)>& each);
   /// In the order in which they were stored.
   [[nodiscard]] Outcome messages(const MessageQuery& query,
                                  const std::function<void(StoredMessage)>& each);
+  /// By their names. The rows that were given are those of the ledger, which ends somewhere.
+  [[nodiscard]] Outcome backends(const std::function<void(StoredBackend)>& each);
+  /// The last lines of the ledger, the oldest first.
+  [[nodiscard]] Outcome exports(std::int64_t last, const std::function<void(StoredExport)>& each);
   /// In the order in which they were stored.
   [[nodiscard]] Outcome events(Events kind, const EventQuery& query,
                                const std::function<void(StoredEvent)>& each);
@@ -93,9 +127,16 @@ class StoreReader {
   struct Close {
     void operator()(sqlite3* database) const;
   };
-  explicit StoreReader(std::unique_ptr<sqlite3, Close> database);
+  explicit StoreReader(std::string path) : path_(std::move(path)) {}
 
+  [[nodiscard]] Outcome connect();
+  [[nodiscard]] Outcome connect(bool atRest);
+  /// Before each query: a store that was at rest may have come to life.
+  [[nodiscard]] Outcome reconnect();
+
+  std::string path_;
   std::unique_ptr<sqlite3, Close> database_;
+  bool atRest_ = false;  // opened as a file that nobody writes
 };
 
 /// Wakes when something is written to a store.

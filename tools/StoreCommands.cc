@@ -123,7 +123,7 @@ Outcome PrintRows(const std::string& path, bool json, bool follow, Table table, 
 
 }  // namespace
 
-Outcome Sessions(const Options& options) {
+Outcome Sessions(const Options& options, const RowOptions& which) {
   auto store = StoreReader::open(PathOf(options));
   if (!store) return std::move(store.error());
   Table table({{"SESSION", true},
@@ -133,7 +133,7 @@ Outcome Sessions(const Options& options) {
                {"MESSAGES", true},
                {"APPLICATION"}},
               Terminal::standardOutput());
-  auto read = store.value().sessions([&](const StoredSession& session) {
+  auto read = store.value().sessions({which.since, which.last}, [&](const StoredSession& session) {
     if (options.json) {
       PrintJson(session);
     } else {
@@ -152,7 +152,7 @@ Outcome Messages(const Options& options, const MessageOptions& which) {
       path, options.json, which.follow,
       Table({{"SENT"}, {"SESSION", true}, {"SERVICE"}, {"CATEGORY"}, {"TYPE"}, {"PAYLOAD"}},
             Terminal::standardOutput()),
-      StoreReader::MessageQuery{0, which.session, std::nullopt, which.last},
+      StoreReader::MessageQuery{0, which.since, which.session, std::nullopt, which.last},
       [&](const auto& query, const auto& each) { return store.value().messages(query, each); });
 }
 
@@ -163,7 +163,7 @@ Outcome Events(const Options& options, const EventOptions& which) {
   const auto kind = which.power ? StoreReader::Events::power : StoreReader::Events::analytics;
   return PrintRows(
       path, options.json, which.follow, TableOf(kind),
-      StoreReader::EventQuery{0, std::nullopt, std::nullopt, which.last},
+      StoreReader::EventQuery{0, which.since, std::nullopt, which.last},
       [&](const auto& query, const auto& each) { return store.value().events(kind, query, each); });
 }
 

@@ -106,7 +106,7 @@ Result<std::optional<ClientUptime>> UptimeOfClient(StoreReader& store,
 
 Result<Run> LatestRun(StoreReader& store, std::int64_t reporterID) {
   std::optional<Run> run;
-  auto read = store.sessions([&](StoredSession session) {
+  auto read = store.sessions({}, [&](StoredSession session) {
     if (session.reporterID != reporterID) return;
     const std::int64_t earlier = run ? run->earlierRuns + 1 : 0;
     run.emplace();

@@ -7,6 +7,12 @@
 #include <utility>
 
 namespace quarvel {
+namespace {
+
+constexpr std::size_t kGap = 2;
+constexpr std::size_t kLeastText = 8;
+
+}  // namespace
 
 Table::Table(std::vector<Column> columns, const Terminal& terminal)
     : columns_(std::move(columns)), terminal_(terminal) {
@@ -22,36 +28,48 @@ void Table::add(std::vector<std::string> row) {
 }
 
 void Table::print() {
+  const std::vector<std::size_t> widths = fittedWidths();
   if (!std::exchange(begun_, true)) {
     std::vector<std::string> headings;
     for (const Column& column : columns_) headings.emplace_back(column.heading);
-    printLine(headings, true);
+    printLine(headings, widths, true);
   }
-  for (const auto& row : rows_) printLine(row, false);
+  for (const auto& row : rows_) printLine(row, widths, false);
   rows_.clear();
   std::fflush(stdout);
 }
 
-void Table::printLine(const std::vector<std::string>& cells, bool heading) {
-  constexpr std::size_t kGap = 2;
-  constexpr std::size_t kLeastLast = 8;
-  std::string line;
-  std::size_t used = 0;
-  for (std::size_t i = 0; i < cells.size(); ++i) {
-    const bool last = i + 1 == cells.size();
-    const std::size_t blanks = widths_[i] - ColumnsOf(cells[i]);
-    if (columns_[i].toTheRight) line.append(blanks, ' ');
-    if (last && terminal_.attached && !columns_[i].toTheRight) {
-      line += Fitted(cells[i],
-                     std::max(kLeastLast, terminal_.columns - std::min(used, terminal_.columns)));
-    } else {
-      line += cells[i];
+std::vector<std::size_t> Table::fittedWidths() const {
+  std::vector<std::size_t> widths = widths_;
+  if (!terminal_.attached) return widths;
+  // As wide as fits, if no text were wider than this; numbers are not cut.
+  for (std::size_t most = terminal_.columns; most >= kLeastText; --most) {
+    std::size_t line = kGap * (widths.size() - 1);
+    for (std::size_t i = 0; i < widths.size(); ++i) {
+      widths[i] = columns_[i].toTheRight ? widths_[i] : std::min(widths_[i], most);
+      line += widths[i];
     }
-    if (last) break;
+    if (line <= terminal_.columns) {
+      if (!columns_.back().toTheRight) widths.back() += terminal_.columns - line;
+      break;
+    }
+  }
+  return widths;
+}
+
+void Table::printLine(const std::vector<std::string>& cells, const std::vector<std::size_t>& widths,
+                      bool heading) {
+  std::string line;
+  for (std::size_t i = 0; i < cells.size(); ++i) {
+    const std::string cell = terminal_.attached ? Fitted(cells[i], widths[i]) : cells[i];
+    const std::size_t blanks = widths[i] - std::min(widths[i], ColumnsOf(cell));
+    if (columns_[i].toTheRight) line.append(blanks, ' ');
+    line += cell;
+    if (i + 1 == cells.size()) break;
     if (!columns_[i].toTheRight) line.append(blanks, ' ');
     line.append(kGap, ' ');
-    used += widths_[i] + kGap;
   }
+  if (terminal_.attached) line = Fitted(line, terminal_.columns);
   if (heading && terminal_.coloured) {
     fmt::print("\x1b[1m{}\x1b[0m\n", line);
   } else {

@@ -10,7 +10,7 @@
 namespace quarvel {
 
 /// Rows under a heading, printed to standard output in portions: columns are as wide as the widest
-/// cell so far. On a terminal the last column is cut where the line ends.
+/// cell so far. On a terminal the widest texts are cut until the line fits.
 class Table {
  public:
   struct Column {
@@ -26,7 +26,9 @@ class Table {
   void print();
 
  private:
-  void printLine(const std::vector<std::string>& cells, bool heading);
+  [[nodiscard]] std::vector<std::size_t> fittedWidths() const;
+  void printLine(const std::vector<std::string>& cells, const std::vector<std::size_t>& widths,
+                 bool heading);
 
   const std::vector<Column> columns_;
   const Terminal terminal_;
