@@ -26,9 +26,10 @@ function(quarvel_library NAME)
   target_include_directories(${NAME} PUBLIC $<BUILD_INTERFACE:${PROJECT_SOURCE_DIR}>)
 endfunction()
 
-# quarvel_test(NAME SOURCES … LINKS … [TIMEOUT seconds]): a GoogleTest program that ctest runs case by case.
+# quarvel_test(NAME SOURCES … LINKS … [TIMEOUT seconds] [LABELS label]): a GoogleTest program that ctest runs
+# case by case.
 function(quarvel_test NAME)
-  cmake_parse_arguments(ARG "" "TIMEOUT" "SOURCES;LINKS" ${ARGN})
+  cmake_parse_arguments(ARG "" "TIMEOUT;LABELS" "SOURCES;LINKS" ${ARGN})
   if(NOT ARG_TIMEOUT)
     set(ARG_TIMEOUT 120)
   endif()
@@ -41,5 +42,5 @@ function(quarvel_test NAME)
   else()
     target_precompile_headers(${NAME} REUSE_FROM base_test)
   endif()
-  gtest_discover_tests(${NAME} PROPERTIES TIMEOUT ${ARG_TIMEOUT} DISCOVERY_TIMEOUT 60)
+  gtest_discover_tests(${NAME} PROPERTIES TIMEOUT ${ARG_TIMEOUT} LABELS "${ARG_LABELS}" DISCOVERY_TIMEOUT 60)
 endfunction()
