@@ -27,29 +27,34 @@ void Check(bool ok, const char* what) {
   std::_Exit(1);
 }
 
-/// The service's message table, written as plainly as SQLite allows.
-class Table {
+/// The service's tables, written as plainly as SQLite allows.
+class Tables {
  public:
-  Table(const std::filesystem::path& file, const std::string& json) : json_(json) {
+  Tables(const std::filesystem::path& file, const std::string& json, int rowsPerMessage)
+      : json_(json), rowsPerMessage_(rowsPerMessage) {
+    if (rowsPerMessage == 0) return;
     Check(sqlite3_open(file.c_str(), &database_) == SQLITE_OK, "open");
     execute("PRAGMA journal_mode=WAL; PRAGMA synchronous=NORMAL");
     execute(
         "CREATE TABLE message(id INTEGER PRIMARY KEY, agent_session INTEGER, session_id INTEGER "
         "NOT "
         "NULL, client_name TEXT NOT NULL, service_name TEXT NOT NULL, category INTEGER NOT NULL, "
-        "type INTEGER NOT NULL, payload TEXT NOT NULL, sent_at INTEGER NOT NULL)");
-    Check(sqlite3_prepare_v2(database_,
-                             "INSERT INTO message VALUES(NULL, 1, 1, 'tarnwick.quarvel', "
-                             "'unknown_session', 3, 1, ?, 1769865901123456)",
-                             -1, &insert_, nullptr) == SQLITE_OK,
-          "prepare");
+        "type INTEGER NOT NULL, payload TEXT NOT NULL, sent_at INTEGER NOT NULL);"
+        "CREATE TABLE analytics_event(id INTEGER PRIMARY KEY, name TEXT NOT NULL, payload TEXT NOT "
+        "NULL, recorded_at INTEGER NOT NULL)");
+    prepare(message_,
+            "INSERT INTO message VALUES(NULL, 1, 1, 'tarnwick.quarvel', 'unknown_session', 3, 1, "
+            "?, 1769865901123456)");
+    prepare(event_,
+            "INSERT INTO analytics_event VALUES(NULL, 'tarnwick.quarvel.DSP_Playback.Start', ?, "
+            "1769865901123456)");
   }
   void add() {
-    if (rows_++ == 0) execute("BEGIN IMMEDIATE");
-    sqlite3_bind_text(insert_, 1, json_.data(), static_cast<int>(json_.size()), SQLITE_STATIC);
-    Check(sqlite3_step(insert_) == SQLITE_DONE, "insert");
-    sqlite3_reset(insert_);
-    if (rows_ == kRowsPerCommit) commit();
+    if (rowsPerMessage_ == 0) return;
+    if (rows_ == 0) execute("BEGIN IMMEDIATE");
+    insert(message_);
+    if (rowsPerMessage_ == 2) insert(event_);
+    if (rows_ >= kRowsPerCommit) commit();
   }
   void commit() {
     if (rows_ > 0) execute("COMMIT");
@@ -57,20 +62,31 @@ class Table {
   }
 
  private:
+  void prepare(sqlite3_stmt*& statement, const char* sql) {
+    Check(sqlite3_prepare_v2(database_, sql, -1, &statement, nullptr) == SQLITE_OK, sql);
+  }
+  void insert(sqlite3_stmt* statement) {
+    ++rows_;
+    sqlite3_bind_text(statement, 1, json_.data(), static_cast<int>(json_.size()), SQLITE_STATIC);
+    Check(sqlite3_step(statement) == SQLITE_DONE, "insert");
+    sqlite3_reset(statement);
+  }
   void execute(const char* sql) {
     Check(sqlite3_exec(database_, sql, nullptr, nullptr, nullptr) == SQLITE_OK, sql);
   }
 
   const std::string& json_;
+  const int rowsPerMessage_;
   sqlite3* database_ = nullptr;
-  sqlite3_stmt* insert_ = nullptr;
+  sqlite3_stmt* message_ = nullptr;
+  sqlite3_stmt* event_ = nullptr;
   int rows_ = 0;
 };
 
 }  // namespace
 
-void RunFloor(const std::filesystem::path& directory, const std::string& json) {
-  Table table(directory / "telemetry.db", json);
+void RunFloor(const std::filesystem::path& directory, const std::string& json, int rows) {
+  Tables tables(directory / "telemetry.db", json, rows);
   const int listener = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
   sockaddr_un address{};
   address.sun_family = AF_UNIX;
@@ -113,13 +129,13 @@ void RunFloor(const std::filesystem::path& directory, const std::string& json) {
              MessagePackScanner::Progress::complete) {
         at += scanner.length();
         scanner.reset();
-        table.add();
+        tables.add();
         replies += kReply;
       }
       bytes.erase(0, at);
       Check(write(descriptor, replies.data(), replies.size()) >= 0, "write");
     }
-    table.commit();
+    tables.commit();
   }
 }
 

@@ -1,386 +1,269 @@
-// Measures the service against its floor in one run: the same messages through a bare socket into
-// the same table with nothing in between. Rates are printed with their ratio, since only that
-// compares between machines.
+// Measures the service, its floor and its peers in turn, round by round, in one run: only what was
+// measured in the same run compares. Prints medians with their spread, and the targets.
 //
-// Usage: service-bench QUARVELD [MESSAGES] [ROUNDS]
+// Usage: service-bench QUARVELD [--messages N] [--rounds N] [--peers DIRECTORY]
 
-#include <fcntl.h>
 #include <fmt/format.h>
-#include <sqlite3.h>
-#include <sys/socket.h>
-#include <sys/un.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <algorithm>
-#include <array>
 #include <chrono>
 #include <csignal>
-#include <cstdlib>
-#include <cstring>
-#include <filesystem>
-#include <fstream>
-#include <functional>
-#include <iterator>
 #include <map>
 #include <memory>
-#include <sstream>
 #include <string>
 #include <thread>
 #include <vector>
 
-#include "base/Json.h"
-#include "base/MessagePack.h"
 #include "base/Payload.h"
-#include "bench/Floor.h"
+#include "bench/Subject.h"
 
 namespace quarvel {
 namespace {
 
 using Clock = std::chrono::steady_clock;
 
-[[noreturn]] void Fail(const std::string& what) {
-  fmt::print(stderr, "service-bench: {}: {}\n", what, std::strerror(errno));
-  std::_Exit(1);
+double SecondsSince(Clock::time_point begin) {
+  return std::chrono::duration<double>(Clock::now() - begin).count();
 }
 
-/// What an audio client reports every few seconds: some 280 bytes on the wire.
-Dictionary TypicalPayload() {
-  return {{"zqreporting_timestamp", Date(std::chrono::microseconds(1'769'865'901'123'456))},
-          {"HostApplicationDisplayID", "org.example.player"},
-          {"sample_rate", 48000.0},
-          {"io_buffer_frames", 512},
-          {"route", "BuiltInSpeaker"},
-          {"output_latency_ms", 11.6},
-          {"glitch_count", 0},
-          {"volume", 0.43},
-          {"spatial", true},
-          {"codec", "aac-eld"},
-          {"processuptime_ms", 1234567}};
-}
-
-std::string Call(std::uint32_t messageID, std::string_view method,
-                 const std::function<void(MessagePackWriter&)>& arguments, std::size_t count) {
-  std::string frame;
-  MessagePackWriter writer(frame);
-  writer.list(4);
-  writer.integer(0);
-  // Always five bytes, so that every frame of a kind has one length.
-  frame += '\xce';
-  for (int shift = 24; shift >= 0; shift -= 8)
-    frame += static_cast<char>(messageID >> shift & 0xff);
-  writer.string(method);
-  writer.list(count);
-  arguments(writer);
-  return frame;
-}
-
-std::string SendMessageFrame(std::uint32_t messageID, std::int64_t reporterID) {
-  return Call(
-      messageID, "sendMessage:withCategory:andType:forReportingIDs:reply:",
-      [reporterID](MessagePackWriter& writer) {
-        writer.value(TypicalPayload());
-        writer.integer(0x10000003);
-        writer.integer(1);
-        writer.list(1);
-        writer.integer(reporterID);
-      },
-      4);
-}
-
-class Client {
+/// The figures of one measure, round by round.
+class Samples {
  public:
-  explicit Client(const std::string& path)
-      : socket_(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    path.copy(address.sun_path, sizeof address.sun_path - 1);
-    const auto deadline = Clock::now() + std::chrono::seconds(10);
-    while (connect(socket_, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
-      if (Clock::now() > deadline) Fail("connect " + path);
-      std::this_thread::sleep_for(std::chrono::milliseconds(1));
-    }
+  void add(double value) { values_.push_back(value); }
+  [[nodiscard]] bool empty() const { return values_.empty(); }
+  [[nodiscard]] double median() const {
+    std::vector<double> sorted = values_;
+    std::ranges::sort(sorted);
+    return sorted[sorted.size() / 2];
   }
-  ~Client() { close(socket_); }
-  Client(const Client&) = delete;
-  Client& operator=(const Client&) = delete;
+  /// How far the extremes lie apart, of the median.
+  [[nodiscard]] double spread() const {
+    const auto [low, high] = std::ranges::minmax(values_);
+    return median() == 0 ? 0 : (high - low) / median();
+  }
 
-  void write(std::string_view bytes) {
-    while (!bytes.empty()) {
-      const ssize_t count = ::write(socket_, bytes.data(), bytes.size());
-      if (count <= 0) Fail("write");
-      bytes.remove_prefix(static_cast<std::size_t>(count));
+ private:
+  std::vector<double> values_;
+};
+
+/// Measures in the order of the table's rows, subjects in the order of its columns.
+class Table {
+ public:
+  void add(const std::string& measure, const Subject& subject, double value) {
+    if (std::ranges::find(measures_, measure) == measures_.end()) measures_.push_back(measure);
+    if (std::ranges::find(subjects_, subject.name()) == subjects_.end()) {
+      subjects_.push_back(subject.name());
     }
+    cells_[{measure, subject.name()}].add(value);
   }
-  /// Waits for at least one reply; returns how many are there.
-  std::size_t readReplies() {
-    for (;;) {
-      char buffer[65536];
-      const ssize_t count = read(socket_, buffer, sizeof buffer);
-      if (count <= 0) Fail("read");
-      pending_.append(buffer, static_cast<std::size_t>(count));
-      std::size_t replies = 0;
-      std::size_t at = 0;
-      MessagePackScanner scanner(1 << 20, 32);
-      while (scanner.scan(std::string_view(pending_).substr(at)) ==
-             MessagePackScanner::Progress::complete) {
-        at += scanner.length();
-        scanner.reset();
-        ++replies;
+  [[nodiscard]] double median(const std::string& measure, const std::string& subject) const {
+    const auto cell = cells_.find({measure, subject});
+    return cell == cells_.end() ? 0 : cell->second.median();
+  }
+  /// GitHub's Markdown, which is legible as it stands too.
+  void print() const {
+    fmt::print("| {:<34} |", "medians (spread)");
+    for (const std::string& subject : subjects_) fmt::print(" {:>18} |", subject);
+    fmt::print("\n|{:-<36}|", "");
+    for (std::size_t i = 0; i < subjects_.size(); ++i) fmt::print("{:->19}:|", "");
+    fmt::print("\n");
+    for (const std::string& measure : measures_) {
+      fmt::print("| {:<34} |", measure);
+      for (const std::string& subject : subjects_) {
+        const auto cell = cells_.find({measure, subject});
+        fmt::print(" {:>18} |", cell == cells_.end() ? "" : text(cell->second));
       }
-      pending_.erase(0, at);
-      if (replies > 0) return replies;
-    }
-  }
-  void call(std::string_view method, std::int64_t reporterID, bool answered = true) {
-    write(Call(
-        0, method, [&](MessagePackWriter& writer) { writer.integer(reporterID); }, 1));
-    if (answered) readReplies();
-  }
-  /// Sends `count` messages with at most `window` unanswered.
-  void pipeline(std::int64_t reporterID, std::size_t count, std::size_t window) {
-    const std::string frame = SendMessageFrame(7, reporterID);
-    std::string batch;
-    std::size_t sent = 0;
-    for (std::size_t answered = 0; answered < count; answered += readReplies()) {
-      const std::size_t more = std::min(count - sent, window - (sent - answered));
-      batch.clear();
-      for (std::size_t i = 0; i < more; ++i) batch += frame;
-      write(batch);
-      sent += more;
+      fmt::print("\n");
     }
   }
 
  private:
-  int socket_;
-  std::string pending_;
+  static std::string text(const Samples& samples) {
+    const double value = samples.median();
+    const int decimals = value >= 1000 ? 0 : value >= 10 ? 1 : 2;
+    return fmt::format("{:.{}f} ({:.0f} %)", value, decimals, samples.spread() * 100);
+  }
+
+  std::vector<std::string> measures_;
+  std::vector<std::string> subjects_;
+  std::map<std::pair<std::string, std::string>, Samples> cells_;
 };
 
-/// A server under test in a directory of its own.
-class Server {
- public:
-  explicit Server(const std::function<void(const std::filesystem::path& directory)>& run) {
-    std::string pattern =
-        (std::filesystem::temp_directory_path() / "quarvel-bench-XXXXXX").string();
-    if (mkdtemp(pattern.data()) == nullptr) Fail("mkdtemp");
-    directory_ = pattern;
-    process_ = fork();
-    if (process_ == 0) {
-      run(directory_);
-      std::_Exit(1);
-    }
-  }
-  ~Server() {
-    kill(process_, SIGTERM);
-    waitpid(process_, nullptr, 0);
-    std::filesystem::remove_all(directory_);
-  }
-  Server(const Server&) = delete;
-  Server& operator=(const Server&) = delete;
+constexpr const char* kOneClient = "messages/s stored, 1 client";
+constexpr const char* kEightClients = "messages/s stored, 8 clients";
+constexpr const char* kProcessor = "CPU seconds per million messages";
+constexpr const char* kPeak = "peak resident MB, 8 clients";
+constexpr const char* kWritten = "bytes written / bytes stored";
+constexpr const char* kTripHalf = "round trip us, p50";
+constexpr const char* kTripMost = "round trip us, p99";
+constexpr const char* kTripTail = "round trip us, p99.9";
+constexpr const char* kStart = "start to first answer ms";
+constexpr const char* kIdleResident = "idle resident MB";
+constexpr const char* kIdleProportional = "idle proportional MB";
+constexpr const char* kHistory = "history, bytes beside a payload";
 
-  [[nodiscard]] std::string socket() const { return directory_ / "reporting.sock"; }
-  /// Returns when the store holds `rows` messages.
-  void waitForRows(std::int64_t rows) {
-    sqlite3* database = nullptr;
-    const std::string path = directory_ / "telemetry.db";
-    if (sqlite3_open_v2(path.c_str(), &database, SQLITE_OPEN_READONLY, nullptr) != SQLITE_OK) {
-      Fail("open " + path);
-    }
-    sqlite3_stmt* query = nullptr;
-    sqlite3_prepare_v2(database, "SELECT coalesce(max(id), 0) FROM message", -1, &query, nullptr);
-    const auto deadline = Clock::now() + std::chrono::seconds(60);
-    for (;;) {
-      const bool there =
-          sqlite3_step(query) == SQLITE_ROW && sqlite3_column_int64(query, 0) >= rows;
-      sqlite3_reset(query);
-      if (there) break;
-      if (Clock::now() > deadline) Fail("rows missing");
-      std::this_thread::sleep_for(std::chrono::microseconds(500));
-    }
-    sqlite3_finalize(query);
-    sqlite3_close(database);
-  }
-  [[nodiscard]] double cpuSeconds() const {
-    std::ifstream file(fmt::format("/proc/{}/stat", process_));
-    std::string text((std::istreambuf_iterator<char>(file)), {});
-    std::istringstream fields(text.substr(text.rfind(')') + 2));
-    std::string skipped;
-    for (int i = 0; i < 11; ++i) fields >> skipped;
-    double user = 0;
-    double system = 0;
-    fields >> user >> system;
-    return (user + system) / static_cast<double>(sysconf(_SC_CLK_TCK));
-  }
-  [[nodiscard]] double residentMegabytes() const {
-    std::ifstream file(fmt::format("/proc/{}/status", process_));
-    for (std::string line; std::getline(file, line);) {
-      if (line.starts_with("VmRSS:")) return std::stod(line.substr(6)) / 1024;
-    }
-    return 0;
-  }
-
- private:
-  std::filesystem::path directory_;
-  pid_t process_ = -1;
-};
-
-double Median(std::vector<double> values) {
-  std::ranges::sort(values);
-  return values[values.size() / 2];
+std::string WakeUpsOf(std::size_t clients) {
+  return fmt::format("wake-ups a minute, {} clients", clients);
 }
 
-/// What is measured: the service with one row a message, with two (the analytics event too), and
-/// the floor.
-enum class Subject { service, serviceWithAnalytics, floor };
-constexpr std::array kSubjects = {Subject::service, Subject::serviceWithAnalytics, Subject::floor};
-
-std::string JsonOfTypicalPayload() {
-  return JsonText(Payload(TypicalPayload()));
-}
-
-std::unique_ptr<Server> Start(Subject subject, const std::string& quarveld) {
-  auto server = std::make_unique<Server>([&](const std::filesystem::path& directory) {
-    if (subject == Subject::floor) RunFloor(directory, JsonOfTypicalPayload());
-    const std::string path = directory;
-    std::ofstream(directory / "quarvel.toml")
-        << "[log]\nlevel = \"error\"\n[analytics]\nwanted = ["
-        << (subject == Subject::service ? "" : "\"*\"") << "]\n";
-    for (const char* name : {"RUNTIME_DIRECTORY", "STATE_DIRECTORY", "CONFIGURATION_DIRECTORY"}) {
-      setenv(name, path.c_str(), 1);
-    }
-    unsetenv("QUARVEL_SOCKET");
-    execl(quarveld.c_str(), quarveld.c_str(), nullptr);
-    Fail("exec " + quarveld);
-  });
-  Client(server->socket());  // returns once it is served
-  return server;
-}
-
-/// A client with a started session, as far as the subject knows of sessions.
-std::unique_ptr<Client> Connect(Server& server, Subject subject, std::int64_t reporterID) {
-  auto client = std::make_unique<Client>(server.socket());
-  if (subject != Subject::floor) {
-    client->call("createReportingSession:reply:", reporterID);
-    client->call("startReportingSessionForID:reply:", reporterID, false);
+/// From the first message sent until all are stored.
+void MeasureThroughput(Table& table, const Subject& subject, std::size_t clients,
+                       std::size_t messages) {
+  const auto server = subject.start();
+  std::vector<std::unique_ptr<WireClient>> connections;
+  for (std::size_t i = 1; i <= clients; ++i) {
+    connections.push_back(subject.connect(*server, static_cast<std::int64_t>(i)));
   }
-  return client;
-}
-
-struct Throughput {
-  double messagesPerSecond;
-  double cpuSecondsPerMillion;
-};
-
-/// From the first message sent until all are in the store.
-Throughput MeasureThroughput(Subject subject, const std::string& quarveld, std::size_t clients,
-                             std::size_t messages) {
-  const auto server = Start(subject, quarveld);
-  std::vector<std::unique_ptr<Client>> connections;
-  for (std::size_t i = 0; i < clients; ++i) {
-    connections.push_back(Connect(*server, subject, static_cast<std::int64_t>(i + 1)));
-  }
-  const double cpuBefore = server->cpuSeconds();
+  const double processorBefore = server->cpuSeconds();
+  const std::uint64_t writtenBefore = server->bytesWritten();
   const auto begin = Clock::now();
   std::vector<std::thread> threads;
   for (std::size_t i = 0; i < clients; ++i) {
     threads.emplace_back([&, i] {
-      connections[i]->pipeline(static_cast<std::int64_t>(i + 1), messages / clients, 64);
+      subject.send(*connections[i], static_cast<std::int64_t>(i + 1), messages / clients);
     });
   }
   for (std::thread& thread : threads) thread.join();
-  server->waitForRows(static_cast<std::int64_t>(messages / clients * clients));
-  const double seconds = std::chrono::duration<double>(Clock::now() - begin).count();
+  subject.awaitStored(*server, messages / clients * clients);
   const auto count = static_cast<double>(messages);
-  return {count / seconds, (server->cpuSeconds() - cpuBefore) * 1e6 / count};
+  table.add(clients == 1 ? kOneClient : kEightClients, subject, count / SecondsSince(begin));
+  if (clients == 1) return;
+  table.add(kProcessor, subject, (server->cpuSeconds() - processorBefore) * 1e6 / count);
+  table.add(kPeak, subject, server->peakMegabytes());
+  table.add(kWritten, subject,
+            static_cast<double>(server->bytesWritten() - writtenBefore) /
+                static_cast<double>(subject.fileBytes(*server)));
 }
 
-struct RoundTrip {
-  double p50;
-  double p99;
-};
-
-/// Microseconds, one call in flight.
-RoundTrip MeasureRoundTrip(Subject subject, const std::string& quarveld) {
+/// One call in flight.
+void MeasureRoundTrip(Table& table, const Subject& subject) {
   constexpr std::size_t kTrips = 20'000;
-  const auto server = Start(subject, quarveld);
-  const auto client = Connect(*server, subject, 1);
-  const std::string frame = SendMessageFrame(7, 1);
+  const auto server = subject.start();
+  const auto client = subject.connect(*server, 1);
+  const std::string frame = subject.frame(1);
   std::vector<double> trips;
   for (std::size_t i = 0; i < kTrips; ++i) {
     const auto begin = Clock::now();
     client->write(frame);
     client->readReplies();
-    trips.push_back(std::chrono::duration<double, std::micro>(Clock::now() - begin).count());
+    trips.push_back(SecondsSince(begin) * 1e6);
   }
   std::ranges::sort(trips);
-  return {trips[kTrips / 2], trips[kTrips * 99 / 100]};
+  table.add(kTripHalf, subject, trips[kTrips / 2]);
+  table.add(kTripMost, subject, trips[kTrips * 99 / 100]);
+  table.add(kTripTail, subject, trips[kTrips * 999 / 1000]);
 }
 
-struct Memory {
-  double idle;
-  double afterMessages;
-};
-
-/// Resident megabytes.
-Memory MeasureMemory(const std::string& quarveld) {
-  constexpr std::size_t kMessages = 100'000;
-  const auto server = Start(Subject::service, quarveld);
-  const auto client = Connect(*server, Subject::service, 1);
-  client->call("reporterID:valid:", 1);
-  const double idle = server->residentMegabytes();
-  client->pipeline(1, kMessages, 64);
-  server->waitForRows(kMessages);
-  return {idle, server->residentMegabytes()};
-}
-
-std::string_view NameOf(Subject subject) {
-  switch (subject) {
-    case Subject::service:
-      return "service, one row";
-    case Subject::serviceWithAnalytics:
-      return "service, two rows";
-    case Subject::floor:
-      return "floor";
-  }
-  return "";
-}
-
-int Main(const std::string& quarveld, std::size_t messages, std::size_t rounds) {
-  std::map<Subject, std::vector<double>> one, eight, cpu, p50, p99;
-  std::vector<double> idle, full;
-  for (std::size_t round = 0; round < rounds; ++round) {
-    fmt::print(stderr, "round {} of {}\n", round + 1, rounds);
-    for (const Subject subject : kSubjects) {
-      one[subject].push_back(MeasureThroughput(subject, quarveld, 1, messages).messagesPerSecond);
-      const Throughput many = MeasureThroughput(subject, quarveld, 8, messages);
-      eight[subject].push_back(many.messagesPerSecond);
-      cpu[subject].push_back(many.cpuSecondsPerMillion);
-      const RoundTrip trip = MeasureRoundTrip(subject, quarveld);
-      p50[subject].push_back(trip.p50);
-      p99[subject].push_back(trip.p99);
+void MeasureIdle(Table& table, const Subject& service) {
+  constexpr std::chrono::seconds kWatched(6);
+  const auto server = service.start();
+  // With a store that is there, as at every start but the first.
+  service.restart(*server);
+  const auto begin = Clock::now();
+  const auto first = service.connect(*server, 0);
+  first->call("reporterID:valid:", 0);
+  table.add(kStart, service, SecondsSince(begin) * 1e3);
+  std::vector<std::unique_ptr<WireClient>> clients;
+  for (const std::size_t connected : {std::size_t{1}, std::size_t{100}}) {
+    while (clients.size() + 1 < connected) {
+      clients.push_back(service.connect(*server, static_cast<std::int64_t>(clients.size() + 2)));
     }
-    const Memory memory = MeasureMemory(quarveld);
-    idle.push_back(memory.idle);
-    full.push_back(memory.afterMessages);
+    std::this_thread::sleep_for(std::chrono::seconds(2));
+    if (connected == 1) {
+      table.add(kIdleResident, service, server->residentMegabytes());
+      table.add(kIdleProportional, service, server->proportionalMegabytes());
+    }
+    const std::uint64_t before = server->wakeUps();
+    std::this_thread::sleep_for(kWatched);
+    table.add(WakeUpsOf(connected), service,
+              static_cast<double>((server->wakeUps() - before) * 60) /
+                  static_cast<double>(kWatched.count()));
   }
-  fmt::print("{:<20}{:>14}{:>14}{:>12}{:>11}{:>11}\n", "medians", "msg/s, 1", "msg/s, 8", "CPU s/M",
-             "p50 us", "p99 us");
-  for (const Subject subject : kSubjects) {
-    fmt::print("{:<20}{:>14.0f}{:>14.0f}{:>12.2f}{:>11.1f}{:>11.1f}\n", NameOf(subject),
-               Median(one[subject]), Median(eight[subject]), Median(cpu[subject]),
-               Median(p50[subject]), Median(p99[subject]));
+}
+
+void MeasureHistory(Table& table, const Subject& service) {
+  constexpr std::size_t kMessages = 100'000;
+  const auto server = service.start();
+  const auto client = service.connect(*server, 1);
+  // The second hundred thousand: what the first needed for its way is there already.
+  client->pipeline(service.frame(1), kMessages, 64);
+  service.awaitStored(*server, kMessages);
+  const double before = server->residentMegabytes();
+  client->pipeline(service.frame(1), kMessages, 64);
+  service.awaitStored(*server, 2 * kMessages);
+  const double grown = (server->residentMegabytes() - before) * 1024 * 1024;
+  const auto payload = static_cast<double>(Payload(TypicalPayload()).encoded().size());
+  table.add(kHistory, service, grown / kMessages - payload);
+}
+
+void PrintTargets(const Table& table) {
+  const std::string one = "service, one row";
+  const std::string two = "service, two rows";
+  const auto ratio = [&table](const char* measure, const std::string& subject,
+                              const std::string& other) {
+    const double base = table.median(measure, other);
+    return base == 0 ? 0 : table.median(measure, subject) / base;
+  };
+  const double ratePerClient =
+      table.median(kOneClient, one) / std::max(table.median(kEightClients, one), 1.0);
+  struct Target {
+    const char* what;
+    double value;
+    double bound;
+    bool atLeast;
+  };
+  for (const Target& target : {
+           Target{"8 clients, one row / floor", ratio(kEightClients, one, "floor, one row"), 0.75,
+                  true},
+           Target{"8 clients, one row / redis-server", ratio(kEightClients, one, "redis-server"), 1,
+                  true},
+           Target{"8 clients, two rows / floor", ratio(kEightClients, two, "floor, two rows"), 0.75,
+                  true},
+           Target{"one client / eight", ratePerClient, 0.6, true},
+           Target{"CPU seconds per million", table.median(kProcessor, one), 3.0, false},
+           Target{"round trip p50 / echo", ratio(kTripHalf, one, "echo"), 1.2, false},
+           Target{"round trip p99 / echo", ratio(kTripMost, one, "echo"), 2, false},
+           Target{"wake-ups a minute, 100 clients", table.median(WakeUpsOf(100), one), 0, false},
+           Target{"idle resident MB", table.median(kIdleResident, one), 8, false},
+           Target{"idle proportional MB", table.median(kIdleProportional, one), 4, false},
+           Target{"start to first answer ms", table.median(kStart, one), 8, false},
+           Target{"bytes written / stored", table.median(kWritten, one), 1.5, false},
+           Target{"history, bytes beside a payload", table.median(kHistory, one), 96, false},
+       }) {
+    const bool reached =
+        target.atLeast ? target.value >= target.bound : target.value <= target.bound;
+    fmt::print("{:<36}{:>8.2f}  {} {:g}  {}\n", target.what, target.value,
+               target.atLeast ? ">=" : "<=", target.bound, reached ? "reached" : "NOT REACHED");
   }
-  for (const Subject subject : {Subject::service, Subject::serviceWithAnalytics}) {
-    const auto ratio = [&](std::map<Subject, std::vector<double>>& figures) {
-      return Median(figures[subject]) / Median(figures[Subject::floor]);
-    };
-    fmt::print("{:<20}{:>14.2f}{:>14.2f}{:>12.2f}{:>11.2f}{:>11.2f}\n", "  / floor", ratio(one),
-               ratio(eight), ratio(cpu), ratio(p50), ratio(p99));
+}
+
+int Main(const std::string& quarveld, const std::string& peers, std::size_t messages,
+         std::size_t rounds) {
+  std::vector<std::unique_ptr<Subject>> subjects;
+  subjects.push_back(ServiceSubject(quarveld, 1));
+  subjects.push_back(ServiceSubject(quarveld, 2));
+  subjects.push_back(FloorSubject(1));
+  subjects.push_back(FloorSubject(2));
+  subjects.push_back(FloorSubject(0));
+  for (auto& peer : PeerSubjects(peers)) subjects.push_back(std::move(peer));
+
+  Table table;
+  for (std::size_t round = 1; round <= rounds; ++round) {
+    for (const auto& subject : subjects) {
+      fmt::print(stderr, "\rround {} of {}: {:<20}", round, rounds, subject->name());
+      if (subject->stores()) {
+        MeasureThroughput(table, *subject, 1, messages);
+        MeasureThroughput(table, *subject, 8, messages);
+      }
+      if (subject->acknowledges()) MeasureRoundTrip(table, *subject);
+    }
+    MeasureIdle(table, *subjects.front());
+    MeasureHistory(table, *subjects.front());
   }
-  fmt::print(
-      "resident: {:.1f} MB idle with one client, {:.1f} MB after 100,000 messages in one "
-      "session\n",
-      Median(idle), Median(full));
+  fmt::print(stderr, "\r{:<40}\r", "");
+  table.print();
+  fmt::print("\n");
+  PrintTargets(table);
   return 0;
 }
 
@@ -388,11 +271,19 @@ int Main(const std::string& quarveld, std::size_t messages, std::size_t rounds) 
 }  // namespace quarvel
 
 int main(int argc, char** argv) {
-  if (argc < 2) {
-    fmt::print(stderr, "usage: service-bench QUARVELD [MESSAGES] [ROUNDS]\n");
+  std::signal(SIGPIPE, SIG_IGN);
+  std::map<std::string, std::string> options{
+      {"--messages", "200000"}, {"--rounds", "5"}, {"--peers", "/"}};
+  bool usable = argc >= 2 && argc % 2 == 0;
+  for (int i = 2; usable && i < argc; i += 2) {
+    usable = options.contains(argv[i]);
+    options[argv[i]] = argv[i + 1];
+  }
+  if (!usable) {
+    fmt::print(stderr,
+               "usage: service-bench QUARVELD [--messages N] [--rounds N] [--peers DIRECTORY]\n");
     return 2;
   }
-  std::signal(SIGPIPE, SIG_IGN);
-  return quarvel::Main(argv[1], argc > 2 ? std::stoul(argv[2]) : 200'000,
-                       argc > 3 ? std::stoul(argv[3]) : 5);
+  return quarvel::Main(argv[1], options["--peers"], std::stoul(options["--messages"]),
+                       std::stoul(options["--rounds"]));
 }

@@ -92,7 +92,7 @@ void BareLoop(const std::filesystem::path& path, const Payload& payload) {
   const std::string json = JsonText(payload);
   SqliteConnection connection;
   SqliteStatement insert;
-  Check(connection.open(path, "") && connection.execute("PRAGMA synchronous = NORMAL") &&
+  Check(connection.open(path) && connection.execute("PRAGMA synchronous = NORMAL") &&
             connection.prepare(insert,
                                "INSERT INTO message VALUES(NULL, 1, 1, 'tarnwick.quarvel',"
                                " 'music_session', 3, 1, ?1, 1769865901123456)"),
