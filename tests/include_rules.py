@@ -19,8 +19,10 @@ RULES = [
     ("platform/", [r"base/\w+\.h", r"platform/\w+\.h"], [STANDARD, FMT]),
     ("Statistics/", [r"base/\w+\.h", r"platform/\w+\.h", r"Statistics/.*"], [STANDARD, FMT]),
     ("client/", [r"base/\w+\.h", r"client/.*"], [STANDARD, SYSTEM, FMT, r"quarvel/.*"]),
-    ("tools/", [r"base/\w+\.h", r"tools/.*"],
+    ("tools/", [r"base/\w+\.h", r"tools/.*", r"platform/linux/store/StoreErasure\.h"],
      [STANDARD, SYSTEM, FMT, r"quarvel/.*", r"CLI/CLI\.hpp", r"sqlite3\.h", r"toml\+\+/toml\.h"]),
+    ("examples/", [], [STANDARD, SYSTEM, r"quarvel/.*"]),
+    ("deploy/", [], [STANDARD, SYSTEM, r"nats/nats\.h"]),
     ("tests/", [ANYTHING], [ANYTHING]),
     ("bench/", [ANYTHING], [ANYTHING]),
 ]
@@ -53,7 +55,7 @@ def fault(path, quoted, angled):
 
 
 def faults(root):
-    for pattern in ("*.h", "*.hpp", "*.cc"):
+    for pattern in ("*.h", "*.hpp", "*.cc", "*.c"):
         for file in sorted(root.rglob(pattern)):
             path = file.relative_to(root).as_posix()
             if path.startswith(("build/", "demo/", ".")):
@@ -72,6 +74,7 @@ ALLOWED = [
     ("Statistics/Service/main.cc", '"platform/ServiceListener.h"'),
     ("client/Channel.cc", "<sys/socket.h>"),
     ("tools/Store.cc", "<sqlite3.h>"),
+    ("examples/client.c", "<quarvel/quarvel.h>"),
     ("tools/PreferencesFile.cc", "<toml++/toml.h>"),
     ("tests/platform/Scheduler.cc", '"platform/linux/work/Work.h"'),
 ]
@@ -90,6 +93,7 @@ FORBIDDEN = [
     ("client/Client.cc", "<CLI/CLI.hpp>"),
     ("client/Client.cc", "<toml++/toml.h>"),
     ("tools/Store.cc", '"platform/linux/store/Store.h"'),
+    ("examples/client.c", '"base/Value.h"'),
     ("tools/quarvelctl.cc", "<asio.hpp>"),
     ("elsewhere/File.cc", "<vector>"),
 ]

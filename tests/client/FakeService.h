@@ -27,6 +27,9 @@ class FakeService {
     if (::mkdtemp(directory) == nullptr) throw std::runtime_error("no temporary directory");
     directory_ = directory;
     path_ = directory_ / "reporting.sock";
+    listen();
+  }
+  void listen() {
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
     std::strncpy(address.sun_path, path_.c_str(), sizeof address.sun_path - 1);
@@ -50,6 +53,7 @@ class FakeService {
   void accept() { connection_ = ::accept(listener_, nullptr, nullptr); }
   void hangUp() {
     if (connection_ >= 0) ::close(std::exchange(connection_, -1));
+    received_.clear();
   }
   /// The socket file stays, as when a service dies.
   void stopListening() {

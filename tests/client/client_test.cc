@@ -11,42 +11,22 @@
 #include <quarvel/client.hpp>
 
 #include "base/Json.h"
+#include "tests/client/ClientTesting.h"
 #include "tests/client/FakeService.h"
 
 namespace quarvel {
 namespace {
 
+using test::Expected;
 using test::FakeService;
+using test::IsCode;
+using test::Text;
 using vocabulary::Component;
 using vocabulary::Kind;
 using namespace std::chrono_literals;
 using ::testing::AllOf;
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
-
-template <class T>
-std::string Text(const Result<T>& result) {
-  return result ? "ok" : result.error().description();
-}
-
-bool IsCode(const Error& error, Client::Code code) {
-  return error.domain == Client::kErrorDomain && error.code == static_cast<std::int64_t>(code);
-}
-
-/// A reply that a test can wait for.
-template <class T>
-class Expected {
- public:
-  Client::Reply<T> reply() {
-    return [promise = promise_](Result<T> result) { promise->set_value(std::move(result)); };
-  }
-  Result<T> get() { return future_.get(); }
-  bool given() { return future_.wait_for(0s) == std::future_status::ready; }
-
- private:
-  std::shared_ptr<std::promise<Result<T>>> promise_ = std::make_shared<std::promise<Result<T>>>();
-  std::future<Result<T>> future_ = promise_->get_future();
-};
 
 class ClientTest : public ::testing::Test {
  protected:

@@ -1,6 +1,8 @@
 """What feeds and steers the installed service: driver counters, orientation, preferences, properties."""
 
 import json
+import os
+import subprocess
 import unittest
 
 from harness import CallError, ServiceTest, eventually
@@ -134,6 +136,66 @@ class InternalBuild(ServiceTest):
         client.message({"a": 1}, [1])
         client.stop_session(1)
         service.wait_for_rows(2, "message WHERE session_id = 1")
+
+    def test_orientation_comes_from_the_sensor_proxy_while_a_session_tracks_it(self):
+        service = self.prepared('[device]\nInternalBuild = true\n[orientation]\nsource = "iio"\n')
+        service.prefer(reporting_session_verbose=True)
+        bus = SystemBus(self, service.directory)
+        service.environment |= bus.environment
+        service.start()
+        self.addCleanup(service.finish)
+        client = self.client(service)
+        client.start_session(1, 7)
+        eventually(lambda: bus.claimants() == 1, "the session's claim on the sensor")
+        for word, orientation in (("left-up", "landscapeRight"), ("bottom-up", "portraitUpsideDown")):
+            bus.turn(word)
+            eventually(lambda: f'orientation="{orientation}"' in service.log(), orientation)
+        client.stop_session(1)
+        eventually(lambda: bus.claimants() == 0, "the claim's end with the session")
+        summary = json.loads(service.wait_for_rows(1, "message WHERE category = 65535")[0]["payload"])
+        self.assertEqual(summary["device_orientation"], "landscapeRight,portraitUpsideDown")
+
+
+class SystemBus:
+    """A private system bus with a sensor proxy on it; both end with the test."""
+
+    PROXY = "net.hadess.SensorProxy", "/net/hadess/SensorProxy", "org.freedesktop.DBus.Mock"
+
+    def __init__(self, test, directory):
+        self._test = test
+        address = f"unix:path={directory}/system.sock"
+        self.environment = {"DBUS_SYSTEM_BUS_ADDRESS": address}
+        (directory / "bus.conf").write_text(
+            '<!DOCTYPE busconfig PUBLIC "-//freedesktop//DTD D-BUS Bus Configuration 1.0//EN"'
+            ' "http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd">'
+            f"<busconfig><type>session</type><listen>{address}</listen><auth>EXTERNAL</auth>"
+            '<policy context="default"><allow own="*"/><allow send_destination="*"/>'
+            '<allow receive_sender="*"/><allow user="*"/></policy></busconfig>')
+        self._beside("dbus-daemon", f"--config-file={directory}/bus.conf", "--nofork", "--nopidfile")
+        eventually((directory / "system.sock").exists, "the bus")
+        self._beside("/usr/bin/python3", "-m", "dbusmock", "--system", "--template", "iio-sensors-proxy",
+                     "-p", '{"has_accelerometer": true}', "-l", f"{directory}/proxy.log")
+        self._gdbus("wait", "--system", "--timeout", "60", self.PROXY[0])
+
+    def _beside(self, *command):
+        process = subprocess.Popen(command, env=os.environ | self.environment,
+                                   stderr=subprocess.DEVNULL)
+        self._test.addCleanup(process.wait)
+        self._test.addCleanup(process.terminate)
+
+    def _gdbus(self, *arguments):
+        return subprocess.run(["gdbus", *arguments], env=os.environ | self.environment, check=True,
+                              capture_output=True, text=True).stdout
+
+    def _call(self, method, *arguments):
+        name, path, mock = self.PROXY
+        return self._gdbus("call", "--system", "-d", name, "-o", path, "-m", f"{mock}.{method}", *arguments)
+
+    def turn(self, word):
+        self._call("SetInternalProperty", self.PROXY[0], "AccelerometerOrientation", f"<'{word}'>")
+
+    def claimants(self):
+        return self._call("GetInternalProperty", "AccelerometerOwners").count(":")
 
 
 if __name__ == "__main__":

@@ -8,6 +8,8 @@ import subprocess
 import time
 import unittest
 
+import msgpack
+
 from harness import PATIENCE, PREFIX, CallError, ServiceTest, eventually
 
 NO_BACKENDS = "[agent]\nbackends = []\n"
@@ -59,6 +61,17 @@ class Sessions(ServiceTest):
         self.assertEqual([(row["domain"], row["name"], json.loads(row["payload"])) for row in power],
                          [(28, "Fennor_Haptics",
                            {"EngineOnDuration": 2.5, "ApplicationName": "Unknown", "TimestampEnd": 8})])
+
+    def test_calls_that_arrive_together_are_all_answered_however_few_may_wait(self):
+        service = self.service("[limits]\nqueued_calls = 4\nframe_seconds = 2\n")
+        client = self.client(service)
+        client.start_session(1)
+        together = range(1000, 1064)
+        client.write(b"".join(
+            msgpack.packb([0, identifier, "sendMessage:withCategory:andType:forReportingIDs:reply:",
+                           [{"number": identifier}, 3, 1, [1]]]) for identifier in together))
+        for identifier in together:
+            self.assertIsNone(client.wait(identifier))
 
     def test_a_thousand_sessions_wait_for_backends_and_nobody_else_does(self):
         service = self.service(NO_BACKENDS)

@@ -48,6 +48,10 @@ class TestService final : public ExportedObject {
   void keep(std::int64_t number, Reply<std::int64_t> reply) {
     ledger_->keep(number, std::move(reply));
   }
+  void leave(std::int64_t number, Reply<std::int64_t> reply) {
+    reply(number);
+    ledger_->leave(number);
+  }
   void make(std::int64_t number, std::uint32_t size, Reply<std::string> reply) {
     ledger_->arrived(number);
     reply(std::string(size, 'x'));
@@ -68,6 +72,7 @@ constexpr std::array kTestMethods{
     Exported<&TestService::never>("never:"),
     Exported<&TestService::refuse>("refuse:"),
     Exported<&TestService::keep>("keep:reply:"),
+    Exported<&TestService::leave>("leave:reply:"),
     Exported<&TestService::make>("make:size:reply:"),
     Exported<&TestService::describe>("describe:code:list:reply:"),
 };
@@ -159,6 +164,13 @@ void Ledger::keep(std::int64_t number, Reply<std::int64_t> reply) {
   changed_.notifyAll();
 }
 
+void Ledger::leave(std::int64_t number) {
+  MutexLock lock(mutex_);
+  numbers_.push_back(number);
+  left_.push_back(VoucherHold::indirect(VoucherHold::current().voucher()));
+  changed_.notifyAll();
+}
+
 std::optional<Ledger::Kept> Ledger::takeKept() {
   MutexLock lock(mutex_);
   if (kept_.empty()) return std::nullopt;
@@ -240,6 +252,14 @@ std::string Client::response() {
     if (count <= 0) return "end";
     received_.append(bytes, static_cast<std::size_t>(count));
   }
+}
+
+std::string Client::responseWithin(std::chrono::milliseconds time) {
+  pollfd descriptor{socket_.get(), POLLIN, 0};
+  if (taken_ == received_.size() && ::poll(&descriptor, 1, static_cast<int>(time.count())) == 0) {
+    return {};
+  }
+  return response();
 }
 
 bool Client::hearsNothing() {

@@ -58,6 +58,9 @@ class Ledger {
   void arrived(std::int64_t number);
   /// As `arrived`; the call stays under way until taken and dropped.
   void keep(std::int64_t number, Reply<std::int64_t> reply);
+  /// As `arrived`; the call is carried out, but something of it is to be done for as long as this
+  /// lives.
+  void leave(std::int64_t number);
   std::optional<Kept> takeKept();
   std::vector<std::int64_t> numbers();
   std::size_t largestKept();
@@ -68,6 +71,7 @@ class Ledger {
   ConditionVariable changed_;
   std::vector<std::int64_t> numbers_ QUARVEL_GUARDED_BY(mutex_);
   std::deque<Kept> kept_ QUARVEL_GUARDED_BY(mutex_);
+  std::vector<VoucherHold> left_ QUARVEL_GUARDED_BY(mutex_);
   std::size_t largestKept_ QUARVEL_GUARDED_BY(mutex_) = 0;
 };
 
@@ -95,6 +99,8 @@ class Client {
   bool call(std::uint32_t messageID, std::string_view method, List arguments);
   /// The next response as JSON text; "end" when the service has hung up.
   std::string response();
+  /// The next response, "end", or nothing when neither came in time.
+  std::string responseWithin(std::chrono::milliseconds time);
   /// Whether there is nothing to read at this moment.
   bool hearsNothing();
   /// Calls echo with this number and says whether the answer, and nothing else, came back.

@@ -3,12 +3,18 @@
 #include <sqlite3.h>
 #include <stdlib.h>
 
+#include "tests/linux/FileCalls.h"
+
 namespace quarvel::testing {
 
 namespace {
 
-std::filesystem::path NewDirectory() {
-  std::string name = (std::filesystem::temp_directory_path() / "quarvel-store-XXXXXX").string();
+std::filesystem::path NewDirectory(bool memory) {
+  const std::filesystem::path shared = "/dev/shm";
+  const bool inMemory = memory && std::filesystem::is_directory(shared);
+  std::string name =
+      ((inMemory ? shared : std::filesystem::temp_directory_path()) / "quarvel-store-XXXXXX")
+          .string();
   EXPECT_NE(mkdtemp(name.data()), nullptr);
   return name;
 }
@@ -35,9 +41,10 @@ std::vector<std::string> RunSql(const std::filesystem::path& path, const std::st
 
 }  // namespace
 
-StoreFixture::StoreFixture() : directory_(NewDirectory()) {}
+StoreFixture::StoreFixture(bool memory) : directory_(NewDirectory(memory)) {}
 
 StoreFixture::~StoreFixture() {
+  FileCalls::watch({});
   std::filesystem::remove_all(directory_);
 }
 

@@ -14,7 +14,8 @@ namespace quarvel::testing {
 /// A directory of its own for each test, and what its store holds, as another program reads it.
 class StoreFixture : public ::testing::Test {
  protected:
-  StoreFixture();
+  /// `memory`: on a medium that costs nothing, when there is one.
+  explicit StoreFixture(bool memory = false);
   ~StoreFixture() override;
 
   [[nodiscard]] std::unique_ptr<TelemetryStore> open(TelemetryStore::Options options = {}) const;
@@ -27,10 +28,10 @@ class StoreFixture : public ::testing::Test {
   const std::filesystem::path path_ = directory_ / "telemetry.db";
 };
 
-/// Yields until it is so.
+/// Waits until it is so.
 template <class Condition>
 void Await(Condition condition) {
-  while (!condition()) std::this_thread::yield();
+  while (!condition()) std::this_thread::sleep_for(std::chrono::microseconds(100));
 }
 
 }  // namespace quarvel::testing

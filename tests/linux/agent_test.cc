@@ -7,8 +7,11 @@
 #include <thread>
 
 #include "platform/linux/store/AnalyticsEventSink.h"
+#include "platform/linux/store/EventPath.h"
 #include "platform/linux/store/SecureRandom.h"
 #include "platform/linux/store/StoreError.h"
+#include "platform/linux/work/Work.h"
+#include "tests/linux/FileCalls.h"
 #include "tests/linux/StoreFixture.h"
 
 namespace quarvel::testing {
@@ -94,9 +97,12 @@ TEST_F(AgentTest, ConfigurationFindsTheBackendsThatCanTakeDataNow) {
     return configuredBackends(*agent.createAgentSession(sessionInfo_, userInfo_));
   };
   EXPECT_THAT(found({"store"}), Optional(ElementsAre("store")));
+  EXPECT_THAT(found({"nats", "otlp"}), Optional(ElementsAre("nats", "otlp")))
+      << "whatever the network is like";
   EXPECT_EQ(found({}), std::nullopt);
   store_->close();
   EXPECT_EQ(found({"store"}), std::nullopt);
+  EXPECT_EQ(found({"nats", "otlp"}), std::nullopt);
 }
 
 TEST_F(AgentTest, AClosedStoreIsAnErrorForEveryOperation) {
@@ -130,7 +136,8 @@ TEST_F(AgentTest, AnUnwantedAnalyticsEventIsNeverBuilt) {
                {"some", {"a.*.[xz]", "?"}, {"a.haptics.x", "b"}}};
   for (const auto& wanted : cases) {
     SCOPED_TRACE(wanted.name);
-    AnalyticsEventSink sink(store_, wanted.wanted);
+    EventPath path(store_);
+    AnalyticsEventSink sink(path, wanted.wanted);
     std::vector<std::string> built;
     for (const std::string name : {"a.haptics.x", "a.music.y", "b"}) {
       sink.sendEventLazy(name, [&] {
@@ -143,6 +150,23 @@ TEST_F(AgentTest, AnUnwantedAnalyticsEventIsNeverBuilt) {
   store_->close();
   EXPECT_THAT(rows("SELECT name FROM analytics_event ORDER BY id"),
               ElementsAre("a.haptics.x", "a.music.y", "b", "a.haptics.x", "b"));
+}
+
+TEST_F(AgentTest, EventsWaitForRoomInTheirOrderAndTheirSendersDoNot) {
+  store_->close();
+  FileCalls& files = FileCalls::watch(directory_);
+  store_ = open({.queueRows = 2});
+  EventPath path(store_);
+  files.hold();
+  for (int i = 0; i < 20; ++i) {
+    path.addAnalyticsEvent(std::to_string(i), payload_);
+    path.addPowerEvent(28, std::to_string(i), payload_);
+  }
+  files.release();
+  ASSERT_TRUE(DrainWork(std::chrono::steady_clock::now() + std::chrono::seconds(60)));
+  store_->close();
+  EXPECT_EQ(value("SELECT count(*), min(name = id - 1) FROM analytics_event"), "20|1");
+  EXPECT_EQ(value("SELECT count(*), min(name = id - 1) FROM power_event"), "20|1");
 }
 
 }  // namespace

@@ -8,6 +8,7 @@
 #include <filesystem>
 #include <fstream>
 #include <map>
+#include <random>
 #include <string>
 #include <vector>
 
@@ -41,6 +42,18 @@ class ConfigurationTest : public testing::Test {
   std::vector<std::string> warnings_;
 };
 
+TEST_F(ConfigurationTest, RandomBytesAreAnErrorThatNamesTheFile) {
+  std::mt19937 random(20'260'131);
+  for (int i = 0; i < 500; ++i) {
+    std::string bytes(1 + random() % 300, '\0');
+    for (char& byte : bytes) byte = static_cast<char>(random());
+    if (bytes.front() == '#') continue;
+    const Result<Configuration> result = read(bytes);
+    ASSERT_FALSE(result.ok()) << i;
+    EXPECT_THAT(result.error().description(), HasSubstr("quarvel.toml")) << i;
+  }
+}
+
 TEST_F(ConfigurationTest, EveryKeyReachesItsPlace) {
   const Result<Configuration> result = read(R"(
 [device]
@@ -58,9 +71,27 @@ max_age_days = 3
 backends = ["otlp", "store"]
 export = false
 drain_rows_per_second = 5
-nats.servers = ["one"]
+device = "car-7"
+[agent.nats]
+urls = ["nats://one:4222", "tls://two"]
+stream = "S"
+create_stream = true
+replicas = 1
+duplicate_window_seconds = 9
+credentials = "/c"
+tls_ca = "/ca"
+tls_certificate = "/cert"
+tls_key = "/key"
+acknowledge_seconds = 8
+gather_seconds = 7
 [agent.otlp]
-endpoint = "two"
+endpoint = "https://three/x"
+headers = { Authorization = "Bearer t" }
+gzip = false
+tls_ca = "/ca2"
+connect_seconds = 6
+timeout_seconds = 5
+gather_seconds = 4
 [analytics]
 wanted = ["tarnwick.*", "other"]
 [tallix]
@@ -101,6 +132,21 @@ connections = 4
   EXPECT_THAT(read.agent.backends, ElementsAre("otlp", "store"));
   EXPECT_FALSE(read.agent.exports);
   EXPECT_EQ(read.agent.drainRowsPerSecond, 5U);
+  EXPECT_EQ(read.agent.device, "car-7");
+  const Configuration::Nats& nats = read.agent.nats;
+  EXPECT_THAT(nats.urls, ElementsAre("nats://one:4222", "tls://two"));
+  EXPECT_EQ(std::tie(nats.stream, nats.createStream, nats.replicas, nats.credentials),
+            std::tuple("S", true, 1, "/c"));
+  EXPECT_EQ(std::tie(nats.tls.authority, nats.tls.certificate, nats.tls.key),
+            std::tuple("/ca", "/cert", "/key"));
+  EXPECT_EQ(std::tuple(nats.duplicateWindow.count(), nats.acknowledge.count(), nats.gather.count()),
+            std::tuple(9, 8, 7));
+  const Configuration::Otlp& otlp = read.agent.otlp;
+  EXPECT_EQ(std::tie(otlp.endpoint, otlp.gzip, otlp.tls.authority),
+            std::tuple("https://three/x", false, "/ca2"));
+  EXPECT_THAT(otlp.headers, ElementsAre(testing::Pair("Authorization", "Bearer t")));
+  EXPECT_EQ(std::tuple(otlp.connect.count(), otlp.timeout.count(), otlp.gather.count()),
+            std::tuple(6, 5, 4));
   EXPECT_THAT(read.analyticsWanted, ElementsAre("tarnwick.*", "other"));
   EXPECT_EQ(read.tallix.root, "/sys/tallix");
   ASSERT_EQ(read.tallix.channels.size(), 2U);
@@ -154,6 +200,16 @@ TEST_F(ConfigurationTest, WrongValueNamesFileLineKeyAndWhatIsAllowed) {
       {"[agent]\nbackends = ['store', 'store']", "each at most once, but is \"store\"."},
       {"[agent]\nexport = 1", ":2: agent.export must be true or false, but is 1."},
       {"[agent]\nnats = 1", ":2: agent.nats must be a table, but is 1."},
+      {"[agent]\ndevice = 'a.b'", ":2: agent.device must be a name of letters, digits,"},
+      {"[agent.nats]\nurls = ['http://x']", ":2: agent.nats.urls[0] must be"},
+      {"[agent.nats]\nurls = []", ":1: agent.nats.urls is missing."},
+      {"[agent.nats]\nstream = 'a.b'", ":2: agent.nats.stream must be a name without"},
+      {"[agent.nats]\nstream = ''\ncreate_stream = true", ":1: agent.nats.stream is missing."},
+      {"[agent.nats]\nreplicas = 6", ":2: agent.nats.replicas must be an integer from 1 to 5"},
+      {"[agent.nats]\ntls_certificate = 'c'", ":1: agent.nats.tls_key is missing."},
+      {"[agent.otlp]\nendpoint = 'localhost:4318'", ":2: agent.otlp.endpoint must be an address"},
+      {"[agent.otlp.headers]\nA = \"b\\nC: d\"", ":2: agent.otlp.headers.A must be a string"},
+      {"[agent.otlp.headers]\nA = 1", ":2: agent.otlp.headers.A must be a string"},
       {"[analytics]\nwanted = ['']", ":2: analytics.wanted[0] must be"},
       {"[device]\nA = 2026-01-31", ":2: device.A must be a boolean, an integer or a string"},
       {"\nstore = []", ":2: store must be a table, but is a list."},
@@ -176,12 +232,13 @@ TEST_F(ConfigurationTest, WrongValueNamesFileLineKeyAndWhatIsAllowed) {
 
 TEST_F(ConfigurationTest, UnknownKeysAreWarningsOnly) {
   const Result<Configuration> result = read(
-      "top = 1\n[limits]\ndepht = 5\n[agent.nats]\nmine = 1\n[[tallix.channel]]\n"
+      "top = 1\n[limits]\ndepht = 5\n[agent.nats]\nurl = 'x'\n[[tallix.channel]]\n"
       "group='g'\nname='n'\nfile='f'\nfiel='f'\n");
   ASSERT_TRUE(result.ok());
   EXPECT_THAT(warnings_, testing::UnorderedElementsAre(
                              file().native() + ":1: top is no key of ours.",
                              file().native() + ":3: limits.depht is no key of ours.",
+                             file().native() + ":5: agent.nats.url is no key of ours.",
                              file().native() + ":10: tallix.channel.fiel is no key of ours."));
 }
 

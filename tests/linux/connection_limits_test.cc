@@ -66,6 +66,15 @@ TEST(ConnectionLimits, AClientThatIsTooFastWaitsAndLosesNothing) {
   }
 }
 
+TEST(ConnectionLimits, WhatWaitsForSomethingSlowHoldsUpItsClientOnlyForAWhile) {
+  constexpr std::size_t kCalls = 500;  // far more than may be answered and not done
+  Service service;
+  Client client = service.connect();
+  for (std::size_t i = 0; i < kCalls; ++i) ASSERT_TRUE(client.call(1, "leave:reply:", {i}));
+  ASSERT_TRUE(service.ledger->waitForArrivals(kCalls));
+  EXPECT_EQ(service.ledger->numbers(), Numbers(kCalls));
+}
+
 TEST(ConnectionLimits, AClientThatReadsLateIsHeldBackAndGetsEveryReply) {
   constexpr std::size_t kCalls = 300;
   Configuration::Limits limits;
@@ -111,7 +120,7 @@ TEST(ConnectionLimits, RepliesThatComeLaterCountToo) {
   Configuration::Limits limits;
   limits.replyBytes = 1024;
   limits.stall = 1ms;
-  limits.queuedCalls = 10'000;
+  limits.queuedCalls = limits.firstTurn = 10'000;
   Service service(limits);
   Client bystander = service.connect();
   Client client = service.connect();

@@ -3,6 +3,7 @@
 
 #include <filesystem>
 #include <optional>
+#include <random>
 #include <string>
 #include <vector>
 
@@ -31,6 +32,17 @@ class PreferencesTest : public ::testing::Test {
   TemporaryDirectory directory;
   PreferencesStore store{directory.path()};
 };
+
+TEST_F(PreferencesTest, RandomBytesChangeNothing) {
+  EXPECT_EQ(written("name = \"Kitchen\"").string("name"), "Kitchen");
+  std::mt19937 random(20'260'131);
+  for (int i = 0; i < 500; ++i) {
+    std::string bytes(1 + random() % 300, '\0');
+    for (char& byte : bytes) byte = static_cast<char>(random());
+    if (bytes.front() == '#') continue;
+    EXPECT_EQ(written(bytes).string("name"), "Kitchen") << i;
+  }
+}
 
 TEST_F(PreferencesTest, ValuesAreReadAsStringsAndBooleans) {
   struct Case {

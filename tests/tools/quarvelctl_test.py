@@ -9,6 +9,8 @@ import sqlite3
 import subprocess
 import sys
 import tempfile
+import termios
+import time
 import tomllib
 import unittest
 
@@ -222,14 +224,55 @@ class StoreTest(ToolTest):
         self.add_event(event, {"processName": "player", "seconds": 60.0}, 3)
         self.assertIsNone(uptime())
 
-    def test_a_terminal_gets_lines_that_fit_and_colour(self):
+    def test_since_and_last_choose_rows(self):
+        now = time.time_ns() // 1000
+        for minutes in (30, 90):
+            self.store.execute(
+                "INSERT INTO message VALUES(NULL,1,7,'','telephony_session',1,1,'{}',?)", (now - minutes * 60_000_000,))
+        for since, numbers in (("1h", [4]), ("1h45m", [4, 5]), ("100m", [4, 5]), ("1s", []),
+                               ("2026-01-31T13:00:00.001+01:00", [1, 2, 3, 4, 5]),
+                               ("2026-01-31T12:00:00.0011Z", [4, 5])):
+            with self.subTest(since):
+                _, lines, error = self.ctl("messages", "--json", "--since", since)
+                self.assertEqual([json.loads(line)["id"] for line in lines], numbers, error)
+        self.assertEqual(len(self.ctl("sessions", "--since", "2026-01-31T12:00:00Z")[1]), 3)
+        self.assertEqual(len(self.ctl("sessions", "--since", "1h")[1]), 1)
+        self.assertEqual([json.loads(line)["session"] for line in self.ctl("sessions", "--last", 1, "--json")[1]], [8])
+        self.add_event("now", {}, now / 1e6 - NOON / 1e6)
+        self.assertEqual(len(self.ctl("events", "--since", "10m")[1]), 2)
+        for wrong in ("", "5", "m", "1h1h", "10m2h", "-1h", "1.5h", "9999999999w", "yesterday", "2026-01-31"):
+            status, _, error = self.ctl("messages", f"--since={wrong}")
+            self.assertEqual((status, "--since" in error), (2, True), wrong)
+
+    def on_terminal(self, columns, *arguments, **variables):
+        """The lines that a terminal of so many columns gets."""
         master, slave = pty.openpty()
-        subprocess.run([QUARVELCTL, "messages"], stdout=slave, env=self.environment, timeout=60, check=True)
+        termios.tcsetwinsize(slave, (24, columns))
+        subprocess.run([QUARVELCTL, *arguments], stdout=slave, env=dict(self.environment, **variables),
+                       timeout=60, check=True)
         os.close(slave)
         lines = os.read(master, 65536).decode().splitlines()
         os.close(master)
+        return lines
+
+    def test_a_terminal_gets_lines_that_fit_and_colour(self):
+        lines = self.on_terminal(80, "messages")
         self.assertTrue(lines[0].startswith("\x1b[1mSENT"))
         self.assertEqual([len(line) for line in lines[1:] if "é" in line], [80])
+        # An ideograph takes two columns, a combining accent none.
+        self.add_message(1, 7, 1, 1, {"Note": "音" * 100})
+        self.add_message(1, 7, 1, 1, {"Note": "e\u0301" * 100})
+        self.add_message(1, 7, 1, 1, {"Note": "\u202ebackwards\x7f\x9b31m"})
+        self.add_event("tarnwick.quarvel." + "A" * 100, {"Payload": "B" * 100}, 1)
+        for columns in (40, 60, 81, 200):
+            for line in self.on_terminal(columns, "messages", NO_COLOR="1")[1:] + \
+                    self.on_terminal(columns, "events", NO_COLOR="1"):
+                width = sum(2 if character == "音" else 0 if character == "\u0301" else 1 for character in line)
+                self.assertLessEqual(width, columns, line)
+                self.assertNotRegex(line, "[\x1b\u202e\x7f\x9b]")
+        events = self.on_terminal(80, "events", NO_COLOR="1")[-1]
+        self.assertRegex(events, r"A…  \{.*B…$", "neither text takes all the room")
+        self.assertTrue(self.on_terminal(80, "events", NO_COLOR="")[0].startswith("\x1b"))
 
     def test_following_prints_what_is_stored_later(self):
         with subprocess.Popen([QUARVELCTL, "messages", "--last", "1", "--follow", "--json"], text=True,

@@ -1,0 +1,297 @@
+#include <quarvel/realtime.hpp>
+
+#include <dlfcn.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <linux/audit.h>
+#include <linux/filter.h>
+#include <linux/seccomp.h>
+#include <pthread.h>
+#include <sys/prctl.h>
+#include <sys/socket.h>
+#include <sys/syscall.h>
+#include <sys/un.h>
+#include <ucontext.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <atomic>
+#include <csignal>
+#include <cstddef>
+#include <cstdlib>
+#include <cstring>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <vector>
+
+// Watches a producer's thread while it records: every allocation and every lock goes through the
+// functions below, which stand before the C library's for the whole process, the shared library
+// included; every system call is trapped by the kernel.
+
+namespace {
+
+thread_local bool watched = false;
+
+std::array<std::atomic<const char*>, 64> calls;  // what a watched thread called
+std::atomic<std::size_t> callCount{0};
+
+void Note(const char* call) {
+  if (!watched) return;
+  const std::size_t index = callCount.fetch_add(1);
+  if (index < calls.size()) calls[index] = call;
+}
+
+template <class Function>
+Function Next(const char* name) {
+  return reinterpret_cast<Function>(::dlsym(RTLD_NEXT, name));
+}
+
+}  // namespace
+
+extern "C" {
+
+void* __libc_malloc(std::size_t size);
+void* __libc_calloc(std::size_t count, std::size_t size);
+void* __libc_realloc(void* memory, std::size_t size);
+void* __libc_memalign(std::size_t alignment, std::size_t size);
+void __libc_free(void* memory);
+
+void* malloc(std::size_t size) {
+  Note("malloc");
+  return __libc_malloc(size);
+}
+void* calloc(std::size_t count, std::size_t size) {
+  Note("calloc");
+  return __libc_calloc(count, size);
+}
+void* realloc(void* memory, std::size_t size) {
+  Note("realloc");
+  return __libc_realloc(memory, size);
+}
+void* aligned_alloc(std::size_t alignment, std::size_t size) {
+  Note("aligned_alloc");
+  return __libc_memalign(alignment, size);
+}
+int posix_memalign(void** memory, std::size_t alignment, std::size_t size) {
+  Note("posix_memalign");
+  *memory = __libc_memalign(alignment, size);
+  return *memory == nullptr ? ENOMEM : 0;
+}
+void free(void* memory) {
+  Note("free");
+  __libc_free(memory);
+}
+
+int pthread_mutex_lock(pthread_mutex_t* mutex) noexcept {
+  static const auto next = Next<int (*)(pthread_mutex_t*)>("pthread_mutex_lock");
+  Note("pthread_mutex_lock");
+  return next(mutex);
+}
+int pthread_mutex_trylock(pthread_mutex_t* mutex) noexcept {
+  static const auto next = Next<int (*)(pthread_mutex_t*)>("pthread_mutex_trylock");
+  Note("pthread_mutex_trylock");
+  return next(mutex);
+}
+int pthread_rwlock_rdlock(pthread_rwlock_t* lock) noexcept {
+  static const auto next = Next<int (*)(pthread_rwlock_t*)>("pthread_rwlock_rdlock");
+  Note("pthread_rwlock_rdlock");
+  return next(lock);
+}
+int pthread_rwlock_wrlock(pthread_rwlock_t* lock) noexcept {
+  static const auto next = Next<int (*)(pthread_rwlock_t*)>("pthread_rwlock_wrlock");
+  Note("pthread_rwlock_wrlock");
+  return next(lock);
+}
+int pthread_spin_lock(pthread_spinlock_t* lock) noexcept {
+  static const auto next = Next<int (*)(pthread_spinlock_t*)>("pthread_spin_lock");
+  Note("pthread_spin_lock");
+  return next(lock);
+}
+
+}  // extern "C"
+
+namespace quarvel {
+namespace {
+
+using namespace std::chrono_literals;
+using ::testing::Contains;
+using ::testing::IsEmpty;
+
+/// Notes a system call and lets it fail.
+void OnSystemCall(int, siginfo_t*, void* context) {
+  Note("a system call");
+  auto& machine = static_cast<ucontext_t*>(context)->uc_mcontext;
+#if defined(__x86_64__)
+  machine.gregs[REG_RAX] = -ENOSYS;
+#elif defined(__aarch64__)
+  machine.regs[0] = static_cast<decltype(machine.regs[0])>(-ENOSYS);
+#else
+#error "Say which register holds a system call's result on this machine."
+#endif
+}
+
+/// From here on the thread can only end: every other system call raises SIGSYS.
+void TrapSystemCalls() {
+  struct sigaction action {};
+  action.sa_sigaction = OnSystemCall;
+  action.sa_flags = SA_SIGINFO;
+  ASSERT_EQ(::sigaction(SIGSYS, &action, nullptr), 0);
+  sock_filter filter[] = {
+      BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
+      BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_exit, 1, 0),
+      BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_rt_sigreturn, 0, 1),  // the handler's own end
+      BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
+      BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_TRAP),
+  };
+  sock_fprog program{std::size(filter), filter};
+  ASSERT_EQ(::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0), 0);
+  ASSERT_EQ(::prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &program, 0, 0), 0);
+}
+
+/// Runs `produce` on a thread that is watched. Returns what it called that it must not.
+template <class Produce>
+std::vector<std::string> Watch(Produce produce) {
+  callCount = 0;
+  std::atomic<bool> completed = false;
+  struct Watched {
+    Produce& produce;
+    std::atomic<bool>& completed;
+  } context{produce, completed};
+  pthread_t thread{};
+  const auto run = [](void* argument) -> void* {
+    auto& [body, done] = *static_cast<Watched*>(argument);
+    // What malloc makes for each thread, so that a fault which allocates is no system call as well.
+    void* volatile first = ::malloc(1);
+    ::free(first);
+    TrapSystemCalls();
+    watched = true;
+    body();
+    watched = false;
+    done = true;
+    ::syscall(SYS_exit, 0);  // the ordinary end of a thread makes more system calls
+    return nullptr;
+  };
+  EXPECT_EQ(::pthread_create(&thread, nullptr, run, &context), 0);
+  EXPECT_EQ(::pthread_join(thread, nullptr), 0);
+  EXPECT_TRUE(completed);
+  std::vector<std::string> called;
+  for (std::size_t i = 0; i < std::min(callCount.load(), calls.size()); ++i) {
+    called.emplace_back(calls[i]);
+  }
+  return called;
+}
+
+/// Takes one connection and reads what comes.
+class Sink {
+ public:
+  Sink() {
+    char directory[] = "/tmp/quarvel-realtime-XXXXXX";
+    path_ = std::string(::mkdtemp(directory)) + "/reporting.sock";
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    path_.copy(address.sun_path, sizeof address.sun_path - 1);
+    listener_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    EXPECT_EQ(::bind(listener_, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+    EXPECT_EQ(::listen(listener_, 1), 0);
+    reader_ = std::jthread([this] {
+      const int connection = ::accept(listener_, nullptr, nullptr);
+      std::vector<char> bytes(65'536);
+      while (::recv(connection, bytes.data(), bytes.size(), 0) > 0) continue;
+      ::close(connection);
+    });
+  }
+  ~Sink() {
+    ::shutdown(listener_, SHUT_RDWR);
+    reader_.join();
+    ::close(listener_);
+    ::unlink(path_.c_str());
+    ::rmdir(path_.substr(0, path_.rfind('/')).c_str());
+  }
+  Sink(const Sink&) = delete;
+  Sink& operator=(const Sink&) = delete;
+  [[nodiscard]] const std::string& path() const { return path_; }
+
+ private:
+  std::string path_;
+  int listener_ = -1;
+  std::jthread reader_;
+};
+
+class RealtimeSafety : public ::testing::Test {
+ protected:
+  static bool record(RealtimeReporter& reporter, int number) {
+    return reporter.record(vocabulary::Kind::playback, RealtimeReporter::MessageType::generic)
+        .set("frames", number)
+        .set("load", 0.5)
+        .set("glitch", true)
+        .set("route", "Speaker")
+        .set("at", Date{})
+        .send();
+  }
+
+  Sink sink_;
+  Client client_ = std::move(Client::connect(sink_.path()).value());
+};
+
+// Records that fit, that are too large and that find the ring full, while the client's thread takes
+// them out.
+TEST_F(RealtimeSafety, TheProducerNeitherAllocatesNorLocksNorCallsTheSystem) {
+  constexpr int kRecords = 200'000;
+  RealtimeReporter::Options options;
+  options.interval = 1ms;
+  RealtimeReporter reporter(client_, 7, options);
+  reporter.start();
+  const std::string large(1'000, 'x');
+  const auto called = Watch([&] {
+    for (int i = 0; i < kRecords; ++i) {
+      record(reporter, i);
+      if (i % 64 == 0) {
+        reporter.record(vocabulary::Kind::error, {}).set("text", std::string_view(large)).send();
+      }
+    }
+  });
+  EXPECT_THAT(called, IsEmpty());
+  reporter.stop();
+  const auto [sent, lost] = reporter.statistics();
+  EXPECT_GT(sent, 0U);
+  EXPECT_GT(lost.full, 0U);
+  EXPECT_GT(lost.tooLarge, 0U);
+}
+
+// A watch that sees nothing proves nothing: each of these is put beside the records.
+TEST_F(RealtimeSafety, TheWatchSeesWhatAProducerMustNotDo) {
+  RealtimeReporter reporter(client_, 7);
+  std::mutex mutex;
+  const struct {
+    const char* seen;
+    std::function<void()> fault;
+  } faults[] = {
+      {"malloc",
+       [] {
+         void* volatile memory = ::malloc(1);
+         ::free(memory);
+       }},
+      {"malloc", [] { delete new volatile int(1); }},
+      {"calloc",
+       [] {
+         void* volatile memory = ::calloc(1, 1);
+         ::free(memory);
+       }},
+      {"free", [leaked = ::malloc(1)] { ::free(leaked); }},
+      {"pthread_mutex_lock", [&] { const std::lock_guard lock(mutex); }},
+      {"a system call", [] { ::getppid(); }},
+      {"a system call", [] { std::this_thread::yield(); }},
+  };
+  for (const auto& [seen, fault] : faults) {
+    const auto called = Watch([&] {
+      record(reporter, 1);
+      fault();
+    });
+    EXPECT_THAT(called, Contains(seen));
+  }
+}
+
+}  // namespace
+}  // namespace quarvel

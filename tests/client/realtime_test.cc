@@ -1,0 +1,224 @@
+#include <quarvel/realtime.hpp>
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <poll.h>
+
+#include <memory>
+#include <thread>
+#include <vector>
+
+#include "base/Json.h"
+#include "tests/client/ClientTesting.h"
+#include "tests/client/FakeService.h"
+
+namespace quarvel {
+namespace {
+
+using test::FakeService;
+using vocabulary::Component;
+using vocabulary::Kind;
+using namespace std::chrono_literals;
+using Loss = RealtimeReporter::Loss;
+using ::testing::ElementsAre;
+
+const RealtimeReporter::Category kPlayback(Component::hal, Kind::playback);
+const auto kSetup = RealtimeReporter::MessageType::setup;
+
+class RealtimeReporterTest : public ::testing::Test {
+ protected:
+  RealtimeReporterTest() {
+    client_.socketPath = service_.path();
+    client_.driver = Client::Driver::caller;
+    reporter_.interval = 1ms;
+    reporter_.lost = [this](const Loss& loss) { losses_.push_back(loss); };
+  }
+  RealtimeReporter& report() {
+    connected_ = std::make_unique<Client>(std::move(Client::connect(client_).value()));
+    service_.accept();
+    reporting_ = std::make_unique<RealtimeReporter>(*connected_, 7, reporter_);
+    return *reporting_;
+  }
+  template <class Done>
+  void drive(Done done) {
+    while (!done()) connected_->dispatch(std::nullopt);
+  }
+  bool record(int number) { return reporting_->record(kPlayback, kSetup).set("n", number).send(); }
+  std::string message() { return JsonText((*service_.receive()->list()).back()); }
+
+  FakeService service_;
+  Client::Options client_;
+  RealtimeReporter::Options reporter_;
+  std::vector<Loss> losses_;
+  std::unique_ptr<Client> connected_;
+  std::unique_ptr<RealtimeReporter> reporting_;
+};
+
+TEST_F(RealtimeReporterTest, ARecordBecomesAMessageWithEveryKindOfValue) {
+  reporter_.recordBytes = 1'024;
+  RealtimeReporter& reporter = report();
+  const std::string text(40, 'x');
+  const std::string longText(300, 'y');
+  const Date date{-1us};
+  reporter.record(kPlayback, kSetup)
+      .set("yes", true)
+      .set("no", false)
+      .set("small", 127)
+      .set("large", 128U)
+      .set("negative", std::int64_t{-1})
+      .set("least", std::numeric_limits<std::int64_t>::min())
+      .set("most", std::numeric_limits<std::uint64_t>::max())
+      .set("real", 0.25)
+      .set("", "")
+      .set(text, longText)
+      .set("date", date)
+      .send();
+  reporter.stop();
+  const Value call = *service_.receive();
+  const List& arguments = *call.list()->back().list();
+  EXPECT_EQ(arguments[0], Value(Dictionary({{"yes", true},
+                                            {"no", false},
+                                            {"small", 127},
+                                            {"large", 128},
+                                            {"negative", -1},
+                                            {"least", std::numeric_limits<std::int64_t>::min()},
+                                            {"most", std::numeric_limits<std::uint64_t>::max()},
+                                            {"real", 0.25},
+                                            {"", ""},
+                                            {text, longText},
+                                            {"date", date}})));
+  EXPECT_EQ(JsonText(Value(List(arguments.begin() + 1, arguments.end()))), "[536870915,3,[7]]");
+}
+
+TEST_F(RealtimeReporterTest, WhatIsLostIsCountedAndToldOfAndTheRestIsWhole) {
+  reporter_.records = 3;  // four slots
+  reporter_.recordBytes = 16;
+  RealtimeReporter& reporter = report();
+  EXPECT_FALSE(reporter.record(kPlayback, kSetup).set("twelve bytes", 128).send());
+  EXPECT_FALSE(reporter.record(kPlayback, kSetup).set("k", std::string(70'000, 'x')).send());
+  EXPECT_TRUE(reporter.record(kPlayback, kSetup).set("k", "\xff").send());
+  EXPECT_TRUE(reporter.record(kPlayback, kSetup).set("elevenbytes", 1).send()) << "16 bytes";
+  static_cast<void>(reporter.record(kPlayback, kSetup).set("abandoned", 1));
+  EXPECT_TRUE(record(1));
+  EXPECT_TRUE(record(2));
+  EXPECT_FALSE(record(3));
+  {
+    auto refused = reporter.record(kPlayback, kSetup);
+    EXPECT_FALSE(refused);
+    EXPECT_FALSE(refused.send());
+    EXPECT_FALSE(refused.set("n", 5).send()) << "spent, and no loss of its own";
+  }
+  reporter.stop();
+  EXPECT_THAT(losses_, ElementsAre(Loss{2, 2, 1, 0}));
+  EXPECT_EQ(message(), R"([{"elevenbytes":1},536870915,3,[7]])");
+  EXPECT_EQ(message(), R"([{"n":1},536870915,3,[7]])");
+  EXPECT_EQ(message(), R"([{"n":2},536870915,3,[7]])");
+  EXPECT_EQ(message(), R"([{"RealtimeRecordsLost":5,"Full":2,"TooLarge":2,"Invalid":1},8,5,[7]])");
+  EXPECT_TRUE(record(6)) << "there is room again";
+  reporter.stop();
+  EXPECT_EQ(message(), R"([{"n":6},536870915,3,[7]])");
+  EXPECT_FALSE(service_.somethingWaits());
+  EXPECT_EQ(reporter.statistics().sent, 4U);
+}
+
+TEST_F(RealtimeReporterTest, TheDriverEmptiesItWhileItIsStartedAndSleepsOtherwise) {
+  RealtimeReporter& reporter = report();
+  pollfd due{connected_->descriptor(), POLLIN, 0};
+  record(1);
+  EXPECT_EQ(::poll(&due, 1, 20), 0) << "not started";
+  reporter.start();
+  reporter.start();
+  drive([&] { return reporter.statistics().sent == 1; });
+  record(2);
+  drive([&] { return reporter.statistics().sent == 2; });
+  reporter.stop();
+  connected_->dispatch(10ms);  // the last wake-up
+  EXPECT_EQ(::poll(&due, 1, 20), 0) << "stopped";
+  record(3);
+  EXPECT_EQ(::poll(&due, 1, 20), 0);
+  EXPECT_EQ(message(), R"([{"n":1},536870915,3,[7]])");
+}
+
+TEST_F(RealtimeReporterTest, RecordsWaitForTheConnectionThatIsMadeAgain) {
+  client_.reconnect = Client::Reconnect{1ms, 4ms};
+  RealtimeReporter& reporter = report();
+  reporter.start();
+  service_.hangUp();
+  drive([&] { return !connected_->connected(); });
+  record(1);
+  reporter.stop();
+  EXPECT_EQ(reporter.statistics().sent, 0U);
+  drive([&] { return reporter.statistics().sent == 1; });
+  service_.accept();
+  EXPECT_EQ(message(), R"([{"n":1},536870915,3,[7]])");
+}
+
+TEST_F(RealtimeReporterTest, RecordsThatNobodyWillSendAreLost) {
+  RealtimeReporter& reporter = report();
+  service_.hangUp();
+  drive([&] { return !connected_->connected(); });
+  record(1);
+  reporter.stop();
+  EXPECT_EQ(reporter.statistics().lost, (Loss{0, 0, 0, 1}));
+  record(2);
+  connected_.reset();
+  reporting_.reset();
+  EXPECT_THAT(losses_, ElementsAre(Loss{0, 0, 0, 1}, Loss{0, 0, 0, 1}));
+}
+
+TEST_F(RealtimeReporterTest, AServiceThatIsSlowCostsRecordsOnlyWhenTheRingIsFull) {
+  client_.gatheredBytes = 1'000;
+  reporter_.records = 4'096;
+  RealtimeReporter& reporter = report();
+  const std::string text(200, 'x');
+  std::uint64_t taken = 0;
+  while (reporter.record(kPlayback, kSetup).set("text", text).send()) {
+    reporter.stop();
+    ++taken;
+  }
+  std::jthread service([&] {
+    for (std::uint64_t i = 0; i < taken; ++i) service_.receive();
+  });
+  drive([&] { return reporter.statistics().sent == taken; });
+  EXPECT_EQ(reporter.statistics().lost, (Loss{1, 0, 0, 0}));
+}
+
+// The client's own thread empties what another writes; both ends are compared.
+TEST_F(RealtimeReporterTest, EveryRecordArrivesOnceAndInItsOrderOrIsCounted) {
+  constexpr std::uint64_t kRecords = 50'000;
+  client_.driver = Client::Driver::ownThread;
+  reporter_.records = 512;
+  reporter_.lossMessage.reset();
+  RealtimeReporter& reporter = report();
+  reporter.start();
+  std::uint64_t refused = 0;
+  std::jthread producer([&] {
+    for (std::uint64_t i = 0; i < kRecords; ++i) {
+      if (reporter.record(kPlayback, kSetup).set("n", i).set("half", i / 2).send()) continue;
+      ++refused;
+      const std::uint64_t sent = reporter.statistics().sent;
+      while (reporter.statistics().sent == sent) std::this_thread::yield();
+    }
+    reporter.stop();
+    connected_->killService();  // the end of what is received
+  });
+  std::uint64_t received = 0;
+  std::int64_t last = -1;
+  for (;;) {
+    const Value call = *service_.receive();
+    const List& arguments = *call.list()->back().list();
+    if (arguments.empty()) break;
+    const std::int64_t number = *arguments[0].dictionary()->find("n")->integer();
+    ASSERT_GT(number, last);
+    ASSERT_EQ(*arguments[0].dictionary()->find("half")->integer(), number / 2);
+    last = number;
+    ++received;
+  }
+  producer.join();
+  EXPECT_EQ(received + refused, kRecords);
+  EXPECT_EQ(reporter.statistics().sent, received);
+  EXPECT_EQ(reporter.statistics().lost, (Loss{refused, 0, 0, 0}));
+}
+
+}  // namespace
+}  // namespace quarvel

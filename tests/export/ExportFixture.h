@@ -1,0 +1,125 @@
+#pragma once
+
+#include <atomic>
+#include <functional>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "base/Mutex.h"
+#include "platform/linux/store/export/ExportEngine.h"
+#include "platform/linux/store/export/Exporter.h"
+#include "tests/linux/StoreFixture.h"
+
+namespace quarvel::testing {
+
+/// An engine that keeps the names of what it takes, and answers as it is told.
+class RecordingEngine : public ExportEngine {
+ public:
+  using Answer = std::function<Delivery(const ExportBatch&)>;
+
+  static Delivery takeAll(const ExportBatch& batch) { return {.taken = batch.rows.size()}; }
+  static Delivery down(const ExportBatch&) {
+    return {.rest = Delivery::Rest::again, .reason = "nobody answers"};
+  }
+
+  Delivery deliver(const ExportBatch& batch) override {
+    ++deliveries;
+    const Delivery delivery = answer(batch);
+    for (std::size_t i = 0; i < delivery.taken; ++i) taken.push_back(batch.nameOf(batch.rows[i]));
+    return delivery;
+  }
+  void rest() override { ++rests; }
+  void stop() override {}
+  void resume() override {}
+
+  Answer answer = takeAll;
+  std::vector<std::string> taken;
+  int deliveries = 0;
+  int rests = 0;
+};
+
+/// A store with a remote backend, and an exporter in virtual time.
+class ExportFixture : public StoreFixture {
+ protected:
+  using Instant = Exporter::Instant;
+  using Duration = Instant::duration;
+
+  void begin(TelemetryStore::Options options = {}, std::uint32_t rowsPerSecond = 1'000'000,
+             std::chrono::seconds gather = {}) {
+    exporter_.reset();
+    source_.reset();
+    options.sync = {};
+    options.remoteBackends = {"engine"};
+    options.clock = [this] { return date(); };
+    store_ = open(options);
+    source_.emplace(*store_, path_, "engine");
+    exporter_.emplace(Exporter::Options{"engine", rowsPerSecond, gather, [this] { return date(); },
+                                        [this] { return now_; }, [] { return 1.0; }},
+                      *source_, engine_);
+    next_ = {now_, false};
+    Await([this] { return !extent().storeID.empty(); });
+  }
+  void addMessages(int count, const Payload& payload = Payload(Dictionary{{"n", 1}})) {
+    for (int i = 0; i < count; ++i) {
+      ASSERT_TRUE(store_->addMessage({std::nullopt, 7, "client", "service", 1, 2, payload}));
+    }
+    Await([this] { return store_->counters().waiting == 0; });
+    extended_ = true;
+  }
+  StoreExtent extent() {
+    StoreExtent extent;
+    store_->followExtent([&extent](const StoreExtent& safe) { extent = safe; });
+    store_->followExtent({});
+    return extent;
+  }
+  /// Lets the exporter do what is due until then; returns how often it woke up.
+  int runFor(Duration duration) {
+    const Instant end = now_ + duration;
+    int wakeUps = 0;
+    for (;;) {
+      if (next_.uponRows && extended_) next_.at = now_;
+      if (!next_.at || *next_.at > end) break;
+      advance(std::max(*next_.at, now_) - now_);
+      extended_ = false;
+      next_ = exporter_->step(extent());
+      ++wakeUps;
+    }
+    if (now_ < end) advance(end - now_);
+    return wakeUps;
+  }
+  std::vector<std::string> names(int first, int last, const std::string& table = "message") const {
+    const std::string storeID = value("SELECT value FROM meta WHERE key = 'store_id'");
+    std::vector<std::string> names;
+    for (int id = first; id <= last; ++id) {
+      names.push_back(storeID + "-" + table + "-" + std::to_string(id));
+    }
+    return names;
+  }
+  std::vector<std::string> ledger() const {
+    return rows(
+        "SELECT backend, table_name, first_id, last_id, rows, outcome FROM export_log"
+        " ORDER BY id");
+  }
+
+  [[nodiscard]] Date date() const { return date_; }
+
+  RecordingEngine engine_;
+  std::unique_ptr<TelemetryStore> store_;
+  std::optional<ExportSource> source_;
+  std::optional<Exporter> exporter_;
+  Instant now_{std::chrono::hours(1)};
+
+ private:
+  void advance(Duration duration) {
+    now_ += duration;
+    date_ = date() + std::chrono::duration_cast<Date::duration>(duration);
+  }
+
+  std::atomic<Date> date_{
+      Date(std::chrono::seconds(1'700'000'000))};  // the store's writer reads it
+  Exporter::Next next_;
+  bool extended_ = false;
+};
+
+}  // namespace quarvel::testing

@@ -1,0 +1,144 @@
+#include <gmock/gmock.h>
+
+#include <fstream>
+#include <future>
+
+#include "platform/linux/store/StoreErasure.h"
+#include "tests/export/ExportFixture.h"
+
+namespace quarvel::testing {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::IsEmpty;
+using namespace std::chrono_literals;
+
+class ErasureTest : public ExportFixture {
+ protected:
+  static constexpr std::int64_t kErasedSession = 4102;
+
+  void addSecret(std::int64_t sessionID, int count) {
+    const Payload info(Dictionary{{"App", "secret"}});
+    const auto session =
+        store_->addAgentSession({sessionID, 19, 2.0, true, "t", "client", "music", info});
+    for (int i = 0; i < count; ++i) {
+      // So long that some rows have pages of their own.
+      const Payload payload(Dictionary{{"secret", std::string(i % 10 == 0 ? 9000 : 90, 's')}});
+      ASSERT_TRUE(
+          store_->addMessage({session.value(), sessionID, "client", "music", 1, 2, payload}));
+    }
+  }
+  Result<std::int64_t> erase(const ErasureSelection& selection) {
+    std::promise<Result<std::int64_t>> erased;
+    EXPECT_TRUE(store_->erase(selection,
+                              [&](const Result<std::int64_t>& rows) { erased.set_value(rows); }));
+    return erased.get_future().get();
+  }
+  [[nodiscard]] bool filesHold(const std::string& text) const {
+    for (const auto& entry : std::filesystem::directory_iterator(directory_)) {
+      std::ifstream file(entry.path(), std::ios::binary);
+      const std::string content((std::istreambuf_iterator<char>(file)), {});
+      if (content.find(text) != std::string::npos) return true;
+    }
+    return false;
+  }
+};
+
+TEST_F(ErasureTest, LeavesNothingOfWhatWasErasedInTheFilesAndOneLineInTheLedger) {
+  begin();
+  addMessages(2000);
+  addSecret(kErasedSession, 1500);
+  addMessages(2000);
+  ASSERT_TRUE(filesHold("secret") || store_->counters().waiting > 0);
+  EXPECT_EQ(erase({kErasedSession}).value(), 1501);
+  EXPECT_FALSE(filesHold("secret"));
+  EXPECT_EQ(value("SELECT count(*) FROM message"), "4000");
+  EXPECT_THAT(rows("SELECT backend, table_name, first_id, rows, bytes > 100000, outcome FROM "
+                   "export_log"),
+              ElementsAre("store|*|-|1501|1|erased: session 4102"));
+  const StoreCounters counters = store_->counters();
+  EXPECT_EQ(counters.dropped[StoreDrop::erased], 1500U);
+  EXPECT_EQ(counters.accepted, counters.stored + counters.dropped.sum());
+  begin();
+  EXPECT_EQ(store_->counters(), counters) << "as before the restart";
+}
+
+TEST_F(ErasureTest, ErasesByDateAndKeepsTheSessionsOfWhatRemains) {
+  begin();
+  addSecret(1, 10);
+  addMessages(5);
+  ASSERT_TRUE(store_->addAnalyticsEvent("old", Payload()));
+  const Payload info;
+  const auto open = store_->addAgentSession({2, 19, 2.0, true, "t", "c", "s", info});
+  runFor(1h);
+  ASSERT_TRUE(store_->addMessage({open.value(), 2, "c", "s", 1, 2, Payload()}));
+  ASSERT_TRUE(store_->addPowerEvent(1, "new", Payload()));
+  Await([this] { return store_->counters().waiting == 0; });
+  EXPECT_EQ(erase({date() - 1min}).value(), 10 + 1 + 5 + 1);
+  EXPECT_THAT(rows("SELECT session_id FROM agent_session"), ElementsAre("2"));
+  EXPECT_THAT(rows("SELECT session_id FROM message"), ElementsAre("2"));
+  EXPECT_EQ(value("SELECT (SELECT count(*) FROM analytics_event) || (SELECT count(*) FROM "
+                  "power_event)"),
+            "01");
+}
+
+// An id that was given twice would be a repeat to every engine.
+TEST_F(ErasureTest, GivesNoIdTwiceAndExportsWhatComesAfter) {
+  begin();
+  engine_.answer = RecordingEngine::down;
+  addMessages(10);
+  runFor(1s);
+  EXPECT_EQ(erase({}).value(), 10);
+  EXPECT_EQ(erase({}).value(), 0) << "and leaves its line all the same";
+  begin();
+  engine_.answer = RecordingEngine::takeAll;
+  addMessages(3);
+  runFor(1h);
+  EXPECT_EQ(engine_.taken, names(11, 13));
+  EXPECT_THAT(rows("SELECT rows FROM export_log WHERE backend = 'store'"), ElementsAre("10", "0"));
+}
+
+TEST_F(ErasureTest, TakesRowsMeanwhileAndErasesNoneOfThem) {
+  begin();
+  addMessages(20'000);
+  std::promise<Result<std::int64_t>> erased;
+  ASSERT_TRUE(store_->erase({}, [&](const auto& rows) { erased.set_value(rows); }));
+  addMessages(5000);
+  EXPECT_EQ(erased.get_future().get().value(), 20'000);
+  EXPECT_EQ(value("SELECT min(id) || ' ' || count(*) FROM message"), "20001 5000");
+}
+
+TEST_F(ErasureTest, WorksOnAStoreThatNobodyHasOpen) {
+  begin();
+  addSecret(1, 700);
+  store_->close();
+  std::ofstream(path_.string() + ".corrupt-1") << "secret";
+  std::ofstream(path_.string() + ".corrupt-1-wal") << "secret";
+  {
+    SqliteConnection connection;
+    ASSERT_TRUE(connection.open(path_));
+    StoreErasure erasure(connection, {}, date());
+    while (erasure.step() == StoreErasure::Progress::more) continue;
+    EXPECT_EQ(erasure.rows(), 701);
+  }
+  EXPECT_EQ(StoreErasure::removeSetAside(path_), 2U);
+  EXPECT_FALSE(filesHold("secret"));
+  begin();
+  EXPECT_EQ(store_->counters().dropped[StoreDrop::erased], 700U);
+  addMessages(1);
+  EXPECT_EQ(value("SELECT id FROM message"), "701");
+}
+
+TEST_F(ErasureTest, AClosedStoreSaysThatItWasNotFinished) {
+  begin();
+  addMessages(5000);
+  std::promise<Result<std::int64_t>> erased;
+  ASSERT_TRUE(store_->erase({}, [&](const auto& rows) { erased.set_value(rows); }));
+  store_->close();
+  const auto result = erased.get_future().get();
+  EXPECT_TRUE(result.ok() ||
+              result.error().description().find("before all was erased") != std::string::npos);
+}
+
+}  // namespace
+}  // namespace quarvel::testing

@@ -1,0 +1,287 @@
+#include "platform/linux/store/export/Exporter.h"
+
+#include <gmock/gmock.h>
+
+#include <fstream>
+
+#include "tests/export/ExportFixture.h"
+#include "tests/linux/LogRecorder.h"
+
+namespace quarvel::testing {
+namespace {
+
+using ::testing::AllOf;
+using ::testing::Contains;
+using ::testing::ElementsAre;
+using ::testing::Ge;
+using ::testing::HasSubstr;
+using ::testing::IsEmpty;
+using ::testing::Le;
+using ::testing::Optional;
+using namespace std::chrono_literals;
+using Rest = Delivery::Rest;
+
+class ExporterTest : public ExportFixture {};
+
+TEST_F(ExporterTest, CarriesEveryTableOutOnceInOrderAndSaysSo) {
+  begin();
+  const Payload info(Dictionary{{"App", "a\"b"}});
+  ASSERT_TRUE(store_->addAgentSession({-5, 19, 2.5, true, "token", "client", "music", info}));
+  ASSERT_TRUE(store_->addAnalyticsEvent("an.event", Payload(Dictionary{{"x", 1.5}})));
+  ASSERT_TRUE(store_->addPowerEvent(-28, "", Payload()));
+  std::vector<std::string> json;
+  engine_.answer = [&json](const ExportBatch& batch) {
+    for (const ExportRow& row : batch.rows) AppendRowJson(json.emplace_back(), batch.table, row);
+    return RecordingEngine::takeAll(batch);
+  };
+  addMessages(2500);
+  runFor(1s);
+  EXPECT_THAT(json.front(),
+              R"({"id":1,"session_id":-5,"client_type":19,"client_version":2.5,"batch_event":true,)"
+              R"("hierarchy_token":"token","client_name":"client","service_name":"music",)"
+              R"("user_info":{"App":"a\"b"},"opened_at":1700000000000000})");
+  EXPECT_THAT(json[2500],
+              R"({"id":2500,"agent_session":null,"session_id":7,"client_name":"client",)"
+              R"("service_name":"service","category":1,"type":2,"payload":{"n":1},)"
+              R"("sent_at":1700000000000000})");
+  auto expected = names(1, 1, "agent_session");
+  for (const auto& more :
+       {names(1, 2500), names(1, 1, "analytics_event"), names(1, 1, "power_event")}) {
+    expected.insert(expected.end(), more.begin(), more.end());
+  }
+  EXPECT_EQ(engine_.taken, expected);
+  EXPECT_THAT(ledger(), ElementsAre("engine|agent_session|1|1|1|acknowledged",
+                                    "engine|message|1|1000|1000|acknowledged",
+                                    "engine|message|1001|2000|1000|acknowledged",
+                                    "engine|message|2001|2500|500|acknowledged",
+                                    "engine|analytics_event|1|1|1|acknowledged",
+                                    "engine|power_event|1|1|1|acknowledged"));
+  EXPECT_EQ(exporter_->status().exportedRows, 2503U);
+  EXPECT_THAT(exporter_->status().acknowledgedAt, Optional(AllOf(Ge(date() - 1s), Le(date()))));
+
+  begin();
+  engine_.taken.clear();
+  runFor(1h);
+  EXPECT_THAT(engine_.taken, IsEmpty()) << "after a restart nothing is repeated";
+  addMessages(1);
+  runFor(1s);
+  EXPECT_EQ(engine_.taken, names(2501, 2501));
+}
+
+TEST_F(ExporterTest, RestsWhenThereIsNothingToSend) {
+  begin();
+  addMessages(1);
+  runFor(29s);
+  EXPECT_EQ(engine_.rests, 0) << "the connection is kept for what may follow";
+  runFor(2s);
+  EXPECT_EQ(engine_.rests, 1);
+  EXPECT_EQ(runFor(1000h), 0);
+}
+
+TEST_F(ExporterTest, GathersRowsForAsLongAsItIsTold) {
+  begin({}, 1'000'000, 60s);
+  addMessages(1);
+  runFor(59s);
+  addMessages(1);
+  EXPECT_EQ(engine_.deliveries, 0);
+  runFor(2s);
+  EXPECT_EQ(engine_.deliveries, 1);
+  EXPECT_EQ(engine_.taken, names(1, 2));
+}
+
+TEST_F(ExporterTest, DrainsABacklogAtItsShare) {
+  begin({}, 100);
+  addMessages(1000);
+  runFor(5s);
+  EXPECT_THAT(engine_.taken.size(), AllOf(Ge(475U), Le(525U)));
+  runFor(5s);
+  EXPECT_EQ(engine_.taken.size(), 1000U);
+}
+
+TEST_F(ExporterTest, AnEngineDownForEightHoursCostsFewWakeUpsAndNoRow) {
+  LogRecorder::take();
+  begin({.maximumBytes = 8 << 20});
+  engine_.answer = RecordingEngine::down;
+  int wakeUps = 0;
+  for (int minute = 0; minute < 480; ++minute) {
+    addMessages(20);
+    wakeUps += runFor(1min);
+  }
+  // 1 + 2 + 4 ... + 256 seconds, then one every five minutes.
+  EXPECT_THAT(wakeUps, AllOf(Ge(100), Le(110)));
+  EXPECT_THAT(LogRecorder::takeErrors(), ElementsAre(HasSubstr("nobody answers")));
+  EXPECT_THAT(exporter_->status().error, Optional(std::string("nobody answers")));
+  EXPECT_THAT(exporter_->status().nextAttempt, Optional(Ge(date())));
+  EXPECT_THAT(source_->backlog(exporter_->status().exportedThrough).value(), 9600);
+
+  engine_.answer = RecordingEngine::takeAll;
+  runFor(5min);
+  EXPECT_EQ(engine_.taken, names(1, 9600));
+  EXPECT_EQ(exporter_->status().error, std::nullopt);
+  EXPECT_EQ(source_->backlog(exporter_->status().exportedThrough).value(), 0);
+}
+
+// The disk is bounded all the same; what has been exported goes first, and what must go is counted.
+TEST_F(ExporterTest, RetentionTakesExportedRowsFirstAndCountsTheOthers) {
+  LogRecorder::take();
+  constexpr std::uint64_t kBound = 4 << 20;
+  begin({.maximumBytes = kBound});
+  const Payload large(Dictionary{{"text", std::string(4000, 'x')}});
+  const auto addHundreds = [&](int hundreds) {
+    for (int i = 0; i < hundreds; ++i) addMessages(100, large);
+  };
+  addHundreds(5);
+  runFor(1s);
+  engine_.answer = RecordingEngine::down;
+  addHundreds(8);
+  EXPECT_EQ(value("SELECT min(id) > 1 AND min(id) <= 501 AND max(id) = 1300 FROM message"), "1");
+  EXPECT_THAT(LogRecorder::takeErrors(), IsEmpty());
+  addHundreds(12);
+  EXPECT_THAT(LogRecorder::takeErrors(), Contains(HasSubstr("no backend has had")));
+  EXPECT_LE(std::filesystem::file_size(path_), kBound);
+  engine_.answer = RecordingEngine::takeAll;
+  engine_.taken.clear();
+  const int first = std::stoi(value("SELECT min(id) FROM message"));
+  runFor(10min);
+  EXPECT_EQ(engine_.taken, names(first, 2500));
+}
+
+TEST_F(ExporterTest, BacksOffAsLongAsTheEngineAsksButNoLongerThanAnHour) {
+  for (const auto& [asked, kept] : {std::pair{90s, 90s}, {1s, 1s}, {86'400s, 3600s}}) {
+    begin();
+    engine_.answer = [asked = asked](const ExportBatch&) {
+      return Delivery{.rest = Rest::again, .reason = "busy", .after = asked};
+    };
+    addMessages(1);
+    runFor(1ms);
+    engine_.answer = RecordingEngine::takeAll;
+    const int before = engine_.deliveries;
+    runFor(kept - 2ms);
+    EXPECT_EQ(engine_.deliveries, before) << asked.count();
+    runFor(2ms);
+    EXPECT_EQ(engine_.deliveries, before + 1) << asked.count();
+  }
+}
+
+TEST_F(ExporterTest, BacksOffAfterAnEngineThatTookItsTimeNotMeanwhile) {
+  begin();
+  addMessages(1);
+  engine_.answer = [this](const ExportBatch& batch) {
+    now_ += 10s;
+    return RecordingEngine::down(batch);
+  };
+  runFor(0s);
+  engine_.answer = RecordingEngine::takeAll;
+  runFor(999ms);
+  EXPECT_EQ(engine_.deliveries, 1);
+  runFor(1ms);
+  EXPECT_EQ(engine_.deliveries, 2);
+}
+
+TEST_F(ExporterTest, WhatIsTakenOfABatchIsNotSentAgain) {
+  begin();
+  addMessages(10);
+  engine_.answer = [](const ExportBatch&) {
+    return Delivery{.taken = 4, .rest = Rest::again, .reason = "full"};
+  };
+  runFor(1ms);
+  engine_.answer = RecordingEngine::takeAll;
+  runFor(1s);
+  EXPECT_EQ(engine_.taken, names(1, 10));
+  engine_.answer = [](const ExportBatch& batch) {
+    return Delivery{.taken = batch.rows.size(), .reason = "too old", .droppedByEngine = 2};
+  };
+  addMessages(5);
+  runFor(1s);
+  EXPECT_THAT(ledger(),
+              ElementsAre("engine|message|1|4|4|acknowledged", "engine|message|5|10|6|acknowledged",
+                          "engine|message|11|15|5|partly refused: 2 of 5: too old"));
+  EXPECT_EQ(exporter_->status().refusedRows, 2U);
+}
+
+TEST_F(ExporterTest, APoisonousRowIsSetAsideAlone) {
+  begin();
+  addMessages(1000);
+  engine_.answer = [](const ExportBatch& batch) {
+    for (const ExportRow& row : batch.rows) {
+      if (row.id == 778) {
+        return Delivery{.rest = Rest::refused, .refused = batch.rows.size(), .reason = "bad row"};
+      }
+    }
+    return RecordingEngine::takeAll(batch);
+  };
+  runFor(1s);
+  auto expected = names(1, 1000);
+  expected.erase(expected.begin() + 777);
+  EXPECT_EQ(engine_.taken, expected);
+  EXPECT_LE(engine_.deliveries, 30);
+  EXPECT_THAT(ledger(), Contains("engine|message|778|778|1|refused: bad row"));
+  EXPECT_EQ(value("SELECT count(*) FROM message WHERE id = 778"), "1") << "it stays in the store";
+  EXPECT_EQ(exporter_->status().refusedRows, 1U);
+}
+
+TEST_F(ExporterTest, AnEngineThatRefusesEverythingIsNotAskedRowByRow) {
+  begin();
+  addMessages(3000);
+  engine_.answer = [](const ExportBatch& batch) {
+    return Delivery{.rest = Rest::refused, .refused = batch.rows.size(), .reason = "nonsense"};
+  };
+  runFor(1s);
+  const int firstSecond = engine_.deliveries;
+  EXPECT_LE(firstSecond, 25);
+  runFor(1h);
+  EXPECT_LE(engine_.deliveries, firstSecond + 20) << "it has time to come to its senses";
+  engine_.answer = RecordingEngine::takeAll;
+  runFor(10min);
+  EXPECT_EQ(value("SELECT sum(rows) FROM export_log"), "3000");
+}
+
+// What was acknowledged and could not be recorded is repeated, under the same names.
+TEST_F(ExporterTest, ACrashRepeatsOneBatchAtMost) {
+  begin();
+  addMessages(3000);
+  engine_.answer = [this](const ExportBatch& batch) {
+    if (batch.rows.front().id == 1001) store_->close();
+    return RecordingEngine::takeAll(batch);
+  };
+  runFor(1ms);
+  engine_.answer = RecordingEngine::takeAll;
+  begin();
+  addMessages(0);
+  runFor(1s);
+  auto expected = names(1, 2000);
+  const auto repeated = names(1001, 3000);
+  expected.insert(expected.end(), repeated.begin(), repeated.end());
+  EXPECT_EQ(engine_.taken, expected);
+}
+
+TEST_F(ExporterTest, AStoreThatTakesThePlaceOfAnotherIsExportedFromItsBeginning) {
+  begin();
+  addMessages(10);
+  runFor(1s);
+  store_->close();
+  for (const char* suffix : {"", "-wal", "-shm"}) {
+    std::error_code ignored;
+    std::filesystem::rename(path_.string() + suffix, path_.string() + ".aside" + suffix, ignored);
+  }
+  store_ = open({.sync = 0ms});
+  source_.emplace(*store_, path_, "engine");
+  engine_.taken.clear();
+  addMessages(3);
+  runFor(1s);
+  EXPECT_EQ(engine_.taken, names(1, 3));
+}
+
+TEST_F(ExporterTest, WhatAPowerCutMayStillTakeIsNotSent) {
+  begin();
+  addMessages(10);
+  StoreExtent safe = extent();
+  safe.lastIDs[StoreTable::message] = 4;
+  (void)exporter_->step(safe);
+  now_ += 1s;
+  (void)exporter_->step(safe);
+  EXPECT_EQ(engine_.taken, names(1, 4));
+}
+
+}  // namespace
+}  // namespace quarvel::testing

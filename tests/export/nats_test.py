@@ -1,0 +1,162 @@
+"""The service and a real NATS cluster of three nodes, any of which may be killed at any moment."""
+
+import collections
+import contextlib
+import json
+import os
+import pathlib
+import random
+import signal
+import sqlite3
+import sys
+import time
+import unittest
+
+sys.path.insert(0, str(pathlib.Path(__file__).parents[1] / "integration"))
+from cluster import Cluster, SecuredCluster
+from harness import ServiceTest, eventually
+
+NIGHTLY = bool(os.environ.get("QUARVEL_NIGHTLY"))
+CONFIGURATION = """
+[store]
+sync_ms = 20
+[analytics]
+wanted = []
+[agent]
+backends = ["nats"]
+device = "car-7"
+drain_rows_per_second = 20000
+[agent.nats]
+urls = {urls}
+create_stream = true
+duplicate_window_seconds = {window}
+acknowledge_seconds = 5
+"""
+
+
+class Nats(ServiceTest):
+    def setUp(self):
+        self.cluster = Cluster()
+        self.addCleanup(self.cluster.close)
+
+    def started(self, window=600):
+        return self.service(CONFIGURATION.format(urls=json.dumps(self.cluster.urls), window=window))
+
+    def names(self, service):
+        """Of every row that the store holds."""
+        store = service.rows("SELECT value FROM meta WHERE key = 'store_id'")[0][0]
+        return [f"{store}-{table}-{row[0]}"
+                for table in ("agent_session", "message", "analytics_event", "power_event")
+                for row in service.rows(f"SELECT id FROM {table} ORDER BY id")]
+
+    def await_export(self, service):
+        def settled():
+            before = len(self.names(service))
+            time.sleep(0.3)
+            return 0 < before == len(self.names(service))
+        eventually(settled, "everything is stored")
+        eventually(lambda: all(
+            service.rows(f"SELECT (SELECT ifnull(max(id), 0) FROM {table}) <= (SELECT ifnull(max(exported_through), 0)"
+                         " FROM backend_cursor WHERE table_name = ?)", table)[0][0]
+            for table in ("agent_session", "message", "analytics_event", "power_event")), "all is exported")
+
+    def test_every_row_arrives_once_whatever_is_killed(self):
+        rows = 100_000 if NIGHTLY else 20_000
+        dice = random.Random(7)
+        service = self.started()
+        killed = []
+        sent = 0
+        for turn in range(8):
+            client = self.client(service)
+            client.start_session(turn + 1)
+            for _ in range(rows // 8):
+                sent += 1
+                client.message({"n": sent, "route": "speaker", "text": "x" * 150}, [turn + 1])
+            if turn == 1:
+                killed.append(dice.randrange(3))
+                self.cluster.kill(killed[-1])
+            if turn == 4:
+                self.cluster.start(killed[-1])
+            if turn in (2, 3, 5, 6):
+                time.sleep(dice.random())
+                service.end(signal.SIGKILL)
+                service.start()
+        self.await_export(service)
+        names = self.names(service)
+        self.assertGreaterEqual(len(names), rows - 4 * 1024)  # what a kill may take: the last moment's
+        arrived = self.cluster.rows(os.environ["QUARVEL_CONSUMER"])
+        self.assertEqual(sorted(row["name"] for row in arrived), sorted(names))
+        self.assertEqual(self.cluster.state()["messages"], len(names), "the stream itself has dropped the repeats")
+        self.assertEqual({row["subject"] for row in arrived if "-message-" in row["name"]}, {"quarvel.car-7.message"})
+        stored = {row["id"]: json.loads(row["payload"]) for row in service.rows("SELECT id, payload FROM message")}
+        self.assertEqual({row["row"]["id"]: row["row"]["payload"] for row in arrived if "-message-" in row["name"]},
+                         stored)
+
+    def test_a_repeat_after_the_streams_window_is_dropped_by_the_consumer(self):
+        service = self.started(window=1)
+        client = self.client(service)
+        client.start_session(1)
+        for number in range(300):
+            client.message({"n": number}, [1])
+        self.await_export(service)
+        before = self.cluster.state()["messages"]
+        for wait, repeats in ((2, 100), (0, 100)):
+            # As a crash between the acknowledgement and the cursor's commit leaves it.
+            service.end(signal.SIGKILL)
+            with contextlib.closing(sqlite3.connect(service.directory / "state/telemetry.db")) as store, store:
+                store.execute("UPDATE backend_cursor SET exported_through = exported_through - 100"
+                              " WHERE table_name = 'message'")
+            time.sleep(wait)
+            service.start()
+            self.await_export(service)
+        self.assertGreaterEqual(self.cluster.state()["messages"], before + repeats)
+        names = collections.Counter(row["name"] for row in self.cluster.rows(os.environ["QUARVEL_CONSUMER"]))
+        self.assertEqual(sorted(names.elements()), sorted(self.names(service)))
+
+    def test_what_the_stream_cannot_take_is_set_aside_and_the_reason_told(self):
+        service = self.service(CONFIGURATION.format(urls=json.dumps(self.cluster.urls), window=60).replace(
+            "create_stream = true", "create_stream = false"))
+        client = self.client(service)
+        client.start_session(1)
+        eventually(lambda: "no stream QUARVEL" in service.log(), "the missing stream is told of")
+        service.end()
+        configuration = service.directory / "etc/quarvel.toml"
+        configuration.write_text(configuration.read_text().replace("create_stream = false", "create_stream = true"))
+        service.start()
+        client = self.client(service)
+        client.start_session(2)
+        client.message({"n": 1}, [2])
+        client.message({"text": "\x01" * 400_000}, [2])  # six bytes each in JSON
+        client.message({"n": 2}, [2])
+        self.await_export(service)
+        outcomes = [(row["first_id"], row["outcome"]) for row in service.rows(
+            "SELECT * FROM export_log WHERE table_name = 'message' AND outcome != 'acknowledged'")]
+        large = service.rows("SELECT id FROM message WHERE length(payload) > 1000000")[0][0]
+        self.assertEqual([line[0] for line in outcomes], [large])
+        self.assertRegex(outcomes[0][1], "^refused: [0-9]+ bytes are more than it allows")
+        self.assertEqual(len(self.cluster.rows(os.environ["QUARVEL_CONSUMER"])), len(self.names(service)) - 1)
+
+
+class SecuredNats(ServiceTest):
+    def test_a_device_publishes_below_its_own_name_and_nowhere_else(self):
+        cluster = SecuredCluster()
+        self.addCleanup(cluster.close)
+        cluster.create_stream()
+        configuration = CONFIGURATION.replace("create_stream = true", "create_stream = false").format(
+            urls=json.dumps(cluster.urls), window=60)
+        files = "".join(f'{key} = "{cluster.directory}/{file}"\n' for key, file in
+                        (("tls_ca", "ca.pem"), ("tls_certificate", "car-7.pem"), ("tls_key", "car-7.key")))
+        for device, allowed in (("car-7", True), ("car-8", False)):
+            service = self.service(configuration.replace("car-7", device) + files)
+            client = self.client(service)
+            client.start_session(1)
+            if allowed:
+                eventually(lambda service=service: service.count("export_log WHERE outcome = 'acknowledged'"), "a row")
+            else:
+                eventually(lambda service=service: "takes no rows" in service.log(), "the refusal")
+                self.assertEqual(service.count("export_log"), 0)
+        self.assertEqual(cluster.state()["messages"], 1)
+
+
+if __name__ == "__main__":
+    unittest.main(verbosity=2)

@@ -1,0 +1,105 @@
+// What stands in for the outer ends of the platform under fuzzing: an agent and sinks that take
+// everything and look at it, a process that does not end.
+
+#include <rapidjson/reader.h>
+#include <unistd.h>
+
+#include <array>
+#include <atomic>
+#include <cstdlib>
+
+#include "base/Json.h"
+#include "platform/Counters.h"
+#include "platform/Ohmrik.h"
+#include "platform/Process.h"
+#include "platform/RelmReporting.h"
+#include "platform/Vistrel.h"
+#include "platform/WorkQueue.h"
+#include "tests/fuzz/Require.h"
+
+namespace quarvel {
+
+namespace {
+
+void Look(const Payload& payload) {
+  const std::string json = JsonText(payload);
+  rapidjson::StringStream stream(json.c_str());
+  rapidjson::BaseReaderHandler<> nobody;
+  Require(
+      !rapidjson::Reader().Parse<rapidjson::kParseValidateEncodingFlag>(stream, nobody).IsError(),
+      "what reaches the agent is JSON");
+}
+
+class Session final : public RelmReportingSession {
+ public:
+  ~Session() override { Require(flushes_ <= 1, "a session is flushed once"); }
+  void startConfiguration(ConfigurationCompletion completion) override {
+    BackgroundQueue().async([completion = std::move(completion)] { completion({{"memory"}}); });
+  }
+  Outcome agentSendMessage(std::uint16_t, std::uint16_t, const Payload& payload) override {
+    Require(flushes_ == 0, "nothing comes after the flush");
+    Look(payload);
+    return Success();
+  }
+  void flushMessages(FlushCompletion completion) override {
+    ++flushes_;
+    BackgroundQueue().async([completion = std::move(completion)] { completion(std::nullopt); });
+  }
+  [[nodiscard]] std::string description() const override { return "<Session>"; }
+
+ private:
+  int flushes_ = 0;
+};
+
+}  // namespace
+
+RelmReportingToken RelmReporting::newSecureHierarchyToken(
+    const std::optional<RelmReportingToken>&) {
+  return "token";
+}
+
+std::shared_ptr<RelmReportingSession> RelmReporting::createAgentSession(
+    const Dictionary& sessionInfo, const Dictionary& userInfo, const std::vector<std::string>&) {
+  Look(Payload(sessionInfo));
+  Look(Payload(userInfo));
+  return std::make_shared<Session>();
+}
+
+Outcome RelmReporting::sendOneMessage(const Dictionary&, const Dictionary&, std::uint16_t,
+                                      std::uint16_t, const Payload& payload) {
+  Look(payload);
+  return Success();
+}
+
+void CountAcceptedMessage() {}
+void CountDroppedMessage(MessageDrop) {}
+void AddToGauge(Gauge gauge, int difference) {
+  static std::array<std::atomic<int>, 3> gauges{};
+  const int now = gauges[static_cast<std::size_t>(gauge)] += difference;
+  Require(now >= 0, "nothing ends more often than it begins");
+}
+
+void VistrelSendEventLazy(std::string_view, const std::function<Payload()>& payload) {
+  Look(payload());
+}
+
+void OhmrikLogRegisteredEvent(std::int32_t, std::string_view, const Payload& record,
+                              std::nullptr_t) {
+  Look(record);
+}
+
+std::int32_t OwnProcessIdentifier() {
+  return getpid();
+}
+std::string OwnProcessName() {
+  return "fuzzed";
+}
+std::optional<std::string> ProcessCommandName(std::int32_t) {
+  return "client";
+}
+void ExitProcess(int) {
+  Require(false, "nothing ends the process");
+  std::abort();
+}
+
+}  // namespace quarvel

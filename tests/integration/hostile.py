@@ -1,0 +1,228 @@
+"""Clients that mean no good, each in a process of its own, and a polite one that suffers or does not."""
+
+import contextlib
+import multiprocessing
+import os
+import pathlib
+import socket
+import statistics
+import time
+
+import msgpack
+from harness import PATIENCE, Client
+
+SEND = "sendMessage:withCategory:andType:forReportingIDs:reply:"
+_fork = multiprocessing.get_context("fork")
+
+
+class Hostile:
+    """Runs `act(service)` again and again in another process, while it is let."""
+
+    def __init__(self, service, act):
+        self._go = _fork.Event()
+        self._resting = _fork.Event()
+        self._process = _fork.Process(target=self._live, args=(service, act), daemon=True)
+        self._process.start()
+
+    def _live(self, service, act):
+        os.nice(19)  # what the machine gives to whom is not the service's to say
+        while True:
+            self._resting.set()
+            self._go.wait()
+            self._resting.clear()
+            while self._go.is_set():
+                with contextlib.suppress(OSError):  # turned away, hung up on, held back
+                    act(service)
+
+    def attack(self):
+        self._go.set()
+
+    def rest(self):
+        self._go.clear()
+        assert self._resting.wait(PATIENCE)
+
+    def end(self):
+        self._process.kill()
+        self._process.join()
+
+
+class PoliteClient:
+    """Sends a message every two milliseconds and waits for each answer."""
+
+    PAUSE = 0.002
+
+    def __init__(self, service, reporter):
+        self._client = Client(service)
+        self._reporter = reporter
+        self._client.start_session(reporter)
+        self.sent = 0
+
+    def close(self):
+        self._client.close()
+
+    def stop(self):
+        self._client.stop_session(self._reporter)
+
+    def send(self):
+        self._client.message({"n": self.sent, "route": "Speaker"}, [self._reporter])
+        self.sent += 1
+
+    def measure(self, seconds):
+        """Returns messages a second and the time that 99 of 100 messages stay below."""
+        times = []
+        begun = due = time.perf_counter()
+        while due < begun + seconds:
+            time.sleep(max(0, due - time.perf_counter()))
+            asked = time.perf_counter()
+            self.send()
+            times.append(time.perf_counter() - asked)
+            due += self.PAUSE
+        elapsed = time.perf_counter() - begun
+        return len(times) / elapsed, statistics.quantiles(times, n=100)[98]
+
+
+def compare(polite, hostile, rounds, seconds):
+    """The polite client's throughput and latency beside the hostile one as multiples of what they are
+    alone, and the latency in seconds: medians of rounds that take turns."""
+    throughputs, latencies, seconds_beside = [], [], []
+    for _ in range(rounds):
+        alone = polite.measure(seconds)
+        hostile.attack()
+        beside = polite.measure(seconds)
+        hostile.rest()
+        throughputs.append(beside[0] / alone[0])
+        latencies.append(beside[1] / alone[1])
+        seconds_beside.append(beside[1])
+    return tuple(map(statistics.median, (throughputs, latencies, seconds_beside)))
+
+
+def resident(process, peak=False):
+    """Memory in MiB."""
+    key = "VmHWM:" if peak else "VmRSS:"
+    for line in pathlib.Path(f"/proc/{process.pid}/status").read_text().splitlines():
+        if line.startswith(key):
+            return int(line.split()[1]) / 1024
+    raise AssertionError(key)
+
+
+def processor_seconds(process):
+    fields = pathlib.Path(f"/proc/{process.pid}/stat").read_text().rpartition(") ")[2].split()
+    return (int(fields[11]) + int(fields[12])) / os.sysconf("SC_CLK_TCK")
+
+
+def threads(process):
+    return len(os.listdir(f"/proc/{process.pid}/task"))
+
+
+def raw(service):
+    """A connected socket without a client around it."""
+    connected = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
+    try:
+        connected.connect(str(service.socket))  # waits while too many others do
+    except OSError:
+        connected.close()
+        raise
+    connected.settimeout(PATIENCE)
+    return connected
+
+
+def notification(method, *arguments):
+    return msgpack.packb([2, method, list(arguments)])
+
+
+def request(number, method, *arguments):
+    return msgpack.packb([0, number, method, list(arguments)])
+
+
+def ask(connected, method, *arguments):
+    """Calls on a raw socket and returns the result."""
+    connected.sendall(request(1, method, *arguments))
+    unpacker = msgpack.Unpacker(raw=False)
+    while True:
+        unpacker.feed(connected.recv(65536))
+        for _, _, error, result in unpacker:
+            assert error is None
+            return result
+
+
+# What hostile clients do. Each does it once, or for as long as a blink.
+
+
+def send_bombs(service):
+    """Lengths, depths and maps that promise more than they hold."""
+    head = b"\x94\x00\x01\xd9\x37" + SEND.encode() + b"\x94"
+    for bomb in (b"\xdd\xff\xff\xff\xff", b"\x94\x00\x01\xdb\x7f\xff\xff\xff", b"\x94\x00\x01\xa1x" + b"\x91" * 4096,
+                 head + b"\xdf\xff\xff\xff\xff", head + b"\x81\xa1k" * 1000, head + b"\xde\xff\xff" + b"\xc0" * 65536,
+                 head + b"\xdd\x00\x0f\xff\x00" + b"\xc0" * (1 << 20), b"\xc1"):
+        with contextlib.closing(raw(service)) as attacker, contextlib.suppress(ConnectionError):
+            attacker.sendall(bomb)
+            attacker.shutdown(socket.SHUT_WR)
+            while attacker.recv(65536):
+                pass
+
+
+def send_tiny_keys(service, payload={f"{i:x}": 0 for i in range(16384)}):
+    with contextlib.closing(Client(service)) as attacker:
+        attacker.call("createReportingSession:reply:", 666)
+        for _ in range(4):
+            attacker.message(payload, [666])
+
+
+def trickle(service, message=request(1, SEND, {"a": "x" * 1000}, 3, 1, None)):
+    """A hundred clients that send one byte at a time."""
+    with contextlib.ExitStack() as closing:
+        attackers = [closing.enter_context(raw(service)) for _ in range(100)]
+        for at in range(50):
+            for attacker in attackers:
+                attacker.send(message[at:at + 1])
+            time.sleep(0.005)
+
+
+def write_at_full_speed(service, burst=notification(SEND, {"noise": "x" * 200, "n": 1}, 3, 1, [666]) * 1000):
+    with contextlib.closing(raw(service)) as attacker:
+        attacker.sendall(request(1, "createReportingSession:reply:", 666))
+        attacker.sendall(request(2, "startReportingSessionForID:reply:", 666))
+        until = time.monotonic() + 0.2
+        while time.monotonic() < until:
+            attacker.sendall(burst)
+
+
+def never_read(service, question=request(1, "x" * 60)):
+    with contextlib.closing(raw(service)) as attacker:
+        attacker.setblocking(False)
+        until = time.monotonic() + 0.2
+        while time.monotonic() < until:
+            try:
+                attacker.sendall(question * 1000)
+            except BlockingIOError:
+                time.sleep(0.001)
+
+
+def meddle(service):
+    """With the sessions of others, with none, and with the ends of the range."""
+    with contextlib.closing(Client(service)) as attacker:
+        for reporter in (1, 0, -1, 2**63 - 1, -2**63):
+            for call in (("startReportingSessionForID:reply:", reporter),
+                         ("setServiceType:reportingSession:reply:", 11, reporter),
+                         ("setConfiguration:forReporterID:reply:", {"HostApplicationDisplayID": "x"}, reporter),
+                         ("stopReportingSessionForID:reply:", reporter),
+                         ("destroyReportingSession:reply:", reporter)):
+                attacker.write(notification(*call))
+            attacker.call("reporterID:valid:", reporter)
+            attacker.call("getServiceNameForReporterID:reply:", reporter)
+
+
+def come_and_go(service):
+    with contextlib.ExitStack() as closing:
+        for _ in range(500):
+            closing.enter_context(raw(service))
+
+
+def broadcast(service):
+    """To a thousand sessions of its own, of which every line of the log tells."""
+    with contextlib.closing(Client(service)) as attacker:
+        attacker.write(b"".join(notification("createReportingSession:reply:", n) for n in range(10_000, 11_000)))
+        attacker.call("reporterID:valid:", 1)
+        for _ in range(10):
+            attacker.write(notification(SEND, {"n": 1}, 3, 1, None) * 50)
+            attacker.call("reporterID:valid:", 1)

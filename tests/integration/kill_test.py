@@ -1,0 +1,111 @@
+"""The service is killed, or told to end, at random moments under load: what it has answered for is there."""
+
+import os
+import random
+import signal
+import statistics
+import threading
+import time
+import unittest
+
+from harness import Client, ServiceTest
+
+NIGHTLY = bool(os.environ.get("QUARVEL_NIGHTLY"))
+SEND = "sendMessage:withCategory:andType:forReportingIDs:reply:"
+# How long after its answer a message is safe from a kill. The promise is 10 ms of a machine that has
+# time for the service; the rest is for one that has not.
+SAFE_AFTER = 0.010 + (0.040 if NIGHTLY else 1)
+RESTART = 1 if NIGHTLY else 5
+
+
+class Writer(threading.Thread):
+    """Writes to a session of its own, `ahead` messages before their answers, until the service is gone."""
+
+    def __init__(self, service, round_number, reporter, ahead):
+        super().__init__(daemon=True)
+        self.key = f'{{"round":{round_number},"writer":{reporter},"n":'
+        self.answered = []  # when, by message
+        self._base = {"round": round_number, "writer": reporter}
+        self._reporter, self._ahead = reporter, ahead
+        self._client = Client(service)
+        self._client.start_session(reporter)
+        self.start()
+
+    def run(self):
+        numbers = {}
+        sent = 0
+        try:
+            while True:
+                while sent - len(self.answered) < self._ahead:
+                    numbers[self._client.send(SEND, {**self._base, "n": sent}, 3, 1, [self._reporter])] = sent
+                    sent += 1
+                answer = self._client.receive()
+                if answer is None:
+                    break
+                if numbers.pop(answer, None) is not None:
+                    self.answered.append(time.monotonic())
+        except OSError:
+            pass
+        self._client.close()
+
+
+class Kills(ServiceTest):
+    def load(self, service, round_number):
+        """Some writers who wait for each answer, or who do not."""
+        return [Writer(service, round_number, reporter, ahead)
+                for reporter, ahead in enumerate(random.choice(([1, 1, 1], [64], [1, 64], [32, 32, 32])), 1)]
+
+    def stored(self, service, writer):
+        """How many of the writer's messages are there: those that it sent first, in their order."""
+        rows = service.rows("SELECT payload FROM message WHERE payload LIKE ? ORDER BY id", writer.key + "%")
+        numbers = [int(row["payload"][len(writer.key):-1]) for row in rows]
+        self.assertEqual(numbers, list(range(len(numbers))), "none is missing between two that are there")
+        return len(numbers)
+
+    def test_what_was_answered_survives_a_kill(self):
+        service = self.service()
+        kills, answered, lost, ages, restarts = (1000 if NIGHTLY else 100), 0, 0, [], []
+        for number in range(kills):
+            writers = self.load(service, number)
+            time.sleep(random.uniform(0.02, 0.25))
+            killed = time.monotonic()
+            service.end(signal.SIGKILL)
+            self.assertTrue(service.socket.exists(), "a killed service leaves its socket")
+            for writer in writers:
+                writer.join()
+            began = time.monotonic()
+            service.start()
+            restarts.append(time.monotonic() - began)
+            missing = [writer.answered[self.stored(service, writer):] for writer in writers]
+            answered += sum(len(writer.answered) for writer in writers)
+            lost += sum(map(len, missing))
+            ages.append(max([0] + [killed - answers[0] for answers in missing if answers]))
+            self.assertLess(ages[-1], SAFE_AFTER, "answered, and lost")
+        print(f"harness: kill: {kills} kills, {answered} messages answered, {lost} of them lost, answered at most "
+              f"{max(ages) * 1000:.1f} ms before, {statistics.median(ages) * 1000:.1f} ms in half of the kills; back after {statistics.median(restarts) * 1000:.0f} ms, "
+              f"at most {max(restarts) * 1000:.0f} ms", flush=True)
+        self.assertGreater(answered, 10 * kills)
+        self.assertLess(max(restarts), RESTART)
+
+    def test_what_was_answered_survives_an_end_in_order(self):
+        service = self.service()
+        ends, answered, longest = (200 if NIGHTLY else 20), 0, 0
+        for number in range(ends):
+            writers = self.load(service, number)
+            time.sleep(random.uniform(0.02, 0.25))
+            told = time.monotonic()
+            self.assertEqual(service.end(), 0)
+            longest = max(longest, time.monotonic() - told)
+            for writer in writers:
+                writer.join()
+                self.assertGreaterEqual(self.stored(service, writer), len(writer.answered))
+                answered += len(writer.answered)
+            service.start()
+        print(f"harness: end: {ends} ends in order, {answered} messages answered, none lost, "
+              f"{longest:.2f} s at most", flush=True)
+        self.assertGreater(answered, 10 * ends)
+        self.assertLess(longest, 5 if NIGHTLY else 20)
+
+
+if __name__ == "__main__":
+    unittest.main(verbosity=2)

@@ -1,0 +1,105 @@
+"""What the installed service tells of itself, and what becomes of what it was sent."""
+
+import contextlib
+import json
+import os
+import shutil
+import subprocess
+import time
+import unittest
+
+from harness import ServiceTest, eventually
+
+CAN_MOUNT = shutil.which("unshare") and subprocess.run(
+    ["unshare", "-m", "mount", "-t", "tmpfs", "tmpfs", "/mnt"], capture_output=True, check=False).returncode == 0
+# Runs the service with a file system of its own for its store, which others see through /proc.
+ON_SMALL_DISK = ["unshare", "-m", "sh", "-c",
+                 'mount -t tmpfs -o size=2m tmpfs "$STATE_DIRECTORY" && exec "$0"']
+
+
+class Status(ServiceTest):
+    def status(self, service):
+        return json.loads(service.ctl("status", "--json").stdout)
+
+    def settled(self, service, accepted):
+        """The status once so many rows have come and none waits; the counters always add up. The
+        client that looks whether the service is up leaves one row, its uptime."""
+        def nothing_waits():
+            status = self.status(service)
+            counters = status["counters"]
+            self.assertEqual(counters["accepted"], counters["stored"] + counters["waiting"]
+                             + sum(counters["dropped"].values()), counters)
+            settled = counters["accepted"] == accepted + 1 and counters["waiting"] == 0
+            return status if settled else None
+        return eventually(nothing_waits, "everything is stored or dropped")
+
+    def test_every_message_is_accounted_for_also_after_a_restart(self):
+        service = self.service()
+        client = self.client(service)
+        client.start_session(1)
+        client.start_session(2, 11)
+        for number in range(20):
+            client.message({"n": number}, [1, 2, 3, 0])
+        # Each message once for each ID, and an analytics event for each session that there is.
+        status = self.settled(service, 20 * (4 + 2))
+        self.assertTrue(status["healthy"], status)
+        self.assertEqual((status["clients"], status["sessions"], status["started_sessions"]), (1, 2, 2))
+        self.assertEqual({reason: rows for reason, rows in status["counters"]["dropped"].items() if rows},
+                         {"test": 20, "no_such_session": 40})
+        self.assertEqual(status["store"]["rows"], service.count("message") + service.count("analytics_event"))
+        self.assertEqual(status["store"]["path"], str(service.directory / "state/telemetry.db"))
+        client.close()
+        service.end()
+        service.start()
+        # And a summary of each session, one of which is a test; the uptimes of two more clients.
+        again = self.settled(service, 20 * (4 + 2) + 2 + 2)
+        self.assertEqual(again["counters"]["dropped"]["test"], 21)
+
+    def test_people_get_a_verdict_and_an_exit_status(self):
+        service = self.service()
+        told = service.ctl("status")
+        self.assertEqual((told.returncode, told.stderr), (0, ""))
+        self.assertEqual(told.stdout.splitlines()[0], "healthy")
+        self.assertRegex(told.stdout, r"\d accepted = \d stored \+ \d waiting \+ 0 dropped")
+        service.end()
+        told = service.ctl("status")
+        self.assertEqual((told.returncode, told.stdout), (1, ""))
+        self.assertIn("The service does not answer", told.stderr)
+
+    def test_nothing_is_written_unasked_and_the_files_are_nobody_elses(self):
+        service = self.service()
+        self.client(service).message({"n": 1}, None)
+        self.assertFalse((service.directory / "run/status.json").exists())
+        self.status(service)
+        for name, mode in (("run/status.json", 0o640), ("run/notify", 0o750), ("state/telemetry.db", 0o640),
+                           ("state/telemetry.db-wal", 0o640), ("state/telemetry.db-shm", 0o640)):
+            self.assertEqual((service.directory / name).stat().st_mode & 0o777, mode, name)
+
+    @unittest.skipUnless(CAN_MOUNT, "needs a file system of its own")
+    def test_a_full_disk_holds_rows_and_senders_and_shows_in_the_status(self):
+        service = self.service(wrapper=ON_SMALL_DISK)
+        state = f"/proc/{service.process.pid}/root/{service.directory}/state"
+        with open(f"{state}/ballast", "wb") as ballast, contextlib.suppress(OSError):
+            for _ in range(4096):
+                os.write(ballast.fileno(), bytes(4096))
+        client = self.client(service)
+        for number in range(400):
+            client.send("sendMessage:withCategory:andType:forReportingIDs:reply:",
+                        {"n": number, "text": "x" * 3000}, 3, 1, None)
+        status = eventually(lambda: (lambda s: s if s["store"]["error"] else None)(self.status(service)),
+                            "the status tells of the full disk")
+        self.assertFalse(status["healthy"])
+        self.assertIn("full", status["problems"][0])
+        # What was moved out of the log may make room for a few rows once more.
+        eventually(lambda: (lambda told: (told.returncode, told.stdout.splitlines()[0]))(
+            service.ctl("status")) == (1, "not healthy"), "the tool tells of it too")
+        time.sleep(1)  # it tries again and again
+        self.assertEqual(service.log().count("fails:"), 1)
+        os.unlink(f"{state}/ballast")
+        status = self.settled(service, 400)
+        self.assertEqual(status["counters"]["stored"], 401)
+        self.assertTrue(status["healthy"])
+
+
+if __name__ == "__main__":
+    unittest.main()

@@ -1,0 +1,175 @@
+#include <fmt/format.h>
+#include <gmock/gmock.h>
+
+#include <fstream>
+#include <future>
+
+#include "platform/linux/store/Sqlite.h"
+#include "tests/linux/FileCalls.h"
+#include "tests/linux/LogRecorder.h"
+#include "tests/linux/StoreFixture.h"
+
+namespace quarvel::testing {
+namespace {
+
+using namespace std::chrono_literals;
+using Purpose = FileCalls::Purpose;
+
+/// Lets each call that a store makes for its files fail, one after the other, once or from then on.
+class FaultTest : public StoreFixture {
+ protected:
+  FaultTest() : StoreFixture(true) {}
+
+  /// What is there when the store is opened: files by name.
+  using Files = std::vector<std::pair<std::string, std::string>>;
+
+  static TelemetryStore::Options options() {
+    return {.sync = 0ms, .maximumBytes = 100'000, .logPages = 6, .firstBackOff = 1ms};
+  }
+  void begin(const Files& found) {
+    std::filesystem::remove_all(directory_);
+    std::filesystem::create_directory(directory_);
+    for (const auto& [name, content] : found) {
+      std::ofstream(directory_ / name, std::ios::binary) << content;
+    }
+    LogRecorder::take();
+    sent_ = 0;
+  }
+  void send(TelemetryStore& store, int rows) {
+    for (int i = 0; i < rows; ++i) {
+      const Payload payload(Dictionary{{"n", ++sent_}, {"text", std::string(1500, 'x')}});
+      ASSERT_TRUE(store.addMessage({std::nullopt, 7, "client", "service", 1, 2, payload}));
+    }
+  }
+
+  /// A store that an end of the process has left behind: with a write-ahead log.
+  Files leftBehind() {
+    begin({});
+    auto store = open(options());
+    send(*store, 20);
+    Await([&] { return store->counters().waiting == 0; });
+    Files files;
+    for (const char* name : {"telemetry.db", "telemetry.db-wal"}) {
+      std::ifstream file(directory_ / name, std::ios::binary);
+      files.emplace_back(name, std::string(std::istreambuf_iterator<char>(file), {}));
+    }
+    return files;
+  }
+
+  /// A life of a store with one fault. Returns whether the fault struck.
+  bool live(const Files& found, const FileCalls::Fault& fault) {
+    begin(found);
+    FileCalls& files = FileCalls::watch(directory_);
+    files.inject(fault);
+    TelemetryStore::Options own = options();
+    own.path = path_;
+    auto opened = TelemetryStore::open(own);
+    if (!opened) {
+      EXPECT_THAT(opened.error().description(), ::testing::StartsWith("quarvel.store"));
+      files.lift();
+      opened = TelemetryStore::open(own);
+      EXPECT_TRUE(opened) << opened.error().description();
+      if (!opened) return true;
+    }
+    TelemetryStore& store = *opened.value();
+    const Payload info;
+    const auto session = store.addAgentSession({1, 19, 2.0, true, "t", "c", "s", info});
+    send(store, 10);
+    std::promise<std::optional<Error>> flushed;
+    EXPECT_TRUE(store.flush(session.value(), [&](const auto& error) { flushed.set_value(error); }));
+    Await([&] {
+      return store.counters().waiting == 0 || files.failedCalls() > 4 ||
+             (!fault.forever && files.failedCalls() > 0);
+    });
+    files.lift();
+    if (!resumes(store)) return true;
+    EXPECT_EQ(flushed.get_future().get(), std::nullopt);
+    // Once more, so that a fault that has not struck yet may strike on the way out.
+    if (files.failedCalls() == 0) files.inject(fault);
+    send(store, 2);
+    store.close();
+    const bool struck = files.failedCalls() > 0;
+    files.lift();
+    FileCalls::watch({});
+    inspect(store.counters(), found.empty() ? 0 : 20);
+    return struck;
+  }
+
+  /// Whether the store takes rows again, within a time that means never.
+  bool resumes(const TelemetryStore& store) {
+    const auto never = std::chrono::steady_clock::now() + 30s;
+    Await(
+        [&] { return store.counters().waiting == 0 || std::chrono::steady_clock::now() > never; });
+    EXPECT_EQ(store.counters().waiting, 0U) << store.state().problem.value_or("no problem");
+    return store.counters().waiting == 0;
+  }
+
+  void inspect(const StoreCounters& counters, std::uint64_t before) {
+    const std::uint64_t lost = counters.dropped[StoreDrop::storeClosed];
+    EXPECT_EQ(counters.accepted, before + 12);
+    EXPECT_EQ(counters.accepted, counters.stored + counters.dropped.sum());
+    EXPECT_LE(lost, 2U) << "only what came when the store was closed";
+    EXPECT_EQ(counters.accepted, counters.stored + lost + counters.dropped[StoreDrop::retention]);
+    SqliteConnection connection;
+    ASSERT_TRUE(connection.open(path_)) << connection.message();
+    EXPECT_EQ(connection.text("SELECT group_concat(integrity_check) FROM pragma_integrity_check"),
+              "ok");
+    // A commit whose sync fails is not counted, but may well be there.
+    const auto accountedFor = static_cast<std::uint64_t>(
+        connection
+            .integer("SELECT (SELECT count(*) FROM message) +"
+                     " ifnull((SELECT value FROM meta WHERE key = 'dropped.retention'), 0)")
+            .value_or(0));
+    EXPECT_GE(accountedFor, counters.accepted - lost);
+    EXPECT_LE(accountedFor, counters.accepted);
+    EXPECT_GE(connection.integer("SELECT max(payload ->> 'n') FROM message"), 12 - lost);
+    EXPECT_EQ(connection.integer("SELECT count(*) FROM agent_session"
+                                 " WHERE flushed_at IS NOT NULL"),
+              1);
+    for (const auto& entry : std::filesystem::directory_iterator(directory_)) {
+      EXPECT_THAT(entry.path().string(), ::testing::Not(::testing::HasSubstr("corrupt")));
+    }
+  }
+
+  std::int64_t sent_ = 0;
+};
+
+TEST_F(FaultTest, AtNoCallIsARowLostOrTheServiceStuck) {
+  struct Mode {
+    const char* name;
+    FileCalls::Fault fault;
+  };
+  const Mode modes[] = {
+      {"EIO once", {.error = EIO}},
+      {"EIO from then on", {.error = EIO, .forever = true}},
+      {"no room once", {.error = ENOSPC, .only = Purpose::write}},
+      {"no room from then on", {.error = ENOSPC, .forever = true, .only = Purpose::write}},
+      {"interrupted", {.error = EINTR}},
+      {"a short write", {.error = 0, .only = Purpose::write}},
+      {"no descriptor once", {.error = EMFILE, .only = Purpose::open}},
+      {"no descriptor from then on", {.error = EMFILE, .forever = true, .only = Purpose::open}},
+  };
+  const std::pair<const char*, Files> beginnings[] = {{"a new store", {}},
+                                                      {"a store left behind", leftBehind()}};
+  std::size_t points = 0;
+  for (const auto& [beginning, found] : beginnings) {
+    for (const Mode& mode : modes) {
+      std::size_t at = 0;
+      for (FileCalls::Fault fault = mode.fault;; fault.at = ++at) {
+        SCOPED_TRACE(fmt::format("{}, {}, call {}", beginning, mode.name, at));
+        if (!live(found, fault)) break;
+        if (HasFailure()) {
+          for (const auto& line : LogRecorder::take()) fmt::print("{}\n", line.message);
+          return;
+        }
+      }
+      fmt::print("faults, {}, {}: {} calls\n", beginning, mode.name, at);
+      points += at;
+    }
+  }
+  fmt::print("faults: {} points\n", points);
+  EXPECT_GT(points, 500U);
+}
+
+}  // namespace
+}  // namespace quarvel::testing

@@ -1,0 +1,164 @@
+"""A machine to install packages on: this one's files under an overlay that is thrown away, in
+namespaces of its own, with systemd as its first process."""
+
+import json
+import os
+import pathlib
+import subprocess
+import tempfile
+import textwrap
+import time
+import unittest
+
+# How long something may take that normally takes no time: machines that test are slow at times.
+PATIENCE = float(os.environ.get("QUARVEL_TEST_PATIENCE", "60"))
+
+# Runs in the namespaces, before there is a first process. /proc/sys and /sys are the real machine's,
+# so they are for reading only.
+BOOT = r"""
+set -e
+root=$1/root
+mount --make-rprivate /
+mount -t tmpfs tmpfs "$1"
+mkdir "$1"/upper "$1"/work "$root"
+mount -t overlay -o lowerdir=/,upperdir="$1/upper",workdir="$1/work" overlay "$root"
+mount -t proc proc "$root/proc"
+mount --bind "$root/proc/sys" "$root/proc/sys"
+mount -o remount,bind,ro "$root/proc/sys"
+mount -t sysfs -o ro sysfs "$root/sys"
+mount -t tmpfs tmpfs "$root/sys/fs/cgroup"
+mount -t cgroup2 cgroup2 "$root/sys/fs/cgroup"
+for directory in dev run tmp; do mount -t tmpfs -o mode=0755 tmpfs "$root/$directory"; done
+chmod 1777 "$root/tmp"
+for device in null:1:3 zero:1:5 full:1:7 random:1:8 urandom:1:9 tty:5:0; do
+  IFS=: read -r name major minor <<<"$device"
+  mknod -m 0666 "$root/dev/$name" c "$major" "$minor"
+done
+mkdir "$root"/dev/{shm,pts,mqueue,hugepages}
+mount -t devpts -o newinstance,ptmxmode=0666 devpts "$root/dev/pts"
+mount -t mqueue mqueue "$root/dev/mqueue"
+ln -s pts/ptmx "$root/dev/ptmx"
+ln -s /proc/self/fd "$root/dev/fd"
+# Nothing is started but sockets; packages may start what they bring.
+rm -rf "$root"/etc/systemd/system/* "$root"/lib/systemd/system/*.wants "$root/usr/sbin/policy-rc.d"
+wants=$root/etc/systemd/system/sockets.target.wants
+mkdir "$wants"
+for socket in dbus systemd-journald systemd-journald-dev-log; do
+  ln -s "/lib/systemd/system/$socket.socket" "$wants"
+done
+export container=quarvel
+# The loopback interface is brought up: SIOCSIFFLAGS, IFF_UP.
+/usr/bin/python3 -c 'import fcntl, socket, struct
+fcntl.ioctl(socket.socket(), 0x8914, struct.pack("16sh", b"lo", 1))'
+# Whoever is in a chroot may make no user namespaces, which sandboxes want.
+mkdir "$root/old"
+cd "$root"
+pivot_root . old
+umount -l /old
+exec /lib/systemd/systemd --unit=basic.target
+"""
+
+class Machine:
+    def __init__(self):
+        self._directory = tempfile.TemporaryDirectory(prefix="quarvel-machine-")
+        base = pathlib.Path(self._directory.name)
+        (base / "root").mkdir()
+        self._cgroup = self._make_cgroup()
+        self._boot = base / "boot"
+        self._boot.write_text(BOOT)
+        self._first = None
+        enter = f'echo $$ > {self._cgroup}/cgroup.procs && exec "$@"'
+        with open(base / "log", "wb") as log:
+            self._process = subprocess.Popen(
+                ["sh", "-c", enter, "sh",
+                 "unshare", "--mount", "--pid", "--fork", "--uts", "--ipc", "--net", "--cgroup",
+                 "--kill-child=KILL", "bash", self._boot, base / "root"],
+                stdin=subprocess.DEVNULL, stdout=log, stderr=log)
+        try:
+            self._first = self._wait_for_first_process()
+            self._wait_until_up()
+        except TimeoutError as problem:
+            log = (base / "log").read_text(errors="replace").strip()
+            self.close()
+            raise unittest.SkipTest(f"no systemd can be started here: {problem} {log}") from None
+
+    @staticmethod
+    def available():
+        """Skips the test where there can be none."""
+        if os.geteuid() != 0:
+            raise unittest.SkipTest("starting a systemd of one's own needs root")
+        if not pathlib.Path("/lib/systemd/systemd").exists():
+            raise unittest.SkipTest("there is no systemd to start")
+        if Machine._cgroup_mount() is None:
+            raise unittest.SkipTest("there is no cgroup2 file system for a systemd of one's own")
+
+    @staticmethod
+    def _cgroup_mount():
+        for line in pathlib.Path("/proc/self/mounts").read_text().splitlines():
+            _, place, kind, *_ = line.split()
+            if kind == "cgroup2" and os.access(place, os.W_OK):
+                return pathlib.Path(place)
+        return None
+
+    @staticmethod
+    def _make_cgroup():
+        own = [line[3:] for line in pathlib.Path("/proc/self/cgroup").read_text().splitlines()
+               if line.startswith("0::")][0]
+        cgroup = Machine._cgroup_mount() / own.lstrip("/") / f"quarvel-test-{os.getpid()}"
+        cgroup.mkdir()
+        return cgroup
+
+    def _wait_for_first_process(self):
+        children = pathlib.Path(f"/proc/{self._process.pid}/task/{self._process.pid}/children")
+        deadline = time.monotonic() + PATIENCE
+        while time.monotonic() < deadline and self._process.poll() is None:
+            for child in children.read_text().split():
+                with open(f"/proc/{child}/comm", encoding="utf-8") as comm:
+                    if comm.read() == "systemd\n":
+                        return int(child)
+            time.sleep(0.05)
+        raise TimeoutError("there was no first process.")
+
+    def _wait_until_up(self):
+        deadline = time.monotonic() + PATIENCE
+        while time.monotonic() < deadline and self._process.poll() is None:
+            if self.run("systemctl", "is-active", "basic.target").stdout == "active\n":
+                return
+            time.sleep(0.05)
+        raise TimeoutError("it did not come up.")
+
+    def close(self):
+        self._process.kill()
+        self._process.wait()
+        for _ in range(100):  # the last processes of the machine are just going
+            try:
+                for directory, _, _ in os.walk(self._cgroup, topdown=False):
+                    os.rmdir(directory)
+                break
+            except OSError:
+                time.sleep(0.05)
+        self._directory.cleanup()
+
+    def run(self, *command, **options):
+        """Runs a command on the machine, as root."""
+        return subprocess.run(
+            ["nsenter", "-t", str(self._first), "-m", "-p", "-u", "-i", "-n", "-C", "-r", "-w",
+             *map(str, command)],
+            capture_output=True, text=True, timeout=PATIENCE, **options)
+
+    def must(self, *command, **options):
+        """Runs a command that has to succeed; returns what it printed."""
+        done = self.run(*command, **options)
+        if done.returncode != 0:
+            raise AssertionError(f"{command}: {done.returncode}\n{done.stdout}{done.stderr}")
+        return done.stdout
+
+    def write(self, path, content):
+        self.must("sh", "-c", 'mkdir -p "$(dirname "$1")" && cat > "$1"', "sh", path, input=textwrap.dedent(content))
+
+    def property(self, unit, name):
+        return self.must("systemctl", "show", unit, "-P", name).strip()
+
+    def journal(self, unit):
+        lines = self.must("journalctl", "-u", unit, "-o", "json", "--no-pager").splitlines()
+        return [json.loads(line) for line in lines]

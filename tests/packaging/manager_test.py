@@ -1,0 +1,165 @@
+"""What a service manager asks of the installed service: its socket is passed in, it says when it is
+ready, alive and stopping, and the units do what they say."""
+
+import configparser
+import os
+import pathlib
+import shlex
+import signal
+import socket
+import subprocess
+import unittest
+
+from harness import PATIENCE, PREFIX, Client, ServiceTest, eventually
+
+UNITS = PREFIX / "lib/systemd/system"
+
+
+def unit(name):
+    """A unit's settings; of those that come several times, the last."""
+    parser = configparser.RawConfigParser(strict=False)
+    parser.optionxform = str
+    parser.read(UNITS / name)
+    return parser
+
+
+def command(setting):
+    """A command of the service's unit, as it is here instead of where it will be installed."""
+    program, *arguments = shlex.split(unit("quarvel.service")["Service"][setting])
+    return [PREFIX / pathlib.Path(program).relative_to("/usr"), *arguments]
+
+
+class Manager(ServiceTest):
+    def watched(self, service, **variables):
+        """Has the service speak to a service manager; returns what that one hears from."""
+        path = service.directory / "notify.sock"
+        heard = socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM)
+        self.addCleanup(heard.close)
+        heard.bind(str(path))
+        heard.settimeout(PATIENCE)
+        service.environment.update(NOTIFY_SOCKET=str(path), **variables)
+        return heard
+
+    def test_it_says_when_it_is_ready_and_when_it_stops_and_nothing_else(self):
+        service = self.prepared()
+        heard = self.watched(service)
+        service.start()
+        self.assertEqual(heard.recv(100), b"READY=1")
+        self.assertEqual(service.end(), 0)
+        self.assertEqual(heard.recv(100), b"STOPPING=1")
+        heard.setblocking(False)
+        with self.assertRaises(BlockingIOError):
+            heard.recv(100)
+
+    def test_it_is_not_ready_when_it_cannot_start(self):
+        service = self.prepared('[log]\nlevel = "loud"\n')
+        heard = self.watched(service)
+        subprocess.run([PREFIX / "sbin/quarveld"], env=service.environment, stderr=subprocess.DEVNULL,
+                       timeout=PATIENCE)
+        heard.setblocking(False)
+        with self.assertRaises(BlockingIOError):
+            heard.recv(100)
+
+    def test_it_pings_a_watchdog_until_the_end(self):
+        service = self.prepared()
+        heard = self.watched(service, WATCHDOG_USEC="200000")
+        service.start()
+        self.addCleanup(service.finish)
+        said = [heard.recv(100) for _ in range(5)]
+        self.assertEqual(said, [b"READY=1"] + [b"WATCHDOG=1"] * 4)
+        service.process.send_signal(signal.SIGSTOP)
+        heard.settimeout(1)
+        with self.assertRaises(TimeoutError):  # what was on its way comes, and then no more
+            for _ in range(20):
+                heard.recv(100)
+        heard.settimeout(PATIENCE)
+        service.process.send_signal(signal.SIGCONT)
+        self.assertEqual(heard.recv(100), b"WATCHDOG=1")
+
+    def test_a_socket_that_is_passed_in_outlives_the_service(self):
+        service = self.prepared()
+        arguments = ["systemd-socket-activate", "-l", service.socket, "--fdname=reporting"]
+        for name in ("RUNTIME_DIRECTORY", "STATE_DIRECTORY", "CONFIGURATION_DIRECTORY",
+                     "QUARVEL_DIAGNOSTICS_PREFIX", "ASAN_OPTIONS"):
+            if name in service.environment:
+                arguments.append(f"--setenv={name}={service.environment[name]}")
+        with open(service.log_path, "wb") as log:
+            service.process = subprocess.Popen([*arguments, *command("ExecStart")], stderr=log)
+        self.addCleanup(service.finish)
+        eventually(service.socket.exists, "the socket")
+        self.assertNotIn("quarveld", service.log(), "nobody has come yet")
+        client = self.client(service)
+        client.start_session(5)
+        client.message({"first": True}, [5])
+        self.assertTrue((service.directory / "run/notify").is_dir(), "notifications can be posted")
+        self.assertEqual(service.end(), 0)
+        self.assertEqual(service.count("message WHERE session_id = 5"), 2, "and the summary")
+        self.assertTrue(service.socket.exists(), "it belongs to whoever passed it in")
+
+    def test_reloading_makes_it_read_its_preferences(self):
+        service = self.service()
+        client = self.client(service)
+        send = ("sendMessage:withCategory:andType:forReportingIDs:reply:", {}, 3, 1, None)
+
+        def refused():
+            identifier = client.send(*send)
+            with_error = False
+            try:
+                client.wait(identifier)
+            except Exception as error:
+                with_error = error.domain == "tarnwick.audio.reporting"
+            return with_error
+
+        self.assertFalse(refused())
+        service.prefer(disable_reporting=True)
+        self.assertFalse(refused(), "it has not been told yet")
+        subprocess.run(command("ExecReload"), env=service.environment, check=True, timeout=PATIENCE,
+                       stdout=subprocess.DEVNULL)
+        eventually(refused, "reporting is off")
+
+
+class Units(unittest.TestCase):
+    # From "systemd-analyze security": 10 is nothing between the service and the machine.
+    MOST_EXPOSURE = 1.5
+
+    def analyze(self, *arguments):
+        done = subprocess.run(["systemd-analyze", *map(str, arguments)], capture_output=True, text=True,
+                              timeout=PATIENCE, env=dict(os.environ, SYSTEMD_LOG_LEVEL="warning"))
+        self.assertEqual(done.returncode, 0, done.stdout + done.stderr)
+        return done.stdout + done.stderr
+
+    def test_systemd_understands_every_line(self):
+        # The programs are looked for where they will be, so the units are read as they are here.
+        text = (UNITS / "quarvel.service").read_text()
+        directory = pathlib.Path(self.enterContext(temporary_directory()))
+        (directory / "quarvel.service").write_text(text.replace("/usr/", f"{PREFIX}/"))
+        (directory / "quarvel.socket").write_text((UNITS / "quarvel.socket").read_text())
+        found = self.analyze("verify", "--recursive-errors=one", "--man=no",
+                             directory / "quarvel.service", directory / "quarvel.socket")
+        self.assertEqual(found, "")
+
+    def test_the_service_is_locked_up(self):
+        self.analyze("security", "--offline=yes", f"--threshold={round(self.MOST_EXPOSURE * 10)}",
+                     "--no-pager", UNITS / "quarvel.service")
+
+    def test_user_and_directories_are_made_before_they_are_used(self):
+        service = unit("quarvel.service")["Service"]
+        sockets = unit("quarvel.socket")["Socket"]
+        sysusers = (PREFIX / "lib/sysusers.d/quarvel.conf").read_text()
+        tmpfiles = (PREFIX / "lib/tmpfiles.d/quarvel.conf").read_text()
+        self.assertIn(f"u {service['User']} -", sysusers)
+        self.assertEqual(service["User"], sockets["SocketUser"])
+        directory = f"/run/{service['RuntimeDirectory']}"
+        self.assertEqual(sockets["ListenStream"], f"{directory}/reporting.sock")
+        # Of another's, systemd would give all that is in it to the service's group, the socket too.
+        self.assertIn(f"d {directory} {service['RuntimeDirectoryMode']} {service['User']} {service['Group']}",
+                      tmpfiles)
+
+
+def temporary_directory():
+    import tempfile
+    return tempfile.TemporaryDirectory(prefix="quarvel-units-")
+
+
+if __name__ == "__main__":
+    unittest.main(verbosity=2)

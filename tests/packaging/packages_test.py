@@ -1,0 +1,84 @@
+"""The packages: what Debian's own checks say of them, and what somebody has who installed them."""
+
+import os
+import pathlib
+import re
+import subprocess
+import tempfile
+import unittest
+
+SOURCE = pathlib.Path(os.environ["QUARVEL_SOURCE"])
+BUILD = pathlib.Path(os.environ["QUARVEL_BUILD"])
+PACKAGES = sorted((BUILD / "packages").glob("*.deb"))
+PATIENCE = 600
+
+
+def run(*command, **options):
+    done = subprocess.run(list(map(str, command)), capture_output=True, text=True, timeout=PATIENCE, **options)
+    if done.returncode != 0:
+        raise AssertionError(f"{command}: {done.returncode}\n{done.stdout}{done.stderr}")
+    return done.stdout
+
+
+class Packages(unittest.TestCase):
+    def test_lintian_finds_no_fault(self):
+        run("lintian", "--allow-root", "--fail-on", "error,warning", *PACKAGES)
+
+    def test_they_are_the_same_every_time(self):
+        with tempfile.TemporaryDirectory() as directory:
+            run("cpack", "--config", BUILD / "CPackConfig.cmake", "-B", directory)
+            for package in PACKAGES:
+                again = pathlib.Path(directory) / package.name
+                self.assertEqual(again.read_bytes(), package.read_bytes(), package.name)
+
+    def test_the_library_s_name_and_the_package_s_agree(self):
+        soname = re.search(r"SONAME.*\[(.*)\.so\.(\d+)\]",
+                           run("readelf", "-d", BUILD / "client/libquarvel.so")).groups()
+        names = [package.name.split("_")[0] for package in PACKAGES]
+        self.assertEqual(names, ["libquarvel-dev", "".join(soname), "quarvel-tools", "quarvel"])
+        self.assertIn(f"{soname[0]} {soname[1]} {''.join(soname)} ", run("dpkg-deb", "--info", PACKAGES[1], "shlibs"))
+
+
+class Installed(unittest.TestCase):
+    """Without a machine of its own: unpacked, and used from there."""
+
+    @classmethod
+    def setUpClass(cls):
+        cls.tree = pathlib.Path(cls.enterClassContext(tempfile.TemporaryDirectory(prefix="quarvel-tree-")))
+        for package in PACKAGES:
+            run("dpkg-deb", "-x", package, cls.tree)
+        [cls.libraries] = [path.parent for path in cls.tree.glob("usr/lib/**/libquarvel.so")]
+        cls.examples = cls.tree / "usr/share/doc/quarvel/examples"
+        cls.environment = dict(os.environ, QUARVEL_PREFIX=str(cls.tree / "usr"),
+                               LD_LIBRARY_PATH=str(cls.libraries), PKG_CONFIG_SYSROOT_DIR=str(cls.tree),
+                               PKG_CONFIG_PATH=str(cls.libraries / "pkgconfig"))
+
+    def test_the_examples_are_built_by_the_cmake_package_and_speak_to_the_service(self):
+        run("/usr/bin/python3", SOURCE / "tests/client/examples_test.py", self.examples, env=self.environment)
+
+    def test_pkg_config_builds_them_too(self):
+        flags = run("pkg-config", "--cflags", "--libs", "quarvel", env=self.environment).split()
+        strict = ["-Wall", "-Wextra", "-Wpedantic", "-Werror"]
+        os.environ["QUARVEL_PREFIX"] = self.environment["QUARVEL_PREFIX"]
+        from harness import Service
+        for compiler, source in ((["cc", "-std=gnu99"], "client.c"), (["c++", "-std=c++20"], "client.cc")):
+            program = self.tree / source.replace(".", "-")
+            run(*compiler, *strict, self.examples / source, "-o", program, *flags)
+            service = Service()
+            self.addCleanup(service.tidy)
+            service.start()
+            self.addCleanup(service.finish)
+            run(program, service.socket, env=dict(service.environment, **self.environment))
+            service.wait_for_rows(1, "agent_session WHERE flushed_at IS NOT NULL")
+
+    def test_each_header_needs_nothing_but_the_standard_library(self):
+        headers = self.tree / "usr/include"
+        for header in sorted(headers.rglob("*.h*")):
+            for language, wanted in (("c", header.name == "quarvel.h"), ("c++", True)):
+                if wanted:
+                    run("cc", "-fsyntax-only", f"-x{language}", f"-std={'c99' if language == 'c' else 'c++20'}",
+                        "-Wall", "-Wextra", "-Wpedantic", "-Werror", "-I", headers, "-include", header, "/dev/null")
+
+
+if __name__ == "__main__":
+    unittest.main(verbosity=2)

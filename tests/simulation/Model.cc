@@ -1,0 +1,256 @@
+#include "tests/simulation/Model.h"
+
+#include <fmt/format.h>
+
+#include <algorithm>
+
+#include "base/Json.h"
+
+namespace quarvel {
+
+namespace {
+
+constexpr std::uint16_t kTest = 11;
+
+// The words for the codes that the simulated clients use.
+std::string CategoryName(std::uint32_t category) {
+  static const std::map<std::uint32_t, std::string> kNames = {{3, "Playback"},
+                                                              {0x2000'0003, "HAL_Playback"},
+                                                              {0x4000'0007, "Routing_RouteChange"},
+                                                              {0x1000'1234, "DSP_Undefined"}};
+  return kNames.at(category);
+}
+
+std::string TypeName(std::uint16_t type) {
+  return type == 1 ? "Start" : type == 2 ? "Stop" : "Undefined";
+}
+
+std::string ServiceName(std::uint16_t type) {
+  static const std::map<std::uint16_t, std::string> kNames = {
+      {2, "telephony"},     {3, "haptics"},  {4, "alarms"},     {5, "standalone"},
+      {7, "longformaudio"}, {kTest, "test"}, {65535, "unknown"}};
+  return kNames.at(type);
+}
+
+Dictionary WithoutBlanksInKeys(const Dictionary& payload) {
+  Dictionary result;
+  for (const auto& [key, value] : payload) {
+    if (const std::string* text = key.string()) {
+      std::string underscored = *text;
+      std::ranges::replace(underscored, ' ', '_');
+      result.set(underscored, value);
+    } else {
+      result.set(key, value);
+    }
+  }
+  return result;
+}
+
+Model::Message AgentMessage(std::uint32_t category, std::uint16_t type, Dictionary payload) {
+  return {static_cast<std::uint16_t>(category % 0x1'0000), type, std::move(payload)};
+}
+
+}  // namespace
+
+void Model::arrived(const Arrival& arrival) {
+  if (arrival.kind == Arrival::Kind::notification) return readPreferences();
+  if (arrival.kind == Arrival::Kind::connection) {
+    clients_.push_back({arrival.client, {}});
+    return;
+  }
+  const auto client = std::ranges::find(clients_, arrival.client, &Client::number);
+  if (arrival.kind == Arrival::Kind::call) return carryOut(*client, *arrival.call);
+  for (const auto& [reporterID, session] : client->sessions) {
+    if (session->started) stop(*session);
+  }
+  clients_.erase(client);
+  ++ended;
+}
+
+void Model::readPreferences() {
+  const Dictionary read = preferences.front();
+  preferences.pop_front();
+  Dictionary defaults;
+  if (const Value* name = read.find("device_name")) defaults.set("device_name", *name);
+  const Value* disabled = read.find("disable_reporting");
+  defaults.set("disable_reporting", disabled == nullptr ? Value(0) : *disabled);
+  reporting_ = disabled == nullptr || *disabled != Value(true);
+  for (Client& client : clients_) {
+    for (const auto& [reporterID, session] : client.sessions) session->userInfo.merge(defaults);
+  }
+}
+
+Model::Session* Model::own(Client& client, std::int64_t reporterID) {
+  const auto found = client.sessions.find(reporterID);
+  return found == client.sessions.end() ? nullptr : found->second;
+}
+
+Model::Session* Model::any(Client& client, std::int64_t reporterID) {
+  if (Session* session = own(client, reporterID)) return session;
+  if (reporterID == 0 || !reporting_) return nullptr;
+  for (Client& other : clients_) {
+    if (Session* session = own(other, reporterID)) return session;
+  }
+  return nullptr;
+}
+
+void Model::carryOut(Client& client, const RecordedCall& call) {
+  std::vector<Value>& answer = answers[&call];
+  const std::string operation = call.method.substr(0, call.method.find(':'));
+  const auto number = [&](std::size_t i) { return *call.arguments.at(i).integer(); };
+  if (operation == "createReportingSession") {
+    Session& session = sessions.emplace_back();
+    session.reporterID = number(0);
+    client.sessions[session.reporterID] = &session;
+    answer.emplace_back(true);
+  } else if (operation == "setServiceType") {
+    Session* session = number(1) == 0 ? nullptr : own(client, number(1));
+    if (session != nullptr) setServiceType(*session, static_cast<std::uint16_t>(number(0)));
+    answer.emplace_back(true);
+  } else if (operation == "getServiceNameForReporterID") {
+    if (number(0) == 0) answer.emplace_back(65535);
+    const Session* session = any(client, number(0));
+    answer.emplace_back(session == nullptr ? 65535 : session->serviceType);
+  } else if (operation == "setConfiguration") {
+    Session* session = own(client, number(1));
+    if (session != nullptr) session->userInfo.merge(*call.arguments.at(0).dictionary());
+    answer.emplace_back(true);
+  } else if (operation == "startReportingSessionForID") {
+    if (number(0) == 0) {
+      answer.emplace_back(true);
+    } else if (Session* session = any(client, number(0)); session != nullptr && !session->started) {
+      start(*session, call);
+    }
+  } else if (operation == "sendMessage") {
+    send(client, call);
+  } else if (operation == "stopReportingSessionForID") {
+    if (Session* session = number(0) == 0 ? nullptr : own(client, number(0))) stop(*session);
+    answer.emplace_back(true);
+  } else if (operation == "destroyReportingSession") {
+    if (Session* session = number(0) == 0 ? nullptr : own(client, number(0))) {
+      stop(*session);
+      client.sessions.erase(number(0));
+    }
+    answer.emplace_back(true);
+  } else if (operation == "reporterID") {
+    const Session* session = any(client, number(0));
+    answer.emplace_back(
+        Dictionary{{"reporterID", session == nullptr ? Value(0) : Value(number(0))},
+                   {"serviceType", session == nullptr ? 65535 : session->serviceType}});
+  } else {
+    List all;
+    for (const Client& each : clients_) {
+      for (const auto& [reporterID, session] : each.sessions) all.emplace_back(reporterID);
+    }
+    answer.emplace_back(std::move(all));
+  }
+}
+
+void Model::setServiceType(Session& session, std::uint16_t serviceType) {
+  if ((serviceType == kTest) != (session.serviceType == kTest) && !session.runs.empty()) {
+    session.unsettled = true;
+  }
+  session.serviceType = serviceType;
+  for (SingleMessage& single : singleMessages) {
+    if (single.session == &session) single.serviceNames.insert(ServiceName(serviceType));
+  }
+}
+
+void Model::start(Session& session, const RecordedCall& call) {
+  session.started = true;
+  session.history.clear();
+  session.runs.push_back({session.serviceType != kTest,
+                          ServiceName(session.serviceType) + "_session",
+                          session.userInfo,
+                          {}});
+  // The start before this one is answered once more.
+  for (const RecordedCall* start : session.starts) answers[start].emplace_back(true);
+  session.starts = {&call};
+}
+
+void Model::stop(Session& session) {
+  if (!session.started) return;
+  Run& run = session.runs.back();
+  if (!session.history.empty()) {
+    Dictionary summary = {{"ZQ_Session_Summary_Event", std::to_string(session.serviceType)}};
+    for (const auto& [messageID, payload] : session.history) {
+      summary.set(messageID, JsonText(payload));
+    }
+    run.messages.push_back({0xffff, 0xffff, summary});
+    const Value* application = session.userInfo.find("HostApplicationDisplayID");
+    histories.push_back({fmt::format("-quarvel-{}-{}.json",
+                                     application == nullptr ? "unknown" : *application->string(),
+                                     ServiceName(session.serviceType)),
+                         session.userInfo, session.history});
+  }
+  run.stopped = true;
+  session.started = false;
+  for (const RecordedCall* start : session.starts) answers[start].emplace_back(true);
+}
+
+void Model::send(Client& client, const RecordedCall& call) {
+  const Dictionary payload =
+      call.arguments[0].isNil() ? Dictionary() : *call.arguments[0].dictionary();
+  const auto category = static_cast<std::uint32_t>(*call.arguments[1].integer());
+  const auto type = static_cast<std::uint16_t>(*call.arguments[2].integer());
+  if (!reporting_) {
+    answers[&call].emplace_back("tarnwick.audio.reporting 1");
+    return;
+  }
+  std::vector<Session*> targets;
+  if (const List* reporterIDs = call.arguments[3].list()) {
+    for (const Value& reporterID : *reporterIDs) {
+      Session* session = *reporterID.integer() == 0 ? nullptr : any(client, *reporterID.integer());
+      if (session != nullptr) {
+        targets.push_back(session);
+      } else {
+        ++toNobody;
+      }
+    }
+  } else {
+    for (Client& each : clients_) {
+      for (const auto& [reporterID, session] : each.sessions) {
+        if (session->started) targets.push_back(session);
+      }
+    }
+    if (targets.empty()) {
+      singleMessages.push_back(
+          {AgentMessage(category, type, WithoutBlanksInKeys(payload)), {ServiceName(5)}, nullptr});
+    }
+  }
+  for (Session* session : targets) {
+    offerToSinks(*session, payload, category, type);
+    deliver(*session, payload, category, type);
+  }
+  answers[&call].emplace_back();
+}
+
+void Model::offerToSinks(const Session& session, const Dictionary& payload, std::uint32_t category,
+                         std::uint16_t type) {
+  const Value* application = session.userInfo.find("HostApplicationDisplayID");
+  const Value named = application == nullptr ? Value("Unknown") : *application;
+  Dictionary event = payload;
+  event.set("HostApplicationDisplayID", named);
+  events.emplace_back(fmt::format("tarnwick.quarvel.{}.{}", CategoryName(category), TypeName(type)),
+                      event);
+  if (const Value* engineOnTime = payload.find("EngineOnTime")) {
+    powerRecords.push_back({{"EngineOnDuration", *engineOnTime}, {"ApplicationName", named}});
+  }
+}
+
+void Model::deliver(Session& session, const Dictionary& payload, std::uint32_t category,
+                    std::uint16_t type) {
+  const std::string name = CategoryName(category) + '_' + TypeName(type);
+  const std::string messageID = fmt::format("{}_{}", name, ++session.counts[name]);
+  Dictionary enriched = WithoutBlanksInKeys(payload);
+  if (session.started) {
+    session.history.emplace_back(messageID, enriched);
+    session.runs.back().messages.push_back(AgentMessage(category, type, std::move(enriched)));
+  } else {
+    singleMessages.push_back({AgentMessage(category, type, std::move(enriched)),
+                              {ServiceName(session.serviceType)},
+                              &session});
+  }
+}
+
+}  // namespace quarvel
