@@ -69,8 +69,7 @@ class Preferences(ServiceTest):
         self.assertFalse(refused(), "nothing is read before the notification")
         service.notify()
         eventually(refused, "reporting is off")
-        preferences = service.directory / "etc/preferences/tarnwick.quarvel.toml"
-        preferences.write_text("disable_reporting = fal")
+        service.write_preferences("disable_reporting = fal")
         service.notify()
         eventually(lambda: "tarnwick.quarvel.toml" in service.log(), "a line that names the file")
         self.assertTrue(refused(), "a slip of the pen changes nothing")

@@ -114,14 +114,17 @@ class Service:
 
     def prefer(self, **values):
         """Writes the service's preferences; they take effect when it is notified."""
-        lines = [f"{key} = {json.dumps(value)}\n" for key, value in values.items()]
+        self.write_preferences("".join(f"{key} = {json.dumps(value)}\n"
+                                       for key, value in values.items()))
+
+    def write_preferences(self, text):
+        """Put in place whole: a file that is written where it lies is empty for a moment."""
         path = self.directory / "etc/preferences/tarnwick.quarvel.toml"
-        path.write_text("".join(lines))
+        path.with_suffix(".new").write_text(text)
+        path.with_suffix(".new").replace(path)
 
     def notify(self, name="tarnwick.quarvel.reporting"):
-        path = self.directory / "run/notify" / name
-        path.touch()
-        os.utime(path)
+        (self.directory / "run/notify" / name).touch()
 
 
 class Client:
