@@ -53,6 +53,7 @@ List ReporterIDList(const std::vector<ReporterID>& reporterIDs) {
 template <class Sessions, class Projection>
 std::string SessionDescriptions(const Sessions& sessions, Projection reporterID) {
   std::string text = "[";
+  text.reserve(64 * sessions.size());
   for (const auto& session : sessions) {
     text += text.size() == 1 ? "\"" : ",\"";
     ZQReportingSession::appendDescription(text, std::invoke(reporterID, session));
@@ -61,8 +62,8 @@ std::string SessionDescriptions(const Sessions& sessions, Projection reporterID)
   return text += ']';
 }
 
-std::string SessionDescriptions(const std::vector<std::shared_ptr<ZQReportingSession>>& sessions) {
-  return SessionDescriptions(sessions, [](const auto& session) { return session->reporterID(); });
+std::string SessionDescriptions(const std::vector<ZQReportingSession*>& sessions) {
+  return SessionDescriptions(sessions, &ZQReportingSession::reporterID);
 }
 
 std::string SessionDescriptions(const ZQReportingServerInstance::SessionMap& sessions) {
@@ -485,13 +486,13 @@ void ZQReportingServerInstance::broadcast(ZQReportingServiceDelegateProtocol& de
                                           std::uint32_t category, std::uint16_t type) {
   ZQ_FUNCTION(
       "-[ZQReportingServerInstance sendMessage:withCategory:andType:forReportingIDs:reply:]");
-  std::vector<std::shared_ptr<ZQReportingSession>> active;
+  std::vector<ZQReportingSession*> active;  // of the clients' maps, which this queue guards
   for (const auto& client : delegate.getAllClients()) {
     const auto& sessions = client->clientReportingSessionMap();
     ZQ_LOG(Scope(), standard, "sessions for client {} : {}", client->processIdentifier(),
            SessionDescriptions(sessions));
     for (const auto& [reporterID, session] : sessions) {
-      if (session->started()) active.push_back(session);
+      if (session->started()) active.push_back(session.get());
     }
   }
   ZQ_LOG(Scope(), standard, "active reporting sessions {} : {}", active.size(),
@@ -502,7 +503,7 @@ void ZQReportingServerInstance::broadcast(ZQReportingServiceDelegateProtocol& de
                                           delegate.getDefaults(), nullptr);
     return;
   }
-  for (const auto& session : active) {
+  for (ZQReportingSession* const session : active) {
     // The session first and the sinks after it: the other way round than for messages by
     // identifier.
     session->sendMessage(payload, category, type, nullptr);

@@ -182,7 +182,10 @@ ZQReportingSession::~ZQReportingSession() {
 }
 
 void ZQReportingSession::appendDescription(std::string& text, ReporterID reporterID) {
-  fmt::format_to(std::back_inserter(text), "<ZQReportingSession {}>", reporterID);
+  const fmt::format_int number(reporterID);
+  text += "<ZQReportingSession ";
+  text.append(number.data(), number.size());
+  text += '>';
 }
 
 std::shared_ptr<PayloadHistory> ZQReportingSession::aggregatedPayloadData() const {

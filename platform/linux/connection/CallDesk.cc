@@ -12,8 +12,8 @@ namespace {
 constexpr std::int64_t kResponse = 1;
 
 // Half a turn that takes longer than this makes the next ones shorter; one that takes less, longer.
-constexpr std::chrono::microseconds kSlow{1000};
-constexpr std::chrono::microseconds kFast{250};
+constexpr std::chrono::microseconds kSlow{500};
+constexpr std::chrono::microseconds kFast{125};
 
 /// What the store takes in a few milliseconds.
 constexpr std::size_t kMostBehind = 128;

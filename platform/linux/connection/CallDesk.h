@@ -87,7 +87,7 @@ class CallDesk {
   std::atomic<std::size_t> bytes_{0};  // of calls of which anything is still to be done
   std::atomic<bool> waiting_{false};   // the I/O thread wants to hear of room
 
-  /// How many calls may be ahead of other clients' ones: as many as are carried out in about a
+  /// How many calls may be ahead of other clients' ones: as many as are carried out in about half a
   /// millisecond, whatever they cost, and no more than the limit. Written by the I/O thread.
   std::atomic<std::size_t> turn_;
   // Calls that have been carried out, and so answered, but of which something is still to be done:

@@ -37,8 +37,8 @@ class Passages {
   }
 
  private:
-  /// What they bring is carried out in about a millisecond.
-  static constexpr std::size_t kMost = 32;
+  /// What they bring is carried out in a fraction of a millisecond.
+  static constexpr std::size_t kMost = 8;
 
   class Passage final : public Voucher {
    public:

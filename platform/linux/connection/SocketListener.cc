@@ -31,7 +31,7 @@ namespace {
 constexpr std::chrono::seconds kRetryAccepting{1};
 
 /// So many clients are welcomed before those who are there get their turn.
-constexpr int kAcceptedPerTurn = 16;
+constexpr int kAcceptedPerTurn = 4;
 
 }  // namespace
 

@@ -7,6 +7,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <thread>
+#include <vector>
 
 #include "platform/linux/work/Activity.h"
 #include "platform/linux/work/Keeper.h"
@@ -15,10 +16,15 @@
 namespace quarvel {
 namespace {
 
+constexpr std::size_t kMostGathered = 1024;
+
 struct Worker {
   Pool* pool = nullptr;
   const Lane* lane = nullptr;
   unsigned blockingScopes = 0;
+  // What the block under way has made ready, all of one pool.
+  Pool* gatheredFor = nullptr;
+  std::vector<std::shared_ptr<Lane>> gathered;
 };
 thread_local Worker worker;
 
@@ -48,13 +54,35 @@ Pool::Pool(std::string_view name, int nice, std::size_t width, std::size_t mostH
 
 void Pool::submit(std::shared_ptr<Lane> lane) {
   ActivityBegan();
+  submit({&lane, 1});
+}
+
+void Pool::submit(std::span<std::shared_ptr<Lane>> lanes) {
+  std::size_t begun = 0;
   Help help = Help::none;
-  {
-    const MutexLock lock(mutex_);
-    ready_.push_back(std::move(lane));
-    help = helpNeeded();
-  }
-  call(help);
+  do {
+    {
+      const MutexLock lock(mutex_);
+      for (; begun < lanes.size(); ++begun) ready_.push_back(std::move(lanes[begun]));
+      help = helpNeeded();
+    }
+    call(help);
+  } while (help != Help::none && lanes.size() > 1);
+}
+
+void Pool::submitSoon(std::shared_ptr<Lane> lane) {
+  if (worker.pool == nullptr) return submit(std::move(lane));
+  ActivityBegan();
+  if (worker.gatheredFor != this) submitGathered();
+  worker.gatheredFor = this;
+  worker.gathered.push_back(std::move(lane));
+  if (worker.gathered.size() == kMostGathered) submitGathered();
+}
+
+void Pool::submitGathered() {
+  if (worker.gathered.empty()) return;
+  worker.gatheredFor->submit(worker.gathered);
+  worker.gathered.clear();
 }
 
 Pool::Help Pool::helpNeeded() {
@@ -145,6 +173,7 @@ std::shared_ptr<Lane> Pool::nextLane(std::shared_ptr<Lane> unfinished) {
 void Pool::beginBlocking() {
   Pool* const pool = worker.pool;
   if (pool == nullptr || worker.blockingScopes++ > 0) return;
+  submitGathered();
   Help help = Help::none;
   {
     const MutexLock lock(pool->mutex_);

@@ -3,6 +3,7 @@
 #include <cstddef>
 #include <deque>
 #include <memory>
+#include <span>
 #include <string_view>
 
 #include "base/Mutex.h"
@@ -30,6 +31,12 @@ class Pool {
   /// Puts a lane in the line for one turn, and for another as long as it wants one. From any
   /// thread.
   void submit(std::shared_ptr<Lane> lane) QUARVEL_EXCLUDES(mutex_);
+  /// The same when the block that the calling thread is running has ended, or a few dozen lanes
+  /// have come together: so one that brings work to a thousand queues takes the lock and wakes
+  /// threads a few times. At once on a thread of no pool.
+  void submitSoon(std::shared_ptr<Lane> lane) QUARVEL_EXCLUDES(mutex_);
+  /// On a pool's thread, after each block.
+  static void submitGathered();
 
   /// Starts a thread that has been counted already. On the keeper's thread, whose nice value no
   /// pool undercuts.
@@ -52,6 +59,7 @@ class Pool {
   void work();
   [[nodiscard]] std::shared_ptr<Lane> nextLane(std::shared_ptr<Lane> unfinished)
       QUARVEL_EXCLUDES(mutex_);
+  void submit(std::span<std::shared_ptr<Lane>> lanes) QUARVEL_EXCLUDES(mutex_);
   [[nodiscard]] Help helpNeeded() QUARVEL_REQUIRES(mutex_);
   void call(Help help) QUARVEL_EXCLUDES(mutex_);
 

@@ -20,17 +20,19 @@ class SerialLane final : public Lane {
   SerialLane(std::string_view label, Pool& pool) : Lane(label), pool_(pool) {}
 
   void add(WorkItem&& item) override {
-    HelpScope* const help = item.isBrief ? HelpScope::current() : nullptr;
+    const bool isBrief = item.isBrief;
     {
       const MutexLock lock(mutex_);
       if (waiting_.capacity() == 0) waiting_.reserve(kFirstCapacity);
       waiting_.push_back(std::move(item));
       if (std::exchange(ready_, true)) return;
     }
-    if (help != nullptr) {
+    if (!isBrief) {
+      pool_.submit(shared_from_this());
+    } else if (HelpScope* const help = HelpScope::current()) {
       help->adopt(shared_from_this(), pool_);
     } else {
-      pool_.submit(shared_from_this());
+      pool_.submitSoon(shared_from_this());
     }
   }
 
@@ -38,6 +40,7 @@ class SerialLane final : public Lane {
     for (int blocks = 0; blocks < kBlocksPerTurn; ++blocks) {
       if (next_ == batch_.size() && !takeBatch()) return false;
       batch_[next_++].run();
+      Pool::submitGathered();
     }
     return true;
   }
@@ -92,6 +95,7 @@ class ConcurrentLane final : public Lane {
 
   bool takeTurn() override {
     next().run();
+    Pool::submitGathered();
     return false;
   }
   bool takeBriefTurn(HelpScope& /*help*/) override { return takeTurn(); }
