@@ -223,6 +223,23 @@ TEST(LendingTest, AnyBlockingCallMayBorrow) {
   done.wait();
 }
 
+TEST(LendingTest, WhatABlockHasBroughtRunsWhileItIsHeldBack) {
+  const auto server = serverQueue();
+  std::vector<std::unique_ptr<WorkQueue>> sessions;
+  for (int i = 0; i < 100; ++i) sessions.push_back(utilityQueue());
+  std::latch all(100);
+  std::latch done(1);
+  server->async([&] {
+    for (const auto& session : sessions) session->asyncBrief([&all] { all.count_down(); });
+    {
+      const BlockingScope blocking;
+      all.wait();
+    }
+    done.count_down();
+  });
+  done.wait();
+}
+
 TEST(ConditionTest, WaitSaysWhetherTheDeadlinePassed) {
   const auto condition = CreateCondition();
   condition->lock();
