@@ -29,16 +29,19 @@ class Beside(ServiceTest):
         service = self.service(SHORT_LIMITS)
         polite = hostile.PoliteClient(service, 1)
         self.addCleanup(polite.close)
+        elsewhere = hostile.PoliteClient(self.service(), 1)
+        self.addCleanup(elsewhere.close)
         attacker = hostile.Hostile(service, act)
         self.addCleanup(attacker.end)
         for attempt in range(3):
-            throughput, latency, beside = hostile.compare(polite, attacker, ROUNDS, SECONDS)
+            found = hostile.compare(polite, elsewhere, attacker, ROUNDS, SECONDS)
             memory = hostile.resident(service.process, peak=True)
-            figure(act.__name__, f"throughput {throughput:.2f}, p99 {latency:.1f} times that alone "
-                                 f"({beside * 1000:.1f} ms), {memory:.0f} MB")
+            figure(act.__name__, f"throughput {found.throughput:.2f}, p99 {found.seconds * 1000:.1f} ms, "
+                                 f"{found.latency:.1f} times that alone and {found.share:.1f} times another "
+                                 f"service's, {memory:.0f} MB")
             # Within a time slice of the machine nobody can tell who took the time.
-            served = (throughput >= 0.8 and (latency <= 2 or beside <= 0.005)) if NIGHTLY else (
-                throughput >= 0.2 and (latency <= 3 or beside <= 1))
+            served = (found.throughput >= 0.8 and (found.share <= 2 or found.seconds <= 0.005)) if NIGHTLY else (
+                found.throughput >= 0.2 and (found.share <= 3 or found.seconds <= 1))
             if served:
                 break
         self.assertTrue(served)

@@ -18,8 +18,8 @@ using std::chrono::steady_clock;
 
 namespace {
 
-/// One client's calls are taken in for so long before the others have their turn, looked at every few
-/// calls. Those for which the server queue has work stop earlier, at the desk.
+/// One client's calls are taken in for so long before the others have their turn, looked at every
+/// few calls. Those for which the server queue has work stop earlier, at the desk.
 constexpr std::chrono::microseconds kLongestTurn{200};
 constexpr unsigned kCallsPerLook = 16;
 
