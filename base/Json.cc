@@ -53,12 +53,22 @@ constexpr bool MustAnyBeEscaped(std::uint64_t eight) {
 /// Copies a text that needs no escape; false when it does, and then what was copied is undefined.
 bool CopyPlain(std::string_view text, char* to) {
   const std::size_t size = text.size();
-  if (size < sizeof(std::uint64_t)) {
+  if (size < sizeof(std::uint32_t)) {
     for (std::size_t at = 0; at < size; ++at) {
       if (MustBeEscaped(text[at])) return false;
       to[at] = text[at];
     }
     return true;
+  }
+  // What the steps leave over is copied once more with the last one.
+  if (size < sizeof(std::uint64_t)) {
+    std::uint32_t first = 0;
+    std::uint32_t last = 0;
+    std::memcpy(&first, text.data(), sizeof first);
+    std::memcpy(&last, text.data() + size - sizeof last, sizeof last);
+    std::memcpy(to, &first, sizeof first);
+    std::memcpy(to + size - sizeof last, &last, sizeof last);
+    return !MustAnyBeEscaped(std::uint64_t{last} << 32 | first);
   }
   const auto step = [&](std::size_t at) {
     std::uint64_t eight = 0;
@@ -66,7 +76,6 @@ bool CopyPlain(std::string_view text, char* to) {
     std::memcpy(to + at, &eight, sizeof eight);
     return !MustAnyBeEscaped(eight);
   };
-  // What the steps leave over is copied once more with the last one.
   for (std::size_t at = 0; at + sizeof(std::uint64_t) < size; at += sizeof(std::uint64_t)) {
     if (!step(at)) return false;
   }

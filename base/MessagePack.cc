@@ -16,6 +16,7 @@ MessagePackScanner::MessagePackScanner(std::size_t maximumBytes, unsigned maximu
 
 void MessagePackScanner::reset() {
   position_ = 0;
+  left_ = 1;
   depth_ = 0;
   fault_.clear();
 }
@@ -26,42 +27,45 @@ MessagePackScanner::Progress MessagePackScanner::fail(std::string reason) {
 }
 
 MessagePackScanner::Progress MessagePackScanner::scan(std::string_view bytes) {
-  // `position_` may lie beyond what has arrived: the rest of a string is skipped unread.
-  while ((depth_ > 0 || position_ == 0) && position_ < bytes.size()) {
-    const auto code = static_cast<unsigned char>(bytes[position_]);
-    const MessagePackForm& form = MessagePackForm::of(code);
+  // Held here while the bytes are read, which might be these members for all the compiler knows.
+  // `position` may lie beyond what has arrived: the rest of a string is skipped unread.
+  std::size_t position = position_;
+  std::uint64_t left = left_;
+  unsigned depth = depth_;
+  while (left > 0 && position < bytes.size()) {
+    const char* const value = bytes.data() + position;
+    const MessagePackForm& form = MessagePackForm::at(value);
     if (form.kind == MessagePackForm::Kind::unused) {
-      return fail(fmt::format("byte {} is 0xc1, which MessagePack never uses", position_));
+      return fail(fmt::format("byte {} is 0xc1, which MessagePack never uses", position));
     }
-    const std::size_t arrived = bytes.size() - position_;
-    if (arrived < form.headBytes) break;
-    const std::uint64_t length = form.length(bytes.data() + position_);
-    const bool container = form.isContainer();
+    if (bytes.size() - position < form.headBytes) break;
+    const std::uint64_t length = form.length(value);
     const std::uint64_t values =
         form.kind == MessagePackForm::Kind::dictionary ? 2 * length : length;
     // Each value takes a byte at least, so a container's count bounds its bytes from below.
     const std::uint64_t needed = form.headBytes + values;
-    if (needed > maximumBytes_ || position_ > maximumBytes_ - needed) {
+    if (needed > maximumBytes_ || position > maximumBytes_ - needed) {
       return fail(
           fmt::format("the value at byte {} needs {} bytes or more; a message has at most {}",
-                      position_, needed, maximumBytes_));
+                      position, needed, maximumBytes_));
     }
-    position_ += form.headBytes;
-    if (!container) {
-      position_ += length;
-    } else if (depth_ == maximumDepth_) {
-      return fail(fmt::format("the container at byte {} is nested deeper than {}",
-                              position_ - form.headBytes, maximumDepth_));
+    --left;
+    if (!form.isContainer()) {
+      position += needed;
+    } else if (depth == maximumDepth_) {
+      return fail(fmt::format("the container at byte {} is nested deeper than {}", position,
+                              maximumDepth_));
     } else {
-      remaining_[depth_++] = values + 1;  // the container itself is counted off below
+      position += form.headBytes;
+      leftAround_[depth++] = left;
+      left = values;
     }
-    while (depth_ > 0 && --remaining_[depth_ - 1] == 0) {
-      // A container that is finished is one value less in the container around it.
-      --depth_;
-    }
+    while (left == 0 && depth > 0) left = leftAround_[--depth];
   }
-  const bool finished = depth_ == 0 && position_ > 0 && position_ <= bytes.size();
-  return finished ? Progress::complete : Progress::incomplete;
+  position_ = position;
+  left_ = left;
+  depth_ = depth;
+  return left == 0 && position <= bytes.size() ? Progress::complete : Progress::incomplete;
 }
 
 template <class Unsigned>

@@ -43,8 +43,9 @@ class MessagePackScanner {
   std::size_t maximumBytes_;
   unsigned maximumDepth_;
   std::size_t position_ = 0;  // every byte before it has been looked at, or is to be skipped
+  std::uint64_t left_ = 1;    // values still to come in the innermost open container
   unsigned depth_ = 0;        // containers that are open
-  std::array<std::uint64_t, kDeepest> remaining_{};  // values still to come in each
+  std::array<std::uint64_t, kDeepest> leftAround_{};  // the same around each of them
   std::string fault_;
 };
 

@@ -41,45 +41,6 @@ static_assert(static_cast<int>(Form::Kind::nil) == static_cast<int>(Value::Kind:
               static_cast<int>(Form::Kind::dictionary) ==
                   static_cast<int>(Value::Kind::dictionary));
 
-std::optional<bool> PayloadValue::boolean() const {
-  if (Form::at(at_).kind != Form::Kind::boolean) return std::nullopt;
-  return *at_ == '\xc3';
-}
-
-std::optional<std::int64_t> PayloadValue::integer() const {
-  const Form& form = Form::at(at_);
-  if (form.kind == Form::Kind::unsignedInteger) {
-    const std::uint64_t number = *unsignedInteger();
-    if (number > std::numeric_limits<std::int64_t>::max()) return std::nullopt;
-    return static_cast<std::int64_t>(number);
-  }
-  if (form.kind != Form::Kind::integer) return std::nullopt;
-  if (form.fixed == 0) return static_cast<signed char>(*at_);
-  // Shifted up and back down, the sign bit spreads.
-  const int unusedBits = 64 - 8 * form.fixed;
-  return static_cast<std::int64_t>(Form::bigEndian(at_ + 1, form.fixed) << unusedBits) >>
-         unusedBits;
-}
-
-std::optional<std::uint64_t> PayloadValue::unsignedInteger() const {
-  const Form& form = Form::at(at_);
-  if (form.kind == Form::Kind::unsignedInteger) {
-    return form.fixed == 0 ? static_cast<unsigned char>(*at_)
-                           : Form::bigEndian(at_ + 1, form.fixed);
-  }
-  const auto number = integer();
-  if (!number || *number < 0) return std::nullopt;
-  return static_cast<std::uint64_t>(*number);
-}
-
-std::optional<double> PayloadValue::real() const {
-  const Form& form = Form::at(at_);
-  if (form.kind != Form::Kind::real) return std::nullopt;
-  const std::uint64_t bits = Form::bigEndian(at_ + 1, form.fixed);
-  if (form.fixed == 4) return std::bit_cast<float>(static_cast<std::uint32_t>(bits));
-  return std::bit_cast<double>(bits);
-}
-
 std::optional<Date> PayloadValue::date() const {
   using namespace std::chrono;
   if (!IsTimestamp(at_)) return std::nullopt;
@@ -423,7 +384,10 @@ Payload Payload::replacingInKeys(char from, char to) const {
     return text && text->find(from) != std::string_view::npos;
   };
   bool any = false;
-  for (const PayloadEntry& entry : root().entries()) any = any || concerned(entry);
+  // Most payloads have no such character anywhere, which is found out at once.
+  if (encoded().find(from) != std::string_view::npos) {
+    for (const PayloadEntry& entry : root().entries()) any = any || concerned(entry);
+  }
   if (!any) return *this;
 
   std::string rewritten;

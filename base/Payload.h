@@ -1,9 +1,11 @@
 #pragma once
 
 #include <atomic>
+#include <bit>
 #include <cstddef>
 #include <cstdint>
 #include <iterator>
+#include <limits>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -45,10 +47,10 @@ class PayloadValue {
 
   // Each is none when the value is of another kind. The integers accept every integer form whose
   // number fits.
-  [[nodiscard]] std::optional<bool> boolean() const;
-  [[nodiscard]] std::optional<std::int64_t> integer() const;
-  [[nodiscard]] std::optional<std::uint64_t> unsignedInteger() const;
-  [[nodiscard]] std::optional<double> real() const;
+  [[nodiscard]] inline std::optional<bool> boolean() const;
+  [[nodiscard]] inline std::optional<std::int64_t> integer() const;
+  [[nodiscard]] inline std::optional<std::uint64_t> unsignedInteger() const;
+  [[nodiscard]] inline std::optional<double> real() const;
   [[nodiscard]] std::optional<std::string_view> string() const {
     return octets(MessagePackForm::Kind::string);
   }
@@ -149,6 +151,45 @@ class PayloadValue::Entries {
   const char* first_;
   std::size_t count_;
 };
+
+std::optional<bool> PayloadValue::boolean() const {
+  if (MessagePackForm::at(at_).kind != MessagePackForm::Kind::boolean) return std::nullopt;
+  return *at_ == '\xc3';
+}
+
+std::optional<std::int64_t> PayloadValue::integer() const {
+  const MessagePackForm& form = MessagePackForm::at(at_);
+  if (form.kind == MessagePackForm::Kind::unsignedInteger) {
+    const std::uint64_t number = *unsignedInteger();
+    if (number > std::numeric_limits<std::int64_t>::max()) return std::nullopt;
+    return static_cast<std::int64_t>(number);
+  }
+  if (form.kind != MessagePackForm::Kind::integer) return std::nullopt;
+  if (form.fixed == 0) return static_cast<signed char>(*at_);
+  // Shifted up and back down, the sign bit spreads.
+  const int unusedBits = 64 - 8 * form.fixed;
+  return static_cast<std::int64_t>(MessagePackForm::bigEndian(at_ + 1, form.fixed) << unusedBits) >>
+         unusedBits;
+}
+
+std::optional<std::uint64_t> PayloadValue::unsignedInteger() const {
+  const MessagePackForm& form = MessagePackForm::at(at_);
+  if (form.kind == MessagePackForm::Kind::unsignedInteger) {
+    return form.fixed == 0 ? static_cast<unsigned char>(*at_)
+                           : MessagePackForm::bigEndian(at_ + 1, form.fixed);
+  }
+  const auto number = integer();
+  if (!number || *number < 0) return std::nullopt;
+  return static_cast<std::uint64_t>(*number);
+}
+
+std::optional<double> PayloadValue::real() const {
+  const MessagePackForm& form = MessagePackForm::at(at_);
+  if (form.kind != MessagePackForm::Kind::real) return std::nullopt;
+  const std::uint64_t bits = MessagePackForm::bigEndian(at_ + 1, form.fixed);
+  if (form.fixed == 4) return std::bit_cast<float>(static_cast<std::uint32_t>(bits));
+  return std::bit_cast<double>(bits);
+}
 
 PayloadValue::Items PayloadValue::items() const {
   const MessagePackForm& form = MessagePackForm::at(at_);

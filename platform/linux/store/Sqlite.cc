@@ -55,6 +55,29 @@ SqliteStatement& SqliteStatement::bind(int parameter, std::nullptr_t) {
   return *this;
 }
 
+SqliteStatement::Steady& SqliteStatement::steady(int parameter) {
+  const auto index = static_cast<std::size_t>(parameter);
+  if (index >= steady_.size()) {
+    const int count = std::max(sqlite3_bind_parameter_count(statement_.get()), parameter);
+    steady_.resize(static_cast<std::size_t>(count) + 1);
+  }
+  return steady_[index];
+}
+
+SqliteStatement& SqliteStatement::bindSteady(int parameter, std::int64_t integer) {
+  Steady& bound = steady(parameter);
+  if (bound.integer == integer) return *this;
+  bound.integer = integer;
+  return bind(parameter, integer);
+}
+
+SqliteStatement& SqliteStatement::bindSteady(int parameter, std::string_view text) {
+  Steady& bound = steady(parameter);
+  if (bound.text == text) return *this;
+  bound.text = text;
+  return bind(parameter, std::string_view(*bound.text));
+}
+
 SqliteStatement& SqliteStatement::bind(int parameter, const SqliteStatement& row, int column) {
   sqlite3_bind_value(statement_.get(), parameter,
                      sqlite3_column_value(row.statement_.get(), column));
@@ -108,6 +131,8 @@ void SqliteConnection::Close::operator()(sqlite3* connection) const {
 }
 
 bool SqliteConnection::open(const std::filesystem::path& path) {
+  // Nobody asks how much memory it uses, and counting takes a lock at each allocation.
+  static const int uncounted [[maybe_unused]] = sqlite3_config(SQLITE_CONFIG_MEMSTATUS, 0);
   sqlite3* connection = nullptr;
   const int result =
       sqlite3_open_v2(path.c_str(), &connection,

@@ -8,6 +8,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "base/Error.h"
 
@@ -31,6 +32,7 @@ class SqliteStatement {
   enum class Step : std::uint8_t { row, done, failed };
 
   SqliteStatement() = default;
+  /// Null when it could not be prepared: every run fails.
   explicit SqliteStatement(sqlite3_stmt* prepared) : statement_(prepared) {}
 
   // Parameters count from 1. Text is not copied: it must live until the statement has run.
@@ -38,6 +40,10 @@ class SqliteStatement {
   SqliteStatement& bind(int parameter, double real);
   SqliteStatement& bind(int parameter, std::string_view text);
   SqliteStatement& bind(int parameter, std::nullptr_t);
+  /// For a parameter that is mostly what it was in the last run, and then costs a comparison; bound
+  /// in no other way. The text is copied.
+  SqliteStatement& bindSteady(int parameter, std::int64_t integer);
+  SqliteStatement& bindSteady(int parameter, std::string_view text);
   /// A column of another statement's current row, of whatever kind.
   SqliteStatement& bind(int parameter, const SqliteStatement& row, int column);
 
@@ -59,6 +65,13 @@ class SqliteStatement {
   struct Finalize {
     void operator()(sqlite3_stmt* statement) const;
   };
+  struct Steady {
+    std::optional<std::int64_t> integer;
+    std::optional<std::string> text;
+  };
+  Steady& steady(int parameter);
+
+  std::vector<Steady> steady_;  // by parameter; its texts are bound, so it never grows
   std::unique_ptr<sqlite3_stmt, Finalize> statement_;
 };
 

@@ -94,6 +94,20 @@ struct ErasureRow {
 using StoreRow = std::variant<AgentSessionRow, MessageRow, AnalyticsEventRow, PowerEventRow,
                               FlushRow, ExportedRow, ErasureRow>;
 
+/// The most that a row's texts and payload may come to. As JSON they are six times as long at most,
+/// and a row that is longer than SQLite takes (10^9 bytes) would be tried for ever, with
+/// everybody's rows waiting behind it.
+inline constexpr std::size_t kMostRowBytes = std::size_t{128} << 20;
+
+template <class Row>
+[[nodiscard]] bool IsTooLarge(const Row& row, std::initializer_list<std::string_view> texts) {
+  std::size_t bytes = 0;
+  for (const std::string_view text : texts) bytes += text.size();
+  if constexpr (requires { row.payload; }) bytes += row.payload.encoded().size();
+  if constexpr (requires { row.userInfo; }) bytes += row.userInfo.encoded().size();
+  return bytes > kMostRowBytes;
+}
+
 /// Rows in the order in which they were queued. Their texts stand one after the other in one
 /// string, which is emptied and filled again with the batch, so that a row costs no allocation of
 /// its own.

@@ -196,11 +196,11 @@ bool StoreDatabase::insert(const StoreBatch& batch, const MessageRow& row) {
     insertMessage_.bind(2, nullptr);
   }
   return insertMessage_.bind(1, ++lastIDs_[StoreTable::message])
-      .bind(3, row.sessionID)
-      .bind(4, batch.text(row.texts[MessageRow::clientName]))
-      .bind(5, batch.text(row.texts[MessageRow::serviceName]))
-      .bind(6, std::int64_t{row.category})
-      .bind(7, std::int64_t{row.type})
+      .bindSteady(3, row.sessionID)
+      .bindSteady(4, batch.text(row.texts[MessageRow::clientName]))
+      .bindSteady(5, batch.text(row.texts[MessageRow::serviceName]))
+      .bindSteady(6, std::int64_t{row.category})
+      .bindSteady(7, std::int64_t{row.type})
       .bind(8, json(row.payload))
       .bind(9, Microseconds(row.sentAt))
       .run();
@@ -208,7 +208,7 @@ bool StoreDatabase::insert(const StoreBatch& batch, const MessageRow& row) {
 
 bool StoreDatabase::insert(const StoreBatch& batch, const AnalyticsEventRow& row) {
   return insertAnalyticsEvent_.bind(1, ++lastIDs_[StoreTable::analyticsEvent])
-      .bind(2, batch.text(row.texts[AnalyticsEventRow::name]))
+      .bindSteady(2, batch.text(row.texts[AnalyticsEventRow::name]))
       .bind(3, json(row.payload))
       .bind(4, Microseconds(row.recordedAt))
       .run();

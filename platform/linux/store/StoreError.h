@@ -18,6 +18,7 @@ enum class StoreErrorCode : std::int64_t {
   laterVersion = 5,  // a later version of the service wrote the store
   foreign = 6,       // the file is the database of another program
   corrupt = 7,       // its header contradicts what is in it
+  tooLarge = 8,      // a row is longer than the store takes
 };
 
 [[nodiscard]] inline Error StoreError(StoreErrorCode code, std::string reason) {

@@ -1,5 +1,7 @@
 #include "platform/linux/store/StoreQueue.h"
 
+#include <fmt/format.h>
+
 #include <algorithm>
 
 #include "platform/linux/store/StoreError.h"
@@ -27,7 +29,11 @@ void StoreQueue::awaitRoom() {
 
 Error StoreQueue::refuse(std::uint64_t counted) {
   dropAccepted(StoreDrop::refused, counted);
-  return StoreError(StoreErrorCode::closed, "The telemetry store is closed.");
+  if (closed_) return StoreError(StoreErrorCode::closed, "The telemetry store is closed.");
+  return StoreError(
+      StoreErrorCode::tooLarge,
+      fmt::format("A row of the telemetry store has at most {} MiB of texts and payload.",
+                  kMostRowBytes >> 20));
 }
 
 void StoreQueue::dropAccepted(StoreDrop reason, std::uint64_t rows) {

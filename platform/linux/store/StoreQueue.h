@@ -27,23 +27,25 @@ class StoreQueue {
 
   /// Any thread. Holds the caller back while either bound is reached, so that the bound on bytes
   /// may be passed by one row; but lets one pass that must not wait (`BlockingScope`). Errors: the
-  /// queue is closed, also while the caller was held back.
+  /// queue is closed, also while the caller was held back; the row is larger than any may be.
   template <class Row>
   Outcome push(Row&& row, std::initializer_list<std::string_view> texts) QUARVEL_EXCLUDES(mutex_) {
+    const bool tooLarge = IsTooLarge(row, texts);
     MutexLock lock(mutex_);
-    awaitRoom();
-    if (closed_) return refuse(1);
+    if (!tooLarge) awaitRoom();
+    if (closed_ || tooLarge) return refuse(1);
     append(std::forward<Row>(row), texts);
     return Success();
   }
 
   /// As `push`, but where that would hold the caller back it does nothing and returns false. True
-  /// also when the queue is closed.
+  /// also when the row is refused.
   template <class Row>
   [[nodiscard]] bool pushIfRoom(Row&& row, std::initializer_list<std::string_view> texts)
       QUARVEL_EXCLUDES(mutex_) {
+    const bool tooLarge = IsTooLarge(row, texts);
     MutexLock lock(mutex_);
-    if (closed_) {
+    if (closed_ || tooLarge) {
       (void)refuse(1);
     } else if (hasRoom()) {
       append(std::forward<Row>(row), texts);
@@ -57,8 +59,9 @@ class StoreQueue {
   template <class Row>
   Outcome pushAtOnce(Row&& row, std::initializer_list<std::string_view> texts)
       QUARVEL_EXCLUDES(mutex_) {
+    const bool tooLarge = IsTooLarge(row, texts);
     MutexLock lock(mutex_);
-    if (closed_) return refuse(0);
+    if (closed_ || tooLarge) return refuse(0);
     append(std::forward<Row>(row), texts);
     return Success();
   }
