@@ -10,12 +10,15 @@
 #include <csignal>
 #include <map>
 #include <memory>
+#include <stdexcept>
 #include <string>
 #include <thread>
 #include <vector>
 
 #include "base/Payload.h"
 #include "bench/Subject.h"
+
+#include <quarvel/client.hpp>
 
 namespace quarvel {
 namespace {
@@ -101,6 +104,8 @@ constexpr const char* kStart = "start to first answer ms";
 constexpr const char* kIdleResident = "idle resident MB";
 constexpr const char* kIdleProportional = "idle proportional MB";
 constexpr const char* kHistory = "history, bytes beside a payload";
+constexpr const char* kBroadcast = "broadcast to 1,000 sessions us";
+constexpr const char* kClientCost = "client: one sendMessage us";
 
 std::string WakeUpsOf(std::size_t clients) {
   return fmt::format("wake-ups a minute, {} clients", clients);
@@ -160,14 +165,15 @@ void MeasureIdle(Table& table, const Subject& service) {
   // With a store that is there, as at every start but the first.
   service.restart(*server);
   const auto begin = Clock::now();
-  const auto first = service.connect(*server, 0);
-  first->call("reporterID:valid:", 0);
-  table.add(kStart, service, SecondsSince(begin) * 1e3);
   std::vector<std::unique_ptr<WireClient>> clients;
-  for (const std::size_t connected : {std::size_t{1}, std::size_t{100}}) {
-    while (clients.size() + 1 < connected) {
-      clients.push_back(service.connect(*server, static_cast<std::int64_t>(clients.size() + 2)));
+  clients.push_back(service.connect(*server, 0));
+  clients.front()->call("reporterID:valid:", 0);
+  table.add(kStart, service, SecondsSince(begin) * 1e3);
+  for (const std::size_t connected : {std::size_t{1}, std::size_t{100}, std::size_t{0}}) {
+    while (clients.size() < connected) {
+      clients.push_back(service.connect(*server, static_cast<std::int64_t>(clients.size() + 1)));
     }
+    clients.resize(connected);
     std::this_thread::sleep_for(std::chrono::seconds(2));
     if (connected == 1) {
       table.add(kIdleResident, service, server->residentMegabytes());
@@ -194,6 +200,48 @@ void MeasureHistory(Table& table, const Subject& service) {
   const double grown = (server->residentMegabytes() - before) * 1024 * 1024;
   const auto payload = static_cast<double>(Payload(TypicalPayload()).encoded().size());
   table.add(kHistory, service, grown / kMessages - payload);
+}
+
+/// From the call to its reply, which comes when the server queue is done with all sessions.
+void MeasureBroadcast(Table& table, const Subject& service) {
+  constexpr std::int64_t kSessions = 1000;
+  constexpr std::size_t kBroadcasts = 50;
+  const auto server = service.start();
+  const auto client = service.connect(*server, 1);
+  for (std::int64_t id = 2; id <= kSessions; ++id) client->startSession(id);
+  std::vector<double> taken;
+  for (std::size_t i = 1; i <= kBroadcasts; ++i) {
+    const auto begin = Clock::now();
+    client->write(SendMessageFrame(1, 0));
+    client->readReplies();
+    taken.push_back(SecondsSince(begin) * 1e6);
+    service.awaitStored(*server, i * kSessions);
+  }
+  std::ranges::sort(taken);
+  table.add(kBroadcast, service, taken[kBroadcasts / 2]);
+}
+
+/// What a caller of the client library spends in a call that waits for nothing.
+void MeasureClient(Table& table, const Subject& service) {
+  constexpr std::size_t kBursts = 100;
+  constexpr std::size_t kBurst = 100;
+  const auto server = service.start();
+  auto client = Client::connect((server->directory() / "reporting.sock").native());
+  if (!client) throw std::runtime_error(client.error().description());
+  client.value().createReportingSession(1);
+  client.value().startReportingSessionForID(1);
+  const Payload payload(TypicalPayload());
+  double spent = 0;
+  for (std::size_t i = 1; i <= kBursts; ++i) {
+    const auto begin = Clock::now();
+    for (std::size_t sent = 0; sent < kBurst; ++sent) {
+      client.value().sendMessage(payload, {vocabulary::Component::hal, vocabulary::Kind::playback},
+                                 vocabulary::MessageType::generic, 1);
+    }
+    spent += SecondsSince(begin);
+    service.awaitStored(*server, i * kBurst);
+  }
+  table.add(kClientCost, service, spent * 1e6 / (kBursts * kBurst));
 }
 
 void PrintTargets(const Table& table) {
@@ -229,6 +277,7 @@ void PrintTargets(const Table& table) {
            Target{"start to first answer ms", table.median(kStart, one), 8, false},
            Target{"bytes written / stored", table.median(kWritten, one), 1.5, false},
            Target{"history, bytes beside a payload", table.median(kHistory, one), 96, false},
+           Target{"broadcast to 1,000 sessions us", table.median(kBroadcast, one), 1000, false},
        }) {
     const bool reached =
         target.atLeast ? target.value >= target.bound : target.value <= target.bound;
@@ -259,6 +308,8 @@ int Main(const std::string& quarveld, const std::string& peers, std::size_t mess
     }
     MeasureIdle(table, *subjects.front());
     MeasureHistory(table, *subjects.front());
+    MeasureBroadcast(table, *subjects.front());
+    MeasureClient(table, *subjects.front());
   }
   fmt::print(stderr, "\r{:<40}\r", "");
   table.print();

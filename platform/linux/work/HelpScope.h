@@ -38,6 +38,7 @@ class HelpScope {
  private:
   const std::chrono::steady_clock::time_point end_;
   bool exhausted_ = false;
+  unsigned asked_ = 0;
 };
 
 }  // namespace quarvel
