@@ -7,7 +7,7 @@ import sys
 import tempfile
 import unittest
 
-from harness import PATIENCE, PREFIX, ServiceTest, eventually
+from harness import LAUNCH, PATIENCE, PREFIX, ServiceTest, eventually
 
 SOURCES = pathlib.Path(sys.argv.pop(1))
 
@@ -39,21 +39,21 @@ class Examples(ServiceTest):
         return ended.stdout, session["service_name"], [json.loads(row["payload"]) for row in rows[:-1]]
 
     def test_c_on_an_event_loop(self):
-        output, service_name, payloads = self.run_example(self.built / "client-c")
+        output, service_name, payloads = self.run_example(LAUNCH, self.built / "client-c")
         self.assertIn("has stopped", output)
         self.assertIn("longformaudio", service_name)
         self.assertEqual(payloads, [{"number": number, "route": "Speaker", "rates": [44100, 48000]}
                                     for number in range(1, 6)])
 
     def test_cc(self):
-        output, service_name, payloads = self.run_example(self.built / "client-cc")
+        output, service_name, payloads = self.run_example(LAUNCH, self.built / "client-cc")
         self.assertEqual(output, "started: true\nstopped: true\n")
         self.assertIn("telephony", service_name)
         self.assertEqual(payloads, [{"number": number, "route": "Receiver"} for number in (1, 2, 3)]
                          + [{"volume": 0.5}])
 
     def test_realtime(self):
-        output, service_name, payloads = self.run_example(self.built / "realtime")
+        output, service_name, payloads = self.run_example(LAUNCH, self.built / "realtime")
         self.assertEqual(output, "200 records sent\n")
         self.assertIn("audiodeviceusage", service_name)
         self.assertEqual([payload["callback"] for payload in payloads], list(range(200)))

@@ -214,7 +214,7 @@ class Otlp(ServiceTest):
         service, client = self.started()
         client.message({"n": 1}, [5])
         eventually(lambda: len(self.collector.records()) == 1, "the first row")
-        self.collector.answer(*["hang"] * 3)
+        self.collector.answer(*["hang"] * 100)
         client.start_session(6)
         for number in range(50):
             client.message({"n": number, "text": "secret"}, [6])

@@ -4,6 +4,7 @@ import contextlib
 import json
 import os
 import pathlib
+import re
 import signal
 import socket
 import sqlite3
@@ -16,6 +17,8 @@ import unittest
 import msgpack
 
 PREFIX = pathlib.Path(os.environ["QUARVEL_PREFIX"])
+LAUNCH = pathlib.Path(__file__).resolve().parent.parent / "launch"
+QUARVELD = (LAUNCH, PREFIX / "sbin/quarveld")
 # How long something may take that normally takes no time: machines that test are slow at times.
 PATIENCE = float(os.environ.get("QUARVEL_TEST_PATIENCE", "60"))
 
@@ -58,7 +61,7 @@ class Service:
     def start(self):
         with open(self.log_path, "ab") as log:
             self.process = subprocess.Popen(
-                [*self._wrapper, PREFIX / "sbin/quarveld"], env=self.environment, stderr=log
+                [*self._wrapper, *QUARVELD], env=self.environment, stderr=log
             )
 
         def up():
@@ -77,14 +80,14 @@ class Service:
         return self.process.wait(PATIENCE)
 
     def finish(self):
-        """Ends it and looks whether a sanitizer has spoken."""
+        """Ends it and looks whether a sanitizer or valgrind has spoken."""
         try:
             self.end()
         finally:
             if self.process.poll() is None:
                 self.process.kill()
                 self.process.wait()
-        if "Sanitizer" in self.log() or "runtime error:" in self.log():
+        if re.search(r"Sanitizer|runtime error:|^==\d+==", self.log(), re.MULTILINE):
             raise AssertionError(self.log())
 
     def tidy(self):
@@ -108,7 +111,7 @@ class Service:
 
     def ctl(self, *arguments, **options):
         return subprocess.run(
-            [PREFIX / "bin/quarvelctl", *map(str, arguments)],
+            [LAUNCH, PREFIX / "bin/quarvelctl", *map(str, arguments)],
             env=self.environment, capture_output=True, text=True, timeout=PATIENCE, **options
         )
 

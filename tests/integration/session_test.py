@@ -10,7 +10,7 @@ import unittest
 
 import msgpack
 
-from harness import PATIENCE, PREFIX, CallError, ServiceTest, eventually
+from harness import PATIENCE, PREFIX, QUARVELD, CallError, ServiceTest, eventually
 
 NO_BACKENDS = "[agent]\nbackends = []\n"
 
@@ -225,7 +225,7 @@ class Ends(ServiceTest):
 
     def test_what_cannot_start_says_why(self):
         def refuse(service, *words):
-            ended = subprocess.run([PREFIX / "sbin/quarveld"], env=service.environment,
+            ended = subprocess.run(QUARVELD, env=service.environment,
                                    capture_output=True, text=True, timeout=PATIENCE)
             self.assertEqual(ended.returncode, 1, ended.stderr)
             errors = [line for line in ended.stderr.splitlines() if " error " in line or "quarveld:" in line]

@@ -14,7 +14,7 @@ CAN_MOUNT = shutil.which("unshare") and subprocess.run(
     ["unshare", "-m", "mount", "-t", "tmpfs", "tmpfs", "/mnt"], capture_output=True, check=False).returncode == 0
 # Runs the service with a file system of its own for its store, which others see through /proc.
 ON_SMALL_DISK = ["unshare", "-m", "sh", "-c",
-                 'mount -t tmpfs -o size=2m tmpfs "$STATE_DIRECTORY" && exec "$0"']
+                 'mount -t tmpfs -o size=2m tmpfs "$STATE_DIRECTORY" && exec "$0" "$@"']
 
 
 class Status(ServiceTest):

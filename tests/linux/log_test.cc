@@ -274,7 +274,7 @@ TEST_F(LogDeathTest, StandardErrorThatNobodyReadsDoesNotKeepTheProcess) {
 // The journal's socket, in a mount namespace of our own; whether there may be one.
 int listenAsJournal() {
   const int flags = geteuid() == 0 ? CLONE_NEWNS : CLONE_NEWNS | CLONE_NEWUSER;
-  if (unshare(flags) != 0 || mount("none", "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+  if (unshare(flags) != 0 || mount("none", "/", "none", MS_REC | MS_PRIVATE, nullptr) != 0 ||
       mount("tmpfs", "/run", "tmpfs", 0, nullptr) != 0) {
     return -1;
   }

@@ -65,18 +65,19 @@ TEST(RunLoop, FiresTimersInTheOrderOfTheirDatesAndReturnsWhenNoneIsLeft) {
         EXPECT_GE(Clock::now() - begun, date);
       };
     };
-    AddTimer(60ms, note("60", 60ms));
-    const auto moved = AddTimer(10ms, note("10, moved to 80", 80ms));
-    AddTimer(20ms, note("20", 20ms));
-    moved->fireAfter(80ms);
-    AddTimer(40ms, [&] {
-      fired.push_back("40");
-      AddTimer(0ms, note("added by 40", 40ms));
+    AddTimer(600ms, note("600", 600ms));
+    const auto moved = AddTimer(100ms, note("100, moved to 800", 800ms));
+    AddTimer(200ms, note("200", 200ms));
+    moved->fireAfter(800ms);
+    AddTimer(400ms, [&] {
+      fired.push_back("400");
+      AddTimer(0ms, note("added by 400", 400ms));
     });
     RunLoop::current().addTimer(early);
     RunLoop::current().addTimer(early);
     RunLoop::current().run();
-    EXPECT_THAT(fired, ElementsAre("overdue", "20", "40", "added by 40", "60", "10, moved to 80"));
+    EXPECT_THAT(fired,
+                ElementsAre("overdue", "200", "400", "added by 400", "600", "100, moved to 800"));
     RunLoop::current().addTimer(early);  // no longer valid
     early->fireAfter(0s);
     RunLoop::current().run();

@@ -159,6 +159,11 @@ struct Damage {
   bool keepsTheRow = false;
 };
 
+// GoogleTest would print the bytes, those between the members too, which nobody has set.
+void PrintTo(const Damage& damage, std::ostream* out) {
+  *out << damage.name;
+}
+
 class DamagedStoreTest : public StoreTest, public ::testing::WithParamInterface<Damage> {};
 
 TEST_P(DamagedStoreTest, IsKeptAsideAndANewOneBegun) {

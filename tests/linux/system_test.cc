@@ -6,6 +6,7 @@
 #include <cmath>
 #include <fstream>
 #include <iterator>
+#include <sstream>
 #include <string>
 #include <thread>
 
@@ -63,13 +64,13 @@ TEST(ProcessTest, NameThatIsNoTextIsNone) {
 
 TEST(TraceTest, ProbeCanBeFoundByTracingTools) {
   EmitKernelTrace(0x21042814);
-  std::ifstream program("/proc/self/exe", std::ios::binary);
-  const std::string bytes(std::istreambuf_iterator<char>(program), {});
+  std::stringstream bytes;
+  bytes << std::ifstream("/proc/self/exe", std::ios::binary).rdbuf();
   std::string provider = "quarvel";
   provider += '\0';
   provider += "event";
   provider += '\0';
-  EXPECT_NE(bytes.find(provider), std::string::npos);
+  EXPECT_NE(bytes.str().find(provider), std::string::npos);
 }
 
 }  // namespace

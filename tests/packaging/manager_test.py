@@ -10,7 +10,7 @@ import socket
 import subprocess
 import unittest
 
-from harness import PATIENCE, PREFIX, Client, ServiceTest, eventually
+from harness import PATIENCE, PREFIX, QUARVELD, Client, ServiceTest, eventually
 
 UNITS = PREFIX / "lib/systemd/system"
 
@@ -54,8 +54,7 @@ class Manager(ServiceTest):
     def test_it_is_not_ready_when_it_cannot_start(self):
         service = self.prepared('[log]\nlevel = "loud"\n')
         heard = self.watched(service)
-        subprocess.run([PREFIX / "sbin/quarveld"], env=service.environment, stderr=subprocess.DEVNULL,
-                       timeout=PATIENCE)
+        subprocess.run(QUARVELD, env=service.environment, stderr=subprocess.DEVNULL, timeout=PATIENCE)
         heard.setblocking(False)
         with self.assertRaises(BlockingIOError):
             heard.recv(100)

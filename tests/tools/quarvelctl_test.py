@@ -16,7 +16,7 @@ import unittest
 
 from fake_service import FakeService, KILL, REPORTERS, START, STOP, VALID
 
-QUARVELCTL = sys.argv.pop(1)
+QUARVELCTL = (pathlib.Path(__file__).resolve().parent.parent / "launch", sys.argv.pop(1))
 SCHEMA = """
 PRAGMA journal_mode = WAL; PRAGMA application_id = 0x51525654; PRAGMA user_version = 1;
 CREATE TABLE agent_session(id INTEGER PRIMARY KEY, session_id INTEGER NOT NULL,
@@ -39,14 +39,15 @@ class ToolTest(unittest.TestCase):
         self.directory = tempfile.TemporaryDirectory(prefix="quarvelctl-")
         self.addCleanup(self.directory.cleanup)
         self.root = pathlib.Path(self.directory.name)
-        self.environment = {"PATH": os.environ["PATH"], "TZ": "UTC",
-                            "QUARVEL_SOCKET": str(self.root / "reporting.sock"),
-                            "STATE_DIRECTORY": str(self.root),
-                            "CONFIGURATION_DIRECTORY": str(self.root / "etc")}
+        self.environment = {name: os.environ[name] for name in ("PATH", "QUARVEL_VALGRIND") if name in os.environ}
+        self.environment |= {"TZ": "UTC",
+                             "QUARVEL_SOCKET": str(self.root / "reporting.sock"),
+                             "STATE_DIRECTORY": str(self.root),
+                             "CONFIGURATION_DIRECTORY": str(self.root / "etc")}
 
     def ctl(self, *arguments, stdin=""):
         """Status, standard output's lines, standard error."""
-        ran = subprocess.run([QUARVELCTL, *map(str, arguments)], input=stdin, text=True,
+        ran = subprocess.run([*QUARVELCTL, *map(str, arguments)], input=stdin, text=True,
                              capture_output=True, env=self.environment, timeout=60, check=False)
         return ran.returncode, ran.stdout.splitlines(), ran.stderr
 
@@ -248,7 +249,7 @@ class StoreTest(ToolTest):
         """The lines that a terminal of so many columns gets."""
         master, slave = pty.openpty()
         termios.tcsetwinsize(slave, (24, columns))
-        subprocess.run([QUARVELCTL, *arguments], stdout=slave, env=dict(self.environment, **variables),
+        subprocess.run([*QUARVELCTL, *arguments], stdout=slave, env=dict(self.environment, **variables),
                        timeout=60, check=True)
         os.close(slave)
         lines = os.read(master, 65536).decode().splitlines()
@@ -275,7 +276,7 @@ class StoreTest(ToolTest):
         self.assertTrue(self.on_terminal(80, "events", NO_COLOR="")[0].startswith("\x1b"))
 
     def test_following_prints_what_is_stored_later(self):
-        with subprocess.Popen([QUARVELCTL, "messages", "--last", "1", "--follow", "--json"], text=True,
+        with subprocess.Popen([*QUARVELCTL, "messages", "--last", "1", "--follow", "--json"], text=True,
                               stdout=subprocess.PIPE, env=self.environment) as following:
             try:
                 self.assertEqual(json.loads(following.stdout.readline())["id"], 3)
