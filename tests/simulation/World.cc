@@ -34,7 +34,7 @@ World::World(std::uint64_t seed, Lie lie)
                [](Simulation& simulation) {
                  simulation.deviceProperties["InternalBuild"] = isInternalBuild();
                }),
-      simulation_(service_.simulation) {
+      simulation_(service_) {
   simulation_.lie = lie;
   simulation_.deviceProperties["DeviceClassNumber"] = std::int64_t{oneIn(2) ? 6 : 1};
   simulation_.spuriousWakeUps = oneIn(4);
