@@ -10,7 +10,7 @@ import unittest
 
 import msgpack
 
-from harness import PATIENCE, PREFIX, CallError, ServiceTest, eventually
+from harness import PATIENCE, PREFIX, ServiceTest, eventually
 
 NO_BACKENDS = "[agent]\nbackends = []\n"
 
@@ -96,31 +96,6 @@ class Sessions(ServiceTest):
         self.assertGreaterEqual(seconds_between(begun[0], ended[0]), 9)
         self.assertLess(seconds_between(begun[-1], ended[-1]), 20, "side by side, not one by one")
 
-    def test_the_same_in_another_language_and_from_a_script(self):
-        service = self.service()
-        example = subprocess.run(
-            ["/usr/bin/python3", PREFIX / "share/doc/quarvel/examples/client.py", service.socket],
-            capture_output=True, text=True, timeout=PATIENCE)
-        self.assertEqual(example.returncode, 0, example.stderr)
-        script = "\n".join(json.dumps(line) for line in (
-            {"call": "createReportingSession:reply:", "args": [9]},
-            {"expect": True},
-            {"call": "startReportingSessionForID:reply:", "args": [9], "wait": False},
-            {"call": "sendMessage:withCategory:andType:forReportingIDs:reply:", "args": [{"a": 1}, 3, 1, [9]]},
-            {"call": "stopReportingSessionForID:reply:", "args": [9]},
-            {"call": "reporterID:valid:", "args": [9]},
-            {"expect": {"reporterID": 9, "serviceType": 65535}}))
-        played = service.ctl("run", "-", input=script)
-        self.assertEqual(played.returncode, 0, played.stderr)
-        self.assertEqual([json.loads(line)["call"] for line in played.stdout.splitlines()],
-                         ["createReportingSession:reply:",
-                          "sendMessage:withCategory:andType:forReportingIDs:reply:",
-                          "startReportingSessionForID:reply:", "stopReportingSessionForID:reply:",
-                          "reporterID:valid:"])
-        service.wait_for_rows(2, "message WHERE session_id = 9")
-        wrong = service.ctl("run", "-", input=script.replace("65535", "7"))
-        self.assertEqual(wrong.returncode, 1)
-
 
 class Idle(ServiceTest):
     def test_an_idle_service_never_wakes_up(self):
@@ -143,53 +118,6 @@ class Idle(ServiceTest):
                 return False  # a thread has just left
 
         eventually(stays_asleep, "two seconds without a wake-up")
-
-
-class Hostility(ServiceTest):
-    MALFORMED = {
-        "no MessagePack": b"\xc1",
-        "no call": b"\x01",
-        "a response": b"\x94\x01\x01\xc0\xc0",
-        "a list longer than a message may be": b"\xdd\xff\xff\xff\xff",
-        "a string longer than a message may be": b"\x94\x00\x01\xdb\x7f\xff\xff\xff",
-        "nested too deep": b"\x94\x00\x01\xa1x" + b"\x91" * 100,
-    }
-    SEND = "sendMessage:withCategory:andType:forReportingIDs:reply:"
-    WRONG = [
-        (1, ("sendTelegram:", 1)),
-        (2, ("createReportingSession:reply:",)),
-        (2, ("createReportingSession:reply:", "seven")),
-        (2, ("createReportingSession:reply:", 2**63)),
-        (2, ("setServiceType:reportingSession:reply:", 65536, 1)),
-        (2, ("setServiceType:reportingSession:reply:", -1, 1)),
-        (2, (SEND, {1.5: 1}, 3, 1, None)),
-        (2, (SEND, [], 3, 1, None)),
-        (2, (SEND, {}, 3, 1, [1, "two"])),
-        (2, (SEND, {"k": b"bytes", "n": {b"bytes": 1}}, 3, 1, None)),
-    ]
-
-    def test_what_is_malformed_ends_its_own_connection_only(self):
-        service = self.service("[limits]\nframe_seconds = 1\n")
-        polite = self.client(service)
-        started = polite.start_session(1)
-        for name, data in {**self.MALFORMED, "a frame that never ends": b"\x94\x00"}.items():
-            with self.subTest(name):
-                hostile = self.client(service)
-                hostile.start_session(2)
-                hostile.write(data)
-                hostile.until_end()
-                polite.message({"after": name}, [1])
-        for code, call in self.WRONG:
-            with self.subTest(call=call), self.assertRaises(CallError) as wrong:
-                polite.call(*call)
-            self.assertEqual((wrong.exception.domain, wrong.exception.code), ("quarvel.connection", code))
-            self.assertTrue(wrong.exception.reason)
-        eventually(lambda: polite.call("getAllReporters:") == [1], "the sessions of those that went are gone")
-        self.assertNotIn(started, polite.replies)
-        polite.stop_session(1)
-        polite.wait(started)
-        self.assertEqual(service.wait_for_rows(8, "message WHERE session_id = 1")[0]["payload"],
-                         '{"after":"no MessagePack"}')
 
 
 class Ends(ServiceTest):

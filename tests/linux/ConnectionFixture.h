@@ -18,6 +18,7 @@
 #include "base/Value.h"
 #include "platform/linux/connection/SocketListener.h"
 #include "platform/linux/work/Voucher.h"
+#include "tests/TemporaryDirectory.h"
 
 namespace quarvel {
 
@@ -73,17 +74,6 @@ class Ledger {
   std::deque<Kept> kept_ QUARVEL_GUARDED_BY(mutex_);
   std::vector<VoucherHold> left_ QUARVEL_GUARDED_BY(mutex_);
   std::size_t largestKept_ QUARVEL_GUARDED_BY(mutex_) = 0;
-};
-
-/// A directory of its own for one test.
-class TemporaryDirectory {
- public:
-  TemporaryDirectory();
-  ~TemporaryDirectory();
-  [[nodiscard]] const std::filesystem::path& path() const { return path_; }
-
- private:
-  std::filesystem::path path_;
 };
 
 /// A client's end: writes bytes, reads responses.

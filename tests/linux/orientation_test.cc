@@ -9,9 +9,9 @@
 #include <vector>
 
 #include "platform/linux/sources/OrientationFiles.h"
+#include "tests/TemporaryDirectory.h"
 #include "tests/linux/Collected.h"
 #include "tests/linux/LogRecorder.h"
-#include "tests/linux/TemporaryDirectory.h"
 
 namespace quarvel {
 namespace {

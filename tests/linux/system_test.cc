@@ -4,14 +4,11 @@
 
 #include <array>
 #include <cmath>
-#include <fstream>
-#include <iterator>
 #include <string>
 #include <thread>
 
 #include "platform/Process.h"
 #include "platform/Random.h"
-#include "platform/Trace.h"
 
 namespace quarvel {
 namespace {
@@ -59,17 +56,6 @@ TEST(ProcessTest, NameThatIsNoTextIsNone) {
     pthread_setname_np(pthread_self(), "\xff\xfe");
     EXPECT_EQ(ProcessCommandName(gettid()), std::nullopt);
   }).join();
-}
-
-TEST(TraceTest, ProbeCanBeFoundByTracingTools) {
-  EmitKernelTrace(0x21042814);
-  std::ifstream program("/proc/self/exe", std::ios::binary);
-  const std::string bytes(std::istreambuf_iterator<char>(program), {});
-  std::string provider = "quarvel";
-  provider += '\0';
-  provider += "event";
-  provider += '\0';
-  EXPECT_NE(bytes.find(provider), std::string::npos);
 }
 
 }  // namespace
