@@ -4,6 +4,7 @@ import json
 import os
 import pathlib
 import pty
+import shutil
 import sqlite3
 import subprocess
 import sys
@@ -24,20 +25,6 @@ STOP = "stopReportingSessionForID:reply:"
 VALID = "reporterID:valid:"
 REPORTERS = "getAllReporters:"
 KILL = "killService:"
-SCHEMA = """
-PRAGMA journal_mode = WAL; PRAGMA application_id = 0x51525654; PRAGMA user_version = 1;
-CREATE TABLE agent_session(id INTEGER PRIMARY KEY, session_id INTEGER NOT NULL,
-  client_type INTEGER NOT NULL, client_version REAL NOT NULL, batch_event INTEGER NOT NULL,
-  hierarchy_token TEXT NOT NULL, client_name TEXT NOT NULL, service_name TEXT NOT NULL,
-  user_info TEXT NOT NULL, opened_at INTEGER NOT NULL, flushed_at INTEGER);
-CREATE TABLE message(id INTEGER PRIMARY KEY, agent_session INTEGER REFERENCES agent_session(id),
-  session_id INTEGER NOT NULL, client_name TEXT NOT NULL, service_name TEXT NOT NULL,
-  category INTEGER NOT NULL, type INTEGER NOT NULL, payload TEXT NOT NULL, sent_at INTEGER NOT NULL);
-CREATE TABLE analytics_event(id INTEGER PRIMARY KEY, name TEXT NOT NULL, payload TEXT NOT NULL,
-  recorded_at INTEGER NOT NULL);
-CREATE TABLE power_event(id INTEGER PRIMARY KEY, domain INTEGER NOT NULL, name TEXT NOT NULL,
-  payload TEXT NOT NULL, recorded_at INTEGER NOT NULL);
-"""
 NOON = 1_769_860_800_000_000  # 2026-01-31T12:00:00Z
 
 
@@ -56,6 +43,15 @@ class ToolTest(unittest.TestCase):
         ran = subprocess.run([QUARVELCTL, *map(str, arguments)], input=stdin, text=True,
                              capture_output=True, env=self.environment, timeout=60, check=False)
         return ran.returncode, ran.stdout.splitlines(), ran.stderr
+
+
+    def new_store(self):
+        """The empty store that a service makes; a connection to it."""
+        service = harness.Service("[analytics]\nwanted = []\n")
+        self.addCleanup(service.tidy)
+        service.start()
+        service.end()
+        return sqlite3.connect(shutil.copy(service.directory / "state/telemetry.db", self.root), isolation_level=None)
 
 
 class ServiceTest(ToolTest):
@@ -143,9 +139,8 @@ class ServiceTest(ToolTest):
 class StoreTest(ToolTest):
     def setUp(self):
         super().setUp()
-        self.store = sqlite3.connect(self.root / "telemetry.db", isolation_level=None)
+        self.store = self.new_store()
         self.addCleanup(self.store.close)
-        self.store.executescript(SCHEMA)
         info = json.dumps({"HostApplicationDisplayID": "org.example.dialer"})
         for number, flushed in ((7, NOON + 1_500_000), (8, None)):
             self.store.execute("INSERT INTO agent_session VALUES(NULL,?,19,2.0,1,'','tarnwick.quarvel',"
@@ -381,14 +376,12 @@ class RefusalTest(ToolTest):
     def test_what_is_no_store_of_this_version_is_left_alone(self):
         for statement, reason in (("PRAGMA user_version = 2", "is of version 2"),
                                   ("PRAGMA application_id = 7", "is not a telemetry store")):
-            path = self.root / "telemetry.db"
-            store = sqlite3.connect(path)
-            store.executescript(SCHEMA + statement)
+            store = self.new_store()
+            store.execute(statement)
             store.close()
             status, _, error = self.ctl("messages")
             self.assertEqual(status, 1)
             self.assertIn(reason, error)
-            path.unlink()
         (self.root / "text.db").write_text("Not a database, but long enough to be taken for one. " * 20)
         self.assertIn("cannot be read", self.ctl("messages", "--store", self.root / "text.db")[2])
 
