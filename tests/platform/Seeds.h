@@ -3,20 +3,35 @@
 #include <gtest/gtest.h>
 
 #include <cstdint>
-#include <ranges>
+#include <iterator>
 
 namespace quarvel {
 
-/// `QUARVEL_SEED` alone when it is set, to replay a failure; else as many as `QUARVEL_SEEDS` says
-/// (by night, when `QUARVEL_NIGHTLY` is set, 25 times as many), 20 by default.
-[[nodiscard]] std::ranges::iota_view<std::uint64_t, std::uint64_t> AllSeeds();
+/// The seeds to run a test's body for, to be used in a range-for. Ends early once the test has
+/// failed: the first seed that fails is enough.
+class Seeds {
+ public:
+  /// `QUARVEL_SEED` alone when it is set, to replay a failure; else as many as `QUARVEL_SEEDS` says
+  /// (by night, when `QUARVEL_NIGHTLY` is set, 25 times as many), 20 by default.
+  Seeds();
 
-/// The seeds to run a test's body for. Ends early once the test has failed: the first seed that
-/// fails is enough.
-[[nodiscard]] inline auto Seeds() {
-  return AllSeeds() |
-         std::views::take_while([](std::uint64_t) { return !testing::Test::HasFailure(); });
-}
+  struct Iterator {
+    std::uint64_t seed;
+    std::uint64_t last;
+    std::uint64_t operator*() const { return seed; }
+    void operator++() { ++seed; }
+    bool operator!=(std::default_sentinel_t) const {
+      return seed <= last && !testing::Test::HasFailure();
+    }
+  };
+  [[nodiscard]] Iterator begin() const { return {first_, last_}; }
+  [[nodiscard]] std::default_sentinel_t end() const { return {}; }
+  [[nodiscard]] std::uint64_t size() const { return last_ - first_ + 1; }
+
+ private:
+  std::uint64_t first_ = 1;
+  std::uint64_t last_ = 20;
+};
 
 }  // namespace quarvel
 

@@ -266,21 +266,6 @@ SEEDED_TEST(BlockThrottle, AMessageThatComesWhileOthersWaitIsTakenUpAfterThem, T
   EXPECT_THAT(names(), ElementsAre("long", "short"));
 }
 
-// At the very moment of the firing the message may be a duplicate still or a new one already.
-TEST(BlockThrottle, OfAMessageAndTheFiringOfAnEqualOneEitherMayComeFirst) {
-  using Runs = std::vector<Throttled::Run>;
-  for (const auto seed : Seeds()) {
-    Throttled throttled(seed);
-    throttled.addAt(0s, "older");
-    throttled.addAt(500ms, "newer");
-    throttled.runUntil(5s);
-    EXPECT_THAT(throttled.ran,
-                testing::AnyOf(Runs{{"older", 500ms}}, Runs{{"newer", 500ms}}, Runs{{"newer", 1s}},
-                               Runs{{"older", 500ms}, {"newer", 1s}}));
-    EXPECT_THAT(throttled.throttle->timersInFlight(), IsEmpty());
-  }
-}
-
 SEEDED_TEST(BlockThrottle, BlocksRunOneAtATimeAndMayAddMessages, Throttled) {
   int running = 0;
   for (int i = 0; i < 3; ++i) {
