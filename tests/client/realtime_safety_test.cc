@@ -85,31 +85,17 @@ void free(void* memory) {
   __libc_free(memory);
 }
 
-int pthread_mutex_lock(pthread_mutex_t* mutex) noexcept {
-  static const auto next = Next<int (*)(pthread_mutex_t*)>("pthread_mutex_lock");
-  Note("pthread_mutex_lock");
-  return next(mutex);
-}
-int pthread_mutex_trylock(pthread_mutex_t* mutex) noexcept {
-  static const auto next = Next<int (*)(pthread_mutex_t*)>("pthread_mutex_trylock");
-  Note("pthread_mutex_trylock");
-  return next(mutex);
-}
-int pthread_rwlock_rdlock(pthread_rwlock_t* lock) noexcept {
-  static const auto next = Next<int (*)(pthread_rwlock_t*)>("pthread_rwlock_rdlock");
-  Note("pthread_rwlock_rdlock");
-  return next(lock);
-}
-int pthread_rwlock_wrlock(pthread_rwlock_t* lock) noexcept {
-  static const auto next = Next<int (*)(pthread_rwlock_t*)>("pthread_rwlock_wrlock");
-  Note("pthread_rwlock_wrlock");
-  return next(lock);
-}
-int pthread_spin_lock(pthread_spinlock_t* lock) noexcept {
-  static const auto next = Next<int (*)(pthread_spinlock_t*)>("pthread_spin_lock");
-  Note("pthread_spin_lock");
-  return next(lock);
-}
+#define QUARVEL_NOTE_LOCK(name, Lock)                     \
+  int name(Lock* lock) noexcept {                         \
+    static const auto next = Next<int (*)(Lock*)>(#name); \
+    Note(#name);                                          \
+    return next(lock);                                    \
+  }
+QUARVEL_NOTE_LOCK(pthread_mutex_lock, pthread_mutex_t)
+QUARVEL_NOTE_LOCK(pthread_mutex_trylock, pthread_mutex_t)
+QUARVEL_NOTE_LOCK(pthread_rwlock_rdlock, pthread_rwlock_t)
+QUARVEL_NOTE_LOCK(pthread_rwlock_wrlock, pthread_rwlock_t)
+QUARVEL_NOTE_LOCK(pthread_spin_lock, pthread_spinlock_t)
 
 }  // extern "C"
 

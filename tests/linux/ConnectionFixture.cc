@@ -140,10 +140,10 @@ std::size_t Journal::countLocked(std::string_view part) {
   }));
 }
 
-bool Journal::waitFor(std::string_view part, std::size_t times) {
+bool Journal::waitFor(std::string_view part) {
   const auto deadline = std::chrono::steady_clock::now() + kPatience;
   MutexLock lock(mutex_);
-  while (countLocked(part) < times) {
+  while (countLocked(part) == 0) {
     if (!changed_.waitUntil(mutex_, deadline)) return false;
   }
   return true;
@@ -247,11 +247,6 @@ std::string Client::responseWithin(std::chrono::milliseconds time) {
     return {};
   }
   return response();
-}
-
-bool Client::hearsNothing() {
-  pollfd descriptor{socket_.get(), POLLIN, 0};
-  return ::poll(&descriptor, 1, 0) == 0 && taken_ == received_.size();
 }
 
 bool Client::isServed() {

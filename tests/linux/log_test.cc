@@ -214,18 +214,13 @@ TEST_F(LogDeathTest, LinesLeaveBeforeTheProcessHoweverItEnds) {
       testing::ResultOf([](const std::string& text) { return std::ranges::count(text, '\n'); },
                         testing::Ge(5000)),
       testing::Not(HasSubstr("not asked for")));
-  EXPECT_EXIT(
-      {
-        logMany();
-        std::exit(3);
-      },
-      testing::ExitedWithCode(3), everyLine);
-  EXPECT_EXIT(
-      {
-        logMany();
-        ExitProcess(2);
-      },
-      testing::ExitedWithCode(2), everyLine);
+  const struct {
+    void (*end)();
+    int status;
+  } endings[] = {{[] { std::exit(3); }, 3}, {[] { ExitProcess(2); }, 2}};
+  for (const auto& [end, status] : endings) {
+    EXPECT_EXIT((logMany(), end()), testing::ExitedWithCode(status), everyLine);
+  }
   EXPECT_EXIT(
       {
         std::atexit([] {

@@ -226,15 +226,15 @@ TEST_F(StoreTest, HoldsSendersBackAtItsBoundsAndKeepsEveryRow) {
 TEST_F(StoreTest, AFullDiskDelaysRowsAndLosesNone) {
   FileCalls& files = FileCalls::watch(directory_);
   auto store = open({.queueRows = 50});
-  files.setFull(true);
+  files.inject(FileCalls::fullDisk());
   std::thread sender([&] {
     for (int i = 0; i < 200; ++i) ASSERT_TRUE(send(*store, i));
   });
-  files.awaitRefusedWrites(3);
+  files.awaitFailedCalls(3);
   Await([&] { return store->counters().waiting == 50; });
   EXPECT_THAT(LogRecorder::takeErrors(), ElementsAre(AllOf(HasSubstr("fails"), HasSubstr("full"))))
       << "one line however often it is tried";
-  files.setFull(false);
+  files.lift();
   sender.join();
   store->close();
   EXPECT_THAT(store->counters(), AllOf(IsBalanced(), Field(&StoreCounters::stored, 200)));
@@ -248,11 +248,11 @@ TEST_F(StoreTest, ClosingOnAFullDiskCountsWhatIsLost) {
   FileCalls& files = FileCalls::watch(directory_);
   auto store = open({.queueRows = 5});
   sendAndAwait(*store, 0);
-  files.setFull(true);
+  files.inject(FileCalls::fullDisk());
   for (int i = 1; i <= 5; ++i) ASSERT_TRUE(send(*store, i));
   auto flushed = flush(*store, 1);
   auto heldBack = std::async(std::launch::async, [&] { return send(*store, 6); });
-  files.awaitRefusedWrites(1);
+  files.awaitFailedCalls(1);
   store->close();
 
   EXPECT_THAT(flushed.get()->description(), HasSubstr("quarvel.store 2"));
@@ -373,14 +373,14 @@ TEST_F(StoreTest, OpensLaterWhenTheDiskHasNoRoomAtFirst) {
   store.reset();
 
   FileCalls& files = FileCalls::watch(directory_);
-  files.setFull(true);
+  files.inject(FileCalls::fullDisk());
   store = open({.firstBackOff = 1ms});
   EXPECT_THAT(store->state().problem.value_or(""), HasSubstr("quarvel.store"));
   const std::int64_t second = addSession(*store);
   ASSERT_TRUE(store->addMessage({second, 1, "client", "service", 1, 2, payload(1)}));
   auto flushed = flush(*store, second);
-  files.awaitRefusedWrites(3);
-  files.setFull(false);
+  files.awaitFailedCalls(3);
+  files.lift();
   EXPECT_EQ(flushed.get(), std::nullopt);
   EXPECT_EQ(store->state().problem, std::nullopt);
   store->close();
