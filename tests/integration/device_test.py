@@ -97,6 +97,28 @@ class Preferences(ServiceTest):
         self.assertEqual(["device_name" in json.loads(row[0]) for row in service.rows(
             "SELECT user_info FROM agent_session ORDER BY id")], [False, True])
 
+    def test_verbose_lines_are_switched_on_before_the_start_and_off_after_it(self):
+        service = self.prepared()
+        service.prefer(reporting_server_verbose=True, reporting_session_verbose=True)
+        service.start()
+        self.addCleanup(service.finish)
+        client = self.client(service)
+        client.start_session(1)
+
+        def verbose_scopes():
+            """Of what two broadcasts write; once the second one's line is there, so is all of the first."""
+            before = len(service.log())
+            client.message({}, None)
+            client.message({}, None)
+            eventually(lambda: service.log()[before:].count("active reporting sessions") == 2, "the second broadcast")
+            return set(re.findall(r" debug tarnwick\.quarvel\[(\w+)\]", service.log()[before:]))
+
+        self.assertEqual(verbose_scopes(), {"zqrr", "zqrs"})
+        service.prefer(reporting_session_verbose=True)
+        self.assertEqual(verbose_scopes(), {"zqrr", "zqrs"}, "nobody has been told yet")
+        service.notify()
+        eventually(lambda: verbose_scopes() == {"zqrr"}, "one of them is switched off")
+
     def test_unwanted_events_are_not_recorded(self):
         service = self.service('[analytics]\nwanted = ["tarnwick.quarvel.HAL_*"]\n')
         client = self.client(service)
