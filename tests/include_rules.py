@@ -67,17 +67,6 @@ def faults(root):
                     yield f"{path}:{number}: {reason}"
 
 
-ALLOWED = [
-    ("base/Json.cc", "<rapidjson/writer.h>"),
-    ("platform/Log.h", "<fmt/format.h>"),
-    ("platform/linux/connection/Listener.cc", "<asio.hpp>"),
-    ("Statistics/Service/main.cc", '"platform/ServiceListener.h"'),
-    ("client/Channel.cc", "<sys/socket.h>"),
-    ("tools/Store.cc", "<sqlite3.h>"),
-    ("examples/client.c", "<quarvel/quarvel.h>"),
-    ("tools/PreferencesFile.cc", "<toml++/toml.h>"),
-    ("tests/platform/Scheduler.cc", '"platform/linux/work/Work.h"'),
-]
 FORBIDDEN = [
     ("base/Value.h", '"platform/Clock.h"'),
     ("base/Value.h", "<unistd.h>"),
@@ -101,15 +90,14 @@ FORBIDDEN = [
 
 def self_check():
     """Plants each case in a tree of its own and looks whether it is found."""
-    for cases, expected in ((ALLOWED, []), (FORBIDDEN, [2])):
-        for path, include in cases:
-            with tempfile.TemporaryDirectory() as root:
-                file = pathlib.Path(root, path)
-                file.parent.mkdir(parents=True)
-                file.write_text(f"// A planted case.\n#include {include}\n")
-                lines = [int(found.split(":")[1]) for found in faults(pathlib.Path(root))]
-                if lines != expected:
-                    yield f"{path} with {include}: faults in lines {lines}, expected {expected}"
+    for path, include in FORBIDDEN:
+        with tempfile.TemporaryDirectory() as root:
+            file = pathlib.Path(root, path)
+            file.parent.mkdir(parents=True)
+            file.write_text(f"// A planted case.\n#include {include}\n")
+            lines = [int(found.split(":")[1]) for found in faults(pathlib.Path(root))]
+            if lines != [2]:
+                yield f"{path} with {include}: faults in lines {lines}, expected one in line 2"
 
 
 def main():

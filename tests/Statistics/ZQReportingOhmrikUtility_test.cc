@@ -9,7 +9,6 @@ namespace {
 
 using testing::ElementsAre;
 using testing::ElementsAreArray;
-using testing::IsEmpty;
 
 struct Sinks {
   explicit Sinks(const Dictionary& userInfo = {}) { session.merge(userInfo); }
@@ -22,29 +21,6 @@ struct Sinks {
   Simulation simulation{1};
   SharedDictionary session;
 };
-
-TEST(Vistrel, EveryMessageIsAnEventOfTheSessionsApplication) {
-  struct Case {
-    Dictionary userInfo;
-    std::optional<Dictionary> event;
-    Dictionary payload;
-  };
-  const Case kCases[] = {
-      {{}, {{{"a", 1}}}, {{"a", 1}, {"HostApplicationDisplayID", "Unknown"}}},
-      {{{"HostApplicationDisplayID", "Music"}},
-       {{{"HostApplicationDisplayID", "forged"}, {"a b", 1}}},
-       {{"HostApplicationDisplayID", "Music"}, {"a b", 1}}},
-      {{}, std::nullopt, {{"HostApplicationDisplayID", "Unknown"}}},
-  };
-  for (const Case& each : kCases) {
-    Sinks sinks(each.userInfo);
-    sinks.offer(each.event, 0x10000003, 2);
-    ASSERT_EQ(sinks.simulation.vistrel.events.size(), 1U);
-    EXPECT_EQ(sinks.simulation.vistrel.events[0].name, "tarnwick.quarvel.DSP_Playback.Stop");
-    EXPECT_EQ(sinks.simulation.vistrel.events[0].payload.root().toDictionary(), each.payload);
-    EXPECT_THAT(sinks.simulation.ohmrik.records, IsEmpty());
-  }
-}
 
 TEST(Vistrel, UnknownCodesHaveNamesToo) {
   Sinks sinks;

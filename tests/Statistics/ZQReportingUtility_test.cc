@@ -99,26 +99,24 @@ TEST(Vocabulary, TheHostApplicationIsWhateverValueThereIs) {
 }
 
 // A wait of nine seconds, and somebody who touches its condition now and then.
-struct Wait {
-  explicit Wait(std::uint64_t seed) : simulation(seed) {
-    simulation.spawn("waiter", [this] {
-      result = ZQReportingUtilityWait(*condition, &done, "waiting", "too late", log, 9.0);
-      endedAt = simulation.elapsed();
+struct Wait : Simulation {
+  explicit Wait(std::uint64_t seed) : Simulation(seed) {
+    spawn("waiter", [this] {
+      result = ZQReportingUtilityWait(*condition, &done, "waiting", "too late", nullptr, 9.0);
+      endedAt = elapsed();
     });
   }
   void touchAt(Scheduler::Duration at, bool set) {
-    simulation.spawn("setter", [this, at, set] {
-      simulation.scheduler.sleep(at);
+    spawn("setter", [this, at, set] {
+      scheduler.sleep(at);
       const BasicMutexLock<Condition> lock(*condition);
       done = done || set;
       condition->signal();
     });
   }
 
-  Simulation simulation;
   std::shared_ptr<Condition> condition = CreateCondition();
   bool done = false;
-  const LogHandle* log = nullptr;
   std::optional<bool> result;
   Scheduler::Duration endedAt{0};
 };
@@ -155,46 +153,30 @@ TEST(Wait, EndsWhenTheFlagIsSetOrAFullPeriodAfterTheLastWakeUp) {
       SCOPED_TRACE(each.name);
       Wait wait(seed);
       for (const auto& [at, set] : each.touches) wait.touchAt(at, set);
-      wait.simulation.run();
+      wait.run();
       EXPECT_EQ(wait.result, each.result);
       EXPECT_EQ(wait.endedAt, each.endedAt);
-      EXPECT_THAT(wait.simulation.log.texts(), ElementsAreArray(each.lines));
+      EXPECT_THAT(wait.log.texts(), ElementsAreArray(each.lines));
     }
   }
 }
 
-TEST(Wait, AFlagThatIsSetAlreadyNeedsNeitherTimeNorLog) {
-  for (const auto seed : Seeds()) {
-    Wait wait(seed);
-    wait.done = true;
-    wait.simulation.run();
-    EXPECT_EQ(wait.result, true);
-    EXPECT_EQ(wait.endedAt, 0s);
-    EXPECT_THAT(wait.simulation.log.texts(), IsEmpty());
-  }
+SEEDED_TEST(Wait, AFlagThatIsSetAlreadyNeedsNeitherTimeNorLog, Wait) {
+  done = true;
+  run();
+  EXPECT_EQ(result, true);
+  EXPECT_EQ(endedAt, 0s);
+  EXPECT_THAT(log.texts(), IsEmpty());
 }
 
-TEST(Wait, WakeUpsForNothingDoNotEndItEarly) {
-  for (const auto seed : Seeds()) {
-    Wait wait(seed);
-    wait.simulation.spuriousWakeUps = true;
-    wait.simulation.run();
-    EXPECT_EQ(wait.result, false);
-    const auto lines = wait.simulation.log.texts();
-    EXPECT_GE(wait.endedAt, 9s);
-    EXPECT_EQ(wait.endedAt == 9s, lines.size() == 2);
-    EXPECT_EQ(lines.back(), kTooLate);
-  }
-}
-
-TEST(Wait, LogsToTheScopeItIsGiven) {
-  Wait wait(1);
-  const LogHandle scope = ZQLogRegister(FourCharacterCode("zqtt"), "zqtt", "tests", "", 1, 31);
-  wait.log = &scope;
-  wait.simulation.run();
-  EXPECT_THAT(wait.simulation.log.texts(),
-              ElementsAre("default zqtt ZQReportingUtilityWait: waiting",
-                          "error zqtt ZQReportingUtilityWait: too late"));
+SEEDED_TEST(Wait, WakeUpsForNothingDoNotEndItEarly, Wait) {
+  spuriousWakeUps = true;
+  run();
+  EXPECT_EQ(result, false);
+  const auto lines = log.texts();
+  EXPECT_GE(endedAt, 9s);
+  EXPECT_EQ(endedAt == 9s, lines.size() == 2);
+  EXPECT_EQ(lines.back(), kTooLate);
 }
 
 }  // namespace

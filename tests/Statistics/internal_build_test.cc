@@ -39,34 +39,33 @@ TEST_F(InternalBuild, WritesTheHistoryOfARun) {
   };
   for (const Case& each : kCases) {
     SessionOwner owner(1, each.serviceType);
-    owner.simulation.files.diagnosticsPrefix = "/prefix";
+    owner.files.diagnosticsPrefix = "/prefix";
     owner.session->setConfiguration(each.userInfo);
     owner.start();
     owner.send({{"a b", List{1, 2.5}}});
-    owner.simulation.runFor(1s);
+    owner.runFor(1s);
     owner.stop();
-    ASSERT_THAT(owner.simulation.files.files,
+    ASSERT_THAT(owner.files.files,
                 ElementsAre(Pair(
                     "/prefix" + kDirectory + "/20260131-142641+0100-quarvel-" + each.name + ".json",
                     testing::HasSubstr("\n"))));
-    const auto content = ValueFromJson(owner.simulation.files.files.begin()->second);
+    const auto content = ValueFromJson(owner.files.files.begin()->second);
     ASSERT_TRUE(content.ok());
     EXPECT_EQ(content.value(),
               Value(List{each.userInfo,
                          Dictionary{{"Playback_Start_1", Dictionary{{"a_b", List{1, 2.5}}}}}}));
-    EXPECT_THAT(owner.simulation.files.directories,
-                ElementsAre(Pair("/prefix" + kDirectory, 0777)));
+    EXPECT_THAT(owner.files.directories, ElementsAre(Pair("/prefix" + kDirectory, 0777)));
   }
 }
 
 TEST_F(InternalBuild, AFileThatCannotBeWrittenCostsTheSummaryNothing) {
   SessionOwner owner(1);
-  owner.simulation.files.directoryError = Error::because("files", 13, "no");
-  owner.simulation.files.writeError = Error::because("files", 2, "nowhere");
+  owner.files.directoryError = Error::because("files", 13, "no");
+  owner.files.writeError = Error::because("files", 2, "nowhere");
   owner.start();
   owner.send();
   owner.stop();
-  owner.simulation.run();
+  owner.run();
   EXPECT_EQ(owner.delivered().size(), 2U);
   const std::string function = "error zqrr -[ZQReportingSession createSummaryEventForSession]: ";
   EXPECT_THAT(owner.errors(), ElementsAre(function + "can't create logging directory at " +
@@ -86,30 +85,30 @@ TEST_F(InternalBuild, OrientationIsFollowedForSomeServiceTypesAndDevices) {
     SCOPED_TRACE(each.serviceType);
     SessionOwner owner(1, each.serviceType);
     if (each.deviceClass) {
-      owner.simulation.deviceProperties["DeviceClassNumber"] = *each.deviceClass;
+      owner.deviceProperties["DeviceClassNumber"] = *each.deviceClass;
     }
     owner.start();
     const std::size_t expected = each.followed ? 1 : 0;
-    EXPECT_EQ(owner.simulation.orientation.device.count("ZQReportingService 7"), expected);
-    EXPECT_EQ(owner.simulation.orientation.ui.count("ZQReportingService 7"), expected);
+    EXPECT_EQ(owner.orientation.device.count("ZQReportingService 7"), expected);
+    EXPECT_EQ(owner.orientation.ui.count("ZQReportingService 7"), expected);
     owner.stop();
-    EXPECT_THAT(owner.simulation.orientation.device, IsEmpty());
-    EXPECT_THAT(owner.simulation.orientation.ui, IsEmpty());
+    EXPECT_THAT(owner.orientation.device, IsEmpty());
+    EXPECT_THAT(owner.orientation.ui, IsEmpty());
   }
 }
 
 TEST_F(InternalBuild, OrientationChangesAreInTheHistoryToTheMillisecond) {
   for (const auto seed : Seeds()) {
     SessionOwner owner(seed, kServiceTypeTelephony);
-    owner.simulation.log.verbose = {"zqrr"};
+    owner.log.verbose = {"zqrr"};
     owner.session->setConfiguration(Dictionary{{"HostApplicationDisplayID", "Phone"}});
     owner.start();
-    owner.simulation.runFor(1234560us);
-    owner.simulation.log.lines.clear();
-    owner.simulation.orientation.turnDevice(Orientation::landscapeLeft);
-    owner.simulation.runFor(1s);
-    owner.simulation.orientation.turnUI(Orientation::portrait);
-    owner.simulation.runFor(0s);
+    owner.runFor(1234560us);
+    owner.log.lines.clear();
+    owner.orientation.turnDevice(Orientation::landscapeLeft);
+    owner.runFor(1s);
+    owner.orientation.turnUI(Orientation::portrait);
+    owner.runFor(0s);
     std::vector<Dictionary> entries;
     owner.session->aggregatedPayloadData()->forEach(
         [](const MessageIdentity&, const Payload&) { ADD_FAILURE(); },
@@ -121,7 +120,7 @@ TEST_F(InternalBuild, OrientationChangesAreInTheHistoryToTheMillisecond) {
             Dictionary{{"ui_orientation", "portrait"}, {"ui_orientation_time", 2.235}}));
     const std::string line =
         "debug zqrr -[ZQReportingSession start]_block_invoke: Orientation handler callback ";
-    EXPECT_THAT(owner.simulation.log.texts(),
+    EXPECT_THAT(owner.log.texts(),
                 ElementsAre(line + "mode=device orientation=\"landscapeLeft\" app=\"Phone\", "
                                    "time=1.235, id=\"ZQReportingService 7\"",
                             line + "mode=ui orientation=\"portrait\" app=\"Phone\", time=2.235, "

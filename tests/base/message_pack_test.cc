@@ -56,25 +56,6 @@ TEST(MessagePack, EveryFormComesBackAsItWasWritten) {
   }
 }
 
-TEST(MessagePackScanner, FindsTheSameEndHoweverBytesArrive) {
-  const std::string first = Encoded(List{1, "a longer text than the others", List{2, Dictionary{}},
-                                         Dictionary{{"k", List{}}}, Bytes{"xyz"}, Date{}, "last"});
-  for (const std::string& next : {std::string(), Encoded(List{1, 2, 3})}) {
-    const std::string both = first + next;
-    for (std::size_t step = 1; step <= both.size(); ++step) {
-      MessagePackScanner scanner(1 << 20, 4);
-      for (std::size_t arrived = std::min(step, both.size());; arrived += step) {
-        const std::size_t now = std::min(arrived, both.size());
-        const Progress progress = scanner.scan(std::string_view(both).substr(0, now));
-        ASSERT_EQ(progress, now >= first.size() ? Progress::complete : Progress::incomplete)
-            << "after " << now << " bytes in steps of " << step;
-        if (progress == Progress::complete) break;
-      }
-      ASSERT_EQ(scanner.length(), first.size());
-    }
-  }
-}
-
 TEST(MessagePackScanner, RefusesLiesBeforeTheirBytesArrive) {
   const struct {
     const char* name;

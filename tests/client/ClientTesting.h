@@ -1,5 +1,7 @@
 #pragma once
 
+#include <gtest/gtest.h>
+
 #include <chrono>
 #include <future>
 #include <memory>
@@ -7,6 +9,8 @@
 #include <utility>
 
 #include <quarvel/client.hpp>
+
+#include "tests/client/FakeService.h"
 
 namespace quarvel::test {
 
@@ -32,6 +36,31 @@ class Expected {
  private:
   std::shared_ptr<std::promise<Result<T>>> promise_ = std::make_shared<std::promise<Result<T>>>();
   std::future<Result<T>> future_ = promise_->get_future();
+};
+
+/// A client that the test itself drives, unless the options are made to say otherwise, and its
+/// service.
+class DrivenClient : public ::testing::Test {
+ protected:
+  DrivenClient() {
+    options_.socketPath = service_.path();
+    options_.driver = Client::Driver::caller;
+  }
+  Client& connect() {
+    auto connected = Client::connect(options_);
+    EXPECT_TRUE(connected.ok()) << Text(connected);
+    client_ = std::make_unique<Client>(std::move(connected.value()));
+    service_.accept();
+    return *client_;
+  }
+  template <class Done>
+  void driveUntil(Done done) {
+    while (!done()) client_->dispatch(std::nullopt);
+  }
+
+  FakeService service_;
+  Client::Options options_;
+  std::unique_ptr<Client> client_;
 };
 
 }  // namespace quarvel::test

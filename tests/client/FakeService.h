@@ -1,20 +1,17 @@
 #pragma once
 
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
-#include <cstdlib>
-#include <cstring>
 #include <filesystem>
 #include <optional>
-#include <stdexcept>
 #include <string>
 #include <string_view>
 #include <utility>
 
 #include "base/MessagePack.h"
 #include "base/Payload.h"
+#include "tests/TemporaryDirectory.h"
+#include "tests/UnixSocket.h"
 
 namespace quarvel::test {
 
@@ -22,33 +19,20 @@ namespace quarvel::test {
 /// for one and replies what the test says.
 class FakeService {
  public:
-  FakeService() {
-    char directory[] = "/tmp/quarvel-client-XXXXXX";
-    if (::mkdtemp(directory) == nullptr) throw std::runtime_error("no temporary directory");
-    directory_ = directory;
-    path_ = directory_ / "reporting.sock";
-    listen();
-  }
+  FakeService() { listen(); }
   void listen() {
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::strncpy(address.sun_path, path_.c_str(), sizeof address.sun_path - 1);
-    listener_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    if (::bind(listener_, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
-        ::listen(listener_, 8) != 0) {
-      throw std::runtime_error("the fake service cannot listen");
-    }
+    listener_ = BoundSocket(path(), SOCK_STREAM);
+    EXPECT_EQ(::listen(listener_, 8), 0);
   }
   ~FakeService() {
     hangUp();
     stopListening();
-    std::filesystem::remove_all(directory_);
   }
   FakeService(const FakeService&) = delete;
   FakeService& operator=(const FakeService&) = delete;
 
-  [[nodiscard]] const std::filesystem::path& directory() const { return directory_; }
-  [[nodiscard]] std::string path() const { return path_.string(); }
+  [[nodiscard]] const std::filesystem::path& directory() const { return directory_.path(); }
+  [[nodiscard]] std::string path() const { return directory() / "reporting.sock"; }
 
   void accept() { connection_ = ::accept(listener_, nullptr, nullptr); }
   void hangUp() {
@@ -103,8 +87,7 @@ class FakeService {
   void reply(const Value& call, const Value& result) { send(response(call, nullptr, result)); }
 
  private:
-  std::filesystem::path directory_;
-  std::filesystem::path path_;
+  const TemporaryDirectory directory_;
   int listener_ = -1;
   int connection_ = -1;
   std::string received_;

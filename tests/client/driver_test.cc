@@ -1,18 +1,13 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <poll.h>
-#include <sys/epoll.h>
 #include <sys/wait.h>
 
 #include <asio.hpp>
 #include <filesystem>
-#include <memory>
 #include <thread>
 
-#include <quarvel/client.hpp>
-
 #include "tests/client/ClientTesting.h"
-#include "tests/client/FakeService.h"
 
 // A client without a thread: the program's own loop drives it.
 
@@ -20,7 +15,6 @@ namespace quarvel {
 namespace {
 
 using test::Expected;
-using test::FakeService;
 using test::IsCode;
 using test::Text;
 using vocabulary::Kind;
@@ -28,71 +22,15 @@ using namespace std::chrono_literals;
 
 const auto kGeneric = Client::MessageType::generic;
 
-class DrivenClient : public ::testing::Test {
+class DrivenClient : public test::DrivenClient {
  protected:
-  DrivenClient() {
-    options_.socketPath = service_.path();
-    options_.driver = Client::Driver::caller;
-  }
-  Client& connect() {
-    auto connected = Client::connect(options_);
-    EXPECT_TRUE(connected.ok()) << Text(connected);
-    client_ = std::make_unique<Client>(std::move(connected.value()));
-    service_.accept();
-    return *client_;
-  }
   /// Replies true to `calls` calls, on a thread of its own.
   std::jthread replying(int calls) {
     return std::jthread([this, calls] {
       for (int i = 0; i < calls; ++i) service_.reply(*service_.receive(), true);
     });
   }
-
-  FakeService service_;
-  Client::Options options_;
-  std::unique_ptr<Client> client_;
 };
-
-using Loop = void (*)(Client& client, const bool& done);
-
-struct LoopCase {
-  const char* name;
-  Loop run;
-};
-void PrintTo(const LoopCase& loop, std::ostream* out) {
-  *out << loop.name;
-}
-
-class EveryLoop : public DrivenClient, public ::testing::WithParamInterface<LoopCase> {};
-
-// More than the socket takes at once, so that the loop must write what the calls could not.
-TEST_P(EveryLoop, CarriesCallsOutAndGivesReplies) {
-  constexpr int kCalls = 500;
-  Client& client = connect();
-  const auto threads = [] {
-    const std::filesystem::directory_iterator tasks("/proc/self/task");
-    return std::distance(begin(tasks), end(tasks));
-  };
-  const std::jthread service = replying(kCalls);
-  const auto before = threads();
-  const Dictionary large{{"Samples", std::string(4'096, 'x')}};
-  int replies = 0;
-  bool done = false;
-  for (int i = 0; i < kCalls; ++i) {
-    const auto taken = client.setConfiguration(large, i, [&](const Result<bool>& reply) {
-      EXPECT_TRUE(reply.ok()) << Text(reply);
-      done = ++replies == kCalls;
-    });
-    ASSERT_EQ(taken, Client::Code::none);
-  }
-  EXPECT_EQ(threads(), before) << "none of the library's own";
-  GetParam().run(client, done);
-  EXPECT_EQ(replies, kCalls);
-}
-
-void DispatchAlone(Client& client, const bool& done) {
-  while (!done) client.dispatch(std::nullopt);
-}
 
 void Poll(Client& client, const bool& done) {
   while (!done) {
@@ -100,17 +38,6 @@ void Poll(Client& client, const bool& done) {
     ASSERT_EQ(::poll(&due, 1, 60'000), 1);
     client.dispatch();
   }
-}
-
-void EdgeTriggeredEpoll(Client& client, const bool& done) {
-  const int epoll = ::epoll_create1(EPOLL_CLOEXEC);
-  epoll_event event{EPOLLIN | EPOLLET, {}};
-  ASSERT_EQ(::epoll_ctl(epoll, EPOLL_CTL_ADD, client.descriptor(), &event), 0);
-  while (!done) {
-    ASSERT_EQ(::epoll_wait(epoll, &event, 1, 60'000), 1);
-    client.dispatch();
-  }
-  ::close(epoll);
 }
 
 void Asio(Client& client, const bool& done) {
@@ -127,12 +54,34 @@ void Asio(Client& client, const bool& done) {
   due.release();  // the descriptor is the client's
 }
 
-INSTANTIATE_TEST_SUITE_P(Loops, EveryLoop,
-                         ::testing::Values(LoopCase{"dispatch", DispatchAlone},
-                                           LoopCase{"poll", Poll},
-                                           LoopCase{"epoll", EdgeTriggeredEpoll},
-                                           LoopCase{"asio", Asio}),
-                         [](const auto& tested) { return tested.param.name; });
+// More than the socket takes at once, so that the loop must write what the calls could not.
+TEST_F(DrivenClient, EveryLoopCarriesCallsOutAndGivesReplies) {
+  constexpr int kCalls = 500;
+  const auto threads = [] {
+    const std::filesystem::directory_iterator tasks("/proc/self/task");
+    return std::distance(begin(tasks), end(tasks));
+  };
+  for (const auto run : {Poll, Asio}) {
+    Client& client = connect();
+    const std::jthread service = replying(kCalls);
+    const auto before = threads();
+    const Dictionary large{{"Samples", std::string(4'096, 'x')}};
+    int replies = 0;
+    bool done = false;
+    for (int i = 0; i < kCalls; ++i) {
+      const auto taken = client.setConfiguration(large, i, [&](const Result<bool>& reply) {
+        EXPECT_TRUE(reply.ok()) << Text(reply);
+        done = ++replies == kCalls;
+      });
+      ASSERT_EQ(taken, Client::Code::none);
+    }
+    EXPECT_EQ(threads(), before) << "none of the library's own";
+    run(client, done);
+    EXPECT_EQ(replies, kCalls);
+    client_.reset();
+    service_.hangUp();
+  }
+}
 
 TEST_F(DrivenClient, NothingIsDueWhileNothingHappens) {
   Client& client = connect();

@@ -8,9 +8,7 @@
 #include <linux/seccomp.h>
 #include <pthread.h>
 #include <sys/prctl.h>
-#include <sys/socket.h>
 #include <sys/syscall.h>
-#include <sys/un.h>
 #include <ucontext.h>
 #include <unistd.h>
 
@@ -25,6 +23,9 @@
 #include <string>
 #include <thread>
 #include <vector>
+
+#include "tests/TemporaryDirectory.h"
+#include "tests/UnixSocket.h"
 
 // Watches a producer's thread while it records: every allocation and every lock goes through the
 // functions below, which stand before the C library's for the whole process, the shared library
@@ -84,31 +85,17 @@ void free(void* memory) {
   __libc_free(memory);
 }
 
-int pthread_mutex_lock(pthread_mutex_t* mutex) noexcept {
-  static const auto next = Next<int (*)(pthread_mutex_t*)>("pthread_mutex_lock");
-  Note("pthread_mutex_lock");
-  return next(mutex);
-}
-int pthread_mutex_trylock(pthread_mutex_t* mutex) noexcept {
-  static const auto next = Next<int (*)(pthread_mutex_t*)>("pthread_mutex_trylock");
-  Note("pthread_mutex_trylock");
-  return next(mutex);
-}
-int pthread_rwlock_rdlock(pthread_rwlock_t* lock) noexcept {
-  static const auto next = Next<int (*)(pthread_rwlock_t*)>("pthread_rwlock_rdlock");
-  Note("pthread_rwlock_rdlock");
-  return next(lock);
-}
-int pthread_rwlock_wrlock(pthread_rwlock_t* lock) noexcept {
-  static const auto next = Next<int (*)(pthread_rwlock_t*)>("pthread_rwlock_wrlock");
-  Note("pthread_rwlock_wrlock");
-  return next(lock);
-}
-int pthread_spin_lock(pthread_spinlock_t* lock) noexcept {
-  static const auto next = Next<int (*)(pthread_spinlock_t*)>("pthread_spin_lock");
-  Note("pthread_spin_lock");
-  return next(lock);
-}
+#define QUARVEL_NOTE_LOCK(name, Lock)                     \
+  int name(Lock* lock) noexcept {                         \
+    static const auto next = Next<int (*)(Lock*)>(#name); \
+    Note(#name);                                          \
+    return next(lock);                                    \
+  }
+QUARVEL_NOTE_LOCK(pthread_mutex_lock, pthread_mutex_t)
+QUARVEL_NOTE_LOCK(pthread_mutex_trylock, pthread_mutex_t)
+QUARVEL_NOTE_LOCK(pthread_rwlock_rdlock, pthread_rwlock_t)
+QUARVEL_NOTE_LOCK(pthread_rwlock_wrlock, pthread_rwlock_t)
+QUARVEL_NOTE_LOCK(pthread_spin_lock, pthread_spinlock_t)
 
 }  // extern "C"
 
@@ -187,13 +174,6 @@ std::vector<std::string> Watch(Produce produce) {
 class Sink {
  public:
   Sink() {
-    char directory[] = "/tmp/quarvel-realtime-XXXXXX";
-    path_ = std::string(::mkdtemp(directory)) + "/reporting.sock";
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    path_.copy(address.sun_path, sizeof address.sun_path - 1);
-    listener_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    EXPECT_EQ(::bind(listener_, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
     EXPECT_EQ(::listen(listener_, 1), 0);
     reader_ = std::jthread([this] {
       const int connection = ::accept(listener_, nullptr, nullptr);
@@ -206,16 +186,14 @@ class Sink {
     ::shutdown(listener_, SHUT_RDWR);
     reader_.join();
     ::close(listener_);
-    ::unlink(path_.c_str());
-    ::rmdir(path_.substr(0, path_.rfind('/')).c_str());
   }
   Sink(const Sink&) = delete;
   Sink& operator=(const Sink&) = delete;
-  [[nodiscard]] const std::string& path() const { return path_; }
+  [[nodiscard]] std::string path() const { return directory_.path() / "reporting.sock"; }
 
  private:
-  std::string path_;
-  int listener_ = -1;
+  const TemporaryDirectory directory_;
+  const int listener_ = BoundSocket(path(), SOCK_STREAM);
   std::jthread reader_;
 };
 

@@ -4,18 +4,15 @@
 #include <gtest/gtest.h>
 #include <poll.h>
 
-#include <memory>
 #include <thread>
 #include <vector>
 
 #include "base/Json.h"
 #include "tests/client/ClientTesting.h"
-#include "tests/client/FakeService.h"
 
 namespace quarvel {
 namespace {
 
-using test::FakeService;
 using vocabulary::Component;
 using vocabulary::Kind;
 using namespace std::chrono_literals;
@@ -25,32 +22,21 @@ using ::testing::ElementsAre;
 const RealtimeReporter::Category kPlayback(Component::hal, Kind::playback);
 const auto kSetup = RealtimeReporter::MessageType::setup;
 
-class RealtimeReporterTest : public ::testing::Test {
+class RealtimeReporterTest : public test::DrivenClient {
  protected:
   RealtimeReporterTest() {
-    client_.socketPath = service_.path();
-    client_.driver = Client::Driver::caller;
     reporter_.interval = 1ms;
     reporter_.lost = [this](const Loss& loss) { losses_.push_back(loss); };
   }
   RealtimeReporter& report() {
-    connected_ = std::make_unique<Client>(std::move(Client::connect(client_).value()));
-    service_.accept();
-    reporting_ = std::make_unique<RealtimeReporter>(*connected_, 7, reporter_);
+    reporting_ = std::make_unique<RealtimeReporter>(connect(), 7, reporter_);
     return *reporting_;
-  }
-  template <class Done>
-  void drive(Done done) {
-    while (!done()) connected_->dispatch(std::nullopt);
   }
   bool record(int number) { return reporting_->record(kPlayback, kSetup).set("n", number).send(); }
   std::string message() { return JsonText((*service_.receive()->list()).back()); }
 
-  FakeService service_;
-  Client::Options client_;
   RealtimeReporter::Options reporter_;
   std::vector<Loss> losses_;
-  std::unique_ptr<Client> connected_;
   std::unique_ptr<RealtimeReporter> reporting_;
 };
 
@@ -123,16 +109,16 @@ TEST_F(RealtimeReporterTest, WhatIsLostIsCountedAndToldOfAndTheRestIsWhole) {
 
 TEST_F(RealtimeReporterTest, TheDriverEmptiesItWhileItIsStartedAndSleepsOtherwise) {
   RealtimeReporter& reporter = report();
-  pollfd due{connected_->descriptor(), POLLIN, 0};
+  pollfd due{client_->descriptor(), POLLIN, 0};
   record(1);
   EXPECT_EQ(::poll(&due, 1, 20), 0) << "not started";
   reporter.start();
   reporter.start();
-  drive([&] { return reporter.statistics().sent == 1; });
+  driveUntil([&] { return reporter.statistics().sent == 1; });
   record(2);
-  drive([&] { return reporter.statistics().sent == 2; });
+  driveUntil([&] { return reporter.statistics().sent == 2; });
   reporter.stop();
-  connected_->dispatch(10ms);  // the last wake-up
+  client_->dispatch(10ms);  // the last wake-up
   EXPECT_EQ(::poll(&due, 1, 20), 0) << "stopped";
   record(3);
   EXPECT_EQ(::poll(&due, 1, 20), 0);
@@ -140,15 +126,15 @@ TEST_F(RealtimeReporterTest, TheDriverEmptiesItWhileItIsStartedAndSleepsOtherwis
 }
 
 TEST_F(RealtimeReporterTest, RecordsWaitForTheConnectionThatIsMadeAgain) {
-  client_.reconnect = Client::Reconnect{1ms, 4ms};
+  options_.reconnect = Client::Reconnect{1ms, 4ms};
   RealtimeReporter& reporter = report();
   reporter.start();
   service_.hangUp();
-  drive([&] { return !connected_->connected(); });
+  driveUntil([&] { return !client_->connected(); });
   record(1);
   reporter.stop();
   EXPECT_EQ(reporter.statistics().sent, 0U);
-  drive([&] { return reporter.statistics().sent == 1; });
+  driveUntil([&] { return reporter.statistics().sent == 1; });
   service_.accept();
   EXPECT_EQ(message(), R"([{"n":1},536870915,3,[7]])");
 }
@@ -156,18 +142,18 @@ TEST_F(RealtimeReporterTest, RecordsWaitForTheConnectionThatIsMadeAgain) {
 TEST_F(RealtimeReporterTest, RecordsThatNobodyWillSendAreLost) {
   RealtimeReporter& reporter = report();
   service_.hangUp();
-  drive([&] { return !connected_->connected(); });
+  driveUntil([&] { return !client_->connected(); });
   record(1);
   reporter.stop();
   EXPECT_EQ(reporter.statistics().lost, (Loss{0, 0, 0, 1}));
   record(2);
-  connected_.reset();
+  client_.reset();
   reporting_.reset();
   EXPECT_THAT(losses_, ElementsAre(Loss{0, 0, 0, 1}, Loss{0, 0, 0, 1}));
 }
 
 TEST_F(RealtimeReporterTest, AServiceThatIsSlowCostsRecordsOnlyWhenTheRingIsFull) {
-  client_.gatheredBytes = 1'000;
+  options_.gatheredBytes = 1'000;
   reporter_.records = 4'096;
   RealtimeReporter& reporter = report();
   const std::string text(200, 'x');
@@ -179,14 +165,14 @@ TEST_F(RealtimeReporterTest, AServiceThatIsSlowCostsRecordsOnlyWhenTheRingIsFull
   std::jthread service([&] {
     for (std::uint64_t i = 0; i < taken; ++i) service_.receive();
   });
-  drive([&] { return reporter.statistics().sent == taken; });
+  driveUntil([&] { return reporter.statistics().sent == taken; });
   EXPECT_EQ(reporter.statistics().lost, (Loss{1, 0, 0, 0}));
 }
 
 // The client's own thread empties what another writes; both ends are compared.
 TEST_F(RealtimeReporterTest, EveryRecordArrivesOnceAndInItsOrderOrIsCounted) {
   constexpr std::uint64_t kRecords = 50'000;
-  client_.driver = Client::Driver::ownThread;
+  options_.driver = Client::Driver::ownThread;
   reporter_.records = 512;
   reporter_.lossMessage.reset();
   RealtimeReporter& reporter = report();
@@ -200,7 +186,7 @@ TEST_F(RealtimeReporterTest, EveryRecordArrivesOnceAndInItsOrderOrIsCounted) {
       while (reporter.statistics().sent == sent) std::this_thread::yield();
     }
     reporter.stop();
-    connected_->killService();  // the end of what is received
+    client_->killService();  // the end of what is received
   });
   std::uint64_t received = 0;
   std::int64_t last = -1;

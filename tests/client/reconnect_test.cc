@@ -1,14 +1,10 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include <memory>
 #include <vector>
-
-#include <quarvel/client.hpp>
 
 #include "base/Json.h"
 #include "tests/client/ClientTesting.h"
-#include "tests/client/FakeService.h"
 
 namespace quarvel {
 namespace {
@@ -16,7 +12,6 @@ namespace {
 using test::Expected;
 using test::FakeService;
 using test::IsCode;
-using test::Text;
 using vocabulary::Kind;
 using namespace std::chrono_literals;
 using Change = Client::ConnectionChange;
@@ -25,16 +20,12 @@ using ::testing::HasSubstr;
 
 const auto kGeneric = Client::MessageType::generic;
 
-class ReconnectTest : public ::testing::Test {
+class ReconnectTest : public test::DrivenClient {
  protected:
   ReconnectTest() {
-    Client::Options options;
-    options.socketPath = service_.path();
-    options.driver = Client::Driver::caller;
-    options.reconnect = Client::Reconnect{1ms, 4ms};
-    options.connectionChanged = [this](const Change& change) { changes_.push_back(change); };
-    client_ = std::make_unique<Client>(std::move(Client::connect(options).value()));
-    service_.accept();
+    options_.reconnect = Client::Reconnect{1ms, 4ms};
+    options_.connectionChanged = [this](const Change& change) { changes_.push_back(change); };
+    connect();
   }
 
   void receive(int calls) {
@@ -42,15 +33,11 @@ class ReconnectTest : public ::testing::Test {
   }
   void loseConnection() {
     service_.hangUp();
-    drive([&] { return !client_->connected(); });
+    driveUntil([&] { return !client_->connected(); });
   }
   void restoreConnection() {
-    drive([&] { return client_->connected(); });
+    driveUntil([&] { return client_->connected(); });
     service_.accept();
-  }
-  template <class Done>
-  void drive(Done done) {
-    while (!done()) client_->dispatch(std::nullopt);
   }
   /// The calls that the service has received next, without their numbers.
   std::vector<std::string> calls(int count) {
@@ -62,9 +49,7 @@ class ReconnectTest : public ::testing::Test {
     return calls;
   }
 
-  FakeService service_;
   std::vector<Change> changes_;
-  std::unique_ptr<Client> client_;
 };
 
 TEST_F(ReconnectTest, SessionsAreMadeAnewAsTheyWereAndMessagesAreNotRepeated) {
@@ -125,7 +110,7 @@ TEST_F(ReconnectTest, TheStartsReplyTellsOfTheEndOfTheNewStart) {
     }
     receive(1);
     service_.reply(*service_.receive(), true);
-    drive([&] { return stopped.given(); });
+    driveUntil([&] { return stopped.given(); });
     EXPECT_TRUE(stopped.get().value());
     client_->destroyReportingSession(7);
     receive(1);
@@ -174,7 +159,7 @@ TEST_F(ReconnectTest, WhatHadNotLeftIsCountedAndTheRestIsTriedUntilTheServiceIsB
   service_.stopListening();
   std::filesystem::remove(path);
   const auto later = std::chrono::steady_clock::now() + 50ms;
-  drive([&] { return std::chrono::steady_clock::now() > later; });
+  driveUntil([&] { return std::chrono::steady_clock::now() > later; });
   EXPECT_FALSE(client_->connected());
   EXPECT_EQ(changes_.size(), 1U) << "attempts that fail are no changes";
   service_.listen();

@@ -61,10 +61,8 @@ class ExportFixture : public StoreFixture {
     Await([this] { return !extent().storeID.empty(); });
   }
   void addMessages(int count, const Payload& payload = Payload(Dictionary{{"n", 1}})) {
-    for (int i = 0; i < count; ++i) {
-      ASSERT_TRUE(store_->addMessage({std::nullopt, 7, "client", "service", 1, 2, payload}));
-    }
-    Await([this] { return store_->counters().waiting == 0; });
+    for (int i = 0; i < count; ++i) ASSERT_TRUE(send(*store_, payload));
+    awaitStored(*store_);
     extended_ = true;
   }
   StoreExtent extent() {

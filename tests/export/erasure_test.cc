@@ -1,5 +1,6 @@
 #include <gmock/gmock.h>
 
+#include <algorithm>
 #include <fstream>
 #include <future>
 
@@ -18,14 +19,12 @@ class ErasureTest : public ExportFixture {
   static constexpr std::int64_t kErasedSession = 4102;
 
   void addSecret(std::int64_t sessionID, int count) {
-    const Payload info(Dictionary{{"App", "secret"}});
-    const auto session =
-        store_->addAgentSession({sessionID, 19, 2.0, true, "t", "client", "music", info});
+    const std::int64_t session =
+        addSession(*store_, sessionID, Payload(Dictionary{{"App", "secret"}}));
     for (int i = 0; i < count; ++i) {
       // So long that some rows have pages of their own.
       const Payload payload(Dictionary{{"secret", std::string(i % 10 == 0 ? 9000 : 90, 's')}});
-      ASSERT_TRUE(
-          store_->addMessage({session.value(), sessionID, "client", "music", 1, 2, payload}));
+      ASSERT_TRUE(store_->addMessage({session, sessionID, "client", "music", 1, 2, payload}));
     }
   }
   Result<std::int64_t> erase(const ErasureSelection& selection) {
@@ -35,12 +34,8 @@ class ErasureTest : public ExportFixture {
     return erased.get_future().get();
   }
   [[nodiscard]] bool filesHold(const std::string& text) const {
-    for (const auto& entry : std::filesystem::directory_iterator(directory_)) {
-      std::ifstream file(entry.path(), std::ios::binary);
-      const std::string content((std::istreambuf_iterator<char>(file)), {});
-      if (content.find(text) != std::string::npos) return true;
-    }
-    return false;
+    return std::ranges::any_of(
+        files(), [&text](const auto& file) { return file.second.find(text) != std::string::npos; });
   }
 };
 
@@ -68,12 +63,11 @@ TEST_F(ErasureTest, ErasesByDateAndKeepsTheSessionsOfWhatRemains) {
   addSecret(1, 10);
   addMessages(5);
   ASSERT_TRUE(store_->addAnalyticsEvent("old", Payload()));
-  const Payload info;
-  const auto open = store_->addAgentSession({2, 19, 2.0, true, "t", "c", "s", info});
+  const std::int64_t open = addSession(*store_, 2);
   runFor(1h);
-  ASSERT_TRUE(store_->addMessage({open.value(), 2, "c", "s", 1, 2, Payload()}));
+  ASSERT_TRUE(store_->addMessage({open, 2, "c", "s", 1, 2, Payload()}));
   ASSERT_TRUE(store_->addPowerEvent(1, "new", Payload()));
-  Await([this] { return store_->counters().waiting == 0; });
+  awaitStored(*store_);
   EXPECT_EQ(erase({date() - 1min}).value(), 10 + 1 + 5 + 1);
   EXPECT_THAT(rows("SELECT session_id FROM agent_session"), ElementsAre("2"));
   EXPECT_THAT(rows("SELECT session_id FROM message"), ElementsAre("2"));

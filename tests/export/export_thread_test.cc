@@ -57,9 +57,7 @@ class ExportThreadTest : public StoreFixture {
     });
     return *threads_.back();
   }
-  void addMessage() {
-    ASSERT_TRUE(store_->addMessage({std::nullopt, 7, "client", "service", 1, 2, Payload()}));
-  }
+  void addMessage() { ASSERT_TRUE(send(*store_, Payload())); }
 
   std::unique_ptr<TelemetryStore> store_ = open({.sync = 0ms, .remoteBackends = {"dead", "alive"}});
   std::vector<std::unique_ptr<ExportThread>> threads_;

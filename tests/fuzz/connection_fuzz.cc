@@ -4,15 +4,12 @@
 //
 // An input's first byte says how the client behaves, the rest is its stream.
 
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstdlib>
-#include <cstring>
 #include <filesystem>
 #include <initializer_list>
 #include <string>
@@ -23,6 +20,8 @@
 #include "base/MessagePack.h"
 #include "base/Payload.h"
 #include "platform/linux/connection/SocketListener.h"
+#include "tests/TemporaryDirectory.h"
+#include "tests/UnixSocket.h"
 #include "tests/fuzz/Require.h"
 
 namespace {
@@ -35,16 +34,12 @@ using quarvel::PayloadValue;
 constexpr timeval kPatience{30, 0};
 
 std::filesystem::path ServePath() {
-  std::string directory = (std::filesystem::temp_directory_path() / "quarvel-fuzz-XXXXXX").native();
-  Require(::mkdtemp(directory.data()) != nullptr, "a directory");
+  static const quarvel::TemporaryDirectory directory;
   for (const char* name : {"RUNTIME_DIRECTORY", "STATE_DIRECTORY", "CONFIGURATION_DIRECTORY",
                            "QUARVEL_DIAGNOSTICS_PREFIX"}) {
-    ::setenv(name, directory.c_str(), 1);
+    ::setenv(name, directory.path().c_str(), 1);
   }
-  static std::filesystem::path made;
-  made = directory;
-  std::atexit([] { std::filesystem::remove_all(made); });
-  return made / "socket";
+  return directory.path() / "socket";
 }
 
 /// The service, begun once and never ended.
@@ -74,9 +69,7 @@ class Client {
   Client() : socket_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
     ::setsockopt(socket_, SOL_SOCKET, SO_RCVTIMEO, &kPatience, sizeof kPatience);
     ::setsockopt(socket_, SOL_SOCKET, SO_SNDTIMEO, &kPatience, sizeof kPatience);
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::strncpy(address.sun_path, Service().c_str(), sizeof address.sun_path - 1);
+    const sockaddr_un address = quarvel::UnixAddress(Service());
     Require(::connect(socket_, reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0,
             "a connection");
   }

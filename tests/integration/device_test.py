@@ -2,6 +2,8 @@
 
 import json
 import os
+import pathlib
+import re
 import subprocess
 import unittest
 
@@ -49,6 +51,17 @@ class Drivers(ServiceTest):
                          "a channel that vanished takes its own group along, and no other")
         self.assertIn("TallixCreateSamples error", service.log())
 
+    def test_the_documented_example_finds_its_counter(self):
+        document = (pathlib.Path(__file__).parents[2] / "docs/sources.md").read_text()
+        [example] = [block for block in re.findall("```toml\n(.*?)```", document, re.DOTALL) if "/proc/interrupts" in block]
+        service = self.service(example)
+        client = self.client(service)
+        client.start_session(1)
+        client.stop_session(1)
+        self.assertIn("subscribed to group group Speaker-(null)", service.log())
+        self.assertNotIn("couldn't find any channels for driver group Speaker", service.log())
+        self.assertNotIn("SpuriousInterrupts", service.log(), "a counter that cannot be read is told of")
+
 
 class Preferences(ServiceTest):
     def test_reporting_is_switched_off_and_on(self):
@@ -83,6 +96,28 @@ class Preferences(ServiceTest):
         eventually(lambda: service.count("agent_session") == 2, "two runs")
         self.assertEqual(["device_name" in json.loads(row[0]) for row in service.rows(
             "SELECT user_info FROM agent_session ORDER BY id")], [False, True])
+
+    def test_verbose_lines_are_switched_on_before_the_start_and_off_after_it(self):
+        service = self.prepared()
+        service.prefer(reporting_server_verbose=True, reporting_session_verbose=True)
+        service.start()
+        self.addCleanup(service.finish)
+        client = self.client(service)
+        client.start_session(1)
+
+        def verbose_scopes():
+            """Of what two broadcasts write; once the second one's line is there, so is all of the first."""
+            before = len(service.log())
+            client.message({}, None)
+            client.message({}, None)
+            eventually(lambda: service.log()[before:].count("active reporting sessions") == 2, "the second broadcast")
+            return set(re.findall(r" debug tarnwick\.quarvel\[(\w+)\]", service.log()[before:]))
+
+        self.assertEqual(verbose_scopes(), {"zqrr", "zqrs"})
+        service.prefer(reporting_session_verbose=True)
+        self.assertEqual(verbose_scopes(), {"zqrr", "zqrs"}, "nobody has been told yet")
+        service.notify()
+        eventually(lambda: verbose_scopes() == {"zqrr"}, "one of them is switched off")
 
     def test_unwanted_events_are_not_recorded(self):
         service = self.service('[analytics]\nwanted = ["tarnwick.quarvel.HAL_*"]\n')
@@ -125,62 +160,136 @@ class InternalBuild(ServiceTest):
         self.assertEqual([next(iter(entry)) for entry in history[2:]],
                          ["device_orientation", "ui_orientation"])
 
-    def test_without_a_bus_there_is_no_orientation_and_no_harm(self):
-        service = self.prepared('[device]\nInternalBuild = true\n[orientation]\nsource = "iio"\n')
-        service.environment["DBUS_SYSTEM_BUS_ADDRESS"] = f"unix:path={service.directory}/nobus"
-        service.start()
-        self.addCleanup(service.finish)
-        client = self.client(service)
-        client.start_session(1, 2)
-        client.message({"a": 1}, [1])
-        client.stop_session(1)
-        service.wait_for_rows(2, "message WHERE session_id = 1")
 
-    def test_orientation_comes_from_the_sensor_proxy_while_a_session_tracks_it(self):
-        service = self.prepared('[device]\nInternalBuild = true\n[orientation]\nsource = "iio"\n')
-        service.prefer(reporting_session_verbose=True)
-        bus = SystemBus(self, service.directory)
-        service.environment |= bus.environment
-        service.start()
-        self.addCleanup(service.finish)
-        client = self.client(service)
-        client.start_session(1, 7)
-        eventually(lambda: bus.claimants() == 1, "the session's claim on the sensor")
-        for word, orientation in (("left-up", "landscapeRight"), ("bottom-up", "portraitUpsideDown")):
-            bus.turn(word)
-            eventually(lambda: f'orientation="{orientation}"' in service.log(), orientation)
-        client.stop_session(1)
-        eventually(lambda: bus.claimants() == 0, "the claim's end with the session")
-        summary = json.loads(service.wait_for_rows(1, "message WHERE category = 65535")[0]["payload"])
-        self.assertEqual(summary["device_orientation"], "landscapeRight,portraitUpsideDown")
+class Sensor(ServiceTest):
+    """Orientation from the sensor proxy on the system bus."""
+
+    def setUp(self):
+        self.watched = self.prepared('[device]\nInternalBuild = true\n[orientation]\nsource = "iio"\n')
+        self.watched.prefer(reporting_session_verbose=True)
+        self.bus = SystemBus(self, self.watched.directory)
+        self.watched.environment |= self.bus.environment
+        self.watched.start()
+        self.addCleanup(self.watched.finish)
+        self.tracker = self.client(self.watched)
+
+    def track(self):
+        self.tracker.start_session(1, 7)
+
+    def come_and_go(self):
+        for _ in range(3):
+            self.track()
+            self.tracker.stop_session(1)
+
+    def await_claimants(self, count):
+        eventually(lambda: self.bus.claimants() == count, f"{count} claimants")
+
+    def turn(self, word, orientation):
+        told = f'orientation="{orientation}"'
+        before = self.watched.log().count(told)
+        self.bus.turn(word)
+        eventually(lambda: self.watched.log().count(told) > before, orientation)
+
+    def errors(self):
+        return [line for line in self.watched.log().splitlines() if " error " in line]
+
+    def await_error(self, number, words):
+        eventually(lambda: len(self.errors()) >= number, words)
+        self.assertIn(words, self.errors()[-1])
+        self.assertEqual(len(self.errors()), number, self.errors())
+
+    def test_it_is_claimed_while_a_session_tracks_it_and_followed_through_a_restart(self):
+        self.bus.begin()
+        self.bus.begin_proxy(accelerometer_orientation="normal")
+        self.await_claimants(0)
+        self.track()
+        self.await_claimants(1)
+        for word, orientation in (("left-up", "landscapeRight"), ("right-up", "landscapeLeft"),
+                                  ("bottom-up", "portraitUpsideDown"), ("undefined", "unknown"),
+                                  ("normal", "portrait")):
+            self.turn(word, orientation)
+        self.bus.begin_proxy(accelerometer_orientation="left-up")
+        # Claimed again, and what changed meanwhile is told.
+        eventually(lambda: self.watched.log().count('orientation="landscapeRight"') == 2, "the change")
+        self.turn("normal", "portrait")
+        self.tracker.stop_session(1)
+        self.await_claimants(0)
+        summary = json.loads(self.watched.wait_for_rows(1, "message WHERE category = 65535")[0]["payload"])
+        self.assertEqual(summary["device_orientation"], "landscapeRight,landscapeLeft,portraitUpsideDown,"
+                                                        "unknown,portrait,landscapeRight,portrait")
+        self.assertEqual(self.errors(), [])
+
+    def test_no_bus_no_proxy_and_no_accelerometer_are_one_line_each(self):
+        self.come_and_go()
+        self.await_error(1, "the system bus")
+        # With bus and proxy there, the next session succeeds, and all is said anew when they go.
+        self.bus.begin()
+        self.bus.begin_proxy()
+        self.track()
+        self.await_claimants(1)
+        self.turn("left-up", "landscapeRight")
+        self.bus.end_proxy()
+        self.tracker.stop_session(1)
+        self.come_and_go()
+        self.await_error(2, "cannot be claimed")
+        self.bus.begin_proxy()
+        self.track()
+        self.await_claimants(1)
+        self.tracker.stop_session(1)
+        self.bus.begin_proxy(has_accelerometer=False)
+        self.come_and_go()
+        self.await_error(3, "no accelerometer")
+        self.bus.begin_proxy()
+        self.track()
+        self.await_claimants(1)
+        self.bus.end()
+        self.await_error(4, "the system bus was lost")
 
 
 class SystemBus:
-    """A private system bus with a sensor proxy on it; both end with the test."""
+    """A private system bus, and a sensor proxy on it; both end with the test."""
 
     PROXY = "net.hadess.SensorProxy", "/net/hadess/SensorProxy", "org.freedesktop.DBus.Mock"
 
     def __init__(self, test, directory):
-        self._test = test
-        address = f"unix:path={directory}/system.sock"
-        self.environment = {"DBUS_SYSTEM_BUS_ADDRESS": address}
-        (directory / "bus.conf").write_text(
+        self._directory = directory
+        self._address = f"unix:path={directory}/system.sock"
+        self.environment = {"DBUS_SYSTEM_BUS_ADDRESS": self._address}
+        self._bus = self._proxy = None
+        test.addCleanup(self.end)
+        test.addCleanup(self.end_proxy)
+
+    def begin(self):
+        (self._directory / "bus.conf").write_text(
             '<!DOCTYPE busconfig PUBLIC "-//freedesktop//DTD D-BUS Bus Configuration 1.0//EN"'
             ' "http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd">'
-            f"<busconfig><type>session</type><listen>{address}</listen><auth>EXTERNAL</auth>"
+            f"<busconfig><type>session</type><listen>{self._address}</listen><auth>EXTERNAL</auth>"
             '<policy context="default"><allow own="*"/><allow send_destination="*"/>'
             '<allow receive_sender="*"/><allow user="*"/></policy></busconfig>')
-        self._beside("dbus-daemon", f"--config-file={directory}/bus.conf", "--nofork", "--nopidfile")
-        eventually((directory / "system.sock").exists, "the bus")
-        self._beside("/usr/bin/python3", "-m", "dbusmock", "--system", "--template", "iio-sensors-proxy",
-                     "-p", '{"has_accelerometer": true}', "-l", f"{directory}/proxy.log")
+        self._bus = self._beside("dbus-daemon", f"--config-file={self._directory}/bus.conf", "--nofork", "--nopidfile")
+        eventually((self._directory / "system.sock").exists, "the bus")
+
+    def end(self):
+        self._bus = self._ended(self._bus)
+
+    def begin_proxy(self, **parameters):
+        self.end_proxy()
+        self._proxy = self._beside(
+            "/usr/bin/python3", "-m", "dbusmock", "--system", "--template", "iio-sensors-proxy",
+            "-p", json.dumps({"has_accelerometer": True} | parameters), "-l", f"{self._directory}/proxy.log")
         self._gdbus("wait", "--system", "--timeout", "60", self.PROXY[0])
 
+    def end_proxy(self):
+        self._proxy = self._ended(self._proxy)
+
     def _beside(self, *command):
-        process = subprocess.Popen(command, env=os.environ | self.environment,
-                                   stderr=subprocess.DEVNULL)
-        self._test.addCleanup(process.wait)
-        self._test.addCleanup(process.terminate)
+        return subprocess.Popen(command, env=os.environ | self.environment, stderr=subprocess.DEVNULL)
+
+    @staticmethod
+    def _ended(process):
+        if process:
+            process.terminate()
+            process.wait()
 
     def _gdbus(self, *arguments):
         return subprocess.run(["gdbus", *arguments], env=os.environ | self.environment, check=True,

@@ -3,9 +3,7 @@
 #include <fmt/format.h>
 #include <gtest/gtest.h>
 #include <poll.h>
-#include <stdlib.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -17,6 +15,7 @@
 #include "base/Json.h"
 #include "base/MessagePack.h"
 #include "platform/Log.h"
+#include "tests/UnixSocket.h"
 
 namespace quarvel {
 
@@ -141,10 +140,10 @@ std::size_t Journal::countLocked(std::string_view part) {
   }));
 }
 
-bool Journal::waitFor(std::string_view part, std::size_t times) {
+bool Journal::waitFor(std::string_view part) {
   const auto deadline = std::chrono::steady_clock::now() + kPatience;
   MutexLock lock(mutex_);
-  while (countLocked(part) < times) {
+  while (countLocked(part) == 0) {
     if (!changed_.waitUntil(mutex_, deadline)) return false;
   }
   return true;
@@ -198,16 +197,6 @@ bool Ledger::waitForArrivals(std::size_t count) {
   return true;
 }
 
-TemporaryDirectory::TemporaryDirectory() {
-  std::string pattern = (std::filesystem::temp_directory_path() / "quarvel-XXXXXX").native();
-  EXPECT_NE(::mkdtemp(pattern.data()), nullptr);
-  path_ = pattern;
-}
-
-TemporaryDirectory::~TemporaryDirectory() {
-  std::filesystem::remove_all(path_);
-}
-
 Client::Client() : socket_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
   const timeval patience{kPatience.count(), 0};
   ::setsockopt(socket_.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
@@ -215,9 +204,7 @@ Client::Client() : socket_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
 }
 
 void Client::connect(const std::filesystem::path& service) {
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::strncpy(address.sun_path, service.c_str(), sizeof address.sun_path - 1);
+  const sockaddr_un address = UnixAddress(service);
   EXPECT_EQ(::connect(socket_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address),
             0)
       << std::strerror(errno);
@@ -260,11 +247,6 @@ std::string Client::responseWithin(std::chrono::milliseconds time) {
     return {};
   }
   return response();
-}
-
-bool Client::hearsNothing() {
-  pollfd descriptor{socket_.get(), POLLIN, 0};
-  return ::poll(&descriptor, 1, 0) == 0 && taken_ == received_.size();
 }
 
 bool Client::isServed() {

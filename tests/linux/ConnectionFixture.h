@@ -18,6 +18,7 @@
 #include "base/Value.h"
 #include "platform/linux/connection/SocketListener.h"
 #include "platform/linux/work/Voucher.h"
+#include "tests/TemporaryDirectory.h"
 
 namespace quarvel {
 
@@ -34,8 +35,8 @@ class Journal {
   void clear();
   std::vector<std::string> entries();
   std::size_t count(std::string_view part);
-  /// Waits until so many entries contain `part`.
-  bool waitFor(std::string_view part, std::size_t times = 1);
+  /// Waits until an entry contains `part`.
+  bool waitFor(std::string_view part);
 
  private:
   std::size_t countLocked(std::string_view part) QUARVEL_REQUIRES(mutex_);
@@ -75,17 +76,6 @@ class Ledger {
   std::size_t largestKept_ QUARVEL_GUARDED_BY(mutex_) = 0;
 };
 
-/// A directory of its own for one test.
-class TemporaryDirectory {
- public:
-  TemporaryDirectory();
-  ~TemporaryDirectory();
-  [[nodiscard]] const std::filesystem::path& path() const { return path_; }
-
- private:
-  std::filesystem::path path_;
-};
-
 /// A client's end: writes bytes, reads responses.
 class Client {
  public:
@@ -101,8 +91,6 @@ class Client {
   std::string response();
   /// The next response, "end", or nothing when neither came in time.
   std::string responseWithin(std::chrono::milliseconds time);
-  /// Whether there is nothing to read at this moment.
-  bool hearsNothing();
   /// Calls echo with this number and says whether the answer, and nothing else, came back.
   static constexpr std::int64_t kServedNumber = -1000;
   bool isServed();

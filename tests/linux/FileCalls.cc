@@ -49,7 +49,7 @@ void FileCalls::reset(const std::filesystem::path& directory) {
   directory_ = directory.string();
   open_.clear();
   counts_ = {};
-  full_ = hold_ = recording_ = false;
+  hold_ = recording_ = false;
   fault_.reset();
   calls_ = {};
   failedCalls_ = 0;
@@ -69,16 +69,6 @@ void FileCalls::awaitLogSyncs(int atLeast) {
 void FileCalls::awaitSynced() {
   MutexLock lock(mutex_);
   while (counts_.unsynced > 0) changed_.wait(mutex_);
-}
-
-void FileCalls::awaitRefusedWrites(int atLeast) {
-  MutexLock lock(mutex_);
-  while (counts_.refusedWrites < atLeast) changed_.wait(mutex_);
-}
-
-void FileCalls::setFull(bool full) {
-  MutexLock lock(mutex_);
-  full_ = full;
 }
 
 void FileCalls::hold() {
@@ -110,6 +100,11 @@ void FileCalls::lift() {
 std::size_t FileCalls::failedCalls() {
   MutexLock lock(mutex_);
   return failedCalls_;
+}
+
+void FileCalls::awaitFailedCalls(std::size_t atLeast) {
+  MutexLock lock(mutex_);
+  while (failedCalls_ < atLeast) changed_.wait(mutex_);
 }
 
 void FileCalls::record() {
@@ -146,16 +141,12 @@ int FileCalls::admitLocked(Purpose purpose) {
                                ? calls_[purposeIndex]
                                : std::accumulate(calls_.begin(), calls_.end(), std::size_t{0});
   ++calls_[purposeIndex];
-  const bool writes = purpose == Purpose::write;
-  int error = writes && full_ ? ENOSPC : 0;
   const bool struck = fault_ && call >= fault_->at && (!fault_->only || fault_->only == purpose) &&
-                      (fault_->error != 0 || writes);
-  if (struck) {
-    error = fault_->error == 0 ? -1 : fault_->error;
-    if (!fault_->forever) fault_.reset();
-  }
-  if (error != 0) ++failedCalls_;
-  if (error != 0 && writes) ++counts_.refusedWrites;
+                      (fault_->error != 0 || purpose == Purpose::write);
+  if (!struck) return 0;
+  const int error = fault_->error == 0 ? -1 : fault_->error;
+  if (!fault_->forever) fault_.reset();
+  ++failedCalls_;
   changed_.notifyAll();
   return error;
 }

@@ -3,6 +3,7 @@
 #include <sys/types.h>
 
 #include <array>
+#include <cerrno>
 #include <cstddef>
 #include <cstdint>
 #include <filesystem>
@@ -31,19 +32,15 @@ class FileCalls {
     int commits = 0;   // transactions written to a write-ahead log
     int logSyncs = 0;  // syncs of a write-ahead log
     int unsynced = 0;  // transactions since the last of them
-    int refusedWrites = 0;
   };
   [[nodiscard]] Counts counts() QUARVEL_EXCLUDES(mutex_);
-  /// Returns once that many syncs of a log, or refused writes, have been counted.
+  /// Returns once that many syncs of a log have been counted.
   void awaitLogSyncs(int atLeast) QUARVEL_EXCLUDES(mutex_);
   /// Returns once every transaction has been synced.
   void awaitSynced() QUARVEL_EXCLUDES(mutex_);
-  void awaitRefusedWrites(int atLeast) QUARVEL_EXCLUDES(mutex_);
 
   // Switches.
 
-  /// From now on writes fail as on a full disk, or succeed again.
-  void setFull(bool full) QUARVEL_EXCLUDES(mutex_);
   /// From now on writes to a write-ahead log wait, until released.
   void hold() QUARVEL_EXCLUDES(mutex_);
   void release() QUARVEL_EXCLUDES(mutex_);
@@ -63,10 +60,14 @@ class FileCalls {
     bool forever = false;
     std::optional<Purpose> only{};
   };
+  static constexpr Fault fullDisk() {
+    return {.error = ENOSPC, .forever = true, .only = Purpose::write};
+  }
   void inject(const Fault& fault) QUARVEL_EXCLUDES(mutex_);
   void lift() QUARVEL_EXCLUDES(mutex_);
   /// How many calls were made to fail.
   [[nodiscard]] std::size_t failedCalls() QUARVEL_EXCLUDES(mutex_);
+  void awaitFailedCalls(std::size_t atLeast) QUARVEL_EXCLUDES(mutex_);
 
   // The record of what changes files and names, and what makes that safe.
 
@@ -114,7 +115,6 @@ class FileCalls {
   std::string directory_ QUARVEL_GUARDED_BY(mutex_);
   std::map<int, std::string> open_ QUARVEL_GUARDED_BY(mutex_);
   Counts counts_ QUARVEL_GUARDED_BY(mutex_);
-  bool full_ QUARVEL_GUARDED_BY(mutex_) = false;
   bool hold_ QUARVEL_GUARDED_BY(mutex_) = false;
   int held_ QUARVEL_GUARDED_BY(mutex_) = 0;
   std::optional<Fault> fault_ QUARVEL_GUARDED_BY(mutex_);

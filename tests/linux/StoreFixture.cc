@@ -1,7 +1,10 @@
 #include "tests/linux/StoreFixture.h"
 
 #include <sqlite3.h>
-#include <stdlib.h>
+
+#include <fstream>
+#include <iterator>
+#include <memory>
 
 #include "tests/linux/FileCalls.h"
 
@@ -9,14 +12,10 @@ namespace quarvel::testing {
 
 namespace {
 
-std::filesystem::path NewDirectory(bool memory) {
+std::filesystem::path Medium(bool memory) {
   const std::filesystem::path shared = "/dev/shm";
-  const bool inMemory = memory && std::filesystem::is_directory(shared);
-  std::string name =
-      ((inMemory ? shared : std::filesystem::temp_directory_path()) / "quarvel-store-XXXXXX")
-          .string();
-  EXPECT_NE(mkdtemp(name.data()), nullptr);
-  return name;
+  return memory && std::filesystem::is_directory(shared) ? shared
+                                                         : std::filesystem::temp_directory_path();
 }
 
 std::vector<std::string> RunSql(const std::filesystem::path& path, const std::string& sql) {
@@ -41,11 +40,27 @@ std::vector<std::string> RunSql(const std::filesystem::path& path, const std::st
 
 }  // namespace
 
-StoreFixture::StoreFixture(bool memory) : directory_(NewDirectory(memory)) {}
+StoreFixture::StoreFixture(bool memory) : made_(Medium(memory)) {}
 
 StoreFixture::~StoreFixture() {
   FileCalls::watch({});
+}
+
+void StoreFixture::put(const Files& files) const {
   std::filesystem::remove_all(directory_);
+  std::filesystem::create_directory(directory_);
+  for (const auto& [name, content] : files) {
+    std::ofstream(directory_ / name, std::ios::binary) << content;
+  }
+}
+
+StoreFixture::Files StoreFixture::files() const {
+  Files files;
+  for (const auto& entry : std::filesystem::directory_iterator(directory_)) {
+    std::ifstream file(entry.path(), std::ios::binary);
+    files[entry.path().filename()] = std::string(std::istreambuf_iterator<char>(file), {});
+  }
+  return files;
 }
 
 std::unique_ptr<TelemetryStore> StoreFixture::open(TelemetryStore::Options options) const {
@@ -67,6 +82,24 @@ std::string StoreFixture::value(const std::string& query) const {
 
 void StoreFixture::execute(const std::string& statements) const {
   (void)RunSql(path_, statements);
+}
+
+Outcome StoreFixture::send(TelemetryStore& store, const Payload& payload, std::int64_t sessionID) {
+  return store.addMessage({std::nullopt, sessionID, "client", "service", 1, 2, payload});
+}
+
+std::int64_t StoreFixture::addSession(TelemetryStore& store, std::int64_t sessionID,
+                                      const Payload& userInfo) {
+  const auto session =
+      store.addAgentSession({sessionID, 19, 2.0, true, "token", "client", "service", userInfo});
+  EXPECT_TRUE(session);
+  return session ? session.value() : 0;
+}
+
+std::future<std::optional<Error>> StoreFixture::flush(TelemetryStore& store, std::int64_t session) {
+  auto flushed = std::make_shared<std::promise<std::optional<Error>>>();
+  EXPECT_TRUE(store.flush(session, [flushed](const auto& error) { flushed->set_value(error); }));
+  return flushed->get_future();
 }
 
 }  // namespace quarvel::testing

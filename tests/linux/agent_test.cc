@@ -52,28 +52,6 @@ class AgentTest : public StoreFixture {
   }
 };
 
-TEST_F(AgentTest, ASessionsMessagesCarryWhatItWasCreatedWith) {
-  TelemetryAgent agent(store_, {"store"});
-  auto session = agent.createAgentSession(sessionInfo_, userInfo_);
-  ASSERT_TRUE(session->agentSendMessage(0xffff, 3, payload_));
-  EXPECT_EQ(flush(*session), std::nullopt);
-  EXPECT_EQ(value("SELECT count(flushed_at) FROM agent_session"), "1");
-  session.reset();
-  Dictionary single{{kRelmReportingSessionInfoClientType, 19},
-                    {kRelmReportingSessionInfoSessionID, -1}};
-  ASSERT_TRUE(agent.sendOneMessage(single, userInfo_, 5, 6, payload_));
-  store_->close();
-  EXPECT_THAT(
-      rows("SELECT * FROM agent_session"),
-      ElementsAre(
-          "1|42|19|2.0|1|token|tarnwick.quarvel|telephony_session|"
-          R"({"ClientName":"tarnwick.quarvel","ServiceName":"telephony_session","Route":"speaker"}|0|0)"));
-  EXPECT_THAT(rows("SELECT agent_session, session_id, client_name, service_name, category, type, "
-                   "payload FROM message"),
-              ElementsAre(R"(1|42|tarnwick.quarvel|telephony_session|65535|3|{"n":1})",
-                          R"(-|-1|tarnwick.quarvel|telephony_session|5|6|{"n":1})"));
-}
-
 // A row that the database would refuse, for a NULL say, would stop every row behind it.
 TEST_F(AgentTest, MissingAndMisshapenInformationStillMakesARow) {
   TelemetryAgent agent(store_, {"store"});

@@ -14,6 +14,7 @@
 
 #include "platform/DeviceProperties.h"
 #include "platform/linux/system/Directories.h"
+#include "tests/TemporaryDirectory.h"
 
 namespace quarvel {
 namespace {
@@ -25,20 +26,14 @@ using testing::IsEmpty;
 
 class ConfigurationTest : public testing::Test {
  protected:
-  void SetUp() override {
-    std::string name = testing::TempDir() + "configurationXXXXXX";
-    directory_ = mkdtemp(name.data());
-  }
-  void TearDown() override { fs::remove_all(directory_); }
-
   Result<Configuration> read(const std::string& text) {
     std::ofstream(file()) << text;
     warnings_.clear();
     return Configuration::read(file(), warnings_);
   }
-  [[nodiscard]] fs::path file() const { return directory_ / "quarvel.toml"; }
+  [[nodiscard]] fs::path file() const { return directory_.path() / "quarvel.toml"; }
 
-  fs::path directory_;
+  const TemporaryDirectory directory_;
   std::vector<std::string> warnings_;
 };
 
@@ -168,7 +163,8 @@ connections = 4
 
 TEST_F(ConfigurationTest, AbsentFileAndAbsentKeysLeaveTheDefaults) {
   std::vector<std::string> warnings;
-  for (const fs::path& absent : {directory_ / "none.toml", directory_ / "none" / "quarvel.toml"}) {
+  for (const fs::path& absent :
+       {directory_.path() / "none.toml", directory_.path() / "none/quarvel.toml"}) {
     EXPECT_TRUE(Configuration::read(absent, warnings).ok()) << absent;
   }
   const Result<Configuration> partial = read("[limits]\ndepth = 1\n[agent]\nbackends = []\n");
@@ -256,14 +252,14 @@ TEST_F(ConfigurationDeathTest, ProcessWithWrongValueSaysSoAndEndsWithOne) {
   EXPECT_EXIT(
       {
         std::ofstream(file()) << "[limits]\ndepth = 0\n";
-        setenv("CONFIGURATION_DIRECTORY", directory_.c_str(), 1);
+        setenv("CONFIGURATION_DIRECTORY", directory_.path().c_str(), 1);
         static_cast<void>(Configuration::process());
       },
       testing::ExitedWithCode(1), HasSubstr("quarvel.toml:2: limits.depth must be"));
   EXPECT_EXIT(
       {
         std::ofstream(file()) << "[device]\nInternalBuild = true\nDeviceClassNumber = 4\n[lgo]\n";
-        setenv("CONFIGURATION_DIRECTORY", directory_.c_str(), 1);
+        setenv("CONFIGURATION_DIRECTORY", directory_.path().c_str(), 1);
         const bool right = DevicePropertyBoolean("InternalBuild") == true &&
                            DevicePropertyInteger("DeviceClassNumber") == 4 &&
                            !DevicePropertyInteger("InternalBuild") &&

@@ -1,15 +1,13 @@
 #include <gtest/gtest.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <array>
 #include <cerrno>
 #include <cstdio>
-#include <cstring>
 #include <future>
 #include <set>
 
+#include "tests/UnixSocket.h"
 #include "tests/linux/ConnectionFixture.h"
 #include "tests/linux/SocketCalls.h"
 
@@ -105,7 +103,7 @@ class Life {
     calls.begin(fault);
     // A socket file that a killed service has left.
     const std::filesystem::path path = directory_.path() / "socket";
-    LeaveStaleSocket(path);
+    ::close(BoundSocket(path, SOCK_STREAM));
     if (!listen(path)) return;
     auto served = std::async(std::launch::async, [this] {
       const SocketCalls::Watched watched;
@@ -140,15 +138,6 @@ class Life {
   }
 
  private:
-  static void LeaveStaleSocket(const std::filesystem::path& path) {
-    const int socket = ::socket(AF_UNIX, SOCK_STREAM, 0);
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
-    (void)::bind(socket, reinterpret_cast<const sockaddr*>(&address), sizeof address);
-    ::close(socket);
-  }
-
   bool listen(const std::filesystem::path& path) {
     const SocketCalls::Watched watched;
     auto socket = ListeningSocket::listeningAt(path);

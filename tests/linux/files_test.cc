@@ -10,7 +10,7 @@
 #include <thread>
 
 #include "platform/FileSystem.h"
-#include "tests/linux/TemporaryDirectory.h"
+#include "tests/TemporaryDirectory.h"
 
 namespace quarvel {
 namespace {

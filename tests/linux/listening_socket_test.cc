@@ -2,12 +2,9 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 
 #include <atomic>
-#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <string>
@@ -15,6 +12,7 @@
 #include <vector>
 
 #include "platform/linux/connection/ListeningSocket.h"
+#include "tests/UnixSocket.h"
 #include "tests/linux/ConnectionFixture.h"
 
 namespace quarvel {
@@ -22,13 +20,9 @@ namespace {
 
 using ::testing::HasSubstr;
 
-/// A bound socket; listening when `backlog` is not negative. Its file stays when it is closed.
+/// A bound socket; listening when `backlog` is not negative.
 UniqueDescriptor BoundSocket(const std::filesystem::path& path, int type, int backlog) {
-  UniqueDescriptor socket(::socket(AF_UNIX, type, 0));
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
-  EXPECT_EQ(::bind(socket.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+  UniqueDescriptor socket(quarvel::BoundSocket(path, type));
   if (backlog >= 0) {
     EXPECT_EQ(::listen(socket.get(), backlog), 0);
   }

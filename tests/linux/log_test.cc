@@ -5,15 +5,12 @@
 #include <gtest/gtest.h>
 #include <sched.h>
 #include <sys/mount.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
 #include <cstdlib>
-#include <cstring>
 #include <filesystem>
 #include <latch>
 #include <string>
@@ -26,6 +23,7 @@
 #include "platform/linux/system/LogLine.h"
 #include "platform/linux/system/LogWriter.h"
 #include "platform/linux/system/ProcessExit.h"
+#include "tests/UnixSocket.h"
 
 namespace quarvel {
 namespace {
@@ -216,18 +214,13 @@ TEST_F(LogDeathTest, LinesLeaveBeforeTheProcessHoweverItEnds) {
       testing::ResultOf([](const std::string& text) { return std::ranges::count(text, '\n'); },
                         testing::Ge(5000)),
       testing::Not(HasSubstr("not asked for")));
-  EXPECT_EXIT(
-      {
-        logMany();
-        std::exit(3);
-      },
-      testing::ExitedWithCode(3), everyLine);
-  EXPECT_EXIT(
-      {
-        logMany();
-        ExitProcess(2);
-      },
-      testing::ExitedWithCode(2), everyLine);
+  const struct {
+    void (*end)();
+    int status;
+  } endings[] = {{[] { std::exit(3); }, 3}, {[] { ExitProcess(2); }, 2}};
+  for (const auto& [end, status] : endings) {
+    EXPECT_EXIT((logMany(), end()), testing::ExitedWithCode(status), everyLine);
+  }
   EXPECT_EXIT(
       {
         std::atexit([] {
@@ -279,12 +272,7 @@ int listenAsJournal() {
     return -1;
   }
   std::filesystem::create_directories("/run/systemd/journal");
-  const int journal = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::strcpy(address.sun_path, "/run/systemd/journal/socket");
-  EXPECT_EQ(bind(journal, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
-  return journal;
+  return BoundSocket("/run/systemd/journal/socket", SOCK_DGRAM);
 }
 
 constexpr int kNoNamespaces = 77;

@@ -15,8 +15,8 @@
 #include <vector>
 
 #include "platform/linux/sources/NotificationCenter.h"
+#include "tests/TemporaryDirectory.h"
 #include "tests/linux/Collected.h"
-#include "tests/linux/TemporaryDirectory.h"
 
 namespace quarvel {
 namespace {

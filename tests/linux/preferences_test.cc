@@ -8,8 +8,8 @@
 #include <vector>
 
 #include "platform/linux/sources/PreferencesStore.h"
+#include "tests/TemporaryDirectory.h"
 #include "tests/linux/LogRecorder.h"
-#include "tests/linux/TemporaryDirectory.h"
 
 namespace quarvel {
 namespace {

@@ -1,12 +1,9 @@
 #include <gtest/gtest.h>
 #include <poll.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <chrono>
 #include <cstdlib>
-#include <cstring>
 #include <future>
 #include <memory>
 #include <string>
@@ -14,7 +11,8 @@
 #include "platform/WorkQueue.h"
 #include "platform/linux/system/ServiceManager.h"
 #include "platform/linux/work/BlockingScope.h"
-#include "tests/linux/TemporaryDirectory.h"
+#include "tests/TemporaryDirectory.h"
+#include "tests/UnixSocket.h"
 
 namespace quarvel {
 namespace {
@@ -25,14 +23,7 @@ using std::chrono::seconds;
 /// A service manager: the socket to which the process tells how it is.
 class ServiceManagerTest : public testing::Test {
  protected:
-  ServiceManagerTest() : socket_(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0)) {
-    const std::string path = directory_.path() / "notify";
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::memcpy(address.sun_path, path.c_str(), path.size());
-    EXPECT_EQ(::bind(socket_, reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
-    ::setenv("NOTIFY_SOCKET", path.c_str(), 1);
-  }
+  ServiceManagerTest() { ::setenv("NOTIFY_SOCKET", path_.c_str(), 1); }
   ~ServiceManagerTest() override {
     ::unsetenv("NOTIFY_SOCKET");
     ::close(socket_);
@@ -49,7 +40,8 @@ class ServiceManagerTest : public testing::Test {
 
  private:
   const TemporaryDirectory directory_;
-  const int socket_;
+  const std::string path_ = directory_.path() / "notify";
+  const int socket_ = BoundSocket(path_, SOCK_DGRAM);
 };
 
 TEST_F(ServiceManagerTest, PingNeedsTheWorkOfClientsToMove) {

@@ -2,7 +2,6 @@
 #include <gmock/gmock.h>
 
 #include <cstdlib>
-#include <fstream>
 #include <random>
 
 #include "platform/linux/store/Sqlite.h"
@@ -26,34 +25,19 @@ class DamageTest : public StoreFixture {
   DamageTest() : StoreFixture(true) { LogRecorder::take(); }
 
   static void send(TelemetryStore& store, std::int64_t number) {
-    const Payload payload(Dictionary{{"n", number}, {"route", "BuiltInSpeaker"}});
-    ASSERT_TRUE(store.addMessage({std::nullopt, 7, "client", "service", 1, 2, payload}));
-  }
-  static std::string contentOf(const std::filesystem::path& path) {
-    std::ifstream file(path, std::ios::binary);
-    return {std::istreambuf_iterator<char>(file), {}};
-  }
-  static void put(const std::filesystem::path& path, const std::string& content) {
-    std::ofstream(path, std::ios::binary) << content;
+    ASSERT_TRUE(
+        StoreFixture::send(store, Payload(Dictionary{{"n", number}, {"route", "BuiltInSpeaker"}})));
   }
   void fill() {
     auto store = open();
-    const Payload info;
-    for (int i = 0; i < 20; ++i) {
-      ASSERT_TRUE(store->addAgentSession({i, 19, 2.0, true, "token", "client", "service", info}));
-    }
+    for (int i = 0; i < 20; ++i) addSession(*store, i);
     for (int i = 1; i <= kRows; ++i) send(*store, i);
-    Await([&] { return store->counters().waiting == 0; });
-    log_ = contentOf(path_.string() + "-wal");
-    leftBehind_ = contentOf(path_);
+    awaitStored(*store);
+    leftBehind_ = files();
+    leftBehind_.erase("telemetry.db-shm");
     store.reset();
-    closed_ = contentOf(path_);
+    closed_ = files();
     storeID_ = value("SELECT value FROM meta WHERE key = 'store_id'");
-  }
-  void clear() {
-    for (const auto& entry : std::filesystem::directory_iterator(directory_)) {
-      std::filesystem::remove(entry);
-    }
   }
   std::int64_t intactRows() {
     return std::stoll(
@@ -61,7 +45,8 @@ class DamageTest : public StoreFixture {
               " ',\"route\":\"BuiltInSpeaker\"}' AND category = 1 AND type = 2"));
   }
 
-  std::string closed_, leftBehind_, log_, storeID_;
+  Files closed_, leftBehind_;
+  std::string storeID_;
 };
 
 struct Damage {
@@ -105,23 +90,21 @@ TEST_F(DamageTest, AStoreAlwaysOpensAndKeepsWhatCanBeRead) {
     std::int64_t kept = 0;
     for (int i = 0; i < cases; ++i) {
       SCOPED_TRACE(fmt::format("{} {}", damage.name, i));
-      clear();
       // Every fourth is a store that was left behind, with its log, and either of them is damaged.
-      std::string content = i % 4 == 0 ? leftBehind_ : closed_;
-      std::string log = i % 4 == 0 ? log_ : "";
-      damage.inflict(i % 8 == 0 ? log : content, random);
-      put(path_, content);
-      if (!log.empty()) put(path_.string() + "-wal", log);
+      Files found = i % 4 == 0 ? leftBehind_ : closed_;
+      damage.inflict(found[i % 8 == 0 ? "telemetry.db-wal" : "telemetry.db"], random);
+      put(found);
       auto store = open();
       ASSERT_NE(store, nullptr);
       send(*store, 0);
-      Await([&] { return store->counters().waiting == 0; });
+      awaitStored(*store);
       store->close();
       const StoreCounters counters = store->counters();
       EXPECT_EQ(counters.accepted, counters.stored + counters.dropped.sum());
       for (const auto& file : StoresSetAside(path_)) {
         ++setAside;
-        EXPECT_EQ(contentOf(file), content) << "what is set aside stays as it is";
+        EXPECT_EQ(files()[file.filename()], found["telemetry.db"])
+            << "what is set aside stays as it is";
         EXPECT_EQ(value("SELECT count(*) FROM message"), std::to_string(counters.stored));
         EXPECT_EQ(value("PRAGMA integrity_check"), "ok");
       }
@@ -146,29 +129,26 @@ TEST_F(DamageTest, AStoreAlwaysOpensAndKeepsWhatCanBeRead) {
 TEST_F(DamageTest, OnlyTheRowsOfADamagedPageAreLostAndNamesStay) {
   fill();
   // The middle leaf of the table of messages: header byte 13, cells counted in bytes 3 and 4.
+  std::string& content = closed_["telemetry.db"];
   std::vector<std::size_t> leaves;
-  const auto cells = [this](std::size_t page) {
+  const auto cells = [&content](std::size_t page) {
     const auto byte = [&](std::size_t at) {
-      return static_cast<unsigned char>(closed_[page * kPage + at]);
+      return static_cast<unsigned char>(content[page * kPage + at]);
     };
     return byte(0) == 13 ? byte(3) * 256 + byte(4) : 0;
   };
-  for (std::size_t page = 1; page < closed_.size() / kPage; ++page) {
+  for (std::size_t page = 1; page < content.size() / kPage; ++page) {
     if (cells(page) > 40) leaves.push_back(page);
   }
   ASSERT_GT(leaves.size(), 20U);
-  std::string content = closed_;
   const std::size_t page = leaves[leaves.size() / 2];
-  content.replace(page * kPage, kPage, kPage, '\x5a');
-  clear();
-  put(path_, content);
-  auto store = open();
   const auto lost = static_cast<std::uint64_t>(cells(page));
+  content.replace(page * kPage, kPage, kPage, '\x5a');
+  put(closed_);
+  auto store = open();
   EXPECT_EQ(store->counters().dropped[StoreDrop::damaged], lost);
   EXPECT_EQ(store->counters().stored, kRows - lost);
-  const Payload info;
-  EXPECT_EQ(store->addAgentSession({1, 19, 2.0, true, "token", "client", "service", info}).value(),
-            21);
+  EXPECT_EQ(addSession(*store), 21);
   send(*store, kRows + 1);
   store.reset();
   EXPECT_EQ(intactRows(), static_cast<std::int64_t>(kRows + 1 - lost));

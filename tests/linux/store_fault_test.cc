@@ -1,7 +1,6 @@
 #include <fmt/format.h>
 #include <gmock/gmock.h>
 
-#include <fstream>
 #include <future>
 
 #include "platform/linux/store/Sqlite.h"
@@ -20,25 +19,18 @@ class FaultTest : public StoreFixture {
  protected:
   FaultTest() : StoreFixture(true) {}
 
-  /// What is there when the store is opened: files by name.
-  using Files = std::vector<std::pair<std::string, std::string>>;
-
   static TelemetryStore::Options options() {
     return {.sync = 0ms, .maximumBytes = 100'000, .logPages = 6, .firstBackOff = 1ms};
   }
   void begin(const Files& found) {
-    std::filesystem::remove_all(directory_);
-    std::filesystem::create_directory(directory_);
-    for (const auto& [name, content] : found) {
-      std::ofstream(directory_ / name, std::ios::binary) << content;
-    }
+    put(found);
     LogRecorder::take();
     sent_ = 0;
   }
   void send(TelemetryStore& store, int rows) {
     for (int i = 0; i < rows; ++i) {
-      const Payload payload(Dictionary{{"n", ++sent_}, {"text", std::string(1500, 'x')}});
-      ASSERT_TRUE(store.addMessage({std::nullopt, 7, "client", "service", 1, 2, payload}));
+      ASSERT_TRUE(StoreFixture::send(
+          store, Payload(Dictionary{{"n", ++sent_}, {"text", std::string(1500, 'x')}})));
     }
   }
 
@@ -47,49 +39,44 @@ class FaultTest : public StoreFixture {
     begin({});
     auto store = open(options());
     send(*store, 20);
-    Await([&] { return store->counters().waiting == 0; });
-    Files files;
-    for (const char* name : {"telemetry.db", "telemetry.db-wal"}) {
-      std::ifstream file(directory_ / name, std::ios::binary);
-      files.emplace_back(name, std::string(std::istreambuf_iterator<char>(file), {}));
-    }
-    return files;
+    awaitStored(*store);
+    Files left = files();
+    left.erase("telemetry.db-shm");
+    return left;
   }
 
   /// A life of a store with one fault. Returns whether the fault struck.
   bool live(const Files& found, const FileCalls::Fault& fault) {
     begin(found);
-    FileCalls& files = FileCalls::watch(directory_);
-    files.inject(fault);
+    FileCalls& calls = FileCalls::watch(directory_);
+    calls.inject(fault);
     TelemetryStore::Options own = options();
     own.path = path_;
     auto opened = TelemetryStore::open(own);
     if (!opened) {
       EXPECT_THAT(opened.error().description(), ::testing::StartsWith("quarvel.store"));
-      files.lift();
+      calls.lift();
       opened = TelemetryStore::open(own);
       EXPECT_TRUE(opened) << opened.error().description();
       if (!opened) return true;
     }
     TelemetryStore& store = *opened.value();
-    const Payload info;
-    const auto session = store.addAgentSession({1, 19, 2.0, true, "t", "c", "s", info});
+    const std::int64_t session = addSession(store);
     send(store, 10);
-    std::promise<std::optional<Error>> flushed;
-    EXPECT_TRUE(store.flush(session.value(), [&](const auto& error) { flushed.set_value(error); }));
+    auto flushed = flush(store, session);
     Await([&] {
-      return store.counters().waiting == 0 || files.failedCalls() > 4 ||
-             (!fault.forever && files.failedCalls() > 0);
+      return store.counters().waiting == 0 || calls.failedCalls() > 4 ||
+             (!fault.forever && calls.failedCalls() > 0);
     });
-    files.lift();
+    calls.lift();
     if (!resumes(store)) return true;
-    EXPECT_EQ(flushed.get_future().get(), std::nullopt);
+    EXPECT_EQ(flushed.get(), std::nullopt);
     // Once more, so that a fault that has not struck yet may strike on the way out.
-    if (files.failedCalls() == 0) files.inject(fault);
+    if (calls.failedCalls() == 0) calls.inject(fault);
     send(store, 2);
     store.close();
-    const bool struck = files.failedCalls() > 0;
-    files.lift();
+    const bool struck = calls.failedCalls() > 0;
+    calls.lift();
     FileCalls::watch({});
     inspect(store.counters(), found.empty() ? 0 : 20);
     return struck;

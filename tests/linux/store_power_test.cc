@@ -5,9 +5,7 @@
 #include <unistd.h>
 
 #include <cstdlib>
-#include <fstream>
 #include <functional>
-#include <future>
 #include <optional>
 #include <random>
 
@@ -47,21 +45,12 @@ class PowerTest : public StoreFixture {
   void start() { store_ = open(options_); }
   void send(int rows, std::size_t length = 20) {
     for (int i = 0; i < rows; ++i) {
-      const Payload payload(Dictionary{{"n", ++sent_}, {"text", std::string(length, 'x')}});
-      ASSERT_TRUE(store_->addMessage({std::nullopt, 7, "client", "service", 1, 2, payload}));
+      ASSERT_TRUE(StoreFixture::send(
+          *store_, Payload(Dictionary{{"n", ++sent_}, {"text", std::string(length, 'x')}})));
     }
   }
-  void awaitStored() {
-    Await([this] { return store_->counters().waiting == 0; });
-  }
-  void flush() {
-    const Payload info;
-    const auto session =
-        store_->addAgentSession({1, 19, 2.0, true, "token", "client", "service", info});
-    std::promise<void> done;
-    ASSERT_TRUE(store_->flush(session.value(), [&done](const auto&) { done.set_value(); }));
-    done.get_future().wait();
-  }
+  void awaitStored() { StoreFixture::awaitStored(*store_); }
+  void flush() { StoreFixture::flush(*store_, addSession(*store_)).wait(); }
   /// Everything sent so far must survive.
   void promise() { files_->mark(sent_); }
   void failNextSync() { files_->inject({.error = EIO, .only = FileCalls::Purpose::sync}); }
@@ -71,8 +60,7 @@ class PowerTest : public StoreFixture {
   }
 
   Record record(const Run& run) {
-    std::filesystem::remove_all(directory_);
-    std::filesystem::create_directory(directory_);
+    put({});
     options_ = run.options;
     sent_ = 0;
     files_ = &FileCalls::watch(directory_);
@@ -81,14 +69,6 @@ class PowerTest : public StoreFixture {
     Record record = files_->takeRecord();
     FileCalls::watch({});
     return record;
-  }
-
-  void put(const PowerCut::Image& image) {
-    std::filesystem::remove_all(directory_);
-    std::filesystem::create_directory(directory_);
-    for (const auto& [name, content] : image) {
-      std::ofstream(directory_ / name, std::ios::binary) << content;
-    }
   }
 
   /// Puts the files there and opens the store that they make. Says what the cut has broken.
@@ -101,9 +81,7 @@ class PowerTest : public StoreFixture {
     sent_ = -2;
     send(1);
     store_.reset();
-    for (const LogRecorder::Line& line : LogRecorder::take()) {
-      if (line.level == LogLevel::error) return line.message;
-    }
+    if (const auto errors = LogRecorder::takeErrors(); !errors.empty()) return errors.front();
     SqliteConnection connection;
     if (!connection.open(path_)) return connection.message();
     const auto found =

@@ -6,7 +6,6 @@
 #include <atomic>
 #include <fstream>
 #include <future>
-#include <limits>
 #include <set>
 #include <thread>
 
@@ -31,22 +30,13 @@ class StoreTest : public StoreFixture {
   StoreTest() { LogRecorder::take(); }
 
   static Payload payload(std::int64_t number) { return Payload(Dictionary{{"n", number}}); }
+  using StoreFixture::send;
   static Outcome send(TelemetryStore& store, std::int64_t number, std::int64_t sessionID = 7) {
-    return store.addMessage({std::nullopt, sessionID, "client", "service", 1, 2, payload(number)});
-  }
-  static Outcome send(TelemetryStore& store, const Payload& payload) {
-    return store.addMessage({std::nullopt, 7, "client", "service", 1, 2, payload});
+    return send(store, payload(number), sessionID);
   }
   static void sendAndAwait(TelemetryStore& store, std::int64_t number) {
     ASSERT_TRUE(send(store, number));
-    Await([&] { return store.counters().waiting == 0; });
-  }
-  static std::vector<std::string> errorLines() {
-    std::vector<std::string> messages;
-    for (const LogRecorder::Line& line : LogRecorder::take()) {
-      if (line.level == LogLevel::error) messages.push_back(line.message);
-    }
-    return messages;
+    awaitStored(store);
   }
   std::uintmax_t fileBytes() const { return std::filesystem::file_size(path_); }
 };
@@ -82,25 +72,6 @@ TEST_F(StoreTest, KeepsEachKindOfRowWithAllItWasGiven) {
   EXPECT_THAT(rows("SELECT * FROM power_event"), ElementsAre(R"(1|-28||{"n":4}|1000000)"));
 }
 
-TEST_F(StoreTest, WritesPayloadsAsJsonThatKeepsOrderAndKinds) {
-  auto store = open();
-  const Payload odd(Dictionary{{"z", Date{1'234'567us}},
-                               {"a", Bytes{std::string("\0\xff", 2)}},
-                               {-3, std::numeric_limits<double>::quiet_NaN()},
-                               {"inf", -std::numeric_limits<double>::infinity()},
-                               {"big", std::numeric_limits<std::uint64_t>::max()},
-                               {"list", List{Value(true), Value(nullptr), Value(2.5)}},
-                               {"text", "\"\n\xc3\xa4"}});
-  ASSERT_TRUE(send(*store, odd));
-  ASSERT_TRUE(send(*store, Payload()));
-  store->close();
-  EXPECT_THAT(rows("SELECT payload FROM message ORDER BY id"),
-              ElementsAre(R"({"z":"1970-01-01T00:00:01.234567Z","a":"AP8=","-3":"NaN",)"
-                          R"("inf":"-Infinity","big":18446744073709551615,"list":[true,null,2.5],)"
-                          "\"text\":\"\\\"\\n\xc3\xa4\"}",
-                          "{}"));
-}
-
 TEST_F(StoreTest, SaysWhatItIsAndGoesOnWhereItEnded) {
   const mode_t mask = umask(0077);
   auto store = open();
@@ -114,13 +85,12 @@ TEST_F(StoreTest, SaysWhatItIsAndGoesOnWhereItEnded) {
   const std::string storeID = value("SELECT value FROM meta WHERE key = 'store_id'");
   EXPECT_THAT(storeID,
               MatchesRegex("[0-9a-f]{8}-[0-9a-f]{4}-4[0-9a-f]{3}-[89ab][0-9a-f]{3}-[0-9a-f]{12}"));
-  const Payload info;
-  ASSERT_TRUE(store->addAgentSession({1, 19, 2.0, true, "t", "c", "s", info}));
+  addSession(*store);
   ASSERT_TRUE(send(*store, 1));
   store.reset();
 
   store = open();
-  EXPECT_EQ(store->addAgentSession({1, 19, 2.0, true, "t", "c", "s", info}).value(), 2);
+  EXPECT_EQ(addSession(*store), 2);
   ASSERT_TRUE(send(*store, 2));
   EXPECT_EQ(store->counters().accepted, 2U);
   store.reset();
@@ -150,61 +120,38 @@ TEST_F(StoreTest, RefusesWhatIsNotItsOwnAndSaysWhatToDo) {
   EXPECT_THAT(refusal("/sys/telemetry.db"),
               AllOf(HasSubstr("quarvel.store 4"), HasSubstr("Let the service write to /sys")));
   EXPECT_THAT(refusal(directory_), HasSubstr("quarvel.store 4"));
-  EXPECT_THAT(errorLines(), ::testing::IsEmpty());
+  EXPECT_THAT(LogRecorder::takeErrors(), ::testing::IsEmpty());
 }
 
-struct Damage {
-  const char* name;
-  void (*inflict)(const std::filesystem::path& path);
-  bool keepsTheRow = false;
-};
+TEST_F(StoreTest, ADamagedOneIsKeptAsideAndANewOneBegun) {
+  for (const bool onlyItsHeader : {false, true}) {
+    std::filesystem::remove_all(directory_);
+    std::filesystem::create_directory(directory_);
+    auto store = open();
+    ASSERT_TRUE(send(*store, 1));
+    store.reset();
+    if (onlyItsHeader) {
+      std::fstream file(path_, std::ios::in | std::ios::out | std::ios::binary);
+      file.seekp(68);
+      file << '\x11';  // one bit of the application's id: 0x51
+    } else {
+      std::ofstream(path_) << std::string(9999, 'x');
+    }
+    std::ofstream(path_.string() + "-wal") << "left over";
 
-// GoogleTest would print the bytes, those between the members too, which nobody has set.
-void PrintTo(const Damage& damage, std::ostream* out) {
-  *out << damage.name;
+    store = open({.clock = [] { return Date{1'700'000'000s}; }});
+    ASSERT_TRUE(send(*store, 2));
+    EXPECT_EQ(store->counters().accepted, onlyItsHeader ? 2U : 1U);
+    store.reset();
+    EXPECT_EQ(value("SELECT group_concat(payload ->> 'n') FROM message"),
+              onlyItsHeader ? "1,2" : "2");
+    const std::string aside = path_.string() + ".corrupt-20231114T221320.000000Z";
+    EXPECT_TRUE(std::filesystem::exists(aside));
+    EXPECT_TRUE(std::filesystem::exists(aside + "-wal"));
+    EXPECT_THAT(LogRecorder::takeErrors(),
+                ElementsAre(HasSubstr(aside), HasSubstr(" rows could be read")));
+  }
 }
-
-class DamagedStoreTest : public StoreTest, public ::testing::WithParamInterface<Damage> {};
-
-TEST_P(DamagedStoreTest, IsKeptAsideAndANewOneBegun) {
-  auto store = open();
-  ASSERT_TRUE(send(*store, 1));
-  store.reset();
-  GetParam().inflict(path_);
-  std::ofstream(path_.string() + "-wal") << "left over";
-
-  store = open({.clock = [] { return Date{1'700'000'000s}; }});
-  ASSERT_TRUE(send(*store, 2));
-  EXPECT_EQ(store->counters().accepted, GetParam().keepsTheRow ? 2U : 1U);
-  store.reset();
-  EXPECT_EQ(value("SELECT group_concat(payload ->> 'n') FROM message"),
-            GetParam().keepsTheRow ? "1,2" : "2");
-  const std::string aside = path_.string() + ".corrupt-20231114T221320.000000Z";
-  EXPECT_TRUE(std::filesystem::exists(aside));
-  EXPECT_TRUE(std::filesystem::exists(aside + "-wal"));
-  EXPECT_THAT(errorLines(), ElementsAre(HasSubstr(aside), HasSubstr(" rows could be read")));
-}
-
-INSTANTIATE_TEST_SUITE_P(
-    Damages, DamagedStoreTest,
-    ::testing::Values(
-        Damage{"NoDatabase",
-               [](const auto& path) { std::ofstream(path) << std::string(9999, 'x'); }},
-        Damage{"CutShort", [](const auto& path) { std::filesystem::resize_file(path, 8192); }},
-        Damage{"OneBitOfItsHeader",
-               [](const auto& path) {
-                 std::fstream file(path, std::ios::in | std::ios::out | std::ios::binary);
-                 file.seekp(68);
-                 file << '\x11';  // of the application's id: 0x51
-               },
-               true},
-        Damage{"PagesOverwritten",
-               [](const auto& path) {
-                 std::fstream file(path, std::ios::in | std::ios::out | std::ios::binary);
-                 file.seekp(4096);
-                 file << std::string(std::filesystem::file_size(path) - 4096, '\x5a');
-               }}),
-    [](const auto& row) { return row.param.name; });
 
 TEST_F(StoreTest, CorruptionMetLaterLosesNoRowOnItsWay) {
   Date now{0us};
@@ -244,7 +191,7 @@ TEST_F(StoreTest, OneTransactionTakesWhatGatheredAndNoMoreThan1024Rows) {
   files.awaitHeld();
   for (int i = 0; i < 2500; ++i) ASSERT_TRUE(send(*store, i));
   files.release();
-  Await([&] { return store->counters().waiting == 0; });
+  awaitStored(*store);
   EXPECT_EQ(files.counts().commits, before + 3 + 1 + 3);
 }
 
@@ -267,9 +214,7 @@ TEST_F(StoreTest, HoldsSendersBackAtItsBoundsAndKeepsEveryRow) {
       for (int i = 0; i < 300; ++i) ASSERT_TRUE(send(*store, bounded.payload));
     });
     Await([&] { return store->counters().waiting == bounded.waiting; });
-    const Payload info;
-    EXPECT_TRUE(store->addAgentSession({1, 19, 2.0, true, "t", "c", "s", info}))
-        << "is not held back";
+    addSession(*store);  // is not held back
     EXPECT_EQ(store->counters().waiting, bounded.waiting);
     files.release();
     sender.join();
@@ -281,15 +226,15 @@ TEST_F(StoreTest, HoldsSendersBackAtItsBoundsAndKeepsEveryRow) {
 TEST_F(StoreTest, AFullDiskDelaysRowsAndLosesNone) {
   FileCalls& files = FileCalls::watch(directory_);
   auto store = open({.queueRows = 50});
-  files.setFull(true);
+  files.inject(FileCalls::fullDisk());
   std::thread sender([&] {
     for (int i = 0; i < 200; ++i) ASSERT_TRUE(send(*store, i));
   });
-  files.awaitRefusedWrites(3);
+  files.awaitFailedCalls(3);
   Await([&] { return store->counters().waiting == 50; });
-  EXPECT_THAT(errorLines(), ElementsAre(AllOf(HasSubstr("fails"), HasSubstr("full"))))
+  EXPECT_THAT(LogRecorder::takeErrors(), ElementsAre(AllOf(HasSubstr("fails"), HasSubstr("full"))))
       << "one line however often it is tried";
-  files.setFull(false);
+  files.lift();
   sender.join();
   store->close();
   EXPECT_THAT(store->counters(), AllOf(IsBalanced(), Field(&StoreCounters::stored, 200)));
@@ -303,30 +248,27 @@ TEST_F(StoreTest, ClosingOnAFullDiskCountsWhatIsLost) {
   FileCalls& files = FileCalls::watch(directory_);
   auto store = open({.queueRows = 5});
   sendAndAwait(*store, 0);
-  files.setFull(true);
+  files.inject(FileCalls::fullDisk());
   for (int i = 1; i <= 5; ++i) ASSERT_TRUE(send(*store, i));
-  std::promise<std::optional<Error>> flushed;
-  ASSERT_TRUE(store->flush(1, [&](const auto& error) { flushed.set_value(error); }));
+  auto flushed = flush(*store, 1);
   auto heldBack = std::async(std::launch::async, [&] { return send(*store, 6); });
-  files.awaitRefusedWrites(1);
+  files.awaitFailedCalls(1);
   store->close();
 
-  EXPECT_THAT(flushed.get_future().get()->description(), HasSubstr("quarvel.store 2"));
+  EXPECT_THAT(flushed.get()->description(), HasSubstr("quarvel.store 2"));
   const Outcome refused = heldBack.get();
   ASSERT_FALSE(refused);
   EXPECT_EQ(refused.error().code, static_cast<std::int64_t>(StoreErrorCode::closed));
   EXPECT_THAT(store->counters(),
               AllOf(IsBalanced(), Field(&StoreCounters::stored, 1),
                     Dropped(StoreDrop::storeClosed, 5), Dropped(StoreDrop::refused, 1)));
-  EXPECT_THAT(errorLines(), ElementsAre(HasSubstr("fails"), HasSubstr("5 are lost")));
+  EXPECT_THAT(LogRecorder::takeErrors(), ElementsAre(HasSubstr("fails"), HasSubstr("5 are lost")));
 }
 
 TEST_F(StoreTest, AFlushCoversEverythingBeforeItWithOneSync) {
   FileCalls& files = FileCalls::watch(directory_);
   auto store = open({.sync = 24h, .clock = [] { return Date{5us}; }});
-  const Payload info;
-  const std::int64_t session =
-      store->addAgentSession({1, 19, 2.0, true, "t", "c", "s", info}).value();
+  const std::int64_t session = addSession(*store);
   for (int i = 0; i < 100; ++i) sendAndAwait(*store, i);
   const int unsynced = files.counts().logSyncs;
   EXPECT_LE(unsynced, 1) << "only a new log's head is synced";
@@ -427,22 +369,19 @@ TEST_F(StoreTest, AFileThatIsTakenAwayIsPutBackWithAllThatWasInIt) {
 
 TEST_F(StoreTest, OpensLaterWhenTheDiskHasNoRoomAtFirst) {
   auto store = open();
-  const Payload info;
-  const TelemetryStore::AgentSession session{1, 19, 2.0, true, "t", "c", "s", info};
-  EXPECT_EQ(store->addAgentSession(session).value(), 1);
+  EXPECT_EQ(addSession(*store), 1);
   store.reset();
 
   FileCalls& files = FileCalls::watch(directory_);
-  files.setFull(true);
+  files.inject(FileCalls::fullDisk());
   store = open({.firstBackOff = 1ms});
   EXPECT_THAT(store->state().problem.value_or(""), HasSubstr("quarvel.store"));
-  const std::int64_t second = store->addAgentSession(session).value();
+  const std::int64_t second = addSession(*store);
   ASSERT_TRUE(store->addMessage({second, 1, "client", "service", 1, 2, payload(1)}));
-  std::promise<std::optional<Error>> flushed;
-  ASSERT_TRUE(store->flush(second, [&](const auto& error) { flushed.set_value(error); }));
-  files.awaitRefusedWrites(3);
-  files.setFull(false);
-  EXPECT_EQ(flushed.get_future().get(), std::nullopt);
+  auto flushed = flush(*store, second);
+  files.awaitFailedCalls(3);
+  files.lift();
+  EXPECT_EQ(flushed.get(), std::nullopt);
   EXPECT_EQ(store->state().problem, std::nullopt);
   store->close();
   EXPECT_THAT(rows("SELECT m.agent_session, s.id, s.flushed_at > 0 FROM message m, agent_session s"
@@ -530,13 +469,13 @@ TEST_F(StoreRetentionTest, RowsThatNoBackendHasHadGoLastAndAreReported) {
   EXPECT_GT(store->counters().dropped[StoreDrop::retention], 0U);
   EXPECT_EQ(value("SELECT count(*) FROM message WHERE id > 1000"), "3300");
   EXPECT_EQ(value("SELECT count(*) FROM power_event WHERE id > 200"), "230");
-  EXPECT_THAT(errorLines(), ::testing::IsEmpty());
+  EXPECT_THAT(LogRecorder::takeErrors(), ::testing::IsEmpty());
 
   store = open(limited);
   fill(*store, 10'000);
   store->close();
   EXPECT_LE(fileBytes(), kBound);
-  EXPECT_THAT(errorLines(),
+  EXPECT_THAT(LogRecorder::takeErrors(),
               ::testing::Contains(HasSubstr("rows were removed that no backend has had")));
 }
 
@@ -555,12 +494,7 @@ TEST_F(StoreRetentionTest, AFileAboveALoweredBoundShrinks) {
 
 TEST_F(StoreRetentionTest, RowsPastTheirAgeGoAndTheirIDsAreNotGivenAgain) {
   auto store = open(options());
-  const Payload info;
-  const std::int64_t flushed =
-      store->addAgentSession({1, 19, 2.0, true, "t", "c", "s", info}).value();
-  std::promise<void> done;
-  ASSERT_TRUE(store->flush(flushed, [&done](const auto&) { done.set_value(); }));
-  done.get_future().wait();
+  flush(*store, addSession(*store)).wait();
   fill(*store, 1000);
   store.reset();
   now_ = Date{14 * 24h + 500s};
@@ -578,7 +512,7 @@ TEST_F(StoreRetentionTest, RowsPastTheirAgeGoAndTheirIDsAreNotGivenAgain) {
   store = open(options());
   EXPECT_EQ(store->counters().accepted, 1102U);
   ASSERT_TRUE(send(*store, 3));
-  EXPECT_EQ(store->addAgentSession({1, 19, 2.0, true, "t", "c", "s", info}).value(), 2);
+  EXPECT_EQ(addSession(*store), 2);
   store.reset();
   EXPECT_THAT(rows("SELECT id FROM message"), ElementsAre("1002", "1003"));
 }
@@ -596,7 +530,7 @@ TEST_F(StoreRetentionTest, AClockSetByTenYearsEmptiesNothing) {
     sendAndAwait(*store, 11);
     store->close();
     EXPECT_EQ(store->counters().stored, before + 12);
-    EXPECT_THAT(errorLines(), ::testing::IsEmpty());
+    EXPECT_THAT(LogRecorder::takeErrors(), ::testing::IsEmpty());
   }
 }
 

@@ -4,15 +4,11 @@
 
 #include <array>
 #include <cmath>
-#include <fstream>
-#include <iterator>
-#include <sstream>
 #include <string>
 #include <thread>
 
 #include "platform/Process.h"
 #include "platform/Random.h"
-#include "platform/Trace.h"
 
 namespace quarvel {
 namespace {
@@ -60,17 +56,6 @@ TEST(ProcessTest, NameThatIsNoTextIsNone) {
     pthread_setname_np(pthread_self(), "\xff\xfe");
     EXPECT_EQ(ProcessCommandName(gettid()), std::nullopt);
   }).join();
-}
-
-TEST(TraceTest, ProbeCanBeFoundByTracingTools) {
-  EmitKernelTrace(0x21042814);
-  std::stringstream bytes;
-  bytes << std::ifstream("/proc/self/exe", std::ios::binary).rdbuf();
-  std::string provider = "quarvel";
-  provider += '\0';
-  provider += "event";
-  provider += '\0';
-  EXPECT_NE(bytes.str().find(provider), std::string::npos);
 }
 
 }  // namespace

@@ -13,8 +13,8 @@
 #include "platform/Tallix.h"
 #include "platform/linux/sources/TallixFacility.h"
 #include "platform/linux/sources/TallixSampling.h"
+#include "tests/TemporaryDirectory.h"
 #include "tests/linux/LogRecorder.h"
-#include "tests/linux/TemporaryDirectory.h"
 
 namespace quarvel {
 namespace {

@@ -3,10 +3,11 @@
 import os
 import pathlib
 import re
-import sqlite3
 import subprocess
 import tempfile
 import unittest
+
+from harness import Client, Service
 
 SOURCE = pathlib.Path(os.environ["QUARVEL_SOURCE"])
 PREFIX = pathlib.Path(os.environ["QUARVEL_PREFIX"])
@@ -137,19 +138,19 @@ class CommandLine(unittest.TestCase):
         self.assertEqual(self.complete("defaults", "--domain", "x", "wr"), {"write"})
 
     def test_bash_completes_reporter_ids_from_the_store(self):
-        with tempfile.TemporaryDirectory() as directory:
-            schema = (SOURCE / "tests/tools/quarvelctl_test.py").read_text().split('"""')[3]
-            store = sqlite3.connect(pathlib.Path(directory) / "telemetry.db")
-            store.executescript(schema)
-            for reporter in (4102, 4103, -7):
-                store.execute("INSERT INTO agent_session VALUES(NULL,?,1,2.0,1,'','','',?,0,1)",
-                              (reporter, '{"session":99}'))
-            store.commit()
-            store.close()
-            os.environ["STATE_DIRECTORY"] = directory
-            self.addCleanup(os.environ.pop, "STATE_DIRECTORY")
-            self.assertEqual(self.complete("summary", ""), {"4102", "4103", "-7"})
-            self.assertEqual(self.complete("messages", "--session", "41"), {"4102", "4103"})
+        service = Service()
+        self.addCleanup(service.tidy)
+        service.start()
+        self.addCleanup(service.finish)
+        client = Client(service)
+        self.addCleanup(client.close)
+        for reporter in (4102, 4103, -7):
+            client.start_session(reporter, configuration={"session": 99})
+        service.wait_for_rows(3, "agent_session")
+        os.environ["STATE_DIRECTORY"] = str(service.directory / "state")
+        self.addCleanup(os.environ.pop, "STATE_DIRECTORY")
+        self.assertEqual(self.complete("summary", ""), {"4102", "4103", "-7"})
+        self.assertEqual(self.complete("messages", "--session", "41"), {"4102", "4103"})
 
     def test_zsh_knows_every_command_and_option(self):
         completion = PREFIX / "share/zsh/vendor-completions/_quarvelctl"

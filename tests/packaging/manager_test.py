@@ -1,32 +1,18 @@
 """What a service manager asks of the installed service: its socket is passed in, it says when it is
 ready, alive and stopping, and the units do what they say."""
 
-import configparser
 import os
 import pathlib
-import shlex
+import re
 import signal
 import socket
 import subprocess
+import tempfile
 import unittest
 
-from harness import PATIENCE, PREFIX, QUARVELD, Client, ServiceTest, eventually
+from harness import PATIENCE, PREFIX, QUARVELD, ServiceTest, eventually
 
 UNITS = PREFIX / "lib/systemd/system"
-
-
-def unit(name):
-    """A unit's settings; of those that come several times, the last."""
-    parser = configparser.RawConfigParser(strict=False)
-    parser.optionxform = str
-    parser.read(UNITS / name)
-    return parser
-
-
-def command(setting):
-    """A command of the service's unit, as it is here instead of where it will be installed."""
-    program, *arguments = shlex.split(unit("quarvel.service")["Service"][setting])
-    return [PREFIX / pathlib.Path(program).relative_to("/usr"), *arguments]
 
 
 class Manager(ServiceTest):
@@ -83,7 +69,9 @@ class Manager(ServiceTest):
             if name in service.environment:
                 arguments.append(f"--setenv={name}={service.environment[name]}")
         with open(service.log_path, "wb") as log:
-            service.process = subprocess.Popen([*arguments, *command("ExecStart")], stderr=log)
+            # As it is here instead of where it will be installed.
+            program = re.search("^ExecStart=/usr/(.*)$", (UNITS / "quarvel.service").read_text(), re.MULTILINE)[1]
+            service.process = subprocess.Popen([*arguments, PREFIX / program], stderr=log)
         self.addCleanup(service.finish)
         eventually(service.socket.exists, "the socket")
         self.assertNotIn("quarveld", service.log(), "nobody has come yet")
@@ -94,27 +82,6 @@ class Manager(ServiceTest):
         self.assertEqual(service.end(), 0)
         self.assertEqual(service.count("message WHERE session_id = 5"), 2, "and the summary")
         self.assertTrue(service.socket.exists(), "it belongs to whoever passed it in")
-
-    def test_reloading_makes_it_read_its_preferences(self):
-        service = self.service()
-        client = self.client(service)
-        send = ("sendMessage:withCategory:andType:forReportingIDs:reply:", {}, 3, 1, None)
-
-        def refused():
-            identifier = client.send(*send)
-            with_error = False
-            try:
-                client.wait(identifier)
-            except Exception as error:
-                with_error = error.domain == "tarnwick.audio.reporting"
-            return with_error
-
-        self.assertFalse(refused())
-        service.prefer(disable_reporting=True)
-        self.assertFalse(refused(), "it has not been told yet")
-        subprocess.run(command("ExecReload"), env=service.environment, check=True, timeout=PATIENCE,
-                       stdout=subprocess.DEVNULL)
-        eventually(refused, "reporting is off")
 
 
 class Units(unittest.TestCase):
@@ -130,7 +97,7 @@ class Units(unittest.TestCase):
     def test_systemd_understands_every_line(self):
         # The programs are looked for where they will be, so the units are read as they are here.
         text = (UNITS / "quarvel.service").read_text()
-        directory = pathlib.Path(self.enterContext(temporary_directory()))
+        directory = pathlib.Path(self.enterContext(tempfile.TemporaryDirectory(prefix="quarvel-units-")))
         (directory / "quarvel.service").write_text(text.replace("/usr/", f"{PREFIX}/"))
         (directory / "quarvel.socket").write_text((UNITS / "quarvel.socket").read_text())
         found = self.analyze("verify", "--recursive-errors=one", "--man=no",
@@ -140,24 +107,6 @@ class Units(unittest.TestCase):
     def test_the_service_is_locked_up(self):
         self.analyze("security", "--offline=yes", f"--threshold={round(self.MOST_EXPOSURE * 10)}",
                      "--no-pager", UNITS / "quarvel.service")
-
-    def test_user_and_directories_are_made_before_they_are_used(self):
-        service = unit("quarvel.service")["Service"]
-        sockets = unit("quarvel.socket")["Socket"]
-        sysusers = (PREFIX / "lib/sysusers.d/quarvel.conf").read_text()
-        tmpfiles = (PREFIX / "lib/tmpfiles.d/quarvel.conf").read_text()
-        self.assertIn(f"u {service['User']} -", sysusers)
-        self.assertEqual(service["User"], sockets["SocketUser"])
-        directory = f"/run/{service['RuntimeDirectory']}"
-        self.assertEqual(sockets["ListenStream"], f"{directory}/reporting.sock")
-        # Of another's, systemd would give all that is in it to the service's group, the socket too.
-        self.assertIn(f"d {directory} {service['RuntimeDirectoryMode']} {service['User']} {service['Group']}",
-                      tmpfiles)
-
-
-def temporary_directory():
-    import tempfile
-    return tempfile.TemporaryDirectory(prefix="quarvel-units-")
 
 
 if __name__ == "__main__":

@@ -52,9 +52,4 @@ std::int32_t RegisterForNotification(std::string_view name, NotificationToken& t
   return notifications.registrationStatus;
 }
 
-std::int32_t PostNotification(std::string_view name) {
-  Simulation::current().notifications.post(name);
-  return 0;
-}
-
 }  // namespace quarvel

@@ -22,4 +22,16 @@ void OhmrikLogRegisteredEvent(std::int32_t domain, std::string_view name, const 
   simulation.ohmrik.records.push_back({domain, std::string(name), record, simulation.elapsed()});
 }
 
+void CountAcceptedMessage() {
+  ++Simulation::current().counters.accepted;
+}
+
+void CountDroppedMessage(MessageDrop reason) {
+  ++Simulation::current().counters.dropped[static_cast<std::size_t>(reason)];
+}
+
+void AddToGauge(Gauge gauge, int difference) {
+  Simulation::current().counters.gauges[static_cast<std::size_t>(gauge)] += difference;
+}
+
 }  // namespace quarvel

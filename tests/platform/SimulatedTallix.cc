@@ -92,10 +92,6 @@ TallixSamples TallixCreateSamplesDelta(const TallixSamples& earlier, const Talli
         Error{kTallixErrorDomain, static_cast<std::int64_t>(TallixErrorCode::noEarlierSamples), {}};
     return nullptr;
   }
-  if (Tallix().deltaError) {
-    error = Tallix().deltaError;
-    return nullptr;
-  }
   auto delta = std::make_shared<TallixSampleSet>(*later);
   for (std::size_t i = 0; i < delta->samples.size(); ++i) {
     delta->samples[i].value -= earlier->samples.at(i).value;

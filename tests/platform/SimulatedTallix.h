@@ -27,7 +27,6 @@ struct SimulatedTallix {
   // Switches.
   std::optional<Error> channelsError;  // the channels are returned all the same
   std::optional<Error> samplesError;
-  std::optional<Error> deltaError;
 };
 
 }  // namespace quarvel

@@ -15,7 +15,6 @@
 #include "tests/platform/Scheduler.h"
 #include "tests/platform/Seeds.h"
 #include "tests/platform/SimulatedAgent.h"
-#include "tests/platform/SimulatedCounters.h"
 #include "tests/platform/SimulatedListener.h"
 #include "tests/platform/SimulatedLog.h"
 #include "tests/platform/SimulatedSettings.h"

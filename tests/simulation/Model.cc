@@ -17,6 +17,7 @@ std::string CategoryName(std::uint32_t category) {
   static const std::map<std::uint32_t, std::string> kNames = {{3, "Playback"},
                                                               {0x2000'0003, "HAL_Playback"},
                                                               {0x4000'0007, "Routing_RouteChange"},
+                                                              {0x2000'0007, "HAL_RouteChange"},
                                                               {0x1000'1234, "DSP_Undefined"}};
   return kNames.at(category);
 }

@@ -18,7 +18,7 @@ constexpr std::int64_t kReporterIDs[] = {0,
                                          std::numeric_limits<std::int64_t>::min(),
                                          std::numeric_limits<std::int64_t>::max()};
 constexpr std::uint16_t kServiceTypes[] = {2, 3, 4, 7, 11, 65535};
-constexpr std::uint32_t kCategories[] = {3, 0x2000'0003, 0x4000'0007, 0x1000'1234};
+constexpr std::uint32_t kCategories[] = {3, 0x2000'0003, 0x4000'0007, 0x2000'0007, 0x1000'1234};
 constexpr std::uint16_t kTypes[] = {1, 2, 99};
 constexpr Date::duration kSteps[] = {1s, 1min, 24h, 24h * 3650};
 
@@ -34,7 +34,7 @@ World::World(std::uint64_t seed, Lie lie)
                [](Simulation& simulation) {
                  simulation.deviceProperties["InternalBuild"] = isInternalBuild();
                }),
-      simulation_(service_.simulation) {
+      simulation_(service_) {
   simulation_.lie = lie;
   simulation_.deviceProperties["DeviceClassNumber"] = std::int64_t{oneIn(2) ? 6 : 1};
   simulation_.spuriousWakeUps = oneIn(4);

@@ -1,10 +1,10 @@
-"""quarvelctl as people and programs use it: as a process, against a socket and a store."""
+"""quarvelctl as people and programs use it: as a process, against the installed service and a store."""
 
-import datetime
 import json
 import os
 import pathlib
 import pty
+import shutil
 import sqlite3
 import subprocess
 import sys
@@ -14,23 +14,17 @@ import time
 import tomllib
 import unittest
 
-from fake_service import FakeService, KILL, REPORTERS, START, STOP, VALID
+import harness
 
 QUARVELCTL = (pathlib.Path(__file__).resolve().parent.parent / "launch", sys.argv.pop(1))
-SCHEMA = """
-PRAGMA journal_mode = WAL; PRAGMA application_id = 0x51525654; PRAGMA user_version = 1;
-CREATE TABLE agent_session(id INTEGER PRIMARY KEY, session_id INTEGER NOT NULL,
-  client_type INTEGER NOT NULL, client_version REAL NOT NULL, batch_event INTEGER NOT NULL,
-  hierarchy_token TEXT NOT NULL, client_name TEXT NOT NULL, service_name TEXT NOT NULL,
-  user_info TEXT NOT NULL, opened_at INTEGER NOT NULL, flushed_at INTEGER);
-CREATE TABLE message(id INTEGER PRIMARY KEY, agent_session INTEGER REFERENCES agent_session(id),
-  session_id INTEGER NOT NULL, client_name TEXT NOT NULL, service_name TEXT NOT NULL,
-  category INTEGER NOT NULL, type INTEGER NOT NULL, payload TEXT NOT NULL, sent_at INTEGER NOT NULL);
-CREATE TABLE analytics_event(id INTEGER PRIMARY KEY, name TEXT NOT NULL, payload TEXT NOT NULL,
-  recorded_at INTEGER NOT NULL);
-CREATE TABLE power_event(id INTEGER PRIMARY KEY, domain INTEGER NOT NULL, name TEXT NOT NULL,
-  payload TEXT NOT NULL, recorded_at INTEGER NOT NULL);
-"""
+CREATE = "createReportingSession:reply:"
+SET_TYPE = "setServiceType:reportingSession:reply:"
+START = "startReportingSessionForID:reply:"
+SEND = "sendMessage:withCategory:andType:forReportingIDs:reply:"
+STOP = "stopReportingSessionForID:reply:"
+VALID = "reporterID:valid:"
+REPORTERS = "getAllReporters:"
+KILL = "killService:"
 NOON = 1_769_860_800_000_000  # 2026-01-31T12:00:00Z
 
 
@@ -52,11 +46,23 @@ class ToolTest(unittest.TestCase):
         return ran.returncode, ran.stdout.splitlines(), ran.stderr
 
 
+    def new_store(self):
+        """The empty store that a service makes; a connection to it."""
+        service = harness.Service("[analytics]\nwanted = []\n")
+        self.addCleanup(service.tidy)
+        service.start()
+        service.end()
+        return sqlite3.connect(shutil.copy(service.directory / "state/telemetry.db", self.root), isolation_level=None)
+
+
 class ServiceTest(ToolTest):
     def setUp(self):
         super().setUp()
-        self.service = FakeService(self.environment["QUARVEL_SOCKET"], {7: 2, -8: 4242})
-        self.addCleanup(self.service.close)
+        self.service = harness.Service()
+        self.addCleanup(self.service.tidy)
+        self.service.start()
+        self.addCleanup(self.service.finish)
+        self.environment["QUARVEL_SOCKET"] = str(self.service.socket)
 
     def run_script(self, *steps):
         """Status, replies, standard error."""
@@ -65,37 +71,39 @@ class ServiceTest(ToolTest):
 
     def test_replies_are_printed_as_they_arrive_and_a_start_does_not_hold_up(self):
         status, replies, error = self.run_script(
-            {"call": START, "args": [7]}, {"call": STOP, "args": [7]}, {"call": VALID, "args": [7]},
-            {"expect": {"serviceType": 2, "reporterID": 7}}, {"sleep": 0},
-            {"call": REPORTERS, "wait": False})
+            {"call": CREATE, "args": [7]}, {"call": SET_TYPE, "args": [2, 7]}, {"call": START, "args": [7]},
+            {"call": VALID, "args": [7]}, {"expect": {"serviceType": 2, "reporterID": 7}}, {"sleep": 0},
+            {"call": STOP, "args": [7]}, {"call": REPORTERS, "wait": False})
         self.assertEqual((status, error), (0, ""))
-        self.assertEqual([reply["call"] for reply in replies], [STOP, START, VALID, REPORTERS])
-        self.assertEqual(replies[1], {"call": START, "args": [7], "result": True})
-        self.assertEqual(replies[3]["result"], [7, -8])
+        self.assertEqual([reply["call"] for reply in replies], [CREATE, SET_TYPE, VALID, START, STOP, REPORTERS])
+        self.assertEqual(replies[3], {"call": START, "args": [7], "result": True})
+        self.assertEqual(replies[5]["result"], [7])
 
     def test_a_start_that_is_never_answered_does_not_hang_the_script(self):
         status, replies, _ = self.run_script({"call": START, "args": [9]})
         self.assertEqual((status, replies), (0, []))
 
     def test_what_json_lacks_can_be_sent(self):
-        arguments = [{"At": {"$date": "2026-01-31T12:00:00.25Z"}, "Raw": {"$bytes": "AP8="},
-                      "Kept": {"$date": 1, "other": 2}}, 2**63, -1, 1.5, None]
-        status, replies, _ = self.run_script({"call": "anything", "args": arguments})
+        payload = {"At": {"$date": "2026-01-31T12:00:00.25Z"}, "Raw": {"$bytes": "AP8="},
+                   "Kept": {"$date": 1, "other": 2}, "Numbers": [2**63, -1, 1.5, None]}
+        arguments = [payload, 3, 1, None]
+        status, replies, _ = self.run_script({"call": SEND, "args": arguments})
         self.assertEqual((status, replies[0]["args"]), (0, arguments))
-        at = datetime.datetime(2026, 1, 31, 12, 0, 0, 250_000, datetime.timezone.utc)
-        self.assertEqual(self.service.calls, [["anything", [
-            {"At": at, "Raw": b"\0\xff", "Kept": {"$date": 1, "other": 2}}, 2**63, -1, 1.5, None]]])
+        [row] = self.service.wait_for_rows(1, "message")
+        self.assertEqual(json.loads(row["payload"]), payload | {"At": "2026-01-31T12:00:00.250000Z", "Raw": "AP8="})
 
     def test_an_expectation_that_fails_names_its_line(self):
-        status, _, error = self.run_script({"call": "anything"}, {"expect": True}, {"call": "unknown"},
+        status, _, error = self.run_script({"call": REPORTERS}, {"expect": []}, {"call": "unknown"},
                                            {"expect": True})
         self.assertEqual(status, 1)
         self.assertIn("standard input:4: The last reply is {\"domain\":\"quarvel.connection\"", error)
 
     def test_killing_ends_the_script_in_order(self):
-        status, replies, _ = self.run_script({"call": START, "args": [7]}, {"call": KILL})
+        status, replies, _ = self.run_script({"call": CREATE, "args": [7]}, {"call": START, "args": [7]}, {"call": KILL})
         self.assertEqual(status, 0)
-        self.assertEqual({reply["error"]["domain"] for reply in replies}, {"quarvel.client"})
+        self.assertEqual({reply["error"]["domain"] for reply in replies[1:]}, {"quarvel.client"})
+        self.service.end()
+        self.service.start()
         self.assertEqual(self.ctl("kill")[:2], (0, ["The service has ended."]))
 
     def test_nothing_is_played_of_a_file_with_a_fault(self):
@@ -109,13 +117,18 @@ class ServiceTest(ToolTest):
                 script = self.root / "script.jsonl"
                 script.write_text("# A comment, and a call that is right.\n{\"call\": \"x\"}\n" + line + "\n")
                 status, replies, error = self.ctl("run", script)
-                self.assertEqual((status, replies, self.service.calls), (1, [], []))
+                self.assertEqual((status, replies), (1, []))
                 self.assertIn("script.jsonl:3: ", error)
                 self.assertIn(reason, error)
 
     def test_reporters_and_validity(self):
-        self.assertEqual(self.ctl("reporters")[:2], (0, ["7", "-8"]))
-        self.assertEqual(self.ctl("reporters", "--json")[:2], (0, ["[7,-8]"]))
+        client = harness.Client(self.service)
+        self.addCleanup(client.close)
+        for reporter, service_type in ((7, 2), (-8, 4242)):
+            client.call(CREATE, reporter)
+            client.call(SET_TYPE, service_type, reporter)
+        self.assertEqual(self.ctl("reporters")[:2], (0, ["-8", "7"]))
+        self.assertEqual(self.ctl("reporters", "--json")[:2], (0, ["[-8,7]"]))
         self.assertEqual(self.ctl("valid", 7)[:2],
                          (0, ["7 is a reporting session of service type 2 (telephony)."]))
         self.assertIn("(without a name)", self.ctl("valid", -8)[1][0])
@@ -127,9 +140,8 @@ class ServiceTest(ToolTest):
 class StoreTest(ToolTest):
     def setUp(self):
         super().setUp()
-        self.store = sqlite3.connect(self.root / "telemetry.db", isolation_level=None)
+        self.store = self.new_store()
         self.addCleanup(self.store.close)
-        self.store.executescript(SCHEMA)
         info = json.dumps({"HostApplicationDisplayID": "org.example.dialer"})
         for number, flushed in ((7, NOON + 1_500_000), (8, None)):
             self.store.execute("INSERT INTO agent_session VALUES(NULL,?,19,2.0,1,'','tarnwick.quarvel',"
@@ -365,14 +377,12 @@ class RefusalTest(ToolTest):
     def test_what_is_no_store_of_this_version_is_left_alone(self):
         for statement, reason in (("PRAGMA user_version = 2", "is of version 2"),
                                   ("PRAGMA application_id = 7", "is not a telemetry store")):
-            path = self.root / "telemetry.db"
-            store = sqlite3.connect(path)
-            store.executescript(SCHEMA + statement)
+            store = self.new_store()
+            store.execute(statement)
             store.close()
             status, _, error = self.ctl("messages")
             self.assertEqual(status, 1)
             self.assertIn(reason, error)
-            path.unlink()
         (self.root / "text.db").write_text("Not a database, but long enough to be taken for one. " * 20)
         self.assertIn("cannot be read", self.ctl("messages", "--store", self.root / "text.db")[2])
 

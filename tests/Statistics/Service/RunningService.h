@@ -42,12 +42,12 @@ class Client : public SimulatedClient {
 };
 
 /// The whole service on the simulated platform, as its process entry sets it up.
-struct RunningService {
+struct RunningService : Simulation {
   /// `prepare` arranges what the service finds when it begins.
   explicit RunningService(
       std::uint64_t seed, const std::function<void(Simulation&)>& prepare = [](Simulation&) {})
-      : simulation(seed) {
-    prepare(simulation);
+      : Simulation(seed) {
+    prepare(*this);
     ProcessServiceListener().setDelegate(ZQReportingServiceDelegate::create());
     ProcessServiceListener().resume();
   }
@@ -55,19 +55,16 @@ struct RunningService {
   /// Connects a client and runs until it is registered, so that clients are in the order of their
   /// connecting.
   [[nodiscard]] Client connect(std::int32_t pid) {
-    Client client(simulation.listener.connect(pid));
-    simulation.run();
+    Client client(listener.connect(pid));
+    run();
     return client;
   }
   /// Gives the service's preferences domain these entries, and says so.
   void changePreferences(Dictionary entries) {
-    simulation.preferences["tarnwick.quarvel"] = std::move(entries);
-    simulation.notifications.post("tarnwick.quarvel.reporting");
-    simulation.run();
+    preferences["tarnwick.quarvel"] = std::move(entries);
+    notifications.post("tarnwick.quarvel.reporting");
+    run();
   }
-  void run() { simulation.run(); }
-
-  Simulation simulation;
 };
 
 }  // namespace quarvel

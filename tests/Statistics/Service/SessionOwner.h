@@ -13,15 +13,18 @@ namespace quarvel {
 
 /// A session whose owner is the test: it alone runs while the simulation does not, and so stands in
 /// for the `ServerQueue`.
-struct SessionOwner {
-  explicit SessionOwner(std::uint64_t seed, std::uint16_t serviceType = 0) : simulation(seed) {
-    holdServerQueue();
-    session->setServiceType(serviceType);
-    simulation.log.lines.clear();
-    simulation.journal.clear();
+struct SessionOwner : Simulation {
+  explicit SessionOwner(std::uint64_t seed, std::uint16_t serviceType = 0) : Simulation(seed) {
+    setServiceType(serviceType);
   }
   static void holdServerQueue() QUARVEL_ASSERT_CAPABILITY(serverQueueRole) {}
 
+  void setServiceType(std::uint16_t serviceType) {
+    holdServerQueue();
+    session->setServiceType(serviceType);
+    log.lines.clear();
+    journal.clear();
+  }
   void start() {
     holdServerQueue();
     session->start();
@@ -55,13 +58,12 @@ struct SessionOwner {
         [](const Dictionary&) {});
     return ids;
   }
-  [[nodiscard]] std::vector<std::string> errors() const { return simulation.log.texts("error"); }
+  [[nodiscard]] std::vector<std::string> errors() const { return log.texts("error"); }
   /// What reached the agent inside its one session.
   [[nodiscard]] const std::vector<SimulatedAgent::Message>& delivered() const {
-    return simulation.agent.sessions.at(0).messages;
+    return agent.sessions.at(0).messages;
   }
 
-  Simulation simulation;
   std::shared_ptr<ZQReportingSession> session = ZQReportingSession::initWithID(7, {42});
   std::vector<std::optional<Error>> sent;  // the replies to `send`
   std::vector<Value> ended;

@@ -32,8 +32,8 @@ std::string Key(const Payload& payload) {
 }
 
 /// A throttle whose blocks say when they ran.
-struct Throttled {
-  explicit Throttled(std::uint64_t seed) : simulation(seed) {}
+struct Throttled : Simulation {
+  using Simulation::Simulation;
 
   /// Adds a message whose block is called `name`; from a simulated thread or the test.
   void add(std::string name, const Payload& message = Payload(), ReporterID reporterID = 7) {
@@ -41,19 +41,19 @@ struct Throttled {
     blocks[name] = token;
     throttle->addMessageBlock(
         [this, name, token] {
-          ran.push_back({name, simulation.elapsed()});
+          ran.push_back({name, elapsed()});
         },
         reporterID, message, 3, 1);
   }
   /// From a caller's thread, when the time has come.
   void addAt(Scheduler::Duration time, const std::string& name,
              const Payload& message = Payload()) {
-    simulation.spawn("caller " + name, [this, time, name, message] {
-      SleepThread(time - simulation.elapsed());
+    spawn("caller " + name, [this, time, name, message] {
+      SleepThread(time - elapsed());
       add(name, message);
     });
   }
-  void runUntil(Scheduler::Duration elapsed) { simulation.scheduler.runUntil(elapsed); }
+  void runUntil(Scheduler::Duration moment) { scheduler.runUntil(moment); }
   [[nodiscard]] bool isAlive(const std::string& name) { return !blocks[name].expired(); }
   [[nodiscard]] std::vector<std::string> names() const {
     std::vector<std::string> names;
@@ -62,12 +62,11 @@ struct Throttled {
   }
   /// A moment that is any as far as the worker's pauses go.
   [[nodiscard]] Scheduler::Duration anyMoment() {
-    return kPause + Scheduler::Duration(simulation.scheduler.choose(300'000));
+    return kPause + Scheduler::Duration(scheduler.choose(300'000));
   }
 
   using Run = std::pair<std::string, Scheduler::Duration>;
 
-  Simulation simulation;
   std::vector<Run> ran;
   std::map<std::string, std::weak_ptr<int>> blocks;
   std::shared_ptr<ZQReportingBlockThrottle> throttle = ZQReportingBlockThrottle::init();
@@ -218,106 +217,78 @@ TEST(BlockThrottle, RunsAMessageWhenItsDelayIsOverAndNoSooner) {
       EXPECT_THAT(throttled.names(), ElementsAre("a")) << row.delay.count();
       EXPECT_FALSE(throttled.isAlive("a"));
       EXPECT_THAT(throttled.throttle->timersInFlight(), IsEmpty());
-      throttled.simulation.runFor(20s);
+      throttled.runFor(20s);
       EXPECT_THAT(throttled.ran, SizeIs(1));
     }
   }
 }
 
-TEST(BlockThrottle, OfABurstTheLastRunsOnceOneDelayAfterIt) {
-  for (const auto seed : Seeds()) {
-    Throttled throttled(seed);
-    Scheduler::Duration last = throttled.anyMoment();
-    throttled.addAt(last, "0");
-    const std::vector<std::string> older = {"0", "1", "2", "3", "4"};
-    for (int i = 1; i <= 5; ++i) {
-      last += Scheduler::Duration(1 + throttled.simulation.scheduler.choose(499'999));
-      throttled.addAt(last, std::to_string(i));
-    }
-    throttled.runUntil(last + 500ms - kInstant);
-    EXPECT_THAT(throttled.ran, IsEmpty());
-    EXPECT_TRUE(std::ranges::none_of(older, [&](auto& name) { return throttled.isAlive(name); }));
-    EXPECT_THAT(throttled.throttle->timersInFlight(), SizeIs(1));
-    throttled.simulation.runFor(kInstant);
-    EXPECT_THAT(throttled.ran, ElementsAre(Throttled::Run("5", last + 500ms)));
-
-    // The burst is over: an equal message is a new one.
-    throttled.add("6");
-    throttled.simulation.runFor(500ms);
-    EXPECT_THAT(throttled.names(), ElementsAre("5", "6"));
+SEEDED_TEST(BlockThrottle, OfABurstTheLastRunsOnceOneDelayAfterIt, Throttled) {
+  Scheduler::Duration last = anyMoment();
+  addAt(last, "0");
+  const std::vector<std::string> older = {"0", "1", "2", "3", "4"};
+  for (int i = 1; i <= 5; ++i) {
+    last += Scheduler::Duration(1 + scheduler.choose(499'999));
+    addAt(last, std::to_string(i));
   }
+  runUntil(last + 500ms - kInstant);
+  EXPECT_THAT(ran, IsEmpty());
+  EXPECT_TRUE(std::ranges::none_of(older, [&](auto& name) { return isAlive(name); }));
+  EXPECT_THAT(throttle->timersInFlight(), SizeIs(1));
+  runFor(kInstant);
+  EXPECT_THAT(ran, ElementsAre(Throttled::Run("5", last + 500ms)));
+
+  // The burst is over: an equal message is a new one.
+  add("6");
+  runFor(500ms);
+  EXPECT_THAT(names(), ElementsAre("5", "6"));
 }
 
-TEST(BlockThrottle, ALaterMessageBringsItsOwnDelay) {
-  for (const auto seed : Seeds()) {
-    Throttled throttled(seed);
-    throttled.addAt(0s, "a", Delayed(4));
-    throttled.addAt(1s, "b", Delayed(0.25));
-    throttled.addAt(2s, "c", Delayed(0.25));
-    throttled.addAt(2100ms, "d", Delayed(4));
-    throttled.addAt(3s, "e", Delayed(-1));
-    throttled.runUntil(10s);
-    EXPECT_THAT(throttled.ran, ElementsAre(Throttled::Run("b", 1250ms), Throttled::Run("e", 3s)));
-  }
+SEEDED_TEST(BlockThrottle, ALaterMessageBringsItsOwnDelay, Throttled) {
+  addAt(0s, "a", Delayed(4));
+  addAt(1s, "b", Delayed(0.25));
+  addAt(2s, "c", Delayed(0.25));
+  addAt(2100ms, "d", Delayed(4));
+  addAt(3s, "e", Delayed(-1));
+  runUntil(10s);
+  EXPECT_THAT(ran, ElementsAre(Throttled::Run("b", 1250ms), Throttled::Run("e", 3s)));
 }
 
 // The worker looks for new messages only when none is left on its run loop.
-TEST(BlockThrottle, AMessageThatComesWhileOthersWaitIsTakenUpAfterThem) {
-  for (const auto seed : Seeds()) {
-    Throttled throttled(seed);
-    throttled.add("long", Delayed(4.5));
-    throttled.runUntil(1s);
-    throttled.add("short", Payload(Dictionary{{"a", 1}}));
-    EXPECT_THAT(throttled.throttle->unscheduledTimerKeys(),
-                ElementsAre("a|1|reporterID|7|Playback|Start"));
-    throttled.runUntil(4500ms + kPause - kInstant);
-    EXPECT_THAT(throttled.names(), ElementsAre("long"));
-    throttled.runUntil(4500ms + kPause);
-    EXPECT_THAT(throttled.names(), ElementsAre("long", "short"));
-  }
+SEEDED_TEST(BlockThrottle, AMessageThatComesWhileOthersWaitIsTakenUpAfterThem, Throttled) {
+  add("long", Delayed(4.5));
+  runUntil(1s);
+  add("short", Payload(Dictionary{{"a", 1}}));
+  EXPECT_THAT(throttle->unscheduledTimerKeys(), ElementsAre("a|1|reporterID|7|Playback|Start"));
+  runUntil(4500ms + kPause - kInstant);
+  EXPECT_THAT(names(), ElementsAre("long"));
+  runUntil(4500ms + kPause);
+  EXPECT_THAT(names(), ElementsAre("long", "short"));
 }
 
-// At the very moment of the firing the message may be a duplicate still or a new one already.
-TEST(BlockThrottle, OfAMessageAndTheFiringOfAnEqualOneEitherMayComeFirst) {
-  using Runs = std::vector<Throttled::Run>;
-  for (const auto seed : Seeds()) {
-    Throttled throttled(seed);
-    throttled.addAt(0s, "older");
-    throttled.addAt(500ms, "newer");
-    throttled.runUntil(5s);
-    EXPECT_THAT(throttled.ran,
-                testing::AnyOf(Runs{{"older", 500ms}}, Runs{{"newer", 500ms}}, Runs{{"newer", 1s}},
-                               Runs{{"older", 500ms}, {"newer", 1s}}));
-    EXPECT_THAT(throttled.throttle->timersInFlight(), IsEmpty());
+SEEDED_TEST(BlockThrottle, BlocksRunOneAtATimeAndMayAddMessages, Throttled) {
+  int running = 0;
+  for (int i = 0; i < 3; ++i) {
+    throttle->addMessageBlock(
+        [&, i] {
+          EXPECT_EQ(++running, 1);
+          SleepThread(50ms);
+          if (i == 0) add("again", Payload(), 0);
+          --running;
+        },
+        i, Payload(), 3, 1);
   }
-}
-
-TEST(BlockThrottle, BlocksRunOneAtATimeAndMayAddMessages) {
-  for (const auto seed : Seeds()) {
-    Throttled throttled(seed);
-    int running = 0;
-    for (int i = 0; i < 3; ++i) {
-      throttled.throttle->addMessageBlock(
-          [&, i] {
-            EXPECT_EQ(++running, 1);
-            SleepThread(50ms);
-            if (i == 0) throttled.add("again", Payload(), 0);
-            --running;
-          },
-          i, Payload(), 3, 1);
-    }
-    throttled.throttle->addMessageBlock(Block(), 9, Payload(), 3, 1);
-    throttled.runUntil(2s);
-    EXPECT_THAT(throttled.names(), ElementsAre("again"));
-  }
+  throttle->addMessageBlock(Block(), 9, Payload(), 3, 1);
+  runUntil(2s);
+  EXPECT_THAT(names(), ElementsAre("again"));
 }
 
 /// A caller that waits for completion, from now on.
 struct Completion {
   explicit Completion(Throttled& throttled) {
-    throttled.simulation.spawn("waiter", [this, &throttled] {
+    throttled.spawn("waiter", [this, &throttled] {
       throttled.throttle->waitForCompletion();
-      over = throttled.simulation.elapsed();
+      over = throttled.elapsed();
     });
   }
   std::optional<Scheduler::Duration> over;
@@ -341,76 +312,65 @@ TEST(WaitForCompletion, ReturnsAtItsFirstLookThatFindsNothingPending) {
       const Completion completion(throttled);
       throttled.runUntil(10s);
       EXPECT_EQ(completion.over, row.over);
-      EXPECT_THAT(throttled.simulation.log.texts("default"), IsEmpty());
+      EXPECT_THAT(throttled.log.texts("default"), IsEmpty());
     }
   }
 }
 
-TEST(WaitForCompletion, GivesUpAfterFiveSecondsAndLeavesWhatIsPending) {
-  for (const auto seed : Seeds()) {
-    Throttled throttled(seed);
-    throttled.simulation.log.verbose = {"zqrr"};
-    throttled.add("a", Delayed(4));
-    throttled.runUntil(50ms);
-    throttled.add("unscheduled", Payload(Dictionary{{"a", 1}}));
-    throttled.addAt(3s, "b", Delayed(4));
-    const Completion completion(throttled);
-    throttled.runUntil(5050ms - kInstant);
-    EXPECT_EQ(completion.over, std::nullopt);
-    throttled.runUntil(7s - kInstant);
-    EXPECT_EQ(completion.over, 5050ms);
-    EXPECT_THAT(throttled.ran, IsEmpty());
-    throttled.runUntil(7150ms);
-    EXPECT_THAT(throttled.names(), ElementsAre("b", "unscheduled"));
+SEEDED_TEST(WaitForCompletion, GivesUpAfterFiveSecondsAndLeavesWhatIsPending, Throttled) {
+  log.verbose = {"zqrr"};
+  add("a", Delayed(4));
+  runUntil(50ms);
+  add("unscheduled", Payload(Dictionary{{"a", 1}}));
+  addAt(3s, "b", Delayed(4));
+  const Completion completion(*this);
+  runUntil(5050ms - kInstant);
+  EXPECT_EQ(completion.over, std::nullopt);
+  runUntil(7s - kInstant);
+  EXPECT_EQ(completion.over, 5050ms);
+  EXPECT_THAT(ran, IsEmpty());
+  runUntil(7150ms);
+  EXPECT_THAT(names(), ElementsAre("b", "unscheduled"));
 
-    std::vector<std::string> said;
-    for (const LogLine& line : throttled.simulation.log.lines) said.push_back(line.message);
-    EXPECT_THAT(
-        said, ElementsAre(
-                  "calling workingRunLoop run from inside thread block",
+  std::vector<std::string> said;
+  for (const LogLine& line : log.lines) said.push_back(line.message);
+  EXPECT_THAT(
+      said,
+      ElementsAre("calling workingRunLoop run from inside thread block",
                   "waitForCompletion. timersInFlight=2 unscheduledTimerKeys=1",
                   "Waiting up to 5 seconds for blockThrottle queue to be empty.",
                   "Dropping duplicate message for _throttle_seconds|^|reporterID|7|Playback|Start",
                   "Giving up on waiting for completion after 5 seconds. timersInFlight=2",
                   "sleeping in thread", "calling workingRunLoop run from inside thread block",
                   "sleeping in thread"));
-    EXPECT_THAT(throttled.simulation.log.texts(
-                    "default zqrr -[ZQReportingBlockThrottle waitForCompletion]: "),
-                SizeIs(1));
-  }
+  EXPECT_THAT(log.texts("default zqrr -[ZQReportingBlockThrottle waitForCompletion]: "), SizeIs(1));
 }
 
-TEST(BlockThrottle, EndsItsWorkerWhenToldToAndIsThenReleased) {
-  for (const auto seed : Seeds()) {
-    Throttled throttled(seed);
-    throttled.add("taken up", Delayed(2));
-    throttled.runUntil(1s);
-    throttled.add("too late", Payload(Dictionary{{"a", 1}}));
-    throttled.throttle->setShouldKeepRunning(false);
-    throttled.throttle->setQueueThread(nullptr);
-    throttled.simulation.run();  // would never end while the worker goes on
-    EXPECT_THAT(throttled.names(), ElementsAre("taken up"));
-    EXPECT_THAT(throttled.throttle->timersInFlight(), SizeIs(1));
-    const std::weak_ptr released = throttled.throttle;
-    throttled.throttle.reset();
-    EXPECT_TRUE(released.expired());
-    EXPECT_FALSE(throttled.isAlive("too late"));
-  }
+SEEDED_TEST(BlockThrottle, EndsItsWorkerWhenToldToAndIsThenReleased, Throttled) {
+  add("taken up", Delayed(2));
+  runUntil(1s);
+  add("too late", Payload(Dictionary{{"a", 1}}));
+  throttle->setShouldKeepRunning(false);
+  throttle->setQueueThread(nullptr);
+  run();  // would never end while the worker goes on
+  EXPECT_THAT(names(), ElementsAre("taken up"));
+  EXPECT_THAT(throttle->timersInFlight(), SizeIs(1));
+  const std::weak_ptr released = throttle;
+  throttle.reset();
+  EXPECT_TRUE(released.expired());
+  EXPECT_FALSE(isAlive("too late"));
 }
 
-TEST(BlockThrottle, AMessageTakenOutOfTheMapNeverRuns) {
-  for (const auto seed : Seeds()) {
-    Throttled throttled(seed);
-    throttled.add("taken up");
-    throttled.runUntil(200ms);
-    throttled.add("unscheduled", Payload(Dictionary{{"a", 1}}));
-    throttled.throttle->setTimersInFlight({});
-    EXPECT_FALSE(throttled.isAlive("unscheduled"));
-    throttled.runUntil(1s);
-    throttled.add("next");
-    throttled.runUntil(1500ms);
-    EXPECT_THAT(throttled.names(), ElementsAre("next"));
-  }
+SEEDED_TEST(BlockThrottle, AMessageTakenOutOfTheMapNeverRuns, Throttled) {
+  add("taken up");
+  runUntil(200ms);
+  add("unscheduled", Payload(Dictionary{{"a", 1}}));
+  throttle->setTimersInFlight({});
+  EXPECT_FALSE(isAlive("unscheduled"));
+  runUntil(1s);
+  add("next");
+  runUntil(1500ms);
+  EXPECT_THAT(names(), ElementsAre("next"));
 }
 
 }  // namespace

@@ -1,7 +1,5 @@
 #include <gmock/gmock.h>
 
-#include <algorithm>
-
 #include "tests/Statistics/Service/RunningService.h"
 
 namespace quarvel {
@@ -12,7 +10,6 @@ using testing::ElementsAre;
 using testing::IsEmpty;
 using Lines = std::vector<std::string>;
 
-const Value kYes(true);
 const std::string kDelegate = "-[ZQReportingServiceDelegate ";
 const std::string kInstance = "-[ZQReportingServerInstance ";
 
@@ -20,10 +17,10 @@ const std::string kInstance = "-[ZQReportingServerInstance ";
 // "log " and without its function's name.
 Lines JournalOf(RunningService& service, Client& client, const std::string& method,
                 const List& arguments) {
-  service.simulation.journal.clear();
+  service.journal.clear();
   client.call(method, arguments);
   service.run();
-  Lines lines = service.simulation.journal.lines({"log", "trace", "reply", "exit"});
+  Lines lines = service.journal.lines({"log", "trace", "reply", "exit"});
   const std::string own = " zqrs " + kInstance + method + "]: ";
   for (std::string& line : lines) {
     if (const auto at = line.find(own); at != std::string::npos) {
@@ -129,7 +126,7 @@ TEST(ServerInstance, EveryOperationInOrder) {
     Client client = service.connect(42);
     client.create(7);
     service.run();
-    service.simulation.log.verbose = {"zqrs"};
+    service.log.verbose = {"zqrs"};
     for (const Case& each : kCases) {
       EXPECT_EQ(JournalOf(service, client, each.method, each.arguments), each.journal)
           << each.method << " " << JsonText(Value(each.arguments));
@@ -137,136 +134,88 @@ TEST(ServerInstance, EveryOperationInOrder) {
   }
 }
 
-TEST(ServerInstance, EntryLinesAreWrittenBeforeTheServerQueueGetsToTheCall) {
-  for (const auto seed : Seeds()) {
-    RunningService service(seed);
-    Client client = service.connect(42);
-    service.simulation.log.verbose = {"zqrs"};
-    bool entered = false;
-    ServerQueue().async([&] {
-      service.simulation.scheduler.sleep(1s);
-      entered = !service.simulation.log.texts("debug").empty();
-    });
-    client.create(7);
-    service.run();
-    EXPECT_TRUE(entered);
-  }
+SEEDED_TEST(ServerInstance, EntryLinesAreWrittenBeforeTheServerQueueGetsToTheCall, RunningService) {
+  Client client = connect(42);
+  log.verbose = {"zqrs"};
+  bool entered = false;
+  ServerQueue().async([&] {
+    scheduler.sleep(1s);
+    entered = !log.texts("debug").empty();
+  });
+  client.create(7);
+  run();
+  EXPECT_TRUE(entered);
 }
 
-TEST(ServerInstance, AStartIsAnsweredWhenTheSessionStops) {
-  for (const auto seed : Seeds()) {
-    RunningService service(seed);
-    Client owner = service.connect(41);
-    Client other = service.connect(42);
-    owner.create(7);
-    service.run();
-    // Another client may start the session but not stop it.
-    const auto start = other.start(7);
-    service.run();
-    const auto again = owner.start(7);
-    const auto foreignStop = other.stop(7);
-    const auto foreignDestroy = other.destroy(7);
-    service.simulation.runFor(1h);
-    EXPECT_THAT(start->results, IsEmpty());
-    EXPECT_THAT(foreignStop->results, ElementsAre(kYes));
-    EXPECT_THAT(foreignDestroy->results, ElementsAre(kYes));
-
-    const auto stop = owner.stop(7);
-    service.run();
-    EXPECT_THAT(start->results, ElementsAre(kYes));
-    EXPECT_THAT(start->answeredAt, ElementsAre(1h));
-    EXPECT_THAT(stop->results, ElementsAre(kYes));
-    EXPECT_THAT(again->results, IsEmpty()) << "it was started already";
-
-    // The old reply is still there at the next start, and is called once more.
-    const auto restart = owner.start(7);
-    service.run();
-    EXPECT_THAT(start->results, ElementsAre(kYes, kYes));
-    owner.destroy(7);
-    service.run();
-    EXPECT_THAT(restart->results, ElementsAre(kYes));
-    EXPECT_EQ(service.simulation.agent.sessions.size(), 2U);
-  }
+SEEDED_TEST(ServerInstance, AStartIsAnsweredWhenTheSessionStops, RunningService) {
+  Client client = connect(41);
+  client.create(7);
+  const auto start = client.start(7);
+  runFor(1h);
+  EXPECT_THAT(start->results, IsEmpty());
+  client.stop(7);
+  run();
+  EXPECT_THAT(start->answeredAt, ElementsAre(1h));
 }
+
+struct ServiceWithDrivers : RunningService {
+  explicit ServiceWithDrivers(std::uint64_t seed)
+      : RunningService(seed, [](Simulation& simulation) {
+          simulation.tallix.channels = {{"Haptics", "Stats", "X", 5},
+                                        {"Speaker", std::nullopt, "Y", 5}};
+        }) {}
+};
 
 TEST(ServerInstance, AStopReportsWhatTheDriversCountedSinceTheStart) {
   for (const auto seed : Seeds()) {
-    RunningService service(seed, [](Simulation& simulation) {
-      simulation.tallix.channels = {{"Haptics", "Stats", "X", 5},
-                                    {"Speaker", std::nullopt, "Y", 5}};
-    });
+    ServiceWithDrivers service(seed);
     Client client = service.connect(42);
     client.createStarted(7);
     service.run();
-    service.simulation.tallix.channels[0].value = 8;
+    service.tallix.channels[0].value = 8;
     client.stop(7);
     service.run();
-    const auto& messages = service.simulation.agent.sessions.at(0).messages;
+    const auto& messages = service.agent.sessions.at(0).messages;
     ASSERT_EQ(messages.size(), 2U);  // and the summary
     EXPECT_EQ(messages[0].category, 9);
     EXPECT_EQ(messages[0].type, 0);
     EXPECT_EQ(messages[0].payload.root().toDictionary(), (Dictionary{{"Haptics_Stats_X", 3}}));
-    EXPECT_THAT(service.simulation.log.texts("default zqrs"),
+    EXPECT_THAT(service.log.texts("default zqrs"),
                 Contains("default zqrs " + kInstance +
                          "stopReportingSessionForID:reply:]: fetching driver logs "
                          "{\"Haptics_Stats_X\":3}"));
     // The snapshot went with the first stop; without one the counters themselves are reported.
     client.stop(7);
     service.run();
-    ASSERT_EQ(service.simulation.agent.singleMessages.size(), 1U);
-    EXPECT_EQ(service.simulation.agent.singleMessages[0].message.payload.root().toDictionary(),
+    ASSERT_EQ(service.agent.singleMessages.size(), 1U);
+    EXPECT_EQ(service.agent.singleMessages[0].message.payload.root().toDictionary(),
               (Dictionary{{"Haptics_Stats_X", 8}, {"Speaker_Y", 5}}));
   }
 }
 
-TEST(ServerInstance, ASecondSessionOfTheSameNumberTakesTheFirstOnesPlace) {
-  for (const auto seed : Seeds()) {
-    RunningService service(seed);
-    Client client = service.connect(42);
-    client.create(7);
-    client.setServiceType(2, 7);
-    const auto start = client.start(7);
-    const auto created = client.create(7);
-    const auto valid = client.valid(7);
-    service.run();
-    EXPECT_THAT(created->results, ElementsAre(kYes));
-    EXPECT_THAT(start->results, IsEmpty()) << "the older one was stopped";
-    EXPECT_THAT(valid->results,
-                ElementsAre(Value(Dictionary{{"reporterID", 7}, {"serviceType", 65535}})));
-    EXPECT_EQ(service.simulation.journal.lines({"trace 0x21042834"}).size(), 1U);
-    EXPECT_THAT(service.simulation.journal.lines({"trace 0x21042830", "agent 1 flush"}), IsEmpty());
-  }
+SEEDED_TEST(ServerInstance, DestroyStopsAStartedSessionFirst, RunningService) {
+  Client client = connect(42);
+  client.createStarted(7);
+  client.destroy(7);
+  const auto valid = client.valid(7);
+  run();
+  EXPECT_THAT(journal.lines({"reply start", "reply destroy"}),
+              ElementsAre("reply startReportingSessionForID:reply: true",
+                          "reply destroyReportingSession:reply: true"));
+  EXPECT_EQ(valid->results.at(0).dictionary()->find("reporterID")->integer()[0], 0);
 }
 
-TEST(ServerInstance, DestroyStopsAStartedSessionFirst) {
-  for (const auto seed : Seeds()) {
-    RunningService service(seed);
-    Client client = service.connect(42);
-    client.createStarted(7);
-    client.destroy(7);
-    const auto valid = client.valid(7);
-    service.run();
-    EXPECT_THAT(service.simulation.journal.lines({"reply start", "reply destroy"}),
-                ElementsAre("reply startReportingSessionForID:reply: true",
-                            "reply destroyReportingSession:reply: true"));
-    EXPECT_EQ(valid->results.at(0).dictionary()->find("reporterID")->integer()[0], 0);
-  }
-}
-
-TEST(ServerInstance, KillEndsTheProcessWithoutStoppingOrAnsweringAnything) {
-  for (const auto seed : Seeds()) {
-    RunningService service(seed);
-    Client client = service.connect(42);
-    client.create(7);
-    const auto start = client.start(7);
-    service.run();
-    const auto kill = client.kill();
-    service.run();
-    EXPECT_EQ(service.simulation.process.exitStatus, 2);
-    EXPECT_THAT(start->results, IsEmpty());
-    EXPECT_THAT(kill->results, IsEmpty());
-    EXPECT_THAT(service.simulation.agent.sessions.at(0).flushes, IsEmpty());
-  }
+SEEDED_TEST(ServerInstance, KillEndsTheProcessWithoutStoppingOrAnsweringAnything, RunningService) {
+  Client client = connect(42);
+  client.create(7);
+  const auto start = client.start(7);
+  run();
+  const auto kill = client.kill();
+  run();
+  EXPECT_EQ(process.exitStatus, 2);
+  EXPECT_THAT(start->results, IsEmpty());
+  EXPECT_THAT(kill->results, IsEmpty());
+  EXPECT_THAT(agent.sessions.at(0).flushes, IsEmpty());
 }
 
 }  // namespace

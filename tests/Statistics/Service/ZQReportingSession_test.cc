@@ -21,36 +21,33 @@ const char* const kSendSingle =
     "+[ZQReportingSession sendSingleMessage:category:type:serviceType:userInfo:reply:]";
 const char* const kWait = "ZQReportingUtilityWait";
 
-TEST(Session, StartSetsUpAnAgentSessionWithWhatIsConfiguredByThen) {
-  for (const auto seed : Seeds()) {
-    SessionOwner owner(seed, kServiceTypeTelephony);
-    owner.session->setConfiguration(Dictionary{{"app", "Phone"}, {"version", 1}});
-    owner.session->setConfiguration(Dictionary{{"version", 2}});
-    owner.session->updateDefaults(std::nullopt);
-    owner.start();
-    // The user information is shared with the set-up, which has not begun; the service name is not.
-    owner.session->updateDefaults(Dictionary{{"ClientName", "renamed"}});
-    owner.holdServerQueue();
-    owner.session->setServiceType(kServiceTypeAlarms);
-    owner.simulation.run();
+SEEDED_TEST(Session, StartSetsUpAnAgentSessionWithWhatIsConfiguredByThen, SessionOwner) {
+  setServiceType(kServiceTypeTelephony);
+  session->setConfiguration(Dictionary{{"app", "Phone"}, {"version", 1}});
+  session->setConfiguration(Dictionary{{"version", 2}});
+  session->updateDefaults(std::nullopt);
+  start();
+  // The user information is shared with the set-up, which has not begun; the service name is not.
+  session->updateDefaults(Dictionary{{"ClientName", "renamed"}});
+  holdServerQueue();
+  session->setServiceType(kServiceTypeAlarms);
+  run();
 
-    const SimulatedAgent& agent = owner.simulation.agent;
-    ASSERT_EQ(agent.sessions.size(), 1U);
-    EXPECT_THAT(agent.tokenParents, ElementsAre(std::nullopt));
-    EXPECT_EQ(agent.sessions[0].info, (Dictionary{{"ClientType", 19},
-                                                  {"ClientVersion", 2.0},
-                                                  {"SessionID", 7},
-                                                  {"BatchEvent", true},
-                                                  {"HierarchyToken", agent.tokens.at(0)}}));
-    EXPECT_EQ(agent.sessions[0].userInfo, (Dictionary{{"ClientName", "renamed"},
-                                                      {"ServiceName", "telephony_session"},
-                                                      {"app", "Phone"},
-                                                      {"version", 2}}));
-    EXPECT_THAT(agent.sessions[0].frameworksToCheck, IsEmpty());
-    EXPECT_EQ(agent.sessions[0].configurations, 1U);
-    EXPECT_EQ(owner.session->serviceName(), "alarms");
-    EXPECT_FALSE(owner.session->relmReportingSessionStarted());
-  }
+  ASSERT_EQ(agent.sessions.size(), 1U);
+  EXPECT_THAT(agent.tokenParents, ElementsAre(std::nullopt));
+  EXPECT_EQ(agent.sessions[0].info, (Dictionary{{"ClientType", 19},
+                                                {"ClientVersion", 2.0},
+                                                {"SessionID", 7},
+                                                {"BatchEvent", true},
+                                                {"HierarchyToken", agent.tokens.at(0)}}));
+  EXPECT_EQ(agent.sessions[0].userInfo, (Dictionary{{"ClientName", "renamed"},
+                                                    {"ServiceName", "telephony_session"},
+                                                    {"app", "Phone"},
+                                                    {"version", 2}}));
+  EXPECT_THAT(agent.sessions[0].frameworksToCheck, IsEmpty());
+  EXPECT_EQ(agent.sessions[0].configurations, 1U);
+  EXPECT_EQ(session->serviceName(), "alarms");
+  EXPECT_FALSE(session->relmReportingSessionStarted());
 }
 
 TEST(Session, MessagesWaitForTheBackendsUpToNineSeconds) {
@@ -76,14 +73,14 @@ TEST(Session, MessagesWaitForTheBackendsUpToNineSeconds) {
     for (const auto seed : Seeds()) {
       SCOPED_TRACE(each.name);
       SessionOwner owner(seed);
-      SimulatedAgent& agent = owner.simulation.agent;
+      SimulatedAgent& agent = owner.agent;
       agent.answers = each.answersAfter.has_value();
       agent.answersAfter = each.answersAfter.value_or(0s);
       if (!each.found) agent.backends.reset();
       owner.start();
       owner.send();
       EXPECT_THAT(owner.sent, ElementsAre(std::nullopt));  // whatever becomes of it
-      owner.simulation.run();
+      owner.run();
 
       EXPECT_THAT(owner.errors(), ElementsAreArray(each.errors));
       EXPECT_EQ(agent.sessions.at(0).released, !each.deliveredAt);
@@ -91,52 +88,48 @@ TEST(Session, MessagesWaitForTheBackendsUpToNineSeconds) {
       if (each.deliveredAt) {
         EXPECT_EQ(owner.delivered()[0].at, *each.deliveredAt);
       }
-      EXPECT_EQ(owner.simulation.counters.of(MessageDrop::noAgentSession),
-                each.deliveredAt ? 0U : 1U);
+      EXPECT_EQ(owner.counters.of(MessageDrop::noAgentSession), each.deliveredAt ? 0U : 1U);
       EXPECT_FALSE(owner.session->relmReportingSessionStarted());
       EXPECT_THAT(owner.history(), ElementsAre("Playback_Start_1"));
     }
   }
 }
 
-TEST(Session, StopFlushesBehindWhatWasSentAndAnswersTheStartAtOnce) {
-  for (const auto seed : Seeds()) {
-    SessionOwner owner(seed);
-    owner.simulation.agent.answersAfter = 5s;
-    owner.start();
-    owner.awaitEnd();
-    owner.send({{"sent", "while started"}});
-    owner.stop();
-    EXPECT_THAT(owner.ended, ElementsAre(Value(true)));
-    EXPECT_EQ(owner.session->aggregatedPayloadData(), nullptr);
-    owner.send({{"sent", "after the stop"}});
-    owner.simulation.run();
+SEEDED_TEST(Session, StopFlushesBehindWhatWasSentAndAnswersTheStartAtOnce, SessionOwner) {
+  agent.answersAfter = 5s;
+  start();
+  awaitEnd();
+  send({{"sent", "while started"}});
+  stop();
+  EXPECT_THAT(ended, ElementsAre(Value(true)));
+  EXPECT_EQ(session->aggregatedPayloadData(), nullptr);
+  send({{"sent", "after the stop"}});
+  run();
 
-    EXPECT_THAT(owner.simulation.journal.lines({"agent 1"}),
-                ElementsAre("agent 1 created", "agent 1 message 0x3 0x1",
-                            "agent 1 message 0xffff 0xffff", "agent 1 flush", "agent 1 released"));
-    EXPECT_THAT(owner.simulation.agent.sessions[0].flushes, ElementsAre(5s));
-    ASSERT_EQ(owner.simulation.agent.singleMessages.size(), 1U);
-    EXPECT_EQ(owner.simulation.agent.singleMessages[0].message.payload,
-              Payload(Dictionary{{"sent", "after the stop"}}));
-    EXPECT_THAT(owner.errors(), IsEmpty());
-  }
+  EXPECT_THAT(journal.lines({"agent 1"}),
+              ElementsAre("agent 1 created", "agent 1 message 0x3 0x1",
+                          "agent 1 message 0xffff 0xffff", "agent 1 flush", "agent 1 released"));
+  EXPECT_THAT(agent.sessions[0].flushes, ElementsAre(5s));
+  ASSERT_EQ(agent.singleMessages.size(), 1U);
+  EXPECT_EQ(agent.singleMessages[0].message.payload,
+            Payload(Dictionary{{"sent", "after the stop"}}));
+  EXPECT_THAT(errors(), IsEmpty());
 }
 
 TEST(Session, StartsAndStopsRepeat) {
-  const auto log = [](auto... line) { return "log " + Line(line...); };
+  const auto logged = [](auto... line) { return "log " + Line(line...); };
   using Lines = std::vector<std::string>;
-  const Lines starting = {log("debug", kStart, "starting session owned by 7")};
+  const Lines starting = {logged("debug", kStart, "starting session owned by 7")};
   const Lines started = {"trace 0x2104282c"};
-  const Lines already = {log("info", kStart, "7 is already started")};
-  const Lines message = {log("debug", kSend, "sending message for session owned by 7"),
+  const Lines already = {logged("info", kStart, "7 is already started")};
+  const Lines message = {logged("debug", kSend, "sending message for session owned by 7"),
                          "trace 0x21042838"};
-  const Lines ending = {log("debug", kStop, "ending session 7")};
+  const Lines ending = {logged("debug", kStop, "ending session 7")};
   const Lines stopping = {"trace 0x21042830",
-                          log("default", kStop, "sending summary event for reporter 7")};
+                          logged("default", kStop, "sending summary event for reporter 7")};
   for (const auto seed : Seeds()) {
     SessionOwner owner(seed);
-    owner.simulation.log.verbose = {"zqrr"};
+    owner.log.verbose = {"zqrr"};
     owner.awaitEnd();
     owner.stop();
     EXPECT_THAT(owner.ended, IsEmpty()) << "stopped before it was started";
@@ -160,176 +153,111 @@ TEST(Session, StartsAndStopsRepeat) {
           message, ending, starting, started, message, ending, ending, stopping, message}) {
       expected.insert(expected.end(), lines.begin(), lines.end());
     }
-    EXPECT_EQ(owner.simulation.journal.lines({"log", "trace"}), expected);
-    owner.simulation.run();
-    EXPECT_EQ(owner.simulation.agent.tokens.size(), 2U);
-    ASSERT_EQ(owner.simulation.agent.sessions.size(), 2U);
-    EXPECT_EQ(owner.simulation.agent.sessions[0].messages.size(), 3U);
-    EXPECT_EQ(owner.simulation.agent.sessions[1].messages.size(), 2U);
+    EXPECT_EQ(owner.journal.lines({"log", "trace"}), expected);
+    owner.run();
+    EXPECT_EQ(owner.agent.tokens.size(), 2U);
+    ASSERT_EQ(owner.agent.sessions.size(), 2U);
+    EXPECT_EQ(owner.agent.sessions[0].messages.size(), 3U);
+    EXPECT_EQ(owner.agent.sessions[1].messages.size(), 2U);
   }
 }
 
-TEST(Session, AStartBeginsANewHistory) {
-  SessionOwner owner(1);
-  owner.send();
-  EXPECT_THAT(owner.history(), ElementsAre("Playback_Start_1"));
-  owner.start();
-  EXPECT_THAT(owner.history(), IsEmpty());
+SEEDED_TEST(Session, OfTypeTestNeverTouchesTheAgent, SessionOwner) {
+  setServiceType(kServiceTypeTest);
+  start();
+  awaitEnd();
+  send();
+  stop();
+  run();
+  EXPECT_THAT(ended, ElementsAre(Value(true)));
+  EXPECT_THAT(agent.tokens, IsEmpty());
+  EXPECT_THAT(journal.lines({"agent"}), IsEmpty());
+  EXPECT_EQ(counters.of(MessageDrop::testServiceType), 2U);
+  EXPECT_THAT(log.texts(),
+              ElementsAre(Line("default", kStop, "sending summary event for reporter 7"),
+                          Line("info", kSend, "transactions aren't allowed on this platform"),
+                          Line("info", kSend, "transactions aren't allowed on this platform")));
 }
 
-TEST(Session, OfTypeTestNeverTouchesTheAgent) {
-  for (const auto seed : Seeds()) {
-    SessionOwner owner(seed, kServiceTypeTest);
-    owner.start();
-    owner.awaitEnd();
-    owner.send();
-    owner.stop();
-    owner.simulation.run();
-    EXPECT_THAT(owner.ended, ElementsAre(Value(true)));
-    EXPECT_THAT(owner.simulation.agent.tokens, IsEmpty());
-    EXPECT_THAT(owner.simulation.journal.lines({"agent"}), IsEmpty());
-    EXPECT_EQ(owner.simulation.counters.of(MessageDrop::testServiceType), 2U);
-    EXPECT_THAT(owner.simulation.log.texts(),
-                ElementsAre(Line("default", kStop, "sending summary event for reporter 7"),
-                            Line("info", kSend, "transactions aren't allowed on this platform"),
-                            Line("info", kSend, "transactions aren't allowed on this platform")));
+SEEDED_TEST(Session, AnnouncesItsLifeAndKeepsItsQueuedWorkWhenItIsDropped, SessionOwner) {
+  start();
+  send();
+  session.reset();
+  run();
+  EXPECT_EQ(delivered().size(), 1U);
+  EXPECT_THAT(agent.sessions[0].flushes, IsEmpty());
+  EXPECT_TRUE(agent.sessions[0].released);
+  EXPECT_EQ(log.texts().back(),
+            Line("info", "-[ZQReportingSession dealloc]", "deallocing this session 7"));
+  ASSERT_FALSE(trace.empty());
+  EXPECT_EQ(trace.front().code, 0x21042828U);
+  EXPECT_EQ(trace.back().code, 0x21042834U);
+  for (const TraceEvent& event : trace) {
+    EXPECT_THAT(event.arguments, ElementsAre(0, 0, 0, 0));
   }
 }
 
-TEST(Session, AnnouncesItsLifeAndKeepsItsQueuedWorkWhenItIsDropped) {
-  for (const auto seed : Seeds()) {
-    SessionOwner owner(seed);
-    owner.start();
-    owner.send();
-    owner.session.reset();
-    owner.simulation.run();
-    EXPECT_EQ(owner.delivered().size(), 1U);
-    EXPECT_THAT(owner.simulation.agent.sessions[0].flushes, IsEmpty());
-    EXPECT_TRUE(owner.simulation.agent.sessions[0].released);
-    EXPECT_EQ(owner.simulation.log.texts().back(),
-              Line("info", "-[ZQReportingSession dealloc]", "deallocing this session 7"));
-    ASSERT_FALSE(owner.simulation.trace.empty());
-    EXPECT_EQ(owner.simulation.trace.front().code, 0x21042828U);
-    EXPECT_EQ(owner.simulation.trace.back().code, 0x21042834U);
-    for (const TraceEvent& event : owner.simulation.trace) {
-      EXPECT_THAT(event.arguments, ElementsAre(0, 0, 0, 0));
-    }
-  }
+SEEDED_TEST(Session, LogsAFailedFlushAndKeepsQuietAboutAFailedSend, SessionOwner) {
+  agent.sendError = Error::because("agent", 3, "full");
+  agent.flushError = Error::because("agent", 4, "gone");
+  log.verbose = {"zqrr"};
+  start();
+  send();
+  run();
+  EXPECT_EQ(journal.lines({"agent 1 message"}).size(), 1U);
+  EXPECT_THAT(log.texts("debug"),
+              ElementsAre(Line("debug", kStart, "starting session owned by 7"),
+                          Line("debug", kSend, "sending message for session owned by 7")));
+  EXPECT_THAT(errors(), IsEmpty());
+  stop();
+  run();
+  EXPECT_THAT(errors(), ElementsAre(Line("error", kStop, "flush error agent 4: gone")));
+  EXPECT_TRUE(agent.sessions[0].released);
 }
 
-TEST(Session, LogsAFailedFlushAndKeepsQuietAboutAFailedSend) {
-  for (const auto seed : Seeds()) {
-    SessionOwner owner(seed);
-    owner.simulation.agent.sendError = Error::because("agent", 3, "full");
-    owner.simulation.agent.flushError = Error::because("agent", 4, "gone");
-    owner.simulation.log.verbose = {"zqrr"};
-    owner.start();
-    owner.send();
-    owner.simulation.run();
-    EXPECT_EQ(owner.simulation.journal.lines({"agent 1 message"}).size(), 1U);
-    EXPECT_THAT(owner.simulation.log.texts("debug"),
-                ElementsAre(Line("debug", kStart, "starting session owned by 7"),
-                            Line("debug", kSend, "sending message for session owned by 7")));
-    EXPECT_THAT(owner.errors(), IsEmpty());
-    owner.stop();
-    owner.simulation.run();
-    EXPECT_THAT(owner.errors(), ElementsAre(Line("error", kStop, "flush error agent 4: gone")));
-    EXPECT_TRUE(owner.simulation.agent.sessions[0].released);
-  }
+SEEDED_TEST(Delivery, VerboseLinesFollowAMessage, SessionOwner) {
+  log.verbose = {"zqrr"};
+  start();
+  run();
+  log.lines.clear();
+  send({{"a key", 1}}, 0x10000003);
+  run();
+  EXPECT_THAT(log.texts(),
+              ElementsAre(Line("debug", kSend, "sending message for session owned by 7"),
+                          Line("debug", kSend,
+                               "RelmReportingAgent <RelmReportingSession 1> : message "
+                               "{\"a key\":1} : category 268435459 : type 1")));
+
+  stop();
+  run();
+  log.lines.clear();
+  send({{"a key", 1}}, 0x10000003);
+  run();
+  EXPECT_THAT(
+      log.texts(),
+      ElementsAre(
+          Line("debug", kSend, "sending message for session owned by 7"),
+          Line("debug", kSend, "session not started, will send as a single message"),
+          Line("debug", kSendSingle, "sending single message after delta 0 for service 0"),
+          Line("debug", kSendSingle, "sending single message"),
+          Line("debug", kSendSingle, "message {\"a_key\":1} : category 268435459 : type 1")));
 }
 
-TEST(Delivery, RewritesBlanksInItsOwnKeysOnly) {
-  for (const auto seed : Seeds()) {
-    SessionOwner owner(seed);
-    owner.start();
-    owner.send({{"two words", "two words"},
-                {7, 1},
-                {"nested", Dictionary{{"inner key", 2}}},
-                {"a b", "first"},
-                {"a_b", "last"}});
-    owner.simulation.run();
-    ASSERT_EQ(owner.delivered().size(), 1U);
-    EXPECT_EQ(owner.delivered()[0].payload.root().toDictionary(),
-              (Dictionary{{"two_words", "two words"},
-                          {7, 1},
-                          {"nested", Dictionary{{"inner key", 2}}},
-                          {"a_b", "last"}}));
-  }
-}
-
-TEST(Delivery, CountsEachKindForItselfAndKeepsOrder) {
-  for (const auto seed : Seeds()) {
-    SessionOwner owner(seed);
-    owner.start();
-    owner.send({{"n", 1}}, 0x10000003, 1);
-    owner.send({{"n", 2}}, 0x10000003, 2, true);
-    owner.send({{"n", 3}}, 0x10000003, 1, true);
-    owner.send({{"n", 4}}, 0xffffffff, 0xffff);
-    EXPECT_THAT(owner.history(), ElementsAre("DSP_Playback_Start_1", "DSP_Playback_Stop_1",
-                                             "DSP_Playback_Start_2", "Undefined_Unknown_1"));
-    EXPECT_EQ(owner.sent.size(), 4U) << "answered before delivery, synchronous or not";
-    EXPECT_THAT(owner.simulation.agent.sessions, IsEmpty());
-    owner.simulation.run();
-    EXPECT_THAT(owner.simulation.journal.lines({"agent 1 message"}),
-                ElementsAre("agent 1 message 0x3 0x1", "agent 1 message 0x3 0x2",
-                            "agent 1 message 0x3 0x1", "agent 1 message 0xffff 0xffff"));
-    std::vector<std::int64_t> numbers;
-    for (const auto& message : owner.delivered()) {
-      numbers.push_back(*message.payload.find("n")->integer());
-    }
-    EXPECT_THAT(numbers, ElementsAre(1, 2, 3, 4));
-  }
-}
-
-TEST(Delivery, VerboseLinesFollowAMessage) {
-  for (const auto seed : Seeds()) {
-    SessionOwner owner(seed);
-    owner.simulation.log.verbose = {"zqrr"};
-    owner.start();
-    owner.simulation.run();
-    owner.simulation.log.lines.clear();
-    owner.send({{"a key", 1}}, 0x10000003);
-    owner.simulation.run();
-    EXPECT_THAT(owner.simulation.log.texts(),
-                ElementsAre(Line("debug", kSend, "sending message for session owned by 7"),
-                            Line("debug", kSend,
-                                 "RelmReportingAgent <RelmReportingSession 1> : message "
-                                 "{\"a key\":1} : category 268435459 : type 1")));
-
-    owner.stop();
-    owner.simulation.run();
-    owner.simulation.log.lines.clear();
-    owner.send({{"a key", 1}}, 0x10000003);
-    owner.simulation.run();
-    EXPECT_THAT(
-        owner.simulation.log.texts(),
-        ElementsAre(
-            Line("debug", kSend, "sending message for session owned by 7"),
-            Line("debug", kSend, "session not started, will send as a single message"),
-            Line("debug", kSendSingle, "sending single message after delta 0 for service 0"),
-            Line("debug", kSendSingle, "sending single message"),
-            Line("debug", kSendSingle, "message {\"a_key\":1} : category 268435459 : type 1")));
-  }
-}
-
-TEST(SingleMessage, CarriesItsServiceTypeAndNothingOfTheUserInformation) {
-  for (const auto seed : Seeds()) {
-    SessionOwner owner(seed, kServiceTypeTelephony);
-    owner.session->setConfiguration(Dictionary{{"app", "Phone"}});
-    owner.send({{"a key", 1}}, 0x10000003);
-    owner.simulation.run();
-    const auto& singles = owner.simulation.agent.singleMessages;
-    ASSERT_EQ(singles.size(), 1U);
-    EXPECT_EQ(singles[0].info,
-              (Dictionary{{"ClientType", 19}, {"ClientVersion", 2.0}, {"SessionID", -1}}));
-    EXPECT_EQ(singles[0].userInfo,
-              (Dictionary{{"ClientName", "tarnwick.quarvel"}, {"ServiceName", "telephony"}}));
-    EXPECT_EQ(singles[0].message.category, 3);
-    EXPECT_EQ(singles[0].message.payload.root().toDictionary(), (Dictionary{{"a_key", 1}}));
-    EXPECT_THAT(owner.simulation.journal.lines({"trace"}),
-                ElementsAre("trace 0x21042838", "trace 0x21042838"));
-    EXPECT_THAT(owner.history(), ElementsAre("DSP_Playback_Start_1"));
-  }
+SEEDED_TEST(SingleMessage, CarriesItsServiceTypeAndNothingOfTheUserInformation, SessionOwner) {
+  setServiceType(kServiceTypeTelephony);
+  session->setConfiguration(Dictionary{{"app", "Phone"}});
+  send({{"a key", 1}}, 0x10000003);
+  run();
+  const auto& singles = agent.singleMessages;
+  ASSERT_EQ(singles.size(), 1U);
+  EXPECT_EQ(singles[0].info,
+            (Dictionary{{"ClientType", 19}, {"ClientVersion", 2.0}, {"SessionID", -1}}));
+  EXPECT_EQ(singles[0].userInfo,
+            (Dictionary{{"ClientName", "tarnwick.quarvel"}, {"ServiceName", "telephony"}}));
+  EXPECT_EQ(singles[0].message.category, 3);
+  EXPECT_EQ(singles[0].message.payload.root().toDictionary(), (Dictionary{{"a_key", 1}}));
+  EXPECT_THAT(journal.lines({"trace"}), ElementsAre("trace 0x21042838", "trace 0x21042838"));
+  EXPECT_THAT(history(), ElementsAre("DSP_Playback_Start_1"));
 }
 
 TEST(SingleMessage, OnlyAlarmsAreSpreadOverAMinute) {
@@ -390,24 +318,7 @@ TEST(Summary, JoinsEveryKeysTextsAndLeavesTheUserInformationInFront) {
   EXPECT_EQ(owner.session->createSummaryEventForSession(), summary);
   summary.merge({{"app", "Music,Music"}, {"n", "1.5,1.5"}});
   EXPECT_EQ(owner.session->createSummaryEventForSession(), summary);
-  EXPECT_THAT(owner.simulation.files.files, IsEmpty());
-}
-
-TEST(Summary, IsTheLastMessageOfARunThatSentAny) {
-  for (const auto seed : Seeds()) {
-    SessionOwner owner(seed);
-    owner.start();
-    owner.stop();
-    owner.start();
-    owner.send();
-    owner.stop();
-    owner.simulation.run();
-    EXPECT_THAT(owner.simulation.agent.sessions.at(0).messages, IsEmpty());
-    const auto& messages = owner.simulation.agent.sessions.at(1).messages;
-    ASSERT_EQ(messages.size(), 2U);
-    EXPECT_EQ(messages[1].payload.root().toDictionary(),
-              (Dictionary{{"ZQ_Session_Summary_Event", "0"}, {"Playback_Start_1", "{\"a\":1}"}}));
-  }
+  EXPECT_THAT(owner.files.files, IsEmpty());
 }
 
 }  // namespace

@@ -11,8 +11,9 @@ namespace quarvel {
 /// A directory of a test's own, removed with all that is in it.
 class TemporaryDirectory {
  public:
-  TemporaryDirectory() {
-    std::string name = std::filesystem::temp_directory_path() / "quarvel-test-XXXXXX";
+  explicit TemporaryDirectory(
+      const std::filesystem::path& parent = std::filesystem::temp_directory_path()) {
+    std::string name = parent / "quarvel-test-XXXXXX";
     if (mkdtemp(name.data()) == nullptr) std::abort();
     path_ = name;
   }
