@@ -321,6 +321,18 @@ TEST_F(StoreTest, ClosesOnceWithEverythingSafeAndRefusesAfterwards) {
   EXPECT_GE(files.counts().logSyncs, 2);
 }
 
+TEST_F(StoreTest, ARowThatNoStoreCouldTakeHoldsUpNobody) {
+  auto store = open();
+  const Outcome refused =
+      send(*store, Payload(Dictionary{{"text", std::string(kMostRowBytes, 'x')}}));
+  ASSERT_FALSE(refused);
+  EXPECT_EQ(refused.error().code, static_cast<std::int64_t>(StoreErrorCode::tooLarge));
+  ASSERT_TRUE(send(*store, 1));
+  store->close();
+  EXPECT_THAT(store->counters(), AllOf(IsBalanced(), Field(&StoreCounters::stored, 1),
+                                       Dropped(StoreDrop::refused, 1)));
+}
+
 TEST_F(StoreTest, ManySendersLoseNothingAndEachKeepsItsOrder) {
   constexpr int kSenders = 4;
   constexpr int kRows = 5000;
