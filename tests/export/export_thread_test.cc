@@ -49,6 +49,7 @@ class ExportThreadTest : public StoreFixture {
   ~ExportThreadTest() override { store_->followExtent({}); }
 
   ExportThread& exporter(const std::string& backend, HangingEngine::Seen& seen) {
+    store_->followExtent({});  // the store's thread reads the list
     threads_.push_back(std::make_unique<ExportThread>(
         Exporter::Options{backend, 1'000'000}, std::make_unique<HangingEngine>(seen), *store_));
     threads_.back()->start();
