@@ -531,15 +531,20 @@ TEST_F(StoreRetentionTest, RowsPastTheirAgeGoAndTheirIDsAreNotGivenAgain) {
 
 TEST_F(StoreRetentionTest, AClockSetByTenYearsEmptiesNothing) {
   const Date noon{20'000 * 24h};
+  FileCalls& files = FileCalls::watch(directory_);
   for (const auto step : {3650 * 24h, -3650 * 24h}) {
     now_ = noon;
     auto store = open(options());
     const std::uint64_t before = store->counters().stored;
     for (int i = 0; i < 10; ++i) sendAndAwait(*store, i);
-    now_ = noon + step;
-    sendAndAwait(*store, 10);
-    now_ = noon;
-    sendAndAwait(*store, 11);
+    // Set while a row is written, so that the clock is looked at once after it.
+    for (const Date set : {noon + step, noon}) {
+      files.hold();
+      ASSERT_TRUE(send(*store, 10));
+      files.awaitHeld();
+      now_ = set;
+      files.release();
+    }
     store->close();
     EXPECT_EQ(store->counters().stored, before + 12);
     EXPECT_THAT(LogRecorder::takeErrors(), ::testing::IsEmpty());
