@@ -120,9 +120,10 @@ TEST_F(DamageTest, AStoreAlwaysOpensAndKeepsWhatCanBeRead) {
                   .value_or(0);
       if (HasFailure()) return;
     }
-    fmt::print("damage, {}: {} stores opened, {} of them set aside, {:.1f} % of the rows kept\n",
-               damage.name, cases, setAside,
-               100.0 * static_cast<double>(kept) / (static_cast<double>(cases) * kRows));
+    fmt::print(
+        "harness: damage, {}: {} stores opened, {} of them set aside, {:.1f} % of the rows kept\n",
+        damage.name, cases, setAside,
+        100.0 * static_cast<double>(kept) / (static_cast<double>(cases) * kRows));
   }
 }
 

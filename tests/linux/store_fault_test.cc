@@ -154,7 +154,7 @@ TEST_F(FaultTest, AtNoCallIsARowLostOrTheServiceStuck) {
       points += at;
     }
   }
-  fmt::print("faults: {} points\n", points);
+  fmt::print("harness: faults of the store: {} points\n", points);
   EXPECT_GT(points, 500U);
 }
 

@@ -248,7 +248,7 @@ TEST_F(PowerTest, NoCutLosesWhatIsPromisedOrCorruptsTheStore) {
     all.broken += tally.broken;
     fmt::print("power cut, {}: {} images of {} moments\n", run.name, tally.images, tally.moments);
   }
-  fmt::print("power cut: {} images of {} moments, {} broken\n", all.images, all.moments,
+  fmt::print("harness: power cut: {} images of {} moments, {} broken\n", all.images, all.moments,
              all.broken);
   EXPECT_EQ(all.broken, 0U);
 }
@@ -280,14 +280,14 @@ TEST_F(PowerTest, NoCutLosesWhatASalvageFinds) {
     }
     ++moments;
   }
-  fmt::print("power cut, salvage: {} images of {} moments\n", images, moments);
+  fmt::print("harness: power cut, salvage: {} images of {} moments\n", images, moments);
 }
 
 // As if `synchronous` were OFF. What is promised does not count here: the file itself breaks.
 TEST_F(PowerTest, FindsThatAStoreThatNeverSyncsIsCorrupted) {
   std::size_t broken = 0;
   for (const Run& run : runs()) broken += cutEverywhere(run, 200, false).broken;
-  fmt::print("power cut without syncs: {} images broken\n", broken);
+  fmt::print("harness: power cut without syncs: {} images broken\n", broken);
   EXPECT_GT(broken, 20U);
 }
 
