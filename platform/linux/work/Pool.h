@@ -31,9 +31,9 @@ class Pool {
   /// Puts a lane in the line for one turn, and for another as long as it wants one. From any
   /// thread.
   void submit(std::shared_ptr<Lane> lane) QUARVEL_EXCLUDES(mutex_);
-  /// The same when the block that the calling thread is running has ended, or a few dozen lanes
-  /// have come together: so one that brings work to a thousand queues takes the lock and wakes
-  /// threads a few times. At once on a thread of no pool.
+  /// The same when the block that the calling thread is running has ended or is held back, or a
+  /// thousand lanes have come together: so one that brings work to many queues takes the lock and
+  /// wakes threads once. At once on a thread of no pool.
   void submitSoon(std::shared_ptr<Lane> lane) QUARVEL_EXCLUDES(mutex_);
   /// On a pool's thread, after each block.
   static void submitGathered();
