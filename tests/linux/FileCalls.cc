@@ -26,9 +26,8 @@ bool IsLog(std::string_view path) {
 }
 
 /// The head of a frame holds, for the last of a transaction, the size of the database after it.
-bool IsCommit(std::string_view path, std::string_view bytes) {
-  return IsLog(path) && bytes.size() == kFrameHeadBytes &&
-         std::memcmp(bytes.data() + 4, "\0\0\0\0", 4) != 0;
+bool IsCommit(std::string_view bytes) {
+  return bytes.size() == kFrameHeadBytes && std::memcmp(bytes.data() + 4, "\0\0\0\0", 4) != 0;
 }
 
 }  // namespace
@@ -49,7 +48,8 @@ void FileCalls::reset(const std::filesystem::path& directory) {
   directory_ = directory.string();
   open_.clear();
   counts_ = {};
-  hold_ = recording_ = false;
+  hold_.reset();
+  recording_ = false;
   fault_.reset();
   calls_ = {};
   failedCalls_ = 0;
@@ -71,14 +71,14 @@ void FileCalls::awaitSynced() {
   while (counts_.unsynced > 0) changed_.wait(mutex_);
 }
 
-void FileCalls::hold() {
+void FileCalls::hold(Purpose purpose) {
   MutexLock lock(mutex_);
-  hold_ = true;
+  hold_ = purpose;
 }
 
 void FileCalls::release() {
   MutexLock lock(mutex_);
-  hold_ = false;
+  hold_.reset();
   changed_.notifyAll();
 }
 
@@ -151,23 +151,23 @@ int FileCalls::admitLocked(Purpose purpose) {
   return error;
 }
 
+void FileCalls::passHold(Purpose purpose) {
+  if (hold_ != purpose) return;
+  ++held_;
+  changed_.notifyAll();
+  while (hold_ == purpose) changed_.wait(mutex_);
+  --held_;
+}
+
 int FileCalls::admit(Purpose purpose) {
   MutexLock lock(mutex_);
   return admitLocked(purpose);
 }
 
-int FileCalls::admitWrite(std::string_view path, std::string_view bytes) {
+int FileCalls::admitWrite(std::string_view path) {
   MutexLock lock(mutex_);
-  ++held_;
-  changed_.notifyAll();
-  while (IsLog(path) && hold_) changed_.wait(mutex_);
-  --held_;
-  const int error = admitLocked(Purpose::write);
-  if (error == 0 && IsCommit(path, bytes)) {
-    ++counts_.commits;
-    ++counts_.unsynced;
-  }
-  return error;
+  if (IsLog(path)) passHold(Purpose::write);
+  return admitLocked(Purpose::write);
 }
 
 void FileCalls::opened(int descriptor, const char* path, bool created) {
@@ -186,12 +186,32 @@ void FileCalls::closed(int descriptor) {
 
 void FileCalls::changed(Change change) {
   MutexLock lock(mutex_);
-  if (change.kind == Change::Kind::sync && !change.failed && IsLog(change.path)) {
-    ++counts_.logSyncs;
-    counts_.unsynced = 0;
+  if (change.kind == Change::Kind::write && IsLog(change.path)) {
+    if (std::exchange(commits_, IsCommit(change.text))) {
+      ++counts_.commits;
+      ++counts_.unsynced;
+    }
   }
   changed_.notifyAll();
   if (recording_) record_.push_back(std::move(change));
+}
+
+FileCalls::Sync FileCalls::syncBegins() {
+  MutexLock lock(mutex_);
+  const Sync begun{record_.size(), counts_.commits};
+  passHold(Purpose::sync);
+  return begun;
+}
+
+void FileCalls::synced(const std::string& path, const Sync& begun, bool failed) {
+  {
+    MutexLock lock(mutex_);
+    if (!failed && IsLog(path)) {
+      ++counts_.logSyncs;
+      counts_.unsynced = counts_.commits - begun.commits;
+    }
+  }
+  changed({.kind = Change::Kind::sync, .path = path, .failed = failed, .begun = begun.changes});
 }
 
 namespace {
@@ -227,8 +247,9 @@ int Sync(int (*real)(int), int descriptor) {
   const auto path = Calls().pathOf(descriptor);
   if (!path) return real(descriptor);
   const int error = Calls().admit(Purpose::sync);
+  const FileCalls::Sync begun = Calls().syncBegins();
   const int result = error == 0 ? real(descriptor) : Fail(error);
-  Calls().changed({.kind = Kind::sync, .path = *path, .failed = result != 0});
+  Calls().synced(*path, begun, result != 0);
   return result;
 }
 
@@ -286,7 +307,7 @@ ssize_t pwrite64(int descriptor, const void* bytes, size_t count, off64_t offset
   const auto path = Calls().pathOf(descriptor);
   if (!path) return real(descriptor, bytes, count, offset);
   const std::string_view whole(static_cast<const char*>(bytes), count);
-  const int error = Calls().admitWrite(*path, whole);
+  const int error = Calls().admitWrite(*path);
   if (error > 0) return Fail(error);
   const ssize_t written = real(descriptor, bytes, error < 0 ? (count + 1) / 2 : count, offset);
   if (written > 0) {

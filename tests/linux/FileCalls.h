@@ -39,17 +39,18 @@ class FileCalls {
   /// Returns once every transaction has been synced.
   void awaitSynced() QUARVEL_EXCLUDES(mutex_);
 
+  enum class Purpose : std::uint8_t { open, write, sync, other };
+
   // Switches.
 
-  /// From now on writes to a write-ahead log wait, until released.
-  void hold() QUARVEL_EXCLUDES(mutex_);
+  /// From now on writes to a write-ahead log wait, or syncs of any file, until released.
+  void hold(Purpose purpose = Purpose::write) QUARVEL_EXCLUDES(mutex_);
   void release() QUARVEL_EXCLUDES(mutex_);
-  /// Returns once a write waits.
+  /// Returns once one waits.
   void awaitHeld() QUARVEL_EXCLUDES(mutex_);
 
   // Faults.
 
-  enum class Purpose : std::uint8_t { open, write, sync, other };
   struct Fault {
     /// Which call fails: its number among all since `watch`, or among those that serve `only`,
     /// counted from 0; one that has been made already means the next.
@@ -85,7 +86,8 @@ class FileCalls {
     std::string path;
     std::string text{};
     off_t offset = 0;
-    bool failed = false;  // a sync
+    bool failed = false;    // a sync
+    std::size_t begun = 0;  // a sync: how many changes had been recorded when it began
   };
   void record() QUARVEL_EXCLUDES(mutex_);
   void mark(off_t promise) QUARVEL_EXCLUDES(mutex_);
@@ -99,15 +101,23 @@ class FileCalls {
   [[nodiscard]] bool watches(const char* path) QUARVEL_EXCLUDES(mutex_);
   /// Counts a call; returns the error number with which it has to fail, -1 for half a write, or 0.
   [[nodiscard]] int admit(Purpose purpose) QUARVEL_EXCLUDES(mutex_);
-  /// As `admit`, for a write of `bytes`; waits while writes are held.
-  [[nodiscard]] int admitWrite(std::string_view path, std::string_view bytes)
-      QUARVEL_EXCLUDES(mutex_);
+  /// As `admit`, for a write; waits while writes are held.
+  [[nodiscard]] int admitWrite(std::string_view path) QUARVEL_EXCLUDES(mutex_);
   void opened(int descriptor, const char* path, bool created) QUARVEL_EXCLUDES(mutex_);
   void closed(int descriptor) QUARVEL_EXCLUDES(mutex_);
   void changed(Change change) QUARVEL_EXCLUDES(mutex_);
+  /// What comes to pass while a sync is under way is not covered by it.
+  struct Sync {
+    std::size_t changes;
+    int commits;
+  };
+  /// Waits while syncs are held.
+  [[nodiscard]] Sync syncBegins() QUARVEL_EXCLUDES(mutex_);
+  void synced(const std::string& path, const Sync& begun, bool failed) QUARVEL_EXCLUDES(mutex_);
 
  private:
   void reset(const std::filesystem::path& directory) QUARVEL_EXCLUDES(mutex_);
+  void passHold(Purpose purpose) QUARVEL_REQUIRES(mutex_);
   [[nodiscard]] int admitLocked(Purpose purpose) QUARVEL_REQUIRES(mutex_);
 
   Mutex mutex_;
@@ -115,7 +125,9 @@ class FileCalls {
   std::string directory_ QUARVEL_GUARDED_BY(mutex_);
   std::map<int, std::string> open_ QUARVEL_GUARDED_BY(mutex_);
   Counts counts_ QUARVEL_GUARDED_BY(mutex_);
-  bool hold_ QUARVEL_GUARDED_BY(mutex_) = false;
+  bool commits_ QUARVEL_GUARDED_BY(mutex_) =
+      false;  // the page of a transaction's last frame is next
+  std::optional<Purpose> hold_ QUARVEL_GUARDED_BY(mutex_);
   int held_ QUARVEL_GUARDED_BY(mutex_) = 0;
   std::optional<Fault> fault_ QUARVEL_GUARDED_BY(mutex_);
   std::array<std::size_t, 4> calls_ QUARVEL_GUARDED_BY(mutex_){};  // in the order of `Purpose`

@@ -41,7 +41,7 @@ bool PowerCut::advance() {
     case Kind::sync:
       if (!syncs_) break;
       if (const auto file = names_.find(change.path); file != names_.end()) {
-        syncFile(files_[file->second], change.failed);
+        syncFile(files_[file->second], change);
       } else if (!change.failed) {
         safeNames_ = names_;
         pendingNames_.clear();
@@ -51,10 +51,11 @@ bool PowerCut::advance() {
   return true;
 }
 
-void PowerCut::syncFile(File& file, bool failed) const {
+void PowerCut::syncFile(File& file, const Change& sync) const {
   for (Pending& pending : file.pending) {
-    if (failed && !pending.safe) pending.given_up = true;
-    if (!failed && !pending.given_up) pending.safe = true;
+    if (pending.change >= record_.data() + sync.begun) break;
+    if (sync.failed && !pending.safe) pending.given_up = true;
+    if (!sync.failed && !pending.given_up) pending.safe = true;
   }
   const auto firstUnsafe = std::ranges::find(file.pending, false, &Pending::safe);
   std::for_each(file.pending.begin(), firstUnsafe,

@@ -13,10 +13,11 @@ namespace quarvel::testing {
 
 /// Walks through a record of changes and tells what could be on the medium if power were cut then.
 ///
-/// What was synced is there. Of a file's other changes each is there or not, whatever is newer, and
-/// of a write any part, in sectors of 512 bytes. Of the changes to names the first few are there,
-/// as journaling file systems keep them in order. A sync that failed makes nothing safe, and no
-/// later one either: the system has given up what it could not write.
+/// What was there when a sync began that has ended is there. Of a file's other changes each is
+/// there or not, whatever is newer, and of a write any part, in sectors of 512 bytes. Of the
+/// changes to names the first few are there, as journaling file systems keep them in order. A sync
+/// that failed makes nothing safe, and no later one either: the system has given up what it could
+/// not write.
 class PowerCut {
  public:
   using Change = FileCalls::Change;
@@ -47,7 +48,7 @@ class PowerCut {
   };
   using Names = std::map<std::string, std::size_t>;
 
-  void syncFile(File& file, bool failed) const;
+  void syncFile(File& file, const Change& sync) const;
   static void applyName(Names& names, const Change& change, std::size_t created);
   static void apply(std::string& content, const Change& change);
   static void applyTorn(std::string& content, const Change& change, std::mt19937& random);

@@ -165,6 +165,30 @@ const std::vector<PowerTest::Run>& PowerTest::runs() {
          test.send(3);
          test.end();
        }},
+      {"rows that come while the medium is slow",
+       {.sync = 24h, .logPages = 12},
+       [](PowerTest& test) {
+         test.start();
+         const std::int64_t session = addSession(*test.store_);
+         for (int i = 0; i < 8; ++i) {
+           test.send(3);
+           const std::int64_t promised = test.sent_;
+           test.files_->hold(FileCalls::Purpose::sync);
+           auto flushed = StoreFixture::flush(*test.store_, session);
+           test.files_->awaitHeld();
+           test.send(2);
+           // Not when it is the writer that waits, to begin the log again.
+           const auto meanwhile = std::chrono::steady_clock::now() + 20ms;
+           Await([&] {
+             return test.store_->counters().waiting == 0 ||
+                    std::chrono::steady_clock::now() > meanwhile;
+           });
+           test.files_->release();
+           flushed.wait();
+           test.files_->mark(promised);
+         }
+         test.end();
+       }},
       {"each commit",
        {.sync = 0ms, .logPages = 12},
        [](PowerTest& test) {

@@ -283,6 +283,36 @@ TEST_F(StoreTest, AFlushCoversEverythingBeforeItWithOneSync) {
   EXPECT_GT(files.counts().logSyncs, unsynced);
 }
 
+TEST_F(StoreTest, RowsAreCommittedWhileTheMediumIsSlow) {
+  FileCalls& files = FileCalls::watch(directory_);
+  auto store = open({.sync = 24h, .logPages = 24});
+  const std::int64_t session = addSession(*store);
+  for (int i = 0; i < 3; ++i) sendAndAwait(*store, i);
+
+  files.hold(FileCalls::Purpose::sync);
+  auto flushed = flush(*store, session);
+  files.awaitHeld();
+  for (int i = 3; i < 6; ++i) sendAndAwait(*store, i);
+  EXPECT_EQ(value("SELECT count(*) FROM message"), "6");
+  EXPECT_EQ(flushed.wait_for(0s), std::future_status::timeout) << "it is not on the medium";
+  auto flushedToo = flush(*store, session);
+  files.release();
+  EXPECT_EQ(flushed.get(), std::nullopt);
+  EXPECT_EQ(flushedToo.get(), std::nullopt) << "what came meanwhile has a sync of its own";
+  EXPECT_EQ(files.counts().unsynced, 0);
+
+  // Moving the log into the file begins with a sync.
+  files.hold(FileCalls::Purpose::sync);
+  int sent = 6;
+  const auto isMoving = std::async(std::launch::async, [&] { files.awaitHeld(); });
+  while (isMoving.wait_for(0s) != std::future_status::ready) sendAndAwait(*store, sent++);
+  for (int i = 0; i < 3; ++i) sendAndAwait(*store, sent++);
+  EXPECT_EQ(value("SELECT count(*) FROM message"), std::to_string(sent));
+  files.release();
+  store.reset();
+  EXPECT_EQ(value("SELECT count(*) FROM message"), std::to_string(sent));
+}
+
 TEST_F(StoreTest, SyncsWithEachCommitOrOnceTheIntervalIsOver) {
   FileCalls& files = FileCalls::watch(directory_);
   auto store = open({.sync = 0ms});

@@ -212,28 +212,28 @@ void SqliteConnection::noteSyncFailure() {
   if (sqlite3_extended_errcode(connection_.get()) == SQLITE_IOERR_FSYNC) logIsDoubtful_ = true;
 }
 
-bool SqliteConnection::moveLog(int mode) {
-  if (logIsDoubtful_ && !syncLog()) return false;
+SqliteConnection::Moved SqliteConnection::moveLog(int mode) {
+  if (logIsDoubtful_ && !syncLog()) return {};
   int logPages = -1;
   int movedPages = -1;
   const int result =
       sqlite3_wal_checkpoint_v2(connection_.get(), "main", mode, &logPages, &movedPages);
   noteSyncFailure();
-  return result == SQLITE_OK && logPages == movedPages;
+  return {result == SQLITE_OK && logPages == movedPages, movedPages};
 }
 
-bool SqliteConnection::checkpoint() {
+SqliteConnection::Moved SqliteConnection::checkpoint() {
   return moveLog(SQLITE_CHECKPOINT_PASSIVE);
 }
 
 bool SqliteConnection::restartLog() {
-  if (!moveLog(SQLITE_CHECKPOINT_RESTART)) return false;
+  if (!moveLog(SQLITE_CHECKPOINT_RESTART).all) return false;
   *logPages_ = 0;
   return true;
 }
 
 bool SqliteConnection::emptyLog() {
-  if (!moveLog(SQLITE_CHECKPOINT_TRUNCATE)) return false;
+  if (!moveLog(SQLITE_CHECKPOINT_TRUNCATE).all) return false;
   *logPages_ = 0;
   return true;
 }

@@ -97,9 +97,12 @@ class SqliteConnection {
   /// Ends the transaction under way, if there still is one: some failures end it themselves.
   void rollBack();
 
+  struct Moved {
+    bool all = false;  // then every commit is on the medium
+    int pages = 0;     // up to which page of the log
+  };
   /// Moves what readers allow from the write-ahead log into the database file; never waits for one.
-  /// True when that was everything: then every commit is on the medium.
-  bool checkpoint();
+  Moved checkpoint();
   /// Has the write-ahead log begin again at its start, all of it moved; waits for readers as long
   /// as the busy time-out. False when a reader still needs it.
   bool restartLog();
@@ -116,12 +119,17 @@ class SqliteConnection {
   /// Whether a sync has failed and none has succeeded since: then commits and checkpoints must wait
   /// until `syncLog` has succeeded.
   [[nodiscard]] bool logIsDoubtful() const { return logIsDoubtful_; }
+  /// A sync has failed on another connection.
+  void doubtLog() { logIsDoubtful_ = true; }
   /// Pages in the write-ahead log after the last commit.
   [[nodiscard]] int logPages() const { return *logPages_; }
 
   /// Whether the file is no longer where it was opened: it was removed or renamed, or its directory
   /// was.
   [[nodiscard]] bool hasMoved() const;
+  [[nodiscard]] bool isSameFileAs(const SqliteConnection& other) const {
+    return device_ == other.device_ && inode_ == other.inode_;
+  }
   /// Copies everything that is committed into the file `path`, which must be empty or not exist.
   bool copyTo(const std::filesystem::path& path);
 
@@ -132,7 +140,7 @@ class SqliteConnection {
  private:
   [[nodiscard]] SqliteFault currentFault() const;
   void noteSyncFailure();
-  bool moveLog(int mode);
+  Moved moveLog(int mode);
 
   struct Close {
     void operator()(sqlite3* connection) const;

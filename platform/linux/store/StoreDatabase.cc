@@ -18,6 +18,7 @@ namespace {
 
 constexpr std::size_t kKeptJson = 1 << 20;
 constexpr int kLogsBeforeRestart = 4;
+constexpr int kFewPages = 16;  // the part of `logPages` that is one of them
 constexpr std::uint64_t kLogPageBytes = 4096;
 
 /// As much as the file itself, but enough for readers that take their time.
@@ -64,9 +65,12 @@ StoreDatabase::StoreDatabase(SqliteConnection connection, const Options& options
     : connection_(std::move(connection)),
       logPages_(options.logPages),
       longestLogPages_(LongestLogPages(options)),
-      retention_(options.bounds, connection_, committedIDs_) {}
+      retention_(options.bounds, connection_, committedIDs_),
+      path_(options.path) {}
 
 StoreDatabase::~StoreDatabase() {
+  awaitMedium();
+  syncer_.reset();
   // The log of a file that was taken away has a name that may be another's now.
   if (fault() != SqliteFault::corrupt && !wasTakenAway()) connection_.checkpointAtClose();
 }
@@ -141,8 +145,10 @@ bool StoreDatabase::write(const StoreBatch& batch, std::size_t first, std::size_
                           Safety safety, Date now, const StoreDrops& drops) {
   now_ = Microseconds(now);
   bool changesFile = false;
+  const bool isAtItsLongest = connection_.logPages() >= longestLogPages_;
+  if (safety == Safety::full || isAtItsLongest) awaitMedium();
   if (connection_.logIsDoubtful() && !sync()) return false;
-  logIsTooLong_ = connection_.logPages() >= longestLogPages_ && !connection_.restartLog();
+  logIsTooLong_ = isAtItsLongest && !connection_.restartLog();
   if (logIsTooLong_) return false;
   bool written = begin(safety);
   for (std::size_t i = first; written && i < last; ++i) {
@@ -289,16 +295,99 @@ std::string_view StoreDatabase::json(const Payload& payload) {
   return json_;
 }
 
-bool StoreDatabase::checkpointIfDue() {
+bool StoreDatabase::sync() {
+  awaitMedium();
+  return connection_.syncLog();
+}
+
+void StoreDatabase::checkpoint() {
+  awaitMedium();
+  connection_.checkpoint();
+}
+
+bool StoreDatabase::beginCheckpointIfDue() {
   const int logPages = connection_.logPages();
-  // The log began again, or a reader has kept it from doing so: then what was moved is still there.
-  if (logPages < checkpointedPages_) checkpointedPages_ = 0;
-  if (logPages - checkpointedPages_ < logPages_) return false;
+  if (logPages < checkpointedPages_) {
+    // The log has begun again.
+    checkpointedPages_ = movedPages_ = 0;
+    isCatchingUp_ = false;
+  }
+  const int left = logPages - movedPages_;
+  if (left <= 0) isCatchingUp_ = false;
+  if (!isCatchingUp_ && logPages - checkpointedPages_ < logPages_) return false;
   checkpointedPages_ = logPages;
-  // A log that has grown several times as long is kept from beginning again by readers: new ones
-  // wait for this.
-  return logPages < logPages_ * kLogsBeforeRestart ? connection_.checkpoint()
-                                                   : connection_.restartLog();
+  // What is left is so little that the writer does it itself: nothing is added meanwhile, and the
+  // log can begin again. A log that has grown several times as long is kept from that by readers:
+  // new ones wait for it.
+  const bool isLittle = isCatchingUp_ && left <= std::max(logPages_ / kFewPages, 1);
+  const bool isLong = logPages >= logPages_ * kLogsBeforeRestart;
+  if (isLittle || isLong) {
+    underWay_ = {StoreSyncer::Task::checkpoint, committedIDs_, std::nullopt};
+    carryOutHere();
+  } else {
+    beginTask(StoreSyncer::Task::checkpoint);
+  }
+  return true;
+}
+
+void StoreDatabase::beginTask(StoreSyncer::Task task) {
+  underWay_ = {task, committedIDs_, std::nullopt};
+  // What a failed sync has left is written again by nobody but who writes.
+  if (!connection_.logIsDoubtful() && !syncer_) {
+    syncer_ = StoreSyncer::open(path_, connection_, mediumAnswered_);
+  }
+  if (!connection_.logIsDoubtful() && syncer_) {
+    syncer_->begin(task);
+  } else {
+    carryOutHere();
+  }
+}
+
+void StoreDatabase::carryOutHere() {
+  const StoreSyncer::Task task = underWay_->task;
+  StoreSyncer::End end{task, false, false, connection_.logPages()};
+  if (task == StoreSyncer::Task::sync) {
+    end.isSafe = connection_.syncLog();
+  } else if (connection_.logPages() >= logPages_ * kLogsBeforeRestart) {
+    end.isSafe = connection_.restartLog();
+  } else {
+    const SqliteConnection::Moved moved = connection_.checkpoint();
+    end.isSafe = moved.all;
+    end.movedPages = moved.pages;
+  }
+  end.logIsDoubtful = connection_.logIsDoubtful();
+  taskEnded(end);
+}
+
+void StoreDatabase::taskEnded(const StoreSyncer::End& end) {
+  underWay_->end = end;
+  if (end.task == StoreSyncer::Task::checkpoint) {
+    movedPages_ = std::max(end.movedPages, 0);
+    isCatchingUp_ = end.isSafe;
+  }
+  if (!end.logIsDoubtful) return;
+  connection_.doubtLog();
+  // Its connection does not learn of it when the log has been written again.
+  syncer_.reset();
+}
+
+void StoreDatabase::awaitMedium() {
+  if (!underWay_ || underWay_->end) return;
+  syncer_->await();
+  if (const auto end = syncer_->takeEnd()) taskEnded(*end);
+}
+
+std::optional<StoreDatabase::Safe> StoreDatabase::takeSafe() {
+  if (!underWay_) return std::nullopt;
+  if (!underWay_->end) {
+    const auto end = syncer_->takeEnd();
+    if (!end) return std::nullopt;
+    taskEnded(*end);
+  }
+  const StoreSyncer::End& end = *underWay_->end;
+  const Safe safe{end.isSafe, underWay_->ids, end.task == StoreSyncer::Task::sync && !end.isSafe};
+  underWay_.reset();
+  return safe;
 }
 
 }  // namespace quarvel

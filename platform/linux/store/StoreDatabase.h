@@ -3,9 +3,12 @@
 #include <cstddef>
 #include <cstdint>
 #include <filesystem>
+#include <functional>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
+#include <utility>
 
 #include "base/Date.h"
 #include "base/Error.h"
@@ -13,6 +16,7 @@
 #include "platform/linux/store/StoreBatch.h"
 #include "platform/linux/store/StoreCounters.h"
 #include "platform/linux/store/StoreRetention.h"
+#include "platform/linux/store/StoreSyncer.h"
 #include "platform/linux/store/StoreTables.h"
 
 namespace quarvel {
@@ -47,15 +51,36 @@ class StoreDatabase {
   /// before it reached the store.
   [[nodiscard]] bool write(const StoreBatch& batch, std::size_t first, std::size_t last,
                            Safety safety, Date now, const StoreDrops& drops);
-  /// Makes all earlier commits as safe as a full one. Only the log is synced: a transaction to
-  /// carry a full commit would wear the medium for nothing.
-  [[nodiscard]] bool sync() { return connection_.syncLog(); }
+  /// Makes all earlier commits as safe as a full one, at once. Only the log is synced: a
+  /// transaction to carry a full commit would wear the medium for nothing.
+  [[nodiscard]] bool sync();
 
-  /// Moves the write-ahead log into the database file once it has grown to a few megabytes. True
-  /// when this made every commit safe.
-  bool checkpointIfDue();
-  /// Does so at once: on a full disk this may give the log's own space back.
-  void checkpoint() { connection_.checkpoint(); }
+  // What waits for the medium is done beside the writer, one at a time; or here, where that cannot
+  // be.
+
+  /// Called, on any thread, when something has ended that was begun: `takeSafe` says what. Before
+  /// anything is begun.
+  void onMediumsAnswer(std::function<void()> answered) { mediumAnswered_ = std::move(answered); }
+  /// Whether something is under way, or its end has not been taken.
+  [[nodiscard]] bool isUnderWay() const { return underWay_.has_value(); }
+  /// Begins to make all earlier commits as safe as a full one. Only when nothing is under way.
+  void beginSync() { beginTask(StoreSyncer::Task::sync); }
+  /// Begins to move the write-ahead log into the database file once it has grown to a few
+  /// megabytes, or has been left long. False when there is nothing to be moved. Only when nothing
+  /// is under way.
+  [[nodiscard]] bool beginCheckpointIfDue();
+  /// Returns when what is under way has ended, however it did.
+  void awaitMedium();
+  struct Safe {
+    bool all;      // that was committed when it began
+    StoreIDs ids;  // the last ones then
+    bool syncFailed;
+  };
+  /// What has ended.
+  [[nodiscard]] std::optional<Safe> takeSafe();
+
+  /// Moves the log at once: on a full disk this may give its own space back.
+  void checkpoint();
 
   /// Whether the file has been taken away; then nobody will find what is written to it.
   [[nodiscard]] bool wasTakenAway() const { return connection_.hasMoved(); }
@@ -100,6 +125,9 @@ class StoreDatabase {
   bool keepDrops(const StoreDrops& drops);
   bool insert(const StoreBatch& batch, const ExportedRow& row);
   bool insert(const StoreBatch&, const ErasureRow&) { return true; }
+  void beginTask(StoreSyncer::Task task);
+  void carryOutHere();
+  void taskEnded(const StoreSyncer::End& end);
   std::string_view json(const Payload& payload);
   [[nodiscard]] std::int64_t placed(std::int64_t session) const;
 
@@ -112,7 +140,10 @@ class StoreDatabase {
   const int logPages_;
   const int longestLogPages_;
   bool logIsTooLong_ = false;
-  int checkpointedPages_ = 0;  // length of the log at the last checkpoint
+  // Of the log, as of the last checkpoint.
+  int checkpointedPages_ = 0;  // how long it was when that began
+  int movedPages_ = 0;         // up to where it has been moved
+  bool isCatchingUp_ = false;  // all of it was moved, and it has grown meanwhile
   std::string storeID_;
   StoreIDs lastIDs_;  // given, in the transaction under way too
   StoreIDs committedIDs_;
@@ -123,6 +154,15 @@ class StoreDatabase {
   std::uint64_t storedAtOpening_ = 0;
   StoreDrops dropsAtOpening_;
   StoreDrops keptDrops_;  // of those that are dropped before they reach the store
+  const std::filesystem::path path_;
+  std::function<void()> mediumAnswered_ = [] {};
+  std::unique_ptr<StoreSyncer> syncer_;  // null before it is needed
+  struct UnderWay {
+    StoreSyncer::Task task;
+    StoreIDs ids;
+    std::optional<StoreSyncer::End> end;
+  };
+  std::optional<UnderWay> underWay_;
 };
 
 }  // namespace quarvel

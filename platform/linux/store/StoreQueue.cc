@@ -3,6 +3,7 @@
 #include <fmt/format.h>
 
 #include <algorithm>
+#include <utility>
 
 #include "platform/linux/store/StoreError.h"
 #include "platform/linux/work/BlockingScope.h"
@@ -79,6 +80,7 @@ StoreQueue::Take StoreQueue::take(StoreBatch& batch, std::optional<Instant> dead
   MutexLock lock(mutex_);
   while (waiting_.rows().empty()) {
     if (closed_) return Take::closed;
+    if (std::exchange(called_, false)) return Take::called;
     writerWaits_ = true;
     bool inTime = true;
     if (deadline) {
@@ -89,9 +91,16 @@ StoreQueue::Take StoreQueue::take(StoreBatch& batch, std::optional<Instant> dead
     writerWaits_ = false;
     if (!inTime && waiting_.rows().empty() && !closed_) return Take::deadline;
   }
+  called_ = false;
   std::swap(waiting_, batch);
   batch.isLast = closed_;
   return Take::rows;
+}
+
+void StoreQueue::call() {
+  MutexLock lock(mutex_);
+  called_ = true;
+  if (writerWaits_) rowsCame_.notifyOne();
 }
 
 bool StoreQueue::waitForClose(Instant deadline) {

@@ -81,10 +81,12 @@ class StoreQueue {
 
   // The rest is the writer's.
 
-  enum class Take : std::uint8_t { rows, deadline, closed };
+  enum class Take : std::uint8_t { rows, called, deadline, closed };
   /// Exchanges the rows that wait for the empty `batch`. Waits for rows until `deadline`, if there
-  /// is one; `closed` once the queue is closed and empty.
+  /// is one, or somebody calls; `closed` once the queue is closed and empty.
   Take take(StoreBatch& batch, std::optional<Instant> deadline) QUARVEL_EXCLUDES(mutex_);
+  /// Has the writer look up, although no rows have come. Any thread.
+  void call() QUARVEL_EXCLUDES(mutex_);
   /// Waits until `deadline`, whatever is queued meanwhile; returns early, and true, when closed.
   [[nodiscard]] bool waitForClose(Instant deadline) QUARVEL_EXCLUDES(mutex_);
 
@@ -133,6 +135,7 @@ class StoreQueue {
   ConditionVariable closing_;   // for the writer while it waits for room on the disk
   bool closed_ QUARVEL_GUARDED_BY(mutex_) = false;
   bool writerWaits_ QUARVEL_GUARDED_BY(mutex_) = false;
+  bool called_ QUARVEL_GUARDED_BY(mutex_) = false;
   std::size_t heldBack_ QUARVEL_GUARDED_BY(mutex_) = 0;
   StoreBatch waiting_ QUARVEL_GUARDED_BY(mutex_);
   Tally outstanding_ QUARVEL_GUARDED_BY(mutex_);  // queued, or taken and not yet committed

@@ -3,6 +3,7 @@
 #include <fmt/format.h>
 
 #include <algorithm>
+#include <iterator>
 #include <utility>
 #include <variant>
 
@@ -40,12 +41,10 @@ StoreWriter::StoreWriter(Options options, std::unique_ptr<StoreDatabase> databas
     : options_(std::move(options)),
       syncAfter_(SyncAfter(options_.sync)),
       queue_(queue),
-      database_(std::move(database)),
       agedAt_(steady_clock::now()),
       agedAtDate_(options_.clock()) {
-  if (database_) {
-    lastEarlierSession_ = database_->lastIDs()[StoreTable::agentSession];
-    queue_.restart(database_->storedAtOpening(), database_->dropsAtOpening());
+  if (database) {
+    adopt(std::move(database));
   } else {
     failed(*failure);
   }
@@ -53,13 +52,16 @@ StoreWriter::StoreWriter(Options options, std::unique_ptr<StoreDatabase> databas
 
 void StoreWriter::run() {
   // What a killed process left in the log may not be on the medium yet.
-  if (database_ && !options_.database.bounds.remoteBackends.empty()) syncTail();
+  if (database_ && !options_.database.bounds.remoteBackends.empty()) syncHere();
   StoreBatch batch;
   for (;;) {
+    attendMedium();
     switch (queue_.take(batch, nextDeadline())) {
       case StoreQueue::Take::rows:
         write(batch);
         batch.clear();
+        break;
+      case StoreQueue::Take::called:
         break;
       case StoreQueue::Take::deadline:
         atDeadline();
@@ -73,18 +75,20 @@ void StoreWriter::run() {
 
 std::optional<StoreWriter::Instant> StoreWriter::nextDeadline() const {
   if (retaining_ || isSuspect_ || !erasures_.empty()) return Instant{};
-  if (unsyncedSince_) return *unsyncedSince_ + syncAfter_;
+  // The end of what is under way calls.
+  if (!database_ || database_->isUnderWay()) return std::nullopt;
+  if (!flushes_.empty()) return syncNotBefore_;
+  if (unsyncedSince_) return std::max(*unsyncedSince_ + syncAfter_, syncNotBefore_);
   return std::nullopt;
 }
 
 void StoreWriter::atDeadline() {
   // A new file is begun at once; should that fail, it is tried again when rows come.
   if (std::exchange(isSuspect_, false) && !database_) (void)reopen(true);
-  if (unsyncedSince_ && steady_clock::now() >= *unsyncedSince_ + syncAfter_) syncTail();
   erase();
   if (!retaining_) return;
-  const auto expired =
-      ageing_ ? std::optional(options_.clock() - options_.maximumAge) : std::nullopt;
+  // By the time that was found to be right: the clock may have been set since.
+  const auto expired = ageing_ ? std::optional(agedAtDate_ - options_.maximumAge) : std::nullopt;
   if (!retain(0, expired)) retaining_ = ageing_ = false;
 }
 
@@ -106,7 +110,7 @@ void StoreWriter::write(const StoreBatch& batch) {
     }
     queue_.committed(tally);
     complete(batch, first, last, std::nullopt);
-    if (database_->checkpointIfDue()) allIsSafe();
+    attendMedium();
     erase();
     first = last;
   }
@@ -137,6 +141,7 @@ bool StoreWriter::writeRows(const StoreBatch& batch, std::size_t first, std::siz
     if (closing) return false;
     closing = queue_.waitForClose(steady_clock::now() + backOff);
     backOff = std::min(backOff * 2, kLongestBackOff);
+    attendMedium();
     if (database_) database_->checkpoint();
     // What does not go away by itself may be the connection's.
     if (attempts % kAttemptsPerConnection == 0) close();
@@ -147,7 +152,9 @@ bool StoreWriter::writeRows(const StoreBatch& batch, std::size_t first, std::siz
 
 bool StoreWriter::tryToWrite(const StoreBatch& batch, std::size_t first, std::size_t last) {
   if (!database_ && !reopen(std::exchange(isSuspect_, false))) return false;
-  const bool full = needsFullCommit(batch, first, last);
+  const bool full = needsFullCommit(batch, last);
+  if (full) settle();
+  if (!database_) return false;
   const auto safety = full ? StoreDatabase::Safety::full : StoreDatabase::Safety::normal;
   if (!database_->write(batch, first, last, safety, options_.clock(), queue_.counters().dropped)) {
     return false;
@@ -160,14 +167,8 @@ bool StoreWriter::tryToWrite(const StoreBatch& batch, std::size_t first, std::si
   return true;
 }
 
-bool StoreWriter::needsFullCommit(const StoreBatch& batch, std::size_t first,
-                                  std::size_t last) const {
-  if (batch.isLast && last == batch.rows().size()) return true;
-  if (steady_clock::now() >= unsyncedSince_.value_or(batch.queuedAt) + syncAfter_) return true;
-  const auto rows = batch.rows().begin();
-  return std::any_of(rows + static_cast<std::ptrdiff_t>(first),
-                     rows + static_cast<std::ptrdiff_t>(last),
-                     [](const StoreRow& row) { return std::holds_alternative<FlushRow>(row); });
+bool StoreWriter::needsFullCommit(const StoreBatch& batch, std::size_t last) const {
+  return options_.sync.count() == 0 || (batch.isLast && last == batch.rows().size());
 }
 
 void StoreWriter::followExtent(std::function<void(const StoreExtent&)> follower) {
@@ -176,20 +177,80 @@ void StoreWriter::followExtent(std::function<void(const StoreExtent&)> follower)
   if (extentFollower_) extentFollower_(extent_);
 }
 
-void StoreWriter::allIsSafe() {
-  unsyncedSince_.reset();
+void StoreWriter::attendMedium() {
+  takeSafe();
+  // An erasure moves the log itself.
+  if (!database_ || database_->isUnderWay() || !erasures_.empty()) return;
+  if (!database_->beginCheckpointIfDue()) {
+    const Instant now = steady_clock::now();
+    const bool isDue = !flushes_.empty() || (unsyncedSince_ && now >= *unsyncedSince_ + syncAfter_);
+    if (!isDue || now < syncNotBefore_) return;
+    database_->beginSync();
+  }
+  coveredSince_ = std::exchange(unsyncedSince_, std::nullopt);
+  coveredFlushes_ = std::exchange(flushes_, {});
+  takeSafe();
+}
+
+void StoreWriter::takeSafe() {
+  const auto safe = database_ ? database_->takeSafe() : std::nullopt;
+  if (!safe) return;
+  if (safe->all) {
+    if (std::exchange(syncBackOff_, std::chrono::milliseconds{0}).count() > 0) succeeded();
+    return isSafe(safe->ids);
+  }
+  uncover();
+  if (!safe->syncFailed) return;
+  syncBackOff_ = std::clamp(syncBackOff_ * 2, options_.firstBackOff, kLongestBackOff);
+  syncNotBefore_ = steady_clock::now() + syncBackOff_;
+  failed(databaseError());
+}
+
+/// What was under way has made nothing safe.
+void StoreWriter::uncover() {
+  if (coveredSince_) unsyncedSince_ = std::exchange(coveredSince_, std::nullopt);
+  std::swap(flushes_, coveredFlushes_);
+  std::ranges::move(coveredFlushes_, std::back_inserter(flushes_));
+  coveredFlushes_.clear();
+}
+
+void StoreWriter::settle() {
+  if (!database_) return;
+  database_->awaitMedium();
+  takeSafe();
+}
+
+void StoreWriter::isSafe(const StoreIDs& ids) {
+  coveredSince_.reset();
+  completeFlushes(coveredFlushes_, std::nullopt);
   MutexLock lock(following_);
-  StoreExtent extent{database_->storeID(), database_->lastIDs()};
+  StoreExtent extent{database_->storeID(), ids};
   if (extent == extent_) return;
   extent_ = std::move(extent);
   if (extentFollower_) extentFollower_(extent_);
+}
+
+void StoreWriter::allIsSafe() {
+  unsyncedSince_.reset();
+  completeFlushes(flushes_, std::nullopt);
+  isSafe(database_->lastIDs());
+}
+
+void StoreWriter::completeFlushes(std::vector<Flush>& flushes, const std::optional<Error>& error) {
+  for (const Flush& completion : std::exchange(flushes, {})) completion(error);
 }
 
 void StoreWriter::complete(const StoreBatch& batch, std::size_t first, std::size_t last,
                            const std::optional<Error>& error) {
   for (std::size_t i = first; i < last; ++i) {
     const StoreRow& row = batch.rows()[i];
-    if (const auto* completion = StoreBatch::completion(row)) (*completion)(error);
+    const auto* completion = StoreBatch::completion(row);
+    const bool waitsForSync = !error && unsyncedSince_ && std::holds_alternative<FlushRow>(row);
+    if (waitsForSync) {
+      flushes_.push_back(*completion);
+    } else if (completion != nullptr) {
+      (*completion)(error);
+    }
     const auto* erasure = std::get_if<ErasureRow>(&row);
     if (erasure != nullptr && error) erasure->completion(*error);
     if (erasure != nullptr && !error) erasures_.push_back({*erasure, database_->lastIDs()});
@@ -199,6 +260,7 @@ void StoreWriter::complete(const StoreBatch& batch, std::size_t first, std::size
 void StoreWriter::erase() {
   ZQ_FUNCTION("StoreWriter::erase");
   if (erasures_.empty()) return;
+  settle();
   if (!database_ && !reopen(false)) return endErasure(failure_);
   if (!erasure_) {
     erasure_ = database_->erasure(erasures_.front().wanted.selection, erasures_.front().through,
@@ -240,8 +302,8 @@ void StoreWriter::lose(const StoreBatch& batch, std::size_t first) {
   complete(batch, first, batch.rows().size(), failure_);
 }
 
-void StoreWriter::syncTail() {
-  unsyncedSince_.reset();
+void StoreWriter::syncHere() {
+  settle();
   if (!database_) return;
   if (database_->sync()) {
     succeeded();
@@ -339,7 +401,15 @@ void StoreWriter::close() {
   erasure_.reset();
   if (database_) knownIDs_ = database_->lastIDs();
   database_.reset();
+  uncover();
   unsyncedSince_.reset();
+}
+
+void StoreWriter::adopt(std::unique_ptr<StoreDatabase> database) {
+  database_ = std::move(database);
+  database_->onMediumsAnswer([this] { queue_.call(); });
+  if (!lastEarlierSession_) lastEarlierSession_ = database_->lastIDs()[StoreTable::agentSession];
+  queue_.restart(database_->storedAtOpening(), database_->dropsAtOpening());
 }
 
 bool StoreWriter::reopen(bool isSuspect) {
@@ -351,10 +421,8 @@ bool StoreWriter::reopen(bool isSuspect) {
     failure_ = database.error();
     return false;
   }
-  database_ = std::move(database.value());
-  if (!lastEarlierSession_) lastEarlierSession_ = database_->lastIDs()[StoreTable::agentSession];
+  adopt(std::move(database.value()));
   database_->placeProvisionalSessions(*lastEarlierSession_);
-  queue_.restart(database_->storedAtOpening(), database_->dropsAtOpening());
   return true;
 }
 
@@ -364,11 +432,16 @@ void StoreWriter::finish() {
     endErasure(StoreError(StoreErrorCode::closed, "The store was closed before all was erased."));
   }
   const StoreDrops drops = queue_.counters().dropped;
-  if (database_ && !gaveUp_ &&
-      !database_->write({}, 0, 0, StoreDatabase::Safety::full, options_.clock(), drops)) {
-    failed(databaseError());
+  settle();
+  if (database_ && !gaveUp_) {
+    if (database_->write({}, 0, 0, StoreDatabase::Safety::full, options_.clock(), drops)) {
+      allIsSafe();
+    } else {
+      failed(databaseError());
+    }
   }
-  if (unsyncedSince_) syncTail();
+  if (unsyncedSince_ || !flushes_.empty()) syncHere();
+  completeFlushes(flushes_, failure_);
   putBackIfTakenAway();
   if (const std::uint64_t lost = drops[StoreDrop::storeClosed]; lost > 0) {
     ZQ_LOG(nullptr, error, "The telemetry store {} was closed while it took no rows: {} are lost.",

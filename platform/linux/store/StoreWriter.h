@@ -8,6 +8,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "base/Date.h"
 #include "base/Error.h"
@@ -17,9 +18,9 @@
 
 namespace quarvel {
 
-/// The store's one writer: takes batches from the queue and commits them, syncs what would wait for
-/// a sync too long, keeps the file within its bounds. Owned by the store; everything runs on the
-/// store's thread.
+/// The store's one writer: takes batches from the queue and commits them, has synced beside that
+/// what would wait for a sync too long, keeps the file within its bounds. Owned by the store;
+/// everything runs on the store's thread.
 class StoreWriter {
  public:
   struct Options {
@@ -47,6 +48,7 @@ class StoreWriter {
 
  private:
   using Instant = StoreQueue::Instant;
+  using Flush = std::function<void(const std::optional<Error>&)>;
 
   /// At most one line a minute.
   class Minutely {
@@ -64,16 +66,23 @@ class StoreWriter {
   /// Commits rows, however long that takes; false when the store was closed before it could.
   bool writeRows(const StoreBatch& batch, std::size_t first, std::size_t last);
   [[nodiscard]] bool tryToWrite(const StoreBatch& batch, std::size_t first, std::size_t last);
-  [[nodiscard]] bool needsFullCommit(const StoreBatch& batch, std::size_t first,
-                                     std::size_t last) const;
+  [[nodiscard]] bool needsFullCommit(const StoreBatch& batch, std::size_t last) const;
   void complete(const StoreBatch& batch, std::size_t first, std::size_t last,
                 const std::optional<Error>& error);
   void lose(const StoreBatch& batch, std::size_t first);
-  /// Everything that was committed is on the medium now.
+  /// Sees to what the medium has answered, and begins what is due.
+  void attendMedium();
+  void takeSafe();
+  void uncover();
+  /// Waits for what is under way at the medium.
+  void settle();
+  /// Everything up to these ids is on the medium now.
+  void isSafe(const StoreIDs& ids) QUARVEL_EXCLUDES(following_);
   void allIsSafe() QUARVEL_EXCLUDES(following_);
+  void completeFlushes(std::vector<Flush>& flushes, const std::optional<Error>& error);
   void erase();
   void endErasure(const Result<std::int64_t>& rows);
-  void syncTail();
+  void syncHere();
   void makeRoom(const StoreQueue::Tally& incoming);
   /// Has rows past their age removed, unless the clock was set since that was last done: who sets
   /// it forward by years must not empty the store, and a device without a clock of its own is told
@@ -90,6 +99,7 @@ class StoreWriter {
   void succeeded();
   void setProblem(std::optional<std::string> problem) QUARVEL_EXCLUDES(problemMutex_);
   void close();
+  void adopt(std::unique_ptr<StoreDatabase> database);
   [[nodiscard]] bool reopen(bool isSuspect);
   void finish();
 
@@ -110,12 +120,18 @@ class StoreWriter {
   bool failing_ = false;
   Minutely failureLine_;
   bool gaveUp_ = false;  // the store was closed while it took no rows
-  std::optional<Instant>
-      unsyncedSince_;      // when the oldest row was queued that a power cut would take
-  bool retaining_ = true;  // there may be rows to remove
-  bool ageing_ = false;    // ... because of their age
-  Instant agedAt_;         // when rows were last looked at for their age
-  Date agedAtDate_;        // ... by the clock
+  // What a power cut would take, and no sync that is under way covers: since when, and who waits.
+  std::optional<Instant> unsyncedSince_;
+  std::vector<Flush> flushes_;
+  // The same of what is under way.
+  std::optional<Instant> coveredSince_;
+  std::vector<Flush> coveredFlushes_;
+  std::chrono::milliseconds syncBackOff_{0};  // after a failure
+  Instant syncNotBefore_{};
+  bool retaining_ = true;                 // there may be rows to remove
+  bool ageing_ = false;                   // ... because of their age
+  Instant agedAt_;                        // when rows were last looked at for their age
+  Date agedAtDate_;                       // ... by the clock
   std::uint64_t removedNotExported_ = 0;  // and not yet reported
   Minutely removedLine_;
 
