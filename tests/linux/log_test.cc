@@ -65,8 +65,9 @@ TEST(LogLineTest, ReadsAsAgreed) {
     setenv("TZ", each.zone, 1);
     // Local time is kept a thread.
     std::thread([&] {
-      const LogLine line = FormatLogLine(date, each.level, "tarnwick.quarvel[zqrs]", "File.cc", 88,
-                                         kFunction, each.message);
+      fmt::memory_buffer buffer;
+      const LogLine line = FormatLogLine(buffer, date, each.level, "tarnwick.quarvel[zqrs]",
+                                         "File.cc", 88, kFunction, each.message);
       EXPECT_EQ(line.text, each.text);
       EXPECT_THAT(line.message(), testing::StartsWith("File.cc:88:-[Class op:]: "));
       EXPECT_THAT(line.message(), testing::Not(HasSubstr("\n")));

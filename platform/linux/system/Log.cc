@@ -94,9 +94,11 @@ bool ZQLogEnabled(LogLevel level, LogHandle scope) {
 
 void ZQLogWrite(LogHandle scope, LogLevel level, const char* file, int line, const char* function,
                 std::string_view message) {
-  LogWriter::instance().write(FormatLogLine(CurrentDate(), level,
-                                            scope == nullptr ? kDefaultLogName : scope->name, file,
-                                            line, function, message));
+  fmt::memory_buffer buffer;
+  LogWriter::instance().write(
+      FormatLogLine(buffer, CurrentDate(), level,
+                    scope == nullptr ? kDefaultLogName : std::string_view(scope->name), file, line,
+                    function, message));
 }
 
 }  // namespace quarvel

@@ -1,11 +1,8 @@
 #include "platform/linux/system/LogLine.h"
 
-#include <fmt/format.h>
-
 #include <chrono>
 #include <cstdlib>
 #include <ctime>
-#include <iterator>
 
 #include "base/Mutex.h"
 
@@ -54,29 +51,34 @@ const LocalSecond& localSecond(std::time_t second) {
   return local;
 }
 
-void appendOnOneLine(std::string& out, std::string_view message) {
+void append(fmt::memory_buffer& out, std::string_view text) {
+  out.append(text.data(), text.data() + text.size());
+}
+
+void appendOnOneLine(fmt::memory_buffer& out, std::string_view message) {
   for (std::size_t end = 0; (end = message.find('\n')) != std::string_view::npos;) {
-    out.append(message.substr(0, end)).append("\\n");
+    append(out, message.substr(0, end));
+    append(out, "\\n");
     message.remove_prefix(end + 1);
   }
-  out.append(message);
+  append(out, message);
 }
 
 }  // namespace
 
-LogLine FormatLogLine(Date date, LogLevel level, std::string_view scope, const char* file, int line,
-                      const char* function, std::string_view message) {
+LogLine FormatLogLine(fmt::memory_buffer& buffer, Date date, LogLevel level, std::string_view scope,
+                      const char* file, int line, const char* function, std::string_view message) {
   const auto second = std::chrono::floor<std::chrono::seconds>(date);
   const LocalSecond& local = localSecond(std::chrono::system_clock::to_time_t(second));
-  LogLine out{level, scope, file, line, function, {}, 0};
-  auto text = std::back_inserter(out.text);
-  fmt::format_to(text, "{}.{:06}{} {} {} ", local.text, (date - second).count(), local.offset,
+  buffer.clear();
+  const auto out = fmt::appender(buffer);
+  fmt::format_to(out, "{}.{:06}{} {} {} ", local.text, (date - second).count(), local.offset,
                  levelName(level), scope);
-  out.messageStart = out.text.size();
-  fmt::format_to(text, "{}:{}:{}: ", file, line, function);
-  appendOnOneLine(out.text, message);
-  out.text += '\n';
-  return out;
+  const std::size_t messageStart = buffer.size();
+  fmt::format_to(out, "{}:{}:{}: ", file, line, function);
+  appendOnOneLine(buffer, message);
+  buffer.push_back('\n');
+  return {level, scope, file, line, function, {buffer.data(), buffer.size()}, messageStart};
 }
 
 }  // namespace quarvel

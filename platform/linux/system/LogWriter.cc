@@ -21,8 +21,14 @@
 namespace quarvel {
 namespace {
 
-std::size_t bytesOf(const LogLine& line) {
-  return sizeof line + line.text.size();
+/// When about so much has been written, those who are held back hear of room.
+constexpr std::size_t kBytesAtOnce = std::size_t{32} * 1024;
+
+/// What has grown beyond this for a burst is not kept for the quiet that follows.
+constexpr std::size_t kKeptBytes = std::size_t{64} * 1024;
+
+std::size_t bytesOf(std::size_t lines, std::size_t text) {
+  return lines * sizeof(LogLine) + text;
 }
 
 /// Whether standard error is the stream that the journal made for this service. Sending to a
@@ -96,7 +102,21 @@ LogWriter::LogWriter() : toJournal_(standardErrorIsJournal()) {
   std::atexit([] { instance().end(); });
 }
 
-void LogWriter::write(LogLine line) {
+void LogWriter::Lines::add(const LogLine& line) {
+  text += line.text;
+  entries.push_back({line, text.size()});
+}
+
+void LogWriter::Lines::clear() {
+  if (text.capacity() > kKeptBytes) {
+    *this = {};
+  } else {
+    entries.clear();
+    text.clear();
+  }
+}
+
+void LogWriter::write(const LogLine& line) {
   Way way = Way::queued;
   {
     const MutexLock lock(mutex_);
@@ -106,18 +126,19 @@ void LogWriter::write(LogLine line) {
     }
     way = way_;
     if (way == Way::queued) {
-      bytes_ += bytesOf(line);
+      bytes_ += bytesOf(1, line.text.size());
       ++linesTaken_;
-      queue_.push_back(std::move(line));
-      if (queue_.size() > 1) return;  // the writer has been called already
+      queue_.add(line);
+      if (queue_.entries.size() > 1) return;  // the writer has been called already
     }
   }
   if (way == Way::queued) {
     arrived_.notifyOne();
   } else if (way == Way::direct) {
-    std::vector<LogLine> lines;
-    lines.push_back(std::move(line));
-    put(lines);
+    Lines lines;
+    lines.add(line);
+    const MutexLock lock(output_);
+    put(lines, 0, 1);
   }
 }
 
@@ -140,31 +161,53 @@ void LogWriter::end() {
 }
 
 void LogWriter::run() {
-  std::vector<LogLine> lines;
-  mutex_.lock();
+  Lines lines;
   for (;;) {
-    while (queue_.empty()) arrived_.wait(mutex_);
-    std::swap(lines, queue_);
-    mutex_.unlock();
+    {
+      const MutexLock lock(mutex_);
+      while (queue_.entries.empty()) arrived_.wait(mutex_);
+      std::swap(lines, queue_);
+    }
     put(lines);
-    std::size_t bytes = 0;
-    for (const LogLine& line : lines) bytes += bytesOf(line);
-    const std::size_t count = lines.size();
     lines.clear();
-    mutex_.lock();
-    bytes_ -= bytes;
-    linesWritten_ += count;
-    written_.notifyAll();
   }
 }
 
-void LogWriter::put(const std::vector<LogLine>& lines) {
-  const MutexLock lock(output_);
-  std::string text;
-  for (const LogLine& line : lines) {
-    if (!toJournal_ || !sendToJournal(line)) text += line.text;
+void LogWriter::put(const Lines& lines) {
+  const std::vector<Lines::Entry>& entries = lines.entries;
+  std::size_t begin = 0;
+  for (std::size_t first = 0; first < entries.size();) {
+    std::size_t last = first + 1;
+    while (last < entries.size() && entries[last].end - begin <= kBytesAtOnce) ++last;
+    {
+      const MutexLock lock(output_);
+      put(lines, first, last);
+    }
+    const std::size_t end = entries[last - 1].end;
+    {
+      const MutexLock lock(mutex_);
+      bytes_ -= bytesOf(last - first, end - begin);
+      linesWritten_ += last - first;
+    }
+    written_.notifyAll();
+    first = last;
+    begin = end;
   }
-  writeToStandardError(text);
+}
+
+void LogWriter::put(const Lines& lines, std::size_t first, std::size_t last) {
+  const std::string_view text = lines.text;
+  std::size_t begin = first == 0 ? 0 : lines.entries[first - 1].end;
+  std::string unsent;
+  if (!toJournal_)
+    return writeToStandardError(text.substr(begin, lines.entries[last - 1].end - begin));
+  for (std::size_t i = first; i < last; ++i) {
+    LogLine line = lines.entries[i].line;
+    line.text = text.substr(begin, lines.entries[i].end - begin);
+    if (!sendToJournal(line)) unsent += line.text;
+    begin = lines.entries[i].end;
+  }
+  writeToStandardError(unsent);
 }
 
 }  // namespace quarvel

@@ -2,6 +2,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <string>
 #include <vector>
 
 #include "base/Mutex.h"
@@ -16,7 +17,7 @@ class LogWriter {
  public:
   [[nodiscard]] static LogWriter& instance();
 
-  void write(LogLine line) QUARVEL_EXCLUDES(mutex_);
+  void write(const LogLine& line) QUARVEL_EXCLUDES(mutex_);
 
   /// Waits until every line taken so far is written, at most `kPatience`: whoever reads standard
   /// error may have stopped. Returns whether they are.
@@ -25,6 +26,19 @@ class LogWriter {
  private:
   static constexpr std::size_t kQueuedBytes = 1024 * 1024;
   static constexpr std::chrono::seconds kPatience{2};
+
+  /// Lines with their texts, one after the other.
+  struct Lines {
+    struct Entry {
+      LogLine line;  // without its text
+      std::size_t end;
+    };
+    std::vector<Entry> entries;
+    std::string text;
+
+    void add(const LogLine& line);
+    void clear();
+  };
 
   enum class Way {
     queued,
@@ -35,7 +49,8 @@ class LogWriter {
   LogWriter();
   void run();
   void end() QUARVEL_EXCLUDES(mutex_);
-  void put(const std::vector<LogLine>& lines) QUARVEL_EXCLUDES(output_);
+  void put(const Lines& lines) QUARVEL_EXCLUDES(mutex_, output_);
+  void put(const Lines& lines, std::size_t first, std::size_t last) QUARVEL_REQUIRES(output_);
 
   const bool toJournal_;
 
@@ -44,7 +59,7 @@ class LogWriter {
   ConditionVariable arrived_;
   ConditionVariable written_;
   Way way_ QUARVEL_GUARDED_BY(mutex_) = Way::queued;
-  std::vector<LogLine> queue_ QUARVEL_GUARDED_BY(mutex_);
+  Lines queue_ QUARVEL_GUARDED_BY(mutex_);
   // What is queued or being written.
   std::size_t bytes_ QUARVEL_GUARDED_BY(mutex_) = 0;
   std::uint64_t linesTaken_ QUARVEL_GUARDED_BY(mutex_) = 0;
