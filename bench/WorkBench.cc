@@ -1,6 +1,7 @@
 #include <benchmark/benchmark.h>
 
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 
 #include "platform/WorkQueue.h"
@@ -12,6 +13,7 @@ namespace {
 class Counted final : public Voucher {
  public:
   [[nodiscard]] std::size_t bytes() const override { return 280; }
+  void ran(std::chrono::nanoseconds /*time*/) override {}
   void carriedOut() override {}
   void completed() override {}
 };

@@ -300,8 +300,13 @@ class RecordedVoucher final : public Voucher {
   [[nodiscard]] std::size_t bytes() const override { return size_; }
 
   std::atomic<int> carriedOutTimes{0};
+  std::atomic<int> timesRan{0};
 
  private:
+  void ran(std::chrono::nanoseconds /*time*/) override {
+    EXPECT_EQ(carriedOutTimes, 0);
+    ++timesRan;
+  }
   void carriedOut() override { ++carriedOutTimes; }
   void completed() override {
     EXPECT_EQ(carriedOutTimes, 1);

@@ -11,12 +11,14 @@ namespace {
 
 constexpr std::int64_t kResponse = 1;
 
-// Half a turn that takes longer than this makes the next ones shorter; one that takes less, longer.
-constexpr std::chrono::microseconds kSlow{500};
-constexpr std::chrono::microseconds kFast{125};
+/// How long the calls of one client may keep those of others waiting.
+constexpr std::chrono::nanoseconds kTurn = std::chrono::microseconds{100};
 
-/// What the store takes in a few milliseconds.
 constexpr std::size_t kMostBehind = 128;
+// When half of those that may be behind take longer than this, fewer may be; when they take less,
+// more.
+constexpr std::chrono::microseconds kSlowBehind{2000};
+constexpr std::chrono::microseconds kFastBehind{500};
 
 /// A buffer that has grown beyond this for a burst is not kept for the quiet that follows.
 constexpr std::size_t kKeptCapacity = std::size_t{64} * 1024;
@@ -36,7 +38,9 @@ CallDesk::CallDesk(const Configuration::Limits& limits, std::function<void()> wa
       callsLimit_(limits.queuedCalls),
       bytesLimit_(limits.queuedBytes),
       wake_(std::move(wake)),
-      turn_(std::min(limits.firstTurn, callsLimit_)) {}
+      callTime_(kTurn.count() / static_cast<std::int64_t>(limits.firstTurn)),
+      turn_(std::min(limits.firstTurn, limits.queuedCalls)),
+      behindLimit_(kMostBehind) {}
 
 template <class Encode>
 void CallDesk::reply(Encode encode) {
@@ -116,43 +120,50 @@ void CallDesk::wakeIfHalfIsDone() {
   if (waiting_ && halfIsDone() && waiting_.exchange(false)) wake_();
 }
 
+void CallDesk::ran(std::chrono::nanoseconds time) {
+  // Heavy ones count at once, light ones in the long run.
+  const std::int64_t known = callTime_.load(std::memory_order_relaxed);
+  const std::int64_t callTime =
+      std::max({known + (time.count() - known) / 8, time.count() / 4, std::int64_t{1}});
+  callTime_.store(callTime, std::memory_order_relaxed);
+  turn_ =
+      std::clamp(static_cast<std::size_t>(kTurn.count() / callTime), std::size_t{1}, callsLimit_);
+}
+
 bool CallDesk::mustWaitForRoom() {
-  if (!waiting_ && !isFull()) {
-    if (turnIsUsedUp_) adaptTurn();
-    return false;
+  if (waiting_ || isFull()) {
+    if (isFullBehind() && !fullBehindSince_) fullBehindSince_ = std::chrono::steady_clock::now();
+    // Said before looking once more: a call that is done in between either is seen here or sees it.
+    waiting_ = true;
+    if (!halfIsDone()) return true;
+    waiting_ = false;
   }
-  if (calls_ >= turn_ && !std::exchange(turnIsUsedUp_, true)) {
-    usedUpAt_ = std::chrono::steady_clock::now();
-  }
-  // Said before looking once more: a call that is done in between either is seen here or sees it.
-  waiting_ = true;
-  if (!halfIsDone()) return true;
-  waiting_ = false;
-  if (turnIsUsedUp_) adaptTurn();
+  if (fullBehindSince_) adaptBehind();
   return false;
 }
 
-void CallDesk::adaptTurn() {
-  turnIsUsedUp_ = false;
-  const auto took = std::chrono::steady_clock::now() - usedUpAt_;
-  const std::size_t turn = turn_.load(std::memory_order_relaxed);
-  if (took > kSlow) {
-    turn_ = std::max<std::size_t>(turn / 2, 1);
-  } else if (took < kFast) {
-    turn_ = std::min(turn * 2, callsLimit_);
+void CallDesk::adaptBehind() {
+  const auto took =
+      std::chrono::steady_clock::now() - *std::exchange(fullBehindSince_, std::nullopt);
+  if (took > kSlowBehind) {
+    behindLimit_ = std::max<std::size_t>(behindLimit_ / 2, 1);
+  } else if (took < kFastBehind) {
+    behindLimit_ = std::min(behindLimit_ * 2, kMostBehind);
   }
+}
+
+void CallDesk::excuseThoseBehind() {
+  excused_ = behind();
+  fullBehindSince_.reset();
 }
 
 bool CallDesk::isFull() const {
   return calls_ >= turn_ || bytes_ >= bytesLimit_ || isFullBehind();
 }
 
-bool CallDesk::isFullBehind() const {
-  return behind() >= excused_ + kMostBehind;
-}
-
 bool CallDesk::halfIsDone() const {
-  return calls_ <= turn_ / 2 && bytes_ <= bytesLimit_ / 2 && behind() <= excused_ + kMostBehind / 2;
+  return calls_ <= turn_ / 2 && bytes_ <= bytesLimit_ / 2 &&
+         behind() <= excused_ + behindLimit_ / 2;
 }
 
 Call::Call(std::shared_ptr<CallDesk> desk, std::optional<std::uint32_t> messageID,

@@ -47,6 +47,8 @@ class CallDesk {
 
   /// I/O thread. A call of so many bytes is taken in.
   void begin(std::size_t bytes);
+  /// What it brought to the queue of all clients has run for so long.
+  void ran(std::chrono::nanoseconds time);
   /// It has been carried out, though work that came of it may go on.
   void carriedOut();
   /// All work that came of it is done.
@@ -59,7 +61,7 @@ class CallDesk {
   /// I/O thread, while it waits. When the number of calls done stays the same for long, those
   /// behind wait for something slow, and the client shall not.
   [[nodiscard]] std::size_t callsDone() const { return callsDone_; }
-  void excuseThoseBehind() { excused_ = behind(); }
+  void excuseThoseBehind();
 
  private:
   template <class Encode>
@@ -67,9 +69,9 @@ class CallDesk {
   void wakeIfHalfIsDone();
   [[nodiscard]] bool isFull() const;
   [[nodiscard]] bool halfIsDone() const;
+  [[nodiscard]] bool isFullBehind() const { return behind() >= excused_ + behindLimit_; }
   [[nodiscard]] std::size_t behind() const { return callsBegun_ - callsDone_ - calls_; }
-  [[nodiscard]] bool isFullBehind() const;
-  void adaptTurn();
+  void adaptBehind();
 
   // Constant after construction.
   const std::size_t replyBytesLimit_;
@@ -87,19 +89,20 @@ class CallDesk {
   std::atomic<std::size_t> bytes_{0};  // of calls of which anything is still to be done
   std::atomic<bool> waiting_{false};   // the I/O thread wants to hear of room
 
-  /// How many calls may be ahead of other clients' ones: as many as are carried out in about half a
-  /// millisecond, whatever they cost, and no more than the limit. Written by the I/O thread.
+  // How many calls may be ahead of other clients' ones: as many as take half a millisecond, by what
+  // the last ones took.
+  std::atomic<std::int64_t> callTime_;  // in nanoseconds
   std::atomic<std::size_t> turn_;
   // Calls that have been carried out, and so answered, but of which something is still to be done:
-  // few, so that what is answered is soon in the store. Those that wait for something slow, such as
-  // a session's backends, are excused.
+  // as many as are done in a few milliseconds, so that what is answered is soon in the store, and
+  // what comes of it is in nobody's way. Those that wait for something slow, such as a session's
+  // backends, are excused.
+  std::atomic<std::size_t> behindLimit_;
   std::atomic<std::size_t> callsBegun_{0};
   std::atomic<std::size_t> callsDone_{0};
   std::atomic<std::size_t> excused_{0};
 
-  // The I/O thread's.
-  bool turnIsUsedUp_ = false;
-  std::chrono::steady_clock::time_point usedUpAt_;
+  std::optional<std::chrono::steady_clock::time_point> fullBehindSince_;  // the I/O thread's
 };
 
 /// One call: where its reply goes and what stands for the work that came of it.
@@ -113,6 +116,7 @@ class Call final : public ReplySink, public Voucher {
   [[nodiscard]] std::size_t bytes() const override { return bytes_; }
 
  protected:
+  void ran(std::chrono::nanoseconds time) override { desk_->ran(time); }
   void carriedOut() override { desk_->carriedOut(); }
   void completed() override { desk_->done(bytes_); }
 

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <atomic>
+#include <chrono>
 #include <cstddef>
 #include <functional>
 #include <memory>
@@ -47,6 +48,7 @@ class Passages {
     [[nodiscard]] std::size_t bytes() const override { return 0; }
 
    protected:
+    void ran(std::chrono::nanoseconds /*time*/) override {}
     void carriedOut() override {}
     void completed() override { all_.ended(); }
 

@@ -2,6 +2,7 @@
 
 #include <sys/socket.h>
 
+#include <algorithm>
 #include <asio/executor_work_guard.hpp>
 #include <asio/io_context.hpp>
 #include <asio/posix/stream_descriptor.hpp>
@@ -33,6 +34,27 @@ constexpr std::chrono::seconds kRetryAccepting{1};
 /// So many clients are welcomed before those who are there get their turn.
 constexpr int kAcceptedPerTurn = 4;
 
+/// Whoever comes brings the server queue work, a look at its process, lines of the log and a row:
+/// some hundred microseconds in all. So many may come at once, and in the long run so often, that
+/// those who come and go as fast as they can leave the processor to others.
+class Pace {
+ public:
+  [[nodiscard]] bool allowsOne() const { return next_ <= std::chrono::steady_clock::now(); }
+  void oneCame() {
+    next_ = std::max(next_, std::chrono::steady_clock::now() - kInterval * kAtOnce) + kInterval;
+  }
+  /// When a turn's worth may come again.
+  [[nodiscard]] std::chrono::steady_clock::time_point nextTurn() const {
+    return next_ + kInterval * kAcceptedPerTurn;
+  }
+
+ private:
+  static constexpr int kAtOnce = 512;
+  static constexpr std::chrono::microseconds kInterval{250};
+
+  std::chrono::steady_clock::time_point next_;
+};
+
 }  // namespace
 
 /// The listener's side of the event loop: accepts, counts, ends. All of it belongs to the I/O
@@ -45,7 +67,7 @@ class SocketListener::Loop {
         busy_(context_->io.get_executor()),
         listeningSocket_(std::move(socket)),
         socket_(context_->io, listeningSocket_.releaseDescriptor().release()),
-        retryTimer_(context_->io),
+        acceptTimer_(context_->io),
         pulseTimer_(context_->io),
         signals_(context_->io) {
     for (const int signal : options_.endSignals) signals_.add(signal);
@@ -98,19 +120,23 @@ class SocketListener::Loop {
       case Accepted::turn:
         acceptSoon(context_->io);
         break;
+      case Accepted::paced:
+        acceptAt(pace_.nextTurn());
+        break;
       case Accepted::heldBack:
         break;
     }
   }
 
-  /// What became of the clients who wait: all are accepted, as many as were to be, or no more may
-  /// be until somebody calls `acceptSoon`.
-  enum class Accepted { all, turn, heldBack };
+  /// What became of the clients who wait: all are accepted, as many as were to be, as many as may
+  /// be for now, or no more may be until somebody calls `acceptSoon`.
+  enum class Accepted { all, turn, paced, heldBack };
 
   Accepted accept(int most) {
     for (int accepted = 0;;) {
       if (accepted == most) return Accepted::turn;
       if (!ended_ && context_->passages.areTooMany()) return Accepted::heldBack;
+      if (!ended_ && !pace_.allowsOne()) return Accepted::paced;
       if (connections_.size() >= options_.limits.connections) {
         holdBack(fmt::format("there are {} connections already", connections_.size()));
         return Accepted::heldBack;
@@ -119,13 +145,14 @@ class SocketListener::Loop {
           ::accept4(socket_.native_handle(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
       if (client) {
         ++accepted;
+        pace_.oneCame();
         welcome(std::move(client));
       } else if (errno == EAGAIN) {
         heldBack_ = false;
         return Accepted::all;
       } else if (errno != EINTR && errno != ECONNABORTED && errno != EPROTO) {
         holdBack(std::generic_category().message(errno));
-        retryLater();
+        acceptAt(std::chrono::steady_clock::now() + kRetryAccepting);
         return Accepted::heldBack;
       }
     }
@@ -138,9 +165,9 @@ class SocketListener::Loop {
     ZQ_LOG(nullptr, error, "no further client is accepted until one has gone: {}", reason);
   }
 
-  void retryLater() {
-    retryTimer_.expires_after(kRetryAccepting);
-    retryTimer_.async_wait([this](asio::error_code error) {
+  void acceptAt(std::chrono::steady_clock::time_point time) {
+    acceptTimer_.expires_at(time);
+    acceptTimer_.async_wait([this](asio::error_code error) {
       if (!error) acceptWaiting();
     });
   }
@@ -176,7 +203,7 @@ class SocketListener::Loop {
     if (listeningSocket_.removeFile()) (void)accept(std::numeric_limits<int>::max());
     asio::error_code ignored;
     socket_.close(ignored);
-    retryTimer_.cancel();
+    acceptTimer_.cancel();
     pulseTimer_.cancel();
     signals_.cancel(ignored);
     // Each takes itself out of the set.
@@ -196,11 +223,12 @@ class SocketListener::Loop {
   asio::executor_work_guard<asio::io_context::executor_type> busy_;  // until the end
   ListeningSocket listeningSocket_;
   asio::posix::stream_descriptor socket_;
-  asio::steady_timer retryTimer_;
+  asio::steady_timer acceptTimer_;
   asio::steady_timer pulseTimer_;
   asio::signal_set signals_;
   std::unordered_set<std::shared_ptr<SocketConnection>> connections_;
   std::uint64_t lastNumber_ = 0;
+  Pace pace_;
   bool accepting_ = false;  // waits for a client
   bool heldBack_ = false;   // clients wait, but there is no room
   bool ended_ = false;

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <memory>
 #include <string_view>
 #include <utility>
@@ -19,11 +20,15 @@ struct WorkItem {
 
   /// Runs the block, destroys it, and only then lets the voucher go.
   void run() {
+    using Clock = std::chrono::steady_clock;
+    const bool isTimed = voucher.isDirect();
+    const auto began = isTimed ? Clock::now() : Clock::time_point();
     {
       const VoucherScope scope(VoucherScope::Of::block, voucher);
       block();
       block = Block();
     }
+    if (isTimed) voucher.ran(Clock::now() - began);
     voucher = VoucherHold();
   }
 };

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <atomic>
+#include <chrono>
 #include <cstddef>
 #include <cstdint>
 #include <memory>
@@ -20,7 +21,12 @@ class Voucher {
   [[nodiscard]] virtual std::size_t bytes() const = 0;
 
  protected:
-  // Each is called once, on whatever thread it comes to pass on. Must not block.
+  // On whatever thread it comes to pass on; must not block.
+
+  /// One of the call's own blocks has run for so long. Before `carriedOut`.
+  virtual void ran(std::chrono::nanoseconds time) = 0;
+
+  // Each of these is called once.
 
   /// The call, and the blocks that it queued itself, have run.
   virtual void carriedOut() = 0;
@@ -69,6 +75,10 @@ class VoucherHold {
   }
 
   [[nodiscard]] const std::shared_ptr<Voucher>& voucher() const { return voucher_; }
+  /// Whether it is of a call, or of a block that the call queued itself.
+  [[nodiscard]] bool isDirect() const { return direct_ && voucher_ != nullptr; }
+  /// The block that held this has run for so long.
+  void ran(std::chrono::nanoseconds time) const { voucher_->ran(time); }
   explicit operator bool() const { return voucher_ != nullptr; }
 
   /// A further hold on the voucher that is current on this thread; empty when none is.
