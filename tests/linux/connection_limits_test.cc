@@ -10,6 +10,7 @@
 #include <string>
 #include <thread>
 
+#include "platform/linux/connection/CallDesk.h"
 #include "tests/linux/ConnectionFixture.h"
 
 namespace quarvel {
@@ -64,6 +65,78 @@ TEST(ConnectionLimits, AClientThatIsTooFastWaitsAndLosesNothing) {
     EXPECT_EQ(arrived, Numbers(kCalls));
     EXPECT_LE(service.ledger->largestKept(), 9U);
   }
+}
+
+/// Takes calls in until the desk has no room for more.
+std::size_t Fill(CallDesk& desk) {
+  std::size_t calls = 0;
+  for (; !desk.mustWaitForRoom(); ++calls) desk.begin(1);
+  return calls;
+}
+
+void CarryOut(CallDesk& desk, std::size_t calls, std::chrono::nanoseconds each) {
+  for (; calls > 0; --calls) {
+    desk.ran(each);
+    desk.carriedOut();
+  }
+}
+
+void Finish(CallDesk& desk, std::size_t calls) {
+  for (; calls > 0; --calls) desk.done(1);
+}
+
+TEST(ConnectionLimits, AsManyCallsAreAheadOfOthersAsTakeAMoment) {
+  const Configuration::Limits limits;
+  int woken = 0;
+  CallDesk desk(limits, [&woken] { ++woken; });
+  const auto turnAfter = [&](std::size_t calls, std::chrono::nanoseconds each) {
+    CarryOut(desk, calls, each);
+    Finish(desk, calls);
+    return Fill(desk);
+  };
+  EXPECT_EQ(Fill(desk), limits.firstTurn);
+  std::size_t turn = limits.firstTurn;
+  for (int i = 0; i < 20; ++i) turn = turnAfter(turn, 1us);
+  EXPECT_GT(turn, 90U) << "light calls are many";
+  // One heavy call among them is enough, though none of its like has used up a turn.
+  CarryOut(desk, 1, 10ms);
+  Finish(desk, 1);
+  turn = turnAfter(turn - 1, 50us);
+  EXPECT_EQ(turn, 1U);
+  for (int i = 0; i < 200; ++i) turn = turnAfter(turn, 1us);
+  EXPECT_GT(turn, 90U) << "and it is forgotten";
+  EXPECT_GT(woken, 200);
+}
+
+TEST(ConnectionLimits, FewerAreAnsweredAndNotDoneWhereThatTakesLong) {
+  Configuration::Limits limits;
+  CallDesk desk(limits, [] {});
+  const auto answer = [&] {
+    std::size_t calls = 0;
+    for (; !desk.mustWaitForRoom(); ++calls) {
+      desk.begin(1);
+      CarryOut(desk, 1, 1us);
+    }
+    return calls;
+  };
+  const std::size_t most = answer();
+  EXPECT_GT(most, 16U);
+  std::this_thread::sleep_for(5ms);
+  Finish(desk, most);
+  EXPECT_EQ(answer(), most / 2);
+  // What waits for something slow is excused, and says nothing of the rest.
+  std::this_thread::sleep_for(5ms);
+  desk.excuseThoseBehind();
+  EXPECT_EQ(answer(), most / 2);
+}
+
+TEST(ConnectionLimits, WhoComesAndGoesAsFastAsHeCanIsPaced) {
+  Service service;
+  const auto began = std::chrono::steady_clock::now();
+  for (int i = 0; i < 1012; ++i) service.connect().hangUp();
+  EXPECT_TRUE(service.connect().isServed());
+  // 500 more than may come at once, at 4,000 a second.
+  EXPECT_GT(std::chrono::steady_clock::now() - began, 120ms);
 }
 
 TEST(ConnectionLimits, WhatWaitsForSomethingSlowHoldsUpItsClientOnlyForAWhile) {
