@@ -11,6 +11,7 @@
 
 #include "platform/linux/store/Sqlite.h"
 #include "platform/linux/store/StoreError.h"
+#include "platform/linux/store/StoreQueue.h"
 #include "tests/linux/FileCalls.h"
 #include "tests/linux/LogRecorder.h"
 #include "tests/linux/StoreFixture.h"
@@ -193,6 +194,36 @@ TEST_F(StoreTest, OneTransactionTakesWhatGatheredAndNoMoreThan1024Rows) {
   files.release();
   awaitStored(*store);
   EXPECT_EQ(files.counts().commits, before + 3 + 1 + 3);
+}
+
+TEST(StoreQueueTest, HoldsAsManyRowsAsAreCommittedInAFewMilliseconds) {
+  StoreQueue queue(2048, std::size_t{1} << 30);
+  const auto fill = [&queue] {
+    std::size_t rows = 0;
+    while (queue.pushIfRoom(AnalyticsEventRow{Payload(), Date{}}, {"event"})) ++rows;
+    return rows;
+  };
+  const auto commit = [&queue](std::chrono::nanoseconds each) {
+    StoreBatch batch;
+    ASSERT_EQ(queue.take(batch, std::nullopt), StoreQueue::Take::rows);
+    StoreQueue::Tally tally;
+    for (const StoreRow& row : batch.rows()) tally.add(row);
+    queue.committed(tally, each * static_cast<std::int64_t>(tally.rows));
+  };
+  const auto rowsAfter = [&](std::chrono::nanoseconds each, int commits) {
+    std::size_t rows = 0;
+    for (; commits > 0; --commits) {
+      commit(each);
+      rows = fill();
+    }
+    return rows;
+  };
+  EXPECT_EQ(fill(), 2048U);
+  EXPECT_EQ(rowsAfter(1us, 1), 2048U);
+  EXPECT_NEAR(static_cast<double>(rowsAfter(10us, 30)), 400, 20);
+  // Seconds that a full disk took are no measure of what comes then.
+  EXPECT_EQ(rowsAfter(100ms, 30), 128U);
+  EXPECT_EQ(rowsAfter(1us, 20), 2048U);
 }
 
 TEST_F(StoreTest, HoldsSendersBackAtItsBoundsAndKeepsEveryRow) {

@@ -10,6 +10,15 @@
 
 namespace quarvel {
 
+namespace {
+
+/// With what it takes to come here, half of the time after which what was answered is stored.
+constexpr std::chrono::nanoseconds kTimeToCommit = std::chrono::milliseconds{4};
+/// In a shorter transaction the rows are not what takes the time.
+constexpr std::size_t kFewestRows = 128;
+
+}  // namespace
+
 void StoreQueue::Tally::add(const StoreRow& row) {
   ++rows;
   bytes += StoreBatch::bytes(row);
@@ -17,7 +26,8 @@ void StoreQueue::Tally::add(const StoreRow& row) {
 }
 
 bool StoreQueue::hasRoom() const {
-  return outstanding_.rows < maximumRows_ && outstanding_.bytes < maximumBytes_;
+  return outstanding_.rows < std::min(rowsInTime_, maximumRows_) &&
+         outstanding_.bytes < maximumBytes_;
 }
 
 void StoreQueue::awaitRoom() {
@@ -119,10 +129,19 @@ void StoreQueue::release(const Tally& tally) {
   if (heldBack_ > 0 && hasRoom()) roomCame_.notifyAll();
 }
 
-void StoreQueue::committed(const Tally& tally) {
+void StoreQueue::committed(const Tally& tally, std::chrono::nanoseconds time) {
   MutexLock lock(mutex_);
   counters_.stored += tally.counted;
+  if (tally.rows >= kFewestRows) learn(tally.rows, time);
   release(tally);
+}
+
+void StoreQueue::learn(std::size_t rows, std::chrono::nanoseconds time) {
+  const std::int64_t longest = kTimeToCommit.count() / static_cast<std::int64_t>(kFewestRows);
+  const std::int64_t rowTime =
+      std::clamp(time.count() / static_cast<std::int64_t>(rows), std::int64_t{1}, longest);
+  rowTime_ = rowTime_ == 0 ? rowTime : (3 * rowTime_ + rowTime) / 4;
+  rowsInTime_ = static_cast<std::size_t>(kTimeToCommit.count() / rowTime_);
 }
 
 void StoreQueue::lost(const Tally& tally) {

@@ -17,13 +17,15 @@
 namespace quarvel {
 
 /// Between any number of senders and the store's writer: bounded, first come, first served. A row
-/// counts against the bounds until it is committed or lost.
+/// counts against the bounds until it is committed or lost. There may be as many rows as are
+/// committed in a few milliseconds, however slow the machine, so that what is here is soon safe
+/// from the end of the process.
 class StoreQueue {
  public:
   using Instant = StoreBatch::Instant;
 
   StoreQueue(std::size_t maximumRows, std::size_t maximumBytes)
-      : maximumRows_(maximumRows), maximumBytes_(maximumBytes) {}
+      : maximumRows_(maximumRows), maximumBytes_(maximumBytes), rowsInTime_(maximumRows) {}
 
   /// Any thread. Holds the caller back while either bound is reached, so that the bound on bytes
   /// may be passed by one row; but lets one pass that must not wait (`BlockingScope`). Errors: the
@@ -97,8 +99,8 @@ class StoreQueue {
 
     void add(const StoreRow& row);
   };
-  // Makes room: rows that were taken are now in the database, or lost.
-  void committed(const Tally& tally) QUARVEL_EXCLUDES(mutex_);
+  // Makes room: rows that were taken are now in the database, which took so long, or lost.
+  void committed(const Tally& tally, std::chrono::nanoseconds time) QUARVEL_EXCLUDES(mutex_);
   void lost(const Tally& tally) QUARVEL_EXCLUDES(mutex_);
 
   /// Counts from what the opened database holds, and from the drops that it keeps.
@@ -115,6 +117,7 @@ class StoreQueue {
   Error refuse(std::uint64_t counted) QUARVEL_REQUIRES(mutex_);
   void dropAccepted(StoreDrop reason, std::uint64_t rows) QUARVEL_REQUIRES(mutex_);
   void release(const Tally& tally) QUARVEL_REQUIRES(mutex_);
+  void learn(std::size_t rows, std::chrono::nanoseconds time) QUARVEL_REQUIRES(mutex_);
 
   template <class Row>
   void append(Row&& row, std::initializer_list<std::string_view> texts) QUARVEL_REQUIRES(mutex_) {
@@ -138,8 +141,10 @@ class StoreQueue {
   bool called_ QUARVEL_GUARDED_BY(mutex_) = false;
   std::size_t heldBack_ QUARVEL_GUARDED_BY(mutex_) = 0;
   StoreBatch waiting_ QUARVEL_GUARDED_BY(mutex_);
-  Tally outstanding_ QUARVEL_GUARDED_BY(mutex_);  // queued, or taken and not yet committed
-  StoreCounters counters_                         // without what is on its way
+  Tally outstanding_ QUARVEL_GUARDED_BY(mutex_);         // queued, or taken and not yet committed
+  std::int64_t rowTime_ QUARVEL_GUARDED_BY(mutex_) = 0;  // of a commit, in nanoseconds; 0: unknown
+  std::size_t rowsInTime_ QUARVEL_GUARDED_BY(mutex_);
+  StoreCounters counters_  // without what is on its way
       QUARVEL_GUARDED_BY(mutex_);
 };
 

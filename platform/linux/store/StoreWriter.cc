@@ -103,12 +103,13 @@ void StoreWriter::write(const StoreBatch& batch) {
       // What was added after an erasure was asked for is none of its rows.
       if (std::holds_alternative<ErasureRow>(row)) break;
     }
+    const Instant began = steady_clock::now();
     if (!gaveUp_) makeRoom(tally);
     if (gaveUp_ || !writeRows(batch, first, last)) {
       lose(batch, first);
       return;
     }
-    queue_.committed(tally);
+    queue_.committed(tally, steady_clock::now() - began);
     complete(batch, first, last, std::nullopt);
     attendMedium();
     erase();
