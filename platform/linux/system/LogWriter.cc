@@ -1,12 +1,12 @@
 #include "platform/linux/system/LogWriter.h"
 
-#include <errno.h>
 #include <fmt/format.h>
 #include <poll.h>
 #include <sys/stat.h>
 #include <sys/uio.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdlib>
 #include <string>
 #include <utility>
@@ -195,7 +195,7 @@ void LogWriter::put(const Lines& lines) {
   }
 }
 
-void LogWriter::put(const Lines& lines, std::size_t first, std::size_t last) {
+void LogWriter::put(const Lines& lines, std::size_t first, std::size_t last) const {
   const std::string_view text = lines.text;
   std::size_t begin = first == 0 ? 0 : lines.entries[first - 1].end;
   std::string unsent;

@@ -24,7 +24,7 @@ class LogWriter {
   bool flush() QUARVEL_EXCLUDES(mutex_);
 
  private:
-  static constexpr std::size_t kQueuedBytes = 1024 * 1024;
+  static constexpr std::size_t kQueuedBytes = std::size_t{1024} * 1024;
   static constexpr std::chrono::seconds kPatience{2};
 
   /// Lines with their texts, one after the other.
@@ -50,7 +50,7 @@ class LogWriter {
   void run();
   void end() QUARVEL_EXCLUDES(mutex_);
   void put(const Lines& lines) QUARVEL_EXCLUDES(mutex_, output_);
-  void put(const Lines& lines, std::size_t first, std::size_t last) QUARVEL_REQUIRES(output_);
+  void put(const Lines& lines, std::size_t first, std::size_t last) const QUARVEL_REQUIRES(output_);
 
   const bool toJournal_;
 
