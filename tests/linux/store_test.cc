@@ -612,5 +612,31 @@ TEST_F(StoreRetentionTest, AClockSetByTenYearsEmptiesNothing) {
   }
 }
 
+// Rows are to be removed for their age, but others come first, and then the clock is found to be
+// set.
+TEST_F(StoreRetentionTest, AClockSetBeforeOldRowsWereRemovedRemovesNothing) {
+  const Date noon{20'000 * 24h};
+  std::atomic<int> looks = -1;  // counted once the first row is being written
+  TelemetryStore::Options options = this->options();
+  options.clock = [&, set = noon + 3650 * 24h] {
+    // After the first row, at the second one's writing and after it.
+    return looks < 0 || looks++ < 2 ? noon : set;
+  };
+  FileCalls& files = FileCalls::watch(directory_);
+  auto store = open(options);
+  for (int i = 0; i < 10; ++i) sendAndAwait(*store, i);
+  files.hold();
+  ASSERT_TRUE(send(*store, 10));
+  files.awaitHeld();
+  ASSERT_TRUE(send(*store, 11));
+  looks = 0;
+  files.release();
+  Await([&] { return looks >= 3; });
+  for (int i = 0; i < 100; ++i) {
+    ASSERT_EQ(store->counters().dropped.sum(), 0U);
+    std::this_thread::sleep_for(1ms);
+  }
+}
+
 }  // namespace
 }  // namespace quarvel::testing

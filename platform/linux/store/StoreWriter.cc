@@ -87,9 +87,9 @@ void StoreWriter::atDeadline() {
   if (std::exchange(isSuspect_, false) && !database_) (void)reopen(true);
   erase();
   if (!retaining_) return;
-  // By the time that was found to be right: the clock may have been set since.
-  const auto expired = ageing_ ? std::optional(agedAtDate_ - options_.maximumAge) : std::nullopt;
-  if (!retain(0, expired)) retaining_ = ageing_ = false;
+  if (retain(0, expired_)) return;
+  retaining_ = false;
+  expired_.reset();
 }
 
 void StoreWriter::write(const StoreBatch& batch) {
@@ -125,9 +125,11 @@ void StoreWriter::beginAgeing() {
   const Date date = options_.clock();
   const auto step = (date - std::exchange(agedAtDate_, date)) - (now - std::exchange(agedAt_, now));
   if (step >= -kClockMayDrift && step <= kClockMayDrift) {
-    retaining_ = ageing_ = true;
+    retaining_ = true;
+    expired_ = date - options_.maximumAge;
     return;
   }
+  expired_.reset();
   ZQ_LOG(
       nullptr, standard,
       "The clock was set by {} s: no row is removed for its age until it has run on for a while.",

@@ -128,10 +128,10 @@ class StoreWriter {
   std::vector<Flush> coveredFlushes_;
   std::chrono::milliseconds syncBackOff_{0};  // after a failure
   Instant syncNotBefore_{};
-  bool retaining_ = true;                 // there may be rows to remove
-  bool ageing_ = false;                   // ... because of their age
-  Instant agedAt_;                        // when rows were last looked at for their age
-  Date agedAtDate_;                       // ... by the clock
+  bool retaining_ = true;        // there may be rows to remove
+  std::optional<Date> expired_;  // ... those of before it, by a clock that was found to run on
+  Instant agedAt_;               // when rows were last looked at for their age
+  Date agedAtDate_;              // ... by the clock
   std::uint64_t removedNotExported_ = 0;  // and not yet reported
   Minutely removedLine_;
 
