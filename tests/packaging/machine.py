@@ -28,8 +28,7 @@ mount -o remount,bind,ro "$root/proc/sys"
 mount -t sysfs -o ro sysfs "$root/sys"
 mount -t tmpfs tmpfs "$root/sys/fs/cgroup"
 mount -t cgroup2 cgroup2 "$root/sys/fs/cgroup"
-for directory in dev run tmp; do mount -t tmpfs -o mode=0755 tmpfs "$root/$directory"; done
-chmod 1777 "$root/tmp"
+for directory in dev run; do mount -t tmpfs -o mode=0755 tmpfs "$root/$directory"; done
 for device in null:1:3 zero:1:5 full:1:7 random:1:8 urandom:1:9 tty:5:0; do
   IFS=: read -r name major minor <<<"$device"
   mknod -m 0666 "$root/dev/$name" c "$major" "$minor"
