@@ -14,6 +14,7 @@ constexpr std::int64_t kResponse = 1;
 /// How long the calls of one client may keep those of others waiting.
 constexpr std::chrono::nanoseconds kTurn = std::chrono::microseconds{100};
 
+/// What the store takes in a few milliseconds, where nothing is in its way.
 constexpr std::size_t kMostBehind = 128;
 // When half of those that may be behind take longer than this, fewer may be; when they take less,
 // more.
