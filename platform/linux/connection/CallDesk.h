@@ -89,8 +89,8 @@ class CallDesk {
   std::atomic<std::size_t> bytes_{0};  // of calls of which anything is still to be done
   std::atomic<bool> waiting_{false};   // the I/O thread wants to hear of room
 
-  // How many calls may be ahead of other clients' ones: as many as take a tenth of a millisecond, by
-  // what the last ones took.
+  // How many calls may be ahead of other clients' ones: as many as take a tenth of a millisecond,
+  // by what the last ones took.
   std::atomic<std::int64_t> callTime_;  // in nanoseconds
   std::atomic<std::size_t> turn_;
   // Calls that have been carried out, and so answered, but of which something is still to be done:

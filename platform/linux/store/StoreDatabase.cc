@@ -320,14 +320,17 @@ bool StoreDatabase::beginCheckpointIfDue() {
   // log can begin again. A log that has grown several times as long is kept from that by readers:
   // new ones wait for it.
   const bool isLittle = isCatchingUp_ && left <= std::max(logPages_ / kFewPages, 1);
-  const bool isLong = logPages >= logPages_ * kLogsBeforeRestart;
-  if (isLittle || isLong) {
+  if (isLittle || logIsLong()) {
     underWay_ = {StoreSyncer::Task::checkpoint, committedIDs_, std::nullopt};
     carryOutHere();
   } else {
     beginTask(StoreSyncer::Task::checkpoint);
   }
   return true;
+}
+
+bool StoreDatabase::logIsLong() const {
+  return connection_.logPages() >= logPages_ * kLogsBeforeRestart;
 }
 
 void StoreDatabase::beginTask(StoreSyncer::Task task) {
@@ -348,7 +351,7 @@ void StoreDatabase::carryOutHere() {
   StoreSyncer::End end{task, false, false, connection_.logPages()};
   if (task == StoreSyncer::Task::sync) {
     end.isSafe = connection_.syncLog();
-  } else if (connection_.logPages() >= logPages_ * kLogsBeforeRestart) {
+  } else if (logIsLong()) {
     end.isSafe = connection_.restartLog();
   } else {
     const SqliteConnection::Moved moved = connection_.checkpoint();

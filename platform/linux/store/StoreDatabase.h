@@ -125,6 +125,7 @@ class StoreDatabase {
   bool keepDrops(const StoreDrops& drops);
   bool insert(const StoreBatch& batch, const ExportedRow& row);
   bool insert(const StoreBatch&, const ErasureRow&) { return true; }
+  [[nodiscard]] bool logIsLong() const;
   void beginTask(StoreSyncer::Task task);
   void carryOutHere();
   void taskEnded(const StoreSyncer::End& end);
