@@ -213,6 +213,8 @@ class Payload {
   /// reason.
   [[nodiscard]] static Result<Payload> from(PayloadValue dictionary);
   explicit Payload(const Dictionary& dictionary);
+  /// Of what a `MessagePackWriter` wrote: a dictionary that is a payload, which is not checked.
+  [[nodiscard]] static Payload written(std::string_view encoded) { return Payload(encoded); }
 
   Payload(const Payload& other) noexcept;
   Payload(Payload&& other) noexcept : block_(std::exchange(other.block_, nullptr)) {}

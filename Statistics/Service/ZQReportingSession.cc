@@ -5,9 +5,13 @@
 #include <algorithm>
 #include <chrono>
 #include <cmath>
+#include <deque>
+#include <unordered_map>
 #include <utility>
 
 #include "base/Format.h"
+#include "base/Json.h"
+#include "base/MessagePack.h"
 #include "platform/Clock.h"
 #include "platform/Condition.h"
 #include "platform/DeviceProperties.h"
@@ -63,32 +67,37 @@ Dictionary OrientationEntry(std::string_view mode, std::string_view orientation,
 /// The texts that each key of a history had, joined, in the order in which the keys first came.
 class SummaryText {
  public:
-  void add(const Key& key, std::string text) {
-    const auto [found, isNew] = index_.try_emplace(KeyText(key), texts_.size());
-    if (isNew) {
-      texts_.emplace_back(found->first, std::move(text));
-    } else {
-      texts_[found->second].second.append(1, ',').append(text);
+  void add(std::string key, std::string text) {
+    if (const auto found = index_.find(key); found != index_.end()) {
+      found->second->append(1, ',').append(text);
+      return;
     }
+    auto& [ownKey, ownText] = texts_.emplace_back(std::move(key), std::move(text));
+    index_.emplace(ownKey, &ownText);
   }
-  [[nodiscard]] Dictionary dictionary() && {
-    Dictionary summary;
-    for (auto& [key, text] : texts_) summary.set(std::move(key), std::move(text));
-    return summary;
+  [[nodiscard]] Payload payload() const {
+    std::string encoded;
+    MessagePackWriter writer(encoded);
+    writer.dictionary(texts_.size());
+    for (const auto& [key, text] : texts_) {
+      writer.string(key);
+      writer.string(text);
+    }
+    return Payload::written(encoded);
   }
 
  private:
-  static std::string KeyText(const Key& key) {
-    if (const auto* text = key.string()) return *text;
-    if (const auto* number = key.integer()) return fmt::to_string(*number);
-    return fmt::to_string(*key.unsignedInteger());
-  }
-
-  std::vector<std::pair<std::string, std::string>> texts_;
-  std::unordered_map<std::string, std::size_t> index_;
+  std::deque<std::pair<std::string, std::string>> texts_;  // they stay where the index finds them
+  std::unordered_map<std::string_view, std::string*> index_;
 };
 
-Dictionary SummaryOf(const PayloadHistory& history, std::uint16_t serviceType) {
+std::string KeyText(const Key& key) {
+  if (const auto* text = key.string()) return *text;
+  if (const auto* number = key.integer()) return fmt::to_string(*number);
+  return fmt::to_string(*key.unsignedInteger());
+}
+
+Payload SummaryOf(const PayloadHistory& history, std::uint16_t serviceType) {
   SummaryText texts;
   texts.add(kSummaryKey, fmt::to_string(serviceType));
   history.forEach(
@@ -96,9 +105,9 @@ Dictionary SummaryOf(const PayloadHistory& history, std::uint16_t serviceType) {
         texts.add(identity.text(), JsonText(payload));
       },
       [&texts](const Dictionary& dictionary) {
-        for (const auto& [key, value] : dictionary) texts.add(key, Described(value));
+        for (const auto& [key, value] : dictionary) texts.add(KeyText(key), Described(value));
       });
-  return std::move(texts).dictionary();
+  return texts.payload();
 }
 
 /// A client's text as part of a file name: it can name no directory and leaves room for the rest.
@@ -303,7 +312,7 @@ void ZQReportingSession::sendSummary() {
   const auto history = aggregatedPayloadData();
   if (history == nullptr || history->empty()) return;
   if (ZQReportingUtilityIsInternalBuild()) {
-    const Payload summary(*createSummaryEventForSession());
+    const Payload summary = *createSummaryEventForSession();
     ZQ_LOG(Scope(), standard, "sending summary event for reporter {}", reporterID_);
     sendMessage(summary, kCategorySummary, kTypeSummary, true, nullptr);
     return;
@@ -314,7 +323,7 @@ void ZQReportingSession::sendSummary() {
   EmitKernelTrace(kTraceMessageSent);
   relmReportingQueue_->async(
       [self = shared_from_this(), history, serviceType = serviceType_.load()] {
-        const Payload summary(SummaryOf(*history, serviceType));
+        const Payload summary = SummaryOf(*history, serviceType);
         self->deliver(EnrichPayload(summary), kCategorySummary, kTypeSummary, summary, true);
       });
 }
@@ -357,10 +366,10 @@ void ZQReportingSession::unregisterOrientationHandlers() {
   orientationCallbackID_.reset();
 }
 
-std::optional<Dictionary> ZQReportingSession::createSummaryEventForSession() {
+std::optional<Payload> ZQReportingSession::createSummaryEventForSession() {
   const auto history = aggregatedPayloadData();
   if (history == nullptr || history->empty()) return std::nullopt;
-  Dictionary summary = SummaryOf(*history, serviceType_);
+  Payload summary = SummaryOf(*history, serviceType_);
   history->insertAtFront(userInfo_->copy());
   if (ZQReportingUtilityIsInternalBuild()) writeSummaryLogFile(*history);
   return summary;

@@ -83,10 +83,10 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
                                 std::uint16_t type, std::uint16_t serviceType,
                                 const std::optional<Dictionary>& userInfo, SendReply reply);
 
-  /// Condenses the history into one dictionary, each key's values joined by ",". Leaves the user
-  /// information at the front of the history, and on an internal build the whole history as a JSON
-  /// file in the diagnostics directory. None when nothing was sent.
-  [[nodiscard]] std::optional<Dictionary> createSummaryEventForSession()
+  /// Condenses the history into one dictionary of texts, each key's values joined by ",". Leaves
+  /// the user information at the front of the history, and on an internal build the whole history
+  /// as a JSON file in the diagnostics directory. None when nothing was sent.
+  [[nodiscard]] std::optional<Payload> createSummaryEventForSession()
       QUARVEL_REQUIRES(serverQueueRole);
   /// Whether changes of the orientation go into the history: on internal builds, for some service
   /// types, not on every class of device.

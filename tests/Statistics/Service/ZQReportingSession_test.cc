@@ -313,11 +313,11 @@ TEST(Summary, JoinsEveryKeysTextsAndLeavesTheUserInformationInFront) {
   Dictionary summary = {{"ZQ_Session_Summary_Event", "7"},
                         {"Playback_Start_1", "{\"a_b\":[1,\"x\"]}"},
                         {"Playback_Start_2", "{\"a\":true}"}};
-  EXPECT_EQ(owner.session->createSummaryEventForSession(), summary);
+  EXPECT_EQ(owner.session->createSummaryEventForSession(), Payload(summary));
   summary.merge({{"app", "Music"}, {"n", "1.5"}});
-  EXPECT_EQ(owner.session->createSummaryEventForSession(), summary);
+  EXPECT_EQ(owner.session->createSummaryEventForSession(), Payload(summary));
   summary.merge({{"app", "Music,Music"}, {"n", "1.5,1.5"}});
-  EXPECT_EQ(owner.session->createSummaryEventForSession(), summary);
+  EXPECT_EQ(owner.session->createSummaryEventForSession(), Payload(summary));
   EXPECT_THAT(owner.files.files, IsEmpty());
 }
 
