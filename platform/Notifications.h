@@ -25,8 +25,4 @@ using NotificationHandler = std::function<void(NotificationToken)>;
 [[nodiscard]] std::int32_t RegisterForNotification(std::string_view name, NotificationToken& token,
                                                    WorkQueue& queue, NotificationHandler handler);
 
-/// Posts a named notification to every process that registered for it, this one too. From any
-/// thread. Returns 0, or the system's error number when it could not be posted.
-std::int32_t PostNotification(std::string_view name);
-
 }  // namespace quarvel

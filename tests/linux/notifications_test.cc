@@ -61,7 +61,6 @@ TEST_F(NotificationsTest, EachWayOfTouchingAFilePosts) {
       {"opened and closed", [&] { ::close(::open(file.c_str(), O_WRONLY)); }},
       {"touched by path", [&] { utimensat(AT_FDCWD, file.c_str(), nullptr, 0); }},
       {"replaced", [&] { fs::rename(directory.write("new", ""), file); }},
-      {"posted", [&] { EXPECT_EQ(center.post("one"), 0); }},
   };
   NotificationToken one = 0;
   NotificationToken again = 0;
@@ -79,7 +78,7 @@ TEST_F(NotificationsTest, EachWayOfTouchingAFilePosts) {
     ASSERT_TRUE(queue.runNext());
     EXPECT_EQ(called, (std::vector{one, again}));
     // What is left of this touch comes before the next posting, and none of it is of another name.
-    ASSERT_EQ(center.post("other"), 0);
+    directory.write("notify/other", "");
     do {
       ASSERT_TRUE(queue.runNext());
     } while (called.back() != other);
@@ -95,13 +94,13 @@ TEST_F(NotificationsTest, PostingsBeforeTheHandlerBeginsAreOneCallAndLaterOnesAn
   ASSERT_EQ(center.add("burst", token, queue,
                        [&](NotificationToken) {
                          // Comes while the handler runs: must not be lost.
-                         if (++calls == 1) center.post("burst");
+                         if (++calls == 1) directory.write("notify/burst", "");
                        }),
             0);
   ASSERT_EQ(center.add("marker", marker, markers, [](NotificationToken) {}), 0);
   const auto burst = [&] {
-    for (int i = 0; i < 50; ++i) center.post("burst");
-    center.post("marker");
+    for (int i = 0; i < 50; ++i) directory.write("notify/burst", "");
+    directory.write("notify/marker", "");
     return markers.runNext();  // so all before it have been seen
   };
   ASSERT_TRUE(burst());
@@ -141,7 +140,6 @@ TEST_F(NotificationsTest, SetUpThatFailsYieldsAStatusAndNoToken) {
   NotificationToken token = 7;
   EXPECT_EQ(impossible.add("one", token, queue, [](NotificationToken) {}), ENOTDIR);
   EXPECT_EQ(token, 0);
-  EXPECT_EQ(impossible.post("one"), ENOTDIR);
 }
 
 }  // namespace

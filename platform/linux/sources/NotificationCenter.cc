@@ -1,9 +1,5 @@
 #include "platform/linux/sources/NotificationCenter.h"
 
-#include <fcntl.h>
-#include <unistd.h>
-
-#include <cerrno>
 #include <utility>
 
 namespace quarvel {
@@ -37,15 +33,6 @@ void NotificationCenter::posted(std::string_view name) {
       registration->handler(registration->token);
     });
   }
-}
-
-int NotificationCenter::post(std::string_view name) {
-  const std::filesystem::path file = directory_ / name;
-  const int descriptor =
-      ::open(file.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC | O_NOCTTY | O_NONBLOCK, 0644);
-  if (descriptor < 0) return errno;
-  ::close(descriptor);
-  return 0;
 }
 
 }  // namespace quarvel

@@ -18,14 +18,13 @@ namespace quarvel {
 /// N. From any thread. Must not be destroyed before `watch`.
 class NotificationCenter {
  public:
-  /// Nothing is touched or started before the first registration or posting.
+  /// Nothing is touched or started before the first registration.
   NotificationCenter(std::filesystem::path directory, DirectoryWatch& watch)
       : directory_(std::move(directory)), watch_(watch) {}
 
-  // As `RegisterForNotification` and `PostNotification`.
+  /// As `RegisterForNotification`.
   [[nodiscard]] int add(std::string_view name, NotificationToken& token, WorkQueue& queue,
                         NotificationHandler handler);
-  int post(std::string_view name);
 
  private:
   struct Registration {

@@ -22,8 +22,4 @@ std::int32_t RegisterForNotification(std::string_view name, NotificationToken& t
   return processCenter().add(name, token, queue, std::move(handler));
 }
 
-std::int32_t PostNotification(std::string_view name) {
-  return processCenter().post(name);
-}
-
 }  // namespace quarvel

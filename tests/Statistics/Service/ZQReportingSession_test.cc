@@ -146,6 +146,10 @@ TEST(Session, StartsAndStopsRepeat) {
     EXPECT_THAT(owner.history(), ElementsAre("Playback_Start_3")) << "counts run on";
     owner.stop();
     EXPECT_THAT(owner.ended, ElementsAre(Value(true), Value(true)));
+    owner.holdServerQueue();
+    EXPECT_EQ(owner.session->messageIdForCategory(kCategorySummary, kTypeSummary),
+              "Undefined_Unknown_3")
+        << "the summaries have counted";
 
     Lines expected;
     for (const Lines& lines :
@@ -310,14 +314,17 @@ TEST(Summary, JoinsEveryKeysTextsAndLeavesTheUserInformationInFront) {
   EXPECT_EQ(owner.session->createSummaryEventForSession(), std::nullopt);
   owner.send({{"a b", List{1, "x"}}});
   owner.send({{"a", true}});
-  Dictionary summary = {{"ZQ_Session_Summary_Event", "7"},
-                        {"Playback_Start_1", "{\"a_b\":[1,\"x\"]}"},
-                        {"Playback_Start_2", "{\"a\":true}"}};
-  EXPECT_EQ(owner.session->createSummaryEventForSession(), Payload(summary));
-  summary.merge({{"app", "Music"}, {"n", "1.5"}});
-  EXPECT_EQ(owner.session->createSummaryEventForSession(), Payload(summary));
-  summary.merge({{"app", "Music,Music"}, {"n", "1.5,1.5"}});
-  EXPECT_EQ(owner.session->createSummaryEventForSession(), Payload(summary));
+  const auto with = [](const Dictionary& userInfo) {
+    Dictionary summary = {{"ZQ_Session_Summary_Event", "7"}};
+    summary.merge(userInfo);
+    summary.merge(
+        {{"Playback_Start_1", "{\"a_b\":[1,\"x\"]}"}, {"Playback_Start_2", "{\"a\":true}"}});
+    return Payload(summary);
+  };
+  EXPECT_EQ(owner.session->createSummaryEventForSession(), with({}));
+  EXPECT_EQ(owner.session->createSummaryEventForSession(), with({{"app", "Music"}, {"n", "1.5"}}));
+  EXPECT_EQ(owner.session->createSummaryEventForSession(),
+            with({{"app", "Music,Music"}, {"n", "1.5,1.5"}}));
   EXPECT_THAT(owner.files.files, IsEmpty());
 }
 
