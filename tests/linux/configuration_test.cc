@@ -59,7 +59,7 @@ Model = "Marl"
 level = "info"
 [store]
 path = "/data/t.db"
-sync_ms = 0
+sync_ms = 70
 max_bytes = 1048576
 max_age_days = 3
 [agent]
@@ -121,7 +121,7 @@ connections = 4
   EXPECT_EQ(std::get<std::string>(read.device.at("Model")), "Marl");
   EXPECT_EQ(read.logLevel, LogLevel::info);
   EXPECT_EQ(read.store.path, "/data/t.db");
-  EXPECT_EQ(read.store.sync.count(), 0);
+  EXPECT_EQ(read.store.sync, std::chrono::milliseconds(70));
   EXPECT_EQ(read.store.maximumBytes, 1048576U);
   EXPECT_EQ(read.store.maximumAge.count(), 3);
   EXPECT_THAT(read.agent.backends, ElementsAre("otlp", "store"));
@@ -153,8 +153,8 @@ connections = 4
   EXPECT_EQ(read.orientation, Configuration::OrientationSource::iio);
   EXPECT_EQ(read.limits.messageBytes, 2048U);
   EXPECT_EQ(read.limits.replyBytes, 4096U);
-  EXPECT_EQ(read.limits.frame.count(), 1);
-  EXPECT_EQ(read.limits.stall.count(), 2);
+  EXPECT_EQ(read.limits.frame, std::chrono::seconds(1));
+  EXPECT_EQ(read.limits.stall, std::chrono::seconds(2));
   EXPECT_EQ(read.limits.depth, 128U);
   EXPECT_EQ(read.limits.queuedCalls, 3U);
   EXPECT_EQ(read.limits.queuedBytes, 8192U);

@@ -5,6 +5,7 @@
 #include <toml++/toml.h>
 
 #include <algorithm>
+#include <chrono>
 #include <concepts>
 #include <cstdint>
 #include <filesystem>
@@ -125,21 +126,21 @@ class Section {
     }
   }
 
-  /// An integer, or a duration by its count.
-  template <class Number>
+  template <std::integral Number>
   void read(std::string_view key, std::int64_t least, std::int64_t most, Number& out) {
-    const std::string allowed = most == kAnyPositive
-                                    ? fmt::format("an integer of at least {}", least)
-                                    : fmt::format("an integer from {} to {}", least, most);
-    const toml::node* const node = find(key);
-    if (node == nullptr) return;
-    const auto* const integer = node->as_integer();
-    if (integer == nullptr || integer->get() < least || integer->get() > most) {
-      findings_.wrongValue(path(key), *node, allowed);
-    } else if constexpr (std::integral<Number>) {
-      out = static_cast<Number>(integer->get());
-    } else {
-      out = Number(static_cast<typename Number::rep>(integer->get()));
+    if (const auto number = integer(key, least, most)) out = static_cast<Number>(*number);
+  }
+
+  /// A duration, in the unit that ends its key: `_ms`, `_seconds` or `_days`.
+  template <class Rep, class Period>
+  void read(std::string_view key, std::int64_t least, std::int64_t most,
+            std::chrono::duration<Rep, Period>& out) {
+    using std::chrono::milliseconds;
+    const milliseconds unit = key.ends_with("_ms")        ? milliseconds(1)
+                              : key.ends_with("_seconds") ? std::chrono::seconds(1)
+                                                          : std::chrono::days(1);
+    if (const auto number = integer(key, least, most)) {
+      out = std::chrono::duration_cast<std::chrono::duration<Rep, Period>>(*number * unit);
     }
   }
 
@@ -216,6 +217,18 @@ class Section {
   const toml::node* find(std::string_view key) {
     known_.emplace(key);
     return table_ == nullptr ? nullptr : table_->get(key);
+  }
+
+  std::optional<std::int64_t> integer(std::string_view key, std::int64_t least, std::int64_t most) {
+    const toml::node* const node = find(key);
+    if (node == nullptr) return std::nullopt;
+    const auto* const value = node->as_integer();
+    if (value != nullptr && value->get() >= least && value->get() <= most) return value->get();
+    findings_.wrongValue(path(key), *node,
+                         most == kAnyPositive
+                             ? fmt::format("an integer of at least {}", least)
+                             : fmt::format("an integer from {} to {}", least, most));
+    return std::nullopt;
   }
 
   template <class Kind, class Take>
