@@ -92,7 +92,7 @@ class SocketListener::Loop {
     }
     acceptSoon(context_->io);
     if (options_.atStart) asio::post(context_->io, options_.atStart);
-    if (options_.pulseInterval > options_.pulseInterval.zero()) pulseLater();
+    if (options_.pulseInterval > std::chrono::nanoseconds::zero()) pulseLater();
     context_->io.run();
     for (const auto& step : options_.atEnd) step();
   }

@@ -61,7 +61,7 @@ std::string ErasureSelection::description() const {
 StoreErasure::StoreErasure(SqliteConnection& connection, ErasureSelection selection,
                            const StoreIDs& through, const StoreIDs& lastIDs, Date now)
     : connection_(connection),
-      selection_(std::move(selection)),
+      selection_(selection),
       lastIDs_(lastIDs),
       through_(through),
       now_(now) {
@@ -69,7 +69,7 @@ StoreErasure::StoreErasure(SqliteConnection& connection, ErasureSelection select
 }
 
 StoreErasure::StoreErasure(SqliteConnection& connection, ErasureSelection selection, Date now)
-    : connection_(connection), selection_(std::move(selection)), lastIDs_(ownLastIDs_), now_(now) {
+    : connection_(connection), selection_(selection), lastIDs_(ownLastIDs_), now_(now) {
   connection_.execute("PRAGMA secure_delete = ON");
   for (const StoreTable table : kAllStoreTables) {
     ownLastIDs_[table] =

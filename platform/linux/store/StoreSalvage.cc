@@ -157,7 +157,8 @@ class TableSalvage {
 /// What `meta` keeps and the cursors. Of two numbers the larger one is right: they only grow. An id
 /// that has left the device is not given again, though its row may be lost.
 bool Adopt(SqliteConnection& from, SqliteConnection& into) {
-  SqliteStatement read, write;
+  SqliteStatement read;
+  SqliteStatement write;
   if (from.prepare(read, "SELECT key, value FROM meta")) {
     if (!into.prepare(write,
                       "INSERT INTO meta VALUES(?1, ?2) ON CONFLICT(key) DO UPDATE SET value ="

@@ -56,7 +56,7 @@ Gauges& ProcessGauges() {
   return gauges;
 }
 
-void DescribeInStatus(Status& status, std::shared_ptr<const TelemetryStore> store) {
+void DescribeInStatus(Status& status, const std::shared_ptr<const TelemetryStore>& store) {
   status.add([store] {
     const auto now = [](Gauge gauge) {
       return ProcessGauges()[static_cast<std::size_t>(gauge)].load();

@@ -15,6 +15,6 @@ using Gauges = std::array<std::atomic<std::int64_t>, 3>;
 [[nodiscard]] Gauges& ProcessGauges();
 
 /// Has the status tell of the store, its queue and its counters, and of the process's gauges.
-void DescribeInStatus(Status& status, std::shared_ptr<const TelemetryStore> store);
+void DescribeInStatus(Status& status, const std::shared_ptr<const TelemetryStore>& store);
 
 }  // namespace quarvel

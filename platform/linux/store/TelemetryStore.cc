@@ -108,7 +108,7 @@ Outcome TelemetryStore::addExport(ExportRecord record, FlushCompletion completio
 
 Outcome TelemetryStore::erase(ErasureSelection selection,
                               std::function<void(const Result<std::int64_t>&)> completion) {
-  return queue_.pushAtOnce(ErasureRow{std::move(selection), std::move(completion)}, {});
+  return queue_.pushAtOnce(ErasureRow{selection, std::move(completion)}, {});
 }
 
 void TelemetryStore::followExtent(std::function<void(const StoreExtent&)> follower) {
