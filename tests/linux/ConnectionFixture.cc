@@ -4,7 +4,6 @@
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <sys/socket.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <array>
@@ -29,7 +28,6 @@ void ZQLogWrite(LogHandle, LogLevel, const char*, int, const char*, std::string_
 
 namespace {
 
-/// The exported object: operations that answer at once, later, at length or not at all.
 class TestService final : public ExportedObject {
  public:
   explicit TestService(std::shared_ptr<Ledger> ledger) : ledger_(std::move(ledger)) {}
@@ -46,10 +44,6 @@ class TestService final : public ExportedObject {
   void refuse(ErrorReply reply) { reply(Error{"test", 9, {{"why", "because"}}}); }
   void keep(std::int64_t number, Reply<std::int64_t> reply) {
     ledger_->keep(number, std::move(reply));
-  }
-  void leave(std::int64_t number, Reply<std::int64_t> reply) {
-    reply(number);
-    ledger_->leave(number);
   }
   void make(std::int64_t number, std::uint32_t size, Reply<std::string> reply) {
     ledger_->arrived(number);
@@ -71,7 +65,6 @@ constexpr std::array kTestMethods{
     Exported<&TestService::never>("never:"),
     Exported<&TestService::refuse>("refuse:"),
     Exported<&TestService::keep>("keep:reply:"),
-    Exported<&TestService::leave>("leave:reply:"),
     Exported<&TestService::make>("make:size:reply:"),
     Exported<&TestService::describe>("describe:code:list:reply:"),
 };
@@ -79,34 +72,31 @@ constexpr ExportedInterface kTestInterface{"TestProtocol", kTestMethods};
 
 class TestDelegate final : public ServiceListenerDelegate {
  public:
-  explicit TestDelegate(Service& service) : service_(service) {}
+  explicit TestDelegate(Served& served) : served_(served) {}
 
   bool shouldAcceptNewConnection(ServiceListener&,
                                  const std::shared_ptr<ClientConnection>& connection) override {
-    const auto object = std::make_shared<TestService>(service_.ledger);
-    service_.connections.push_back(connection);
-    service_.objects.push_back(object);
-    EXPECT_EQ(connection->processIdentifier(), ::getpid());
+    const auto object = std::make_shared<TestService>(served_.ledger);
+    served_.connections.push_back(connection);
+    served_.objects.push_back(object);
     connection->setExportedInterface(kTestInterface);
     connection->setExportedObject(object);
     // Holding the object, as a careless delegate might, must not keep anything alive.
     connection->setInterruptionHandler([object] { Journal::shared().add("interrupted"); });
     connection->setInvalidationHandler([object] { Journal::shared().add("invalidated"); });
     connection->resume();
-    return service_.accepts;
+    return served_.accepts;
   }
 
  private:
-  Service& service_;
+  Served& served_;
 };
 
-ListeningSocket ListenAt(const std::filesystem::path& path) {
-  Result<ListeningSocket> socket = ListeningSocket::listeningAt(path);
-  EXPECT_TRUE(socket) << socket.error().description();
-  return std::move(socket.value());
-}
-
 }  // namespace
+
+std::shared_ptr<ServiceListenerDelegate> DelegateFor(Served& served) {
+  return std::make_shared<TestDelegate>(served);
+}
 
 Journal& Journal::shared() {
   static Journal journal;
@@ -163,13 +153,6 @@ void Ledger::keep(std::int64_t number, Reply<std::int64_t> reply) {
   changed_.notifyAll();
 }
 
-void Ledger::leave(std::int64_t number) {
-  MutexLock lock(mutex_);
-  numbers_.push_back(number);
-  left_.push_back(VoucherHold::indirect(VoucherHold::current().voucher()));
-  changed_.notifyAll();
-}
-
 std::optional<Ledger::Kept> Ledger::takeKept() {
   MutexLock lock(mutex_);
   if (kept_.empty()) return std::nullopt;
@@ -197,13 +180,11 @@ bool Ledger::waitForArrivals(std::size_t count) {
   return true;
 }
 
-Client::Client() : socket_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
+Client::Client(const std::filesystem::path& service)
+    : socket_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
   const timeval patience{kPatience.count(), 0};
   ::setsockopt(socket_.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
   ::setsockopt(socket_.get(), SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
-}
-
-void Client::connect(const std::filesystem::path& service) {
   const sockaddr_un address = UnixAddress(service);
   EXPECT_EQ(::connect(socket_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address),
             0)
@@ -269,17 +250,18 @@ std::string CallBytes(std::optional<std::uint32_t> messageID, std::string_view m
   return bytes;
 }
 
-Service::Service(const Configuration::Limits& limits, std::optional<ListeningSocket> socket,
-                 NotBegun) {
+Service::Service(const Configuration::Limits& limits, bool begun) {
   Journal::shared().clear();
   SocketListener::Options options;
   options.limits = limits;
   options.atEnd.emplace_back([] { Journal::shared().add("ended"); });
-  auto listener = SocketListener::create(socket ? std::move(*socket) : ListenAt(socketPath()),
-                                         std::move(options));
+  auto socket = ListeningSocket::listeningAt(socketPath());
+  EXPECT_TRUE(socket) << socket.error().description();
+  auto listener = SocketListener::create(std::move(socket.value()), std::move(options));
   EXPECT_TRUE(listener);
   listener_ = std::move(listener.value());
-  listener_->setDelegate(std::make_shared<TestDelegate>(*this));
+  listener_->setDelegate(DelegateFor(*this));
+  if (begun) begin();
 }
 
 void Service::begin() {

@@ -10,7 +10,6 @@
 #include <string>
 #include <string_view>
 #include <thread>
-#include <utility>
 #include <vector>
 
 #include "base/Mutex.h"
@@ -59,9 +58,6 @@ class Ledger {
   void arrived(std::int64_t number);
   /// As `arrived`; the call stays under way until taken and dropped.
   void keep(std::int64_t number, Reply<std::int64_t> reply);
-  /// As `arrived`; the call is carried out, but something of it is to be done for as long as this
-  /// lives.
-  void leave(std::int64_t number);
   std::optional<Kept> takeKept();
   std::vector<std::int64_t> numbers();
   std::size_t largestKept();
@@ -72,17 +68,13 @@ class Ledger {
   ConditionVariable changed_;
   std::vector<std::int64_t> numbers_ QUARVEL_GUARDED_BY(mutex_);
   std::deque<Kept> kept_ QUARVEL_GUARDED_BY(mutex_);
-  std::vector<VoucherHold> left_ QUARVEL_GUARDED_BY(mutex_);
   std::size_t largestKept_ QUARVEL_GUARDED_BY(mutex_) = 0;
 };
 
 /// A client's end: writes bytes, reads responses.
 class Client {
  public:
-  /// Not connected yet; has its descriptor.
-  Client();
-  explicit Client(const std::filesystem::path& service) : Client() { connect(service); }
-  void connect(const std::filesystem::path& service);
+  explicit Client(const std::filesystem::path& service);
 
   /// Sends all of it, waiting for the service to take it. False when the service has hung up.
   bool send(std::string_view bytes);
@@ -107,18 +99,23 @@ class Client {
 std::string CallBytes(std::optional<std::uint32_t> messageID, std::string_view method,
                       const List& arguments);
 
+/// Whom a listener has served, and with what.
+struct Served {
+  /// What the delegate answers from now on.
+  std::atomic<bool> accepts = true;
+  const std::shared_ptr<Ledger> ledger = std::make_shared<Ledger>();
+  /// Of each connection, in order of acceptance; to be read when its end has been heard of.
+  std::vector<std::weak_ptr<ClientConnection>> connections;
+  std::vector<std::weak_ptr<ExportedObject>> objects;
+};
+/// A delegate that exports operations that answer at once, later, at length or not at all.
+std::shared_ptr<ServiceListenerDelegate> DelegateFor(Served& served);
+
 /// A listener that serves on a thread of its own from `begin` to `end`.
-class Service {
+class Service : public Served {
  public:
-  /// Begun. Listens at `socketPath` unless a socket is given.
-  explicit Service(const Configuration::Limits& limits = {},
-                   std::optional<ListeningSocket> socket = std::nullopt)
-      : Service(limits, std::move(socket), NotBegun()) {
-    begin();
-  }
-  /// Clients can connect, but nobody looks at them yet.
-  struct NotBegun {};
-  explicit Service(NotBegun notBegun) : Service({}, std::nullopt, notBegun) {}
+  /// Begun, unless clients shall connect and nobody look at them yet.
+  explicit Service(const Configuration::Limits& limits = {}, bool begun = true);
   ~Service() { end(); }
 
   Client connect() { return Client(socketPath()); }
@@ -128,16 +125,7 @@ class Service {
   void end();
   void requestEnd() { listener_->requestEnd(); }
 
-  /// What the delegate answers from now on.
-  std::atomic<bool> accepts = true;
-  const std::shared_ptr<Ledger> ledger = std::make_shared<Ledger>();
-  /// Of each connection, in order of acceptance; to be read when its end has been heard of.
-  std::vector<std::weak_ptr<ClientConnection>> connections;
-  std::vector<std::weak_ptr<ExportedObject>> objects;
-
  private:
-  Service(const Configuration::Limits& limits, std::optional<ListeningSocket> socket, NotBegun);
-
   TemporaryDirectory directory_;
   std::unique_ptr<SocketListener> listener_;
   std::thread thread_;

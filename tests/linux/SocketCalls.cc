@@ -71,103 +71,51 @@ std::optional<int> SocketCalls::admit(const char* function) {
 
 // The C library's functions, as this program finds them.
 
-#define QUARVEL_ADMIT(name, ...)                                                           \
-  static const auto real = reinterpret_cast<decltype(&(name))>(::dlsym(RTLD_NEXT, #name)); \
-  if (const auto error = quarvel::testing::SocketCalls::instance().admit(#name)) {         \
-    errno = *error == 0 ? EIO : *error;                                                    \
-    return -1;                                                                             \
-  }                                                                                        \
-  return real(__VA_ARGS__)
+#define QUARVEL_CALL(type, name, parameters, arguments, throws)                              \
+  type name parameters throws {                                                              \
+    static const auto real = reinterpret_cast<decltype(&(name))>(::dlsym(RTLD_NEXT, #name)); \
+    if (const auto error = quarvel::testing::SocketCalls::instance().admit(#name)) {         \
+      errno = *error == 0 ? EIO : *error;                                                    \
+      return -1;                                                                             \
+    }                                                                                        \
+    return real arguments;                                                                   \
+  }
 
 extern "C" {
 
-int socket(int domain, int type, int protocol) noexcept {
-  QUARVEL_ADMIT(socket, domain, type, protocol);
-}
-
-int bind(int descriptor, const sockaddr* address, socklen_t length) noexcept {
-  QUARVEL_ADMIT(bind, descriptor, address, length);
-}
-
-int listen(int descriptor, int backlog) noexcept {
-  QUARVEL_ADMIT(listen, descriptor, backlog);
-}
-
-int accept4(int descriptor, sockaddr* address, socklen_t* length, int flags) {
-  QUARVEL_ADMIT(accept4, descriptor, address, length, flags);
-}
-
-int connect(int descriptor, const sockaddr* address, socklen_t length) {
-  QUARVEL_ADMIT(connect, descriptor, address, length);
-}
-
-ssize_t recv(int descriptor, void* bytes, size_t count, int flags) {
-  QUARVEL_ADMIT(recv, descriptor, bytes, count, flags);
-}
-
-int shutdown(int descriptor, int how) noexcept {
-  QUARVEL_ADMIT(shutdown, descriptor, how);
-}
-
-int getsockopt(int descriptor, int level, int name, void* value, socklen_t* length) noexcept {
-  QUARVEL_ADMIT(getsockopt, descriptor, level, name, value, length);
-}
-
-int epoll_create1(int flags) noexcept {
-  QUARVEL_ADMIT(epoll_create1, flags);
-}
-
-int epoll_ctl(int events, int operation, int descriptor, epoll_event* event) noexcept {
-  QUARVEL_ADMIT(epoll_ctl, events, operation, descriptor, event);
-}
-
-int epoll_wait(int events, epoll_event* ready, int most, int timeout) {
-  QUARVEL_ADMIT(epoll_wait, events, ready, most, timeout);
-}
-
-int eventfd(unsigned value, int flags) noexcept {
-  QUARVEL_ADMIT(eventfd, value, flags);
-}
-
-int timerfd_create(int clock, int flags) noexcept {
-  QUARVEL_ADMIT(timerfd_create, clock, flags);
-}
-
-int timerfd_settime(int timer, int flags, const itimerspec* time, itimerspec* before) noexcept {
-  QUARVEL_ADMIT(timerfd_settime, timer, flags, time, before);
-}
-
-ssize_t read(int descriptor, void* bytes, size_t count) {
-  QUARVEL_ADMIT(read, descriptor, bytes, count);
-}
-
-ssize_t write(int descriptor, const void* bytes, size_t count) {
-  QUARVEL_ADMIT(write, descriptor, bytes, count);
-}
-
-int mkdir(const char* path, mode_t mode) noexcept {
-  QUARVEL_ADMIT(mkdir, path, mode);
-}
-
-int flock(int descriptor, int operation) noexcept {
-  QUARVEL_ADMIT(flock, descriptor, operation);
-}
-
-int fchmod(int descriptor, mode_t mode) noexcept {
-  QUARVEL_ADMIT(fchmod, descriptor, mode);
-}
-
-int chmod(const char* path, mode_t mode) noexcept {
-  QUARVEL_ADMIT(chmod, path, mode);
-}
-
-int lstat(const char* path, struct stat* status) noexcept {
-  QUARVEL_ADMIT(lstat, path, status);
-}
-
-int unlink(const char* path) noexcept {
-  QUARVEL_ADMIT(unlink, path);
-}
+QUARVEL_CALL(int, socket, (int domain, int type, int protocol), (domain, type, protocol), noexcept)
+QUARVEL_CALL(int, bind, (int descriptor, const sockaddr* address, socklen_t length),
+             (descriptor, address, length), noexcept)
+QUARVEL_CALL(int, listen, (int descriptor, int backlog), (descriptor, backlog), noexcept)
+QUARVEL_CALL(int, accept4, (int descriptor, sockaddr* address, socklen_t* length, int flags),
+             (descriptor, address, length, flags), noexcept(false))
+QUARVEL_CALL(int, connect, (int descriptor, const sockaddr* address, socklen_t length),
+             (descriptor, address, length), noexcept(false))
+QUARVEL_CALL(ssize_t, recv, (int descriptor, void* bytes, size_t count, int flags),
+             (descriptor, bytes, count, flags), noexcept(false))
+QUARVEL_CALL(int, shutdown, (int descriptor, int how), (descriptor, how), noexcept)
+QUARVEL_CALL(int, getsockopt, (int descriptor, int level, int name, void* value, socklen_t* length),
+             (descriptor, level, name, value, length), noexcept)
+QUARVEL_CALL(int, epoll_create1, (int flags), (flags), noexcept)
+QUARVEL_CALL(int, epoll_ctl, (int events, int operation, int descriptor, epoll_event* event),
+             (events, operation, descriptor, event), noexcept)
+QUARVEL_CALL(int, epoll_wait, (int events, epoll_event* ready, int most, int timeout),
+             (events, ready, most, timeout), noexcept(false))
+QUARVEL_CALL(int, eventfd, (unsigned value, int flags), (value, flags), noexcept)
+QUARVEL_CALL(int, timerfd_create, (int clock, int flags), (clock, flags), noexcept)
+QUARVEL_CALL(int, timerfd_settime,
+             (int timer, int flags, const itimerspec* time, itimerspec* before),
+             (timer, flags, time, before), noexcept)
+QUARVEL_CALL(ssize_t, read, (int descriptor, void* bytes, size_t count), (descriptor, bytes, count),
+             noexcept(false))
+QUARVEL_CALL(ssize_t, write, (int descriptor, const void* bytes, size_t count),
+             (descriptor, bytes, count), noexcept(false))
+QUARVEL_CALL(int, mkdir, (const char* path, mode_t mode), (path, mode), noexcept)
+QUARVEL_CALL(int, flock, (int descriptor, int operation), (descriptor, operation), noexcept)
+QUARVEL_CALL(int, fchmod, (int descriptor, mode_t mode), (descriptor, mode), noexcept)
+QUARVEL_CALL(int, chmod, (const char* path, mode_t mode), (path, mode), noexcept)
+QUARVEL_CALL(int, lstat, (const char* path, struct stat* status), (path, status), noexcept)
+QUARVEL_CALL(int, unlink, (const char* path), (path), noexcept)
 
 ssize_t send(int descriptor, const void* bytes, size_t count, int flags) {
   static const auto real = reinterpret_cast<decltype(&send)>(::dlsym(RTLD_NEXT, "send"));
@@ -179,11 +127,16 @@ ssize_t send(int descriptor, const void* bytes, size_t count, int flags) {
 }
 
 int open(const char* path, int flags, ...) {
+  static const auto real = reinterpret_cast<decltype(&open)>(::dlsym(RTLD_NEXT, "open"));
   va_list arguments;
   va_start(arguments, flags);
   const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(arguments, mode_t) : 0;
   va_end(arguments);
-  QUARVEL_ADMIT(open, path, flags, mode);
+  if (const auto error = quarvel::testing::SocketCalls::instance().admit("open")) {
+    errno = *error;
+    return -1;
+  }
+  return real(path, flags, mode);
 }
 
 }  // extern "C"

@@ -1,7 +1,6 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <array>
 #include <cerrno>
 #include <cstdio>
 #include <future>
@@ -59,27 +58,6 @@ bool IsPassing(int error) {
   return error == EINTR || error == EAGAIN || error == ECONNABORTED || error == EPROTO;
 }
 
-class EchoService final : public ExportedObject {
- public:
-  void echo(std::int64_t number, Reply<std::int64_t> reply) { reply(number); }
-};
-
-constexpr std::array kMethods{Exported<&EchoService::echo>("echo:reply:")};
-constexpr ExportedInterface kInterface{"EchoProtocol", kMethods};
-
-class Delegate final : public ServiceListenerDelegate {
- public:
-  bool shouldAcceptNewConnection(ServiceListener&,
-                                 const std::shared_ptr<ClientConnection>& connection) override {
-    connection->setExportedInterface(kInterface);
-    connection->setExportedObject(std::make_shared<EchoService>());
-    connection->setInterruptionHandler([] {});
-    connection->setInvalidationHandler([] {});
-    connection->resume();
-    return true;
-  }
-};
-
 /// What clients do while something may fail; any of them may be turned away.
 void BeClients(const std::filesystem::path& path) {
   Client first(path);
@@ -133,8 +111,7 @@ class Life {
   [[nodiscard]] bool refused() const { return refused_; }
   /// How many calls of a function something may fail for ever before.
   [[nodiscard]] std::size_t callsWhileFailing(const std::string& function) const {
-    const auto found = countsWhileFailing_.find(function);
-    return found == countsWhileFailing_.end() ? 0 : found->second;
+    return countsWhileFailing_.contains(function) ? countsWhileFailing_.at(function) : 0;
   }
 
  private:
@@ -147,14 +124,14 @@ class Life {
     auto listener = SocketListener::create(std::move(socket.value()), std::move(options));
     if (!listener) return refuse(listener.error());
     listener_ = std::move(listener.value());
-    listener_->setDelegate(std::make_shared<Delegate>());
+    listener_->setDelegate(DelegateFor(served_));
     return true;
   }
 
   bool refuse(const Error& error) {
     refused_ = true;
-    const Value* reason = error.userInfo.find("reason");
-    if (reason == nullptr) finding_ = "the service does not begin and does not say why";
+    if (error.userInfo.find("reason") == nullptr)
+      finding_ = "the service does not begin and does not say why";
     return false;
   }
 
@@ -172,6 +149,7 @@ class Life {
   }
 
   TemporaryDirectory directory_;
+  Served served_;
   std::map<std::string, std::size_t> countsWhileFailing_;
   std::unique_ptr<SocketListener> listener_;
   std::string finding_;

@@ -20,15 +20,12 @@ using ::testing::HasSubstr;
 using ::testing::StartsWith;
 using namespace std::string_literals;
 
-/// How error lines begin that blame this process.
-std::string AboutThisClient() {
-  return "error: client " + std::to_string(::getpid());
-}
+/// As the bytes of a call have it.
+const std::string echo =
+    "\xab"
+    "echo:reply:"s;
 
 TEST(Connection, AnswersCallsInEveryFormThatFits) {
-  const std::string echo =
-      "\xab"
-      "echo:reply:"s;
   const struct {
     const char* name;
     std::string bytes;
@@ -104,9 +101,6 @@ TEST(Connection, EndsAClientThatBreaksTheProtocolAndNoOther) {
   Configuration::Limits limits;
   limits.messageBytes = 4096;
   limits.depth = 8;
-  const std::string echo =
-      "\xab"
-      "echo:reply:"s;
   const struct {
     const char* name;
     std::string bytes;
@@ -145,22 +139,17 @@ TEST(Connection, EndsAClientThatBreaksTheProtocolAndNoOther) {
     EXPECT_EQ(client.response(), "end");
     ASSERT_TRUE(Journal::shared().waitFor("invalidated"));
     EXPECT_THAT(Journal::shared().entries(),
-                ElementsAre(StartsWith(AboutThisClient() + " broke the protocol: "), "interrupted",
-                            "invalidated"));
+                ElementsAre(StartsWith("error: client " + std::to_string(::getpid()) +
+                                       " broke the protocol: "),
+                            "interrupted", "invalidated"));
     EXPECT_TRUE(bystander.isServed());
   }
 }
 
-TEST(Connection, TakesMessagesInPiecesOfAnySize) {
+TEST(Connection, TakesAMegabyteInSixtyThousandPieces) {
   Service service;
   Client client = service.connect();
-  for (const char byte :
-       CallBytes(1, "describe:code:list:reply:", {Dictionary{{"key", "value"}}, 1, List{}})) {
-    ASSERT_TRUE(client.send({&byte, 1}));
-  }
-  EXPECT_EQ(client.response(), R"([1,1,null,"{\"key\":\"value\"} 1 0"])");
-
-  // A megabyte in sixty thousand pieces: looked at once a piece, it would take minutes.
+  // Looked at once a piece, it would take minutes.
   Dictionary large{{"text", std::string(1'000'000, 't')}};
   for (int i = 0; i < 1000; ++i) large.set(i, i);
   const std::string bytes = CallBytes(2, "describe:code:list:reply:", {large, 1, nullptr});
@@ -215,6 +204,7 @@ TEST(Connection, LetsEverythingGoWhenItsClientHasGone) {
   ASSERT_TRUE(service.ledger->waitForArrivals(1));
   ASSERT_TRUE(other.isServed());
   auto stillKnown = service.connections.front().lock();
+  EXPECT_EQ(stillKnown->processIdentifier(), ::getpid());
   client.hangUp();
   ASSERT_TRUE(Journal::shared().waitFor("invalidated"));
   ASSERT_TRUE(other.isServed());  // on the same thread, so what follows an invalidation is done
@@ -279,7 +269,7 @@ TEST(Connection, EndsInOrderWithCallsUnderWay) {
 }
 
 TEST(Connection, HearsWhoCameBeforeTheEnd) {
-  Service service{Service::NotBegun()};
+  Service service({}, false);
   Client client = service.connect();
   ASSERT_TRUE(client.call(1, "echo:reply:", {1}));
   service.requestEnd();

@@ -3,146 +3,120 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
-#include <atomic>
+#include <algorithm>
 #include <filesystem>
-#include <fstream>
+#include <latch>
+#include <optional>
 #include <string>
 #include <thread>
 #include <vector>
 
 #include "platform/linux/connection/ListeningSocket.h"
+#include "tests/TemporaryDirectory.h"
 #include "tests/UnixSocket.h"
-#include "tests/linux/ConnectionFixture.h"
 
 namespace quarvel {
 namespace {
 
 using ::testing::HasSubstr;
 
-/// A bound socket; listening when `backlog` is not negative.
-UniqueDescriptor BoundSocket(const std::filesystem::path& path, int type, int backlog) {
-  UniqueDescriptor socket(quarvel::BoundSocket(path, type));
-  if (backlog >= 0) {
-    EXPECT_EQ(::listen(socket.get(), backlog), 0);
-  }
-  return socket;
-}
+class ListeningSocketTest : public ::testing::Test {
+ protected:
+  const TemporaryDirectory directory_;
+  const std::filesystem::path path_ = directory_.path() / "socket";
+};
 
-mode_t ModeOf(const std::filesystem::path& path) {
-  struct stat status {};
-  EXPECT_EQ(::stat(path.c_str(), &status), 0);
-  return status.st_mode & 07777;
-}
-
-TEST(ListeningSocket, MakesItsDirectoryAndRemovesItsFile) {
-  const TemporaryDirectory directory;
-  const auto path = directory.path() / "run" / "quarvel" / "reporting.sock";
+TEST_F(ListeningSocketTest, MakesItsDirectoryAndRemovesItsFile) {
+  const auto path = directory_.path() / "run" / "quarvel" / "reporting.sock";
+  const auto modeOf = [](const std::filesystem::path& file) {
+    return static_cast<mode_t>(std::filesystem::status(file).permissions());
+  };
   const mode_t umaskBefore = ::umask(0027);
   {
     auto socket = ListeningSocket::listeningAt(path);
     ::umask(umaskBefore);
     ASSERT_TRUE(socket) << socket.error().description();
-    EXPECT_EQ(ModeOf(path), 0660U);
-    EXPECT_EQ(ModeOf(path.parent_path()), 0750U);
+    EXPECT_EQ(modeOf(path), 0660U);
+    EXPECT_EQ(modeOf(path.parent_path()), 0750U);
   }
   EXPECT_FALSE(std::filesystem::exists(path));
 }
 
-TEST(ListeningSocket, ReplacesOnlyWhatNobodyListensAt) {
+TEST_F(ListeningSocketTest, ReplacesOnlyWhatNobodyListensAt) {
   const struct {
     const char* name;
     int type;
-    int backlog;
-    bool closed;
-    const char* refusal;  // empty: is replaced
+    int backlog;  // -1: does not listen
+    bool closed;  // and so replaced
   } cases[] = {
-      {"dead", SOCK_STREAM, 5, true, ""},
-      {"dead before it listened", SOCK_STREAM, -1, true, ""},
-      {"dead, of another type", SOCK_DGRAM, -1, true, ""},
-      {"live", SOCK_STREAM, 5, false, "another service is listening there"},
-      {"live, with its queue full", SOCK_STREAM, 0, false, "another service is listening there"},
-      {"about to listen", SOCK_STREAM, -1, false, "another service is listening there"},
-      {"live, of another type", SOCK_DGRAM, -1, false, "another service is listening there"},
+      {"dead", SOCK_STREAM, 5, true},
+      {"dead before it listened", SOCK_STREAM, -1, true},
+      {"dead, of another type", SOCK_DGRAM, -1, true},
+      {"live", SOCK_STREAM, 5, false},
+      {"live, with its queue full", SOCK_STREAM, 0, false},
+      {"about to listen", SOCK_STREAM, -1, false},
+      {"live, of another type", SOCK_DGRAM, -1, false},
   };
   for (const auto& row : cases) {
     SCOPED_TRACE(row.name);
-    const TemporaryDirectory directory;
-    const auto path = directory.path() / "socket";
-    UniqueDescriptor there = BoundSocket(path, row.type, row.backlog);
-    if (row.closed) there = UniqueDescriptor();
-    const auto socket = ListeningSocket::listeningAt(path);
-    EXPECT_EQ(socket.ok(), std::string(row.refusal).empty());
-    if (!socket) {
-      EXPECT_THAT(socket.error().description(), HasSubstr(row.refusal));
+    std::filesystem::remove(path_);
+    UniqueDescriptor there(BoundSocket(path_, row.type));
+    if (row.backlog >= 0) {
+      ASSERT_EQ(::listen(there.get(), row.backlog), 0);
     }
-    EXPECT_TRUE(std::filesystem::exists(path));
+    if (row.closed) there = UniqueDescriptor();
+    const auto socket = ListeningSocket::listeningAt(path_);
+    EXPECT_EQ(socket.ok(), row.closed);
+    if (!socket) {
+      EXPECT_THAT(socket.error().description(), HasSubstr("another service is listening there"));
+    }
+    EXPECT_TRUE(std::filesystem::exists(path_));
   }
 }
 
-TEST(ListeningSocket, LeavesAFileThatIsNoSocketAlone) {
-  const TemporaryDirectory directory;
-  const auto path = directory.path() / "socket";
-  std::ofstream(path) << "precious";
-  const auto socket = ListeningSocket::listeningAt(path);
+TEST_F(ListeningSocketTest, RefusesWhatItCannotListenAtAndLeavesItAlone) {
+  directory_.write("socket", "precious");
+  const auto socket = ListeningSocket::listeningAt(path_);
   ASSERT_FALSE(socket);
   EXPECT_THAT(socket.error().description(), HasSubstr("no socket"));
-  EXPECT_EQ(std::filesystem::file_size(path), 8U);
+  EXPECT_EQ(std::filesystem::file_size(path_), 8U);
 
-  const auto tooLong = ListeningSocket::listeningAt(directory.path() / std::string(108, 'l'));
+  const auto tooLong = ListeningSocket::listeningAt(directory_.path() / std::string(108, 'l'));
   ASSERT_FALSE(tooLong);
   EXPECT_THAT(tooLong.error().description(), HasSubstr("1 to 107 bytes"));
+
+  EXPECT_FALSE(ListeningSocket::inherited(
+      UniqueDescriptor(BoundSocket(directory_.path() / "quiet", SOCK_STREAM))));
 }
 
-TEST(ListeningSocket, OfServicesThatStartAtOnceExactlyOneSucceeds) {
+TEST_F(ListeningSocketTest, OfServicesThatStartAtOnceExactlyOneSucceeds) {
   for (int round = 0; round < 50; ++round) {
-    const TemporaryDirectory directory;
-    const auto path = directory.path() / "socket";
-    BoundSocket(path, SOCK_STREAM, 5);  // stale
-    std::atomic<int> listening{0};
-    std::atomic<bool> go{false};
+    ::close(BoundSocket(path_, SOCK_STREAM));  // stale
+    std::latch go(4);
     std::vector<std::optional<ListeningSocket>> sockets(4);
     std::vector<std::thread> services;
     for (auto& mine : sockets) {
       services.emplace_back([&] {
-        while (!go) std::this_thread::yield();
-        if (auto socket = ListeningSocket::listeningAt(path)) {
+        go.arrive_and_wait();
+        if (auto socket = ListeningSocket::listeningAt(path_))
           mine.emplace(std::move(socket.value()));
-          ++listening;
-        }
       });
     }
-    go = true;
     for (std::thread& service : services) service.join();
-    ASSERT_EQ(listening, 1);
+    ASSERT_EQ(std::ranges::count_if(sockets, [](const auto& each) { return each.has_value(); }), 1);
   }
 }
 
-TEST(ListeningSocket, LeavesTheFileOfASuccessorAlone) {
-  const TemporaryDirectory directory;
-  const auto path = directory.path() / "socket";
-  auto socket = ListeningSocket::listeningAt(path);
+TEST_F(ListeningSocketTest, LeavesTheFileOfASuccessorAlone) {
+  auto socket = ListeningSocket::listeningAt(path_);
   ASSERT_TRUE(socket);
-  std::filesystem::remove(path);
-  const auto successor = ListeningSocket::listeningAt(path);
+  std::filesystem::remove(path_);
+  const auto successor = ListeningSocket::listeningAt(path_);
   ASSERT_TRUE(successor);
   socket.value().removeFile();
-  EXPECT_TRUE(std::filesystem::exists(path));
-}
-
-TEST(ListeningSocket, ServesAtAnInheritedSocketAndLeavesItsFile) {
-  const TemporaryDirectory directory;
-  const auto path = directory.path() / "socket";
-  auto socket = ListeningSocket::inherited(BoundSocket(path, SOCK_STREAM, 5));
-  ASSERT_TRUE(socket) << socket.error().description();
-  {
-    Service service({}, std::move(socket.value()));
-    EXPECT_TRUE(Client(path).isServed());
-  }
-  EXPECT_TRUE(std::filesystem::exists(path));
-
-  EXPECT_FALSE(
-      ListeningSocket::inherited(BoundSocket(directory.path() / "quiet", SOCK_STREAM, -1)));
+  EXPECT_TRUE(std::filesystem::exists(path_));
 }
 
 }  // namespace
