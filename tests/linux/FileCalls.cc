@@ -61,16 +61,6 @@ FileCalls::Counts FileCalls::counts() {
   return counts_;
 }
 
-void FileCalls::awaitLogSyncs(int atLeast) {
-  MutexLock lock(mutex_);
-  while (counts_.logSyncs < atLeast) changed_.wait(mutex_);
-}
-
-void FileCalls::awaitSynced() {
-  MutexLock lock(mutex_);
-  while (counts_.unsynced > 0) changed_.wait(mutex_);
-}
-
 void FileCalls::hold(Purpose purpose) {
   MutexLock lock(mutex_);
   hold_ = purpose;
@@ -79,12 +69,12 @@ void FileCalls::hold(Purpose purpose) {
 void FileCalls::release() {
   MutexLock lock(mutex_);
   hold_.reset();
-  changed_.notifyAll();
+  released_.notifyAll();
 }
 
-void FileCalls::awaitHeld() {
+bool FileCalls::holdsOne() {
   MutexLock lock(mutex_);
-  while (held_ == 0) changed_.wait(mutex_);
+  return held_ > 0;
 }
 
 void FileCalls::inject(const Fault& fault) {
@@ -100,11 +90,6 @@ void FileCalls::lift() {
 std::size_t FileCalls::failedCalls() {
   MutexLock lock(mutex_);
   return failedCalls_;
-}
-
-void FileCalls::awaitFailedCalls(std::size_t atLeast) {
-  MutexLock lock(mutex_);
-  while (failedCalls_ < atLeast) changed_.wait(mutex_);
 }
 
 void FileCalls::record() {
@@ -147,15 +132,13 @@ int FileCalls::admitLocked(Purpose purpose) {
   const int error = fault_->error == 0 ? -1 : fault_->error;
   if (!fault_->forever) fault_.reset();
   ++failedCalls_;
-  changed_.notifyAll();
   return error;
 }
 
 void FileCalls::passHold(Purpose purpose) {
   if (hold_ != purpose) return;
   ++held_;
-  changed_.notifyAll();
-  while (hold_ == purpose) changed_.wait(mutex_);
+  while (hold_ == purpose) released_.wait(mutex_);
   --held_;
 }
 
@@ -192,7 +175,6 @@ void FileCalls::changed(Change change) {
       ++counts_.unsynced;
     }
   }
-  changed_.notifyAll();
   if (recording_) record_.push_back(std::move(change));
 }
 
@@ -278,23 +260,18 @@ using quarvel::testing::Purpose;
 
 extern "C" {
 
-int open(const char* path, int flags, ...) {
-  static auto* const real = Next<int(const char*, int, ...)>("open");
-  va_list arguments;
-  va_start(arguments, flags);
-  const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(arguments, mode_t) : 0;
-  va_end(arguments);
-  return quarvel::testing::Open(real, path, flags, mode);
-}
-
-int open64(const char* path, int flags, ...) {
-  static auto* const real = Next<int(const char*, int, ...)>("open64");
-  va_list arguments;
-  va_start(arguments, flags);
-  const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(arguments, mode_t) : 0;
-  va_end(arguments);
-  return quarvel::testing::Open(real, path, flags, mode);
-}
+// Libraries call the one or the other.
+#define QUARVEL_OPEN(name)                                                      \
+  int name(const char* path, int flags, ...) {                                  \
+    static auto* const real = Next<int(const char*, int, ...)>(#name);          \
+    va_list arguments;                                                          \
+    va_start(arguments, flags);                                                 \
+    const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(arguments, mode_t) : 0; \
+    va_end(arguments);                                                          \
+    return quarvel::testing::Open(real, path, flags, mode);                     \
+  }
+QUARVEL_OPEN(open)
+QUARVEL_OPEN(open64)
 
 int close(int descriptor) {
   static auto* const real = Next<int(int)>("close");

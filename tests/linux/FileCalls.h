@@ -34,10 +34,6 @@ class FileCalls {
     int unsynced = 0;  // transactions since the last of them
   };
   [[nodiscard]] Counts counts() QUARVEL_EXCLUDES(mutex_);
-  /// Returns once that many syncs of a log have been counted.
-  void awaitLogSyncs(int atLeast) QUARVEL_EXCLUDES(mutex_);
-  /// Returns once every transaction has been synced.
-  void awaitSynced() QUARVEL_EXCLUDES(mutex_);
 
   enum class Purpose : std::uint8_t { open, write, sync, other };
 
@@ -46,8 +42,8 @@ class FileCalls {
   /// From now on writes to a write-ahead log wait, or syncs of any file, until released.
   void hold(Purpose purpose = Purpose::write) QUARVEL_EXCLUDES(mutex_);
   void release() QUARVEL_EXCLUDES(mutex_);
-  /// Returns once one waits.
-  void awaitHeld() QUARVEL_EXCLUDES(mutex_);
+  /// Whether one waits.
+  [[nodiscard]] bool holdsOne() QUARVEL_EXCLUDES(mutex_);
 
   // Faults.
 
@@ -68,7 +64,6 @@ class FileCalls {
   void lift() QUARVEL_EXCLUDES(mutex_);
   /// How many calls were made to fail.
   [[nodiscard]] std::size_t failedCalls() QUARVEL_EXCLUDES(mutex_);
-  void awaitFailedCalls(std::size_t atLeast) QUARVEL_EXCLUDES(mutex_);
 
   // The record of what changes files and names, and what makes that safe.
 
@@ -121,7 +116,7 @@ class FileCalls {
   [[nodiscard]] int admitLocked(Purpose purpose) QUARVEL_REQUIRES(mutex_);
 
   Mutex mutex_;
-  ConditionVariable changed_;
+  ConditionVariable released_;
   std::string directory_ QUARVEL_GUARDED_BY(mutex_);
   std::map<int, std::string> open_ QUARVEL_GUARDED_BY(mutex_);
   Counts counts_ QUARVEL_GUARDED_BY(mutex_);

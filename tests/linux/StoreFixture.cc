@@ -84,8 +84,8 @@ void StoreFixture::execute(const std::string& statements) const {
   (void)RunSql(path_, statements);
 }
 
-Outcome StoreFixture::send(TelemetryStore& store, const Payload& payload, std::int64_t sessionID) {
-  return store.addMessage({std::nullopt, sessionID, "client", "service", 1, 2, payload});
+Outcome StoreFixture::send(TelemetryStore& store, const Payload& payload) {
+  return store.addMessage({std::nullopt, 7, "client", "service", 1, 2, payload});
 }
 
 std::int64_t StoreFixture::addSession(TelemetryStore& store, std::int64_t sessionID,

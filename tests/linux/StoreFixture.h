@@ -42,7 +42,7 @@ class StoreFixture : public ::testing::Test {
   void execute(const std::string& statements) const;
 
   /// A message of no agent session.
-  static Outcome send(TelemetryStore& store, const Payload& payload, std::int64_t sessionID = 7);
+  static Outcome send(TelemetryStore& store, const Payload& payload);
   static void awaitStored(const TelemetryStore& store) {
     Await([&store] { return store.counters().waiting == 0; });
   }

@@ -6,7 +6,6 @@
 #include <limits>
 #include <thread>
 
-#include "platform/linux/store/AnalyticsEventSink.h"
 #include "platform/linux/store/EventPath.h"
 #include "platform/linux/store/SecureRandom.h"
 #include "platform/linux/store/StoreError.h"
@@ -21,30 +20,11 @@ using ::testing::ElementsAre;
 using ::testing::MatchesRegex;
 using ::testing::Optional;
 using ::testing::StartsWith;
-using Backends = std::optional<std::vector<std::string>>;
 
 class AgentTest : public StoreFixture {
  protected:
   std::shared_ptr<TelemetryStore> store_ = open({.clock = [] { return Date{}; }});
-  const Dictionary sessionInfo_{{kRelmReportingSessionInfoClientType, 19},
-                                {kRelmReportingSessionInfoClientVersion, 2.0},
-                                {kRelmReportingSessionInfoSessionID, 42},
-                                {kRelmReportingSessionInfoBatchEvent, true},
-                                {kRelmReportingSessionInfoHierarchyToken, "token"}};
-  const Dictionary userInfo_{{kRelmReportingUserInfoClientName, "tarnwick.quarvel"},
-                             {kRelmReportingUserInfoServiceName, "telephony_session"},
-                             {"Route", "speaker"}};
-  const Payload payload_{Dictionary{{"n", 1}}};
 
-  static Backends configuredBackends(RelmReportingSession& session) {
-    std::promise<std::pair<Backends, std::thread::id>> found;
-    session.startConfiguration([&found](const Backends& backends) {
-      found.set_value({backends, std::this_thread::get_id()});
-    });
-    const auto [backends, thread] = found.get_future().get();
-    EXPECT_NE(thread, std::this_thread::get_id());
-    return backends;
-  }
   static std::optional<Error> flush(RelmReportingSession& session) {
     std::promise<std::optional<Error>> done;
     session.flushMessages([&done](const std::optional<Error>& error) { done.set_value(error); });
@@ -70,9 +50,16 @@ TEST_F(AgentTest, MissingAndMisshapenInformationStillMakesARow) {
 }
 
 TEST_F(AgentTest, ConfigurationFindsTheBackendsThatCanTakeDataNow) {
-  const auto found = [this](std::vector<std::string> configured) {
+  const auto found = [this,
+                      asking = std::this_thread::get_id()](std::vector<std::string> configured) {
     TelemetryAgent agent(store_, std::move(configured));
-    return configuredBackends(*agent.createAgentSession(sessionInfo_, userInfo_));
+    std::promise<std::optional<std::vector<std::string>>> answer;
+    const auto session = agent.createAgentSession({}, {});
+    session->startConfiguration([&](const auto& backends) {
+      EXPECT_NE(std::this_thread::get_id(), asking);
+      answer.set_value(backends);
+    });
+    return answer.get_future().get();
   };
   EXPECT_THAT(found({"store"}), Optional(ElementsAre("store")));
   EXPECT_THAT(found({"nats", "otlp"}), Optional(ElementsAre("nats", "otlp")))
@@ -85,16 +72,16 @@ TEST_F(AgentTest, ConfigurationFindsTheBackendsThatCanTakeDataNow) {
 
 TEST_F(AgentTest, AClosedStoreIsAnErrorForEveryOperation) {
   TelemetryAgent agent(store_, {"store"});
-  const auto before = agent.createAgentSession(sessionInfo_, userInfo_);
+  const auto before = agent.createAgentSession({}, {});
   store_->close();
-  const auto after = agent.createAgentSession(sessionInfo_, userInfo_);
+  const auto after = agent.createAgentSession({}, {});
   for (const auto& session : {before, after}) {
-    const Outcome sent = session->agentSendMessage(1, 1, payload_);
+    const Outcome sent = session->agentSendMessage(1, 1, Payload());
     ASSERT_FALSE(sent);
     EXPECT_THAT(sent.error().description(), StartsWith("quarvel.store 1: "));
     EXPECT_EQ(flush(*session), sent.error());
   }
-  EXPECT_FALSE(agent.sendOneMessage(sessionInfo_, userInfo_, 1, 1, payload_));
+  EXPECT_FALSE(agent.sendOneMessage({}, {}, 1, 1, Payload()));
 }
 
 TEST_F(AgentTest, TokensAreDifferentAndBelowTheirParents) {
@@ -104,32 +91,6 @@ TEST_F(AgentTest, TokensAreDifferentAndBelowTheirParents) {
   EXPECT_THAT(NewHierarchyToken(parent), StartsWith(parent + "."));
 }
 
-TEST_F(AgentTest, AnUnwantedAnalyticsEventIsNeverBuilt) {
-  const struct {
-    const char* name;
-    std::vector<std::string> wanted;
-    std::vector<std::string> kept;
-  } cases[] = {{"all", {"*"}, {"a.haptics.x", "a.music.y", "b"}},
-               {"none", {}, {}},
-               {"some", {"a.*.[xz]", "?"}, {"a.haptics.x", "b"}}};
-  for (const auto& wanted : cases) {
-    SCOPED_TRACE(wanted.name);
-    EventPath path(store_);
-    AnalyticsEventSink sink(path, wanted.wanted);
-    std::vector<std::string> built;
-    for (const std::string name : {"a.haptics.x", "a.music.y", "b"}) {
-      sink.sendEventLazy(name, [&] {
-        built.push_back(name);
-        return payload_;
-      });
-    }
-    EXPECT_EQ(built, wanted.kept);
-  }
-  store_->close();
-  EXPECT_THAT(rows("SELECT name FROM analytics_event ORDER BY id"),
-              ElementsAre("a.haptics.x", "a.music.y", "b", "a.haptics.x", "b"));
-}
-
 TEST_F(AgentTest, EventsWaitForRoomInTheirOrderAndTheirSendersDoNot) {
   store_->close();
   FileCalls& files = FileCalls::watch(directory_);
@@ -137,8 +98,8 @@ TEST_F(AgentTest, EventsWaitForRoomInTheirOrderAndTheirSendersDoNot) {
   EventPath path(store_);
   files.hold();
   for (int i = 0; i < 20; ++i) {
-    path.addAnalyticsEvent(std::to_string(i), payload_);
-    path.addPowerEvent(28, std::to_string(i), payload_);
+    path.addAnalyticsEvent(std::to_string(i), Payload());
+    path.addPowerEvent(28, std::to_string(i), Payload());
   }
   files.release();
   ASSERT_TRUE(DrainWork(std::chrono::steady_clock::now() + std::chrono::seconds(60)));

@@ -2,7 +2,6 @@
 #include <gmock/gmock.h>
 
 #include <cstdlib>
-#include <future>
 
 #include "platform/linux/store/Sqlite.h"
 #include "tests/linux/FileCalls.h"

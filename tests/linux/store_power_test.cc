@@ -5,7 +5,6 @@
 #include <unistd.h>
 
 #include <cstdlib>
-#include <functional>
 #include <optional>
 #include <random>
 
@@ -175,7 +174,7 @@ const std::vector<PowerTest::Run>& PowerTest::runs() {
            const std::int64_t promised = test.sent_;
            test.files_->hold(FileCalls::Purpose::sync);
            auto flushed = StoreFixture::flush(*test.store_, session);
-           test.files_->awaitHeld();
+           Await([&] { return test.files_->holdsOne(); });
            test.send(2);
            // Not when it is the writer that waits, to begin the log again.
            const auto meanwhile = std::chrono::steady_clock::now() + 20ms;
@@ -209,7 +208,7 @@ const std::vector<PowerTest::Run>& PowerTest::runs() {
              test.send(2);
              test.awaitStored();
            }
-           test.files_->awaitSynced();
+           Await([&] { return test.files_->counts().unsynced == 0; });
            test.promise();
          }
          test.end();
@@ -235,7 +234,7 @@ const std::vector<PowerTest::Run>& PowerTest::runs() {
            test.failNextSync();
            test.send(2);
            test.awaitStored();
-           test.files_->awaitSynced();
+           Await([&] { return test.files_->counts().unsynced == 0; });
            test.promise();
          }
          test.end();
