@@ -6,7 +6,6 @@
 
 #include <atomic>
 #include <future>
-#include <random>
 #include <string>
 #include <thread>
 #include <vector>
@@ -135,49 +134,6 @@ TEST(RunLoop, WhatIsStillOnItWhenItsThreadEndsNeverFires) {
   while (!dropped.expired()) std::this_thread::sleep_for(1ms);
   kept->fireAfter(0s);
   kept->invalidate();
-}
-
-// Each timer is moved and invalidated by several threads while its run loop fires.
-TEST(RunLoop, ATimerFiresOnceAtMostWhateverOtherThreadsDoToIt) {
-  constexpr std::size_t kTimers = 400;
-  constexpr std::uint32_t kThreads = 3;
-  std::vector<std::shared_ptr<RunLoopTimer>> timers;
-  std::vector<int> fired(kTimers);
-  std::vector<std::weak_ptr<int>> blocks;
-  for (std::size_t i = 0; i < kTimers; ++i) {
-    const auto token = std::make_shared<int>();
-    blocks.push_back(token);
-    timers.push_back(CreateRunLoopTimer(kNever, [&fired, i, token] { ++fired[i]; }));
-  }
-  std::vector<std::thread> others;
-  {
-    Worker worker([&] {
-      for (const auto& timer : timers) RunLoop::current().addTimer(timer);
-      RunLoop::current().run();
-    });
-    for (std::uint32_t seed = 0; seed < kThreads; ++seed) {
-      others.emplace_back([&, seed] {
-        std::minstd_rand random(seed + 1);
-        for (std::size_t i = 0; i < 4 * kTimers; ++i) {
-          const std::size_t chosen = random() % kTimers;
-          if (chosen % 4 == 0) {
-            timers[chosen]->invalidate();
-          } else {
-            timers[chosen]->fireAfter(std::chrono::microseconds(random() % 2000));
-          }
-        }
-        for (std::size_t i = 0; i < kTimers; ++i) {
-          if (i % 4 != 0) timers[i]->fireAfter(0s);
-        }
-        for (std::size_t i = 0; i < kTimers; i += 4) timers[i]->invalidate();
-      });
-    }
-    for (std::thread& other : others) other.join();
-  }
-  for (std::size_t i = 0; i < kTimers; ++i) {
-    EXPECT_EQ(fired[i], i % 4 == 0 ? 0 : 1) << i;
-    EXPECT_TRUE(blocks[i].expired()) << i;
-  }
 }
 
 TEST(WorkerThread, ShowsItsNameAndDestroysItsBody) {
