@@ -34,10 +34,6 @@ class Collected {
     const MutexLock lock(mutex_);
     return items_.size();
   }
-  void clear() {
-    const MutexLock lock(mutex_);
-    items_.clear();
-  }
 
  private:
   Mutex mutex_;

@@ -1,7 +1,6 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include <cstdlib>
 #include <future>
 #include <memory>
 #include <string>
@@ -10,7 +9,6 @@
 #include <vector>
 
 #include "platform/linux/sources/OrientationFiles.h"
-#include "platform/linux/sources/OrientationSensor.h"
 #include "tests/TemporaryDirectory.h"
 #include "tests/linux/Collected.h"
 #include "tests/linux/LogRecorder.h"
@@ -127,16 +125,6 @@ TEST_F(OrientationTest, UnregisteringWaitsForTheHandlerUnlessCalledFromIt) {
   center.remove(OrientationKind::device, "slow");
   EXPECT_TRUE(left);
   EXPECT_THAT(after.next(), Optional(Orientation::portrait));
-}
-
-// What it says and follows is looked at with the service, which never ends it.
-TEST(OrientationSensorTest, EndsWhateverItWaitsFor) {
-  LogRecorder::take();
-  setenv("DBUS_SYSTEM_BUS_ADDRESS", "unix:path=/nowhere/system.sock", 1);
-  OrientationCenter center;
-  center.setSource(std::make_unique<OrientationSensor>(center));
-  center.add(OrientationKind::device, "id", [](Orientation) { ADD_FAILURE(); });
-  EXPECT_THAT(LogRecorder::nextError(), HasSubstr("the system bus"));
 }
 
 }  // namespace
