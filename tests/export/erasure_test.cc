@@ -27,11 +27,11 @@ class ErasureTest : public ExportFixture {
       ASSERT_TRUE(store_->addMessage({session, sessionID, "client", "music", 1, 2, payload}));
     }
   }
-  Result<std::int64_t> erase(const ErasureSelection& selection) {
-    std::promise<Result<std::int64_t>> erased;
-    EXPECT_TRUE(store_->erase(selection,
-                              [&](const Result<std::int64_t>& rows) { erased.set_value(rows); }));
-    return erased.get_future().get();
+  /// Begins to erase; what comes of it.
+  std::future<Result<std::int64_t>> erase(const ErasureSelection& selection) {
+    auto erased = std::make_shared<std::promise<Result<std::int64_t>>>();
+    EXPECT_TRUE(store_->erase(selection, [erased](const auto& rows) { erased->set_value(rows); }));
+    return erased->get_future();
   }
   [[nodiscard]] bool filesHold(const std::string& text) const {
     return std::ranges::any_of(
@@ -45,7 +45,7 @@ TEST_F(ErasureTest, LeavesNothingOfWhatWasErasedInTheFilesAndOneLineInTheLedger)
   addSecret(kErasedSession, 1500);
   addMessages(2000);
   ASSERT_TRUE(filesHold("secret") || store_->counters().waiting > 0);
-  EXPECT_EQ(erase({kErasedSession}).value(), 1501);
+  EXPECT_EQ(erase({kErasedSession}).get().value(), 1501);
   EXPECT_FALSE(filesHold("secret"));
   EXPECT_EQ(value("SELECT count(*) FROM message"), "4000");
   EXPECT_THAT(rows("SELECT backend, table_name, first_id, rows, bytes > 100000, outcome FROM "
@@ -68,7 +68,7 @@ TEST_F(ErasureTest, ErasesByDateAndKeepsTheSessionsOfWhatRemains) {
   ASSERT_TRUE(store_->addMessage({open, 2, "c", "s", 1, 2, Payload()}));
   ASSERT_TRUE(store_->addPowerEvent(1, "new", Payload()));
   awaitStored(*store_);
-  EXPECT_EQ(erase({date() - 1min}).value(), 10 + 1 + 5 + 1);
+  EXPECT_EQ(erase({date() - 1min}).get().value(), 10 + 1 + 5 + 1);
   EXPECT_THAT(rows("SELECT session_id FROM agent_session"), ElementsAre("2"));
   EXPECT_THAT(rows("SELECT session_id FROM message"), ElementsAre("2"));
   EXPECT_EQ(value("SELECT (SELECT count(*) FROM analytics_event) || (SELECT count(*) FROM "
@@ -82,8 +82,8 @@ TEST_F(ErasureTest, GivesNoIdTwiceAndExportsWhatComesAfter) {
   engine_.answer = RecordingEngine::down;
   addMessages(10);
   runFor(1s);
-  EXPECT_EQ(erase({}).value(), 10);
-  EXPECT_EQ(erase({}).value(), 0) << "and leaves its line all the same";
+  EXPECT_EQ(erase({}).get().value(), 10);
+  EXPECT_EQ(erase({}).get().value(), 0) << "and leaves its line all the same";
   begin();
   engine_.answer = RecordingEngine::takeAll;
   addMessages(3);
@@ -95,10 +95,9 @@ TEST_F(ErasureTest, GivesNoIdTwiceAndExportsWhatComesAfter) {
 TEST_F(ErasureTest, TakesRowsMeanwhileAndErasesNoneOfThem) {
   begin();
   addMessages(20'000);
-  std::promise<Result<std::int64_t>> erased;
-  ASSERT_TRUE(store_->erase({}, [&](const auto& rows) { erased.set_value(rows); }));
+  auto erased = erase({});
   addMessages(5000);
-  EXPECT_EQ(erased.get_future().get().value(), 20'000);
+  EXPECT_EQ(erased.get().value(), 20'000);
   EXPECT_EQ(value("SELECT min(id) || ' ' || count(*) FROM message"), "20001 5000");
 }
 
@@ -126,10 +125,9 @@ TEST_F(ErasureTest, WorksOnAStoreThatNobodyHasOpen) {
 TEST_F(ErasureTest, AClosedStoreSaysThatItWasNotFinished) {
   begin();
   addMessages(5000);
-  std::promise<Result<std::int64_t>> erased;
-  ASSERT_TRUE(store_->erase({}, [&](const auto& rows) { erased.set_value(rows); }));
+  auto erased = erase({});
   store_->close();
-  const auto result = erased.get_future().get();
+  const auto result = erased.get();
   EXPECT_TRUE(result.ok() ||
               result.error().description().find("before all was erased") != std::string::npos);
 }

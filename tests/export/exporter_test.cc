@@ -2,8 +2,6 @@
 
 #include <gmock/gmock.h>
 
-#include <fstream>
-
 #include "tests/export/ExportFixture.h"
 #include "tests/linux/LogRecorder.h"
 
@@ -121,29 +119,17 @@ TEST_F(ExporterTest, AnEngineDownForEightHoursCostsFewWakeUpsAndNoRow) {
   EXPECT_EQ(source_->backlog(exporter_->status().exportedThrough).value(), 0);
 }
 
-// The disk is bounded all the same; what has been exported goes first, and what must go is counted.
-TEST_F(ExporterTest, RetentionTakesExportedRowsFirstAndCountsTheOthers) {
-  LogRecorder::take();
-  constexpr std::uint64_t kBound = 4 << 20;
-  begin({.maximumBytes = kBound});
-  const Payload large(Dictionary{{"text", std::string(4000, 'x')}});
-  const auto addHundreds = [&](int hundreds) {
-    for (int i = 0; i < hundreds; ++i) addMessages(100, large);
-  };
-  addHundreds(5);
-  runFor(1s);
+TEST_F(ExporterTest, GoesOnBehindRowsThatRetentionHasTaken) {
+  begin({.maximumBytes = 4 << 20});
   engine_.answer = RecordingEngine::down;
-  addHundreds(8);
-  EXPECT_EQ(value("SELECT min(id) > 1 AND min(id) <= 501 AND max(id) = 1300 FROM message"), "1");
-  EXPECT_THAT(LogRecorder::takeErrors(), IsEmpty());
-  addHundreds(12);
-  EXPECT_THAT(LogRecorder::takeErrors(), Contains(HasSubstr("no backend has had")));
-  EXPECT_LE(std::filesystem::file_size(path_), kBound);
+  const Payload large(Dictionary{{"text", std::string(4000, 'x')}});
+  for (int i = 0; i < 20; ++i) addMessages(100, large);
+  runFor(1s);
   engine_.answer = RecordingEngine::takeAll;
-  engine_.taken.clear();
   const int first = std::stoi(value("SELECT min(id) FROM message"));
+  EXPECT_GT(first, 1);
   runFor(10min);
-  EXPECT_EQ(engine_.taken, names(first, 2500));
+  EXPECT_EQ(engine_.taken, names(first, 2000));
 }
 
 TEST_F(ExporterTest, BacksOffAsLongAsTheEngineAsksButNoLongerThanAnHour) {

@@ -1,13 +1,10 @@
 """What a service manager asks of the installed service: its socket is passed in, it says when it is
 ready, alive and stopping, and the units do what they say."""
 
-import os
-import pathlib
 import re
 import signal
 import socket
 import subprocess
-import tempfile
 import unittest
 
 from harness import PATIENCE, PREFIX, QUARVELD, ServiceTest, eventually
@@ -88,25 +85,11 @@ class Units(unittest.TestCase):
     # From "systemd-analyze security": 10 is nothing between the service and the machine.
     MOST_EXPOSURE = 1.5
 
-    def analyze(self, *arguments):
-        done = subprocess.run(["systemd-analyze", *map(str, arguments)], capture_output=True, text=True,
-                              timeout=PATIENCE, env=dict(os.environ, SYSTEMD_LOG_LEVEL="warning"))
-        self.assertEqual(done.returncode, 0, done.stdout + done.stderr)
-        return done.stdout + done.stderr
-
-    def test_systemd_understands_every_line(self):
-        # The programs are looked for where they will be, so the units are read as they are here.
-        text = (UNITS / "quarvel.service").read_text()
-        directory = pathlib.Path(self.enterContext(tempfile.TemporaryDirectory(prefix="quarvel-units-")))
-        (directory / "quarvel.service").write_text(text.replace("/usr/", f"{PREFIX}/"))
-        (directory / "quarvel.socket").write_text((UNITS / "quarvel.socket").read_text())
-        found = self.analyze("verify", "--recursive-errors=one", "--man=no",
-                             directory / "quarvel.service", directory / "quarvel.socket")
-        self.assertEqual(found, "")
-
     def test_the_service_is_locked_up(self):
-        self.analyze("security", "--offline=yes", f"--threshold={round(self.MOST_EXPOSURE * 10)}",
-                     "--no-pager", UNITS / "quarvel.service")
+        done = subprocess.run(["systemd-analyze", "security", "--offline=yes", "--no-pager",
+                               f"--threshold={round(self.MOST_EXPOSURE * 10)}", UNITS / "quarvel.service"],
+                              capture_output=True, text=True, timeout=PATIENCE)
+        self.assertEqual(done.returncode, 0, done.stdout + done.stderr)
 
 
 if __name__ == "__main__":
