@@ -33,7 +33,7 @@ class PowerTest : public StoreFixture {
 
   using Record = std::vector<FileCalls::Change>;
 
-  /// What is done to a store, through all of its life.
+  /// What is done to a store between its opening and its end.
   struct Run {
     const char* name;
     TelemetryStore::Options options;
@@ -64,7 +64,9 @@ class PowerTest : public StoreFixture {
     sent_ = 0;
     files_ = &FileCalls::watch(directory_);
     files_->record();
+    start();
     run.work(*this);
+    end();
     Record record = files_->takeRecord();
     FileCalls::watch({});
     return record;
@@ -127,7 +129,6 @@ class PowerTest : public StoreFixture {
 
   static constexpr off_t kDamaged = 1'000'000;  // the mark of a file that has been damaged
   static void replaceADamagedOne(PowerTest& test) {
-    test.start();
     test.send(200, 200);
     test.end();
     const int file = ::open(test.path_.c_str(), O_RDWR);
@@ -138,7 +139,6 @@ class PowerTest : public StoreFixture {
     test.files_->mark(kDamaged);
     test.start();
     test.send(1);
-    test.store_.reset();
   }
 
   TelemetryStore::Options options_;
@@ -153,7 +153,6 @@ const std::vector<PowerTest::Run>& PowerTest::runs() {
       {"flushes",
        {.sync = 24h, .logPages = 12},
        [](PowerTest& test) {
-         test.start();
          for (int i = 0; i < 5; ++i) {
            test.send(7);
            test.flush();
@@ -162,12 +161,10 @@ const std::vector<PowerTest::Run>& PowerTest::runs() {
          test.end();
          test.start();
          test.send(3);
-         test.end();
        }},
       {"rows that come while the medium is slow",
        {.sync = 24h, .logPages = 12},
        [](PowerTest& test) {
-         test.start();
          const std::int64_t session = addSession(*test.store_);
          for (int i = 0; i < 8; ++i) {
            test.send(3);
@@ -186,23 +183,19 @@ const std::vector<PowerTest::Run>& PowerTest::runs() {
            flushed.wait();
            test.files_->mark(promised);
          }
-         test.end();
        }},
       {"each commit",
        {.sync = 0ms, .logPages = 12},
        [](PowerTest& test) {
-         test.start();
          for (int i = 0; i < 15; ++i) {
            test.send(1);
            test.awaitStored();
            test.promise();
          }
-         test.end();
        }},
       {"intervals",
        {.sync = 5ms, .logPages = 12},
        [](PowerTest& test) {
-         test.start();
          for (int i = 0; i < 5; ++i) {
            for (int burst = 0; burst < 3; ++burst) {
              test.send(2);
@@ -211,23 +204,19 @@ const std::vector<PowerTest::Run>& PowerTest::runs() {
            Await([&] { return test.files_->counts().unsynced == 0; });
            test.promise();
          }
-         test.end();
        }},
       {"long rows, removed when they are old",
        {.sync = 24h, .maximumBytes = 120'000, .logPages = 24},
        [](PowerTest& test) {
-         test.start();
          for (int i = 0; i < 4; ++i) {
            test.send(4, 9000);
            test.flush();
            test.promise();
          }
-         test.end();
        }},
       {"an interval's sync fails",
        {.sync = 5ms, .logPages = 12, .firstBackOff = 1ms},
        [](PowerTest& test) {
-         test.start();
          for (int i = 0; i < 6; ++i) {
            test.send(2);
            test.awaitStored();
@@ -237,12 +226,10 @@ const std::vector<PowerTest::Run>& PowerTest::runs() {
            Await([&] { return test.files_->counts().unsynced == 0; });
            test.promise();
          }
-         test.end();
        }},
       {"a flush's sync fails beside a reader",
        {.sync = 24h, .logPages = 40, .firstBackOff = 1ms},
        [](PowerTest& test) {
-         test.start();
          test.send(3);
          test.flush();
          SqliteConnection reader;
@@ -256,7 +243,7 @@ const std::vector<PowerTest::Run>& PowerTest::runs() {
            test.flush();
            test.promise();
          }
-         test.end();
+         test.end();  // the reader stays until then
        }},
   };
   return kRuns;
