@@ -5,6 +5,7 @@
 #include <deque>
 #include <optional>
 #include <utility>
+#include <vector>
 
 #include "base/Mutex.h"
 
@@ -29,6 +30,12 @@ class Collected {
     std::optional<T> item(std::move(items_.front()));
     items_.pop_front();
     return item;
+  }
+  /// All that are there.
+  std::vector<T> take() {
+    const MutexLock lock(mutex_);
+    const std::deque<T> taken = std::exchange(items_, {});
+    return {taken.begin(), taken.end()};
   }
   std::size_t size() {
     const MutexLock lock(mutex_);

@@ -1,17 +1,14 @@
 #include "tests/linux/LogRecorder.h"
 
-#include <chrono>
 #include <utility>
 
-#include "base/Mutex.h"
+#include "tests/linux/Collected.h"
 
 namespace quarvel {
 
 namespace {
 
-Mutex linesMutex;
-ConditionVariable lineAdded;
-std::vector<testing::LogRecorder::Line> lines QUARVEL_GUARDED_BY(linesMutex);
+Collected<testing::LogRecorder::Line> lines;
 
 }  // namespace
 
@@ -21,14 +18,11 @@ bool ZQLogEnabled(LogLevel, LogHandle) {
 
 void ZQLogWrite(LogHandle, LogLevel level, const char*, int, const char*,
                 std::string_view message) {
-  MutexLock lock(linesMutex);
-  lines.push_back({level, std::string(message)});
-  lineAdded.notifyAll();
+  lines.add({level, std::string(message)});
 }
 
 std::vector<testing::LogRecorder::Line> testing::LogRecorder::take() {
-  MutexLock lock(linesMutex);
-  return std::exchange(lines, {});
+  return lines.take();
 }
 
 std::vector<std::string> testing::LogRecorder::takeErrors() {
@@ -40,16 +34,10 @@ std::vector<std::string> testing::LogRecorder::takeErrors() {
 }
 
 std::string testing::LogRecorder::nextError() {
-  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
-  MutexLock lock(linesMutex);
-  for (;;) {
-    while (!lines.empty()) {
-      const Line line = std::move(lines.front());
-      lines.erase(lines.begin());
-      if (line.level == LogLevel::error) return line.message;
-    }
-    if (!lineAdded.waitUntil(linesMutex, deadline)) return {};
+  while (const auto line = lines.next()) {
+    if (line->level == LogLevel::error) return line->message;
   }
+  return {};
 }
 
 }  // namespace quarvel

@@ -45,12 +45,11 @@ TEST_F(PreferencesTest, RandomBytesChangeNothing) {
 }
 
 TEST_F(PreferencesTest, ValuesAreReadAsStringsAndBooleans) {
-  struct Case {
+  const struct {
     const char* value;
     std::optional<std::string> string;
     bool boolean;
-  };
-  const std::vector<Case> cases{
+  } cases[] = {
       {"true", std::nullopt, true},
       {"false", std::nullopt, false},
       {"0", "0", false},
@@ -67,7 +66,7 @@ TEST_F(PreferencesTest, ValuesAreReadAsStringsAndBooleans) {
       {"\"no\"", "no", false},
       {"\"yes, please\"", "yes, please", false},
   };
-  for (const Case& c : cases) {
+  for (const auto& c : cases) {
     SCOPED_TRACE(c.value);
     const PreferencesDomain domain = written(std::string("key = ") + c.value);
     EXPECT_TRUE(domain.hasValue("key"));
@@ -80,12 +79,11 @@ TEST_F(PreferencesTest, ValuesAreReadAsStringsAndBooleans) {
 }
 
 TEST_F(PreferencesTest, FileThatCannotBeUnderstoodChangesNothing) {
-  struct Case {
+  const struct {
     const char* name;
     std::string text;
     const char* line;
-  };
-  const std::vector<Case> cases{
+  } cases[] = {
       {"torn", "device_name = \"x\"\ndisable_reporting = tr", "some.domain.toml:2: "},
       {"twice", "disable_reporting = false\ndisable_reporting = false\n", "some.domain.toml:2: "},
       {"list", "\n\ndisable_reporting = [false]\n", "some.domain.toml:3: "},
@@ -98,7 +96,7 @@ TEST_F(PreferencesTest, FileThatCannotBeUnderstoodChangesNothing) {
   EXPECT_FALSE(written("disable_reporting = nonsense").hasValue("disable_reporting"));
   EXPECT_THAT(LogRecorder::nextError(), HasSubstr("some.domain.toml:1: "));
   EXPECT_TRUE(written("disable_reporting = true").boolean("disable_reporting"));
-  for (const Case& c : cases) {
+  for (const auto& c : cases) {
     SCOPED_TRACE(c.name);
     EXPECT_TRUE(written(c.text).boolean("disable_reporting"));
     EXPECT_TRUE(store.open("some.domain").boolean("disable_reporting"));

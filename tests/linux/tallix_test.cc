@@ -88,12 +88,11 @@ TEST_F(TallixTest, LookupMatchesGroupsAndSubgroups) {
   const TallixFacility facility(
       configuration({{"Speaker", "", "Single", directory.path() / "elsewhere", ""}}));
 
-  struct Case {
+  const struct {
     const char* name;
     std::optional<std::string_view> group, subgroup;
     std::optional<std::vector<std::string>> found;  // absent: no such group
-  };
-  const std::vector<Case> cases{
+  } cases[] = {
       {"group alone", "Speaker", std::nullopt, {{"Opened", "Single", "Clips"}}},
       {"links are followed, the rest is skipped",
        "Haptics",
@@ -110,7 +109,7 @@ TEST_F(TallixTest, LookupMatchesGroupsAndSubgroups) {
       {"a group without channels", "Bare", std::nullopt, {{}}},
       {"a subgroup without channels", "Bare", "Stats", {{}}},
   };
-  for (const Case& c : cases) {
+  for (const auto& c : cases) {
     SCOPED_TRACE(c.name);
     std::optional<Error> error;
     const TallixChannels channels = facility.channelsInGroup(c.group, c.subgroup, error);
