@@ -85,7 +85,7 @@ class TestDelegate final : public ServiceListenerDelegate {
     connection->setInterruptionHandler([object] { Journal::shared().add("interrupted"); });
     connection->setInvalidationHandler([object] { Journal::shared().add("invalidated"); });
     connection->resume();
-    return served_.accepts;
+    return true;
   }
 
  private:

@@ -1,6 +1,5 @@
 #pragma once
 
-#include <atomic>
 #include <chrono>
 #include <cstdint>
 #include <deque>
@@ -101,8 +100,6 @@ std::string CallBytes(std::optional<std::uint32_t> messageID, std::string_view m
 
 /// Whom a listener has served, and with what.
 struct Served {
-  /// What the delegate answers from now on.
-  std::atomic<bool> accepts = true;
   const std::shared_ptr<Ledger> ledger = std::make_shared<Ledger>();
   /// Of each connection, in order of acceptance; to be read when its end has been heard of.
   std::vector<std::weak_ptr<ClientConnection>> connections;

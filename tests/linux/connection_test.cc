@@ -215,17 +215,6 @@ TEST(Connection, LetsEverythingGoWhenItsClientHasGone) {
   service.ledger->takeKept()->reply(1);  // vanishes
 }
 
-TEST(Connection, ClosesAClientThatIsNotAccepted) {
-  Service service;
-  service.accepts = false;
-  Client client = service.connect();
-  EXPECT_EQ(client.response(), "end");
-  service.accepts = true;
-  ASSERT_TRUE(service.connect().isServed());
-  service.end();
-  EXPECT_EQ(Journal::shared().count("invalidated"), 1U) << "only who was accepted is invalidated";
-}
-
 TEST(Connection, CarriesOutWhatWasSentByAClientThatDoesNotStayForTheReplies) {
   constexpr std::size_t kCalls = 2000;
   Service service;
