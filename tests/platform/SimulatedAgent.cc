@@ -28,7 +28,6 @@ class SimulatedAgentSession final : public RelmReportingSession {
   }
 
   void startConfiguration(ConfigurationCompletion completion) override {
-    ++record_.configurations;
     if (!Agent().answers) return;
     if (Agent().backends) record_.foundAfter = Agent().answersAfter;
     Simulation& simulation = Simulation::current();
@@ -81,18 +80,15 @@ class SimulatedAgentSession final : public RelmReportingSession {
 }  // namespace
 
 RelmReportingToken RelmReporting::newSecureHierarchyToken(
-    const std::optional<RelmReportingToken>& parent) {
-  Agent().tokenParents.push_back(parent);
+    const std::optional<RelmReportingToken>&) {
   return Agent().tokens.emplace_back(fmt::format("token {}", Agent().tokens.size() + 1));
 }
 
 std::shared_ptr<RelmReportingSession> RelmReporting::createAgentSession(
-    const Dictionary& sessionInfo, const Dictionary& userInfo,
-    const std::vector<std::string>& frameworksToCheck) {
+    const Dictionary& sessionInfo, const Dictionary& userInfo, const std::vector<std::string>&) {
   SimulatedAgent::Session& record = Agent().sessions.emplace_back();
   record.info = sessionInfo;
   record.userInfo = userInfo;
-  record.frameworksToCheck = frameworksToCheck;
   record.queue = Simulation::current().scheduler.currentQueue();
   Simulation::current().note(fmt::format("agent {} created", Agent().sessions.size()));
   return std::make_shared<SimulatedAgentSession>(record, Agent().sessions.size());

@@ -23,11 +23,9 @@ struct SimulatedAgent {
   struct Session {
     Dictionary info;
     Dictionary userInfo;
-    std::vector<std::string> frameworksToCheck;
     std::vector<Message> messages;
     /// Also those that were refused.
     std::vector<Message> offered;
-    std::size_t configurations = 0;
     /// When a configuration found backends, after how long.
     std::optional<Scheduler::Duration> foundAfter;
     /// The number of the queue on which the session was made.
@@ -56,7 +54,6 @@ struct SimulatedAgent {
   bool full = false;
 
   std::vector<RelmReportingToken> tokens;
-  std::vector<std::optional<RelmReportingToken>> tokenParents;
   std::deque<Session> sessions;  // references stay valid
   std::vector<SingleMessage> singleMessages;
   std::vector<SingleMessage> refusedSingleMessages;

@@ -1,18 +1,12 @@
 #include "tests/platform/SimulatedLog.h"
 
-#include <algorithm>
-#include <memory>
+#include <map>
 
 #include "tests/platform/Simulation.h"
 
 namespace quarvel {
 
 namespace {
-
-std::vector<const LogScope*>& Scopes() {
-  static std::vector<const LogScope*> scopes;
-  return scopes;
-}
 
 const char* LevelName(LogLevel level) {
   switch (level) {
@@ -30,10 +24,6 @@ const char* LevelName(LogLevel level) {
 
 }  // namespace
 
-const std::vector<const LogScope*>& RegisteredLogScopes() {
-  return Scopes();
-}
-
 std::string LogLine::text() const {
   return fmt::format("{} {} {}: {}", LevelName(level), scope, function, message);
 }
@@ -46,16 +36,10 @@ std::vector<std::string> SimulatedLog::texts(std::string_view prefix) const {
   return texts;
 }
 
-LogHandle ZQLogRegister(std::uint32_t code, std::string_view scope, std::string_view subsystem,
-                        std::string_view verboseKey, int options, int levelMask) {
-  const auto known = std::ranges::find(Scopes(), code, &LogScope::code);
-  if (known != Scopes().end()) return *known;
-  static std::vector<std::unique_ptr<LogScope>> owned;
-  return Scopes().emplace_back(
-      owned
-          .emplace_back(new LogScope{code, std::string(scope), std::string(subsystem),
-                                     std::string(verboseKey), options, levelMask})
-          .get());
+LogHandle ZQLogRegister(std::uint32_t code, std::string_view scope, std::string_view,
+                        std::string_view, int, int) {
+  static std::map<std::uint32_t, LogScope> scopes;
+  return &scopes.try_emplace(code, LogScope{std::string(scope)}).first->second;
 }
 
 bool ZQLogEnabled(LogLevel level, LogHandle scope) {
@@ -63,13 +47,13 @@ bool ZQLogEnabled(LogLevel level, LogHandle scope) {
   return scope != nullptr && Simulation::current().log.verbose.contains(scope->name);
 }
 
-void ZQLogWrite(LogHandle scope, LogLevel level, const char* file, int line, const char* function,
+void ZQLogWrite(LogHandle scope, LogLevel level, const char*, int, const char* function,
                 std::string_view message) {
   Simulation& simulation = Simulation::current();
   if (simulation.scheduler.stopped()) return;
   EXPECT_TRUE(ZQLogEnabled(level, scope)) << "written without asking: " << message;
-  simulation.log.lines.push_back({level, scope == nullptr ? "[default]" : scope->name, file, line,
-                                  function, std::string(message)});
+  simulation.log.lines.push_back(
+      {level, scope == nullptr ? "[default]" : scope->name, function, std::string(message)});
   simulation.note("log " + simulation.log.lines.back().text());
 }
 

@@ -12,22 +12,12 @@ namespace quarvel {
 /// A scope that was registered. Lives, as its handle does, as long as the process.
 class LogScope {
  public:
-  std::uint32_t code;
   std::string name;
-  std::string subsystem;
-  std::string verboseKey;
-  int options;
-  int levelMask;
 };
-
-/// The scopes registered in this process, by whichever simulation.
-[[nodiscard]] const std::vector<const LogScope*>& RegisteredLogScopes();
 
 struct LogLine {
   LogLevel level;
   std::string scope;  // "[default]" for the default log
-  std::string file;
-  int line;
   std::string function;
   std::string message;
 

@@ -11,15 +11,15 @@ namespace quarvel {
 void VistrelSendEventLazy(std::string_view name, const std::function<Payload()>& payload) {
   Simulation& simulation = Simulation::current();
   simulation.note(fmt::format("vistrel {}", name));
-  if (!simulation.vistrel.wanted || simulation.tells(Lie::eventLost)) return;
-  simulation.vistrel.events.push_back({std::string(name), payload(), simulation.elapsed()});
+  if (simulation.tells(Lie::eventLost)) return;
+  simulation.vistrel.events.push_back({std::string(name), payload()});
 }
 
-void OhmrikLogRegisteredEvent(std::int32_t domain, std::string_view name, const Payload& record,
+void OhmrikLogRegisteredEvent(std::int32_t, std::string_view name, const Payload& record,
                               std::nullptr_t) {
   Simulation& simulation = Simulation::current();
   simulation.note(fmt::format("ohmrik {}", name));
-  simulation.ohmrik.records.push_back({domain, std::string(name), record, simulation.elapsed()});
+  simulation.ohmrik.records.push_back(record);
 }
 
 void CountAcceptedMessage() {

@@ -12,29 +12,24 @@
 namespace quarvel {
 
 std::uint32_t SimulatedRandom::below(std::uint32_t bound) {
-  bounds.push_back(bound);
-  const std::uint32_t drawn = always ? *always : static_cast<std::uint32_t>(random_() % bound);
-  EXPECT_LT(drawn, bound);
-  return drawn;
+  return largest ? bound - 1 : static_cast<std::uint32_t>(random_() % bound);
 }
 
 std::uint32_t RandomBelow(std::uint32_t bound) {
   return Simulation::current().random.below(bound);
 }
 
-void EmitKernelTrace(std::uint32_t code, std::uint64_t first, std::uint64_t second,
-                     std::uint64_t third, std::uint64_t fourth) {
-  Simulation& simulation = Simulation::current();
-  simulation.trace.push_back({code, {first, second, third, fourth}});
-  simulation.note(fmt::format("trace {:#x}", code));
+void EmitKernelTrace(std::uint32_t code, std::uint64_t, std::uint64_t, std::uint64_t,
+                     std::uint64_t) {
+  Simulation::current().note(fmt::format("trace {:#x}", code));
 }
 
 std::int32_t OwnProcessIdentifier() {
-  return Simulation::current().process.ownIdentifier;
+  return 4711;
 }
 
 std::string OwnProcessName() {
-  return Simulation::current().process.ownName;
+  return "quarveld";
 }
 
 std::optional<std::string> ProcessCommandName(std::int32_t processIdentifier) {
@@ -112,23 +107,19 @@ void UnregisterUIOrientationHandler(std::string_view callbackID) {
 }
 
 std::string DiagnosticsPath(std::string_view path) {
-  return Simulation::current().files.diagnosticsPrefix + std::string(path);
+  return std::string(path);
 }
 
-Outcome CreateDirectory(std::string_view path, std::uint32_t permissions) {
-  SimulatedFiles& files = Simulation::current().files;
-  if (files.directoryError) return *files.directoryError;
-  files.directories.emplace(path, permissions);
-  return Success();
+Outcome CreateDirectory(std::string_view, std::uint32_t) {
+  const SimulatedFiles& files = Simulation::current().files;
+  return files.directoryError ? Outcome(*files.directoryError) : Success();
 }
 
 Outcome WriteFileAtomically(std::string_view path, std::string_view content) {
   SimulatedFiles& files = Simulation::current().files;
   const bool cut = Simulation::current().tells(Lie::historyCut);
   files.writes.emplace_back(path, cut ? content.substr(0, content.size() / 2) : content);
-  if (files.writeError) return *files.writeError;
-  files.files.insert_or_assign(std::string(path), content);
-  return Success();
+  return files.writeError ? Outcome(*files.writeError) : Success();
 }
 
 }  // namespace quarvel

@@ -1,6 +1,5 @@
 #pragma once
 
-#include <array>
 #include <cstdint>
 #include <map>
 #include <optional>
@@ -13,20 +12,13 @@
 
 namespace quarvel {
 
-struct TraceEvent {
-  std::uint32_t code;
-  std::array<std::uint64_t, 4> arguments;
-};
-
-/// Where `RandomBelow` gets its numbers: from the seed, or as the test says.
+/// Where `RandomBelow` gets its numbers: from the seed.
 class SimulatedRandom {
  public:
   explicit SimulatedRandom(std::uint64_t seed) : random_(seed) {}
 
-  /// Switch: the number that is drawn from now on.
-  std::optional<std::uint32_t> always;
-  /// The bounds that were asked for.
-  std::vector<std::uint32_t> bounds;
+  /// Switch: the largest number is drawn from now on.
+  bool largest = false;
 
   std::uint32_t below(std::uint32_t bound);
 
@@ -35,8 +27,6 @@ class SimulatedRandom {
 };
 
 struct SimulatedProcess {
-  std::int32_t ownIdentifier = 4711;
-  std::string ownName = "quarveld";
   /// The kernel's process table: command names.
   std::map<std::int32_t, std::string> table;
   /// With what status the process has exited. Nothing runs or is recorded after that.
@@ -58,15 +48,10 @@ class SimulatedOrientation {
 };
 
 struct SimulatedFiles {
-  /// Path to content.
-  std::map<std::string, std::string, std::less<>> files;
   /// Path and content of every write in order, also of those that failed.
   std::vector<std::pair<std::string, std::string>> writes;
-  /// Path to permissions.
-  std::map<std::string, std::uint32_t, std::less<>> directories;
 
   // Switches.
-  std::string diagnosticsPrefix;
   std::optional<Error> directoryError;
   std::optional<Error> writeError;
 };

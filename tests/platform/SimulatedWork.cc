@@ -1,9 +1,6 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <ctime>
-#include <iomanip>
-#include <sstream>
 #include <vector>
 
 #include "platform/Clock.h"
@@ -111,10 +108,9 @@ class SimulatedCondition final : public Condition {
 
 }  // namespace
 
-std::unique_ptr<WorkQueue> CreateSerialQueue(std::string_view label,
-                                             QualityOfService qualityOfService) {
+std::unique_ptr<WorkQueue> CreateSerialQueue(std::string_view label, QualityOfService) {
   auto queue = TheScheduler().makeQueue(std::string(label), true);
-  Simulation::current().queues.push_back({std::string(label), qualityOfService, queue->number});
+  Simulation::current().queues.push_back({std::string(label), queue->number});
   return std::make_unique<SimulatedWorkQueue>(std::move(queue));
 }
 
@@ -131,16 +127,8 @@ Date CurrentDate() {
   return TheScheduler().wallClock();
 }
 
-std::string LocalDateText(Date date, const char* pattern) {
-  const std::chrono::seconds offset = Simulation::current().localOffset;
-  const auto local = std::chrono::floor<std::chrono::seconds>(date + offset);
-  const std::time_t seconds = local.time_since_epoch().count();
-  std::tm calendar{};
-  gmtime_r(&seconds, &calendar);
-  calendar.tm_gmtoff = offset.count();
-  std::ostringstream text;
-  text << std::put_time(&calendar, pattern);
-  return text.str();
+std::string LocalDateText(Date date, const char*) {
+  return DateText(date);
 }
 
 }  // namespace quarvel

@@ -66,7 +66,6 @@ class Simulation {
  public:
   struct CreatedQueue {
     std::string label;
-    QualityOfService qualityOfService;
     std::size_t number = 0;
   };
 
@@ -97,8 +96,6 @@ class Simulation {
   bool spuriousWakeUps = false;
   /// Switch: what the platform gets wrong.
   Lie lie = Lie::none;
-  /// How far local time is ahead of UTC.
-  std::chrono::seconds localOffset{3600};
   std::vector<CreatedQueue> queues;
   std::map<std::string, std::variant<bool, std::int64_t>, std::less<>> deviceProperties;
 
@@ -106,7 +103,6 @@ class Simulation {
   SimulatedCounters counters;
   std::vector<Arrival> arrivals;
   SimulatedLog log;
-  std::vector<TraceEvent> trace;
   SimulatedRandom random;
   SimulatedProcess process;
   SimulatedVistrel vistrel;

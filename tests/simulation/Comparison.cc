@@ -14,8 +14,8 @@ namespace quarvel {
 namespace {
 
 constexpr const char* kSessionQueue = "tarnwick.quarvel.session.relmreporting";
-constexpr std::uint32_t kSessionMade = 0x21042828;
-constexpr std::uint32_t kSessionDisposed = 0x21042834;
+constexpr const char* kSessionMade = "trace 0x21042828";
+constexpr const char* kSessionDisposed = "trace 0x21042834";
 
 bool Same(const Model::Message& owed, const SimulatedAgent::Message& given) {
   return owed.category == given.category && owed.type == given.type &&
@@ -181,7 +181,7 @@ void World::compareSinks() {
   expect(uptimes <= model_.ended, "a client's time was reported twice");
   std::vector<Dictionary> records;
   for (const auto& record : simulation_.ohmrik.records) {
-    records.push_back(record.payload.root().toDictionary());
+    records.push_back(record.root().toDictionary());
   }
   expect(records == model_.powerRecords, "the power log holds other records than those owed");
 }
@@ -230,9 +230,7 @@ void World::compareLifetimes() {
     expect(client.connection().expired() && client.exportedObject().expired(),
            "a client that has gone is kept");
   }
-  const auto traced = [&](std::uint32_t code) {
-    return std::ranges::count(simulation_.trace, code, &TraceEvent::code);
-  };
+  const auto traced = [&](const char* code) { return simulation_.journal.lines({code}).size(); };
   expect(traced(kSessionMade) == traced(kSessionDisposed), "a session is kept");
 }
 

@@ -33,30 +33,9 @@ struct SessionOwner : Simulation {
     holdServerQueue();
     session->stop();
   }
-  void send(const Dictionary& payload = {{"a", 1}}, std::uint32_t category = 3,
-            std::uint16_t type = 1, bool sync = false) {
+  void send(const Dictionary& payload = {{"a", 1}}, std::uint32_t category = 3) {
     holdServerQueue();
-    session->sendMessage(Payload(payload), category, type, sync,
-                         [this](const std::optional<Error>& error) { sent.push_back(error); });
-  }
-  /// A start reply that counts in `ended`.
-  void awaitEnd() {
-    struct Counter : ReplySink {
-      explicit Counter(std::vector<Value>& counted) : ended(counted) {}
-      void result(Value value) override { ended.push_back(std::move(value)); }
-      void error(const Error&) override { ADD_FAILURE(); }
-      std::vector<Value>& ended;
-    };
-    holdServerQueue();
-    session->setTransactionCompleteBlock(BoolReply(std::make_shared<Counter>(ended)));
-  }
-  /// The ids of the messages in the history.
-  [[nodiscard]] std::vector<std::string> history() const {
-    std::vector<std::string> ids;
-    session->aggregatedPayloadData()->forEach(
-        [&](const MessageIdentity& identity, const Payload&) { ids.push_back(identity.text()); },
-        [](const Dictionary&) {});
-    return ids;
+    session->sendMessage(Payload(payload), category, 1, nullptr);
   }
   [[nodiscard]] std::vector<std::string> errors() const { return log.texts("error"); }
   /// What reached the agent inside its one session.
@@ -65,8 +44,6 @@ struct SessionOwner : Simulation {
   }
 
   std::shared_ptr<ZQReportingSession> session = ZQReportingSession::initWithID(7, {42});
-  std::vector<std::optional<Error>> sent;  // the replies to `send`
-  std::vector<Value> ended;
 };
 
 }  // namespace quarvel

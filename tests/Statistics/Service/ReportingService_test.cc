@@ -1,0 +1,340 @@
+#include <gmock/gmock.h>
+
+#include <algorithm>
+
+#include "tests/Statistics/Service/RunningService.h"
+
+// What the service says on its way, in what order, and what only happens in special places. What
+// becomes of the messages is for the simulation.
+
+namespace quarvel {
+namespace {
+
+using testing::Contains;
+using testing::ElementsAre;
+using testing::IsEmpty;
+using testing::StartsWith;
+using Lines = std::vector<std::string>;
+
+const Value kYes(true);
+const std::string kDelegate = "-[ZQReportingServiceDelegate ";
+const std::string kInstance = "-[ZQReportingServerInstance ";
+
+// What one call leaves in the journal. The lines of the operation itself stand there without
+// "log " and without its function's name.
+Lines JournalOf(RunningService& service, Client& client, const std::string& method,
+                const List& arguments) {
+  service.journal.clear();
+  client.call(method, arguments);
+  service.run();
+  Lines lines = service.journal.lines({"log", "trace", "reply", "exit"});
+  const std::string own = " zqrs " + kInstance + method + "]: ";
+  for (std::string& line : lines) {
+    if (const auto at = line.find(own); at != std::string::npos) {
+      line = line.substr(4, at - 4) + ": " + line.substr(at + own.size());
+    } else if (line.starts_with("reply " + method)) {
+      line = "reply" + line.substr(6 + method.size());
+    }
+  }
+  return lines;
+}
+
+TEST(ServerInstance, EveryOperationInOrder) {
+  struct Case {
+    const char* method;
+    List arguments;
+    Lines journal;
+  };
+  const std::string notFound = "log error zqrs " + kDelegate +
+                               "findReportingSessionForID:]: failed to find reporting session 99";
+  const Case kCases[] = {
+      {"createReportingSession:reply:",
+       {8},
+       {"debug: creating session for reporter 8", "trace 0x21042814",
+        "log info zqrr -[ZQReportingSession initWithID:processIdentifiers:]: created reporting "
+        "session for ID: 8",
+        "trace 0x21042828", "default: session created for reporter 8", "reply true"}},
+      {"setServiceType:reportingSession:reply:",
+       {2, 7},
+       {"debug: setting service type 2 for reporter 7",
+        "log info zqrr -[ZQReportingSession setServiceType:]: setting service type telephony",
+        "default: service type 2 set for reporter  7", "reply true"}},
+      {"setServiceType:reportingSession:reply:",
+       {2, 99},
+       {"debug: setting service type 2 for reporter 99", "reply true"}},
+      {"getServiceNameForReporterID:reply:",
+       {7},
+       {"debug: fetching seviceType", "reply 2",
+        "default: returnning service type 2 for reporter  7"}},
+      {"getServiceNameForReporterID:reply:",
+       {99},
+       {"debug: fetching seviceType", notFound, "reply 65535",
+        "default: returnning service type 65535 for reporter  99"}},
+      {"getServiceNameForReporterID:reply:",
+       {0},
+       {"debug: fetching seviceType", "reply 65535", "reply 65535",
+        "default: returnning service type 65535 for reporter  0"}},
+      {"setConfiguration:forReporterID:reply:",
+       {Dictionary{{"a", 1}}, 7},
+       {"debug: setting configuration", "reply true"}},
+      {"startReportingSessionForID:reply:",
+       {99},
+       {"debug: starting session for reporter 99", "trace 0x21042818", notFound}},
+      {"startReportingSessionForID:reply:",
+       {0},
+       {"debug: starting session for reporter 0", "trace 0x21042818", "reply true"}},
+      {"stopReportingSessionForID:reply:",
+       {7},
+       {"debug: stopping session for reporter 7", "trace 0x2104281c",
+        "default: nothing interesting to fetch from the drivers", "default: stopping 7",
+        "reply true"}},
+      {"stopReportingSessionForID:reply:",
+       {0},
+       {"debug: stopping session for reporter 0", "trace 0x2104281c", "reply true"}},
+      {"reporterID:valid:",
+       {7},
+       {"debug: validating reporter 7", "default: validating reporter 7",
+        "reply {\"reporterID\":7,\"serviceType\":2}"}},
+      {"getAllReporters:", {}, {"reply [7,8]"}},
+      {"destroyReportingSession:reply:",
+       {0},
+       {"debug: destroying session for reporter 0", "trace 0x21042820", "reply true"}},
+      {"destroyReportingSession:reply:",
+       {8},
+       {"debug: destroying session for reporter 8", "trace 0x21042820", "trace 0x21042834",
+        "log info zqrr -[ZQReportingSession dealloc]: deallocing this session 8",
+        "default: destroying 8", "reply true"}},
+      {"killService:", {}, {"default: DESTROYING SERVICE", "exit 2"}},
+  };
+  for (const auto seed : Seeds()) {
+    RunningService service(seed);
+    Client client = service.connect(42);
+    client.create(7);
+    service.run();
+    service.log.verbose = {"zqrs"};
+    for (const Case& each : kCases) {
+      EXPECT_EQ(JournalOf(service, client, each.method, each.arguments), each.journal)
+          << each.method << " " << JsonText(Value(each.arguments));
+    }
+  }
+}
+
+SEEDED_TEST(ServerInstance, EntryLinesAreWrittenBeforeTheServerQueueGetsToTheCall, RunningService) {
+  Client client = connect(42);
+  log.verbose = {"zqrs"};
+  bool entered = false;
+  ServerQueue().async([&] {
+    scheduler.sleep(1s);
+    entered = !log.texts("debug").empty();
+  });
+  client.create(7);
+  run();
+  EXPECT_TRUE(entered);
+}
+
+TEST(ServerInstance, AStopReportsWhatTheDriversCountedSinceTheStart) {
+  const std::optional<std::string> none;
+  for (const auto seed : Seeds()) {
+    RunningService service(seed, [&](Simulation& simulation) {
+      simulation.tallix.channels = {{"VorrenMXDrv", none, "a", 10},
+                                    {"Speaker", "any", "b", 10},
+                                    {"other", "MCA", "c", 10},
+                                    {"Haptics", "Stats", none, 10},
+                                    {"Haptics", "Other", "d", 10}};
+    });
+    Client client = service.connect(42);
+    client.createStarted(7);
+    service.run();
+    std::int64_t values[] = {11, 9, 17, 13, 99};
+    for (auto& channel : service.tallix.channels) {
+      channel.value = values[&channel - service.tallix.channels.data()];
+    }
+    client.stop(7);
+    service.run();
+    const auto& messages = service.agent.sessions.at(0).messages;
+    ASSERT_EQ(messages.size(), 2U);  // and the summary
+    EXPECT_EQ(messages[0].category, 9);
+    EXPECT_EQ(messages[0].type, 0);
+    EXPECT_EQ(messages[0].payload.root().toDictionary(),
+              (Dictionary{{"VorrenMXDrv_a", 1}, {"MCA_c", 7}, {"Haptics_Stats_", 3}}));
+    EXPECT_THAT(service.log.texts("default zqrs"),
+                Contains("default zqrs " + kInstance +
+                         "stopReportingSessionForID:reply:]: fetching driver logs "
+                         "{\"VorrenMXDrv_a\":1,\"MCA_c\":7,\"Haptics_Stats_\":3}"));
+    // The snapshot went with the first stop; without one the counters themselves are reported.
+    client.stop(7);
+    service.run();
+    ASSERT_EQ(service.agent.singleMessages.size(), 1U);
+    EXPECT_EQ(service.agent.singleMessages[0].message.payload.root().toDictionary(),
+              (Dictionary{
+                  {"VorrenMXDrv_a", 11}, {"Speaker_b", 9}, {"MCA_c", 17}, {"Haptics_Stats_", 13}}));
+  }
+}
+
+// The journal is of the `ServerQueue` alone, which no other queue's work interleaves with while the
+// sessions are started.
+SEEDED_TEST(Routing, TheSinksComeBeforeANamedSessionAndAfterOneThatABroadcastReaches,
+            RunningService) {
+  const auto routed = [this] { return journal.lines({"vistrel", "ohmrik", "trace"}); };
+  const std::string routing = "trace 0x21042824";
+  const std::string event = "vistrel tarnwick.quarvel.Playback.Start";
+  const std::string power = "ohmrik Fennor_Haptics";
+  const std::string sent = "trace 0x21042838";
+  const Dictionary payload = {{"EngineOnTime", 3}, {"zqreporting_timestamp", 9.5}};
+  Client first = connect(41);
+  Client second = connect(42);
+  second.createStarted(6);
+  first.create(8);
+  first.createStarted(7);
+  run();
+  journal.clear();
+  first.send(payload, 3, 1, List{6, 6});
+  run();
+  EXPECT_THAT(routed(), ElementsAre(routing, event, power, sent, event, power, sent));
+  journal.clear();
+  log.lines.clear();
+  second.send(payload);
+  run();
+  EXPECT_THAT(routed(), ElementsAre(routing, sent, event, power, sent, event, power));
+  const std::string line =
+      "default zqrs " + kInstance + "sendMessage:withCategory:andType:forReportingIDs:reply:]: ";
+  EXPECT_THAT(log.texts(),
+              ElementsAre(line + "sessions for client 41 : [\"<ZQReportingSession 7>\","
+                                 "\"<ZQReportingSession 8>\"]",
+                          line + "sessions for client 42 : [\"<ZQReportingSession 6>\"]",
+                          line + "active reporting sessions 2 : [\"<ZQReportingSession 7>\","
+                                 "\"<ZQReportingSession 6>\"]"));
+}
+
+SEEDED_TEST(Routing, AnAgentWithoutRoomHoldsNobodyUp, RunningService) {
+  Client client = connect(41);
+  client.createStarted(7);
+  run();
+  agent.full = true;
+  client.send({{"n", 1}}, 3, 1, List{7});
+  client.send({{"n", 2}});
+  const auto stop = client.stop(7);
+  runFor(1s);
+  EXPECT_THAT(stop->results, ElementsAre(kYes));
+  EXPECT_THAT(agent.sessions.at(0).messages, IsEmpty());
+  agent.full = false;
+  run();
+}
+
+TEST(ServiceDelegate, EndsAClientOnceAndLetsItGo) {
+  for (const auto seed : Seeds()) {
+    for (const bool interrupted : {true, false}) {
+      RunningService service(seed);
+      Client client = service.connect(-1);
+      client.createStarted(7);
+      service.run();
+      interrupted ? client.interrupt() : client.disconnect();
+      service.run();
+      const auto ofClient = [&](const std::string& line) {
+        return std::ranges::count(service.journal.lines(), "log default zqrs " + line);
+      };
+      EXPECT_EQ(ofClient(kDelegate + "listener:shouldAcceptNewConnection:]: InterruptionHandler: "
+                                     "connection exited"),
+                interrupted ? 1 : 0);
+      EXPECT_EQ(
+          ofClient(kInstance + "initWithPID:delegate:]: new client with pid 18446744073709551615"),
+          1);
+      EXPECT_EQ(
+          ofClient(kInstance + "handleConnectionError]: removing -1 from the server client list"),
+          1);
+      EXPECT_EQ(ofClient(kInstance + "dealloc]: dealloc -1 from the server client list"), 1);
+    }
+  }
+}
+
+SEEDED_TEST(Preferences, AreNotReadForAForeignNotification, RunningService) {
+  log.lines.clear();
+  notifications.deliverForeign("tarnwick.quarvel.reporting");
+  run();
+  EXPECT_THAT(log.texts(), IsEmpty());
+}
+
+TEST(Preferences, TheServiceRunsOnWithoutNotifications) {
+  RunningService service(
+      1, [](Simulation& simulation) { simulation.notifications.registrationStatus = 5; });
+  EXPECT_EQ(service.log.texts("default").at(0),
+            "default zqrs " + kDelegate + "listenForDefaultsNotification]: notify setup result 5");
+  const auto created = service.connect(42).create(7);
+  service.run();
+  EXPECT_THAT(created->results, ElementsAre(kYes));
+}
+
+TEST(ClientUptime, IsReportedWhenTheConnectionEnds) {
+  struct Case {
+    const char* name;
+    const char* process;  // none: unknown to the kernel
+    std::chrono::seconds clockStep;
+    std::optional<double> seconds;
+    Lines lines;
+  };
+  const Case kCases[] = {
+      {"a fraction is cut in the line only",
+       "player",
+       0s,
+       12.75,
+       {"InvalidationHandler: connection exited process=player uptime_sec=12"}},
+      {"the clock went back",
+       "player",
+       -60s,
+       47.25,
+       {"clientStartDate is in the past. clientpid=42 clientprocessname=player",
+        "InvalidationHandler: connection exited process=player uptime_sec=47"}},
+      {"a process without a name",
+       nullptr,
+       0s,
+       std::nullopt,
+       {"InvalidationHandler: connection exited process=(null) uptime_sec=12",
+        "clientProcessName is nil. clientpid=42"}},
+  };
+  const std::string function =
+      "default zqrs " + kDelegate + "listener:shouldAcceptNewConnection:]: ";
+  for (const Case& each : kCases) {
+    for (const auto seed : Seeds()) {
+      SCOPED_TRACE(each.name);
+      RunningService service(seed);
+      if (each.process != nullptr) service.process.table[42] = each.process;
+      Client client = service.connect(42);
+      service.runFor(12750ms);
+      service.scheduler.setWallClock(service.scheduler.wallClock() + each.clockStep);
+      service.log.lines.clear();
+      client.disconnect();
+      service.run();
+      Lines lines = service.log.texts(function);
+      for (std::string& line : lines) line.erase(0, function.size());
+      EXPECT_EQ(lines, each.lines);
+      const auto& events = service.vistrel.events;
+      ASSERT_EQ(events.size(), each.seconds ? 1U : 0U);
+      if (each.seconds) {
+        EXPECT_EQ(events[0].name, "tarnwick.quarvel.zqreportingclientuptime");
+        EXPECT_EQ(events[0].payload.root().toDictionary(),
+                  (Dictionary{{"processName", each.process}, {"seconds", *each.seconds}}));
+      }
+    }
+  }
+}
+
+SEEDED_TEST(ClientUptime, OfAClientThatLeftBeforeItWasRegistered, RunningService) {
+  process.table[42] = "player";
+  ServerQueue().async([&] { scheduler.sleep(1s); });
+  Client client(listener.connect(42));
+  client.disconnect();
+  run();
+  const std::string function =
+      "default zqrs " + kDelegate + "listener:shouldAcceptNewConnection:]: ";
+  const auto lines = log.texts(function);
+  EXPECT_THAT(lines, ElementsAre(StartsWith(function + "newConnection: "),
+                                 function + "clientStartDate is nil. clientpid=42 "
+                                            "clientprocessname=unknown",
+                                 function + "InvalidationHandler: connection exited process=(null) "
+                                            "uptime_sec=-1",
+                                 function + "clientProcessName is nil. clientpid=42"));
+  EXPECT_THAT(vistrel.events, IsEmpty());
+}
+
+}  // namespace
+}  // namespace quarvel
