@@ -11,10 +11,12 @@
 #include <chrono>
 #include <cstdlib>
 #include <filesystem>
-#include <initializer_list>
 #include <string>
 #include <string_view>
 #include <thread>
+#include <vector>
+
+#include <quarvel/client.hpp>
 
 #include "Statistics/Service/ZQReportingServiceDelegate.h"
 #include "base/MessagePack.h"
@@ -27,11 +29,10 @@
 namespace {
 
 using quarvel::MessagePackScanner;
-using quarvel::MessagePackWriter;
 using quarvel::PayloadValue;
 
-/// In seconds of real time; nothing should take a thousandth of it.
-constexpr timeval kPatience{30, 0};
+/// Nothing should take a thousandth of it.
+constexpr std::chrono::seconds kPatience(30);
 
 std::filesystem::path ServePath() {
   static const quarvel::TemporaryDirectory directory;
@@ -67,8 +68,9 @@ const std::filesystem::path& Service() {
 class Client {
  public:
   Client() : socket_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
-    ::setsockopt(socket_, SOL_SOCKET, SO_RCVTIMEO, &kPatience, sizeof kPatience);
-    ::setsockopt(socket_, SOL_SOCKET, SO_SNDTIMEO, &kPatience, sizeof kPatience);
+    const timeval patience{kPatience.count(), 0};
+    ::setsockopt(socket_, SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+    ::setsockopt(socket_, SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
     const sockaddr_un address = quarvel::UnixAddress(Service());
     Require(::connect(socket_, reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0,
             "a connection");
@@ -100,9 +102,8 @@ class Client {
     received_.append(bytes, static_cast<std::size_t>(count));
     return true;
   }
-  /// Gives `look` the id and the result of the next response, if it has come whole.
-  template <class Look>
-  bool response(Look&& look) {
+  /// Takes the next response off, if it has come whole.
+  bool response() {
     MessagePackScanner scanner(std::size_t{1} << 24, MessagePackScanner::kDeepest);
     const auto progress = scanner.scan(received_);
     Require(progress != MessagePackScanner::Progress::fault, "the service sends MessagePack");
@@ -111,13 +112,11 @@ class Client {
     Require(response.count() == 4, "a response has four items");
     auto item = response.items().begin();
     Require((*item).integer() == 1, "it is a response");
-    const auto id = (*++item).unsignedInteger();
+    Require((*++item).unsignedInteger().has_value(), "it has an id");
     const PayloadValue error = *++item;
     const PayloadValue result = *++item;
-    Require(id.has_value(), "it has an id");
     Require(error.isNil() || (error.find("domain") && error.find("code") && result.isNil()),
             "an error says what it is");
-    look(*id, result);
     received_.erase(0, scanner.length());
     return true;
   }
@@ -127,53 +126,24 @@ class Client {
   std::string received_;
 };
 
-/// One that is served as it should be, or the service has failed.
-class PoliteClient : Client {
- public:
-  /// Makes sure that the service serves, and soon has nobody's sessions but this client's.
-  void call() {
-    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(kPatience.tv_sec);
-    while (!isAlone()) {
-      Require(std::chrono::steady_clock::now() < deadline, "the sessions of those who went go");
-      std::this_thread::yield();
-    }
-  }
-
- private:
-  static constexpr std::int64_t kReporterID = 4711;
-
-  void append(const char* method, std::initializer_list<std::int64_t> arguments) {
-    MessagePackWriter writer(bytes_);
-    writer.list(4);
-    writer.integer(0);
-    writer.unsignedInteger(++calls_);
-    writer.string(method);
-    writer.list(arguments.size());
-    for (const std::int64_t argument : arguments) writer.integer(argument);
-  }
-
-  bool isAlone() {
-    bytes_.clear();
+/// Makes sure that the service serves a polite client, and soon has nobody's sessions but that
+/// one's.
+void ServePolitely() {
+  static quarvel::Client& polite =
+      *new quarvel::Client(std::move(quarvel::Client::connect(Service().string()).value()));
+  constexpr quarvel::ReporterID kReporterID = 4711;
+  auto sync = polite.sync(kPatience);
+  const auto deadline = std::chrono::steady_clock::now() + kPatience;
+  for (;;) {
     // Anew each time, since others may have started it and sent to it.
-    append("createReportingSession:reply:", {kReporterID});
-    append("getAllReporters:", {});
-    Require(send(bytes_), "the polite client is heard");
-    bool answered = false;
-    bool alone = false;
-    const auto look = [&](std::uint64_t id, PayloadValue result) {
-      if (id != calls_) return;
-      answered = true;
-      alone = result.count() == 1 && (*result.items().begin()).integer() == kReporterID;
-    };
-    while (!answered) {
-      if (!response(look)) Require(receive(), "the polite client is answered");
-    }
-    return alone;
+    Require(sync.createReportingSession(kReporterID).ok(), "the polite client is served");
+    const auto reporters = sync.getAllReporters();
+    Require(reporters.ok(), "the polite client is answered");
+    if (reporters.value() == std::vector{kReporterID}) return;
+    Require(std::chrono::steady_clock::now() < deadline, "the sessions of those who went go");
+    std::this_thread::yield();
   }
-
-  std::uint64_t calls_ = 0;
-  std::string bytes_;
-};
+}
 
 }  // namespace
 
@@ -193,12 +163,10 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     if (reads) {
       client.stopSending();
       do {
-        while (client.response([](std::uint64_t, PayloadValue) {})) {
-        }
+        while (client.response()) continue;
       } while (client.receive());
     }
   }
-  static PoliteClient& polite = *new PoliteClient;
-  polite.call();
+  ServePolitely();
   return 0;
 }

@@ -40,59 +40,20 @@ class Reader {
     if (code <= 0x8f) return items(2 * (code & 0x0f), depth);
     if (code <= 0x9f) return items(code & 0x0f, depth);
     if (code <= 0xbf) return rest(code & 0x1f);
-    constexpr unsigned kWrong = 0xc1;
-    switch (code) {
-      case 0xc0:
-      case 0xc2:
-      case 0xc3:
-        return Finding::whole;
-      case 0xc4:
-      case 0xd9:
-        return sized(1, 0);
-      case 0xc5:
-      case 0xda:
-        return sized(2, 0);
-      case 0xc6:
-      case 0xdb:
-        return sized(4, 0);
-      case 0xc7:
-        return sized(1, 1);
-      case 0xc8:
-        return sized(2, 1);
-      case 0xc9:
-        return sized(4, 1);
-      case 0xca:
-      case 0xce:
-      case 0xd2:
-        return rest(4);
-      case 0xcb:
-      case 0xcf:
-      case 0xd3:
-        return rest(8);
-      case 0xcc:
-      case 0xd0:
-        return rest(1);
-      case 0xcd:
-      case 0xd1:
-        return rest(2);
-      case 0xd4:
-      case 0xd5:
-      case 0xd6:
-      case 0xd7:
-      case 0xd8:
-        return rest(1 + (1U << (code - 0xd4)));
-      case 0xdc:
-        return counted(2, 1, depth);
-      case 0xdd:
-        return counted(4, 1, depth);
-      case 0xde:
-        return counted(2, 2, depth);
-      case 0xdf:
-        return counted(4, 2, depth);
-      case kWrong:
-      default:
-        return Finding::wrong;
-    }
+    if (code == 0xc1) return Finding::wrong;
+    // Of the codes from 0xc0: how many octets say a length, what follows besides, and what the
+    // length counts when it is no octets.
+    constexpr struct {
+      std::uint8_t octets, more, items;
+    } kForms[] = {{0, 0, 0}, {0, 0, 0}, {0, 0, 0}, {0, 0, 0},  {1, 0, 0}, {2, 0, 0}, {4, 0, 0},
+                  {1, 1, 0}, {2, 1, 0}, {4, 1, 0}, {0, 4, 0},  {0, 8, 0}, {0, 1, 0}, {0, 2, 0},
+                  {0, 4, 0}, {0, 8, 0}, {0, 1, 0}, {0, 2, 0},  {0, 4, 0}, {0, 8, 0}, {0, 2, 0},
+                  {0, 3, 0}, {0, 5, 0}, {0, 9, 0}, {0, 17, 0}, {1, 0, 0}, {2, 0, 0}, {4, 0, 0},
+                  {2, 0, 1}, {4, 0, 1}, {2, 0, 2}, {4, 0, 2}};
+    const auto& [octets, more, times] = kForms[code - 0xc0];
+    const auto length = number(octets);
+    if (!length) return Finding::cut;
+    return times > 0 ? items(*length * times, depth) : rest(*length + more);
   }
   [[nodiscard]] std::size_t position() const { return position_; }
 
@@ -110,14 +71,6 @@ class Reader {
     return result;
   }
   Finding rest(std::size_t count) { return take(count) ? Finding::whole : Finding::cut; }
-  Finding sized(std::size_t octets, std::size_t more) {
-    const auto size = number(octets);
-    return size ? rest(*size + more) : Finding::cut;
-  }
-  Finding counted(std::size_t octets, std::size_t times, unsigned depth) {
-    const auto count = number(octets);
-    return count ? items(*count * times, depth) : Finding::cut;
-  }
   Finding items(std::size_t count, unsigned depth) {
     if (depth + 1 > kDeepest) return Finding::wrong;
     for (; count > 0; --count) {

@@ -16,22 +16,15 @@ class RecordingReply final : public ReplySink {
   explicit RecordingReply(std::shared_ptr<RecordedCall> call) : call_(std::move(call)) {}
 
   void result(Value value) override {
-    if (Simulation::current().tells(Lie::replyLost)) return;
-    record(JsonText(value));
-    if (Simulation::current().tells(Lie::replyTwice)) call_->results.push_back(value);
+    Simulation& simulation = Simulation::current();
+    if (simulation.tells(Lie::replyLost)) return;
+    simulation.note(fmt::format("reply {} {}", call_->method, JsonText(value)));
+    if (simulation.tells(Lie::replyTwice)) call_->results.push_back(value);
     call_->results.push_back(std::move(value));
   }
-  void error(const Error& error) override {
-    record(error.description());
-    call_->errors.push_back(error);
-  }
+  void error(const Error& error) override { call_->results.emplace_back(error.description()); }
 
  private:
-  void record(const std::string& answer) {
-    Simulation::current().note(fmt::format("reply {} {}", call_->method, answer));
-    call_->answeredAt.push_back(Simulation::current().elapsed());
-  }
-
   const std::shared_ptr<RecordedCall> call_;
 };
 
@@ -121,9 +114,7 @@ class SimulatedConnection final : public ClientConnection,
 };
 
 SimulatedClient::SimulatedClient(const std::shared_ptr<SimulatedConnection>& connection)
-    : connection_(connection),
-      exportedObject_(connection->observedObject),
-      description_(connection->description()) {}
+    : connection_(connection), exportedObject_(connection->observedObject) {}
 
 SimulatedClient::Call SimulatedClient::call(std::string method, const List& arguments) {
   auto call = std::make_shared<RecordedCall>();

@@ -6,7 +6,6 @@
 #include <string>
 #include <vector>
 
-#include "base/Error.h"
 #include "base/Value.h"
 #include "platform/ServiceListener.h"
 #include "tests/platform/Scheduler.h"
@@ -19,10 +18,7 @@ class SimulatedConnection;
 struct RecordedCall {
   std::string method;
   List arguments;
-  std::vector<Value> results;
-  std::vector<Error> errors;
-  /// When each answer came.
-  std::vector<Scheduler::Duration> answeredAt;
+  std::vector<Value> results;  // an error as its text
   /// Why the call did not reach the exported object.
   std::optional<std::string> fault;
 };
@@ -52,8 +48,6 @@ class SimulatedClient {
   /// Goes away: invalidation alone.
   void disconnect();
 
-  /// How log lines print the connection.
-  [[nodiscard]] const std::string& description() const { return description_; }
   // For asserting that nobody keeps them alive.
   [[nodiscard]] std::weak_ptr<ClientConnection> connection() const;
   [[nodiscard]] std::weak_ptr<ExportedObject> exportedObject() const { return *exportedObject_; }
@@ -61,7 +55,6 @@ class SimulatedClient {
  private:
   std::weak_ptr<SimulatedConnection> connection_;
   std::shared_ptr<const std::weak_ptr<ExportedObject>> exportedObject_;
-  std::string description_;
 };
 
 /// The process's listener.

@@ -34,7 +34,7 @@ std::string OwnProcessName() {
 
 std::optional<std::string> ProcessCommandName(std::int32_t processIdentifier) {
   EXPECT_GE(processIdentifier, 1);
-  const auto& table = Simulation::current().process.table;
+  const auto& table = Simulation::current().processes;
   const auto found = table.find(processIdentifier);
   return found == table.end() ? std::nullopt : std::optional(found->second);
 }
@@ -42,7 +42,6 @@ std::optional<std::string> ProcessCommandName(std::int32_t processIdentifier) {
 void ExitProcess(int status) {
   Simulation& simulation = Simulation::current();
   simulation.note(fmt::format("exit {}", status));
-  simulation.process.exitStatus = status;
   simulation.scheduler.stop();
   throw ThreadEnded{};
 }

@@ -26,13 +26,6 @@ class SimulatedRandom {
   std::mt19937 random_;
 };
 
-struct SimulatedProcess {
-  /// The kernel's process table: command names.
-  std::map<std::int32_t, std::string> table;
-  /// With what status the process has exited. Nothing runs or is recorded after that.
-  std::optional<int> exitStatus;
-};
-
 /// The orientation facility. Changes are told on a platform thread; handlers must not wait there.
 class SimulatedOrientation {
  public:

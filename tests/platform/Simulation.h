@@ -104,7 +104,8 @@ class Simulation {
   std::vector<Arrival> arrivals;
   SimulatedLog log;
   SimulatedRandom random;
-  SimulatedProcess process;
+  /// The kernel's process table: command names.
+  std::map<std::int32_t, std::string> processes;
   SimulatedVistrel vistrel;
   SimulatedOhmrik ohmrik;
   SimulatedAgent agent;

@@ -62,7 +62,7 @@ class Model {
   std::deque<Dictionary> preferences;
 
   // What is owed, each in order where the service has one.
-  std::map<const RecordedCall*, std::vector<Value>> answers;  // an error as its code
+  std::map<const RecordedCall*, std::vector<Value>> answers;  // an error as its text
   std::deque<Session> sessions;                               // in the order of their creation
   std::vector<SingleMessage> singleMessages;
   std::vector<std::pair<std::string, Dictionary>> events;

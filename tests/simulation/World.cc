@@ -68,7 +68,7 @@ void World::run() {
 void World::step() {
   if (clients_.empty() || (clients_.size() < 5 && oneIn(4))) {
     const auto pid = static_cast<std::int32_t>(100 + draw(3));
-    if (oneIn(2)) simulation_.process.table[pid] = "a client";
+    if (oneIn(2)) simulation_.processes[pid] = "a client";
     clients_.emplace_back(simulation_.listener.connect(pid));
   }
   for (std::uint64_t calls = 1 + draw(8); calls > 0; --calls) act(clients_[draw(clients_.size())]);

@@ -1,8 +1,8 @@
-#include <gtest/gtest.h>
+#include <gtest/gtest-spi.h>
 
 #include <cstdio>
 
-#include "Statistics/ZQReportingUtility.h"
+#include "platform/Condition.h"
 #include "tests/simulation/World.h"
 
 // The whole service on the simulated platform against a model of what it owes. A failure names its
@@ -65,6 +65,18 @@ TEST(ServiceSimulation, ALieOfThePlatformIsNoticed) {
     }
     EXPECT_NE(finding, "") << "lie " << static_cast<int>(lie) << " is believed";
   }
+}
+
+TEST(ServiceSimulation, ADeadlockIsNoticedWithItsSeedAndWhoWaits) {
+  Simulation simulation(7);
+  const auto condition = CreateCondition();
+  const auto queue = CreateSerialQueue("the queue", QualityOfService::utility);
+  queue->async([condition]() QUARVEL_NO_THREAD_SAFETY_ANALYSIS {
+    condition->lock();
+    condition->lock();
+  });
+  EXPECT_NONFATAL_FAILURE(simulation.run(), "the queue for a condition's lock");
+  EXPECT_NONFATAL_FAILURE(simulation.run(), "QUARVEL_SEED=7");
 }
 
 }  // namespace

@@ -297,7 +297,7 @@ TEST(ClientUptime, IsReportedWhenTheConnectionEnds) {
     for (const auto seed : Seeds()) {
       SCOPED_TRACE(each.name);
       RunningService service(seed);
-      if (each.process != nullptr) service.process.table[42] = each.process;
+      if (each.process != nullptr) service.processes[42] = each.process;
       Client client = service.connect(42);
       service.runFor(12750ms);
       service.scheduler.setWallClock(service.scheduler.wallClock() + each.clockStep);
@@ -319,7 +319,7 @@ TEST(ClientUptime, IsReportedWhenTheConnectionEnds) {
 }
 
 SEEDED_TEST(ClientUptime, OfAClientThatLeftBeforeItWasRegistered, RunningService) {
-  process.table[42] = "player";
+  processes[42] = "player";
   ServerQueue().async([&] { scheduler.sleep(1s); });
   Client client(listener.connect(42));
   client.disconnect();
