@@ -11,22 +11,6 @@ namespace {
 
 using testing::HasSubstr;
 
-TEST(Payload, IsWalkedInTheOrderReceived) {
-  const Payload payload(
-      Dictionary{{"zulu", 1}, {5, List{1, "two", nullptr}}, {"alpha", Dictionary{{"k", 2.5}}}});
-  std::vector<std::string> keys;
-  for (const PayloadEntry& entry : payload) {
-    keys.emplace_back(entry.key.string() ? *entry.key.string() : "5");
-  }
-  EXPECT_THAT(keys, testing::ElementsAre("zulu", "5", "alpha"));
-  EXPECT_EQ(payload.find("alpha")->find("k")->real(), 2.5);
-  EXPECT_FALSE(payload.find("beta"));
-  EXPECT_FALSE(payload.find("zulu")->find("k"));
-  EXPECT_EQ(payload.root().items().begin(), std::default_sentinel) << "a dictionary has no items";
-  EXPECT_TRUE(Payload().empty());
-  EXPECT_EQ(Payload(), Payload(Dictionary{}));
-}
-
 TEST(Payload, RefusesWhatIsNoPayload) {
   const struct {
     const char* name;
@@ -110,23 +94,6 @@ TEST(Payload, ReplacesInItsOwnKeysOnly) {
       Dictionary{{"two words here", 1}, {7, Dictionary{{"in side", 1}}}, {"a b", 2}, {"a_b", 3}});
   EXPECT_EQ(JsonText(blanks.replacingInKeys(' ', '_')),
             R"({"two_words_here":1,"7":{"in side":1},"a_b":3})");
-}
-
-TEST(Json, WritesWhatItLacksAsText) {
-  const Dictionary values{{"date", Date(std::chrono::microseconds(1'769'865'901'000'001))},
-                          {"bytes", Bytes{{"\x00\x01\xfe", 3}}},
-                          {"padded", Bytes{"ab"}},
-                          {"nan", std::nan("")},
-                          {"infinite", -std::numeric_limits<double>::infinity()},
-                          {"large", std::numeric_limits<std::uint64_t>::max()},
-                          {"real", 2.0},
-                          {"escaped", "\"\\\n\x01 \u20ac"}};
-  const std::string expected =
-      R"({"date":"2026-01-31T13:25:01.000001Z","bytes":"AAH+","padded":"YWI=","nan":"NaN",)"
-      R"("infinite":"-Infinity","large":18446744073709551615,"real":2.0,)"
-      "\"escaped\":\"\\\"\\\\\\n\\u0001 \u20ac\"}";
-  EXPECT_EQ(JsonText(values), expected);
-  EXPECT_EQ(JsonText(Payload(values)), expected) << "both forms read alike";
 }
 
 TEST(Json, IsReadBackAsWhatItWas) {

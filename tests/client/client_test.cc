@@ -101,17 +101,10 @@ TEST_F(ClientTest, RepliesFindTheirCallsInWhateverOrderAndPiecesTheyArrive) {
   EXPECT_TRUE(stopped.get().value());
 }
 
-TEST_F(ClientTest, WhatTheServiceRefusesIsItsOwnError) {
-  Expected<std::monostate> refused;
+TEST_F(ClientTest, AReplyOfAnotherKindIsAnError) {
   Expected<bool> unexpected;
-  client().sendMessage(kPayload, Kind::error, Client::MessageType::error, 7, refused.reply());
   client().stopReportingSessionForID(7, unexpected.reply());
-  const Dictionary error{{"domain", "tarnwick.audio.reporting"},
-                         {"code", 1},
-                         {"userInfo", Dictionary{{"reason", "off"}}}};
-  service_.send(FakeService::response(*service_.receive(), error, nullptr));
   service_.reply(*service_.receive(), "yes");
-  EXPECT_EQ(Text(refused.get()), "tarnwick.audio.reporting 1: off");
   EXPECT_TRUE(IsCode(unexpected.get().error(), Client::Code::unexpectedReply));
 }
 
@@ -143,13 +136,6 @@ TEST_F(ClientTest, ALostConnectionAnswersWhatWaitsAndWhatStillComes) {
   EXPECT_TRUE(IsCode(late.error(), Client::Code::connectionLost)) << Text(late);
   EXPECT_THAT(order, ElementsAre(0, 1, 2));
   EXPECT_FALSE(client().connected());
-}
-
-TEST_F(ClientTest, KillingTheServiceSucceedsWhenItIsGone) {
-  auto killed = beside([](Client& c) { return c.sync().killService(); });
-  ASSERT_TRUE(service_.receive());
-  service_.hangUp();
-  EXPECT_TRUE(killed.get().ok());
 }
 
 TEST_F(ClientTest, BytesThatAreNoReplyLoseTheConnection) {

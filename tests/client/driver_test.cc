@@ -14,6 +14,7 @@
 namespace quarvel {
 namespace {
 
+using test::DrivenClient;
 using test::Expected;
 using test::IsCode;
 using test::Text;
@@ -21,16 +22,6 @@ using vocabulary::Kind;
 using namespace std::chrono_literals;
 
 const auto kGeneric = Client::MessageType::generic;
-
-class DrivenClient : public test::DrivenClient {
- protected:
-  /// Replies true to `calls` calls, on a thread of its own.
-  std::jthread replying(int calls) {
-    return std::jthread([this, calls] {
-      for (int i = 0; i < calls; ++i) service_.reply(*service_.receive(), true);
-    });
-  }
-};
 
 void Poll(Client& client, const bool& done) {
   while (!done) {
@@ -63,7 +54,9 @@ TEST_F(DrivenClient, EveryLoopCarriesCallsOutAndGivesReplies) {
   };
   for (const auto run : {Poll, Asio}) {
     Client& client = connect();
-    const std::jthread service = replying(kCalls);
+    const std::jthread service([this] {
+      for (int i = 0; i < kCalls; ++i) service_.reply(*service_.receive(), true);
+    });
     const auto before = threads();
     const Dictionary large{{"Samples", std::string(4'096, 'x')}};
     int replies = 0;
@@ -94,18 +87,6 @@ TEST_F(DrivenClient, NothingIsDueWhileNothingHappens) {
   ASSERT_EQ(::poll(&due, 1, 60'000), 1);
   EXPECT_EQ(client.dispatch(), Client::Code::connectionLost);
   EXPECT_EQ(::poll(&due, 1, 0), 0) << "a lost connection is told of once";
-}
-
-TEST_F(DrivenClient, SynchronousFormsDriveItAndTimeOut) {
-  Client& client = connect();
-  {
-    const std::jthread service = replying(2);
-    bool other = false;
-    client.setServiceType(Client::ServiceType::test, 7, [&](const auto&) { other = true; });
-    EXPECT_TRUE(client.sync().createReportingSession(7).value());
-    EXPECT_TRUE(other) << "given in there, since it came first";
-  }
-  EXPECT_TRUE(IsCode(client.sync(1ms).getAllReporters().error(), Client::Code::timedOut));
 }
 
 TEST_F(DrivenClient, NeverWaitsAndRefusesWhatIsTooMuch) {

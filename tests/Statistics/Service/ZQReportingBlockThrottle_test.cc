@@ -27,10 +27,6 @@ Payload Delayed(Value seconds) {
   return Payload(Dictionary{{kSeconds, std::move(seconds)}});
 }
 
-std::string Key(const Payload& payload) {
-  return ZQReportingBlockThrottle::buildMessageKey(payload, 7, 3, 1);
-}
-
 /// A throttle whose blocks say when they ran.
 struct Throttled : Simulation {
   using Simulation::Simulation;
@@ -72,89 +68,34 @@ struct Throttled : Simulation {
   std::shared_ptr<ZQReportingBlockThrottle> throttle = ZQReportingBlockThrottle::init();
 };
 
-TEST(MessageKey, HasKeysSortedAndValuesInTheirTextualForm) {
-  EXPECT_EQ(Key(Payload()), "reporterID|7|Playback|Start");
+TEST(MessageKey, HasKeysSortedAndValuesInTheirTextualFormButNotThoseLeftOut) {
   const Dictionary inner = {{"z", 1.5}, {"b", List{true, nullptr}}, {12, "12"}};
-  const Payload payload(Dictionary{{"text", "as it |stands\""},
-                                   {"systemuptime_sec", 17},
-                                   {"Upper", inner},
-                                   {9, -3},
-                                   {"list", List{"a", Date{}}}});
-  EXPECT_EQ(ZQReportingBlockThrottle::buildMessageKey(payload, -1, 0x1000'0003, 0xffff'ffff),
-            R"(9|-3|Upper|{"12":"12","b":[true,null],"z":1.5}|)"
-            R"(list|["a","1970-01-01T00:00:00.000000Z"]|systemuptime_sec|^|)"
-            R"(text|as it |stands"|reporterID|-1|DSP_Playback|Undefined)");
-}
-
-TEST(MessageKey, MessagesAreEqualWhenWhatIsComparedIs) {
-  struct Row {
-    const char* name;
-    Dictionary one;
-    Dictionary other;
-    bool equal;
+  const struct {
+    Dictionary payload;
+    const char* key;
+  } kRows[] = {
+      {{}, ""},
+      {{{"text", "as it |stands\""}, {"Upper", inner}, {9, -3}, {"list", List{"b", "a", Date{}}}},
+       R"(9|-3|Upper|{"12":"12","b":[true,null],"z":1.5}|)"
+       R"(list|["b","a","1970-01-01T00:00:00.000000Z"]|text|as it |stands"|)"},
+      {{{"systemuptime_sec", 17},
+        {"processuptime_ms", 1},
+        {"zqreporting_timestamp", 1},
+        {kSeconds, 1}},
+       "_throttle_seconds|^|processuptime_ms|^|systemuptime_sec|^|zqreporting_timestamp|^|"},
+      {{{"a", 1}, {"b", 2}, {4, 1}, {kBlacklist, List{"b", 4, nullptr}}},
+       "4|^|_comparison_field_blacklist|^|a|1|b|^|"},
+      {{{"b", 2}, {kBlacklist, "b"}}, "_comparison_field_blacklist|^|b|2|"},
+      {{{"b", 2}, {kBlacklist, Dictionary{{"b", "b"}}}}, "_comparison_field_blacklist|^|b|2|"},
+      {{{"Volume", 1}, {"VolumeOperationTime", nullptr}}, "Volume|^|VolumeOperationTime|^|"},
+      {{{"Volume", 1}}, "Volume|1|"},
+      {{{"VolumeOperationTime", 1}}, "VolumeOperationTime|1|"},
   };
-  const Row rows[] = {
-      {"order of keys", {{"a", 1}, {"b", 2}}, {{"b", 2}, {"a", 1}}, true},
-      {"order of inner keys",
-       {{"a", List{Dictionary{{"x", 1}, {"y", 2}}}}},
-       {{"a", List{Dictionary{{"y", 2}, {"x", 1}}}}},
-       true},
-      {"inner value", {{"a", Dictionary{{"x", 1}}}}, {{"a", Dictionary{{"x", 2}}}}, false},
-      {"order of a list", {{"a", List{1, 2}}}, {{"a", List{2, 1}}}, false},
-      {"value", {{"a", 1}}, {{"a", 2}}, false},
-      {"system uptime", {{"systemuptime_sec", 1}}, {{"systemuptime_sec", "2"}}, true},
-      {"process uptime", {{"processuptime_ms", 1}}, {{"processuptime_ms", 2}}, true},
-      {"timestamp", {{"zqreporting_timestamp", 1}}, {{"zqreporting_timestamp", 2}}, true},
-      {"delay", {{kSeconds, 1}}, {{kSeconds, 2}}, true},
-      {"system uptime absent", {{"systemuptime_sec", 1}}, {}, false},
-      {"process uptime absent", {{"processuptime_ms", 1}}, {}, false},
-      {"timestamp absent", {{"zqreporting_timestamp", 1}}, {}, false},
-      {"delay absent", {{kSeconds, 1}}, {}, false},
-      {"listed key",
-       {{"a", 1}, {"b", 2}, {kBlacklist, List{"b"}}},
-       {{"a", 1}, {"b", 3}, {kBlacklist, List{"b", 5, nullptr}}},
-       true},
-      {"key beside a listed one",
-       {{"a", 1}, {"b", 2}, {kBlacklist, List{"b"}}},
-       {{"a", 2}, {"b", 2}, {kBlacklist, List{"b"}}},
-       false},
-      {"listed by one only",
-       {{"b", 2}, {kBlacklist, List{"b"}}},
-       {{"b", 2}, {kBlacklist, List{}}},
-       false},
-      {"listed number", {{4, 1}, {kBlacklist, List{4}}}, {{4, 2}, {kBlacklist, List{4}}}, true},
-      {"key named without a list",
-       {{"b", 2}, {kBlacklist, "b"}},
-       {{"b", 3}, {kBlacklist, "b"}},
-       false},
-      {"key of a dictionary in place of a list",
-       {{"b", 2}, {kBlacklist, Dictionary{{"b", "b"}}}},
-       {{"b", 3}, {kBlacklist, Dictionary{{"b", "b"}}}},
-       false},
-      {"volume and its time",
-       {{"Volume", 1}, {"VolumeOperationTime", 10}},
-       {{"Volume", 2}, {"VolumeOperationTime", nullptr}},
-       true},
-      {"volume alone", {{"Volume", 1}}, {{"Volume", 2}}, false},
-      {"volume time alone", {{"VolumeOperationTime", 1}}, {{"VolumeOperationTime", 2}}, false},
-  };
-  for (const Row& row : rows) {
-    SCOPED_TRACE(row.name);
-    EXPECT_EQ(Key(Payload(row.one)) == Key(Payload(row.other)), row.equal)
-        << Key(Payload(row.one)) << "\n"
-        << Key(Payload(row.other));
+  for (const auto& [payload, key] : kRows) {
+    EXPECT_EQ(
+        ZQReportingBlockThrottle::buildMessageKey(Payload(payload), -1, 0x1000'0003, 0xffff'ffff),
+        std::string(key) + "reporterID|-1|DSP_Playback|Undefined");
   }
-}
-
-TEST(MessageKey, EqualNumbersInDifferentEncodingsAreEqual) {
-  const auto shortest =
-      Payload::from(PayloadValue("\x81\xa1"
-                                 "a\x05"));
-  const auto wide =
-      Payload::from(PayloadValue("\x81\xd9\x01"
-                                 "a\xd1\x00\x05"));
-  ASSERT_TRUE(shortest && wide);
-  EXPECT_EQ(Key(shortest.value()), Key(wide.value()));
 }
 
 TEST(SleepTime, IsWhatThePayloadAsksForWithinBounds) {
