@@ -26,8 +26,9 @@ std::vector<std::string> Lines(const Simulation& simulation, const char* operati
 
 TEST(Drivers, SubscribesToTheGroupsThatHaveChannelsAndOnlyLogsAnError) {
   Simulation simulation(1);
-  simulation.tallix.channels = {{"VorrenMXDrv", kNone, "a", 0}, {"other", "MCA", "c", 0}};
-  simulation.tallix.emptyGroups = {{"Haptics", "Stats"}};
+  simulation.tallix.channels = {{"VorrenMXDrv", kNone, "a", 0},
+                                {"other", "MCA", "c", 0},
+                                {"Haptics", "Stats", "d", 0, false}};
   simulation.tallix.channelsError = Error{"tallix", 5, {}};
   const ZQReportingDriverUtility drivers;
   ASSERT_EQ(drivers.ioChannelSubscriptions().size(), 2U);

@@ -130,24 +130,12 @@ SimulatedClient::Call SimulatedClient::call(std::string method, const List& argu
   return call;
 }
 
-namespace {
-
-void End(const std::weak_ptr<SimulatedConnection>& observed, bool interrupted) {
-  if (const auto connection = observed.lock()) {
-    connection->perform([observed, interrupted] {
-      if (const auto serving = observed.lock()) serving->end(interrupted);
+void SimulatedClient::end(bool interrupted) {
+  if (const auto connection = connection_.lock()) {
+    connection->perform([weak = connection_, interrupted] {
+      if (const auto serving = weak.lock()) serving->end(interrupted);
     });
   }
-}
-
-}  // namespace
-
-void SimulatedClient::interrupt() {
-  End(connection_, true);
-}
-
-void SimulatedClient::disconnect() {
-  End(connection_, false);
 }
 
 std::weak_ptr<ClientConnection> SimulatedClient::connection() const {

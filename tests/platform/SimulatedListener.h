@@ -43,10 +43,8 @@ class SimulatedClient {
 
   /// Sends `arguments`, as MessagePack, to the exported operation `method`.
   Call call(std::string method, const List& arguments);
-  /// Breaks the protocol: interruption, then invalidation.
-  void interrupt();
-  /// Goes away: invalidation alone.
-  void disconnect();
+  /// Breaks the protocol (interruption, then invalidation) or goes away (invalidation alone).
+  void end(bool interrupted = false);
 
   // For asserting that nobody keeps them alive.
   [[nodiscard]] std::weak_ptr<ClientConnection> connection() const;

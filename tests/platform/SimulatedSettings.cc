@@ -34,22 +34,19 @@ void SimulatedNotifications::deliver(const std::shared_ptr<Registration>& regist
   });
 }
 
-NotificationToken SimulatedNotifications::add(std::string name, WorkQueue& queue,
-                                              NotificationHandler handler) {
-  const auto token = static_cast<NotificationToken>(registrations_.size() * 100 + 100);
-  registrations_.push_back(std::make_shared<Registration>(
-      Registration{std::move(name), token, &queue, std::move(handler)}));
-  return token;
+std::int32_t SimulatedNotifications::add(std::string_view name, NotificationToken& token,
+                                         WorkQueue& queue, NotificationHandler handler) {
+  token = static_cast<NotificationToken>(registrations_.size() * 100 + 100);
+  if (registrationStatus == 0) {
+    registrations_.push_back(std::make_shared<Registration>(
+        Registration{std::string(name), token, &queue, std::move(handler)}));
+  }
+  return registrationStatus;
 }
 
 std::int32_t RegisterForNotification(std::string_view name, NotificationToken& token,
                                      WorkQueue& queue, NotificationHandler handler) {
-  SimulatedNotifications& notifications = Simulation::current().notifications;
-  token = 0;
-  if (notifications.registrationStatus == 0) {
-    token = notifications.add(std::string(name), queue, std::move(handler));
-  }
-  return notifications.registrationStatus;
+  return Simulation::current().notifications.add(name, token, queue, std::move(handler));
 }
 
 }  // namespace quarvel

@@ -24,7 +24,8 @@ class SimulatedNotifications {
   /// Calls a name's handlers with a token that is not theirs.
   void deliverForeign(std::string_view name);
 
-  NotificationToken add(std::string name, WorkQueue& queue, NotificationHandler handler);
+  std::int32_t add(std::string_view name, NotificationToken& token, WorkQueue& queue,
+                   NotificationHandler handler);
   /// For the end of the simulation.
   void release() { registrations_.clear(); }
 

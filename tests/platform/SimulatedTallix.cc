@@ -1,16 +1,12 @@
 #include "tests/platform/SimulatedTallix.h"
 
-#include <algorithm>
-
 #include "platform/Tallix.h"
 #include "tests/platform/Simulation.h"
 
 namespace quarvel {
 
-class TallixChannelSet {
- public:
-  std::vector<std::size_t> channels;  // indices of the published ones
-};
+/// Indices of the published ones.
+class TallixChannelSet : public std::vector<std::size_t> {};
 
 class TallixSubscription {
  public:
@@ -23,10 +19,7 @@ class TallixChannelSample {
   std::int64_t value;
 };
 
-class TallixSampleSet {
- public:
-  std::vector<TallixChannelSample> samples;
-};
+class TallixSampleSet : public std::vector<TallixChannelSample> {};
 
 namespace {
 
@@ -44,22 +37,18 @@ TallixChannels TallixCopyChannelsInGroup(std::optional<std::string_view> group,
                                          std::optional<std::string_view> subgroup,
                                          std::optional<Error>& error) {
   if (Tallix().channelsError) error = Tallix().channelsError;
-  auto found = std::make_shared<TallixChannelSet>();
+  std::shared_ptr<TallixChannelSet> found;
   for (std::size_t i = 0; i < Tallix().channels.size(); ++i) {
     const SimulatedTallix::Channel& channel = Tallix().channels[i];
-    if (Matches(group, channel.group) && Matches(subgroup, channel.subgroup)) {
-      found->channels.push_back(i);
-    }
+    if (!Matches(group, channel.group) || !Matches(subgroup, channel.subgroup)) continue;
+    if (found == nullptr) found = std::make_shared<TallixChannelSet>();
+    if (channel.published) found->push_back(i);
   }
-  const bool known = std::ranges::any_of(Tallix().emptyGroups, [&](const auto& each) {
-    return Matches(group, each.first) && Matches(subgroup, each.second);
-  });
-  if (found->channels.empty() && !known) return nullptr;
   return found;
 }
 
 std::int32_t TallixGetChannelCount(const TallixChannelSet& channels) {
-  return static_cast<std::int32_t>(channels.channels.size());
+  return static_cast<std::int32_t>(channels.size());
 }
 
 std::shared_ptr<TallixSubscription> TallixCreateSubscription(const TallixChannels& channels,
@@ -78,9 +67,8 @@ TallixSamples TallixCreateSamples(TallixSubscription& subscription,
     return nullptr;
   }
   auto samples = std::make_shared<TallixSampleSet>();
-  for (const std::size_t i : subscribedChannels->channels) {
-    const SimulatedTallix::Channel& channel = Tallix().channels[i];
-    samples->samples.push_back({channel.name, channel.value});
+  for (const std::size_t i : *subscribedChannels) {
+    samples->push_back({Tallix().channels[i].name, Tallix().channels[i].value});
   }
   return samples;
 }
@@ -93,22 +81,17 @@ TallixSamples TallixCreateSamplesDelta(const TallixSamples& earlier, const Talli
     return nullptr;
   }
   auto delta = std::make_shared<TallixSampleSet>(*later);
-  for (std::size_t i = 0; i < delta->samples.size(); ++i) {
-    delta->samples[i].value -= earlier->samples.at(i).value;
-  }
+  for (std::size_t i = 0; i < delta->size(); ++i) (*delta)[i].value -= earlier->at(i).value;
   return delta;
 }
 
 void TallixIterate(const TallixSampleSet& samples,
                    const std::function<int(const TallixChannelSample&)>& visitor) {
-  for (const TallixChannelSample& sample : samples.samples) {
-    if (visitor(sample) != 0) return;
-  }
+  for (const TallixChannelSample& sample : samples) EXPECT_EQ(visitor(sample), 0);
 }
 
 std::optional<std::string_view> TallixChannelGetChannelName(const TallixChannelSample& sample) {
-  if (!sample.name) return std::nullopt;
-  return *sample.name;
+  return sample.name;
 }
 
 std::int64_t TallixSimpleGetIntegerValue(const TallixChannelSample& sample) {

@@ -3,7 +3,6 @@
 #include <cstdint>
 #include <optional>
 #include <string>
-#include <utility>
 #include <vector>
 
 #include "base/Error.h"
@@ -18,11 +17,10 @@ struct SimulatedTallix {
     Name subgroup;
     Name name;
     std::int64_t value = 0;
+    bool published = true;  // else its group is known all the same
   };
   /// What is published now. Channels may change their values but not vanish.
   std::vector<Channel> channels;
-  /// Groups, with subgroups, that are known although they publish nothing.
-  std::vector<std::pair<Name, Name>> emptyGroups;
 
   // Switches.
   std::optional<Error> channelsError;  // the channels are returned all the same

@@ -4,6 +4,8 @@
 
 #include <algorithm>
 
+#include <quarvel/vocabulary.hpp>
+
 #include "base/Json.h"
 
 namespace quarvel {
@@ -12,25 +14,14 @@ namespace {
 
 constexpr std::uint16_t kTest = 11;
 
-// The words for the codes that the simulated clients use.
-std::string CategoryName(std::uint32_t category) {
-  static const std::map<std::uint32_t, std::string> kNames = {{3, "Playback"},
-                                                              {0x2000'0003, "HAL_Playback"},
-                                                              {0x4000'0007, "Routing_RouteChange"},
-                                                              {0x2000'0007, "HAL_RouteChange"},
-                                                              {0x1000'1234, "DSP_Undefined"}};
-  return kNames.at(category);
-}
-
-std::string TypeName(std::uint16_t type) {
-  return type == 1 ? "Start" : type == 2 ? "Stop" : "Undefined";
-}
-
+// In the words of the client's library.
 std::string ServiceName(std::uint16_t type) {
-  static const std::map<std::uint16_t, std::string> kNames = {
-      {2, "telephony"},     {3, "haptics"},  {4, "alarms"},     {5, "standalone"},
-      {7, "longformaudio"}, {kTest, "test"}, {65535, "unknown"}};
-  return kNames.at(type);
+  return std::string(vocabulary::NameOf(vocabulary::ServiceType{type}));
+}
+
+std::string MessageName(std::uint32_t category, char separator, std::uint16_t type) {
+  return fmt::format("{}{}{}", vocabulary::NameOf(vocabulary::Category(category)), separator,
+                     vocabulary::NameOf(vocabulary::MessageType{type}));
 }
 
 Dictionary WithoutBlanksInKeys(const Dictionary& payload) {
@@ -232,8 +223,7 @@ void Model::offerToSinks(const Session& session, const Dictionary& payload, std:
   const Value named = application == nullptr ? Value("Unknown") : *application;
   Dictionary event = payload;
   event.set("HostApplicationDisplayID", named);
-  events.emplace_back(fmt::format("tarnwick.quarvel.{}.{}", CategoryName(category), TypeName(type)),
-                      event);
+  events.emplace_back("tarnwick.quarvel." + MessageName(category, '.', type), event);
   if (const Value* engineOnTime = payload.find("EngineOnTime")) {
     powerRecords.push_back({{"EngineOnDuration", *engineOnTime}, {"ApplicationName", named}});
   }
@@ -241,7 +231,7 @@ void Model::offerToSinks(const Session& session, const Dictionary& payload, std:
 
 void Model::deliver(Session& session, const Dictionary& payload, std::uint32_t category,
                     std::uint16_t type) {
-  const std::string name = CategoryName(category) + '_' + TypeName(type);
+  const std::string name = MessageName(category, '_', type);
   const std::string messageID = fmt::format("{}_{}", name, ++session.counts[name]);
   Dictionary enriched = WithoutBlanksInKeys(payload);
   if (session.started) {

@@ -58,7 +58,7 @@ void World::run() {
   const std::uint64_t steps = 10 + draw(30);
   for (std::uint64_t i = 0; i < steps; ++i) step();
   simulation_.agent.full = false;
-  for (Client& client : clients_) client.disconnect();
+  for (Client& client : clients_) client.end();
   std::ranges::move(clients_, std::back_inserter(gone_));
   clients_.clear();
   service_.run();
@@ -74,7 +74,7 @@ void World::step() {
   for (std::uint64_t calls = 1 + draw(8); calls > 0; --calls) act(clients_[draw(clients_.size())]);
   if (oneIn(8)) {
     const auto leaving = clients_.begin() + static_cast<std::ptrdiff_t>(draw(clients_.size()));
-    oneIn(2) ? leaving->interrupt() : leaving->disconnect();
+    leaving->end(oneIn(2));
     gone_.push_back(std::move(*leaving));
     clients_.erase(leaving);
   }

@@ -228,7 +228,7 @@ TEST(ServiceDelegate, EndsAClientOnceAndLetsItGo) {
       Client client = service.connect(-1);
       client.createStarted(7);
       service.run();
-      interrupted ? client.interrupt() : client.disconnect();
+      client.end(interrupted);
       service.run();
       const auto ofClient = [&](const std::string& line) {
         return std::ranges::count(service.journal.lines(), "log default zqrs " + line);
@@ -302,7 +302,7 @@ TEST(ClientUptime, IsReportedWhenTheConnectionEnds) {
       service.runFor(12750ms);
       service.scheduler.setWallClock(service.scheduler.wallClock() + each.clockStep);
       service.log.lines.clear();
-      client.disconnect();
+      client.end();
       service.run();
       Lines lines = service.log.texts(function);
       for (std::string& line : lines) line.erase(0, function.size());
@@ -322,7 +322,7 @@ SEEDED_TEST(ClientUptime, OfAClientThatLeftBeforeItWasRegistered, RunningService
   processes[42] = "player";
   ServerQueue().async([&] { scheduler.sleep(1s); });
   Client client(listener.connect(42));
-  client.disconnect();
+  client.end();
   run();
   const std::string function =
       "default zqrs " + kDelegate + "listener:shouldAcceptNewConnection:]: ";
