@@ -225,7 +225,11 @@ void Model::offerToSinks(const Session& session, const Dictionary& payload, std:
   event.set("HostApplicationDisplayID", named);
   events.emplace_back("tarnwick.quarvel." + MessageName(category, '.', type), event);
   if (const Value* engineOnTime = payload.find("EngineOnTime")) {
-    powerRecords.push_back({{"EngineOnDuration", *engineOnTime}, {"ApplicationName", named}});
+    Dictionary& record = powerRecords.emplace_back(
+        Dictionary{{"EngineOnDuration", *engineOnTime}, {"ApplicationName", named}});
+    if (const Value* timestamp = payload.find("zqreporting_timestamp")) {
+      record.set("TimestampEnd", *timestamp);
+    }
   }
 }
 

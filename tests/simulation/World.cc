@@ -50,6 +50,7 @@ Dictionary World::drawPayload() {
   if (oneIn(5)) payload.set("a_key", "the other");
   if (oneIn(5)) payload.set(7, Dictionary{{"in depth", List{1, 2.5, true, nullptr}}});
   if (oneIn(8)) payload.set("EngineOnTime", 1.5);
+  if (oneIn(3)) payload.set("zqreporting_timestamp", 7);
   if (oneIn(8)) payload.set("HostApplicationDisplayID", "Somebody Else");
   return payload;
 }
