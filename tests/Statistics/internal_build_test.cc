@@ -15,9 +15,9 @@ struct InternalBuild : testing::Test {
   // Says yes to whoever asks first; what later simulations say is not asked for any more.
   static void SetUpTestSuite() {
     Simulation simulation(1);
-    simulation.deviceProperties["InternalBuild"] = true;
+    simulation.internalBuild = true;
     ASSERT_TRUE(ZQReportingUtilityIsInternalBuild());
-    simulation.deviceProperties["InternalBuild"] = false;
+    simulation.internalBuild = false;
     ASSERT_TRUE(ZQReportingUtilityIsInternalBuild());
   }
 };
@@ -50,9 +50,7 @@ TEST_F(InternalBuild, OrientationIsFollowedForSomeServiceTypesAndDevices) {
   for (const Case& each : kCases) {
     SCOPED_TRACE(each.serviceType);
     SessionOwner owner(1, each.serviceType);
-    if (each.deviceClass) {
-      owner.deviceProperties["DeviceClassNumber"] = *each.deviceClass;
-    }
+    owner.deviceClass = each.deviceClass;
     owner.start();
     const std::size_t expected = each.followed ? 1 : 0;
     EXPECT_EQ(owner.orientation.device.count("ZQReportingService 7"), expected);
@@ -68,9 +66,9 @@ TEST_F(InternalBuild, OrientationChangesAreInTheHistoryToTheMillisecond) {
     SessionOwner owner(seed, kServiceTypeTelephony);
     owner.start();
     owner.runFor(1234560us);
-    owner.orientation.turnDevice(Orientation::landscapeLeft);
+    SimulatedOrientation::turn(owner.orientation.device, Orientation::landscapeLeft);
     owner.runFor(1s);
-    owner.orientation.turnUI(Orientation::portrait);
+    SimulatedOrientation::turn(owner.orientation.ui, Orientation::portrait);
     owner.runFor(0s);
     std::vector<Dictionary> entries;
     owner.session->aggregatedPayloadData()->forEach(

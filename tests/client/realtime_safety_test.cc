@@ -170,35 +170,21 @@ std::vector<std::string> Watch(Produce produce) {
   return called;
 }
 
-/// Takes one connection and reads what comes.
-class Sink {
- public:
-  Sink() {
+class RealtimeSafety : public ::testing::Test {
+ protected:
+  RealtimeSafety() {
     EXPECT_EQ(::listen(listener_, 1), 0);
-    reader_ = std::jthread([this] {
-      const int connection = ::accept(listener_, nullptr, nullptr);
+    client_.emplace(std::move(Client::connect(path_).value()));
+    // The service, which reads whatever comes.
+    reader_ = std::jthread([listener = listener_] {
+      const int connection = ::accept(listener, nullptr, nullptr);
       std::vector<char> bytes(65'536);
       while (::recv(connection, bytes.data(), bytes.size(), 0) > 0) continue;
       ::close(connection);
+      ::close(listener);
     });
   }
-  ~Sink() {
-    ::shutdown(listener_, SHUT_RDWR);
-    reader_.join();
-    ::close(listener_);
-  }
-  Sink(const Sink&) = delete;
-  Sink& operator=(const Sink&) = delete;
-  [[nodiscard]] std::string path() const { return directory_.path() / "reporting.sock"; }
 
- private:
-  const TemporaryDirectory directory_;
-  const int listener_ = BoundSocket(path(), SOCK_STREAM);
-  std::jthread reader_;
-};
-
-class RealtimeSafety : public ::testing::Test {
- protected:
   static bool record(RealtimeReporter& reporter, int number) {
     return reporter.record(vocabulary::Kind::playback, RealtimeReporter::MessageType::generic)
         .set("frames", number)
@@ -209,8 +195,11 @@ class RealtimeSafety : public ::testing::Test {
         .send();
   }
 
-  Sink sink_;
-  Client client_ = std::move(Client::connect(sink_.path()).value());
+  const TemporaryDirectory directory_;
+  const std::string path_ = directory_.path() / "reporting.sock";
+  const int listener_ = BoundSocket(path_, SOCK_STREAM);
+  std::jthread reader_;
+  std::optional<Client> client_;
 };
 
 // Records that fit, that are too large and that find the ring full, while the client's thread takes
@@ -219,7 +208,7 @@ TEST_F(RealtimeSafety, TheProducerNeitherAllocatesNorLocksNorCallsTheSystem) {
   constexpr int kRecords = 200'000;
   RealtimeReporter::Options options;
   options.interval = 1ms;
-  RealtimeReporter reporter(client_, 7, options);
+  RealtimeReporter reporter(*client_, 7, options);
   reporter.start();
   const std::string large(1'000, 'x');
   const auto called = Watch([&] {
@@ -240,7 +229,7 @@ TEST_F(RealtimeSafety, TheProducerNeitherAllocatesNorLocksNorCallsTheSystem) {
 
 // A watch that sees nothing proves nothing: each of these is put beside the records.
 TEST_F(RealtimeSafety, TheWatchSeesWhatAProducerMustNotDo) {
-  RealtimeReporter reporter(client_, 7);
+  RealtimeReporter reporter(*client_, 7);
   std::mutex mutex;
   const struct {
     const char* seen;

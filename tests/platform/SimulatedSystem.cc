@@ -46,33 +46,19 @@ void ExitProcess(int status) {
   throw ThreadEnded{};
 }
 
-namespace {
-
-template <class T>
-std::optional<T> DeviceProperty(std::string_view name) {
-  const auto& properties = Simulation::current().deviceProperties;
-  const auto found = properties.find(name);
-  if (found == properties.end()) return std::nullopt;
-  const T* value = std::get_if<T>(&found->second);
-  return value == nullptr ? std::nullopt : std::optional(*value);
-}
-
-}  // namespace
-
 std::optional<bool> DevicePropertyBoolean(std::string_view name) {
-  return DeviceProperty<bool>(name);
+  EXPECT_EQ(name, "InternalBuild");
+  return Simulation::current().internalBuild;
 }
 
 std::optional<std::int64_t> DevicePropertyInteger(std::string_view name) {
-  return DeviceProperty<std::int64_t>(name);
+  EXPECT_EQ(name, "DeviceClassNumber");
+  return Simulation::current().deviceClass;
 }
 
-void SimulatedOrientation::turn(Handlers SimulatedOrientation::*kind, Orientation orientation) {
-  Simulation::current().spawn("orientation", [this, kind, orientation] {
-    const Handlers handlers = this->*kind;
-    for (const auto& [callbackID, handler] : handlers) {
-      if ((this->*kind).contains(callbackID)) handler(orientation);
-    }
+void SimulatedOrientation::turn(const Handlers& handlers, Orientation orientation) {
+  Simulation::current().spawn("orientation", [&handlers, orientation] {
+    for (const auto& [callbackID, handler] : handlers) handler(orientation);
   });
 }
 

@@ -33,11 +33,8 @@ class SimulatedOrientation {
   Handlers device;
   Handlers ui;
 
-  void turnDevice(Orientation orientation) { turn(&SimulatedOrientation::device, orientation); }
-  void turnUI(Orientation orientation) { turn(&SimulatedOrientation::ui, orientation); }
-
- private:
-  void turn(Handlers SimulatedOrientation::*kind, Orientation orientation);
+  /// Tells `device` or `ui`.
+  static void turn(const Handlers& handlers, Orientation orientation);
 };
 
 struct SimulatedFiles {

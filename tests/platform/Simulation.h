@@ -5,9 +5,9 @@
 #include <chrono>
 #include <cstdint>
 #include <map>
+#include <optional>
 #include <string>
 #include <string_view>
-#include <variant>
 #include <vector>
 
 #include "platform/WorkQueue.h"
@@ -97,7 +97,9 @@ class Simulation {
   /// Switch: what the platform gets wrong.
   Lie lie = Lie::none;
   std::vector<CreatedQueue> queues;
-  std::map<std::string, std::variant<bool, std::int64_t>, std::less<>> deviceProperties;
+  // Device properties.
+  bool internalBuild = false;
+  std::optional<std::int64_t> deviceClass;
 
   Journal journal;
   SimulatedCounters counters;

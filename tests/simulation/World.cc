@@ -30,13 +30,10 @@ bool World::isInternalBuild() {
 
 World::World(std::uint64_t seed, Lie lie)
     : random_(~seed),
-      service_(seed,
-               [](Simulation& simulation) {
-                 simulation.deviceProperties["InternalBuild"] = isInternalBuild();
-               }),
+      service_(seed, [](Simulation& simulation) { simulation.internalBuild = isInternalBuild(); }),
       simulation_(service_) {
   simulation_.lie = lie;
-  simulation_.deviceProperties["DeviceClassNumber"] = std::int64_t{oneIn(2) ? 6 : 1};
+  simulation_.deviceClass = oneIn(2) ? 6 : 1;
   simulation_.spuriousWakeUps = oneIn(4);
 }
 

@@ -1,6 +1,5 @@
+#include <fmt/format.h>
 #include <gmock/gmock.h>
-
-#include <algorithm>
 
 #include "tests/Statistics/Service/RunningService.h"
 
@@ -14,6 +13,7 @@ using testing::Contains;
 using testing::ElementsAre;
 using testing::IsEmpty;
 using testing::StartsWith;
+using testing::UnorderedElementsAreArray;
 using Lines = std::vector<std::string>;
 
 const Value kYes(true);
@@ -145,10 +145,12 @@ TEST(ServerInstance, AStopReportsWhatTheDriversCountedSinceTheStart) {
     Client client = service.connect(42);
     client.createStarted(7);
     service.run();
-    std::int64_t values[] = {11, 9, 17, 13, 99};
-    for (auto& channel : service.tallix.channels) {
-      channel.value = values[&channel - service.tallix.channels.data()];
-    }
+    auto& channels = service.tallix.channels;
+    channels[0].value = 11;
+    channels[1].value = 9;
+    channels[2].value = 17;
+    channels[3].value = 13;
+    channels[4].value = 99;
     client.stop(7);
     service.run();
     const auto& messages = service.agent.sessions.at(0).messages;
@@ -221,32 +223,6 @@ SEEDED_TEST(Routing, AnAgentWithoutRoomHoldsNobodyUp, RunningService) {
   run();
 }
 
-TEST(ServiceDelegate, EndsAClientOnceAndLetsItGo) {
-  for (const auto seed : Seeds()) {
-    for (const bool interrupted : {true, false}) {
-      RunningService service(seed);
-      Client client = service.connect(-1);
-      client.createStarted(7);
-      service.run();
-      client.end(interrupted);
-      service.run();
-      const auto ofClient = [&](const std::string& line) {
-        return std::ranges::count(service.journal.lines(), "log default zqrs " + line);
-      };
-      EXPECT_EQ(ofClient(kDelegate + "listener:shouldAcceptNewConnection:]: InterruptionHandler: "
-                                     "connection exited"),
-                interrupted ? 1 : 0);
-      EXPECT_EQ(
-          ofClient(kInstance + "initWithPID:delegate:]: new client with pid 18446744073709551615"),
-          1);
-      EXPECT_EQ(
-          ofClient(kInstance + "handleConnectionError]: removing -1 from the server client list"),
-          1);
-      EXPECT_EQ(ofClient(kInstance + "dealloc]: dealloc -1 from the server client list"), 1);
-    }
-  }
-}
-
 SEEDED_TEST(Preferences, AreNotReadForAForeignNotification, RunningService) {
   log.lines.clear();
   notifications.deliverForeign("tarnwick.quarvel.reporting");
@@ -264,55 +240,62 @@ TEST(Preferences, TheServiceRunsOnWithoutNotifications) {
   EXPECT_THAT(created->results, ElementsAre(kYes));
 }
 
-TEST(ClientUptime, IsReportedWhenTheConnectionEnds) {
+TEST(ClientUptime, IsReportedWhenAClientEndsWhichItDoesOnce) {
   struct Case {
-    const char* name;
-    const char* process;  // none: unknown to the kernel
+    std::int32_t pid;
+    bool interrupted;
     std::chrono::seconds clockStep;
     std::optional<double> seconds;
     Lines lines;
   };
   const Case kCases[] = {
-      {"a fraction is cut in the line only",
-       "player",
+      {42,
+       true,
        0s,
-       12.75,
-       {"InvalidationHandler: connection exited process=player uptime_sec=12"}},
-      {"the clock went back",
-       "player",
+       12.75,  // the fraction is cut in the line only
+       {"InterruptionHandler: connection exited",
+        "InvalidationHandler: connection exited process=player uptime_sec=12"}},
+      {42,
+       false,
        -60s,
        47.25,
        {"clientStartDate is in the past. clientpid=42 clientprocessname=player",
         "InvalidationHandler: connection exited process=player uptime_sec=47"}},
-      {"a process without a name",
-       nullptr,
+      {-1,  // has no name
+       false,
        0s,
        std::nullopt,
        {"InvalidationHandler: connection exited process=(null) uptime_sec=12",
-        "clientProcessName is nil. clientpid=42"}},
+        "clientProcessName is nil. clientpid=-1"}},
   };
-  const std::string function =
-      "default zqrs " + kDelegate + "listener:shouldAcceptNewConnection:]: ";
+  const std::string function = "listener:shouldAcceptNewConnection:]: ";
   for (const Case& each : kCases) {
     for (const auto seed : Seeds()) {
-      SCOPED_TRACE(each.name);
+      SCOPED_TRACE(each.lines.back());
       RunningService service(seed);
-      if (each.process != nullptr) service.processes[42] = each.process;
-      Client client = service.connect(42);
+      service.processes[42] = "player";
+      Client client = service.connect(each.pid);
+      EXPECT_EQ(service.log.texts().back(),
+                fmt::format("default zqrs {}initWithPID:delegate:]: new client with pid {}",
+                            kInstance, static_cast<std::uint64_t>(each.pid)));
       service.runFor(12750ms);
       service.scheduler.setWallClock(service.scheduler.wallClock() + each.clockStep);
       service.log.lines.clear();
-      client.end();
+      client.end(each.interrupted);
       service.run();
-      Lines lines = service.log.texts(function);
-      for (std::string& line : lines) line.erase(0, function.size());
-      EXPECT_EQ(lines, each.lines);
+      Lines expected = {
+          fmt::format("{}handleConnectionError]: removing {} from the server client list",
+                      kInstance, each.pid),
+          fmt::format("{}dealloc]: dealloc {} from the server client list", kInstance, each.pid)};
+      for (const std::string& line : each.lines) expected.push_back(kDelegate + function + line);
+      for (std::string& line : expected) line.insert(0, "default zqrs ");
+      EXPECT_THAT(service.log.texts(), UnorderedElementsAreArray(expected));
       const auto& events = service.vistrel.events;
       ASSERT_EQ(events.size(), each.seconds ? 1U : 0U);
       if (each.seconds) {
         EXPECT_EQ(events[0].name, "tarnwick.quarvel.zqreportingclientuptime");
         EXPECT_EQ(events[0].payload.root().toDictionary(),
-                  (Dictionary{{"processName", each.process}, {"seconds", *each.seconds}}));
+                  (Dictionary{{"processName", "player"}, {"seconds", *each.seconds}}));
       }
     }
   }
