@@ -32,14 +32,14 @@ struct Throttled : Simulation {
   using Simulation::Simulation;
 
   /// Adds a message whose block is called `name`; from a simulated thread or the test.
-  void add(std::string name, const Payload& message = Payload(), ReporterID reporterID = 7) {
+  void add(std::string name, const Payload& message = Payload()) {
     const auto token = std::make_shared<int>();
     blocks[name] = token;
     throttle->addMessageBlock(
         [this, name, token] {
           ran.push_back({name, elapsed()});
         },
-        reporterID, message, 3, 1);
+        7, message, 3, 1);
   }
   /// From a caller's thread, when the time has come.
   void addAt(Scheduler::Duration time, const std::string& name,
@@ -207,18 +207,8 @@ SEEDED_TEST(BlockThrottle, AMessageThatComesWhileOthersWaitIsTakenUpAfterThem, T
   EXPECT_THAT(names(), ElementsAre("long", "short"));
 }
 
-SEEDED_TEST(BlockThrottle, BlocksRunOneAtATimeAndMayAddMessages, Throttled) {
-  int running = 0;
-  for (int i = 0; i < 3; ++i) {
-    throttle->addMessageBlock(
-        [&, i] {
-          EXPECT_EQ(++running, 1);
-          SleepThread(50ms);
-          if (i == 0) add("again", Payload(), 0);
-          --running;
-        },
-        i, Payload(), 3, 1);
-  }
+SEEDED_TEST(BlockThrottle, ABlockMayAddItsMessageAgainAndMayBeEmpty, Throttled) {
+  throttle->addMessageBlock([&] { add("again"); }, 7, Payload(), 3, 1);
   throttle->addMessageBlock(Block(), 9, Payload(), 3, 1);
   runUntil(2s);
   EXPECT_THAT(names(), ElementsAre("again"));
