@@ -108,7 +108,7 @@ Outcome PrintLedger(StoreReader& store, std::int64_t last, bool json) {
                {"BYTES", true},
                {"OUTCOME"}},
               Terminal::standardOutput());
-  const auto read = store.exports(last, [&](const StoredExport& line) {
+  auto read = store.exports(last, [&](const StoredExport& line) {
     if (json) {
       fmt::print("{}\n", JsonText(Dictionary{{"id", line.id},
                                              {"at", line.at},

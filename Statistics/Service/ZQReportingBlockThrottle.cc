@@ -245,7 +245,7 @@ void ZQReportingBlockThrottle::addMessageBlock(Block block, ReporterID reporterI
   if (duplicate) {
     ZQ_LOG(Scope(), debug, "Dropping duplicate message for {}", key);
     duplicate->sleepFor(seconds);
-    duplicate->setBlock(std::move(block));
+    duplicate->setBlock(std::move(block));  // NOLINT(bugprone-use-after-move): not moved above
     return;
   }
   const MutexLock lock(unscheduledMutex_);

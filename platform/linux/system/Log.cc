@@ -56,7 +56,7 @@ void SetLogScopeVerbose(LogHandle scope, bool verbose) {
   scope->verbose.store(verbose, std::memory_order_relaxed);
 }
 
-void FollowLogScopes(std::function<void(const LogScopeSwitch&)> follower) {
+void FollowLogScopes(const std::function<void(const LogScopeSwitch&)>& follower) {
   std::map<std::uint32_t, const LogScope*> registered;
   {
     const MutexLock lock(scopes().mutex);

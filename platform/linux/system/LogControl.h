@@ -27,6 +27,6 @@ struct LogScopeSwitch {
 /// Has `follower` told of every scope: of those registered already now, on the calling thread; of
 /// each later one on the thread that registers it, before `ZQLogRegister` returns there. There is
 /// one follower, the preferences facility.
-void FollowLogScopes(std::function<void(const LogScopeSwitch&)> follower);
+void FollowLogScopes(const std::function<void(const LogScopeSwitch&)>& follower);
 
 }  // namespace quarvel

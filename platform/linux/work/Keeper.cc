@@ -56,7 +56,7 @@ void Keeper::after(std::chrono::milliseconds delay, std::shared_ptr<Lane> lane, 
       const auto place = delayed_.emplace(std::pair(due, delays_++), std::move(delayed)).first;
       first = place == delayed_.begin();
       ActivityBegan();
-      delayed.lane = nullptr;
+      delayed.lane = nullptr;  // NOLINT(bugprone-use-after-move): a new value
     }
   }
   if (first) changed_.notifyOne();

@@ -48,7 +48,7 @@ class Exporter {
   /// How long an engine with nothing to do keeps its connection.
   static constexpr std::chrono::seconds kRestAfter{30};
   static constexpr std::size_t kBatchRows = 1000;
-  static constexpr std::size_t kBatchBytes = std::size_t{512} * 1024;
+  static constexpr std::size_t kBatchBytes = 512 * 1024;
   /// So many rows refused one by one, and none taken, and the rest of a batch is not tried singly.
   static constexpr int kRefusalsInARow = 8;
 

@@ -1,6 +1,7 @@
 #include "platform/linux/store/export/HttpPoster.h"
 
 #include <curl/curl.h>
+#include <fmt/format.h>
 
 #include <array>
 #include <cstdlib>
@@ -45,7 +46,7 @@ struct HttpPoster::Connection {
     headers.reset(OrAbort(curl_slist_append(nullptr, "Expect:")));
     for (const auto& [name, value] : options.headers) {
       // A header without a value is written with a semicolon.
-      const std::string line = value.empty() ? name + ";" : name + ": " + value;
+      const std::string line = value.empty() ? name + ";" : fmt::format("{}: {}", name, value);
       OrAbort(curl_slist_append(headers.get(), line.c_str()));
     }
     set(CURLOPT_URL, options.url.c_str());
