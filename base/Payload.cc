@@ -5,10 +5,10 @@
 #include <algorithm>
 #include <bit>
 #include <limits>
-#include <unordered_set>
 #include <vector>
 
 #include "base/MessagePack.h"
+#include "base/SecretHash.h"
 #include "base/Utf8.h"
 
 namespace quarvel {
@@ -140,35 +140,63 @@ namespace {
 
 constexpr const char* kEmptyDictionary = "\x80";
 
+/// The keys of one dictionary, however large, by what they are equal to. Points into its bytes.
+class KeyTable {
+ public:
+  explicit KeyTable(PayloadValue dictionary)
+      : bytes_(dictionary.data()),
+        places_(std::bit_ceil(dictionary.count() + dictionary.count() / 2 + 1)) {}
+
+  /// Puts the key that begins at `key`, a string or an integer, in the place of an equal one, and
+  /// returns that; null when there is none.
+  const char* put(const char* key) {
+    std::uint32_t& place = placeOf(key);
+    const char* const before = at(place);
+    place = static_cast<std::uint32_t>(key - bytes_);
+    return before;
+  }
+  [[nodiscard]] const char* find(const char* key) { return at(placeOf(key)); }
+
+ private:
+  static std::uint64_t hash(PayloadValue key) {
+    if (const auto text = key.string()) return SecretHash::of(*text);
+    const auto number = key.integer();
+    return SecretHash::of(number ? static_cast<std::uint64_t>(*number) : *key.unsignedInteger());
+  }
+  static bool areEqual(PayloadValue one, PayloadValue other) {
+    return one.string() == other.string() && one.integer() == other.integer() &&
+           one.unsignedInteger() == other.unsignedInteger();
+  }
+
+  [[nodiscard]] const char* at(std::uint32_t place) const {
+    return place == 0 ? nullptr : bytes_ + place;
+  }
+  std::uint32_t& placeOf(const char* key) {
+    const std::size_t mask = places_.size() - 1;
+    std::size_t i = hash(PayloadValue(key)) & mask;
+    while (places_[i] != 0 && !areEqual(PayloadValue(at(places_[i])), PayloadValue(key))) {
+      i = (i + 1) & mask;
+    }
+    return places_[i];
+  }
+
+  const char* const bytes_;
+  // From the dictionary's first byte, which no key is; a message has 1 GiB at most.
+  std::vector<std::uint32_t> places_;
+};
+
 /// The keys of one dictionary, to find equal ones. A client's dictionary is small, so comparing is
 /// cheapest; a large one may be meant to make that expensive.
 class SeenKeys {
  public:
-  explicit SeenKeys(std::size_t count) : isSmall_(count <= kSmall) {}
+  explicit SeenKeys(PayloadValue dictionary)
+      : dictionary_(dictionary), isSmall_(dictionary.count() <= kSmall) {}
 
-  /// Whether the key is new for certain.
-  bool add(std::string_view text) {
-    if (!isSmall_) return sets().texts.insert(text).second;
-    const auto at = [&text](std::size_t i) -> std::size_t {
-      return static_cast<unsigned char>(text[i]);
-    };
-    const std::size_t mark =
-        text.empty() ? 0 : text.size() + 7 * at(text.size() / 2) + 31 * at(text.size() - 1);
-    if (isMarked(mark)) {
-      for (std::size_t i = 0; i < count_; ++i) {
-        if (std::string_view(small_[i].text, small_[i].length) == text) return false;
-      }
-    }
-    small_[count_++] = {text.data(), text.size()};
-    return true;
-  }
-  bool add(PayloadValue integer) {
-    // Signed and unsigned numbers of the same bits are different keys, but so rare a meeting may as
-    // well take the slow path, which tells them apart.
-    const auto number = integer.integer();
-    return sets()
-        .numbers.insert(number ? static_cast<std::uint64_t>(*number) : *integer.unsignedInteger())
-        .second;
+  /// Adds the key that begins at `key`, and says whether it is new. `text` is the key if it is one.
+  bool add(const char* key, const std::optional<std::string_view>& text) {
+    if (isSmall_ && text) return addSmall(*text);
+    if (!table_) table_.emplace(dictionary_);
+    return table_->put(key) == nullptr;
   }
 
  private:
@@ -178,16 +206,21 @@ class SeenKeys {
     const char* text;
     std::size_t length;
   };
-  struct Sets {
-    std::unordered_set<std::string_view> texts;
-    std::unordered_set<std::uint64_t> numbers;
-  };
 
-  Sets& sets() {
-    if (!sets_) sets_.emplace();
-    return *sets_;
+  bool addSmall(std::string_view text) {
+    const auto at = [&text](std::size_t i) -> std::size_t {
+      return static_cast<unsigned char>(text[i]);
+    };
+    const std::size_t mark =
+        text.empty() ? 0 : text.size() + 7 * at(text.size() / 2) + 31 * at(text.size() - 1);
+    if (isMarked(mark)) {
+      for (std::size_t i = 0; i < added_; ++i) {
+        if (std::string_view(small_[i].text, small_[i].length) == text) return false;
+      }
+    }
+    small_[added_++] = {text.data(), text.size()};
+    return true;
   }
-
   /// Marks, and says whether it was: two keys with different marks are different.
   bool isMarked(std::size_t mark) {
     std::uint64_t& word = marks_[mark / 64 % marks_.size()];
@@ -197,11 +230,12 @@ class SeenKeys {
     return was;
   }
 
+  const PayloadValue dictionary_;
   const bool isSmall_;
   std::array<std::uint64_t, 4> marks_{};
-  std::array<Span, kSmall> small_;  // the first `count_`; the rest is not initialised
-  std::size_t count_ = 0;
-  std::optional<Sets> sets_;
+  std::array<Span, kSmall> small_;  // the first `added_`; the rest is not initialised
+  std::size_t added_ = 0;
+  std::optional<KeyTable> table_;
 };
 
 /// Walks a well-formed value once: what makes it no payload, and whether it needs rewriting.
@@ -237,25 +271,21 @@ class Inspection {
   }
 
   [[nodiscard]] const std::string& fault() const { return fault_; }
-  [[nodiscard]] bool mayHaveEqualKeys() const { return mayHaveEqualKeys_; }
+  [[nodiscard]] bool hasEqualKeys() const { return hasEqualKeys_; }
 
  private:
   const char* inspectEntries(const char* dictionary) {
     const std::uint64_t count = Form::at(dictionary).length(dictionary);
-    SeenKeys seen(static_cast<std::size_t>(count));
+    SeenKeys seen{PayloadValue(dictionary)};
     const char* at = BodyOf(dictionary);
     for (std::uint64_t left = count; left > 0; --left) {
       const PayloadValue key(at);
-      if (const auto text = key.string()) {
-        if (!IsUtf8(*text)) return refuse(kNotUtf8);
-        mayHaveEqualKeys_ |= !seen.add(*text);
-        at = text->data() + text->size();
-      } else if (key.isInteger()) {
-        mayHaveEqualKeys_ |= !seen.add(key);
-        at = AfterMessagePack(at);
-      } else {
-        return refuse("a key in it is neither a string nor an integer");
+      const auto text = key.string();
+      if (text ? !IsUtf8(*text) : !key.isInteger()) {
+        return refuse(text ? kNotUtf8 : "a key in it is neither a string nor an integer");
       }
+      hasEqualKeys_ |= !seen.add(at, text);
+      at = text ? text->data() + text->size() : AfterMessagePack(at);
       at = inspect(at);
       if (at == nullptr) return nullptr;
     }
@@ -269,22 +299,16 @@ class Inspection {
   static constexpr const char* kNotUtf8 = "a string in it is not UTF-8";
 
   std::string fault_;
-  bool mayHaveEqualKeys_ = false;
+  bool hasEqualKeys_ = false;
 };
 
-/// Whether a payload's own keys may be equal; false is certain.
-bool MayHaveEqualKeys(PayloadValue dictionary) {
-  SeenKeys seen(dictionary.count());
+bool HasEqualKeys(PayloadValue dictionary) {
+  SeenKeys seen(dictionary);
   for (const PayloadEntry& entry : dictionary.entries()) {
-    const auto text = entry.key.string();
-    if (text ? !seen.add(*text) : !seen.add(entry.key)) return true;
+    if (!seen.add(entry.key.data(), entry.key.string())) return true;
   }
   return false;
 }
-
-struct KeyHash {
-  std::size_t operator()(const Key& key) const { return key.hash(); }
-};
 
 /// Writes a value again, each dictionary without the entries whose key comes again later.
 void WriteWithLastKeys(MessagePackWriter& writer, PayloadValue value) {
@@ -292,13 +316,14 @@ void WriteWithLastKeys(MessagePackWriter& writer, PayloadValue value) {
     writer.list(value.count());
     for (const PayloadValue item : value.items()) WriteWithLastKeys(writer, item);
   } else if (value.kind() == Value::Kind::dictionary) {
-    std::unordered_map<Key, std::size_t, KeyHash> last;
-    std::size_t index = 0;
-    for (const PayloadEntry& entry : value.entries()) last[KeyOf(entry.key)] = index++;
-    writer.dictionary(last.size());
-    index = 0;
+    KeyTable last(value);
+    std::size_t count = 0;
     for (const PayloadEntry& entry : value.entries()) {
-      if (last[KeyOf(entry.key)] != index++) continue;
+      if (last.put(entry.key.data()) == nullptr) ++count;
+    }
+    writer.dictionary(count);
+    for (const PayloadEntry& entry : value.entries()) {
+      if (last.find(entry.key.data()) != entry.key.data()) continue;
       writer.encoded(entry.key.encoded());
       WriteWithLastKeys(writer, entry.value);
     }
@@ -345,11 +370,12 @@ Result<Payload> Payload::from(PayloadValue dictionary) {
   };
   if (dictionary.kind() != Value::Kind::dictionary) return refuse("it is not a dictionary");
   Inspection inspection;
-  const char* const end = inspection.inspect(dictionary.at_);
+  const char* const end = inspection.inspect(dictionary.data());
   if (end == nullptr) return refuse(inspection.fault());
-  const std::string_view encoded(dictionary.at_, static_cast<std::size_t>(end - dictionary.at_));
+  const std::string_view encoded(dictionary.data(),
+                                 static_cast<std::size_t>(end - dictionary.data()));
   if (encoded.size() > std::numeric_limits<std::uint32_t>::max()) return refuse("it is over 4 GiB");
-  if (!inspection.mayHaveEqualKeys()) return Payload(encoded);
+  if (!inspection.hasEqualKeys()) return Payload(encoded);
   std::string rewritten;
   rewritten.reserve(encoded.size());
   MessagePackWriter writer(rewritten);
@@ -404,7 +430,7 @@ Payload Payload::replacingInKeys(char from, char to) const {
     }
     writer.encoded(entry.value.encoded());
   }
-  if (!MayHaveEqualKeys(PayloadValue(rewritten.data()))) return Payload(rewritten);
+  if (!HasEqualKeys(PayloadValue(rewritten.data()))) return Payload(rewritten);
   std::string unique;
   MessagePackWriter uniqueWriter(unique);
   WriteWithLastKeys(uniqueWriter, PayloadValue(rewritten.data()));

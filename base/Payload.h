@@ -71,7 +71,9 @@ class PayloadValue {
   /// A dictionary's value under a key; none for other kinds.
   [[nodiscard]] std::optional<PayloadValue> find(std::string_view key) const;
 
-  /// The value's own MessagePack bytes.
+  /// The value's first byte.
+  [[nodiscard]] const char* data() const { return at_; }
+  /// The value's own MessagePack bytes; a walk to its end.
   [[nodiscard]] std::string_view encoded() const {
     return {at_, static_cast<std::size_t>(AfterMessagePack(at_) - at_)};
   }
@@ -86,7 +88,6 @@ class PayloadValue {
     return std::string_view(at_ + form.headBytes, static_cast<std::size_t>(form.length(at_)));
   }
 
-  friend class Payload;
   const char* at_;
 };
 

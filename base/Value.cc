@@ -2,7 +2,16 @@
 
 #include <algorithm>
 
+#include "base/SecretHash.h"
+
 namespace quarvel {
+
+std::size_t Key::hash() const {
+  if (const auto* text = string()) return SecretHash::of(*text);
+  const auto* number = integer();
+  return SecretHash::of(number != nullptr ? static_cast<std::uint64_t>(*number)
+                                          : *unsignedInteger());
+}
 
 Value::Value(List list) : value_(std::move(list)) {}
 Value::Value(Dictionary dictionary) : value_(DictionaryBox(std::move(dictionary))) {}

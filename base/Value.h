@@ -51,9 +51,7 @@ class Key {
   [[nodiscard]] const std::uint64_t* unsignedInteger() const {
     return std::get_if<std::uint64_t>(&key_);
   }
-  [[nodiscard]] std::size_t hash() const {
-    return std::hash<std::variant<std::string, std::int64_t, std::uint64_t>>{}(key_);
-  }
+  [[nodiscard]] std::size_t hash() const;
   bool operator==(const Key&) const = default;
 
  private:

@@ -48,11 +48,17 @@ TEST(Payload, RefusesWhatIsNoPayload) {
 }
 
 TEST(Payload, OfEqualKeysTheLastCounts) {
+  // Texts of all lengths, and numbers of which some have the same bits, each twice.
+  constexpr std::int64_t kKeys = 3000;
   std::string many;
   MessagePackWriter writer(many);
-  writer.dictionary(100);
-  for (int i = 0; i < 100; ++i) {
-    writer.integer(i % 50);
+  writer.dictionary(2 * kKeys);
+  for (std::int64_t i = 0; i < 2 * kKeys; ++i) {
+    const std::int64_t nth = i % kKeys / 3;
+    if (i % 3 == 0)
+      writer.string(std::string(static_cast<std::size_t>(nth % 40), 'k') + std::to_string(nth));
+    if (i % 3 == 1) writer.integer(-1 - nth);
+    if (i % 3 == 2) writer.unsignedInteger(static_cast<std::uint64_t>(-1 - nth));
     writer.integer(i);
   }
   const struct {
@@ -82,9 +88,9 @@ TEST(Payload, OfEqualKeysTheLastCounts) {
     EXPECT_EQ(JsonText(Payload::from(PayloadValue(row.bytes.data())).value()), row.json);
   }
   const Payload unique = Payload::from(PayloadValue(many.data())).value();
-  EXPECT_EQ(unique.count(), 50);
-  for (const PayloadEntry& entry : unique)
-    EXPECT_EQ(*entry.key.integer() + 50, entry.value.integer());
+  EXPECT_EQ(unique.count(), kKeys);
+  std::int64_t expected = kKeys;
+  for (const PayloadEntry& entry : unique) EXPECT_EQ(entry.value.integer(), expected++);
 }
 
 TEST(Payload, ReplacesInItsOwnKeysOnly) {

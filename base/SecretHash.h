@@ -1,0 +1,65 @@
+#pragma once
+
+#include <cstdint>
+#include <cstring>
+#include <random>
+#include <string_view>
+
+namespace quarvel {
+
+/// A hash with a secret of the process in it, for what clients choose: nobody can write keys that
+/// all fall into one place. Folded multiplication, as in wyhash (Wang Yi, 2019; public domain).
+class SecretHash {
+ public:
+  static std::uint64_t of(std::uint64_t number) {
+    const auto& [first, second] = secret();
+    return fold(number ^ first, second);
+  }
+  static std::uint64_t of(std::string_view text) {
+    const auto& [first, second] = secret();
+    const char* at = text.data();
+    std::size_t left = text.size();
+    std::uint64_t hash = first;
+    for (; left > 16; left -= 16, at += 16) {
+      hash = fold(load<std::uint64_t>(at) ^ second, load<std::uint64_t>(at + 8) ^ hash);
+    }
+    std::uint64_t low = 0;
+    std::uint64_t high = 0;
+    if (left >= 8) {
+      low = load<std::uint64_t>(at);
+      high = load<std::uint64_t>(at + left - 8);
+    } else if (left >= 4) {
+      low = load<std::uint32_t>(at);
+      high = load<std::uint32_t>(at + left - 4);
+    } else {
+      for (; left > 0; --left) low = low << 8 | static_cast<unsigned char>(*at++);
+    }
+    return fold(second ^ text.size(), fold(low ^ second, high ^ hash));
+  }
+
+ private:
+  struct Secret {
+    std::uint64_t first, second;
+  };
+  static const Secret& secret() {
+    static const Secret drawn = [] {
+      std::random_device device;
+      const auto number = [&device] { return std::uint64_t{device()} << 32 | device(); };
+      return Secret{number(), number()};
+    }();
+    return drawn;
+  }
+  static std::uint64_t fold(std::uint64_t a, std::uint64_t b) {
+    __extension__ using Wide = unsigned __int128;
+    const Wide product = Wide{a} * b;
+    return static_cast<std::uint64_t>(product) ^ static_cast<std::uint64_t>(product >> 64);
+  }
+  template <class Unsigned>
+  static std::uint64_t load(const char* from) {
+    Unsigned bytes;
+    std::memcpy(&bytes, from, sizeof bytes);
+    return bytes;
+  }
+};
+
+}  // namespace quarvel
