@@ -33,6 +33,12 @@ MessagePackScanner::Progress MessagePackScanner::scan(std::string_view bytes) {
   std::uint64_t left = left_;
   unsigned depth = depth_;
   while (left > 0 && position < bytes.size()) {
+    const std::uint64_t passed =
+        OneByteValues(bytes.data() + position,
+                      std::min({left - 1, std::uint64_t{bytes.size() - position - 1},
+                                std::uint64_t{maximumBytes_ - std::min(position, maximumBytes_)}}));
+    position += passed;
+    left -= passed;
     const char* const value = bytes.data() + position;
     const MessagePackForm& form = MessagePackForm::at(value);
     if (form.kind == MessagePackForm::Kind::unused) {

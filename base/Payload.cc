@@ -258,6 +258,9 @@ class Inspection {
       case Form::Kind::list: {
         const char* at = BodyOf(value);
         for (std::uint64_t left = form.length(value); left > 0 && at != nullptr; --left) {
+          const std::uint64_t passed = OneByteValues(at, left - 1);
+          at += passed;
+          left -= passed;
           at = inspect(at);
         }
         return at;
