@@ -49,10 +49,13 @@ class SecretHash {
     }();
     return drawn;
   }
+  /// The halves of the 128 bits of the product, one folded onto the other.
   static std::uint64_t fold(std::uint64_t a, std::uint64_t b) {
-    __extension__ using Wide = unsigned __int128;
-    const Wide product = Wide{a} * b;
-    return static_cast<std::uint64_t>(product) ^ static_cast<std::uint64_t>(product >> 64);
+    constexpr std::uint64_t kLow = 0xffff'ffff;
+    const std::uint64_t first = (a >> 32) * (b & kLow) + ((a & kLow) * (b & kLow) >> 32);
+    const std::uint64_t second = (a & kLow) * (b >> 32) + (first & kLow);
+    const std::uint64_t high = (a >> 32) * (b >> 32) + (first >> 32) + (second >> 32);
+    return high ^ (a * b);
   }
   template <class Unsigned>
   static std::uint64_t load(const char* from) {
