@@ -150,9 +150,11 @@ class KeyTable {
   /// Puts the key that begins at `key`, a string or an integer, in the place of an equal one, and
   /// returns that; null when there is none.
   const char* put(const char* key) {
+    const auto offset = static_cast<std::uint64_t>(key - bytes_);
+    if (offset > std::numeric_limits<std::uint32_t>::max()) return nullptr;  // it is no payload
     std::uint32_t& place = placeOf(key);
     const char* const before = at(place);
-    place = static_cast<std::uint32_t>(key - bytes_);
+    place = static_cast<std::uint32_t>(offset);
     return before;
   }
   [[nodiscard]] const char* find(const char* key) { return at(placeOf(key)); }
@@ -181,7 +183,7 @@ class KeyTable {
   }
 
   const char* const bytes_;
-  // From the dictionary's first byte, which no key is; a message has 1 GiB at most.
+  // From the dictionary's first byte, which no key is.
   std::vector<std::uint32_t> places_;
 };
 
