@@ -48,7 +48,7 @@ void FileCalls::reset(const std::filesystem::path& directory) {
   directory_ = directory.string();
   open_.clear();
   counts_ = {};
-  hold_.reset();
+  letGo();
   recording_ = false;
   fault_.reset();
   calls_ = {};
@@ -68,7 +68,13 @@ void FileCalls::hold(Purpose purpose) {
 
 void FileCalls::release() {
   MutexLock lock(mutex_);
+  letGo();
+}
+
+void FileCalls::letGo() {
   hold_.reset();
+  held_ = 0;
+  ++releases_;
   released_.notifyAll();
 }
 
@@ -138,8 +144,8 @@ int FileCalls::admitLocked(Purpose purpose) {
 void FileCalls::passHold(Purpose purpose) {
   if (hold_ != purpose) return;
   ++held_;
-  while (hold_ == purpose) released_.wait(mutex_);
-  --held_;
+  const std::size_t before = releases_;
+  while (releases_ == before) released_.wait(mutex_);
 }
 
 int FileCalls::admit(Purpose purpose) {

@@ -39,7 +39,8 @@ class FileCalls {
 
   // Switches.
 
-  /// From now on writes to a write-ahead log wait, or syncs of any file, until released.
+  /// From now on writes to a write-ahead log wait, or syncs of any file, until released: those that
+  /// wait then, though the next ones may be held at once.
   void hold(Purpose purpose = Purpose::write) QUARVEL_EXCLUDES(mutex_);
   void release() QUARVEL_EXCLUDES(mutex_);
   /// Whether one waits.
@@ -112,6 +113,7 @@ class FileCalls {
 
  private:
   void reset(const std::filesystem::path& directory) QUARVEL_EXCLUDES(mutex_);
+  void letGo() QUARVEL_REQUIRES(mutex_);
   void passHold(Purpose purpose) QUARVEL_REQUIRES(mutex_);
   [[nodiscard]] int admitLocked(Purpose purpose) QUARVEL_REQUIRES(mutex_);
 
@@ -124,6 +126,7 @@ class FileCalls {
       false;  // the page of a transaction's last frame is next
   std::optional<Purpose> hold_ QUARVEL_GUARDED_BY(mutex_);
   int held_ QUARVEL_GUARDED_BY(mutex_) = 0;
+  std::size_t releases_ QUARVEL_GUARDED_BY(mutex_) = 0;
   std::optional<Fault> fault_ QUARVEL_GUARDED_BY(mutex_);
   std::array<std::size_t, 4> calls_ QUARVEL_GUARDED_BY(mutex_){};  // in the order of `Purpose`
   std::size_t failedCalls_ QUARVEL_GUARDED_BY(mutex_) = 0;

@@ -559,7 +559,9 @@ TEST_F(StoreRetentionTest, AClockSetByTenYearsEmptiesNothing) {
       Await([&] { return files.holdsOne(); });
       now_ = set;
       files.release();
+      awaitStored(*store);
     }
+    std::this_thread::sleep_for(50ms);
     store->close();
     EXPECT_EQ(store->counters().stored, before + 12);
     EXPECT_THAT(LogRecorder::takeErrors(), ::testing::IsEmpty());
