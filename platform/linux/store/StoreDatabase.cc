@@ -98,7 +98,7 @@ bool StoreDatabase::prepare(const Options& options, Date now) {
          connection_.prepare(moveCursor_, kMoveCursor) &&
          connection_.prepare(writeLedger_, kWriteLedger) &&
          connection_.prepare(trimLedger_, kTrimLedger) && readLastIDs() && learn(options) &&
-         retention_.prepare(committedIDs_[StoreTable::agentSession], now);
+         retention_.prepare(now);
 }
 
 bool StoreDatabase::learn(const Options& options) {

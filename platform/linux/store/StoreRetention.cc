@@ -12,6 +12,13 @@ namespace quarvel {
 namespace {
 
 constexpr std::int64_t kEnd = std::numeric_limits<std::int64_t>::max();
+
+StoreIDs AllIDs() {
+  StoreIDs ids;
+  for (const StoreTable table : kAllStoreTables) ids[table] = kEnd;
+  return ids;
+}
+
 constexpr std::uint64_t kStepBytes = 1 << 20;
 constexpr const char* kVacuumStep = "PRAGMA incremental_vacuum(256)";
 
@@ -22,14 +29,14 @@ constexpr const char* TimeColumn(StoreTable table) {
 /// A session's row goes after its last message: nothing is sent after the flush, nor in this run
 /// for a session that an earlier run never flushed.
 constexpr const char* kRemoveSessions =
-    "DELETE FROM agent_session WHERE id <= (SELECT min(id) + 4096 FROM agent_session)"
+    "DELETE FROM agent_session WHERE id <= min(?4, (SELECT min(id) + 4096 FROM agent_session))"
     " AND coalesce(flushed_at, CASE WHEN id <= ?1 THEN ?2 END) < "
     "min(?3, ifnull((SELECT sent_at FROM message ORDER BY id LIMIT 1), ?3))";
 
 }  // namespace
 
-bool StoreRetention::prepare(std::int64_t lastEarlierSession, Date now) {
-  lastEarlierSession_ = lastEarlierSession;
+bool StoreRetention::prepare(Date now) {
+  lastEarlierSession_ = lastIDs_[StoreTable::agentSession];
   openedAt_ = now.time_since_epoch().count();
   const auto pageBytes = connection_.integer("PRAGMA page_size");
   if (!pageBytes) return false;
@@ -45,7 +52,7 @@ bool StoreRetention::prepare(std::int64_t lastEarlierSession, Date now) {
       return false;
     }
   }
-  return connection_.prepare(pages_, "PRAGMA page_count") &&
+  return clockMarks_.prepare(lastIDs_) && connection_.prepare(pages_, "PRAGMA page_count") &&
          connection_.prepare(freePages_, "PRAGMA freelist_count") &&
          connection_.prepare(cursor_,
                              "SELECT exported_through FROM backend_cursor"
@@ -60,7 +67,7 @@ bool StoreRetention::prepare(std::int64_t lastEarlierSession, Date now) {
 }
 
 StoreRetention::Progress StoreRetention::step(std::uint64_t incomingBytes,
-                                              std::optional<Date> expired) {
+                                              std::optional<Expiry> expired) {
   const auto pages = value(pages_);
   const auto freePages = value(freePages_);
   if (!pages || !freePages) return Progress::failed;
@@ -75,28 +82,36 @@ StoreRetention::Progress StoreRetention::step(std::uint64_t incomingBytes,
     progress = connection_.execute(kVacuumStep) ? Progress::more : Progress::failed;
   }
   if (progress != Progress::nothingToDo || !expired) return progress;
-  return removeOldest(kStepBytes, expired->time_since_epoch().count() - 1, false);
+  return removeOldest(kStepBytes,
+                      {expired->before.time_since_epoch().count() - 1, expired->trusted, false});
+}
+
+std::optional<StoreRetention::Expiry> StoreRetention::expiry(Date now, Date before) {
+  auto trusted = clockMarks_.trusted(now, before);
+  if (!trusted) return std::nullopt;
+  return Expiry{before, *trusted};
 }
 
 StoreRetention::Progress StoreRetention::makeRoom(std::uint64_t bytes) {
-  const Progress progress = removeOldest(bytes, kEnd, true);
-  return progress == Progress::nothingToDo ? removeOldest(bytes, kEnd, false) : progress;
+  const Progress progress = removeOldest(bytes, {kEnd, AllIDs(), true});
+  return progress == Progress::nothingToDo ? removeOldest(bytes, {kEnd, AllIDs(), false})
+                                           : progress;
 }
 
-StoreRetention::Progress StoreRetention::removeOldest(std::uint64_t bytes, std::int64_t through,
-                                                      bool spare) {
+StoreRetention::Progress StoreRetention::removeOldest(std::uint64_t bytes, const Removal& wanted) {
+  Removal removal = wanted;
   PerStoreTable<Window> windows;
   for (const StoreTable table : kCountedStoreTables) {
-    const auto found = window(table, std::min(bytes, kStepBytes), spare);
+    const auto found = window(table, std::min(bytes, kStepBytes), wanted);
     if (!found) return Progress::failed;
     windows[table] = *found;
     // What lies between the end of the shortest window and the ends of the others is younger than
     // rows that the next step will see.
-    through = std::min(through, found->lastTime);
+    removal.through = std::min(removal.through, found->lastTime);
   }
   Removed removed;
   if (!connection_.execute("BEGIN IMMEDIATE")) return Progress::failed;
-  if (!removeWithin(windows, through, removed) || !connection_.execute("COMMIT")) {
+  if (!removeWithin(windows, removal, removed) || !connection_.execute("COMMIT")) {
     connection_.rollBack();
     return Progress::failed;
   }
@@ -105,12 +120,14 @@ StoreRetention::Progress StoreRetention::removeOldest(std::uint64_t bytes, std::
   return removed.rows > 0 ? Progress::more : Progress::nothingToDo;
 }
 
-bool StoreRetention::removeWithin(const PerStoreTable<Window>& windows, std::int64_t through,
+bool StoreRetention::removeWithin(const PerStoreTable<Window>& windows, const Removal& removal,
                                   Removed& removed) {
   for (const StoreTable table : kCountedStoreTables) {
     const Window& window = windows[table];
     const auto removeThrough = [&](std::int64_t lastID) -> std::optional<std::uint64_t> {
-      if (!statements_[table].remove.bind(1, lastID).bind(2, through).run()) return std::nullopt;
+      if (!statements_[table].remove.bind(1, lastID).bind(2, removal.through).run()) {
+        return std::nullopt;
+      }
       return static_cast<std::uint64_t>(connection_.changes());
     };
     const auto exported = removeThrough(std::min(window.lastID, window.exportedThrough));
@@ -119,12 +136,16 @@ bool StoreRetention::removeWithin(const PerStoreTable<Window>& windows, std::int
     removed.rows += *exported + *notExported;
     removed.notExported += *notExported;
   }
-  return removeSessions(through) &&
+  return removeSessions(removal) &&
          (removed.rows == 0 || record(static_cast<std::int64_t>(removed.rows)));
 }
 
-bool StoreRetention::removeSessions(std::int64_t through) {
-  return removeSessions_.bind(1, lastEarlierSession_).bind(2, openedAt_).bind(3, through).run();
+bool StoreRetention::removeSessions(const Removal& removal) {
+  return removeSessions_.bind(1, lastEarlierSession_)
+      .bind(2, openedAt_)
+      .bind(3, removal.through)
+      .bind(4, removal.lastIDs[StoreTable::agentSession])
+      .run();
 }
 
 bool StoreRetention::record(std::int64_t removed) {
@@ -137,10 +158,11 @@ bool StoreRetention::record(std::int64_t removed) {
 }
 
 std::optional<StoreRetention::Window> StoreRetention::window(StoreTable table, std::uint64_t bytes,
-                                                             bool spare) {
+                                                             const Removal& removal) {
   const auto exported = exportedThrough(table);
   if (!exported) return std::nullopt;
-  Window window{spare ? *exported : kEnd, kEnd, *exported};
+  Window window{std::min(removal.lastIDs[table], removal.spare ? *exported : kEnd), kEnd,
+                *exported};
   SqliteStatement& oldest = statements_[table].oldest.bind(1, window.lastID);
   std::uint64_t found = 0;
   std::int64_t rows = 0;

@@ -9,6 +9,7 @@
 
 #include "base/Date.h"
 #include "platform/linux/store/Sqlite.h"
+#include "platform/linux/store/StoreClockMarks.h"
 #include "platform/linux/store/StoreTables.h"
 
 namespace quarvel {
@@ -31,15 +32,28 @@ class StoreRetention {
 
   /// `connection` and `lastIDs`, which are those committed, must outlive this.
   StoreRetention(Bounds bounds, SqliteConnection& connection, const StoreIDs& lastIDs)
-      : bounds_(std::move(bounds)), connection_(connection), lastIDs_(lastIDs) {}
+      : bounds_(std::move(bounds)),
+        connection_(connection),
+        lastIDs_(lastIDs),
+        clockMarks_(connection) {}
 
-  /// Once, with the last agent session of earlier runs of the service. False when it failed.
-  [[nodiscard]] bool prepare(std::int64_t lastEarlierSession, Date now);
+  /// Once, before this run of the service has stored anything. False when it failed.
+  [[nodiscard]] bool prepare(Date now);
+
+  /// The clock was set: what this run of the service has stored is not as old as it may say. False
+  /// when that could not be kept.
+  [[nodiscard]] bool clockWasSet(Date now) { return clockMarks_.add(now); }
+  struct Expiry {
+    Date before;
+    StoreIDs trusted;  // beyond these ids nothing is removed for its age
+  };
+  /// What is past its age; none when that could not be found.
+  [[nodiscard]] std::optional<Expiry> expiry(Date now, Date before);
 
   enum class Progress : std::uint8_t { nothingToDo, more, failed };
   /// One step, in a transaction of its own, towards a file in which rows of about `incomingBytes`
   /// have room and, when `expired` is given, no row is older than that.
-  [[nodiscard]] Progress step(std::uint64_t incomingBytes, std::optional<Date> expired);
+  [[nodiscard]] Progress step(std::uint64_t incomingBytes, std::optional<Expiry> expired);
 
   /// Rows that the steps since the last call removed, and how many of them had not been exported.
   struct Removed {
@@ -49,6 +63,12 @@ class StoreRetention {
   [[nodiscard]] Removed takeRemoved() { return std::exchange(removed_, {}); }
 
  private:
+  /// What one run of steps removes.
+  struct Removal {
+    std::int64_t through;  // the time of the last rows
+    StoreIDs lastIDs;      // ... and their ids
+    bool spare;            // only what has been exported
+  };
   struct Statements {
     SqliteStatement oldest, remove;
   };
@@ -61,18 +81,19 @@ class StoreRetention {
   };
 
   Progress makeRoom(std::uint64_t bytes);
-  /// Removes rows up to `through`, oldest first; with `spare`, only those that have been exported.
-  Progress removeOldest(std::uint64_t bytes, std::int64_t through, bool spare);
-  bool removeWithin(const PerStoreTable<Window>& windows, std::int64_t through, Removed& removed);
-  bool removeSessions(std::int64_t through);
+  /// Removes rows, oldest first.
+  Progress removeOldest(std::uint64_t bytes, const Removal& removal);
+  bool removeWithin(const PerStoreTable<Window>& windows, const Removal& removal, Removed& removed);
+  bool removeSessions(const Removal& removal);
   bool record(std::int64_t removed);
-  std::optional<Window> window(StoreTable table, std::uint64_t bytes, bool spare);
+  std::optional<Window> window(StoreTable table, std::uint64_t bytes, const Removal& removal);
   std::optional<std::int64_t> exportedThrough(StoreTable table);
   std::optional<std::int64_t> value(SqliteStatement& statement);
 
   const Bounds bounds_;
   SqliteConnection& connection_;
   const StoreIDs& lastIDs_;
+  StoreClockMarks clockMarks_;
   std::int64_t lastEarlierSession_ = 0;
   std::int64_t openedAt_ = 0;  // microseconds
   std::uint64_t pageBytes_ = 0;

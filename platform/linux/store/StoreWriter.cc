@@ -22,6 +22,13 @@ constexpr std::chrono::minutes kClockMayDrift{5};
 constexpr int kRetentionStepsPerCommit = 16;
 constexpr int kAttemptsPerConnection = 4;
 
+/// Runs while the device sleeps, as the clock does and the monotonic one does not.
+std::chrono::nanoseconds SinceBoot() {
+  timespec time{};
+  ::clock_gettime(CLOCK_BOOTTIME, &time);
+  return std::chrono::seconds{time.tv_sec} + std::chrono::nanoseconds{time.tv_nsec};
+}
+
 /// Early enough for the sync itself to end in time.
 std::chrono::milliseconds SyncAfter(std::chrono::milliseconds sync) {
   return sync - std::min(sync / 4, std::chrono::milliseconds{100});
@@ -42,7 +49,8 @@ StoreWriter::StoreWriter(Options options, std::unique_ptr<StoreDatabase> databas
       syncAfter_(SyncAfter(options_.sync)),
       queue_(queue),
       agedAt_(steady_clock::now()),
-      agedAtDate_(options_.clock()) {
+      clockSeenAt_(SinceBoot()),
+      clockSeen_(options_.clock()) {
   if (database) {
     adopt(std::move(database));
   } else {
@@ -116,24 +124,39 @@ void StoreWriter::write(const StoreBatch& batch) {
     first = last;
   }
   putBackIfTakenAway();
-  if (steady_clock::now() >= agedAt_ + options_.ageing) beginAgeing();
+  const Date now = options_.clock();
+  watchClock(now);
+  if (steady_clock::now() >= agedAt_ + options_.ageing) beginAgeing(now);
 }
 
-void StoreWriter::beginAgeing() {
-  ZQ_FUNCTION("StoreWriter::beginAgeing");
-  const Instant now = steady_clock::now();
-  const Date date = options_.clock();
-  const auto step = (date - std::exchange(agedAtDate_, date)) - (now - std::exchange(agedAt_, now));
-  if (step >= -kClockMayDrift && step <= kClockMayDrift) {
-    retaining_ = true;
-    expired_ = date - options_.maximumAge;
-    return;
+void StoreWriter::watchClock(Date now) {
+  ZQ_FUNCTION("StoreWriter::watchClock");
+  const auto passed = SinceBoot() - clockSeenAt_;
+  const auto step = (now - std::exchange(clockSeen_, now)) - passed;
+  clockSeenAt_ += passed;
+  if (step < -kClockMayDrift || step > kClockMayDrift) {
+    ZQ_LOG(nullptr, standard,
+           "The clock was set by {} s: no row is removed for its age until it has run on for a "
+           "while, and those stored since the service started count as new.",
+           std::chrono::floor<std::chrono::seconds>(step).count());
+    expired_.reset();
+    clockWasSet_ = true;
+    clockMarkIsDue_ = true;
   }
+  if (!clockMarkIsDue_ || !database_) return;
+  if (!database_->retention().clockWasSet(now)) return failed(databaseError());
+  clockMarkIsDue_ = false;
+  if (!unsyncedSince_) unsyncedSince_ = steady_clock::now();
+}
+
+void StoreWriter::beginAgeing(Date now) {
+  agedAt_ = steady_clock::now();
   expired_.reset();
-  ZQ_LOG(
-      nullptr, standard,
-      "The clock was set by {} s: no row is removed for its age until it has run on for a while.",
-      std::chrono::floor<std::chrono::seconds>(step).count());
+  const bool hasRunOn = !std::exchange(clockWasSet_, clockMarkIsDue_);
+  if (!hasRunOn || !database_) return;
+  expired_ = database_->retention().expiry(now, now - options_.maximumAge);
+  if (!expired_) return failed(databaseError());
+  retaining_ = true;
 }
 
 bool StoreWriter::writeRows(const StoreBatch& batch, std::size_t first, std::size_t last) {
@@ -325,7 +348,8 @@ void StoreWriter::makeRoom(const StoreQueue::Tally& incoming) {
   }
 }
 
-bool StoreWriter::retain(std::uint64_t incomingBytes, std::optional<Date> expired) {
+bool StoreWriter::retain(std::uint64_t incomingBytes,
+                         const std::optional<StoreRetention::Expiry>& expired) {
   if (!database_) return false;
   const auto progress = database_->retention().step(incomingBytes, expired);
   if (progress == StoreRetention::Progress::failed) failed(databaseError());
@@ -436,6 +460,7 @@ void StoreWriter::finish() {
   }
   const StoreDrops drops = queue_.counters().dropped;
   settle();
+  watchClock(options_.clock());
   if (database_ && !gaveUp_) {
     if (database_->write({}, 0, 0, StoreDatabase::Safety::full, options_.clock(), drops)) {
       allIsSafe();

@@ -84,12 +84,13 @@ class StoreWriter {
   void endErasure(const Result<std::int64_t>& rows);
   void syncHere();
   void makeRoom(const StoreQueue::Tally& incoming);
+  /// Finds out whether the clock was set.
+  void watchClock(Date now);
   /// Has rows past their age removed, unless the clock was set since that was last done: who sets
-  /// it forward by years must not empty the store, and a device without a clock of its own is told
-  /// the time some while after its start.
-  void beginAgeing();
+  /// it forward by years must not empty the store.
+  void beginAgeing(Date now);
   /// One step of retention. False when there is nothing more to do.
-  bool retain(std::uint64_t incomingBytes, std::optional<Date> expired);
+  bool retain(std::uint64_t incomingBytes, const std::optional<StoreRetention::Expiry>& expired);
   void reportRemoved(bool now);
   /// A file that was taken away still takes rows, but nobody would find them.
   void putBackIfTakenAway();
@@ -128,11 +129,14 @@ class StoreWriter {
   std::vector<Flush> coveredFlushes_;
   std::chrono::milliseconds syncBackOff_{0};  // after a failure
   Instant syncNotBefore_{};
-  bool retaining_ = true;        // there may be rows to remove
-  std::optional<Date> expired_;  // ... those of before it, by a clock that was found to run on
-  Instant agedAt_;               // when rows were last looked at for their age
-  Date agedAtDate_;              // ... by the clock
-  std::uint64_t removedNotExported_ = 0;  // and not yet reported
+  bool retaining_ = true;                          // there may be rows to remove
+  std::optional<StoreRetention::Expiry> expired_;  // ... these, by a clock that has run on
+  Instant agedAt_;                                 // when rows were last looked at for their age
+  std::chrono::nanoseconds clockSeenAt_;           // since boot
+  Date clockSeen_;                                 // ... by the clock
+  bool clockWasSet_ = false;                       // since rows were last looked at
+  bool clockMarkIsDue_ = false;                    // the store does not know yet that it was
+  std::uint64_t removedNotExported_ = 0;           // and not yet reported
   Minutely removedLine_;
 
   mutable Mutex problemMutex_;
