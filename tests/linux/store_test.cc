@@ -566,7 +566,6 @@ TEST_F(StoreRetentionTest, AClockSetByTenYearsEmptiesNothing) {
       files.release();
       awaitStored(*store);
     }
-    std::this_thread::sleep_for(50ms);
     store->close();
     EXPECT_EQ(store->counters().stored, before + 12);
     EXPECT_THAT(LogRecorder::takeErrors(), ::testing::IsEmpty());
