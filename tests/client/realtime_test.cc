@@ -180,9 +180,10 @@ TEST_F(RealtimeReporterTest, EveryRecordArrivesOnceAndInItsOrderOrIsCounted) {
   std::uint64_t refused = 0;
   std::jthread producer([&] {
     for (std::uint64_t i = 0; i < kRecords; ++i) {
+      // Before the refusal: after it the ring may be empty, and nothing more would be sent.
+      const std::uint64_t sent = reporter.statistics().sent;
       if (reporter.record(kPlayback, kSetup).set("n", i).set("half", i / 2).send()) continue;
       ++refused;
-      const std::uint64_t sent = reporter.statistics().sent;
       while (reporter.statistics().sent == sent) std::this_thread::yield();
     }
     reporter.stop();
