@@ -58,8 +58,7 @@ bool StoreClockMarks::add(Date now) {
 std::optional<StoreIDs> StoreClockMarks::trusted(Date now, Date expired) {
   const std::int64_t time = now.time_since_epoch().count();
   const std::int64_t expiredTime = expired.time_since_epoch().count();
-  StoreIDs trusted;
-  for (const StoreTable table : kAllStoreTables) trusted[table] = kEnd;
+  StoreIDs trusted = AllStoreIDs();
   std::int64_t latest = std::numeric_limits<std::int64_t>::min();
   std::int64_t earliest = kEnd;
   SqliteStatement::Step step = marks_.step();

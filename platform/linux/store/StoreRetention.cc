@@ -12,13 +12,6 @@ namespace quarvel {
 namespace {
 
 constexpr std::int64_t kEnd = std::numeric_limits<std::int64_t>::max();
-
-StoreIDs AllIDs() {
-  StoreIDs ids;
-  for (const StoreTable table : kAllStoreTables) ids[table] = kEnd;
-  return ids;
-}
-
 constexpr std::uint64_t kStepBytes = 1 << 20;
 constexpr const char* kVacuumStep = "PRAGMA incremental_vacuum(256)";
 
@@ -93,16 +86,15 @@ std::optional<StoreRetention::Expiry> StoreRetention::expiry(Date now, Date befo
 }
 
 StoreRetention::Progress StoreRetention::makeRoom(std::uint64_t bytes) {
-  const Progress progress = removeOldest(bytes, {kEnd, AllIDs(), true});
-  return progress == Progress::nothingToDo ? removeOldest(bytes, {kEnd, AllIDs(), false})
+  const Progress progress = removeOldest(bytes, {kEnd, AllStoreIDs(), true});
+  return progress == Progress::nothingToDo ? removeOldest(bytes, {kEnd, AllStoreIDs(), false})
                                            : progress;
 }
 
-StoreRetention::Progress StoreRetention::removeOldest(std::uint64_t bytes, const Removal& wanted) {
-  Removal removal = wanted;
+StoreRetention::Progress StoreRetention::removeOldest(std::uint64_t bytes, Removal removal) {
   PerStoreTable<Window> windows;
   for (const StoreTable table : kCountedStoreTables) {
-    const auto found = window(table, std::min(bytes, kStepBytes), wanted);
+    const auto found = window(table, std::min(bytes, kStepBytes), removal);
     if (!found) return Progress::failed;
     windows[table] = *found;
     // What lies between the end of the shortest window and the ends of the others is younger than

@@ -82,7 +82,7 @@ class StoreRetention {
 
   Progress makeRoom(std::uint64_t bytes);
   /// Removes rows, oldest first.
-  Progress removeOldest(std::uint64_t bytes, const Removal& removal);
+  Progress removeOldest(std::uint64_t bytes, Removal removal);
   bool removeWithin(const PerStoreTable<Window>& windows, const Removal& removal, Removed& removed);
   bool removeSessions(const Removal& removal);
   bool record(std::int64_t removed);

@@ -3,6 +3,7 @@
 #include <array>
 #include <cstddef>
 #include <cstdint>
+#include <limits>
 #include <string>
 
 namespace quarvel {
@@ -20,7 +21,7 @@ inline constexpr std::array kCountedStoreTables{StoreTable::message, StoreTable:
 template <class T>
 class PerStoreTable {
  public:
-  T& operator[](StoreTable table) { return each_[static_cast<std::size_t>(table)]; }
+  constexpr T& operator[](StoreTable table) { return each_[static_cast<std::size_t>(table)]; }
   const T& operator[](StoreTable table) const { return each_[static_cast<std::size_t>(table)]; }
   bool operator==(const PerStoreTable&) const = default;
 
@@ -37,6 +38,15 @@ class PerStoreTable {
 /// row's name and the cursors of the backends rest on that. So they also count every row that ever
 /// came.
 using StoreIDs = PerStoreTable<std::int64_t>;
+
+/// As far as ids go.
+[[nodiscard]] constexpr StoreIDs AllStoreIDs() {
+  StoreIDs ids;
+  for (const StoreTable table : kAllStoreTables) {
+    ids[table] = std::numeric_limits<std::int64_t>::max();
+  }
+  return ids;
+}
 
 /// How far a store is safe from a power cut. What lies beyond may yet be lost, and its ids given to
 /// other rows.

@@ -129,13 +129,13 @@ class StoreWriter {
   std::vector<Flush> coveredFlushes_;
   std::chrono::milliseconds syncBackOff_{0};  // after a failure
   Instant syncNotBefore_{};
+  bool clockWasSet_ = false;                       // since rows were last looked at for their age
+  bool clockMarkIsDue_ = false;                    // the store does not know yet that it was
   bool retaining_ = true;                          // there may be rows to remove
   std::optional<StoreRetention::Expiry> expired_;  // ... these, by a clock that has run on
   Instant agedAt_;                                 // when rows were last looked at for their age
   std::chrono::nanoseconds clockSeenAt_;           // since boot
   Date clockSeen_;                                 // ... by the clock
-  bool clockWasSet_ = false;                       // since rows were last looked at
-  bool clockMarkIsDue_ = false;                    // the store does not know yet that it was
   std::uint64_t removedNotExported_ = 0;           // and not yet reported
   Minutely removedLine_;
 
