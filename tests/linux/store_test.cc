@@ -28,7 +28,7 @@ using ::testing::MatchesRegex;
 using namespace std::chrono_literals;
 
 // How long the device has slept, as told to this program.
-std::atomic<std::int64_t> asleep{0};  // nanoseconds
+std::atomic<std::chrono::seconds> asleep{0s};
 
 class StoreTest : public StoreFixture {
  protected:
@@ -627,9 +627,9 @@ TEST_F(StoreRetentionTest, AClockThatWasAheadHoldsNoRowBackLongerThanOthers) {
 TEST_F(StoreRetentionTest, ADeviceThatSleptHasNotSetItsClock) {
   auto store = open(options());
   sendAndAwait(*store, 1);
-  const std::chrono::nanoseconds night = 14 * 24h + 1s;
-  asleep += night.count();
-  now_ = Date{14 * 24h + 1s};
+  const auto nights = 14 * 24h + 1s;
+  asleep = asleep.load() + nights;
+  now_ = now_.load() + nights;
   sendAndAwait(*store, 2);
   Await([&] { return value("SELECT min(id) FROM message") == "2"; });
 }
@@ -667,6 +667,6 @@ extern "C" int clock_gettime(clockid_t clock, timespec* time) noexcept {
   using Function = int(clockid_t, timespec*);
   static auto* const real = reinterpret_cast<Function*>(::dlsym(RTLD_NEXT, "clock_gettime"));
   const int result = real(clock, time);
-  if (clock == CLOCK_BOOTTIME) time->tv_sec += quarvel::testing::asleep / 1'000'000'000;
+  if (clock == CLOCK_BOOTTIME) time->tv_sec += quarvel::testing::asleep.load().count();
   return result;
 }

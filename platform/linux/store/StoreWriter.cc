@@ -3,6 +3,7 @@
 #include <fmt/format.h>
 
 #include <algorithm>
+#include <ctime>
 #include <iterator>
 #include <utility>
 #include <variant>
