@@ -20,8 +20,8 @@
 #include <vector>
 
 #include "base/Value.h"
-#include "platform/linux/store/export/Exporters.h"
-#include "platform/linux/store/export/NatsEngine.h"
+#include "export/Exporters.h"
+#include "export/nats/NatsEngine.h"
 
 namespace quarvel {
 namespace {

@@ -15,8 +15,8 @@
 #include <vector>
 
 #include "base/Json.h"
-#include "platform/linux/store/Sqlite.h"
-#include "platform/linux/store/TelemetryStore.h"
+#include "store/TelemetryStore.h"
+#include "store/database/Sqlite.h"
 
 namespace quarvel {
 namespace {

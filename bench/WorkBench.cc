@@ -5,12 +5,12 @@
 #include <cstdint>
 
 #include "platform/WorkQueue.h"
-#include "platform/linux/work/Voucher.h"
+#include "queues/CallTracker.h"
 
 namespace quarvel {
 namespace {
 
-class Counted final : public Voucher {
+class Counted final : public CallTracker {
  public:
   [[nodiscard]] std::size_t bytes() const override { return 280; }
   void ran(std::chrono::nanoseconds /*time*/) override {}
@@ -19,7 +19,7 @@ class Counted final : public Voucher {
 };
 
 // One producer to one serial queue, as connections feed the server's queue; timed until the last
-// block has run. First argument: whether each block is queued under a voucher of its own. Second:
+// block has run. First argument: whether each block is queued under a tracker of its own. Second:
 // work of the producer's own between two blocks; slow producers find the queue at rest again.
 void AsyncToSerialQueue(benchmark::State& state) {
   constexpr std::int64_t kBlocks = 1'000'000;
@@ -28,9 +28,9 @@ void AsyncToSerialQueue(benchmark::State& state) {
     std::int64_t run = 0;
     std::atomic<bool> done{false};
     for (std::int64_t i = 0; i < kBlocks; ++i) {
-      VoucherHold hold;
-      if (state.range(0) != 0) hold = VoucherHold(std::make_shared<Counted>());
-      const VoucherScope scope(VoucherScope::Of::call, hold);
+      CallRef hold;
+      if (state.range(0) != 0) hold = CallRef(std::make_shared<Counted>());
+      const CallScope scope(CallScope::Of::call, hold);
       for (std::int64_t pause = 0; pause < state.range(1); ++pause) benchmark::DoNotOptimize(pause);
       queue->async([&run] { ++run; });
     }

@@ -15,23 +15,23 @@
 enum { MESSAGES = 5, MESSAGE_INTERVAL_MS = 50 };
 
 typedef struct {
-  quarvel_client *client;
-  quarvel_payload *payload;
+  quarvel_client* client;
+  quarvel_payload* payload;
   int64_t session;
   int sent;
   bool ended;
   int status;
 } program;
 
-static void fail(program *self, const char *what, const char *why) {
+static void fail(program* self, const char* what, const char* why) {
   fprintf(stderr, "%s: %s\n", what, why);
   self->status = EXIT_FAILURE;
   self->ended = true;
 }
 
 /* The reply to the start, which comes when the session stops. */
-static void stopped(void *context, bool result, const quarvel_error *error) {
-  program *self = context;
+static void stopped(void* context, bool result, const quarvel_error* error) {
+  program* self = context;
   (void)result;
   if (error != NULL) {
     fail(self, "start", error->reason);
@@ -41,11 +41,11 @@ static void stopped(void *context, bool result, const quarvel_error *error) {
   }
 }
 
-static void routed(void *context, const quarvel_error *error) {
+static void routed(void* context, const quarvel_error* error) {
   if (error != NULL) fail(context, "message", error->reason);
 }
 
-static void connection_changed(void *context, const quarvel_connection_change *change) {
+static void connection_changed(void* context, const quarvel_connection_change* change) {
   (void)context;
   if (change->restored) {
     fprintf(stderr, "the service is back, with %" PRIu64 " sessions made anew\n", change->sessions);
@@ -54,8 +54,8 @@ static void connection_changed(void *context, const quarvel_connection_change *c
   }
 }
 
-static void begin(program *self) {
-  quarvel_client *client = self->client;
+static void begin(program* self) {
+  quarvel_client* client = self->client;
   quarvel_create_reporting_session(client, self->session, NULL, NULL);
   quarvel_set_service_type(client, QUARVEL_SERVICE_LONG_FORM_AUDIO, self->session, NULL, NULL);
   quarvel_payload_clear(self->payload);
@@ -65,7 +65,7 @@ static void begin(program *self) {
 }
 
 /* Each time that the timer has run out. */
-static void tick(program *self) {
+static void tick(program* self) {
   quarvel_status status;
   if (self->sent == MESSAGES) {
     quarvel_stop_reporting_session_for_id(self->client, self->session, NULL, NULL);
@@ -97,7 +97,7 @@ static int start_timer(void) {
   return timer;
 }
 
-int main(int argc, char **argv) {
+int main(int argc, char** argv) {
   program self = {.status = EXIT_SUCCESS};
   const quarvel_options options = {
       .size = sizeof options,

@@ -9,10 +9,8 @@
 namespace quarvel {
 
 // Files of the service. From any thread; these operations wait for the medium.
-// Errors: domain `kFileErrorDomain`, the code is the system's error number, the reason names the
-// path.
-
-inline constexpr const char* kFileErrorDomain = "quarvel.files";
+// Errors: domain `kFileErrorDomain` (`base/Files.h`), the code is the system's error number, the
+// reason names the path.
 
 /// Where the diagnostics directory that the system calls `path` lies on this device.
 [[nodiscard]] std::string DiagnosticsPath(std::string_view path);

@@ -9,7 +9,7 @@
 #include <utility>
 
 #include "base/Json.h"
-#include "platform/linux/store/StoreErasure.h"
+#include "store/database/Erasure.h"
 #include "tools/Arrival.h"
 #include "tools/Commands.h"
 #include "tools/Notification.h"
@@ -96,15 +96,15 @@ Result<std::int64_t> EraseOurselves(const Options& options, const ErasureSelecti
     return Failed(
         fmt::format("The store {} cannot be written: {}.", store.native(), connection.message()));
   }
-  StoreErasure erasure(connection, selection, Now());
-  auto progress = StoreErasure::Progress::more;
-  while (progress == StoreErasure::Progress::more) progress = erasure.step();
-  if (progress == StoreErasure::Progress::failed) {
+  Erasure erasure(connection, selection, Now());
+  auto progress = Erasure::Progress::more;
+  while (progress == Erasure::Progress::more) progress = erasure.step();
+  if (progress == Erasure::Progress::failed) {
     return Failed(fmt::format("{} rows were erased from {}, then it failed: {}.", erasure.rows(),
                               store.native(), connection.message()));
   }
   if (std::holds_alternative<ErasureSelection::All>(selection.what)) {
-    StoreErasure::removeSetAside(store);
+    Erasure::removeSetAside(store);
   }
   return erasure.rows();
 }

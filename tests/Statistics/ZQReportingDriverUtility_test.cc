@@ -2,7 +2,7 @@
 
 #include <gmock/gmock.h>
 
-#include "tests/platform/Simulation.h"
+#include "tests/simulated/Simulation.h"
 
 namespace quarvel {
 namespace {

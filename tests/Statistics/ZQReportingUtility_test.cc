@@ -4,7 +4,7 @@
 
 #include "base/Mutex.h"
 #include "platform/Condition.h"
-#include "tests/platform/Simulation.h"
+#include "tests/simulated/Simulation.h"
 
 namespace quarvel {
 namespace {

@@ -7,9 +7,9 @@
 #include <vector>
 
 #include "base/Mutex.h"
-#include "platform/linux/store/export/ExportEngine.h"
-#include "platform/linux/store/export/Exporter.h"
-#include "tests/linux/StoreFixture.h"
+#include "export/ExportEngine.h"
+#include "export/Exporter.h"
+#include "tests/store/StoreFixture.h"
 
 namespace quarvel::testing {
 
@@ -65,10 +65,10 @@ class ExportFixture : public StoreFixture {
     awaitStored(*store_);
     extended_ = true;
   }
-  StoreExtent extent() {
-    StoreExtent extent;
-    store_->followExtent([&extent](const StoreExtent& safe) { extent = safe; });
-    store_->followExtent({});
+  DurableExtent extent() {
+    DurableExtent extent;
+    store_->followDurableExtent([&extent](const DurableExtent& safe) { extent = safe; });
+    store_->followDurableExtent({});
     return extent;
   }
   /// Lets the exporter do what is due until then; returns how often it woke up.

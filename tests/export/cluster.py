@@ -10,7 +10,7 @@ import subprocess
 import tempfile
 import time
 
-DEPLOY = pathlib.Path(__file__).parents[2] / "deploy/nats"
+DEPLOY = pathlib.Path(__file__).parents[2] / "fleet/nats"
 PATIENCE = 60
 
 

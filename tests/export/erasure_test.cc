@@ -4,7 +4,7 @@
 #include <fstream>
 #include <future>
 
-#include "platform/linux/store/StoreErasure.h"
+#include "store/database/Erasure.h"
 #include "tests/export/ExportFixture.h"
 
 namespace quarvel::testing {
@@ -110,11 +110,11 @@ TEST_F(ErasureTest, WorksOnAStoreThatNobodyHasOpen) {
   {
     SqliteConnection connection;
     ASSERT_TRUE(connection.open(path_));
-    StoreErasure erasure(connection, {}, date());
-    while (erasure.step() == StoreErasure::Progress::more) continue;
+    Erasure erasure(connection, {}, date());
+    while (erasure.step() == Erasure::Progress::more) continue;
     EXPECT_EQ(erasure.rows(), 701);
   }
-  EXPECT_EQ(StoreErasure::removeSetAside(path_), 2U);
+  EXPECT_EQ(Erasure::removeSetAside(path_), 2U);
   EXPECT_FALSE(filesHold("secret"));
   begin();
   EXPECT_EQ(store_->counters().dropped[StoreDrop::erased], 700U);

@@ -1,9 +1,9 @@
-#include "platform/linux/store/export/ExportThread.h"
+#include "export/ExportThread.h"
 
 #include <gmock/gmock.h>
 
-#include "tests/linux/Collected.h"
-#include "tests/linux/StoreFixture.h"
+#include "tests/device/Collected.h"
+#include "tests/store/StoreFixture.h"
 
 namespace quarvel::testing {
 namespace {
@@ -46,14 +46,14 @@ class HangingEngine : public ExportEngine {
 
 class ExportThreadTest : public StoreFixture {
  protected:
-  ~ExportThreadTest() override { store_->followExtent({}); }
+  ~ExportThreadTest() override { store_->followDurableExtent({}); }
 
   ExportThread& exporter(const std::string& backend, HangingEngine::Seen& seen) {
-    store_->followExtent({});  // the store's thread reads the list
+    store_->followDurableExtent({});  // the store's thread reads the list
     threads_.push_back(std::make_unique<ExportThread>(
         Exporter::Options{backend, 1'000'000}, std::make_unique<HangingEngine>(seen), *store_));
     threads_.back()->start();
-    store_->followExtent([this](const StoreExtent& extent) {
+    store_->followDurableExtent([this](const DurableExtent& extent) {
       for (const auto& thread : threads_) thread->extend(extent);
     });
     return *threads_.back();

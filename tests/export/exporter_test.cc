@@ -1,9 +1,9 @@
-#include "platform/linux/store/export/Exporter.h"
+#include "export/Exporter.h"
 
 #include <gmock/gmock.h>
 
+#include "tests/LogRecorder.h"
 #include "tests/export/ExportFixture.h"
-#include "tests/linux/LogRecorder.h"
 
 namespace quarvel::testing {
 namespace {
@@ -261,7 +261,7 @@ TEST_F(ExporterTest, AStoreThatTakesThePlaceOfAnotherIsExportedFromItsBeginning)
 TEST_F(ExporterTest, WhatAPowerCutMayStillTakeIsNotSent) {
   begin();
   addMessages(10);
-  StoreExtent safe = extent();
+  DurableExtent safe = extent();
   safe.lastIDs[StoreTable::message] = 4;
   (void)exporter_->step(safe);
   now_ += 1s;

@@ -21,10 +21,10 @@
 #include "Statistics/Service/ZQReportingServiceDelegate.h"
 #include "base/MessagePack.h"
 #include "base/Payload.h"
-#include "platform/linux/connection/SocketListener.h"
 #include "tests/TemporaryDirectory.h"
 #include "tests/UnixSocket.h"
 #include "tests/fuzz/Require.h"
+#include "transport/SocketListener.h"
 
 namespace {
 

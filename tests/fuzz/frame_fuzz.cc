@@ -11,9 +11,9 @@
 #include <vector>
 
 #include "base/MessagePack.h"
-#include "platform/linux/connection/ReadBuffer.h"
-#include "platform/linux/connection/Request.h"
 #include "tests/fuzz/Require.h"
+#include "transport/ReadBuffer.h"
+#include "transport/Request.h"
 
 namespace {
 

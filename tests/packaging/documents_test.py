@@ -38,7 +38,7 @@ class Configuration(unittest.TestCase):
     def setUpClass(cls):
         # What the service reads: Section NAME(findings, table, "path"), then NAME.read("key", …), or
         # a function that several sections are given to.
-        source = "".join(path.read_text() for path in (SOURCE / "platform/linux/system").glob("Configuration*.cc"))
+        source = "".join(path.read_text() for path in (SOURCE / "system").glob("Configuration*.cc"))
         shared, cls.keys = {}, set()
         for function in re.split(r"(?m)^(?=\S.*\) \{$)", source):
             name = re.match(r"void (\w+)\(Section& (\w+)", function)
@@ -164,7 +164,7 @@ class CommandLine(unittest.TestCase):
 
 
 class Diagnostics(unittest.TestCase):
-    SERVICE = ("Statistics", "platform/linux")
+    SERVICE = ("Statistics", "queues", "system", "transport", "store", "export", "device", "linux")
 
     @classmethod
     def setUpClass(cls):

@@ -10,7 +10,7 @@
 #include <vector>
 
 #include "base/Value.h"
-#include "tests/platform/SimulatedListener.h"
+#include "tests/simulated/SimulatedListener.h"
 
 namespace quarvel {
 

@@ -5,7 +5,7 @@
 #include <utility>
 
 #include "Statistics/Service/ZQReportingServiceDelegate.h"
-#include "tests/platform/Simulation.h"
+#include "tests/simulated/Simulation.h"
 
 namespace quarvel {
 

@@ -7,7 +7,7 @@
 #include <vector>
 
 #include "Statistics/Service/ZQReportingSession.h"
-#include "tests/platform/Simulation.h"
+#include "tests/simulated/Simulation.h"
 
 namespace quarvel {
 

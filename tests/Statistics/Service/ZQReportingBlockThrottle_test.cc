@@ -6,7 +6,7 @@
 #include <limits>
 #include <map>
 
-#include "tests/platform/Simulation.h"
+#include "tests/simulated/Simulation.h"
 
 namespace quarvel {
 namespace {

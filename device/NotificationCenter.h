@@ -1,0 +1,51 @@
+#pragma once
+
+#include <atomic>
+#include <filesystem>
+#include <memory>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+#include "base/Mutex.h"
+#include "device/DirectoryWatch.h"
+#include "platform/Notifications.h"
+
+namespace quarvel {
+
+/// Named notifications as files: touching, writing or replacing the file N in the directory posts
+/// N. From any thread. Must not be destroyed before `watch`.
+class NotificationCenter {
+ public:
+  /// Nothing is touched or started before the first registration.
+  NotificationCenter(std::filesystem::path directory, DirectoryWatch& watch)
+      : directory_(std::move(directory)), watch_(watch) {}
+
+  /// As `RegisterForNotification`.
+  [[nodiscard]] int add(std::string_view name, NotificationToken& token, WorkQueue& queue,
+                        NotificationHandler handler);
+
+ private:
+  struct Registration {
+    Registration(NotificationToken ownToken, std::string_view ownName, WorkQueue& ownQueue,
+                 NotificationHandler ownHandler)
+        : token(ownToken), name(ownName), queue(ownQueue), handler(std::move(ownHandler)) {}
+
+    const NotificationToken token;
+    const std::string name;
+    WorkQueue& queue;
+    const NotificationHandler handler;
+    std::atomic<bool> waiting = false;  // on the queue and not yet begun
+  };
+
+  void posted(std::string_view name);
+
+  const std::filesystem::path directory_;
+  DirectoryWatch& watch_;
+  Mutex mutex_;
+  bool watching_ QUARVEL_GUARDED_BY(mutex_) = false;
+  std::vector<std::shared_ptr<Registration>> registrations_ QUARVEL_GUARDED_BY(mutex_);
+};
+
+}  // namespace quarvel

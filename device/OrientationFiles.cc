@@ -1,0 +1,79 @@
+#include "device/OrientationFiles.h"
+
+#include <fstream>
+#include <string>
+#include <system_error>
+#include <utility>
+
+#include "device/Trimmed.h"
+#include "platform/Log.h"
+
+namespace quarvel {
+
+namespace {
+
+constexpr std::array<std::string_view, kOrientationKinds> kFileNames{"device-orientation",
+                                                                     "ui-orientation"};
+
+std::string_view fileName(OrientationKind kind) {
+  return kFileNames[static_cast<std::size_t>(kind)];
+}
+
+}  // namespace
+
+std::optional<Orientation> OrientationFromText(std::string_view text) {
+  text = Trimmed(text);
+  for (std::int32_t number = 0; number <= static_cast<std::int32_t>(Orientation::faceDown);
+       ++number) {
+    const auto orientation = static_cast<Orientation>(number);
+    if (text == std::to_string(number) || text == OrientationName(orientation)) {
+      return orientation;
+    }
+  }
+  return std::nullopt;
+}
+
+OrientationFiles::OrientationFiles(OrientationCenter& center, std::filesystem::path directory,
+                                   DirectoryWatch& watch)
+    : center_(center), directory_(std::move(directory)), watch_(watch) {}
+
+std::optional<Orientation> OrientationFiles::begin(OrientationKind kind) {
+  ZQ_FUNCTION("OrientationFiles");
+  if (!watching_) {
+    const int status = watch_.add(directory_, [this](std::string_view file) { written(file); });
+    if (status != 0) {
+      ZQ_LOG(nullptr, error, "no orientation, {} cannot be watched: {}", directory_.native(),
+             std::generic_category().message(status));
+      return std::nullopt;
+    }
+    watching_ = true;
+  }
+  return read(kind).value_or(Orientation::unknown);
+}
+
+// The watch stays: it costs nothing while nothing is written.
+void OrientationFiles::end(OrientationKind) {}
+
+std::optional<Orientation> OrientationFiles::read(OrientationKind kind) const {
+  ZQ_FUNCTION("OrientationFiles");
+  const std::filesystem::path file = directory_ / fileName(kind);
+  std::ifstream stream(file, std::ios::binary);
+  if (!stream) return std::nullopt;
+  std::string text(64, '\0');
+  stream.read(text.data(), static_cast<std::streamsize>(text.size()));
+  text.resize(static_cast<std::size_t>(stream.gcount()));
+  const auto orientation = OrientationFromText(text);
+  if (!orientation) {
+    ZQ_LOG(nullptr, error, "{} holds \"{}\", which is no orientation", file.native(), text);
+  }
+  return orientation;
+}
+
+void OrientationFiles::written(std::string_view file) {
+  for (const OrientationKind kind : {OrientationKind::device, OrientationKind::ui}) {
+    if (!file.empty() && file != fileName(kind)) continue;
+    if (const auto orientation = read(kind)) center_.changed(kind, *orientation);
+  }
+}
+
+}  // namespace quarvel

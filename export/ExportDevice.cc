@@ -1,0 +1,48 @@
+#include "export/ExportDevice.h"
+
+#include <fmt/format.h>
+#include <systemd/sd-id128.h>
+#include <unistd.h>
+
+#include <array>
+#include <cctype>
+
+namespace quarvel {
+
+namespace {
+
+// Random; makes the derived identifier the service's own.
+constexpr sd_id128_t kApplication{.bytes = {0x7b, 0x0c, 0x5e, 0x42, 0x91, 0xd3, 0x4f, 0x1a, 0xa6,
+                                            0x08, 0x2e, 0xc7, 0x13, 0x5d, 0xf0, 0x69}};
+
+/// With what no subject or label may hold replaced.
+std::string Cleaned(std::string name) {
+  for (char& character : name) {
+    const auto octet = static_cast<unsigned char>(character);
+    if (octet > 127 || (std::isalnum(octet) == 0 && character != '_')) character = '-';
+  }
+  return name;
+}
+
+std::string HostName() {
+  std::array<char, 256> name{};
+  if (::gethostname(name.data(), name.size() - 1) != 0) return {};
+  return Cleaned(name.data());
+}
+
+std::string MachineName() {
+  sd_id128_t identifier{};
+  if (sd_id128_get_machine_app_specific(kApplication, &identifier) < 0) return "unnamed";
+  std::array<char, SD_ID128_STRING_MAX> text{};
+  return sd_id128_to_string(identifier, text.data());
+}
+
+}  // namespace
+
+ExportDevice DescribeDevice(const std::string& configured) {
+  std::string name = configured.empty() ? HostName() : configured;
+  if (name.empty() || name == "localhost") name = MachineName();
+  return {std::move(name), QUARVEL_VERSION};
+}
+
+}  // namespace quarvel

@@ -1,0 +1,7 @@
+#include "export/EngineModule.h"
+#include "export/otlp/OtlpEngine.h"
+
+extern "C" __attribute__((visibility("default"))) quarvel::ExportEngine* QuarvelMakeEngine(
+    const quarvel::Configuration::Agent& agent, const quarvel::ExportDevice& device) {
+  return new quarvel::OtlpEngine(agent.otlp, device);
+}

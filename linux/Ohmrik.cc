@@ -1,0 +1,12 @@
+#include "platform/Ohmrik.h"
+
+#include "linux/ProcessStore.h"
+
+namespace quarvel {
+
+void OhmrikLogRegisteredEvent(std::int32_t domain, std::string_view name, const Payload& record,
+                              std::nullptr_t) {
+  ProcessEventQueue().addPowerEvent(domain, name, record);
+}
+
+}  // namespace quarvel

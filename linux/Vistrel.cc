@@ -1,0 +1,15 @@
+#include "platform/Vistrel.h"
+
+#include "linux/ProcessStore.h"
+#include "store/AnalyticsEventSink.h"
+#include "system/Configuration.h"
+
+namespace quarvel {
+
+void VistrelSendEventLazy(std::string_view name, const std::function<Payload()>& payload) {
+  static auto& sink =
+      *new AnalyticsEventSink(ProcessEventQueue(), Configuration::process().analyticsWanted);
+  sink.sendEventLazy(name, payload);
+}
+
+}  // namespace quarvel

@@ -1,0 +1,154 @@
+#pragma once
+
+#include <array>
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <initializer_list>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <variant>
+#include <vector>
+
+#include "base/Date.h"
+#include "base/Error.h"
+#include "base/Payload.h"
+#include "store/ExportRecord.h"
+#include "store/database/Erasure.h"
+
+namespace quarvel {
+
+/// A piece of a batch's text.
+struct TextSpan {
+  std::uint32_t offset = 0;
+  std::uint32_t length = 0;
+};
+
+// The rows on their way to the store, one struct a kind. `texts` are set by the batch.
+
+struct AgentSessionRow {
+  enum Text { hierarchyToken, clientName, serviceName };
+
+  std::int64_t id;
+  std::int64_t sessionID;
+  std::int64_t clientType;
+  double clientVersion;  // finite
+  bool batchEvent;
+  Payload userInfo;
+  Date openedAt;
+  std::array<TextSpan, 3> texts{};
+};
+
+struct MessageRow {
+  enum Text { clientName, serviceName };
+
+  std::optional<std::int64_t> agentSession;  // none: a single message
+  std::int64_t sessionID;
+  std::uint16_t category;
+  std::uint16_t type;
+  Payload payload;
+  Date sentAt;
+  std::array<TextSpan, 2> texts{};
+};
+
+struct AnalyticsEventRow {
+  enum Text { name };
+
+  Payload payload;
+  Date recordedAt;
+  std::array<TextSpan, 1> texts{};
+};
+
+struct PowerEventRow {
+  enum Text { name };
+
+  std::int32_t domain;
+  Payload payload;
+  Date recordedAt;
+  std::array<TextSpan, 1> texts{};
+};
+
+/// Not a row of its own: marks the agent session as flushed once everything before it is safe.
+struct FlushRow {
+  std::int64_t agentSession;
+  std::function<void(const std::optional<Error>&)> completion;
+  std::array<TextSpan, 0> texts{};
+};
+
+/// Not a row of its own either: moves a backend's cursor and writes the ledger.
+struct ExportedRow {
+  ExportRecord record;
+  std::function<void(const std::optional<Error>&)> completion;
+  std::array<TextSpan, 0> texts{};
+};
+
+/// Nor is this: has the writer begin an erasure once everything before it is committed.
+struct ErasureRow {
+  ErasureSelection selection;
+  std::function<void(const Result<std::int64_t>&)> completion;
+  std::array<TextSpan, 0> texts{};
+};
+
+using StoreRow = std::variant<AgentSessionRow, MessageRow, AnalyticsEventRow, PowerEventRow,
+                              FlushRow, ExportedRow, ErasureRow>;
+
+/// The most that a row's texts and payload may come to. As JSON they are six times as long at most,
+/// and a row that is longer than SQLite takes (10^9 bytes) would be tried for ever, with
+/// everybody's rows waiting behind it.
+inline constexpr std::size_t kMostRowBytes = std::size_t{128} << 20;
+
+template <class Row>
+[[nodiscard]] bool IsTooLarge(const Row& row, std::initializer_list<std::string_view> texts) {
+  std::size_t bytes = 0;
+  for (const std::string_view text : texts) bytes += text.size();
+  if constexpr (requires { row.payload; }) bytes += row.payload.encoded().size();
+  if constexpr (requires { row.userInfo; }) bytes += row.userInfo.encoded().size();
+  return bytes > kMostRowBytes;
+}
+
+/// Rows in the order in which they were queued. Their texts stand one after the other in one
+/// string, which is emptied and filled again with the batch, so that a row costs no allocation of
+/// its own.
+class StoreBatch {
+ public:
+  using Instant = std::chrono::steady_clock::time_point;
+
+  template <class Row>
+  void append(Row&& row, std::initializer_list<std::string_view> texts) {
+    std::size_t index = 0;
+    for (const std::string_view text : texts) {
+      row.texts[index++] = {static_cast<std::uint32_t>(text_.size()),
+                            static_cast<std::uint32_t>(text.size())};
+      text_.append(text);
+    }
+    rows_.emplace_back(std::forward<Row>(row));
+  }
+
+  [[nodiscard]] const std::vector<StoreRow>& rows() const { return rows_; }
+  [[nodiscard]] std::string_view text(TextSpan span) const {
+    return std::string_view(text_).substr(span.offset, span.length);
+  }
+
+  void clear();
+
+  /// What a row counts for in the bound on bytes.
+  [[nodiscard]] static std::size_t bytes(const StoreRow& row);
+  /// The completion that waits for a row's commit; null for one that has none.
+  [[nodiscard]] static const std::function<void(const std::optional<Error>&)>* completion(
+      const StoreRow& row);
+  /// Whether a row is one of those that are counted from acceptance to storage.
+  [[nodiscard]] static bool isCounted(const StoreRow& row);
+
+  /// When the oldest row was queued.
+  Instant queuedAt{};
+  /// Whether nothing comes after this batch: the store is being closed.
+  bool isLast = false;
+
+ private:
+  std::vector<StoreRow> rows_;
+  std::string text_;
+};
+
+}  // namespace quarvel

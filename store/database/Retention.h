@@ -1,0 +1,105 @@
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "base/Date.h"
+#include "store/database/ClockMarks.h"
+#include "store/database/Sqlite.h"
+#include "store/database/Tables.h"
+
+namespace quarvel {
+
+/// Keeps the store within its bounds by removing the oldest rows, in steps so small that rows on
+/// their way in hardly notice. Rows that a remote backend has not yet had go last, but they go.
+///
+/// The file holds its bound because room is made before a batch comes in, and because SQLite takes
+/// freed pages again before it lets the file grow. A file that is too large all the same (the bound
+/// was lowered) is vacuumed page by page. The write-ahead log comes on top, a few megabytes.
+///
+/// Part of the `StoreDatabase`, whose connection it uses; the writer's thread.
+class Retention {
+ public:
+  struct Bounds {
+    std::uint64_t maximumBytes = 268'435'456;
+    /// The backends whose cursors say which rows have been exported; with none, no row waits.
+    std::vector<std::string> remoteBackends;
+  };
+
+  /// `connection` and `lastIDs`, which are those committed, must outlive this.
+  Retention(Bounds bounds, SqliteConnection& connection, const StoreIDs& lastIDs)
+      : bounds_(std::move(bounds)),
+        connection_(connection),
+        lastIDs_(lastIDs),
+        clockMarks_(connection) {}
+
+  /// Once, before this run of the service has stored anything. False when it failed.
+  [[nodiscard]] bool prepare(Date now);
+
+  /// The clock was set: what this run of the service has stored is not as old as it may say. False
+  /// when that could not be kept.
+  [[nodiscard]] bool clockWasSet(Date now) { return clockMarks_.add(now); }
+  struct Expiry {
+    Date before;
+    StoreIDs trusted;  // beyond these ids nothing is removed for its age
+  };
+  /// What is past its age; none when that could not be found.
+  [[nodiscard]] std::optional<Expiry> expiry(Date now, Date before);
+
+  enum class Progress : std::uint8_t { nothingToDo, more, failed };
+  /// One step, in a transaction of its own, towards a file in which rows of about `incomingBytes`
+  /// have room and, when `expired` is given, no row is older than that.
+  [[nodiscard]] Progress step(std::uint64_t incomingBytes, std::optional<Expiry> expired);
+
+  /// Rows that the steps since the last call removed, and how many of them had not been exported.
+  struct Removed {
+    std::uint64_t rows = 0;
+    std::uint64_t notExported = 0;
+  };
+  [[nodiscard]] Removed takeRemoved() { return std::exchange(removed_, {}); }
+
+ private:
+  /// What one run of steps removes.
+  struct Removal {
+    std::int64_t through;  // the time of the last rows
+    StoreIDs lastIDs;      // ... and their ids
+    bool spare;            // only what has been exported
+  };
+  struct Statements {
+    SqliteStatement oldest, remove;
+  };
+  /// The rows that one step may remove from one table: the oldest, up to an id.
+  struct Window {
+    std::int64_t lastID = 0;
+    std::int64_t lastTime =
+        0;  // of its last row when there are rows behind it, else the end of time
+    std::int64_t exportedThrough = 0;
+  };
+
+  Progress makeRoom(std::uint64_t bytes);
+  /// Removes rows, oldest first.
+  Progress removeOldest(std::uint64_t bytes, Removal removal);
+  bool removeWithin(const PerStoreTable<Window>& windows, const Removal& removal, Removed& removed);
+  bool removeSessions(const Removal& removal);
+  bool record(std::int64_t removed);
+  std::optional<Window> window(StoreTable table, std::uint64_t bytes, const Removal& removal);
+  std::optional<std::int64_t> exportedThrough(StoreTable table);
+  std::optional<std::int64_t> value(SqliteStatement& statement);
+
+  const Bounds bounds_;
+  SqliteConnection& connection_;
+  const StoreIDs& lastIDs_;
+  ClockMarks clockMarks_;
+  std::int64_t lastEarlierSession_ = 0;
+  std::int64_t openedAt_ = 0;  // microseconds
+  std::uint64_t pageBytes_ = 0;
+  PerStoreTable<Statements> statements_;
+  SqliteStatement pages_, freePages_, cursor_, removeSessions_, keepLastID_, countDropped_;
+  Removed removed_;
+};
+
+}  // namespace quarvel

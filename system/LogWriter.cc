@@ -1,0 +1,213 @@
+#include "system/LogWriter.h"
+
+#include <fmt/format.h>
+#include <poll.h>
+#include <sys/stat.h>
+#include <sys/uio.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <string>
+#include <utility>
+
+// The place in the source is a line's own, not that of the call to the journal.
+#define SD_JOURNAL_SUPPRESS_LOCATION
+#include <systemd/sd-journal.h>
+
+#include "queues/BlockingScope.h"
+#include "queues/Thread.h"
+
+namespace quarvel {
+namespace {
+
+/// When about so much has been written, those who are held back hear of room.
+constexpr std::size_t kBytesAtOnce = std::size_t{32} * 1024;
+
+/// What has grown beyond this for a burst is not kept for the quiet that follows.
+constexpr std::size_t kKeptBytes = std::size_t{64} * 1024;
+
+std::size_t bytesOf(std::size_t lines, std::size_t text) {
+  return lines * sizeof(LogLine) + text;
+}
+
+/// Whether standard error is the stream that the journal made for this service. Sending to a
+/// journal that does not listen succeeds and loses the line, so its socket must be there too.
+bool standardErrorIsJournal() {
+  const char* const stream = std::getenv("JOURNAL_STREAM");
+  struct stat own {};
+  if (stream == nullptr || ::fstat(STDERR_FILENO, &own) != 0) return false;
+  return fmt::format("{}:{}", own.st_dev, own.st_ino) == stream &&
+         ::access("/run/systemd/journal/socket", W_OK) == 0;
+}
+
+int priorityOf(LogLevel level) {
+  switch (level) {
+    case LogLevel::error:
+      return 3;
+    case LogLevel::standard:
+      return 5;
+    case LogLevel::info:
+      return 6;
+    case LogLevel::debug:
+      break;
+  }
+  return 7;
+}
+
+bool sendToJournal(const LogLine& line) {
+  const std::string fields[] = {
+      fmt::format("MESSAGE={}", line.message()),
+      fmt::format("PRIORITY={}", priorityOf(line.level)),
+      fmt::format("CODE_FILE={}", line.file),
+      fmt::format("CODE_LINE={}", line.line),
+      fmt::format("CODE_FUNC={}", line.function),
+      fmt::format("QUARVEL_SCOPE={}", line.scope),
+  };
+  iovec parts[std::size(fields)];
+  for (std::size_t i = 0; i < std::size(fields); ++i) {
+    parts[i] = {const_cast<char*>(fields[i].data()), fields[i].size()};
+  }
+  return sd_journal_sendv(parts, static_cast<int>(std::size(parts))) == 0;
+}
+
+/// Waits for a reader where it must. Gives up only when standard error takes nothing any more.
+void writeToStandardError(std::string_view text) {
+  while (!text.empty()) {
+    const ssize_t count = ::write(STDERR_FILENO, text.data(), text.size());
+    if (count >= 0) {
+      text.remove_prefix(static_cast<std::size_t>(count));
+    } else if (errno == EAGAIN) {
+      pollfd writable{STDERR_FILENO, POLLOUT, 0};
+      ::poll(&writable, 1, -1);
+    } else if (errno != EINTR) {
+      return;
+    }
+  }
+}
+
+}  // namespace
+
+LogWriter& LogWriter::instance() {
+  // Never destroyed: other threads may log until the very end.
+  static LogWriter& writer = *new LogWriter;
+  return writer;
+}
+
+LogWriter::LogWriter() : toJournal_(standardErrorIsJournal()) {
+  if (StartThread("log", 0, [this] { run(); }) != 0) {
+    const MutexLock lock(mutex_);
+    way_ = Way::direct;
+  }
+  std::atexit([] { instance().end(); });
+}
+
+void LogWriter::Lines::add(const LogLine& line) {
+  text += line.text;
+  entries.push_back({line, text.size()});
+}
+
+void LogWriter::Lines::clear() {
+  if (text.capacity() > kKeptBytes) {
+    *this = {};
+  } else {
+    entries.clear();
+    text.clear();
+  }
+}
+
+void LogWriter::write(const LogLine& line) {
+  Way way = Way::queued;
+  {
+    const MutexLock lock(mutex_);
+    if (way_ == Way::queued && bytes_ >= kQueuedBytes) {
+      const BlockingScope blocking;
+      while (way_ == Way::queued && bytes_ >= kQueuedBytes) written_.wait(mutex_);
+    }
+    way = way_;
+    if (way == Way::queued) {
+      bytes_ += bytesOf(1, line.text.size());
+      ++linesTaken_;
+      queue_.add(line);
+      if (queue_.entries.size() > 1) return;  // the writer has been called already
+    }
+  }
+  if (way == Way::queued) {
+    arrived_.notifyOne();
+  } else if (way == Way::direct) {
+    Lines lines;
+    lines.add(line);
+    const MutexLock lock(output_);
+    put(lines, 0, 1);
+  }
+}
+
+bool LogWriter::flush() {
+  const auto deadline = std::chrono::steady_clock::now() + kPatience;
+  const MutexLock lock(mutex_);
+  const std::uint64_t last = linesTaken_;
+  bool inTime = true;
+  while (inTime && linesWritten_ < last) inTime = written_.waitUntil(mutex_, deadline);
+  return linesWritten_ >= last;
+}
+
+void LogWriter::end() {
+  const bool flushed = flush();
+  {
+    const MutexLock lock(mutex_);
+    way_ = flushed ? Way::direct : Way::none;
+  }
+  written_.notifyAll();
+}
+
+void LogWriter::run() {
+  Lines lines;
+  for (;;) {
+    {
+      const MutexLock lock(mutex_);
+      while (queue_.entries.empty()) arrived_.wait(mutex_);
+      std::swap(lines, queue_);
+    }
+    put(lines);
+    lines.clear();
+  }
+}
+
+void LogWriter::put(const Lines& lines) {
+  const std::vector<Lines::Entry>& entries = lines.entries;
+  std::size_t begin = 0;
+  for (std::size_t first = 0; first < entries.size();) {
+    std::size_t last = first + 1;
+    while (last < entries.size() && entries[last].end - begin <= kBytesAtOnce) ++last;
+    {
+      const MutexLock lock(output_);
+      put(lines, first, last);
+    }
+    const std::size_t end = entries[last - 1].end;
+    {
+      const MutexLock lock(mutex_);
+      bytes_ -= bytesOf(last - first, end - begin);
+      linesWritten_ += last - first;
+    }
+    written_.notifyAll();
+    first = last;
+    begin = end;
+  }
+}
+
+void LogWriter::put(const Lines& lines, std::size_t first, std::size_t last) const {
+  const std::string_view text = lines.text;
+  std::size_t begin = first == 0 ? 0 : lines.entries[first - 1].end;
+  std::string unsent;
+  if (!toJournal_)
+    return writeToStandardError(text.substr(begin, lines.entries[last - 1].end - begin));
+  for (std::size_t i = first; i < last; ++i) {
+    LogLine line = lines.entries[i].line;
+    line.text = text.substr(begin, lines.entries[i].end - begin);
+    if (!sendToJournal(line)) unsent += line.text;
+    begin = lines.entries[i].end;
+  }
+  writeToStandardError(unsent);
+}
+
+}  // namespace quarvel

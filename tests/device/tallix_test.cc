@@ -1,0 +1,261 @@
+#include <fmt/format.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <fstream>
+#include <limits>
+#include <sstream>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "device/TallixFacility.h"
+#include "device/TallixSampling.h"
+#include "platform/Tallix.h"
+#include "tests/LogRecorder.h"
+#include "tests/TemporaryDirectory.h"
+
+namespace quarvel {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+using testing::LogRecorder;
+using ::testing::Pair;
+namespace fs = std::filesystem;
+
+using Figures = std::vector<std::pair<std::string, std::int64_t>>;
+
+Figures figures(const TallixSamples& samples) {
+  Figures all;
+  if (!samples) return all;
+  TallixIterate(*samples, [&all](const TallixChannelSample& sample) {
+    all.emplace_back(TallixChannelGetChannelName(sample).value_or("(no name)"),
+                     TallixSimpleGetIntegerValue(sample));
+    return 0;
+  });
+  return all;
+}
+
+std::int64_t code(const std::optional<Error>& error) {
+  return error ? error->code : 0;
+}
+
+std::int64_t number(TallixErrorCode code) {
+  return static_cast<std::int64_t>(code);
+}
+
+/// A subscription to all that one lookup finds.
+struct Subscribed {
+  explicit Subscribed(const Configuration::Tallix& configuration,
+                      std::optional<std::string_view> group = std::nullopt) {
+    const TallixChannels found =
+        TallixFacility(configuration).channelsInGroup(group, std::nullopt, error);
+    subscription = TallixCreateSubscription(found, channels);
+  }
+  TallixSamples sample() {
+    error.reset();
+    return TallixCreateSamples(*subscription, channels, error);
+  }
+
+  TallixChannels channels;
+  std::shared_ptr<TallixSubscription> subscription;
+  std::optional<Error> error;
+};
+
+class TallixTest : public ::testing::Test {
+ protected:
+  void SetUp() override { LogRecorder::take(); }
+
+  Configuration::Tallix configuration(std::vector<Configuration::TallixChannel> single = {}) const {
+    return {directory.path() / "tree", std::move(single)};
+  }
+
+  TemporaryDirectory directory;
+};
+
+TEST_F(TallixTest, LookupMatchesGroupsAndSubgroups) {
+  directory.write("tree/Speaker/Opened", "1");
+  directory.write("tree/Speaker/Left/Clips", "1");
+  directory.write("tree/VorrenMXDrv/MCA/Underruns", "1");
+  directory.write("tree/Haptics/Stats/Taps", "1");
+  directory.write("tree/Haptics/MCA/Frames", "1");
+  directory.write("tree/Haptics/.hidden", "1");
+  directory.write("tree/Haptics/not\xffutf8", "1");
+  fs::create_directories(directory.path() / "tree/Bare/Stats");
+  fs::create_symlink(directory.write("elsewhere", "1"), directory.path() / "tree/Haptics/Linked");
+  const TallixFacility facility(
+      configuration({{"Speaker", "", "Single", directory.path() / "elsewhere", ""}}));
+
+  const struct {
+    const char* name;
+    std::optional<std::string_view> group, subgroup;
+    std::optional<std::vector<std::string>> found;  // absent: no such group
+  } cases[] = {
+      {"group alone", "Speaker", std::nullopt, {{"Opened", "Single", "Clips"}}},
+      {"links are followed, the rest is skipped",
+       "Haptics",
+       std::nullopt,
+       {{"Linked", "Frames", "Taps"}}},
+      {"subgroup alone", std::nullopt, "MCA", {{"Frames", "Underruns"}}},
+      {"both", "Haptics", "Stats", {{"Taps"}}},
+      {"neither",
+       std::nullopt,
+       std::nullopt,
+       {{"Linked", "Frames", "Taps", "Opened", "Single", "Clips", "Underruns"}}},
+      {"a channel is no subgroup", "Speaker", "Opened", std::nullopt},
+      {"no such group", "Amplifier", std::nullopt, std::nullopt},
+      {"a group without channels", "Bare", std::nullopt, {{}}},
+      {"a subgroup without channels", "Bare", "Stats", {{}}},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    std::optional<Error> error;
+    const TallixChannels channels = facility.channelsInGroup(c.group, c.subgroup, error);
+    EXPECT_EQ(code(error), 0);
+    ASSERT_EQ(channels != nullptr, c.found.has_value());
+    if (!channels) continue;
+    std::vector<std::string> names;
+    for (const DriverChannel& channel : channels->channels) names.push_back(channel.name);
+    EXPECT_EQ(names, *c.found);
+    EXPECT_EQ(TallixGetChannelCount(*channels), static_cast<std::int32_t>(c.found->size()));
+  }
+}
+
+TEST_F(TallixTest, MissingTreeIsAnErrorThatLeavesTheSingleChannels) {
+  const fs::path file = directory.write("counter", "7");
+  std::optional<Error> error;
+  const TallixFacility facility(configuration({{"Speaker", "", "Clips", file, ""}}));
+  const TallixChannels channels = facility.channelsInGroup("Speaker", std::nullopt, error);
+  EXPECT_EQ(code(error), number(TallixErrorCode::unreadableGroups));
+  ASSERT_NE(channels, nullptr);
+  EXPECT_EQ(TallixGetChannelCount(*channels), 1);
+}
+
+TEST_F(TallixTest, SamplesAndDeltasFollowTheCounters) {
+  directory.write("tree/G/Down", "50\n");
+  directory.write("tree/G/Low", std::to_string(std::numeric_limits<std::int64_t>::min()));
+  directory.write("tree/G/Up", "  100\n");
+  Subscribed subscribed(configuration());
+  const TallixSamples earlier = subscribed.sample();
+  ASSERT_NE(earlier, nullptr) << subscribed.error->description();
+
+  directory.write("tree/G/Down", "-20");
+  directory.write("tree/G/Low", "1");
+  directory.write("tree/G/Up", "107\n");
+  const TallixSamples later = subscribed.sample();
+  EXPECT_THAT(figures(later), ElementsAre(Pair("Down", -20), Pair("Low", 1), Pair("Up", 107)));
+  std::optional<Error> error;
+  EXPECT_THAT(figures(TallixCreateSamplesDelta(earlier, later, error)),
+              ElementsAre(Pair("Down", -70), Pair("Low", std::numeric_limits<std::int64_t>::max()),
+                          Pair("Up", 7)));
+  EXPECT_EQ(code(error), 0);
+
+  int visited = 0;
+  TallixIterate(*later, [&visited](const TallixChannelSample&) { return ++visited == 2 ? 1 : 0; });
+  EXPECT_EQ(visited, 2);
+}
+
+TEST_F(TallixTest, SamplesOfOtherChannelsAreRefused) {
+  directory.write("tree/A/One", "1");
+  directory.write("tree/B/One", "1");
+  Subscribed a(configuration(), "A");
+  Subscribed b(configuration(), "B");
+  std::optional<Error> error;
+  EXPECT_EQ(TallixCreateSamplesDelta(nullptr, a.sample(), error), nullptr);
+  EXPECT_EQ(code(error), number(TallixErrorCode::noEarlierSamples));
+  EXPECT_EQ(TallixCreateSamplesDelta(b.sample(), a.sample(), error), nullptr);
+  EXPECT_EQ(code(error), number(TallixErrorCode::differentChannels));
+  EXPECT_EQ(TallixCreateSamples(*a.subscription, b.channels, error), nullptr);
+  EXPECT_EQ(code(error), number(TallixErrorCode::notSubscribed));
+}
+
+TEST_F(TallixTest, ChannelWithoutAnIntegerIsAnErrorUntilItHasOne) {
+  const fs::path file = directory.write("tree/G/Counter", "1");
+  Subscribed subscribed(configuration());
+  const std::vector<std::pair<std::string, TallixErrorCode>> cases{
+      {"", TallixErrorCode::noInteger},
+      {"\n", TallixErrorCode::noInteger},
+      {"many", TallixErrorCode::noInteger},
+      {"12 34", TallixErrorCode::noInteger},
+      {"0x10", TallixErrorCode::noInteger},
+      {std::string(3, '\0'), TallixErrorCode::noInteger},
+      {std::string(5000, ' ') + "1", TallixErrorCode::noInteger},
+      {"9223372036854775808", TallixErrorCode::integerOutOfRange},
+      {std::string(5000, '9'), TallixErrorCode::integerOutOfRange},
+  };
+  for (const auto& [content, expected] : cases) {
+    SCOPED_TRACE(content.substr(0, 30));
+    directory.write("tree/G/Counter", content);
+    EXPECT_EQ(subscribed.sample(), nullptr);
+    EXPECT_EQ(code(subscribed.error), number(expected));
+    EXPECT_THAT(LogRecorder::nextError(), HasSubstr(file.native()));
+  }
+  directory.write("tree/G/Counter", "9223372036854775807");
+  EXPECT_THAT(figures(subscribed.sample()),
+              ElementsAre(Pair("Counter", std::numeric_limits<std::int64_t>::max())));
+}
+
+TEST_F(TallixTest, VanishedChannelIsAnErrorAndMayComeBack) {
+  const fs::path file = directory.write("tree/G/Counter", "1");
+  Subscribed subscribed(configuration());
+  fs::remove(file);
+  EXPECT_EQ(subscribed.sample(), nullptr);
+  EXPECT_EQ(code(subscribed.error), number(TallixErrorCode::channelUnreadable));
+  directory.write("tree/G/Counter", "2");
+  EXPECT_THAT(figures(subscribed.sample()), ElementsAre(Pair("Counter", 2)));
+  // A program that publishes a counter by renaming must not leave us with its first value.
+  fs::rename(directory.write("new", "3"), file);
+  EXPECT_THAT(figures(subscribed.sample()), ElementsAre(Pair("Counter", 3)));
+}
+
+TEST_F(TallixTest, ChannelThatCannotBeOpenedIsLeftOutAlone) {
+  directory.write("tree/G/Counter", "1");
+  Subscribed subscribed(configuration({{"G", "", "Absent", directory.path() / "absent", ""},
+                                       {"G", "", "Folder", directory.path(), "([0-9]+)"}}));
+  EXPECT_THAT(LogRecorder::nextError(), HasSubstr("Absent"));
+  ASSERT_EQ(TallixGetChannelCount(*subscribed.channels), 2);
+  EXPECT_EQ(subscribed.sample(), nullptr);  // a directory opens but cannot be read
+  EXPECT_EQ(code(subscribed.error), number(TallixErrorCode::channelUnreadable));
+}
+
+TEST_F(TallixTest, PatternsFindTheirIntegersInOneLongReport) {
+  std::string report = "           CPU0\n";
+  for (int row = 1; report.size() < 60'000; ++row) {
+    report += fmt::format("{:3}:  {:9}  IO-APIC  {}-edge  device{}\n", row, row * 10, row, row);
+  }
+  report += "ERR:          4\n";
+  const fs::path file = directory.write("interrupts", report);
+  const fs::path line = directory.write("line", std::string(70'000, 'x') + " 5");
+  fs::create_directories(directory.path() / "tree");
+  Subscribed subscribed(configuration({
+      {"Irq", "", "First", file, "^ *1: +([0-9]+)"},
+      {"Irq", "", "Last", file, "^ERR: +([0-9]+)$"},
+      {"Irq", "", "Middle", file, "^ *[0-9]+: +([0-9]+) .*device321$"},
+      {"Irq", "", "NoGroup", file, "[0-9]+"},
+      {"Irq", "", "Unbalanced", file, "([0-9]+"},
+  }));
+  for (const char* wrong : {"NoGroup", "Unbalanced"}) {
+    EXPECT_THAT(LogRecorder::nextError(), HasSubstr(wrong));
+  }
+  EXPECT_THAT(figures(subscribed.sample()),
+              ElementsAre(Pair("First", 10), Pair("Last", 4), Pair("Middle", 3210)));
+
+  Subscribed beyond(configuration({{"Irq", "", "Beyond", line, "x (5)"}}));
+  EXPECT_EQ(beyond.sample(), nullptr);
+  EXPECT_EQ(code(beyond.error), number(TallixErrorCode::noInteger));
+}
+
+TEST_F(TallixTest, KernelReportLongerThanAPageIsReadWhole) {
+  const fs::path maps = "/proc/self/maps";
+  std::stringstream text;
+  text << std::ifstream(maps).rdbuf();
+  ASSERT_GT(text.str().find("[stack]"), 4096U);
+  fs::create_directories(directory.path() / "tree");
+  Subscribed subscribed(configuration({{"Memory", "", "Inode", maps, " ([0-9]+) +\\[stack\\]$"}}));
+  EXPECT_THAT(figures(subscribed.sample()), ElementsAre(Pair("Inode", 0)));
+}
+
+}  // namespace
+}  // namespace quarvel

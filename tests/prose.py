@@ -1,0 +1,151 @@
+"""Holds comments and pages to plain English: few free relatives and indefinite persons, and no long
+sentence. Run with the repository's root, and with paths to list what stands in them instead."""
+
+import pathlib
+import re
+import sys
+
+ALLOWED_PER_1000_WORDS = 1.5
+LONGEST_SENTENCE = 35
+
+COUNTED = re.compile(
+    r"\b(?:what|who|whoever|whatever|whom|nobody|somebody|anybody|those (?:who|that|of))\b", re.IGNORECASE)
+CODE = {".h", ".hpp", ".cc", ".c", ".js"}
+HASH = {".py", ".sh", ".cmake", ".toml", ".conf", ".service", ".socket", ".in"}
+PAGES = {".md"}
+# Folders of generated files, and of tools that are not the project's.
+SKIPPED = ("build/", "demo/", ".git/", "tests/fuzz/seeds/", "tests/fuzz/regressions/", "node_modules/")
+
+
+def blocks_of_code(text):
+    """Comments of C++: each run of // lines is one block, and so is each /* */."""
+    text = re.sub(r'R"(\w*)\(.*?\)\1"', lambda found: "\n" * found[0].count("\n"), text, flags=re.S)
+    block, start = [], 0
+    for number, line in enumerate(text.splitlines(), 1):
+        found = re.match(r'(?:[^"/]|"(?:[^"\\]|\\.)*"|/(?!/))*//[/!]?<?(.*)$', line)
+        own = found and not line[:found.start(1)].strip(" /!<")
+        if block and not own:
+            yield start, "\n".join(block)
+            block = []
+        if found:
+            block, start = block or [], start if block else number
+            block.append(found[1].strip())
+            if not own:
+                yield start, "\n".join(block)
+                block = []
+    if block:
+        yield start, "\n".join(block)
+    for found in re.finditer(r"/\*(.*?)\*/", text, re.S):
+        yield text.count("\n", 0, found.start()) + 1, re.sub(r"(?m)^\s*\*", "", found[1])
+
+
+def blocks_of_hash(text):
+    block, start = [], 0
+    for number, line in enumerate([*text.splitlines(), ""], 1):
+        found = re.match(r"\s*#(?!!)\s?(.*)$", line)
+        if found:
+            start = start if block else number
+            block.append(found[1])
+        elif block:
+            yield start, "\n".join(block)
+            block = []
+    for found in re.finditer(r'"""(.*?)"""', text, re.S):
+        yield text.count("\n", 0, found.start()) + 1, found[1]
+
+
+def blocks_of_page(text):
+    """Paragraphs, headings, list items and table cells."""
+    text = re.sub(r"(?ms)^\s*```.*?^\s*```", lambda found: "\n" * found[0].count("\n"), text)
+    block, start = [], 0
+    for number, line in enumerate([*text.splitlines(), ""], 1):
+        stripped = line.strip()
+        if block and (not stripped or re.match(r"([#|>*+-]|\d+\.)\s?", stripped)):
+            yield start, " ".join(block)
+            block = []
+        if stripped.startswith("|"):
+            for cell in stripped.strip("|").split("|"):
+                yield number, cell
+        elif stripped:
+            start = start if block else number
+            block.append(re.sub(r"^([#>*+-]+|\d+\.)\s", "", stripped))
+
+
+def blocks_of_manual(text):
+    """Paragraphs of a manual page; a request for a new paragraph ends one, verbatim text is skipped."""
+    block, start, verbatim = [], 0, False
+    for number, line in enumerate([*text.splitlines(), ".Pp"], 1):
+        request = re.match(r"\.(\w+)\s*(.*)", line)
+        if request and request[1] in ("Bd", "Ed"):
+            verbatim = request[1] == "Bd"
+        if request and request[1] in ("Pp", "Sh", "Ss", "It", "Bl", "El", "Bd", "Ed", "Dd", "Dt", "Os"):
+            if block:
+                yield start, " ".join(block)
+            block = []
+        elif not verbatim:
+            start = start if block else number
+            # The argument of a request is a name or a quotation.
+            block.append(f"`{request[2]}`" if request else re.sub(r"\\f.|\\&", "", line))
+
+
+def sentences(block):
+    text = re.sub(r"`[^`]*`|<[^>\s]+>|\[([^]]*)\]\([^)]*\)", lambda found: found[1] or "code", block)
+    text = re.sub(r'"[^"]*"', "quote", text.replace("\\-", "-"))
+    # A list inside a comment, an empty line and a colon before a list end a sentence too.
+    text = re.sub(r"\n\s*\n|\n\s*[-*|]\s|;\s", ". ", text)
+    yield from re.split(r"(?<=[.!?:])[\s)*]+(?=[A-Z\"`(*\[0-9a-z-])", re.sub(r"\s+", " ", text))
+
+
+def blocks(path, text):
+    if path.suffix in CODE:
+        return blocks_of_code(text)
+    if path.suffix in PAGES:
+        return blocks_of_page(text)
+    if "man" in path.parts and re.fullmatch(r"\.\d", path.suffix):
+        return blocks_of_manual(text)
+    if path.suffix in HASH or path.name == "CMakeLists.txt" or text.startswith("#!"):
+        return blocks_of_hash(text)
+    return ()
+
+
+def files(root, wanted):
+    for path in sorted(root.rglob("*")):
+        name = path.relative_to(root)
+        if any(f"{name}/".startswith(skipped) or f"/{skipped}" in f"/{name}" for skipped in SKIPPED):
+            continue
+        if wanted and not any(f"{name}".startswith(prefix) for prefix in wanted):
+            continue
+        if path.is_file() and not path.is_symlink() and path.stat().st_size < 500_000:
+            yield name
+
+
+def main():
+    root, wanted = pathlib.Path(sys.argv[1]), sys.argv[2:]
+    words = counted = 0
+    long, found_in = [], []
+    for name in files(root, wanted):
+        try:
+            text = (root / name).read_text()
+        except UnicodeDecodeError:
+            continue
+        for line, block in blocks(name, text):
+            for sentence in sentences(block):
+                length = len(re.findall(r"\w[\w'’-]*", sentence))
+                matches = COUNTED.findall(sentence)
+                words += length
+                counted += len(matches)
+                if matches:
+                    found_in.append(f"{name}:{line}: {', '.join(matches)}: {sentence.strip()}")
+                if length > LONGEST_SENTENCE:
+                    long.append(f"{name}:{line}: {length} words: {sentence.strip()}")
+    rate = 1000 * counted / max(words, 1)
+    if wanted or rate > ALLOWED_PER_1000_WORDS:
+        print("\n".join(found_in))
+    if long:
+        print("\n".join(long))
+    print(f"{counted} counted words in {words}: {rate:.2f} per 1,000 (at most {ALLOWED_PER_1000_WORDS}); "
+          f"{len(long)} sentences over {LONGEST_SENTENCE} words (none)")
+    return 1 if long or rate > ALLOWED_PER_1000_WORDS else 0
+
+
+if __name__ == "__main__":
+    sys.exit(main())

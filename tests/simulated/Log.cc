@@ -1,0 +1,60 @@
+#include "tests/simulated/SimulatedLog.h"
+
+#include <map>
+
+#include "tests/simulated/Simulation.h"
+
+namespace quarvel {
+
+namespace {
+
+const char* LevelName(LogLevel level) {
+  switch (level) {
+    case LogLevel::error:
+      return "error";
+    case LogLevel::standard:
+      return "default";
+    case LogLevel::info:
+      return "info";
+    case LogLevel::debug:
+      return "debug";
+  }
+  return "";
+}
+
+}  // namespace
+
+std::string LogLine::text() const {
+  return fmt::format("{} {} {}: {}", LevelName(level), scope, function, message);
+}
+
+std::vector<std::string> SimulatedLog::texts(std::string_view prefix) const {
+  std::vector<std::string> texts;
+  for (const LogLine& line : lines) {
+    if (std::string text = line.text(); text.starts_with(prefix)) texts.push_back(std::move(text));
+  }
+  return texts;
+}
+
+LogHandle ZQLogRegister(std::uint32_t code, std::string_view scope, std::string_view,
+                        std::string_view, int, int) {
+  static std::map<std::uint32_t, LogScope> scopes;
+  return &scopes.try_emplace(code, LogScope{std::string(scope)}).first->second;
+}
+
+bool ZQLogEnabled(LogLevel level, LogHandle scope) {
+  if (level != LogLevel::debug) return true;
+  return scope != nullptr && Simulation::current().log.verbose.contains(scope->name);
+}
+
+void ZQLogWrite(LogHandle scope, LogLevel level, const char*, int, const char* function,
+                std::string_view message) {
+  Simulation& simulation = Simulation::current();
+  if (simulation.scheduler.stopped()) return;
+  EXPECT_TRUE(ZQLogEnabled(level, scope)) << "written without asking: " << message;
+  simulation.log.lines.push_back(
+      {level, scope == nullptr ? "[default]" : scope->name, function, std::string(message)});
+  simulation.note("log " + simulation.log.lines.back().text());
+}
+
+}  // namespace quarvel

@@ -1,0 +1,113 @@
+#include "tests/simulated/SimulatedAgent.h"
+
+#include <fmt/format.h>
+
+#include "tests/simulated/Simulation.h"
+
+namespace quarvel {
+
+namespace {
+
+using namespace std::chrono_literals;
+
+SimulatedAgent& Agent() {
+  return Simulation::current().agent;
+}
+
+void AwaitRoom() {
+  while (Agent().full) Simulation::current().scheduler.sleep(100ms);
+}
+
+class SimulatedAgentSession final : public RelmReportingSession {
+ public:
+  SimulatedAgentSession(SimulatedAgent::Session& record, std::size_t number)
+      : record_(record), number_(number) {}
+  ~SimulatedAgentSession() override {
+    record_.released = true;
+    Simulation::current().note(fmt::format("agent {} released", number_));
+  }
+
+  void startConfiguration(ConfigurationCompletion completion) override {
+    if (!Agent().answers) return;
+    if (Agent().backends) record_.foundAfter = Agent().answersAfter;
+    Simulation& simulation = Simulation::current();
+    simulation.scheduler.after(Agent().answersAfter, [&simulation, found = Agent().backends,
+                                                      completion = std::move(completion)] {
+      simulation.spawn("agent", [found, completion] { completion(found); });
+    });
+  }
+
+  Outcome agentSendMessage(std::uint16_t category, std::uint16_t type,
+                           const Payload& payload) override {
+    AwaitRoom();
+    Simulation::current().note(
+        fmt::format("agent {} message {:#x} {:#x}", number_, category, type));
+    offer({category, type, payload, Simulation::current().elapsed()});
+    if (Agent().sendError) return *Agent().sendError;
+    record_.messages.push_back({category, type, payload, Simulation::current().elapsed()});
+    return Success();
+  }
+
+  void flushMessages(FlushCompletion completion) override {
+    Simulation& simulation = Simulation::current();
+    if (simulation.tells(Lie::flushLost)) return;
+    simulation.note(fmt::format("agent {} flush", number_));
+    record_.flushes.push_back(simulation.elapsed());
+    simulation.spawn("agent", [completion = std::move(completion), error = Agent().flushError] {
+      completion(error);
+    });
+  }
+
+  [[nodiscard]] std::string description() const override {
+    return fmt::format("<RelmReportingSession {}>", number_);
+  }
+
+ private:
+  void offer(const SimulatedAgent::Message& message) {
+    Simulation& simulation = Simulation::current();
+    if (simulation.tells(Lie::messageLost)) return;
+    record_.offered.push_back(message);
+    if (simulation.tells(Lie::messageTwice)) record_.offered.push_back(message);
+    if (record_.offered.size() > 1 && simulation.tells(Lie::messagesSwapped)) {
+      std::swap(record_.offered.back(), record_.offered.front());
+    }
+  }
+
+  SimulatedAgent::Session& record_;
+  const std::size_t number_;
+};
+
+}  // namespace
+
+RelmReportingToken RelmReporting::newSecureHierarchyToken(
+    const std::optional<RelmReportingToken>&) {
+  return Agent().tokens.emplace_back(fmt::format("token {}", Agent().tokens.size() + 1));
+}
+
+std::shared_ptr<RelmReportingSession> RelmReporting::createAgentSession(
+    const Dictionary& sessionInfo, const Dictionary& userInfo, const std::vector<std::string>&) {
+  SimulatedAgent::Session& record = Agent().sessions.emplace_back();
+  record.info = sessionInfo;
+  record.userInfo = userInfo;
+  record.queue = Simulation::current().scheduler.currentQueue();
+  Simulation::current().note(fmt::format("agent {} created", Agent().sessions.size()));
+  return std::make_shared<SimulatedAgentSession>(record, Agent().sessions.size());
+}
+
+Outcome RelmReporting::sendOneMessage(const Dictionary& sessionInfo, const Dictionary& userInfo,
+                                      std::uint16_t category, std::uint16_t type,
+                                      const Payload& payload) {
+  AwaitRoom();
+  Simulation::current().note(fmt::format("agent single {:#x} {:#x}", category, type));
+  SimulatedAgent::SingleMessage message{
+      sessionInfo, userInfo, {category, type, payload, Simulation::current().elapsed()}};
+  if (Simulation::current().tells(Lie::singleMessageLost)) return Success();
+  if (Agent().singleMessageError) {
+    Agent().refusedSingleMessages.push_back(std::move(message));
+    return *Agent().singleMessageError;
+  }
+  Agent().singleMessages.push_back(std::move(message));
+  return Success();
+}
+
+}  // namespace quarvel

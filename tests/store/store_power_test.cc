@@ -1,0 +1,305 @@
+#include <fcntl.h>
+#include <fmt/format.h>
+#include <gmock/gmock.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <optional>
+#include <random>
+
+#include "store/database/Sqlite.h"
+#include "tests/LogRecorder.h"
+#include "tests/store/FileCalls.h"
+#include "tests/store/PowerCut.h"
+#include "tests/store/StoreFixture.h"
+
+namespace quarvel::testing {
+namespace {
+
+using namespace std::chrono_literals;
+
+std::size_t ImagesWanted() {
+  const char* nightly = std::getenv("QUARVEL_NIGHTLY");
+  return nightly != nullptr && std::string_view(nightly) == "1" ? 100'000 : 5'000;
+}
+
+/// Cuts the power at every moment of some runs of the store, and looks at what it then finds.
+///
+/// Each row holds its number; the marks of a record say up to which number rows are promised.
+class PowerTest : public StoreFixture {
+ protected:
+  PowerTest() : StoreFixture(true) {}
+
+  using Record = std::vector<FileCalls::Change>;
+
+  /// What is done to a store between its opening and its end.
+  struct Run {
+    const char* name;
+    TelemetryStore::Options options;
+    void (*work)(PowerTest& test);
+  };
+  static const std::vector<Run>& runs();
+
+  void start() { store_ = open(options_); }
+  void send(int rows, std::size_t length = 20) {
+    for (int i = 0; i < rows; ++i) {
+      ASSERT_TRUE(StoreFixture::send(
+          *store_, Payload(Dictionary{{"n", ++sent_}, {"text", std::string(length, 'x')}})));
+    }
+  }
+  void awaitStored() { StoreFixture::awaitStored(*store_); }
+  void flush() { StoreFixture::flush(*store_, addSession(*store_)).wait(); }
+  /// Everything sent so far must survive.
+  void promise() { files_->mark(sent_); }
+  void failNextSync() { files_->inject({.error = EIO, .only = FileCalls::Purpose::sync}); }
+  void end() {
+    store_.reset();
+    promise();
+  }
+
+  Record record(const Run& run) {
+    put({});
+    options_ = run.options;
+    sent_ = 0;
+    files_ = &FileCalls::watch(directory_);
+    files_->record();
+    start();
+    run.work(*this);
+    end();
+    Record record = files_->takeRecord();
+    FileCalls::watch({});
+    return record;
+  }
+
+  /// Puts the files there and opens the store that they make. Says what the cut has broken.
+  std::optional<std::string> broken(const PowerCut::Image& image, off_t promised) {
+    put(image);
+    LogRecorder::take();
+    store_ = open(options_);
+    if (store_ == nullptr) return "it cannot be opened";
+    const std::int64_t counted = static_cast<std::int64_t>(store_->counters().stored);
+    sent_ = -2;
+    send(1);
+    store_.reset();
+    if (const auto errors = LogRecorder::takeErrors(); !errors.empty()) return errors.front();
+    SqliteConnection connection;
+    if (!connection.open(path_)) return connection.message();
+    const auto found =
+        connection.text("SELECT group_concat(integrity_check) FROM pragma_integrity_check");
+    if (found != "ok") return found.value_or(connection.message());
+    const auto rows = connection.text(
+        "SELECT count(*) || ' ' || ifnull(max(payload ->> 'n'), 0) || ' ' ||"
+        " ifnull(max(payload ->> 'n') - min(payload ->> 'n') + 1, 0)"
+        " FROM message WHERE payload ->> 'n' > 0");
+    std::int64_t count = 0;
+    std::int64_t last = 0;
+    std::int64_t span = 0;
+    std::istringstream(rows.value_or("")) >> count >> last >> span;
+    if (last < promised) return fmt::format("row {} is promised, {} is the last", promised, last);
+    if (span != count) return fmt::format("{} rows of {} are there", count, span);
+    if (counted != count) return fmt::format("{} rows are counted, {} are there", counted, count);
+    return std::nullopt;
+  }
+
+  struct Tally {
+    std::size_t images = 0;
+    std::size_t moments = 0;
+    std::size_t broken = 0;
+  };
+  /// Looks at so many images of one run, as many at each moment.
+  Tally cutEverywhere(const Run& run, std::size_t images, bool syncs) {
+    const Record record = this->record(run);
+    const std::size_t each = std::max(images / record.size() + 1, std::size_t{3});
+    std::mt19937 random(20'260'131);
+    Tally tally;
+    for (PowerCut cut(record, syncs); cut.advance(); ++tally.moments) {
+      for (std::size_t i = 0; i < each; ++i, ++tally.images) {
+        const auto survival =
+            i < 2 ? static_cast<PowerCut::Survival>(i) : PowerCut::Survival::anything;
+        const auto fault = broken(cut.image(survival, random), syncs ? cut.promised() : 0);
+        if (!fault) continue;
+        if (++tally.broken > 5 || !syncs) continue;
+        ADD_FAILURE() << run.name << ", moment " << tally.moments << ", image " << i << ": "
+                      << *fault;
+      }
+    }
+    return tally;
+  }
+
+  static constexpr off_t kDamaged = 1'000'000;  // the mark of a file that has been damaged
+  static void replaceADamagedOne(PowerTest& test) {
+    test.send(200, 200);
+    test.end();
+    const int file = ::open(test.path_.c_str(), O_RDWR);
+    const std::string page(4096, 'x');
+    ASSERT_EQ(::pwrite64(file, page.data(), page.size(), 12 * 4096), 4096);
+    ::fsync(file);
+    ::close(file);
+    test.files_->mark(kDamaged);
+    test.start();
+    test.send(1);
+  }
+
+  TelemetryStore::Options options_;
+  std::unique_ptr<TelemetryStore> store_;
+  FileCalls* files_ = nullptr;
+  std::int64_t sent_ = 0;
+};
+
+const std::vector<PowerTest::Run>& PowerTest::runs() {
+  // A short log, so that it is moved into the file often.
+  static const std::vector<Run> kRuns = {
+      {"flushes",
+       {.sync = 24h, .logPages = 12},
+       [](PowerTest& test) {
+         for (int i = 0; i < 5; ++i) {
+           test.send(7);
+           test.flush();
+           test.promise();
+         }
+         test.end();
+         test.start();
+         test.send(3);
+       }},
+      {"rows that come while the medium is slow",
+       {.sync = 24h, .logPages = 12},
+       [](PowerTest& test) {
+         const std::int64_t session = addSession(*test.store_);
+         for (int i = 0; i < 8; ++i) {
+           test.send(3);
+           const std::int64_t promised = test.sent_;
+           test.files_->hold(FileCalls::Purpose::sync);
+           auto flushed = StoreFixture::flush(*test.store_, session);
+           Await([&] { return test.files_->holdsOne(); });
+           test.send(2);
+           // Not when it is the writer that waits, to begin the log again.
+           const auto meanwhile = std::chrono::steady_clock::now() + 20ms;
+           Await([&] {
+             return test.store_->counters().waiting == 0 ||
+                    std::chrono::steady_clock::now() > meanwhile;
+           });
+           test.files_->release();
+           flushed.wait();
+           test.files_->mark(promised);
+         }
+       }},
+      {"each commit",
+       {.sync = 0ms, .logPages = 12},
+       [](PowerTest& test) {
+         for (int i = 0; i < 15; ++i) {
+           test.send(1);
+           test.awaitStored();
+           test.promise();
+         }
+       }},
+      {"intervals",
+       {.sync = 5ms, .logPages = 12},
+       [](PowerTest& test) {
+         for (int i = 0; i < 5; ++i) {
+           for (int burst = 0; burst < 3; ++burst) {
+             test.send(2);
+             test.awaitStored();
+           }
+           Await([&] { return test.files_->counts().unsynced == 0; });
+           test.promise();
+         }
+       }},
+      {"long rows, removed when they are old",
+       {.sync = 24h, .maximumBytes = 120'000, .logPages = 24},
+       [](PowerTest& test) {
+         for (int i = 0; i < 4; ++i) {
+           test.send(4, 9000);
+           test.flush();
+           test.promise();
+         }
+       }},
+      {"an interval's sync fails",
+       {.sync = 5ms, .logPages = 12, .firstBackOff = 1ms},
+       [](PowerTest& test) {
+         for (int i = 0; i < 6; ++i) {
+           test.send(2);
+           test.awaitStored();
+           test.failNextSync();
+           test.send(2);
+           test.awaitStored();
+           Await([&] { return test.files_->counts().unsynced == 0; });
+           test.promise();
+         }
+       }},
+      {"a flush's sync fails beside a reader",
+       {.sync = 24h, .logPages = 40, .firstBackOff = 1ms},
+       [](PowerTest& test) {
+         test.send(3);
+         test.flush();
+         SqliteConnection reader;
+         ASSERT_TRUE(reader.open(test.path_));
+         ASSERT_TRUE(reader.execute("BEGIN; SELECT count(*) FROM message"));
+         for (int i = 0; i < 6; ++i) {
+           test.send(2);
+           test.awaitStored();
+           test.failNextSync();
+           test.send(2);
+           test.flush();
+           test.promise();
+         }
+         test.end();  // the reader stays until then
+       }},
+  };
+  return kRuns;
+}
+
+TEST_F(PowerTest, NoCutLosesWhatIsPromisedOrCorruptsTheStore) {
+  Tally all;
+  for (const Run& run : runs()) {
+    const Tally tally = cutEverywhere(run, ImagesWanted() / runs().size(), true);
+    all.images += tally.images;
+    all.moments += tally.moments;
+    all.broken += tally.broken;
+    fmt::print("power cut, {}: {} images of {} moments\n", run.name, tally.images, tally.moments);
+  }
+  fmt::print("harness: power cut: {} images of {} moments, {} broken\n", all.images, all.moments,
+             all.broken);
+  EXPECT_EQ(all.broken, 0U);
+}
+
+// The damaged file is renamed, a new one made and filled: what could be read is read whenever that
+// is interrupted.
+TEST_F(PowerTest, NoCutLosesWhatASalvageFinds) {
+  const Run run{"salvage", {.logPages = 12}, replaceADamagedOne};
+  const Record record = this->record(run);
+  const std::int64_t expected =
+      std::stoll(value("SELECT count(*) FROM message WHERE payload ->> 'n' <= 200"));
+  ASSERT_GT(expected, 150);
+  ASSERT_LT(expected, 200);
+  std::mt19937 random(20'260'131);
+  std::size_t images = 0;
+  std::size_t moments = 0;
+  for (PowerCut cut(record); cut.advance();) {
+    if (cut.promised() != kDamaged) continue;
+    for (int i = 0; i < 6; ++i, ++images) {
+      const auto survival = static_cast<PowerCut::Survival>(std::min(i, 2));
+      put(cut.image(survival, random));
+      store_ = open(options_);
+      ASSERT_NE(store_, nullptr);
+      store_.reset();
+      // All of them where the first life's log has survived, which still holds the page.
+      ASSERT_GE(std::stoll(value("SELECT count(*) FROM message WHERE payload ->> 'n' <= 200")),
+                expected)
+          << "moment " << moments << ", image " << i;
+    }
+    ++moments;
+  }
+  fmt::print("harness: power cut, salvage: {} images of {} moments\n", images, moments);
+}
+
+// As if `synchronous` were OFF. What is promised does not count here: the file itself breaks.
+TEST_F(PowerTest, FindsThatAStoreThatNeverSyncsIsCorrupted) {
+  std::size_t broken = 0;
+  for (const Run& run : runs()) broken += cutEverywhere(run, 200, false).broken;
+  fmt::print("harness: power cut without syncs: {} images broken\n", broken);
+  EXPECT_GT(broken, 20U);
+}
+
+}  // namespace
+}  // namespace quarvel::testing

@@ -1,0 +1,309 @@
+#include "system/Configuration.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <pwd.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <random>
+#include <sstream>
+#include <string>
+#include <tuple>
+#include <vector>
+
+#include "base/StandardPaths.h"
+#include "platform/DeviceProperties.h"
+#include "tests/TemporaryDirectory.h"
+
+namespace quarvel {
+namespace {
+
+namespace fs = std::filesystem;
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::IsEmpty;
+
+class ConfigurationTest : public testing::Test {
+ protected:
+  Result<Configuration> read(const std::string& text) {
+    std::ofstream(file()) << text;
+    warnings_.clear();
+    return Configuration::read(file(), warnings_);
+  }
+  [[nodiscard]] fs::path file() const { return directory_.path() / "quarvel.toml"; }
+
+  const TemporaryDirectory directory_;
+  std::vector<std::string> warnings_;
+};
+
+TEST_F(ConfigurationTest, RandomBytesAreAnErrorThatNamesTheFile) {
+  std::mt19937 random(20'260'131);
+  for (int i = 0; i < 500; ++i) {
+    std::string bytes(1 + random() % 300, '\0');
+    for (char& byte : bytes) byte = static_cast<char>(random());
+    if (bytes.front() == '#') continue;
+    const Result<Configuration> result = read(bytes);
+    ASSERT_FALSE(result.ok()) << i;
+    EXPECT_THAT(result.error().description(), HasSubstr("quarvel.toml")) << i;
+  }
+}
+
+TEST_F(ConfigurationTest, EveryKeyReachesItsPlace) {
+  const Result<Configuration> result = read(R"(
+[device]
+InternalBuild = true
+DeviceClassNumber = 7
+Model = "Marl"
+[log]
+level = "info"
+[store]
+path = "/data/t.db"
+sync_ms = 70
+max_bytes = 1048576
+max_age_days = 3
+[agent]
+backends = ["otlp", "store"]
+export = false
+drain_rows_per_second = 5
+device = "car-7"
+[agent.nats]
+urls = ["nats://one:4222", "tls://two"]
+stream = "S"
+create_stream = true
+replicas = 1
+duplicate_window_seconds = 9
+credentials = "/c"
+tls_ca = "/ca"
+tls_certificate = "/cert"
+tls_key = "/key"
+acknowledge_seconds = 8
+gather_seconds = 7
+[agent.otlp]
+endpoint = "https://three/x"
+headers = { Authorization = "Bearer t" }
+gzip = false
+tls_ca = "/ca2"
+connect_seconds = 6
+timeout_seconds = 5
+gather_seconds = 4
+[analytics]
+wanted = ["tarnwick.*", "other"]
+[tallix]
+root = "/sys/tallix"
+[[tallix.channel]]
+group = "g"
+subgroup = "s"
+name = "n"
+file = "/proc/x"
+pattern = "p"
+[[tallix.channel]]
+group = "g2"
+name = "n2"
+file = "/proc/y"
+[orientation]
+source = "iio"
+[limits]
+message_bytes = 2048
+reply_bytes = 4096
+frame_seconds = 1
+stall_seconds = 2
+depth = 128
+queued_calls = 3
+queued_bytes = 8192
+connections = 4
+)");
+  ASSERT_TRUE(result.ok()) << result.error().description();
+  EXPECT_THAT(warnings_, IsEmpty());
+  const Configuration& read = result.value();
+  EXPECT_EQ(std::get<bool>(read.device.at("InternalBuild")), true);
+  EXPECT_EQ(std::get<std::int64_t>(read.device.at("DeviceClassNumber")), 7);
+  EXPECT_EQ(std::get<std::string>(read.device.at("Model")), "Marl");
+  EXPECT_EQ(read.logLevel, LogLevel::info);
+  EXPECT_EQ(read.store.path, "/data/t.db");
+  EXPECT_EQ(read.store.sync, std::chrono::milliseconds(70));
+  EXPECT_EQ(read.store.maximumBytes, 1048576U);
+  EXPECT_EQ(read.store.maximumAge.count(), 3);
+  EXPECT_THAT(read.agent.backends, ElementsAre("otlp", "store"));
+  EXPECT_FALSE(read.agent.exports);
+  EXPECT_EQ(read.agent.drainRowsPerSecond, 5U);
+  EXPECT_EQ(read.agent.device, "car-7");
+  const Configuration::Nats& nats = read.agent.nats;
+  EXPECT_THAT(nats.urls, ElementsAre("nats://one:4222", "tls://two"));
+  EXPECT_EQ(std::tie(nats.stream, nats.createStream, nats.replicas, nats.credentials),
+            std::tuple("S", true, 1, "/c"));
+  EXPECT_EQ(std::tie(nats.tls.authority, nats.tls.certificate, nats.tls.key),
+            std::tuple("/ca", "/cert", "/key"));
+  EXPECT_EQ(std::tuple(nats.duplicateWindow.count(), nats.acknowledge.count(), nats.gather.count()),
+            std::tuple(9, 8, 7));
+  const Configuration::Otlp& otlp = read.agent.otlp;
+  EXPECT_EQ(std::tie(otlp.endpoint, otlp.gzip, otlp.tls.authority),
+            std::tuple("https://three/x", false, "/ca2"));
+  EXPECT_THAT(otlp.headers, ElementsAre(testing::Pair("Authorization", "Bearer t")));
+  EXPECT_EQ(std::tuple(otlp.connect.count(), otlp.timeout.count(), otlp.gather.count()),
+            std::tuple(6, 5, 4));
+  EXPECT_THAT(read.analyticsWanted, ElementsAre("tarnwick.*", "other"));
+  EXPECT_EQ(read.tallix.root, "/sys/tallix");
+  ASSERT_EQ(read.tallix.channels.size(), 2U);
+  EXPECT_EQ(read.tallix.channels[0].subgroup, "s");
+  EXPECT_EQ(read.tallix.channels[0].pattern, "p");
+  EXPECT_EQ(read.tallix.channels[1].group, "g2");
+  EXPECT_EQ(read.tallix.channels[1].name, "n2");
+  EXPECT_EQ(read.tallix.channels[1].file, "/proc/y");
+  EXPECT_EQ(read.orientation, Configuration::OrientationSource::iio);
+  const Configuration::Limits& limits = read.limits;
+  EXPECT_EQ(std::tie(limits.messageBytes, limits.replyBytes, limits.depth, limits.queuedCalls,
+                     limits.queuedBytes, limits.connections),
+            std::tuple(2048U, 4096U, 128U, 3U, 8192U, 4U));
+  EXPECT_EQ(std::tie(limits.frame, limits.stall),
+            std::tuple(std::chrono::seconds(1), std::chrono::seconds(2)));
+}
+
+TEST_F(ConfigurationTest, AbsentFileAndAbsentKeysLeaveTheDefaults) {
+  std::vector<std::string> warnings;
+  for (const fs::path& absent :
+       {directory_.path() / "none.toml", directory_.path() / "none/quarvel.toml"}) {
+    EXPECT_TRUE(Configuration::read(absent, warnings).ok()) << absent;
+  }
+  const Result<Configuration> partial = read("[limits]\ndepth = 1\n[agent]\nbackends = []\n");
+  ASSERT_TRUE(partial.ok());
+  EXPECT_EQ(partial.value().limits.depth, 1U);
+  EXPECT_EQ(partial.value().limits.connections, 4096U);
+  EXPECT_THAT(partial.value().agent.backends, IsEmpty());
+}
+
+TEST_F(ConfigurationTest, WrongValueNamesFileLineKeyAndWhatIsAllowed) {
+  const struct {
+    const char* text;
+    const char* said;
+  } faults[] = {
+      {"[limits]\ndepth = 129", ":2: limits.depth must be an integer from 1 to 128, but is 129."},
+      {"[limits]\n\ndepth = 0", ":3: limits.depth must be an integer from 1 to 128, but is 0."},
+      {"[limits]\ndepth = '9'", ":2: limits.depth must be an integer from 1 to 128, but is \"9\"."},
+      {"[store]\nsync_ms = -1", ":2: store.sync_ms must be an integer from 0 to 60000, but is -1."},
+      {"[store]\nsync_ms = 1.5", "but is the real 1.5."},
+      {"[store]\nmax_bytes = 5",
+       "store.max_bytes must be an integer of at least 1048576, but is 5."},
+      {"[store]\npath = 5", ":2: store.path must be a string, a path, but is 5."},
+      {"[log]\nlevel = 'loud'",
+       ":2: log.level must be one of \"error\", \"default\", \"info\", \"debug\", but is "
+       "\"loud\"."},
+      {"[agent]\nbackends = 'store'", ":2: agent.backends must be a list of"},
+      {"[agent]\nbackends = [\n'store',\n'kafka']", ":4: agent.backends[1] must be"},
+      {"[agent]\nbackends = ['store', 'store']", "each at most once, but is \"store\"."},
+      {"[agent]\nexport = 1", ":2: agent.export must be true or false, but is 1."},
+      {"[agent]\nnats = 1", ":2: agent.nats must be a table, but is 1."},
+      {"[agent]\ndevice = 'a.b'", ":2: agent.device must be a name of letters, digits,"},
+      {"[agent.nats]\nurls = ['http://x']", ":2: agent.nats.urls[0] must be"},
+      {"[agent.nats]\nurls = []", ":1: agent.nats.urls is missing."},
+      {"[agent.nats]\nstream = 'a.b'", ":2: agent.nats.stream must be a name without"},
+      {"[agent.nats]\nstream = ''\ncreate_stream = true", ":1: agent.nats.stream is missing."},
+      {"[agent.nats]\nreplicas = 6", ":2: agent.nats.replicas must be an integer from 1 to 5"},
+      {"[agent.nats]\ntls_certificate = 'c'", ":1: agent.nats.tls_key is missing."},
+      {"[agent.otlp]\nendpoint = 'localhost:4318'", ":2: agent.otlp.endpoint must be an address"},
+      {"[agent.otlp.headers]\nA = \"b\\nC: d\"", ":2: agent.otlp.headers.A must be a string"},
+      {"[agent.otlp.headers]\nA = 1", ":2: agent.otlp.headers.A must be a string"},
+      {"[analytics]\nwanted = ['']", ":2: analytics.wanted[0] must be"},
+      {"[device]\nA = 2026-01-31", ":2: device.A must be a boolean, an integer or a string"},
+      {"\nstore = []", ":2: store must be a table, but is a list."},
+      {"[tallix.channel]\nname = 'n'",
+       ":1: tallix.channel must be tables, each [[tallix.channel]]"},
+      {"[[tallix.channel]]\ngroup = 'g'\nname = 'n'", ":1: tallix.channel.file is missing."},
+      {"[orientation]\nsource = 'compass'", ":2: orientation.source must be one of"},
+      {"[limits]\nframe_seconds = 0", ":2: limits.frame_seconds must be"},
+      {"[limits]\ndepth = ", ":2: "},
+      {"[limits]\ndepth = 1\ndepth = 2", ":3: "},
+  };
+  for (const auto& fault : faults) {
+    const Result<Configuration> result = read(fault.text);
+    ASSERT_FALSE(result.ok()) << fault.text;
+    EXPECT_EQ(result.error().domain, "quarvel.configuration");
+    EXPECT_THAT(result.error().description(), HasSubstr(file().native() + ":")) << fault.text;
+    EXPECT_THAT(result.error().description(), HasSubstr(fault.said)) << fault.text;
+  }
+}
+
+TEST_F(ConfigurationTest, UnknownKeysAreWarningsOnly) {
+  const Result<Configuration> result = read(
+      "top = 1\n[limits]\ndepht = 5\n[agent.nats]\nurl = 'x'\n[[tallix.channel]]\n"
+      "group='g'\nname='n'\nfile='f'\nfiel='f'\n");
+  ASSERT_TRUE(result.ok());
+  EXPECT_THAT(warnings_, testing::UnorderedElementsAre(
+                             file().native() + ":1: top is no key of ours.",
+                             file().native() + ":3: limits.depht is no key of ours.",
+                             file().native() + ":5: agent.nats.url is no key of ours.",
+                             file().native() + ":10: tallix.channel.fiel is no key of ours."));
+}
+
+TEST_F(ConfigurationTest, FileThatCannotBeReadIsAnErrorNotAnAbsentOne) {
+  fs::create_directory(file());
+  const Result<Configuration> result = Configuration::read(file(), warnings_);
+  ASSERT_FALSE(result.ok());
+  EXPECT_THAT(result.error().description(), HasSubstr("Is a directory"));
+}
+
+using ConfigurationDeathTest = ConfigurationTest;
+
+TEST_F(ConfigurationDeathTest, OfTheProcessHasDevicePropertiesAndWarnsOfUnknownKeys) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_EXIT(
+      {
+        std::ofstream(file()) << "[device]\nInternalBuild = true\nDeviceClassNumber = 4\n[lgo]\n";
+        setenv("CONFIGURATION_DIRECTORY", directory_.path().c_str(), 1);
+        const bool right = DevicePropertyBoolean("InternalBuild") == true &&
+                           DevicePropertyInteger("DeviceClassNumber") == 4 &&
+                           !DevicePropertyInteger("InternalBuild") &&
+                           !DevicePropertyBoolean("Absent");
+        std::exit(right ? 0 : 1);
+      },
+      testing::ExitedWithCode(0), HasSubstr("quarvel.toml:4: lgo is no key of ours."));
+}
+
+TEST(DirectoriesTest, FirstThatAppliesIsTaken) {
+  const struct {
+    const char* name;
+    bool root;
+    const char* variables;
+    const char* directories;  // runtime, state, configuration; then the socket and the prefix
+  } cases[] = {
+      {"systemd, even for root", true,
+       "RUNTIME_DIRECTORY=/r/a:/r/b STATE_DIRECTORY=/s CONFIGURATION_DIRECTORY=/c "
+       "XDG_RUNTIME_DIR=/x",
+       "/r/a /s /c /r/a/reporting.sock "},
+      {"root", true, "XDG_RUNTIME_DIR=/x XDG_STATE_HOME=/x HOME=/root",
+       "/run/quarvel /var/lib/quarvel /etc/quarvel /run/quarvel/reporting.sock "},
+      {"user with XDG", false, "XDG_RUNTIME_DIR=/x/r XDG_STATE_HOME=/x/s XDG_CONFIG_HOME=/x/c",
+       "/x/r/quarvel /x/s/quarvel /x/c/quarvel /x/r/quarvel/reporting.sock "},
+      {"user without, relative and empty ones ignored", false,
+       "HOME=/home/u XDG_RUNTIME_DIR=/x/r XDG_STATE_HOME=s XDG_CONFIG_HOME= STATE_DIRECTORY=",
+       "/x/r/quarvel /home/u/.local/state/quarvel /home/u/.config/quarvel "
+       "/x/r/quarvel/reporting.sock "},
+      {"socket elsewhere, and a prefix", true,
+       "RUNTIME_DIRECTORY=/r QUARVEL_SOCKET=/tmp/s QUARVEL_DIAGNOSTICS_PREFIX=/tmp/p",
+       "/r /var/lib/quarvel /etc/quarvel /tmp/s /tmp/p"},
+  };
+  for (const auto& each : cases) {
+    ::clearenv();
+    std::istringstream variables(each.variables);
+    for (std::string variable; variables >> variable;) {
+      const std::size_t equals = variable.find('=');
+      setenv(variable.substr(0, equals).c_str(), variable.substr(equals + 1).c_str(), 1);
+    }
+    const StandardPaths found = StandardPaths::fromEnvironment(each.root);
+    EXPECT_EQ(found.runtime.native() + ' ' + found.state.native() + ' ' +
+                  found.configuration.native() + ' ' + found.socket.native() + ' ' +
+                  found.diagnosticsPrefix.native(),
+              each.directories)
+        << each.name;
+  }
+  ::clearenv();
+  const std::string home = ::getpwuid(::geteuid())->pw_dir;
+  const StandardPaths found = StandardPaths::fromEnvironment(false);
+  EXPECT_EQ(found.runtime, "/run/user/" + std::to_string(::geteuid()) + "/quarvel");
+  EXPECT_EQ(found.state, home + "/.local/state/quarvel");
+}
+
+}  // namespace
+}  // namespace quarvel

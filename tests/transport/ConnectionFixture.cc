@@ -1,0 +1,277 @@
+#include "tests/transport/ConnectionFixture.h"
+
+#include <fmt/format.h>
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/socket.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <cstring>
+#include <utility>
+
+#include "base/Json.h"
+#include "base/MessagePack.h"
+#include "platform/Log.h"
+#include "tests/UnixSocket.h"
+
+namespace quarvel {
+
+// The log of this program: error lines go to the journal.
+bool ZQLogEnabled(LogLevel level, LogHandle) {
+  return level == LogLevel::error;
+}
+void ZQLogWrite(LogHandle, LogLevel, const char*, int, const char*, std::string_view message) {
+  Journal::shared().add(fmt::format("error: {}", message));
+}
+
+namespace {
+
+class TestService final : public ExportedObject {
+ public:
+  explicit TestService(std::shared_ptr<Ledger> ledger) : ledger_(std::move(ledger)) {}
+
+  void echo(std::int64_t number, Reply<std::int64_t> reply) {
+    ledger_->arrived(number);
+    reply(number);
+  }
+  void twice(std::int64_t number, Reply<std::int64_t> reply) {
+    reply(number);
+    reply(number + 1);
+  }
+  void never(Reply<bool>) {}
+  void refuse(ErrorReply reply) { reply(Error{"test", 9, {{"why", "because"}}}); }
+  void keep(std::int64_t number, Reply<std::int64_t> reply) {
+    ledger_->keep(number, std::move(reply));
+  }
+  void make(std::int64_t number, std::uint32_t size, Reply<std::string> reply) {
+    ledger_->arrived(number);
+    reply(std::string(size, 'x'));
+  }
+  void describe(std::optional<Payload> payload, std::uint16_t code,
+                std::optional<std::vector<std::int64_t>> list, Reply<std::string> reply) {
+    reply(fmt::format("{} {} {}", payload ? JsonText(*payload) : "none", code,
+                      list ? std::to_string(list->size()) : "none"));
+  }
+
+ private:
+  const std::shared_ptr<Ledger> ledger_;
+};
+
+constexpr std::array kTestMethods{
+    Exported<&TestService::echo>("echo:reply:"),
+    Exported<&TestService::twice>("twice:reply:"),
+    Exported<&TestService::never>("never:"),
+    Exported<&TestService::refuse>("refuse:"),
+    Exported<&TestService::keep>("keep:reply:"),
+    Exported<&TestService::make>("make:size:reply:"),
+    Exported<&TestService::describe>("describe:code:list:reply:"),
+};
+constexpr ExportedInterface kTestInterface{"TestProtocol", kTestMethods};
+
+class TestDelegate final : public ServiceListenerDelegate {
+ public:
+  explicit TestDelegate(Served& served) : served_(served) {}
+
+  bool shouldAcceptNewConnection(ServiceListener&,
+                                 const std::shared_ptr<ClientConnection>& connection) override {
+    const auto object = std::make_shared<TestService>(served_.ledger);
+    served_.connections.push_back(connection);
+    served_.objects.push_back(object);
+    connection->setExportedInterface(kTestInterface);
+    connection->setExportedObject(object);
+    // Holding the object, as a careless delegate might, must not keep anything alive.
+    connection->setInterruptionHandler([object] { Journal::shared().add("interrupted"); });
+    connection->setInvalidationHandler([object] { Journal::shared().add("invalidated"); });
+    connection->resume();
+    return true;
+  }
+
+ private:
+  Served& served_;
+};
+
+}  // namespace
+
+std::shared_ptr<ServiceListenerDelegate> DelegateFor(Served& served) {
+  return std::make_shared<TestDelegate>(served);
+}
+
+Journal& Journal::shared() {
+  static Journal journal;
+  return journal;
+}
+
+void Journal::add(std::string entry) {
+  MutexLock lock(mutex_);
+  entries_.push_back(std::move(entry));
+  changed_.notifyAll();
+}
+
+void Journal::clear() {
+  MutexLock lock(mutex_);
+  entries_.clear();
+}
+
+std::vector<std::string> Journal::entries() {
+  MutexLock lock(mutex_);
+  return entries_;
+}
+
+std::size_t Journal::count(std::string_view part) {
+  MutexLock lock(mutex_);
+  return countLocked(part);
+}
+
+std::size_t Journal::countLocked(std::string_view part) {
+  return static_cast<std::size_t>(std::ranges::count_if(entries_, [part](const std::string& entry) {
+    return entry.find(part) != std::string::npos;
+  }));
+}
+
+bool Journal::waitFor(std::string_view part) {
+  const auto deadline = std::chrono::steady_clock::now() + kPatience;
+  MutexLock lock(mutex_);
+  while (countLocked(part) == 0) {
+    if (!changed_.waitUntil(mutex_, deadline)) return false;
+  }
+  return true;
+}
+
+void Ledger::arrived(std::int64_t number) {
+  MutexLock lock(mutex_);
+  numbers_.push_back(number);
+  changed_.notifyAll();
+}
+
+void Ledger::keep(std::int64_t number, Reply<std::int64_t> reply) {
+  MutexLock lock(mutex_);
+  numbers_.push_back(number);
+  kept_.push_back({number, std::move(reply), CallRef::current()});
+  largestKept_ = std::max(largestKept_, kept_.size());
+  changed_.notifyAll();
+}
+
+std::optional<Ledger::Kept> Ledger::takeKept() {
+  MutexLock lock(mutex_);
+  if (kept_.empty()) return std::nullopt;
+  std::optional<Kept> first = std::move(kept_.front());
+  kept_.pop_front();
+  return first;
+}
+
+std::vector<std::int64_t> Ledger::numbers() {
+  MutexLock lock(mutex_);
+  return numbers_;
+}
+
+std::size_t Ledger::largestKept() {
+  MutexLock lock(mutex_);
+  return largestKept_;
+}
+
+bool Ledger::waitForArrivals(std::size_t count) {
+  const auto deadline = std::chrono::steady_clock::now() + kPatience;
+  MutexLock lock(mutex_);
+  while (numbers_.size() < count) {
+    if (!changed_.waitUntil(mutex_, deadline)) return false;
+  }
+  return true;
+}
+
+Client::Client(const std::filesystem::path& service)
+    : socket_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
+  const timeval patience{kPatience.count(), 0};
+  ::setsockopt(socket_.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+  ::setsockopt(socket_.get(), SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
+  const sockaddr_un address = UnixAddress(service);
+  EXPECT_EQ(::connect(socket_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address),
+            0)
+      << std::strerror(errno);
+}
+
+bool Client::send(std::string_view bytes) {
+  while (!bytes.empty()) {
+    const ssize_t count = ::send(socket_.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL);
+    if (count <= 0) return false;
+    bytes.remove_prefix(static_cast<std::size_t>(count));
+  }
+  return true;
+}
+
+bool Client::call(std::uint32_t messageID, std::string_view method, List arguments) {
+  return send(CallBytes(messageID, method, std::move(arguments)));
+}
+
+std::string Client::response() {
+  MessagePackScanner scanner(std::size_t{1} << 30, MessagePackScanner::kDeepest);
+  for (;;) {
+    const std::string_view rest = std::string_view(received_).substr(taken_);
+    if (scanner.scan(rest) == MessagePackScanner::Progress::complete) {
+      taken_ += scanner.length();
+      return JsonText(PayloadValue(rest.data()).toValue());
+    }
+    received_.erase(0, taken_);
+    taken_ = 0;
+    char bytes[64 * 1024];
+    const ssize_t count = ::recv(socket_.get(), bytes, sizeof bytes, 0);
+    if (count < 0 && errno == EAGAIN) return "nothing came";
+    if (count <= 0) return "end";
+    received_.append(bytes, static_cast<std::size_t>(count));
+  }
+}
+
+std::string Client::responseWithin(std::chrono::milliseconds time) {
+  pollfd descriptor{socket_.get(), POLLIN, 0};
+  if (taken_ == received_.size() && ::poll(&descriptor, 1, static_cast<int>(time.count())) == 0) {
+    return {};
+  }
+  return response();
+}
+
+bool Client::isServed() {
+  return call(4242, "echo:reply:", {kServedNumber}) && response() == "[1,4242,null,-1000]";
+}
+
+void Client::stopSending() {
+  ::shutdown(socket_.get(), SHUT_WR);
+}
+
+std::string CallBytes(std::optional<std::uint32_t> messageID, std::string_view method,
+                      const List& arguments) {
+  std::string bytes;
+  MessagePackWriter writer(bytes);
+  writer.list(messageID ? 4 : 3);
+  writer.integer(messageID ? 0 : 2);
+  if (messageID) writer.unsignedInteger(*messageID);
+  writer.string(method);
+  writer.value(Value(arguments));
+  return bytes;
+}
+
+Service::Service(const Configuration::Limits& limits, bool begun) {
+  Journal::shared().clear();
+  SocketListener::Options options;
+  options.limits = limits;
+  options.atEnd.emplace_back([] { Journal::shared().add("ended"); });
+  auto socket = ListeningSocket::listeningAt(socketPath());
+  EXPECT_TRUE(socket) << socket.error().description();
+  auto listener = SocketListener::create(std::move(socket.value()), std::move(options));
+  EXPECT_TRUE(listener);
+  listener_ = std::move(listener.value());
+  listener_->setDelegate(DelegateFor(*this));
+  if (begun) begin();
+}
+
+void Service::begin() {
+  thread_ = std::thread([this] { listener_->resume(); });
+}
+
+void Service::end() {
+  if (!thread_.joinable()) return;
+  requestEnd();
+  thread_.join();
+}
+
+}  // namespace quarvel

@@ -1,0 +1,272 @@
+// What goes over the wire: calls, replies, calls that are not ours, bytes that are no calls.
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <numeric>
+#include <string>
+#include <thread>
+
+#include "base/MessagePack.h"
+#include "tests/transport/ConnectionFixture.h"
+
+namespace quarvel {
+namespace {
+
+using ::testing::AllOf;
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+using ::testing::StartsWith;
+using namespace std::string_literals;
+
+/// As the bytes of a call have it.
+const std::string echo =
+    "\xab"
+    "echo:reply:"s;
+
+TEST(Connection, AnswersCallsInEveryFormThatFits) {
+  const struct {
+    const char* name;
+    std::string bytes;
+    const char* response;
+  } cases[] = {
+      {"shortest forms", "\x94\x00\x07"s + echo + "\x91\x2a", "[1,7,null,42]"},
+      {"unsigned where signed would do",
+       "\x94\xcc\x00\xcd\x00\x07"s + echo + "\x91\xcf\0\0\0\0\0\0\0\x2a"s, "[1,7,null,42]"},
+      {"signed forms of the id", "\x94\x00\xd3\0\0\0\0\xff\xff\xff\xff"s + echo + "\x91\xd0\xd6",
+       "[1,4294967295,null,-42]"},
+      {"long heads for lists and strings",
+       "\xdd\0\0\0\x04\x00\x07\xdb\0\0\0\x0b"s + "echo:reply:" + "\xdc\0\x01\x2a"s,
+       "[1,7,null,42]"},
+      {"absent arguments", CallBytes(8, "describe:code:list:reply:", {nullptr, 65535, nullptr}),
+       R"([1,8,null,"none 65535 none"])"},
+      {"every argument",
+       CallBytes(9, "describe:code:list:reply:",
+                 {Dictionary{{"a", 1}, {2, List{"b", true}}}, 0, List{1, -2, 3}}),
+       R"([1,9,null,"{\"a\":1,\"2\":[\"b\",true]} 0 3"])"},
+      {"an error reply", CallBytes(10, "refuse:", {}),
+       R"([1,10,{"domain":"test","code":9,"userInfo":{"why":"because"}},null])"},
+  };
+  Service service;
+  Client client = service.connect();
+  for (const auto& row : cases) {
+    ASSERT_TRUE(client.send(row.bytes));
+    EXPECT_EQ(client.response(), row.response) << row.name;
+  }
+}
+
+TEST(Connection, AnswersWrongCallsWithAReasonAndGoesOn) {
+  const std::string describe = "describe:code:list:reply:";
+  const struct {
+    const char* name;
+    std::string bytes;
+    int code;
+    const char* reason;
+  } cases[] = {
+      {"unknown method", CallBytes(5, "ecco:", {}), 1,
+       "no operation \\\"ecco:\\\"; there are: echo:reply:,"},
+      {"method that is no text", CallBytes(5, "\xff\n", {}), 1, "no operation \\\"??\\\""},
+      {"too few arguments", CallBytes(5, describe, {}), 2, "takes 3 arguments, but 0 came"},
+      {"too many arguments", CallBytes(5, "echo:reply:", {1, 2}), 2,
+       "takes 1 argument, but 2 came"},
+      {"another kind", CallBytes(5, "echo:reply:", {"1"}), 2,
+       "(echo) of echo:reply: must be a signed 64-bit integer"},
+      {"number out of range", CallBytes(5, describe, {nullptr, 65536, nullptr}), 2, "(code) of"},
+      {"negative number", CallBytes(5, describe, {nullptr, -1, nullptr}), 2,
+       "unsigned 16-bit integer"},
+      {"list with another kind", CallBytes(5, describe, {nullptr, 1, List{1, "2"}}), 2, "item 2"},
+      {"dictionary with a real as key",
+       "\x94\x00\x05\xb9"s + describe + "\x93\x81\xcb\0\0\0\0\0\0\0\0\x01\x01\xc0"s, 2,
+       "(describe) of"},
+      {"text that is not UTF-8",
+       "\x94\x00\x05\xb9"s + describe + "\x93\x81\xa1\x61\xa1\xff\x01\xc0", 2, "(describe) of"},
+  };
+  Service service;
+  Client client = service.connect();
+  for (const auto& row : cases) {
+    ASSERT_TRUE(client.send(row.bytes));
+    EXPECT_THAT(client.response(),
+                AllOf(StartsWith(R"([1,5,{"domain":"quarvel.connection","code":)" +
+                                 std::to_string(row.code)),
+                      HasSubstr(row.reason)))
+        << row.name;
+  }
+  EXPECT_TRUE(client.isServed());
+  EXPECT_THAT(service.ledger->numbers(), ElementsAre(Client::kServedNumber))
+      << "a wrong call reached the object";
+}
+
+TEST(Connection, EndsAClientThatBreaksTheProtocolAndNoOther) {
+  Configuration::Limits limits;
+  limits.messageBytes = 4096;
+  limits.depth = 8;
+  const struct {
+    const char* name;
+    std::string bytes;
+  } cases[] = {
+      {"text", "GET / HTTP/1.1\r\n\r\n"},
+      {"a byte that MessagePack never uses", "\xc1"},
+      {"a list of nothing", "\x90"},
+      {"a dictionary", "\x84\x00\x01\x02\x03\x04\x05\x06\x07"s},
+      {"a response", "\x94\x01\x07\xc0\xc0"},
+      {"an unknown type", "\x94\x03\x07"s + echo + "\x91\x2a"},
+      {"a request without id", "\x93\x00"s + echo + "\x91\x2a"},
+      {"a notification with id", "\x94\x02\x07"s + echo + "\x91\x2a"},
+      {"five items", "\x95\x00\x07"s + echo + "\x91\x2a\xc0"},
+      {"a negative id", "\x94\x00\xff"s + echo + "\x91\x2a"},
+      {"an id above 32 bits", "\x94\x00\xcf\0\0\0\1\0\0\0\0"s + echo + "\x91\x2a"},
+      {"an id that is text", "\x94\x00\xa1\x37"s + echo + "\x91\x2a"},
+      {"a method that is bytes", "\x94\x00\x07\xc4\x01\x61\x91\x2a"s},
+      {"params that are no list", "\x94\x00\x07"s + echo + "\x2a"},
+      {"a string longer than a message", "\x94\x00\x07\xdb\xff\xff\xff\xff"s},
+      {"a list longer than its bytes could hold", "\x94\x00\x07"s + echo + "\xdd\xff\xff\xff\xff"},
+      {"a dictionary longer than its bytes could hold",
+       "\x94\x00\x07"s + echo + "\x91\xdf\x7f\xff\xff\xff"},
+      {"a message too large", CallBytes(7, "echo:reply:", {std::string(4096, 'x')})},
+      {"nested too deeply", "\x94\x00\x07"s + echo + std::string(8, '\x91') + "\x00"s},
+  };
+  Service service(limits);
+  Client bystander = service.connect();
+  ASSERT_TRUE(bystander.isServed());
+  for (const auto& row : cases) {
+    SCOPED_TRACE(row.name);
+    Journal::shared().clear();
+    Client client = service.connect();
+    // The call before it, in the same write, is still carried out and answered.
+    ASSERT_TRUE(client.send(CallBytes(1, "echo:reply:", {1}) + row.bytes));
+    EXPECT_EQ(client.response(), "[1,1,null,1]");
+    EXPECT_EQ(client.response(), "end");
+    ASSERT_TRUE(Journal::shared().waitFor("invalidated"));
+    EXPECT_THAT(Journal::shared().entries(),
+                ElementsAre(StartsWith("error: client " + std::to_string(::getpid()) +
+                                       " broke the protocol: "),
+                            "interrupted", "invalidated"));
+    EXPECT_TRUE(bystander.isServed());
+  }
+}
+
+TEST(Connection, TakesAMegabyteInSixtyThousandPieces) {
+  Service service;
+  Client client = service.connect();
+  // Looked at once a piece, it would take minutes.
+  Dictionary large{{"text", std::string(1'000'000, 't')}};
+  for (int i = 0; i < 1000; ++i) large.set(i, i);
+  const std::string bytes = CallBytes(2, "describe:code:list:reply:", {large, 1, nullptr});
+  for (std::size_t at = 0; at < bytes.size(); at += 16) {
+    ASSERT_TRUE(client.send(std::string_view(bytes).substr(at, 16)));
+  }
+  EXPECT_THAT(client.response(), AllOf(StartsWith("[1,2,null,"), HasSubstr("\\\"999\\\":999")));
+  EXPECT_TRUE(client.isServed());
+}
+
+TEST(Connection, AnswersPipelinedCallsInTheirOrder) {
+  constexpr int kCalls = 5000;
+  Service service;
+  Client client = service.connect();
+  std::string bytes;
+  for (int i = 0; i < kCalls; ++i) {
+    bytes += CallBytes(static_cast<std::uint32_t>(i), "echo:reply:", {i});
+    bytes += CallBytes(std::nullopt, "echo:reply:", {-1});  // a notification, answered with nothing
+  }
+  std::thread sender([&] { EXPECT_TRUE(client.send(bytes)); });
+  for (int i = 0; i < kCalls; ++i) {
+    ASSERT_EQ(client.response(), "[1," + std::to_string(i) + ",null," + std::to_string(i) + "]");
+  }
+  sender.join();
+  EXPECT_TRUE(service.ledger->waitForArrivals(2 * kCalls));
+}
+
+TEST(Connection, DeliversTheFirstReplyAndNoOther) {
+  Service service;
+  Client client = service.connect();
+  ASSERT_TRUE(client.call(1, "twice:reply:", {10}));
+  ASSERT_TRUE(client.call(2, "never:", {}));
+  ASSERT_TRUE(client.send(CallBytes(std::nullopt, "nobody:", {}) +
+                          CallBytes(std::nullopt, "echo:reply:", {"x"})));
+  ASSERT_TRUE(client.call(3, "keep:reply:", {30}));
+  ASSERT_TRUE(client.call(4, "echo:reply:", {40}));
+  EXPECT_EQ(client.response(), "[1,1,null,10]");
+  EXPECT_EQ(client.response(), "[1,4,null,40]")
+      << "replies come in the order in which they are given";
+  auto kept = service.ledger->takeKept();
+  kept->reply(31);  // from this thread
+  kept->reply(32);
+  EXPECT_EQ(client.response(), "[1,3,null,31]");
+  EXPECT_TRUE(client.isServed());
+}
+
+TEST(Connection, LetsEverythingGoWhenItsClientHasGone) {
+  Service service;
+  Client client = service.connect();
+  Client other = service.connect();
+  ASSERT_TRUE(client.call(1, "keep:reply:", {1}));
+  ASSERT_TRUE(service.ledger->waitForArrivals(1));
+  ASSERT_TRUE(other.isServed());
+  auto stillKnown = service.connections.front().lock();
+  EXPECT_EQ(stillKnown->processIdentifier(), ::getpid());
+  client.hangUp();
+  ASSERT_TRUE(Journal::shared().waitFor("invalidated"));
+  ASSERT_TRUE(other.isServed());  // on the same thread, so what follows an invalidation is done
+  EXPECT_TRUE(service.objects.front().expired());
+  stillKnown.reset();
+  EXPECT_TRUE(service.connections.front().expired()) << "though its call is still under way";
+  EXPECT_EQ(Journal::shared().count("interrupted"), 0U) << "going away is no breach";
+  service.ledger->takeKept()->reply(1);  // vanishes
+}
+
+TEST(Connection, CarriesOutWhatWasSentByAClientThatDoesNotStayForTheReplies) {
+  constexpr std::size_t kCalls = 2000;
+  Service service;
+  {
+    Client client = service.connect();
+    for (std::size_t i = 0; i < kCalls; ++i) {
+      ASSERT_TRUE(client.call(static_cast<std::uint32_t>(i), "make:size:reply:", {1, 500}));
+    }
+  }
+  EXPECT_TRUE(service.ledger->waitForArrivals(kCalls));
+  EXPECT_TRUE(Journal::shared().waitFor("invalidated"));
+
+  Client halfOpen = service.connect();
+  ASSERT_TRUE(halfOpen.call(1, "echo:reply:", {1}));
+  halfOpen.stopSending();
+  EXPECT_EQ(halfOpen.response(), "[1,1,null,1]");
+  EXPECT_EQ(halfOpen.response(), "end");
+}
+
+TEST(Connection, EndsInOrderWithCallsUnderWay) {
+  Configuration::Limits limits;
+  limits.queuedCalls = 4;
+  Service service(limits);
+  Client client = service.connect();
+  std::string bytes;
+  for (int i = 0; i < 100; ++i) bytes += CallBytes(std::nullopt, "keep:reply:", {i});
+  ASSERT_TRUE(client.send(bytes));
+  Client other = service.connect();
+  ASSERT_TRUE(other.isServed());
+
+  service.end();
+  std::vector<std::int64_t> sent(100);
+  std::iota(sent.begin(), sent.end(), 0);
+  std::vector<std::int64_t> arrived = service.ledger->numbers();
+  std::erase(arrived, Client::kServedNumber);
+  EXPECT_EQ(arrived, sent) << "what had been sent was to be carried out";
+  EXPECT_THAT(Journal::shared().entries(), ElementsAre("invalidated", "invalidated", "ended"));
+  EXPECT_EQ(client.response(), "end");
+  EXPECT_FALSE(std::filesystem::exists(service.socketPath()));
+  while (auto kept = service.ledger->takeKept()) kept->reply(0);  // too late, and harmless
+}
+
+TEST(Connection, HearsWhoCameBeforeTheEnd) {
+  Service service({}, false);
+  Client client = service.connect();
+  ASSERT_TRUE(client.call(1, "echo:reply:", {1}));
+  service.requestEnd();
+  service.begin();
+  service.end();
+  EXPECT_EQ(client.response(), "[1,1,null,1]");
+  EXPECT_EQ(client.response(), "end");
+}
+
+}  // namespace
+}  // namespace quarvel
