@@ -8,8 +8,11 @@ add_library(quarvel_options INTERFACE)
 target_include_directories(quarvel_options INTERFACE ${PROJECT_SOURCE_DIR})
 target_compile_options(quarvel_options INTERFACE
   -Wall -Wextra -Wpedantic -Wshadow -Wnon-virtual-dtor -Woverloaded-virtual -Wconversion
-  -Wsign-conversion -Wold-style-cast -Wcast-qual -Wformat=2 -Wundef -Werror
-  $<$<CXX_COMPILER_ID:Clang>:-Wthread-safety>)
+  -Wsign-conversion -Wold-style-cast -Wcast-qual -Wformat=2 -Wundef
+  $<$<BOOL:${QUARVEL_WERROR}>:-Werror>
+  $<$<CXX_COMPILER_ID:Clang>:-Wthread-safety>
+  # At -O3 GCC 12 takes the inactive alternative of a std::variant for an uninitialised one.
+  $<$<AND:$<CXX_COMPILER_ID:GNU>,$<VERSION_LESS:$<CXX_COMPILER_VERSION>,13>,$<CONFIG:Release>>:-Wno-maybe-uninitialized>)
 if(QUARVEL_SANITIZE)
   target_compile_options(quarvel_options INTERFACE
     -fsanitize=${QUARVEL_SANITIZE} -fno-sanitize-recover=all -fno-omit-frame-pointer)
