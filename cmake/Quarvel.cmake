@@ -4,6 +4,12 @@ set(CMAKE_CXX_STANDARD_REQUIRED ON)
 set(CMAKE_CXX_EXTENSIONS OFF)
 set(CMAKE_POSITION_INDEPENDENT_CODE ON)
 
+# At -O3 GCC 12 takes the inactive alternative of a std::variant for an uninitialised one, and a
+# literal joined to a string for an overlapping copy.
+if(CMAKE_CXX_COMPILER_ID STREQUAL GNU AND CMAKE_CXX_COMPILER_VERSION VERSION_LESS 13)
+  set(QUARVEL_NO_FALSE_WARNINGS $<$<CONFIG:Release>:-Wno-maybe-uninitialized;-Wno-restrict>)
+endif()
+
 add_library(quarvel_options INTERFACE)
 target_include_directories(quarvel_options INTERFACE ${PROJECT_SOURCE_DIR})
 target_compile_options(quarvel_options INTERFACE
@@ -11,8 +17,7 @@ target_compile_options(quarvel_options INTERFACE
   -Wsign-conversion -Wold-style-cast -Wcast-qual -Wformat=2 -Wundef
   $<$<BOOL:${QUARVEL_WERROR}>:-Werror>
   $<$<CXX_COMPILER_ID:Clang>:-Wthread-safety>
-  # At -O3 GCC 12 takes the inactive alternative of a std::variant for an uninitialised one.
-  $<$<AND:$<CXX_COMPILER_ID:GNU>,$<VERSION_LESS:$<CXX_COMPILER_VERSION>,13>,$<CONFIG:Release>>:-Wno-maybe-uninitialized>)
+  ${QUARVEL_NO_FALSE_WARNINGS})
 if(QUARVEL_SANITIZE)
   target_compile_options(quarvel_options INTERFACE
     -fsanitize=${QUARVEL_SANITIZE} -fno-sanitize-recover=all -fno-omit-frame-pointer)
