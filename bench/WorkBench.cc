@@ -10,6 +10,7 @@
 namespace quarvel {
 namespace {
 
+/// A tracker without effect, of a call of 280 bytes.
 class Counted final : public CallTracker {
  public:
   [[nodiscard]] std::size_t bytes() const override { return 280; }
@@ -18,9 +19,9 @@ class Counted final : public CallTracker {
   void completed() override {}
 };
 
-// One producer to one serial queue, as connections feed the server's queue; timed until the last
-// block has run. First argument: whether each block is queued under a tracker of its own. Second:
-// work of the producer's own between two blocks; slow producers find the queue at rest again.
+// One producer feeds one serial queue, like connections the server queue; the time ends when the
+// last block has run. First argument: whether each block is queued under its own tracker. Second:
+// the producer's work between two blocks; a slow producer finds the queue idle each time.
 void AsyncToSerialQueue(benchmark::State& state) {
   constexpr std::int64_t kBlocks = 1'000'000;
   const auto queue = CreateSerialQueue("tarnwick.quarvel.bench", QualityOfService::userInteractive);
@@ -50,7 +51,7 @@ BENCHMARK(AsyncToSerialQueue)
     ->UseRealTime()
     ->MeasureProcessCPUTime();
 
-// There and back between two queues: what a wake-up costs when there is nothing to batch.
+// From one queue to another and back: the cost of a wake-up without batching.
 void PingPong(benchmark::State& state) {
   const auto server =
       CreateSerialQueue("tarnwick.quarvel.server", QualityOfService::userInteractive);
