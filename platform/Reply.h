@@ -11,9 +11,9 @@
 
 namespace quarvel {
 
-/// Where the answer to one call goes. The connection facility delivers the first answer and ignores
-/// every later one; an answer that is never given is never delivered. From any thread, without
-/// blocking; an answer to a client that has gone is ignored.
+/// Destination of the answer to one call. The connection facility delivers the first answer and
+/// ignores later ones, as well as an answer to a client that has gone. A call need not be answered.
+/// Shared by the copies of one `Reply`. From any thread; never blocks.
 class ReplySink {
  public:
   virtual ~ReplySink() = default;
@@ -21,8 +21,8 @@ class ReplySink {
   virtual void error(const Error& error) = 0;
 };
 
-/// A reply callback. Copies share the one answer. An absent reply (the default) may be called and
-/// does nothing.
+/// A reply callback, passed by value through the queues. Copies share the one answer. An absent
+/// reply (the default) may be called and does nothing.
 template <class T>
 class Reply {
  public:
