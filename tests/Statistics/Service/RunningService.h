@@ -9,7 +9,7 @@
 
 namespace quarvel {
 
-/// A client of the service, with the protocol's operations by name.
+/// A client of the service, with an operation of the protocol each.
 class Client : public SimulatedClient {
  public:
   explicit Client(SimulatedClient client) : SimulatedClient(std::move(client)) {}
@@ -33,7 +33,6 @@ class Client : public SimulatedClient {
   Call destroy(ReporterID id) { return call("destroyReportingSession:reply:", {id}); }
   Call valid(ReporterID id) { return call("reporterID:valid:", {id}); }
   Call reporters() { return call("getAllReporters:", {}); }
-  Call kill() { return call("killService:", {}); }
 
   void createStarted(ReporterID id) {
     create(id);
@@ -43,7 +42,7 @@ class Client : public SimulatedClient {
 
 /// The whole service on the simulated platform, as its process entry sets it up.
 struct RunningService : Simulation {
-  /// `prepare` arranges what the service finds when it begins.
+  /// `prepare` arranges the platform before the service starts.
   explicit RunningService(
       std::uint64_t seed, const std::function<void(Simulation&)>& prepare = [](Simulation&) {})
       : Simulation(seed) {
@@ -52,18 +51,12 @@ struct RunningService : Simulation {
     ProcessServiceListener().resume();
   }
 
-  /// Connects a client and runs until it is registered, so that clients are in the order of their
-  /// connecting.
+  /// Connects a client and runs until it is registered, so that clients are registered in this
+  /// order.
   [[nodiscard]] Client connect(std::int32_t pid) {
     Client client(listener.connect(pid));
     run();
     return client;
-  }
-  /// Gives the service's preferences domain these entries, and says so.
-  void changePreferences(Dictionary entries) {
-    preferences["tarnwick.quarvel"] = std::move(entries);
-    notifications.post("tarnwick.quarvel.reporting");
-    run();
   }
 };
 

@@ -11,8 +11,8 @@
 
 namespace quarvel {
 
-/// A session whose owner is the test: it alone runs while the simulation does not, and so stands in
-/// for the `ServerQueue`.
+/// A session that the test owns. The test runs only while the simulation does not, in place of the
+/// `ServerQueue`.
 struct SessionOwner : Simulation {
   explicit SessionOwner(std::uint64_t seed, std::uint16_t serviceType = 0) : Simulation(seed) {
     setServiceType(serviceType);
@@ -38,7 +38,7 @@ struct SessionOwner : Simulation {
     session->sendMessage(Payload(payload), category, 1, nullptr);
   }
   [[nodiscard]] std::vector<std::string> errors() const { return log.texts("error"); }
-  /// What reached the agent inside its one session.
+  /// Messages that reached the agent inside its one session.
   [[nodiscard]] const std::vector<SimulatedAgent::Message>& delivered() const {
     return agent.sessions.at(0).messages;
   }
