@@ -33,7 +33,9 @@ class ClientConnection {
   virtual void setExportedInterface(const ExportedInterface& exportedInterface) = 0;
   virtual void setExportedObject(std::shared_ptr<ExportedObject> object) = 0;
   [[nodiscard]] virtual std::shared_ptr<ExportedObject> exportedObject() const = 0;
+  /// Called when the client breaks the protocol.
   virtual void setInterruptionHandler(std::function<void()> handler) = 0;
+  /// Called at the end of the connection, for any reason.
   virtual void setInvalidationHandler(std::function<void()> handler) = 0;
 
   /// Starts to serve the client. Returns at once.

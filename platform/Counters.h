@@ -16,7 +16,7 @@ void CountAcceptedMessage();
 enum class MessageDrop : std::uint8_t {
   noAgentSession,   // the session found no backend
   testServiceType,  // messages of the service type "test" are not sent
-  noSuchSession,    // no client has the session that it names
+  noSuchSession,    // it was for a session that nobody has
 };
 /// Counts an accepted message that ends here.
 void CountDroppedMessage(MessageDrop reason);

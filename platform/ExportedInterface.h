@@ -55,6 +55,7 @@ struct ExportedInterface {
 template <class T>
 struct ExportedArgument;
 
+/// An integer of either sign in the value that fits the parameter's width.
 template <IntegerNumber Integer>
 struct ExportedArgument<Integer> {
   static bool decode(PayloadValue value, Integer& out, std::string& /*fault*/) {
@@ -71,18 +72,21 @@ struct ExportedArgument<Integer> {
   }
 };
 
+/// A dictionary that stays encoded; nil for none.
 template <>
 struct ExportedArgument<std::optional<Payload>> {
   static bool decode(PayloadValue value, std::optional<Payload>& out, std::string& fault);
   static std::string expected();
 };
 
+/// A dictionary as a tree of values; nil for none.
 template <>
 struct ExportedArgument<std::optional<Dictionary>> {
   static bool decode(PayloadValue value, std::optional<Dictionary>& out, std::string& fault);
   static std::string expected();
 };
 
+/// A list of signed 64-bit integers; nil for none.
 template <>
 struct ExportedArgument<std::optional<std::vector<std::int64_t>>> {
   static bool decode(PayloadValue value, std::optional<std::vector<std::int64_t>>& out,
@@ -124,6 +128,7 @@ struct ExportedOperation<Operation> {
   }
 
  private:
+  // Decodes in order and stops at the first argument that does not fit.
   template <std::size_t... Index>
   static void decode(const ExportedMethod& method, std::span<const PayloadValue> arguments,
                      Values& values, std::optional<std::string>& wrong,

@@ -17,7 +17,9 @@ namespace quarvel {
 class ReplySink {
  public:
   virtual ~ReplySink() = default;
+  /// The call succeeded; `value` may be nil.
   virtual void result(Value value) = 0;
+  /// The call was refused.
   virtual void error(const Error& error) = 0;
 };
 
@@ -29,9 +31,11 @@ class Reply {
   Reply() = default;
   explicit Reply(std::shared_ptr<ReplySink> sink) : sink_(std::move(sink)) {}
 
+  /// Answers the call. From any thread; never blocks.
   void operator()(T answer) const {
     if (sink_) sink_->result(Value(std::move(answer)));
   }
+  /// Whether there is a call to answer.
   explicit operator bool() const { return sink_ != nullptr; }
 
  private:

@@ -33,14 +33,17 @@ struct MessageIdentity {
 /// of its payload, which is shared.
 class PayloadHistory {
  public:
+  /// Adds a message with its enriched payload.
   void append(const MessageIdentity& identity, Payload payload) {
     const MutexLock lock(mutex_);
     entries().emplace_back(SentMessage{identity, std::move(payload)});
   }
+  /// Adds an orientation entry.
   void append(Dictionary dictionary) {
     const MutexLock lock(mutex_);
     entries().emplace_back(std::make_unique<const Dictionary>(std::move(dictionary)));
   }
+  /// Adds the user information before all other entries.
   void insertAtFront(Dictionary dictionary) {
     const MutexLock lock(mutex_);
     entries().emplace_front(std::make_unique<const Dictionary>(std::move(dictionary)));

@@ -96,21 +96,26 @@ class ZQReportingServerInstance final
   /// the client list, on the `ServerQueue`. A second call does nothing. From any thread.
   void handleConnectionError();
 
+  /// The client's process. From any thread.
   [[nodiscard]] std::int32_t processIdentifier() const { return processIdentifier_; }
   /// The time of registration, absent before. From any thread, like the next three.
   [[nodiscard]] std::optional<Date> clientStartDate() const;
   void setClientStartDate(Date date);
   [[nodiscard]] std::optional<std::string> clientProcessName() const;
   void setClientProcessName(std::optional<std::string> name);
+  /// This client's sessions by identifier.
   [[nodiscard]] const SessionMap& clientReportingSessionMap() const
       QUARVEL_REQUIRES(serverQueueRole) {
     return clientReportingSessionMap_;
   }
 
  private:
+  /// Sends `session` the rise of the driver counters since its start as a message, if there is any.
   void reportDriverStatistics(ZQReportingSession& session) QUARVEL_REQUIRES(serverQueueRole);
+  /// Routes a message to the named sessions; counts a message without a session as dropped.
   void routeByIDs(const std::optional<Payload>& payload, std::uint32_t category, std::uint16_t type,
                   const std::vector<ReporterID>& reportingIDs) QUARVEL_REQUIRES(serverQueueRole);
+  /// Routes a message to every started session, or sends it as a single message without one.
   void broadcast(ZQReportingServiceDelegateProtocol& delegate,
                  const std::optional<Payload>& payload, std::uint32_t category, std::uint16_t type)
       QUARVEL_REQUIRES(serverQueueRole);
@@ -119,6 +124,8 @@ class ZQReportingServerInstance final
   const CountedAs counted_{Gauge::clients};
   const std::weak_ptr<ZQReportingServiceDelegateProtocol> delegate_;
 
+  // The delegate sets these on the `ServerQueue`; the invalidation handler reads them on a platform
+  // thread.
   mutable Mutex clientMutex_;
   std::optional<Date> clientStartDate_ QUARVEL_GUARDED_BY(clientMutex_);
   std::optional<std::string> clientProcessName_ QUARVEL_GUARDED_BY(clientMutex_);
@@ -172,7 +179,9 @@ class ZQReportingServiceDelegate final
   [[nodiscard]] static Dictionary ZQReportingDefaults();
 
  private:
+  /// Registers for changes of the preferences. A failure is logged and leaves the service without.
   void listenForDefaultsNotification();
+  /// Reads the preferences and merges them into every session. Ignores a foreign `token`.
   void readDefaults(NotificationToken token) QUARVEL_REQUIRES(serverQueueRole);
 
   /// Covers the export of a server instance and the search across clients.

@@ -92,10 +92,13 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
   /// and not on one class of device.
   [[nodiscard]] bool shouldReportOrientation() const;
 
+  // Without a queue in their declaration: from any thread.
+
   [[nodiscard]] ReporterID reporterID() const { return reporterID_; }
   [[nodiscard]] const std::vector<std::int32_t>& processIdentifiers() const {
     return processIdentifiers_;
   }
+  /// Whether a start has not been followed by a stop.
   [[nodiscard]] bool started() const QUARVEL_REQUIRES(serverQueueRole) { return started_; }
   /// Never true: nothing sets it.
   [[nodiscard]] bool relmReportingSessionStarted() const { return relmReportingSessionStarted_; }
@@ -129,17 +132,29 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
   /// The pieces of a category's and a type's names: component, kind, type.
   using MessageName = std::array<std::string_view, 3>;
 
+  /// Counts a message and returns its identity.
   [[nodiscard]] MessageIdentity nextIdentity(std::uint32_t category, std::uint16_t type)
       QUARVEL_REQUIRES(serverQueueRole);
+  // On the session's queue.
+
+  /// Creates the agent session and waits for its backends; drops it when none is found in time.
   void setUpAgent(const SharedDictionary& userInfo, const std::string& serviceName,
                   bool backendFound);
+  /// Hands a message to the agent. `wasStarted`: the session's state at the sending, which chooses
+  /// between the agent session and a single message.
   void deliver(const Payload& enriched, std::uint32_t category, std::uint16_t type,
                const Payload& original, bool wasStarted);
-  void acceptMessage() const;
-  void sendSummary() QUARVEL_REQUIRES(serverQueueRole);
+  /// Flushes and releases the agent session.
   void endAgent();
+
+  // On the `ServerQueue`.
+
+  void acceptMessage() const;
+  /// Sends the summary of a run that has a history.
+  void sendSummary() QUARVEL_REQUIRES(serverQueueRole);
   void registerOrientationHandlers() QUARVEL_REQUIRES(serverQueueRole);
   void unregisterOrientationHandlers() QUARVEL_REQUIRES(serverQueueRole);
+  /// Writes `history` as a JSON file into the diagnostics directory. Failures are logged.
   void writeSummaryLogFile(const PayloadHistory& history) const;
   void setAggregatedPayloadData(std::shared_ptr<PayloadHistory> history);
 
@@ -164,6 +179,7 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
   /// Shared with the agent set-up deliberately: it sees merges that precede its run.
   const std::shared_ptr<SharedDictionary> userInfo_ = std::make_shared<SharedDictionary>();
 
+  // The `ServerQueue` replaces it; orientation handlers read it on a platform thread.
   mutable Mutex historyMutex_;
   std::shared_ptr<PayloadHistory> aggregatedPayloadData_ QUARVEL_GUARDED_BY(historyMutex_);
 

@@ -1,6 +1,6 @@
 #include <gmock/gmock.h>
 
-#include "tests/Statistics/Service/SessionOwner.h"
+#include "tests/Statistics/Service/CoreFixtures.h"
 
 // Additional work of internal builds. A program of its own, since a process reads only once whether
 // it belongs to one.

@@ -215,13 +215,11 @@ class SimulatedClient {
   /// Breaks the protocol (interruption, then invalidation) or goes away (invalidation alone).
   void end(bool interrupted = false);
 
-  // For asserting that they are released.
+  /// For asserting that it is released.
   [[nodiscard]] std::weak_ptr<ClientConnection> connection() const;
-  [[nodiscard]] std::weak_ptr<ExportedObject> exportedObject() const { return *exportedObject_; }
 
  private:
   std::weak_ptr<SimulatedConnection> connection_;
-  std::shared_ptr<const std::weak_ptr<ExportedObject>> exportedObject_;
 };
 
 /// The process's listener, owned by the `Simulation`.

@@ -41,7 +41,6 @@ class SimulatedConnection final : public ClientConnection,
   }
   void setExportedObject(std::shared_ptr<ExportedObject> object) override {
     object_ = std::move(object);
-    *observedObject = object_;
   }
   [[nodiscard]] std::shared_ptr<ExportedObject> exportedObject() const override { return object_; }
   void setInterruptionHandler(std::function<void()> handler) override {
@@ -85,9 +84,6 @@ class SimulatedConnection final : public ClientConnection,
     Simulation::current().arrivals.push_back({kind, client_, std::move(call)});
   }
 
-  const std::shared_ptr<std::weak_ptr<ExportedObject>> observedObject =
-      std::make_shared<std::weak_ptr<ExportedObject>>();
-
  private:
   const std::int32_t processIdentifier_;
   const std::size_t client_;
@@ -99,7 +95,7 @@ class SimulatedConnection final : public ClientConnection,
 };
 
 SimulatedClient::SimulatedClient(const std::shared_ptr<SimulatedConnection>& connection)
-    : connection_(connection), exportedObject_(connection->observedObject) {}
+    : connection_(connection) {}
 
 SimulatedClient::Call SimulatedClient::call(std::string method, const List& arguments) {
   auto call = std::make_shared<RecordedCall>();

@@ -1,7 +1,7 @@
 #include <fmt/format.h>
 #include <gmock/gmock.h>
 
-#include "tests/Statistics/Service/RunningService.h"
+#include "tests/Statistics/Service/CoreFixtures.h"
 
 // Log lines and their order, and cases that need a special set-up. The simulation checks the fate
 // of messages.
@@ -20,84 +20,80 @@ const Value kYes(true);
 const std::string kDelegate = "-[ZQReportingServiceDelegate ";
 const std::string kInstance = "-[ZQReportingServerInstance ";
 
-// The journal of one call. Lines of the operation itself lose "log " and the function's name.
-Lines JournalOf(RunningService& service, Client& client, const std::string& method,
-                const List& arguments) {
-  service.journal.clear();
-  client.call(method, arguments);
-  service.run();
-  Lines lines = service.journal.lines({"log", "trace", "reply", "exit"});
-  const std::string own = " zqrs " + kInstance + method + "]: ";
-  for (std::string& line : lines) {
-    if (const auto at = line.find(own); at != std::string::npos) {
-      line = line.substr(4, at - 4) + ": " + line.substr(at + own.size());
-    } else if (line.starts_with("reply " + method)) {
-      line = "reply" + line.substr(6 + method.size());
-    }
-  }
-  return lines;
-}
-
 TEST(ServerInstance, OperationsLogTraceAndReplyInOrder) {
-  struct Case {
-    const char* method;
-    List arguments;
-    Lines journal;
-  };
-  const std::string notFound = "log error zqrs " + kDelegate +
-                               "findReportingSessionForID:]: failed to find reporting session 99";
-  const Case kCases[] = {
-      {"createReportingSession:reply:",
-       {8},
-       {"debug: creating session for reporter 8", "trace 0x21042814",
-        "log info zqrr -[ZQReportingSession initWithID:processIdentifiers:]: created reporting "
-        "session for ID: 8",
-        "trace 0x21042828", "default: session created for reporter 8", "reply true"}},
-      {"setServiceType:reportingSession:reply:",
-       {2, 7},
-       {"debug: setting service type 2 for reporter 7",
-        "log info zqrr -[ZQReportingSession setServiceType:]: setting service type telephony",
-        "default: service type 2 set for reporter  7", "reply true"}},
-      {"getServiceNameForReporterID:reply:",
-       {7},
-       {"debug: fetching seviceType", "reply 2",
-        "default: returnning service type 2 for reporter  7"}},
-      {"getServiceNameForReporterID:reply:",
-       {0},
-       {"debug: fetching seviceType", "reply 65535", "reply 65535",
-        "default: returnning service type 65535 for reporter  0"}},
-      {"setConfiguration:forReporterID:reply:",
-       {Value(), 7},
-       {"debug: setting configuration", "reply true"}},
-      {"startReportingSessionForID:reply:",
-       {99},
-       {"debug: starting session for reporter 99", "trace 0x21042818", notFound}},
-      {"stopReportingSessionForID:reply:",
-       {7},
-       {"debug: stopping session for reporter 7", "trace 0x2104281c",
-        "default: nothing interesting to fetch from the drivers", "default: stopping 7",
-        "reply true"}},
-      {"reporterID:valid:",
-       {7},
-       {"debug: validating reporter 7", "default: validating reporter 7",
-        "reply {\"reporterID\":7,\"serviceType\":2}"}},
-      {"destroyReportingSession:reply:",
-       {8},
-       {"debug: destroying session for reporter 8", "trace 0x21042820", "trace 0x21042834",
-        "log info zqrr -[ZQReportingSession dealloc]: deallocing this session 8",
-        "default: destroying 8", "reply true"}},
-      {"killService:", {}, {"default: DESTROYING SERVICE", "exit 2"}},
-  };
+  // Each call, then its journal. "+" stands for the operation's own log lines.
+  const std::vector<std::pair<std::string, List>> kCalls = {
+      {"createReportingSession:reply:", {8}},
+      {"setServiceType:reportingSession:reply:", {2, 7}},
+      {"getServiceNameForReporterID:reply:", {7}},
+      {"getServiceNameForReporterID:reply:", {0}},
+      {"setConfiguration:forReporterID:reply:", {Value(), 7}},
+      {"startReportingSessionForID:reply:", {99}},
+      {"stopReportingSessionForID:reply:", {7}},
+      {"reporterID:valid:", {7}},
+      {"destroyReportingSession:reply:", {8}},
+      {"killService:", {}}};
+  const std::string kJournal = R"(
++debug: creating session for reporter 8
+trace 0x21042814
+log info zqrr -[ZQReportingSession initWithID:processIdentifiers:]: created reporting session for ID: 8
+trace 0x21042828
++default: session created for reporter 8
+reply true
++debug: setting service type 2 for reporter 7
+log info zqrr -[ZQReportingSession setServiceType:]: setting service type telephony
++default: service type 2 set for reporter  7
+reply true
++debug: fetching seviceType
+reply 2
++default: returnning service type 2 for reporter  7
++debug: fetching seviceType
+reply 65535
+reply 65535
++default: returnning service type 65535 for reporter  0
++debug: setting configuration
+reply true
++debug: starting session for reporter 99
+trace 0x21042818
+log error zqrs -[ZQReportingServiceDelegate findReportingSessionForID:]: failed to find reporting session 99
++debug: stopping session for reporter 7
+trace 0x2104281c
++default: nothing interesting to fetch from the drivers
++default: stopping 7
+reply true
++debug: validating reporter 7
++default: validating reporter 7
+reply {"reporterID":7,"serviceType":2}
++debug: destroying session for reporter 8
+trace 0x21042820
+trace 0x21042834
+log info zqrr -[ZQReportingSession dealloc]: deallocing this session 8
++default: destroying 8
+reply true
++default: DESTROYING SERVICE
+exit 2)";
   for (const auto seed : Seeds()) {
     RunningService service(seed);
     Client client = service.connect(42);
     client.create(7);
     service.run();
     service.log.verbose = {"zqrs"};
-    for (const Case& each : kCases) {
-      EXPECT_EQ(JournalOf(service, client, each.method, each.arguments), each.journal)
-          << each.method << " " << JsonText(Value(each.arguments));
+    std::string journal;
+    for (const auto& [method, arguments] : kCalls) {
+      service.journal.clear();
+      client.call(method, arguments);
+      service.run();
+      for (std::string line : service.journal.lines({"log", "trace", "reply", "exit"})) {
+        const std::string own = " zqrs " + kInstance + method + "]";
+        if (const auto at = line.find(own); at != std::string::npos) {
+          line.erase(at, own.size()).replace(0, 4, "+");
+        } else if (line.starts_with("reply " + method)) {
+          line.erase(5, method.size() + 1);
+        }
+        journal += '\n' + line;
+      }
     }
+    EXPECT_EQ(journal, kJournal);
   }
 }
 

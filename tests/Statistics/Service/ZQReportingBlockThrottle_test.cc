@@ -211,17 +211,11 @@ struct Completion {
 
 TEST(WaitForCompletion, ReturnsAtItsFirstLookThatFindsNothingPending) {
   struct Row {
-    const char* name;
-    std::optional<double> delay;
+    std::optional<double> delay;  // none: nothing pending
     Scheduler::Duration over;
   };
-  const Row rows[] = {{"nothing pending", std::nullopt, 0s},
-                      {"one pause", 0.3, 500ms},
-                      {"two pauses", 0.7, 1s},
-                      {"the last pause", 4.75, 5s}};
   for (const auto seed : Seeds()) {
-    for (const Row& row : rows) {
-      SCOPED_TRACE(row.name);
+    for (const Row& row : {Row{std::nullopt, 0s}, Row{0.7, 1s}, Row{4.75, 5s}}) {
       Throttled throttled(seed);
       if (row.delay) throttled.add("a", Delayed(*row.delay));
       const Completion completion(throttled);

@@ -2,7 +2,7 @@
 
 #include <gmock/gmock.h>
 
-#include "tests/Statistics/Service/SessionOwner.h"
+#include "tests/Statistics/Service/CoreFixtures.h"
 
 namespace quarvel {
 namespace {
