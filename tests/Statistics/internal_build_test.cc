@@ -70,6 +70,7 @@ TEST_F(InternalBuild, TheSummaryHasOrientationChangesToTheMillisecond) {
     owner.runFor(1s);
     SimulatedOrientation::turn(owner.orientation.ui, Orientation::portrait);
     owner.runFor(1s);
+    owner.scheduler.setWallClock(owner.scheduler.wallClock() - 10s);  // before the start
     SimulatedOrientation::turn(owner.orientation.device, Orientation::portrait);
     owner.runFor(0s);
     owner.stop();
@@ -77,7 +78,7 @@ TEST_F(InternalBuild, TheSummaryHasOrientationChangesToTheMillisecond) {
     EXPECT_EQ(owner.delivered().at(0).payload.root().toDictionary(),
               (Dictionary{{"ZQ_Session_Summary_Event", "2"},
                           {"device_orientation", "landscapeLeft,portrait"},
-                          {"device_orientation_time", "1.235,3.235"},
+                          {"device_orientation_time", "1.235,6.765"},
                           {"ui_orientation", "portrait"},
                           {"ui_orientation_time", "2.235"}}));
   }

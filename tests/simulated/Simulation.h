@@ -109,6 +109,7 @@ class Simulation {
   /// Switch: waits in a `Condition` may end without a signal, at a moment chosen by the seed.
   bool spuriousWakeUps = false;
   std::vector<CreatedQueue> queues;
+  std::size_t briefBlocks = 0;  // on all queues
   // Device properties.
   bool internalBuild = false;
   std::optional<std::int64_t> deviceClass;

@@ -19,6 +19,10 @@ class SimulatedWorkQueue final : public WorkQueue {
     TheScheduler().enqueue(queue_, std::move(block));
     TheScheduler().mayYield();
   }
+  void asyncBrief(Block block) override {
+    ++Simulation::current().briefBlocks;
+    async(std::move(block));
+  }
   void after(std::chrono::milliseconds delay, Block block) override {
     TheScheduler().after(delay, [queue = queue_, late = std::move(block)]() mutable {
       TheScheduler().enqueue(queue, std::move(late));

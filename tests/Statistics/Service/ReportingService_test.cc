@@ -211,6 +211,19 @@ SEEDED_TEST(Routing, SinksPrecedeANamedSessionAndFollowABroadcastOne, RunningSer
                                  "\"<ZQReportingSession 6>\"]"));
 }
 
+TEST(Routing, OnlyAMessageToAtMostEightSessionsIsABriefBlock) {
+  RunningService service(1);
+  Client client = service.connect(41);
+  const std::pair<std::optional<List>, std::size_t> kCases[] = {
+      {List(8, Value(1)), 1}, {List(9, Value(1)), 0}, {std::nullopt, 0}};
+  for (const auto& [reporterIDs, briefBlocks] : kCases) {
+    service.briefBlocks = 0;
+    client.send({}, 3, 1, reporterIDs);
+    service.run();
+    EXPECT_EQ(service.briefBlocks, briefBlocks);
+  }
+}
+
 SEEDED_TEST(Routing, AFullAgentDelaysNoReply, RunningService) {
   Client client = connect(41);
   client.createStarted(7);
