@@ -133,9 +133,9 @@ class Service:
 class Client:
     """One connection. `call` waits for the reply; `send` does not."""
 
-    def __init__(self, service):
+    def __init__(self, service, patience=PATIENCE):
         self._socket = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
-        self._socket.settimeout(PATIENCE)
+        self._socket.settimeout(patience)
         try:
             self._socket.connect(str(service.socket))
         except OSError:
@@ -226,7 +226,7 @@ class ServiceTest(unittest.TestCase):
         self.addCleanup(service.finish)
         return service
 
-    def client(self, service):
-        client = Client(service)
+    def client(self, service, **options):
+        client = Client(service, **options)
         self.addCleanup(client.close)
         return client

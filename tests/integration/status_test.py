@@ -5,16 +5,19 @@ import json
 import os
 import shutil
 import subprocess
+import threading
 import time
 import unittest
 
-from harness import ServiceTest, eventually
+from harness import PATIENCE, ServiceTest, eventually
 
 CAN_MOUNT = shutil.which("unshare") and subprocess.run(
     ["unshare", "-m", "mount", "-t", "tmpfs", "tmpfs", "/mnt"], capture_output=True, check=False).returncode == 0
 # Runs the service with a file system of its own for its store, which others see through /proc.
+FLOOD = 5000  # messages: more than the store's queue, one connection's calls and its socket hold together
+SEND = "sendMessage:withCategory:andType:forReportingIDs:reply:"
 ON_SMALL_DISK = ["unshare", "-m", "sh", "-c",
-                 'mount -t tmpfs -o size=2m tmpfs "$STATE_DIRECTORY" && exec "$0" "$@"']
+                 'mount -t tmpfs -o size=8m tmpfs "$STATE_DIRECTORY" && exec "$0" "$@"']
 
 
 class Status(ServiceTest):
@@ -78,14 +81,17 @@ class Status(ServiceTest):
     @unittest.skipUnless(CAN_MOUNT, "needs a file system of its own")
     def test_a_full_disk_holds_rows_and_senders_and_shows_in_the_status(self):
         service = self.service(wrapper=ON_SMALL_DISK)
-        state = f"/proc/{service.process.pid}/root/{service.directory}/state"
-        with open(f"{state}/ballast", "wb") as ballast, contextlib.suppress(OSError):
+        flood, other = self.client(service), self.client(service, patience=PATIENCE / 12)
+        for reporter, client in ((1, flood), (2, other)):
+            client.start_session(reporter)
+        service_state = f"/proc/{service.process.pid}/root/{service.directory}/state"
+        eventually(lambda: self.status(service)["store_queue"]["rows"] == 0, "both agent sessions are stored")
+        with open(f"{service_state}/ballast", "wb") as ballast, contextlib.suppress(OSError):
             for _ in range(4096):
                 os.write(ballast.fileno(), bytes(4096))
-        client = self.client(service)
-        for number in range(400):
-            client.send("sendMessage:withCategory:andType:forReportingIDs:reply:",
-                        {"n": number, "text": "x" * 3000}, 3, 1, None)
+        sender = threading.Thread(daemon=True, target=lambda: [
+            flood.send(SEND, {"n": number, "text": "x" * 100}, 3, 1, [1]) for number in range(FLOOD)])
+        sender.start()
         status = eventually(lambda: (lambda s: s if s["store"]["error"] else None)(self.status(service)),
                             "the status tells of the full disk")
         self.assertFalse(status["healthy"])
@@ -93,11 +99,22 @@ class Status(ServiceTest):
         # What was moved out of the log may make room for a few rows once more.
         eventually(lambda: (lambda told: (told.returncode, told.stdout.splitlines()[0]))(
             service.ctl("status")) == (1, "not healthy"), "the tool tells of it too")
+
+        def is_full():
+            before = self.status(service)["store_queue"]["rows"]
+            time.sleep(0.3)
+            return before == self.status(service)["store_queue"]["rows"] and sender.is_alive()
+        eventually(is_full, "the store's queue takes no more of the flood")
+        # The I/O thread must not wait for the store: it serves the other clients too.
+        for number in range(20):
+            other.message({"n": number}, [2])
+        self.assertTrue(is_full())
         time.sleep(1)  # it tries again and again
         self.assertEqual(service.log().count("fails:"), 1)
-        os.unlink(f"{state}/ballast")
-        status = self.settled(service, 400)
-        self.assertEqual(status["counters"]["stored"], 401)
+        os.unlink(f"{service_state}/ballast")
+        sender.join(PATIENCE)
+        status = self.settled(service, 2 * (FLOOD + 20))
+        self.assertEqual(status["counters"]["stored"], 2 * (FLOOD + 20) + 1)
         self.assertTrue(status["healthy"])
 
 
