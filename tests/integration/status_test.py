@@ -1,4 +1,4 @@
-"""What the installed service tells of itself, and what becomes of what it was sent."""
+"""The installed service's status and counters, and its behaviour on a full disk."""
 
 import contextlib
 import json
@@ -13,7 +13,7 @@ from harness import PATIENCE, ServiceTest, eventually
 
 CAN_MOUNT = shutil.which("unshare") and subprocess.run(
     ["unshare", "-m", "mount", "-t", "tmpfs", "tmpfs", "/mnt"], capture_output=True, check=False).returncode == 0
-# Runs the service with a file system of its own for its store, which others see through /proc.
+# Runs the service with a small file system for its store, which the test reaches through /proc.
 FLOOD = 5000  # messages: more than the store's queue, one connection's calls and its socket hold together
 SEND = "sendMessage:withCategory:andType:forReportingIDs:reply:"
 ON_SMALL_DISK = ["unshare", "-m", "sh", "-c",
@@ -25,8 +25,8 @@ class Status(ServiceTest):
         return json.loads(service.ctl("status", "--json").stdout)
 
     def settled(self, service, accepted):
-        """The status once so many rows have come and none waits; the counters always add up. The
-        client that looks whether the service is up leaves one row, its uptime."""
+        """The status once so many rows are accepted and none waits; the counters always add up. One row more
+        is the uptime of the client that checked the service's start."""
         def nothing_waits():
             status = self.status(service)
             counters = status["counters"]
@@ -43,7 +43,7 @@ class Status(ServiceTest):
         client.start_session(2, 11)
         for number in range(20):
             client.message({"n": number}, [1, 2, 3, 0])
-        # Each message once for each ID, and an analytics event for each session that there is.
+        # Each message counts once for each ID, and has an analytics event for each existing session.
         status = self.settled(service, 20 * (4 + 2))
         self.assertTrue(status["healthy"], status)
         self.assertEqual((status["clients"], status["sessions"], status["started_sessions"]), (1, 2, 2))
@@ -54,11 +54,11 @@ class Status(ServiceTest):
         client.close()
         service.end()
         service.start()
-        # And a summary of each session, one of which is a test; the uptimes of two more clients.
+        # The summaries of both sessions, of which one is a test, and the uptimes of two more clients.
         again = self.settled(service, 20 * (4 + 2) + 2 + 2)
         self.assertEqual(again["counters"]["dropped"]["test"], 21)
 
-    def test_people_get_a_verdict_and_an_exit_status(self):
+    def test_the_tool_prints_a_verdict_and_has_an_exit_status(self):
         service = self.service()
         told = service.ctl("status")
         self.assertEqual((told.returncode, told.stderr), (0, ""))
@@ -69,7 +69,7 @@ class Status(ServiceTest):
         self.assertEqual((told.returncode, told.stdout), (1, ""))
         self.assertIn("The service does not answer", told.stderr)
 
-    def test_nothing_is_written_unasked_and_the_files_are_nobody_elses(self):
+    def test_the_status_is_written_on_demand_and_files_are_not_public(self):
         service = self.service()
         self.client(service).message({"n": 1}, None)
         self.assertFalse((service.directory / "run/status.json").exists())
@@ -93,12 +93,12 @@ class Status(ServiceTest):
             flood.send(SEND, {"n": number, "text": "x" * 100}, 3, 1, [1]) for number in range(FLOOD)])
         sender.start()
         status = eventually(lambda: (lambda s: s if s["store"]["error"] else None)(self.status(service)),
-                            "the status tells of the full disk")
+                            "the full disk in the status")
         self.assertFalse(status["healthy"])
         self.assertIn("full", status["problems"][0])
-        # What was moved out of the log may make room for a few rows once more.
+        # A checkpoint may make room for a few rows.
         eventually(lambda: (lambda told: (told.returncode, told.stdout.splitlines()[0]))(
-            service.ctl("status")) == (1, "not healthy"), "the tool tells of it too")
+            service.ctl("status")) == (1, "not healthy"), "the tool's verdict")
 
         def is_full():
             before = self.status(service)["store_queue"]["rows"]
@@ -109,7 +109,7 @@ class Status(ServiceTest):
         for number in range(20):
             other.message({"n": number}, [2])
         self.assertTrue(is_full())
-        time.sleep(1)  # it tries again and again
+        time.sleep(1)  # the writer retries several times
         self.assertEqual(service.log().count("fails:"), 1)
         os.unlink(f"{service_state}/ballast")
         sender.join(PATIENCE)
