@@ -132,10 +132,10 @@ class Otlp(ServiceTest):
 
         (record,) = self.collector.records()
         body = plain(record["body"])
-        for key, value in {"least": -2**63, "most": str(2**64 - 1), "half": 0.5, "whole": 2.0, "yes": True,
-                           "none": None, "nan": "NaN", "endless": "-Infinity", "empty": {}, "nothing": [],
-                           "bytes": "AP8=", "when": "2026-01-31T12:00:00.000005Z",
-                           "nested": [[1, [{}]], {"a": {"b": [2]}}], "7": "\u00e4\n\"\\"}.items():
+        received = {str(key): value for key, value in sent.items()} | {
+            "most": str(2**64 - 1), "nan": "NaN", "endless": "-Infinity", "bytes": "AP8=",
+            "when": "2026-01-31T12:00:00.000005Z"}
+        for key, value in received.items():
             self.assertEqual((type(body[key]), body[key]), (type(value), value), key)
         row = service.rows("SELECT * FROM message")[0]
         self.assertEqual(record["timeUnixNano"], f"{row['sent_at']}000")

@@ -98,7 +98,7 @@ class Preferences(ServiceTest):
                        reporting_server_verbose=True)
         service.notify()
         eventually(lambda: not refused(), "reporting is on")
-        self.assertEqual(self.verbose_scopes(service, client), {"zqrr", "zqrs"})
+        eventually(lambda: self.verbose_scopes(service, client) == {"zqrr", "zqrs"}, "verbose lines")
         service.prefer(disable_reporting=False, device_name="bench 7", reporting_session_verbose=True)
         service.notify()
         eventually(lambda: self.verbose_scopes(service, client) == {"zqrr"}, "verbose lines of sessions alone")

@@ -68,9 +68,6 @@ class Numbers(ServiceTest):
         self.addCleanup(lambda: [each.close() for each in connected])
         return connected
 
-    def descriptors(self, service):
-        return len(os.listdir(f"/proc/{service.process.pid}/fd"))
-
     def idles(self, service):
         """Whether the service uses less than a fifth of a core while no client calls."""
         before = hostile.processor_seconds(service.process)
@@ -83,7 +80,7 @@ class Numbers(ServiceTest):
         polite.start_session(1)
         began = time.monotonic()
         connected = self.connect(service, self.most)
-        eventually(lambda: self.descriptors(service) > self.most, "all are accepted")
+        eventually(lambda: len(os.listdir(f"/proc/{service.process.pid}/fd")) > self.most, "all are accepted")
         figure("connections", f"{self.most} in {time.monotonic() - began:.1f} s, "
                               f"{hostile.resident(service.process):.0f} MB")
         polite.message({"beside": self.most}, [1])

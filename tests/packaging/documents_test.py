@@ -29,6 +29,10 @@ class Documents(ServiceTest):
             linted = run("mandoc", "-Tlint", "-W", "warning", page)
             self.assertEqual((linted.returncode, linted.stdout), (0, ""), page.name)
 
+    def test_the_protocol_quotes_the_example(self):
+        example = (SOURCE / "examples/client.py").read_text()
+        self.assertIn(f"```python\n{example}```\n", (SOURCE / "docs/protocol.md").read_text())
+
     def sources(self):
         return [path.read_text() for folder in PRODUCT for path in sorted((SOURCE / folder).rglob("*.cc"))]
 
