@@ -1,10 +1,10 @@
-"""Counts the instructions that one message costs the service on its way from socket to store, with
-callgrind, and fails when they are a tenth more than the budget says.
+"""Counts the instructions that one message costs the service from its socket to its store, with
+callgrind, and fails when they exceed the budget by a tenth.
 
-Usage: instructions.py QUARVELD SERVICE-LOAD QUARVELCTL BUDGET
+Usage: bench/instructions.py QUARVELD SERVICE-LOAD QUARVELCTL BUDGET
 
-Counts repeat where times do not. What it costs to start and to end is in both runs and cancels out. A
-change that makes a message dearer on purpose changes BUDGET with it; one that makes it cheaper should.
+Counts repeat where times do not. Both runs start and end the service, so these costs cancel out. A change
+that makes a message dearer on purpose raises BUDGET; a change that makes it cheaper lowers BUDGET.
 """
 
 import contextlib
@@ -15,20 +15,13 @@ import sqlite3
 import subprocess
 import sys
 import tempfile
-import time
 
-FEW, MANY = 1000, 9000
-# Where others keep the cores busy, the store's transactions are small, which makes a message dearer.
+sys.path.insert(0, str(pathlib.Path(__file__).parents[1] / "tests/integration"))
+from harness import PATIENCE, eventually
+
+FEW, MANY = 1000, 9000  # messages
+# On a busy machine the store commits small transactions, which makes a message dearer.
 ATTEMPTS = 12
-PATIENCE = 300
-
-
-def until(condition, what):
-    deadline = time.monotonic() + PATIENCE
-    while not condition():
-        if time.monotonic() > deadline:
-            sys.exit(f"never came about: {what}")
-        time.sleep(0.05)
 
 
 def stored(database):
@@ -39,8 +32,8 @@ def stored(database):
 
 
 def instructions(quarveld, load, ctl, messages):
-    """Of a whole life of the service with so many messages of one session, which is not stopped: its
-    summary would count too."""
+    """Instructions of a service that takes so many messages of one session. The session is not stopped,
+    since its summary would count too."""
     with tempfile.TemporaryDirectory(prefix="quarvel-") as name:
         directory = pathlib.Path(name)
         (directory / "quarvel.toml").write_text('[log]\nlevel = "error"\n[analytics]\nwanted = []\n')
@@ -51,15 +44,14 @@ def instructions(quarveld, load, ctl, messages):
         service = subprocess.Popen(
             ["valgrind", "--tool=callgrind", "--callgrind-out-file=/dev/null", quarveld],
             env=environment, stderr=subprocess.PIPE, text=True)
-        until((directory / "reporting.sock").exists, "the service's socket")
+        eventually((directory / "reporting.sock").exists, "the service's socket", 0.05)
         sender = subprocess.Popen([load, directory / "reporting.sock", str(messages)],
-                                  stdin=subprocess.PIPE, stdout=subprocess.PIPE)
-        sender.stdout.readline()
-        until(lambda: stored(directory / "telemetry.db") >= messages, "the last row")
-        subprocess.run([ctl, "kill"], env=environment, check=False, capture_output=True)
-        said = service.communicate(timeout=PATIENCE)[1]
-        sender.communicate()
-        return int(re.search(r"Collected : (\d+)", said).group(1))
+                                  stdin=subprocess.PIPE, stdout=subprocess.DEVNULL)
+        eventually(lambda: stored(directory / "telemetry.db") >= messages, "the last row", 0.05)
+        subprocess.run([ctl, "kill"], env=environment, check=False, capture_output=True, timeout=PATIENCE)
+        report = service.communicate(timeout=PATIENCE)[1]
+        sender.communicate(timeout=PATIENCE)
+        return int(re.search(r"Collected : (\d+)", report).group(1))
 
 
 def main(quarveld, load, ctl, budget):
@@ -71,7 +63,7 @@ def main(quarveld, load, ctl, budget):
               flush=True)
         if each <= 1.1 * budget:
             return
-    sys.exit("A message has become dearer; callgrind_annotate says where.")
+    sys.exit("A message has become dearer; callgrind_annotate shows where.")
 
 
 if __name__ == "__main__":
