@@ -13,9 +13,9 @@ namespace {
 class Counted final : public CallTracker {
  public:
   [[nodiscard]] std::size_t bytes() const override { return 280; }
-  void ran(std::chrono::nanoseconds /*time*/) override {}
-  void carriedOut() override {}
-  void completed() override {}
+  void blockRan(std::chrono::nanoseconds /*time*/) override {}
+  void callExecuted() override {}
+  void callCompleted() override {}
 };
 
 // One producer to one serial queue, as connections feed the server's queue; timed until the last
