@@ -107,7 +107,7 @@ class StoreQueue {
   void committed(const Tally& tally, std::chrono::nanoseconds time) QUARVEL_EXCLUDES(mutex_);
   void lost(const Tally& tally) QUARVEL_EXCLUDES(mutex_);
 
-  /// Sets the counts to those of the opened database: its rows, and the drops that it has recorded.
+  /// Takes over the counts of the opened database: its rows, and the drops that it has recorded.
   void restart(std::uint64_t stored, const StoreDrops& kept) QUARVEL_EXCLUDES(mutex_);
   void droppedFromStore(StoreDrop reason, std::uint64_t rows) QUARVEL_EXCLUDES(mutex_);
 

@@ -74,8 +74,8 @@ class SocketConnection final : public ClientConnection,
 
   /// Closes a connection that the delegate did not accept. Calls no handler.
   void refuse();
-  /// Ends the connection as if its client had gone now: executes every call that has arrived,
-  /// whatever the limits, then calls the invalidation handler.
+  /// Ends the connection as if its client had gone now: executes every call that has arrived, beyond
+  /// any limit, then calls the invalidation handler.
   void drainAndEnd();
 
  private:

@@ -4,11 +4,11 @@
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <sys/socket.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <array>
 #include <cerrno>
-#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <utility>
@@ -73,13 +73,13 @@ constexpr ExportedInterface kTestInterface{"TestProtocol", kTestMethods};
 
 class TestDelegate final : public ServiceListenerDelegate {
  public:
-  explicit TestDelegate(Served& served) : served_(served) {}
+  explicit TestDelegate(Service& service) : service_(service) {}
 
   bool shouldAcceptNewConnection(ServiceListener&,
                                  const std::shared_ptr<ClientConnection>& connection) override {
     const auto object = std::make_shared<TestService>();
-    served_.connections.push_back(connection);
-    served_.objects.push_back(object);
+    service_.connections.push_back(connection);
+    service_.objects.push_back(object);
     connection->setExportedInterface(kTestInterface);
     connection->setExportedObject(object);
     // Handlers that hold the object, as a careless delegate's might, must not keep it alive.
@@ -90,14 +90,10 @@ class TestDelegate final : public ServiceListenerDelegate {
   }
 
  private:
-  Served& served_;
+  Service& service_;
 };
 
 }  // namespace
-
-std::shared_ptr<ServiceListenerDelegate> DelegateFor(Served& served) {
-  return std::make_shared<TestDelegate>(served);
-}
 
 Journal& Journal::shared() {
   static Journal journal;
@@ -124,21 +120,12 @@ std::vector<std::string> Journal::entries() {
   return entries_;
 }
 
-std::size_t Journal::count(std::string_view part) {
-  MutexLock lock(mutex_);
-  return countLocked(part);
-}
-
-std::size_t Journal::countLocked(std::string_view part) {
-  return static_cast<std::size_t>(std::ranges::count_if(entries_, [part](const std::string& entry) {
-    return entry.find(part) != std::string::npos;
-  }));
-}
-
 bool Journal::waitFor(std::string_view part) {
   const auto deadline = std::chrono::steady_clock::now() + kPatience;
   MutexLock lock(mutex_);
-  while (countLocked(part) == 0) {
+  while (std::ranges::none_of(entries_, [part](const std::string& entry) {
+    return entry.find(part) != std::string::npos;
+  })) {
     if (!changed_.waitUntil(mutex_, deadline)) return false;
   }
   return true;
@@ -255,29 +242,40 @@ std::string CallBytes(std::optional<std::uint32_t> messageID, std::string_view m
   return bytes;
 }
 
-Service::Service(const Configuration::Limits& limits, bool begun) {
+Service::Service(const Configuration::Limits& limits, bool begun, void (*run)(const Work&))
+    : run_(run) {
   journal.clear();
+  ::close(BoundSocket(socketPath(), SOCK_STREAM));
+  run_([&] {
+    if (auto listener = makeListener(limits)) {
+      listener_ = std::move(listener.value());
+    } else {
+      failure = std::move(listener.error());
+    }
+  });
+  if (begun && !failure) begin();
+}
+
+Result<std::unique_ptr<SocketListener>> Service::makeListener(const Configuration::Limits& limits) {
   SocketListener::Options options;
   options.limits = limits;
   options.atEnd.emplace_back([this] { journal.add("ended"); });
   auto socket = ListeningSocket::listeningAt(socketPath());
-  EXPECT_TRUE(socket) << socket.error().description();
+  if (!socket) return std::move(socket.error());
   auto listener = SocketListener::create(std::move(socket.value()), std::move(options));
-  EXPECT_TRUE(listener);
-  listener_ = std::move(listener.value());
-  listener_->setDelegate(DelegateFor(*this));
-  if (begun) begin();
+  if (listener) listener.value()->setDelegate(std::make_shared<TestDelegate>(*this));
+  return listener;
 }
 
 void Service::begin() {
-  serving_ = std::async(std::launch::async, [this] { listener_->resume(); });
+  serving_ = std::async(std::launch::async, [this] { run_([this] { listener_->resume(); }); });
 }
 
 void Service::end() {
   if (!serving_.valid()) return;
   requestEnd();
   if (serving_.wait_for(kPatience) != std::future_status::ready) {
-    std::fputs("the service does not end\n", stderr);
+    ADD_FAILURE() << "the service does not end";
     std::abort();
   }
   serving_.get();

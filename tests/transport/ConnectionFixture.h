@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <deque>
 #include <filesystem>
+#include <functional>
 #include <future>
 #include <memory>
 #include <optional>
@@ -38,7 +39,6 @@ class Journal {
   void clear();
   void add(std::string entry);
   std::vector<std::string> entries();
-  std::size_t count(std::string_view part);
   /// Waits until an entry contains `part`.
   bool waitFor(std::string_view part);
 
@@ -51,8 +51,6 @@ class Journal {
   bool waitForCalls(std::size_t count);
 
  private:
-  std::size_t countLocked(std::string_view part) QUARVEL_REQUIRES(mutex_);
-
   Mutex mutex_;
   ConditionVariable changed_;
   std::vector<std::string> entries_ QUARVEL_GUARDED_BY(mutex_);
@@ -89,20 +87,17 @@ class Client {
 std::string CallBytes(std::optional<std::uint32_t> messageID, std::string_view method,
                       const List& arguments);
 
-/// The connections that a delegate has accepted and their objects, in order. To be read once an
-/// invalidation handler has run.
-struct Served {
-  std::vector<std::weak_ptr<ClientConnection>> connections;
-  std::vector<std::weak_ptr<ExportedObject>> objects;
-};
-/// A delegate that exports operations that answer at once, later, at length or not at all.
-std::shared_ptr<ServiceListenerDelegate> DelegateFor(Served& served);
-
-/// A listener that serves on a thread of its own from `begin` to `end`.
-class Service : public Served {
+/// A listener on a thread of its own, from `begin` to `end`. Its delegate exports operations that
+/// answer at once, later, at length or not at all. It finds the socket file of a killed service.
+class Service {
  public:
-  /// With `begun` false, clients can connect but are not accepted yet.
-  explicit Service(const Configuration::Limits& limits = {}, bool begun = true);
+  using Work = std::function<void()>;
+  static void Run(const Work& work) { work(); }
+
+  /// With `begun` false, clients can connect but are not accepted yet. `run` runs the start and the
+  /// I/O thread.
+  explicit Service(const Configuration::Limits& limits = {}, bool begun = true,
+                   void (*run)(const Work&) = Run);
   ~Service() { end(); }
 
   Client connect() { return Client(socketPath()); }
@@ -113,8 +108,16 @@ class Service : public Served {
   void requestEnd() { listener_->requestEnd(); }
 
   Journal& journal = Journal::shared();
+  // The accepted connections and their objects; to be read once an invalidation handler has run.
+  std::vector<std::weak_ptr<ClientConnection>> connections;
+  std::vector<std::weak_ptr<ExportedObject>> objects;
+  /// Why the service could not start; none when it could.
+  std::optional<Error> failure;
 
  private:
+  Result<std::unique_ptr<SocketListener>> makeListener(const Configuration::Limits& limits);
+
+  void (*const run_)(const Work&);
   TemporaryDirectory directory_;
   std::unique_ptr<SocketListener> listener_;
   std::future<void> serving_;
