@@ -48,6 +48,10 @@ class TestService final : public ExportedObject {
   void later(std::int64_t number, Reply<std::int64_t> reply) {
     Journal::shared().keepCall(number, std::move(reply), CallRef());
   }
+  void answerUnstored(std::int64_t number, Reply<std::int64_t> reply) {
+    reply(number);
+    Journal::shared().keepCall(number, {}, CallRef::indirect(CallRef::current().tracker()));
+  }
   void make(std::int64_t number, std::uint32_t size, Reply<std::string> reply) {
     Journal::shared().addCall(number);
     reply(std::string(size, 'x'));
@@ -66,6 +70,7 @@ constexpr std::array kTestMethods{
     Exported<&TestService::refuse>("refuse:"),
     Exported<&TestService::keep>("keep:reply:"),
     Exported<&TestService::later>("later:reply:"),
+    Exported<&TestService::answerUnstored>("answerUnstored:reply:"),
     Exported<&TestService::make>("make:size:reply:"),
     Exported<&TestService::describe>("describe:code:list:reply:"),
 };

@@ -59,6 +59,15 @@ TEST(ConnectionLimits, AClientThatIsTooFastWaitsAndLosesNothing) {
   }
 }
 
+TEST(ConnectionLimits, CallsThatWaitForASlowBackendHoldBackLaterOnesForAMoment) {
+  Service service;
+  Client client = service.connect();
+  const auto began = std::chrono::steady_clock::now();
+  for (int i = 0; i < 200; ++i) ASSERT_TRUE(client.call(1, "answerUnstored:reply:", {i}));
+  EXPECT_TRUE(service.journal.waitForCalls(200)) << "none of them completes";
+  EXPECT_GE(std::chrono::steady_clock::now() - began, 50ms) << "more than 128 were unstored";
+}
+
 TEST(ConnectionLimits, ClientsThatReconnectWithoutPauseAreRateLimited) {
   Service service;
   const auto began = std::chrono::steady_clock::now();
