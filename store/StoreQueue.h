@@ -91,11 +91,12 @@ class StoreQueue {
   /// called or `deadline`, if there is one, has passed; `closed` once the queue is closed and
   /// empty.
   Take take(StoreBatch& batch, std::optional<Instant> deadline) QUARVEL_EXCLUDES(mutex_);
-  /// Has `take` return without rows. Any thread.
+  /// Has `take` return without rows, once. Any thread.
   void call() QUARVEL_EXCLUDES(mutex_);
   /// Blocks until `deadline`, also when rows are queued; returns early, and true, when closed.
   [[nodiscard]] bool waitForClose(Instant deadline) QUARVEL_EXCLUDES(mutex_);
 
+  /// Amounts that count against the bounds; `counted` of the rows are counted from acceptance on.
   struct Tally {
     std::size_t rows = 0;
     std::size_t bytes = 0;
@@ -109,6 +110,7 @@ class StoreQueue {
 
   /// Takes over the counts of the opened database: its rows, and the drops that it has recorded.
   void restart(std::uint64_t stored, const StoreDrops& kept) QUARVEL_EXCLUDES(mutex_);
+  /// Stored rows were removed from the database: they count as dropped instead of stored.
   void droppedFromStore(StoreDrop reason, std::uint64_t rows) QUARVEL_EXCLUDES(mutex_);
 
   [[nodiscard]] StoreCounters counters() const QUARVEL_EXCLUDES(mutex_);
@@ -116,10 +118,14 @@ class StoreQueue {
   [[nodiscard]] Tally outstanding() const QUARVEL_EXCLUDES(mutex_);
 
  private:
+  /// Whether both bounds allow a further row.
   [[nodiscard]] bool hasRoom() const QUARVEL_REQUIRES(mutex_);
+  /// Blocks until `hasRoom` or the end, where the calling thread may block.
   void awaitRoom() QUARVEL_REQUIRES(mutex_);
+  /// Counts a refused row (`counted` is 0 or 1) and tells why it is refused.
   Error refuse(std::uint64_t counted) QUARVEL_REQUIRES(mutex_);
   void dropAccepted(StoreDrop reason, std::uint64_t rows) QUARVEL_REQUIRES(mutex_);
+  /// Rows no longer count against the bounds.
   void release(const Tally& tally) QUARVEL_REQUIRES(mutex_);
 
   template <class Row>

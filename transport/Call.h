@@ -26,15 +26,19 @@ struct CallChannel {
 
   /// Any thread, without a lock held: has the I/O thread look at replies and at the room for calls.
   const std::function<void()> wake;
+  /// Calls add replies, the connection writes them.
   ReplyQueue replies;
+  /// Calls report progress, the connection asks whether it may take in more.
   CallFlow flow;
 };
 
-/// One call: sends its reply, and tells the connection how far its work is.
-/// Owner: its reply and every block that it caused. Any thread.
+/// One call: sends its reply, and tells the connection how far its work is. Lock-free but for the
+/// reply queue.
+/// Owner: its reply and every block that it caused, until the last of them has gone. Any thread.
 class Call final : public ReplySink, public CallTracker {
  public:
-  /// `messageID`: none for a notification, whose reply is discarded.
+  /// `messageID`: none for a notification, whose reply is discarded. `bytes`: the size of its
+  /// frame, which counts until the call has completed.
   Call(std::shared_ptr<CallChannel> channel, std::optional<std::uint32_t> messageID,
        std::size_t bytes)
       : channel_(std::move(channel)),
@@ -42,7 +46,7 @@ class Call final : public ReplySink, public CallTracker {
         messageID_(messageID.value_or(0)),
         answered_(!messageID.has_value()) {}
 
-  // The first answer is sent, later ones are discarded.
+  // Any thread. The first answer is sent, later ones are discarded.
   void result(Value value) override {
     if (isFirstAnswer()) wakeIf(channel_->replies.addResult(messageID_, value));
   }

@@ -17,7 +17,8 @@ struct Request {
   std::string_view method;                 // not checked: any octets
   PayloadValue params;                     // a list
 
-  /// None when `frame` is neither; `fault` is then a literal that names the error.
+  /// None when `frame` is neither: the connection is then ended. `fault` is a literal that names
+  /// the error, for the log.
   [[nodiscard]] static std::optional<Request> from(PayloadValue frame, std::string_view& fault);
 };
 

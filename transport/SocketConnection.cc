@@ -116,8 +116,6 @@ void SocketConnection::resume() {
   });
 }
 
-/// Makes the calls that have been read, as far as the limits allow, then waits for more bytes. A
-/// limit that stopped it calls it again when there is room.
 void SocketConnection::proceed() {
   if (!open_ || !resumed_ || reading_) return;
   bool isLeft = false;
@@ -158,8 +156,6 @@ void SocketConnection::proceed() {
                      });
 }
 
-/// Makes calls until the limits, the turn or an incomplete call stop it. Whether bytes are left
-/// that may be a complete call.
 bool SocketConnection::decode() {
   ReadTurn turn(Now());
   while (open_ && !buffer_.empty() && !mustWait()) {
@@ -191,7 +187,6 @@ void SocketConnection::receive() {
   proceed();
 }
 
-/// Reads once. The number of bytes read; none when the client has gone.
 std::optional<std::size_t> SocketConnection::readAvailable() {
   const std::span<char> room = buffer_.room();
   const ssize_t count =
@@ -202,7 +197,6 @@ std::optional<std::size_t> SocketConnection::readAvailable() {
   return static_cast<std::size_t>(count);
 }
 
-/// Whether the client has to wait until calls of it are done or until it reads its replies.
 bool SocketConnection::mustWait() {
   if (draining_) return false;
   if (channel_->replies.holdsMaximum()) {
@@ -253,7 +247,6 @@ void SocketConnection::dispatch(const Request& request, std::size_t frameBytes) 
   call->error(*error);
 }
 
-/// Woken through the channel.
 void SocketConnection::onRepliesOrRoom() {
   if (!open_) return;
   flush();
@@ -261,7 +254,6 @@ void SocketConnection::onRepliesOrRoom() {
   proceed();
 }
 
-/// Writes all replies that are queued, with one write where the socket takes them.
 void SocketConnection::flush() {
   while (!writing_) {
     if (sent_ == sending_.size()) {
@@ -305,9 +297,9 @@ void SocketConnection::watchFrame() {
   if (!frameTimerRuns_) awaitFrameDeadline();
 }
 
-/// The timer is left running from one partial frame to the next, so that a busy client, whose every
-/// read ends inside a frame, does not set it each time.
 void SocketConnection::awaitFrameDeadline() {
+  // The timer runs on from one partial frame to the next: a busy client, whose every read ends
+  // inside a frame, does not set it each time.
   frameTimerRuns_ = true;
   frameTimer_.expires_at(frameDeadline_);
   frameTimer_.async_wait([self = shared_from_this()](asio::error_code error) {
@@ -341,7 +333,6 @@ void SocketConnection::unwatchStall() {
   if (std::exchange(stallTimerRuns_, false)) stallTimer_.cancel();
 }
 
-/// Calls that wait for a slow backend do not hold back later calls for long.
 void SocketConnection::watchSlowCalls() {
   if (std::exchange(slowCallsTimerRuns_, true)) return;
   slowCallsTimer_.expires_after(flow::kExemptAfter);

@@ -74,38 +74,59 @@ class SocketConnection final : public ClientConnection,
 
   /// Closes a connection that the delegate did not accept. Calls no handler.
   void refuse();
-  /// Ends the connection as if its client had gone now: executes every call that has arrived, beyond
-  /// any limit, then calls the invalidation handler.
+  /// Ends the connection as if its client had gone now: executes every call that has arrived,
+  /// beyond any limit, then calls the invalidation handler.
   void drainAndEnd();
 
  private:
   SocketConnection(std::shared_ptr<ConnectionContext> context, std::uint64_t number);
 
   // Reading.
+
+  /// Makes the calls that have been read, as far as the limits allow, then waits for more bytes. A
+  /// limit that stopped it calls it again when there is room.
   void proceed();
+  /// Makes calls until the limits, the turn or an incomplete call stop it. Whether bytes are left
+  /// that may be a complete call.
   [[nodiscard]] bool decode();
+  /// The socket is readable.
   void receive();
+  /// Reads once. The number of bytes read; none when the client has gone.
   [[nodiscard]] std::optional<std::size_t> readAvailable();
+  /// Whether the client waits until calls complete or until it reads its replies. A wake through
+  /// the channel, the socket or a timer then calls `proceed`.
   [[nodiscard]] bool mustWait();
+  /// One complete MessagePack value: a call, or a protocol error.
   void execute(std::string_view frame);
+  /// Makes a call on the exported object, or answers with the reason why it cannot be made.
   void dispatch(const Request& request, std::size_t frameBytes);
 
   // Writing.
+
+  /// Woken through the channel: replies are queued, or the limits allow calls again.
   void onRepliesOrRoom();
+  /// Writes all queued replies, with one write where the socket takes them.
   void flush();
   void waitUntilWritable();
 
-  // Time-outs.
+  // Time-outs: `limits.frame` for a partial message while the client could send the rest,
+  // `limits.stall` while it reads no reply and the most replies are held.
+
   void watchFrame();
   void awaitFrameDeadline();
   void unwatchFrame();
   void watchStall();
   void unwatchStall();
+  /// Exempts calls that wait for a slow backend from the limit on unstored calls, after a time.
   void watchSlowCalls();
 
   // Ends.
+
+  /// Bytes that are no call: logs `fault`, calls both handlers.
   void endForProtocolError(std::string_view fault);
+  /// Logs `reason`, calls the invalidation handler alone.
   void endForTimeout(std::string_view reason);
+  /// Closes the socket, calls the handlers and releases the exported object. Once.
   void end(bool interrupted);
 
   // Constant after construction.
