@@ -14,9 +14,9 @@ namespace {
 class Counted final : public CallTracker {
  public:
   [[nodiscard]] std::size_t bytes() const override { return 280; }
-  void ran(std::chrono::nanoseconds /*time*/) override {}
-  void carriedOut() override {}
-  void completed() override {}
+  void blockRan(std::chrono::nanoseconds /*time*/) override {}
+  void callExecuted() override {}
+  void callCompleted() override {}
 };
 
 // One producer feeds one serial queue, like connections the server queue; the time ends when the

@@ -91,8 +91,6 @@ struct Configuration {
     std::size_t queuedCalls = 256;
     std::size_t queuedBytes = 4'194'304;
     std::size_t connections = 4096;
-    /// Of the queued calls, how many a client has ahead of others to begin with. Not configured.
-    std::size_t firstTurn = 16;
   } limits;
 
   /// The process's configuration, read on first use. When the file has an error, says so on

@@ -237,9 +237,9 @@ class RecordedVoucher final : public CallTracker {
   std::atomic<int> carriedOutTimes{0};
 
  private:
-  void ran(std::chrono::nanoseconds /*time*/) override { EXPECT_EQ(carriedOutTimes, 0); }
-  void carriedOut() override { ++carriedOutTimes; }
-  void completed() override {
+  void blockRan(std::chrono::nanoseconds /*time*/) override { EXPECT_EQ(carriedOutTimes, 0); }
+  void callExecuted() override { ++carriedOutTimes; }
+  void callCompleted() override {
     EXPECT_EQ(carriedOutTimes, 1);
     ++completions_;
     completions_.notify_all();
