@@ -5,6 +5,8 @@
 
 #include "base/Json.h"
 #include "base/MessagePack.h"
+#include "base/Utf8.h"
+#include "base/Vocabulary.h"
 
 namespace quarvel {
 namespace {
@@ -154,6 +156,30 @@ TEST(DateText, IsReadAsItIsWritten) {
         "2026-01-31T00:00:00.Z", "2026-01-31T00:00:00Z ", "0000-12-31T00:00:00Z"}) {
     EXPECT_FALSE(DateFromText(bad)) << bad;
   }
+}
+
+TEST(Vocabulary, NamesAreFixed) {
+  using namespace vocabulary;
+  const auto names = []<class Code>(Code, std::initializer_list<std::uint32_t> codes) {
+    std::string text;
+    for (const std::uint32_t code : codes) text.append(NameOf(static_cast<Code>(code))) += ' ';
+    return text;
+  };
+  EXPECT_EQ(names(MessageType{}, {0, 1, 2, 3, 4, 5, 6, 65535}),
+            "Generic Start Stop Setup Error IssueDetector Undefined Unknown ");
+  EXPECT_EQ(names(ServiceType{}, {0, 1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12, 65535}),
+            "generic kivo telephony haptics alarms standalone soundautoconfig longformaudio "
+            "nonlongformaudio audiodeviceusage alerts test  unknown ");
+  EXPECT_EQ(names(Category{0}, {0, 1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12, 0xffff, 0xffff'ffff}),
+            "Undefined Generic Record Playback PlaybackAndRecord Setup ClientRequest RouteChange "
+            "Error Tallixing Performance Volume Undefined Undefined Undefined ");
+  EXPECT_EQ(names(Category{0}, {0x0800'0003, 0x1000'0003, 0x2000'0003, 0x4000'0003, 0x8000'0000,
+                                0x0001'0003, 0xffff'0003}),
+            "Session_Playback DSP_Playback HAL_Playback Routing_Playback Toolbox_Undefined "
+            "_Playback _Playback ");
+  // A code of more than 16 bits is outside the table, also when its low half is not.
+  EXPECT_EQ(TypeName(0x1'0001), "Undefined");
+  EXPECT_EQ(ServiceTypeName(0x1'0001), "");
 }
 
 TEST(Dictionary, ALargeOneKeepsOrderAndReplacesInPlace) {
