@@ -1,17 +1,95 @@
-#include "base/Payload.h"
-
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
+#include <cerrno>
+#include <cmath>
+#include <filesystem>
+#include <fstream>
+#include <limits>
+
+#include "base/Files.h"
 #include "base/Json.h"
 #include "base/MessagePack.h"
-#include "base/Utf8.h"
+#include "base/Payload.h"
 #include "base/Vocabulary.h"
+#include "tests/TemporaryDirectory.h"
 
 namespace quarvel {
 namespace {
 
+namespace fs = std::filesystem;
 using testing::HasSubstr;
+using Progress = MessagePackScanner::Progress;
+
+std::string Encoded(const Value& value) {
+  std::string bytes;
+  MessagePackWriter(bytes).value(value);
+  return bytes;
+}
+
+List EveryForm() {
+  List forms{nullptr, true, false, Value(1.5), Value(-0.0), Bytes{"\x00\xff"}, "text"};
+  for (const int bits : {5, 7, 8, 15, 16, 31, 32, 62, 63}) {
+    const std::uint64_t edge = std::uint64_t{1} << bits;
+    forms.insert(forms.end(), {edge - 1, edge, -static_cast<std::int64_t>(edge - 1) - 1,
+                               -static_cast<std::int64_t>(edge - 1)});
+  }
+  forms.emplace_back(std::numeric_limits<std::uint64_t>::max());
+  for (const std::size_t length : {0U, 31U, 32U, 255U, 256U, 65'535U, 65'536U}) {
+    forms.emplace_back(std::string(length, 's'));
+    forms.emplace_back(Bytes{std::string(length, 'b')});
+  }
+  for (const std::size_t count : {15U, 16U, 65'536U}) forms.emplace_back(List(count, Value(1)));
+  Dictionary large{{7, "seven"}, {-7, "minus seven"}, {"7", "text"}};
+  for (int i = 0; i < 70'000; ++i) large.set(i, i);
+  forms.emplace_back(std::move(large));
+  for (const std::int64_t microseconds :
+       {std::int64_t{0}, std::int64_t{1}, std::int64_t{-1}, std::int64_t{1'769'865'901'123'456},
+        std::int64_t{4'294'967'296'000'000}, std::int64_t{17'179'869'184'000'000}}) {
+    forms.emplace_back(Date(std::chrono::microseconds(microseconds)));
+  }
+  forms.emplace_back(kEarliestDate);
+  forms.emplace_back(kLatestDate);
+  return forms;
+}
+
+TEST(MessagePack, EveryFormComesBackAsItWasWritten) {
+  for (const Value& form : EveryForm()) {
+    const std::string bytes = Encoded(form);
+    MessagePackScanner scanner(bytes.size(), 4);
+    ASSERT_EQ(scanner.scan(bytes), Progress::complete) << scanner.fault();
+    EXPECT_EQ(scanner.length(), bytes.size());
+    EXPECT_EQ(PayloadValue(bytes.data()).toValue(), form);
+    EXPECT_EQ(PayloadValue(bytes.data()).kind(), form.kind());
+    EXPECT_EQ(PayloadValue(bytes.data()).encoded().size(), bytes.size());
+  }
+}
+
+TEST(MessagePackScanner, RefusesLiesBeforeTheirBytesArrive) {
+  const struct {
+    const char* name;
+    std::string bytes;
+    const char* reason;
+  } kRows[] = {
+      {"list longer than a message", {"\xdd\xff\xff\xff\xff", 5}, "needs"},
+      {"dictionary longer than a message", {"\xdf\x00\x00\x02\x01", 5}, "needs"},
+      {"dictionary whose doubled count overflows", {"\xdf\xff\xff\xff\xff", 5}, "needs"},
+      {"string longer than a message", {"\xdb\x00\x00\x04\x00", 5}, "at most 1024"},
+      {"bytes longer than what is left", {"\x92\xa1s\xc5\x03\xff", 6}, "needs"},
+      {"extension longer than a message", {"\xc9\x7f\xff\xff\xff\x01", 6}, "needs"},
+      {"a byte that is never used", {"\x91\xc1", 2}, "0xc1"},
+      {"nested too deep", std::string(5, '\x91'), "deeper than 4"},
+      {"nested too deep in dictionaries", "\x81\x01\x81\x01\x81\x01\x81\x01\x81", "deeper than 4"},
+  };
+  for (const auto& row : kRows) {
+    MessagePackScanner scanner(1024, 4);
+    EXPECT_EQ(scanner.scan(row.bytes), Progress::fault) << row.name;
+    EXPECT_THAT(scanner.fault(), HasSubstr(row.reason)) << row.name;
+  }
+  MessagePackScanner scanner(1024, 4);
+  EXPECT_EQ(scanner.scan("\x91\x91\x91\x90"), Progress::complete) << "at the limit";
+}
 
 TEST(Payload, RefusesWhatIsNoPayload) {
   const struct {
@@ -191,6 +269,73 @@ TEST(Dictionary, ALargeOneKeepsOrderAndReplacesInPlace) {
   int expected = 100;
   for (const auto& [key, value] : dictionary) EXPECT_EQ(value, Value(expected++));
   EXPECT_EQ(dictionary.find("key 50"), nullptr);
+}
+
+TEST(FilesTest, DirectoriesAreMadeWithTheirPermissions) {
+  const TemporaryDirectory directory;
+  const mode_t mask = umask(077);
+  for (const char* path : {"a/b/c", "a/b/d/"}) {
+    const fs::path made = directory.path() / path;
+    ASSERT_TRUE(MakeDirectory(made.native(), 0777).ok());
+    EXPECT_EQ(fs::status(made).permissions(), fs::perms::all);
+  }
+  EXPECT_EQ(fs::status(directory.path() / "a/b").permissions(), fs::perms::owner_all);
+  umask(mask);
+  // One that exists stays as it is.
+  ASSERT_TRUE(MakeDirectory((directory.path() / "a/b").native(), 0777).ok());
+  EXPECT_EQ(fs::status(directory.path() / "a/b").permissions(), fs::perms::owner_all);
+
+  const fs::path file = directory.write("file", "");
+  for (const fs::path& impossible : {file, file / "below"}) {
+    const Outcome outcome = MakeDirectory(impossible.native(), 0777);
+    ASSERT_FALSE(outcome.ok()) << impossible;
+    EXPECT_EQ(outcome.error().code, ENOTDIR);
+  }
+}
+
+TEST(FilesTest, AFileIsReplacedAsAWholeAndAReaderOfTheOldOneReadsOn) {
+  const TemporaryDirectory directory;
+  const fs::path file = directory.write("history.json", "old");
+  const fs::path link = directory.path() / "link";
+  fs::create_symlink(file, link);
+  fs::permissions(file, fs::perms::owner_read | fs::perms::group_read);
+  std::ifstream reader(file);
+  ASSERT_TRUE(RewriteFile(link, "rewritten", 0644).ok());
+  EXPECT_EQ(fs::status(file).permissions(), fs::perms::owner_read | fs::perms::group_read);
+  EXPECT_TRUE(fs::is_symlink(link));
+  ASSERT_TRUE(ReplaceFile(file.native(), "new", 0600).ok());
+  EXPECT_EQ(fs::status(file).permissions(), fs::perms::owner_read | fs::perms::owner_write);
+  EXPECT_EQ(std::string(std::istreambuf_iterator<char>(reader), {}), "old");
+  EXPECT_EQ(ReadWholeFile(link).value(), "new");
+}
+
+TEST(FilesTest, AWholeFileIsReadUpToItsBoundAndNeverWaitedFor) {
+  const TemporaryDirectory directory;
+  const std::string text(20'000, 'x');
+  const fs::path file = directory.write("file", text);
+  const fs::path fifo = directory.path() / "fifo";
+  ASSERT_EQ(::mkfifo(fifo.c_str(), 0600), 0);
+  EXPECT_EQ(ReadWholeFile(file, text.size()).value(), text);
+  EXPECT_EQ(ReadWholeFile(fifo).value(), "");
+  const std::pair<fs::path, int> failures[] = {
+      {file, EFBIG}, {directory.path(), EISDIR}, {file / "below", ENOTDIR}, {"absent", ENOENT}};
+  for (const auto& [path, status] : failures) {
+    const auto read = ReadWholeFile(path, text.size() - 1);
+    ASSERT_FALSE(read) << path;
+    EXPECT_EQ(read.error().code, status) << path;
+  }
+}
+
+TEST(FilesTest, WritingThatFailsLeavesNothingBehind) {
+  const TemporaryDirectory directory;
+  const Outcome missing = ReplaceFile((directory.path() / "no/file").native(), "x");
+  ASSERT_FALSE(missing.ok());
+  EXPECT_EQ(missing.error().code, ENOENT);
+  EXPECT_NE(missing.error().description().find("no/file"), std::string::npos);
+
+  fs::create_directories(directory.path() / "taken/by-a-folder");
+  EXPECT_FALSE(ReplaceFile((directory.path() / "taken/by-a-folder").native(), "x").ok());
+  EXPECT_EQ(std::distance(fs::directory_iterator(directory.path() / "taken"), {}), 1);
 }
 
 }  // namespace
