@@ -11,18 +11,20 @@ namespace quarvel {
 
 class Block;
 
-/// What a block can be made of.
+/// A callable that a block can hold.
 template <class F>
 concept BlockWork = !std::same_as<std::remove_cvref_t<F>, Block> && std::is_invocable_v<F&>;
 
 /// A piece of work to be run once: a callable without arguments or result, moved and never copied,
-/// so that it can own what it works on. Callables of up to `kInlineBytes` are held in place,
-/// without an allocation.
+/// so that it can own its data. Callables of up to `kInlineBytes` are held in place, without an
+/// allocation. Owned by one queue or timer at a time; not synchronised.
 class Block {
  public:
   static constexpr std::size_t kInlineBytes = 88;
 
   Block() = default;
+  /// Takes the callable over. Allocates when it is larger than `kInlineBytes`, or its move may
+  /// throw.
   template <BlockWork F>
   Block(F&& work) {  // NOLINT(google-explicit-constructor): a lambda is a block
     using Work = std::remove_cvref_t<F>;
@@ -46,10 +48,13 @@ class Block {
   Block& operator=(const Block&) = delete;
   ~Block() { reset(); }
 
+  /// False when there is nothing to run: made empty, or moved from.
   explicit operator bool() const { return operations_ != nullptr; }
+  /// Precondition: there is something to run.
   void operator()() { operations_->run(storage_); }
 
  private:
+  /// The operations on the callable's type, as the block itself does not know it.
   struct Operations {
     void (*run)(void* storage);
     void (*move)(void* from, void* to);
@@ -83,7 +88,7 @@ class Block {
     if (operations_ != nullptr) std::exchange(operations_, nullptr)->destroy(storage_);
   }
 
-  const Operations* operations_ = nullptr;
+  const Operations* operations_ = nullptr;  // null: nothing to run
   alignas(std::max_align_t) std::byte storage_[kInlineBytes];
 };
 

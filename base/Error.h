@@ -9,22 +9,23 @@
 
 namespace quarvel {
 
-/// Why something did not happen. `userInfo` may hold "reason", a sentence that says what was wrong
-/// and what is allowed.
+/// The reason of a failure. `userInfo` may hold "reason": a sentence with the fault and the allowed
+/// values. A value; copy it freely.
 struct Error {
   std::string domain;
   std::int64_t code = 0;
   Dictionary userInfo;
 
-  /// An error whose `userInfo` holds just the reason.
+  /// An error whose `userInfo` holds the reason alone.
   [[nodiscard]] static Error because(std::string domain, std::int64_t code, std::string reason);
   /// "domain code: reason", or "domain code" when there is no reason.
   [[nodiscard]] std::string description() const;
   bool operator==(const Error&) const = default;
 };
 
-/// A value, or why there is none.
+/// A value, or the error that prevented it.
 template <class T>
+/// A caller must look at it.
 class [[nodiscard]] Result {
  public:
   Result(T value)  // NOLINT(google-explicit-constructor)
@@ -45,7 +46,7 @@ class [[nodiscard]] Result {
   std::variant<T, Error> result_;
 };
 
-/// The result of what yields nothing but may fail.
+/// The result of an operation without a value.
 using Outcome = Result<std::monostate>;
 inline Outcome Success() {
   return std::monostate{};

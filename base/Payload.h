@@ -17,10 +17,10 @@
 
 namespace quarvel {
 
-/// A look at one value inside MessagePack bytes, walked in place: no tree, no copy. Cheap to copy,
-/// valid as long as the bytes are. The bytes must be well-formed (a `MessagePackScanner` has found
-/// the value's end); that strings are UTF-8 and keys are of a kind that is allowed is known only
-/// inside a `Payload`.
+/// A view of one value inside MessagePack bytes, walked in place: no tree, no copy. Cheap to copy,
+/// valid as long as the bytes are, safe to use from every thread. The bytes must be well-formed: a
+/// `MessagePackScanner` has found the value's end. Only inside a `Payload` are strings known to be
+/// UTF-8 and keys to be of an allowed kind.
 class PayloadValue {
  public:
   using Kind = Value::Kind;
@@ -30,23 +30,24 @@ class PayloadValue {
   /// The value whose first byte is at `wellFormed`.
   explicit PayloadValue(const char* wellFormed) : at_(wellFormed) {}
 
-  /// Extension values are dates: no other extension is allowed in a payload.
+  /// An extension is a date: no other extension is allowed in a payload.
   [[nodiscard]] Kind kind() const {
     const MessagePackForm& form = MessagePackForm::at(at_);
-    // An unsigned integer is one only above the signed range.
+    // In every form, a number in the signed range is a signed integer.
     if (form.kind == MessagePackForm::Kind::unsignedInteger) {
       return form.fixed == 8 && at_[1] < 0 ? Kind::unsignedInteger : Kind::integer;
     }
     return static_cast<Kind>(form.kind);
   }
   [[nodiscard]] bool isNil() const { return kind() == Kind::nil; }
+  /// Whether the value is an integer of either kind.
   [[nodiscard]] bool isInteger() const {
     const MessagePackForm::Kind kind = MessagePackForm::at(at_).kind;
     return kind == MessagePackForm::Kind::integer || kind == MessagePackForm::Kind::unsignedInteger;
   }
 
-  // Each is none when the value is of another kind. The integers accept every integer form whose
-  // number fits.
+  // Each is none when the value is of another kind. The two integers accept every integer form
+  // whose number fits their type.
   [[nodiscard]] inline std::optional<bool> boolean() const;
   [[nodiscard]] inline std::optional<std::int64_t> integer() const;
   [[nodiscard]] inline std::optional<std::uint64_t> unsignedInteger() const;
@@ -59,7 +60,7 @@ class PayloadValue {
   }
   [[nodiscard]] std::optional<Date> date() const;
 
-  /// How many items a list, or entries a dictionary, holds; 0 for other kinds.
+  /// The number of a list's items or a dictionary's entries; 0 for other kinds.
   [[nodiscard]] std::size_t count() const {
     const MessagePackForm& form = MessagePackForm::at(at_);
     return form.isContainer() ? static_cast<std::size_t>(form.length(at_)) : 0;
@@ -73,11 +74,11 @@ class PayloadValue {
 
   /// The value's first byte.
   [[nodiscard]] const char* data() const { return at_; }
-  /// The value's own MessagePack bytes; a walk to its end.
+  /// The value's own MessagePack bytes. Walks to the value's end.
   [[nodiscard]] std::string_view encoded() const {
     return {at_, static_cast<std::size_t>(AfterMessagePack(at_) - at_)};
   }
-  /// The same value as a tree.
+  /// The same value as a tree, which is a copy.
   [[nodiscard]] Value toValue() const;
   [[nodiscard]] Dictionary toDictionary() const;
 
@@ -97,6 +98,7 @@ struct PayloadEntry {
   PayloadValue value;
 };
 
+/// A list's values, for range-for. Valid as long as the bytes.
 class PayloadValue::Items {
  public:
   class Iterator {
@@ -122,6 +124,7 @@ class PayloadValue::Items {
   std::size_t count_;
 };
 
+/// A dictionary's entries, for range-for. Valid as long as the bytes.
 class PayloadValue::Entries {
  public:
   class Iterator {
@@ -202,9 +205,10 @@ PayloadValue::Entries PayloadValue::entries() const {
   return {at_ + form.headBytes, form.kind == MessagePackForm::Kind::dictionary ? count() : 0};
 }
 
-/// What a client sends: a dictionary as one immutable, shared block of its own MessagePack bytes.
-/// Its strings are UTF-8, its keys strings or integers, its dates have an RFC 3339 text, no key
-/// stands twice in one dictionary. Copying shares the block; safe to read from every thread.
+/// A client's dictionary as one immutable, shared block of its own MessagePack bytes. Strings are
+/// UTF-8, keys are strings or integers, dates have an RFC 3339 text, no key stands twice in one
+/// dictionary. Copying shares the block, which lives as long as its last copy; every thread may
+/// read it.
 class Payload {
  public:
   /// The empty dictionary.
@@ -214,7 +218,8 @@ class Payload {
   /// reason.
   [[nodiscard]] static Result<Payload> from(PayloadValue dictionary);
   explicit Payload(const Dictionary& dictionary);
-  /// Of what a `MessagePackWriter` wrote: a dictionary that is a payload, which is not checked.
+  /// The payload in the bytes that a `MessagePackWriter` wrote. Precondition, not checked: they are
+  /// a dictionary that is a payload.
   [[nodiscard]] static Payload written(std::string_view encoded) { return Payload(encoded); }
 
   Payload(const Payload& other) noexcept;
@@ -225,24 +230,30 @@ class Payload {
   }
   ~Payload();
 
+  /// The payload's dictionary. Views of its bytes are valid as long as one copy of the payload
+  /// lives.
   [[nodiscard]] PayloadValue root() const { return PayloadValue(bytes()); }
+  /// The number of entries.
   [[nodiscard]] std::size_t count() const { return root().count(); }
   [[nodiscard]] bool empty() const { return count() == 0; }
+  // For range-for over the entries in the order received.
   [[nodiscard]] auto begin() const;
   [[nodiscard]] auto end() const;
+  /// The value under a string key; none when there is none.
   [[nodiscard]] std::optional<PayloadValue> find(std::string_view key) const {
-    // Mostly it is not there, which a search of the bytes shows sooner than a look at each key.
+    // Most lookups fail, and a search of the bytes shows that sooner than a look at each key.
     if (encoded().find(key) == std::string_view::npos) return std::nullopt;
     return root().find(key);
   }
+  /// The payload's own MessagePack bytes.
   [[nodiscard]] std::string_view encoded() const;
 
-  /// The payload with `from` replaced by `to` in its own string keys; nested dictionaries are left
-  /// as they are. Of keys that become equal the last one stays. Shares the block when nothing
+  /// The payload with `from` replaced by `to` in its own string keys; nested dictionaries do not
+  /// change. Of keys that become equal the last one stays. Shares the block when nothing
   /// changes.
   [[nodiscard]] Payload replacingInKeys(char from, char to) const;
 
-  /// The payload with `value` under `key`, in place of what stood there or at the end.
+  /// The payload with `value` under `key`: in place of an old value, else at the end.
   [[nodiscard]] Payload setting(std::string_view key, const Value& value) const;
 
   /// Whether both are the same block, or hold the same bytes.
@@ -250,6 +261,7 @@ class Payload {
   [[nodiscard]] bool sharesBlockWith(const Payload& other) const { return block_ == other.block_; }
 
  private:
+  /// The shared bytes with their reference count; null stands for the empty dictionary.
   struct Block;
   explicit Payload(std::string_view encoded);
   [[nodiscard]] const char* bytes() const;

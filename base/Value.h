@@ -24,14 +24,14 @@ class Value;
 class Dictionary;
 using List = std::vector<Value>;
 
-/// Octets that are not text.
+/// Octets that are not text. A type of its own, since a string is UTF-8.
 struct Bytes {
   std::string octets;
   bool operator==(const Bytes&) const = default;
 };
 
-/// A dictionary's key: a string or an integer. An unsigned integer only above the signed range, so
-/// that equal numbers are equal keys.
+/// A dictionary's key: a string or an integer. Only a number above the signed range is held
+/// unsigned, so that equal numbers are equal keys.
 class Key {
  public:
   Key(std::string text) : key_(std::move(text)) {}         // NOLINT(google-explicit-constructor)
@@ -46,11 +46,13 @@ class Key {
     }
   }
 
+  // Each is null when the key is of another kind.
   [[nodiscard]] const std::string* string() const { return std::get_if<std::string>(&key_); }
   [[nodiscard]] const std::int64_t* integer() const { return std::get_if<std::int64_t>(&key_); }
   [[nodiscard]] const std::uint64_t* unsignedInteger() const {
     return std::get_if<std::uint64_t>(&key_);
   }
+  /// Keyed with a secret of the process, so that clients cannot write keys that collide.
   [[nodiscard]] std::size_t hash() const;
   bool operator==(const Key&) const = default;
 
@@ -58,12 +60,13 @@ class Key {
   std::variant<std::string, std::int64_t, std::uint64_t> key_;
 };
 
-/// A tree of property-list values that the service builds and changes itself: user information,
+/// A tree of property-list values that the service itself builds and changes: user information,
 /// defaults, session info, summaries. Numbers keep their kind: signed 64-bit, unsigned 64-bit (only
-/// above the signed range), double and boolean are different. Strings are UTF-8.
-/// Not synchronised: one thread at a time, or a lock around it.
+/// above the signed range), double and boolean are different. Strings are UTF-8. A value; copying
+/// copies the tree. Not synchronised: one thread at a time, or a lock around it.
 class Value {
  public:
+  /// The order is that of MessagePack's forms in `MessagePackForm`.
   enum class Kind : std::uint8_t {
     nil,
     boolean,
@@ -77,6 +80,8 @@ class Value {
     dictionary
   };
 
+  // Every property-list type converts to a value. An integer is held signed when it fits, else
+  // unsigned; no argument and `nullptr` are nil.
   Value() = default;
   Value(std::nullptr_t) {}                // NOLINT(google-explicit-constructor)
   Value(std::same_as<bool> auto boolean)  // NOLINT(google-explicit-constructor)
@@ -115,10 +120,11 @@ class Value {
   [[nodiscard]] const List* list() const { return std::get_if<List>(&value_); }
   [[nodiscard]] const Dictionary* dictionary() const;
 
+  /// Values of different kinds are different, also when their numbers are equal.
   bool operator==(const Value& other) const;
 
  private:
-  // A dictionary is held behind a pointer-sized box since it is not complete here.
+  // Holds a dictionary behind a pointer, since the class is not complete here.
   class DictionaryBox {
    public:
     explicit DictionaryBox(Dictionary dictionary);
@@ -140,12 +146,13 @@ class Value {
 };
 
 /// Keys to values, enumerated in the order in which the keys were first set. Two dictionaries are
-/// equal when they hold equal entries, in whatever order.
+/// equal when they hold equal entries, in any order. Not synchronised.
 class Dictionary {
  public:
   using Entry = std::pair<Key, Value>;
 
   Dictionary() = default;
+  /// The last of equal keys keeps its value.
   Dictionary(std::initializer_list<Entry> entries);
 
   /// Null when there is no such key. Valid until the dictionary changes.
@@ -157,6 +164,7 @@ class Dictionary {
 
   [[nodiscard]] std::size_t size() const { return entries_.size(); }
   [[nodiscard]] bool empty() const { return entries_.empty(); }
+  /// For range-for over the entries, in their order. Valid until the dictionary changes.
   [[nodiscard]] auto begin() const { return entries_.begin(); }
   [[nodiscard]] auto end() const { return entries_.end(); }
 
@@ -166,7 +174,8 @@ class Dictionary {
   struct KeyHash {
     std::size_t operator()(const Key& key) const { return key.hash(); }
   };
-  /// From here on an index is kept, so that a large hostile dictionary costs no quadratic time.
+  /// From this size on an index is kept, so that a large hostile dictionary costs no quadratic
+  /// time; below it a linear search is faster.
   static constexpr std::size_t kIndexedFrom = 16;
 
   [[nodiscard]] std::size_t indexOf(const Key& key) const;

@@ -11,10 +11,12 @@
 #include "base/MessagePack.h"
 #include "client/Sessions.h"
 
-// The service's operations as they are called: name, arguments in order, and what outlives the
-// connection. All are views for the length of one call.
+// The service's operations as requests: name, arguments in order, and the lasting effect on a
+// session. All are views for the length of one call.
 
 namespace quarvel::operations {
+
+// Each writes one argument as the wire has it.
 
 template <std::integral Integer>
 void Write(MessagePackWriter& writer, Integer number) {
@@ -43,20 +45,22 @@ inline void Write(MessagePackWriter& writer, const Recipients& recipients) {
   for (const ReporterID session : *recipients.sessions()) writer.integer(session);
 }
 
+/// One operation with its typed arguments.
 template <class... Arguments>
 struct Request {
   std::string_view operation;
   SessionCall session;
   std::tuple<const Arguments&...> arguments;
 
-  /// The arguments as the wire has them: a list.
+  /// The arguments as a MessagePack list.
   void write(MessagePackWriter& writer) const {
     writer.list(sizeof...(Arguments));
     std::apply([&](const auto&... argument) { (Write(writer, argument), ...); }, arguments);
   }
 };
 
-/// Any operation with any arguments.
+/// Any operation by its full keyword name, with any arguments. Has no lasting effect that the
+/// client knows.
 struct AnyRequest {
   std::string_view operation;
   std::span<const Value> arguments;
@@ -69,6 +73,8 @@ struct AnyRequest {
 };
 
 using Kind = SessionCall::Kind;
+
+// The operations by the first keywords of their names. An argument must outlive the request.
 
 inline Request<ReporterID> Create(const ReporterID& session) {
   return {"createReportingSession:reply:", {Kind::create, session, {}, {}}, std::tie(session)};

@@ -1,15 +1,14 @@
 #include "system/Configuration.h"
 
-#include <fcntl.h>
 #include <fmt/format.h>
 #include <toml++/toml.h>
-#include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
 #include <optional>
 #include <utility>
 
+#include "base/Files.h"
 #include "base/StandardPaths.h"
 #include "platform/Log.h"
 #include "platform/Process.h"
@@ -204,27 +203,6 @@ Configuration readRoot(Findings& findings, const toml::table& table) {
 }
 
 /// The whole of a file; none when there is no such file.
-Result<std::optional<std::string>> contentOf(const std::filesystem::path& file) {
-  const auto failure = [&file] {
-    return Error::because("quarvel.configuration", 1,
-                          fmt::format("{}: {}.", file.native(), std::strerror(errno)));
-  };
-  const int descriptor = ::open(file.c_str(), O_RDONLY | O_CLOEXEC);
-  if (descriptor < 0 && (errno == ENOENT || errno == ENOTDIR)) return std::optional<std::string>();
-  if (descriptor < 0) return failure();
-  std::string content;
-  char part[4096];
-  ssize_t count = 0;
-  while ((count = ::read(descriptor, part, sizeof part)) > 0 || (count < 0 && errno == EINTR)) {
-    if (count > 0) content.append(part, static_cast<std::size_t>(count));
-  }
-  std::optional<Error> error;
-  if (count < 0) error = failure();
-  ::close(descriptor);
-  if (error) return *error;
-  return std::optional(std::move(content));
-}
-
 Configuration readForProcess() {
   ZQ_FUNCTION("ConfigurationRead");
   std::vector<std::string> warnings;
@@ -261,13 +239,18 @@ std::vector<std::string> Configuration::Agent::remoteBackends() const {
 
 Result<Configuration> Configuration::read(const std::filesystem::path& file,
                                           std::vector<std::string>& warnings) {
-  Result<std::optional<std::string>> content = contentOf(file);
-  if (!content) return content.error();
-  if (!content.value()) return Configuration{};
+  const Result<std::string> content = ReadWholeFile(file);
+  if (!content) {
+    const std::int64_t status = content.error().code;
+    if (status == ENOENT || status == ENOTDIR) return Configuration{};
+    return Error::because(
+        "quarvel.configuration", 1,
+        fmt::format("{}: {}.", file.native(), std::strerror(static_cast<int>(status))));
+  }
   Findings findings(file, warnings);
   Configuration configuration;
   try {
-    configuration = readRoot(findings, toml::parse(*content.value(), file.native()));
+    configuration = readRoot(findings, toml::parse(content.value(), file.native()));
   } catch (const toml::parse_error& fault) {
     findings.syntaxFault(fault);
   }

@@ -9,8 +9,9 @@
 
 namespace quarvel {
 
-/// Rows under a heading, printed to standard output in portions: columns are as wide as the widest
-/// cell so far. On a terminal the widest texts are cut until the line fits.
+/// Rows under a heading, printed to standard output in portions. Columns are as wide as the widest
+/// cell so far; on a terminal the widest texts are cut until the line fits. Owned by one command;
+/// one thread.
 class Table {
  public:
   struct Column {
@@ -20,12 +21,13 @@ class Table {
 
   Table(std::vector<Column> columns, const Terminal& terminal);
 
-  /// As many cells as there are columns.
+  /// Takes one cell for each column.
   void add(std::vector<std::string> row);
   /// Prints the rows added since the last time, the heading before the first.
   void print();
 
  private:
+  /// The columns' widths, cut so that a line fits the terminal.
   [[nodiscard]] std::vector<std::size_t> fittedWidths() const;
   void printLine(const std::vector<std::string>& cells, const std::vector<std::size_t>& widths,
                  bool heading);
