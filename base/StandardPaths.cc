@@ -70,10 +70,4 @@ StandardPaths StandardPaths::fromEnvironment(bool root) {
   return directories;
 }
 
-const StandardPaths& StandardPaths::process() {
-  // Never destroyed: other threads may ask until the very end.
-  static const StandardPaths& directories = *new StandardPaths(fromEnvironment(geteuid() == 0));
-  return directories;
-}
-
 }  // namespace quarvel

@@ -5,7 +5,7 @@
 namespace quarvel {
 
 /// Where the service keeps its files: systemd's directory variables first, then the fall-backs for
-/// a run by hand. Read once per process.
+/// a run by hand.
 struct StandardPaths {
   std::filesystem::path runtime;
   std::filesystem::path state;
@@ -14,8 +14,6 @@ struct StandardPaths {
   std::filesystem::path socket;
   /// Prefix of the diagnostics directory: `$QUARVEL_DIAGNOSTICS_PREFIX`, empty by default.
   std::filesystem::path diagnosticsPrefix;
-
-  [[nodiscard]] static const StandardPaths& process();
 
   /// Reads the environment; `root` chooses the fall-backs.
   [[nodiscard]] static StandardPaths fromEnvironment(bool root);
