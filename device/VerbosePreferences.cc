@@ -15,9 +15,8 @@ VerbosePreferences::VerbosePreferences()
   ZQ_FUNCTION("FollowVerbosePreferences");
   // First the notification: a change while the scopes are read is then read again.
   NotificationToken token = 0;
-  const std::int32_t status =
-      RegisterForNotification("tarnwick.quarvel.reporting", token, *queue_,
-                              [this](NotificationToken) { readAgain(); });
+  const std::int32_t status = RegisterForNotification("tarnwick.quarvel.reporting", token, *queue_,
+                                                      [this](NotificationToken) { readAgain(); });
   if (status != 0) {
     ZQ_LOG(nullptr, error, "verbose preferences are read at the start only: {}",
            std::generic_category().message(status));

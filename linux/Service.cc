@@ -20,8 +20,8 @@ namespace quarvel {
 
 namespace {
 
-/// The service ends within 5 s; the rest of them is for the store, whose last rows have to reach the
-/// medium.
+/// The service ends within 5 s; the rest of them is for the store, whose last rows have to reach
+/// the medium.
 constexpr std::chrono::seconds kWorkMayTake{4};
 
 std::atomic<Service*> runningService{nullptr};

@@ -33,9 +33,9 @@ namespace quarvel {
 /// functions without a context.
 ///
 /// One at a time in a process. Made and destroyed by the main thread, which serves clients in
-/// between (`listener().resume()`). A part that cannot start ends the process with an error line and
-/// status 1. The product ends by `ExitProcess` and runs no destructor: a client's work may still
-/// hold threads then.
+/// between (`listener().resume()`). A part that cannot start ends the process with an error line
+/// and status 1. The product ends by `ExitProcess` and runs no destructor: a client's work may
+/// still hold threads then.
 class Service {
  public:
   Service();

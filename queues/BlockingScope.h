@@ -26,8 +26,8 @@ class BlockingScope {
 };
 
 /// Lets a thread of no pool, the I/O thread, run short blocks itself while their queue is idle:
-/// brief blocks (`WorkQueue::asyncBrief`) that the thread adds to idle queues are kept for `runOne`.
-/// Saves two context switches per call.
+/// brief blocks (`WorkQueue::asyncBrief`) that the thread adds to idle queues are kept for
+/// `runOne`. Saves two context switches per call.
 ///
 /// Other blocks, and all that are left after 1 ms, go to the pools. A block that runs here must not
 /// block (`BlockingScope::isAllowed`).

@@ -12,10 +12,11 @@ namespace quarvel {
 /// Starts a detached thread. Its stack of 192 KiB is enough for the deepest payload and small
 /// enough for a thousand threads. Signals meant for the process are blocked in it, so that they
 /// reach the threads that wait for them. `nice` is the thread's own nice value; a thread inherits
-/// its starter's, and cannot go below it without privilege. Returns 0, or the system's error number.
+/// its starter's, and cannot go below it without privilege. Returns 0, or the system's error
+/// number.
 [[nodiscard]] int StartThread(std::string_view name, int nice, Block body);
 
-/// A thread like those of `StartThread`, joined by its owner. One thread at a time.
+/// A thread as `StartThread` makes it, but joined by its owner. Used by one thread at a time.
 class JoinedThread {
  public:
   JoinedThread() = default;

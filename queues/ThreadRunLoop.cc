@@ -48,7 +48,8 @@ class ThreadRunLoop::Timer final : public RunLoopTimer {
   }
 
   void invalidate() override QUARVEL_EXCLUDES(mutex_) {
-    // Both destroyed after the lock: the block is foreign, and the loop may hold the last reference.
+    // Both destroyed after the lock: the block is foreign, and the loop may hold the last
+    // reference.
     std::shared_ptr<Timer> removed;
     std::optional<Block> block;
     const MutexLock lock(mutex_);

@@ -20,8 +20,8 @@ class ThreadRunLoop final : public RunLoop {
   void run() override;
 
   /// As `CreateRunLoopTimer`.
-  [[nodiscard]] static std::shared_ptr<RunLoopTimer> createTimer(
-      std::chrono::microseconds interval, Block block);
+  [[nodiscard]] static std::shared_ptr<RunLoopTimer> createTimer(std::chrono::microseconds interval,
+                                                                 Block block);
 
  private:
   class Timer;

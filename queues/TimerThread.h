@@ -17,8 +17,8 @@ namespace quarvel {
 class PendingWork;
 class Pool;
 
-/// The thread of a `WorkQueues`, its owner: adds delayed blocks to their queues when they are due,
-/// and starts the pools' threads, so that no caller pays for a new thread and no thread inherits
+/// The timer thread of a `WorkQueues`, its owner. It adds delayed blocks to their queues when they
+/// are due. It also starts the pools' threads: no caller pays for a new thread, and none inherits
 /// the nice value of a pool below its own. Sleeps until the earliest block is due, without bound
 /// when there is none. Any thread.
 class TimerThread {

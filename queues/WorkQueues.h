@@ -33,8 +33,8 @@ class WorkQueues {
   [[nodiscard]] std::shared_ptr<Condition> createCondition() { return conditions_.create(); }
 
   /// Brings all work to an end, for good: delayed blocks run at once, waits in a condition end
-  /// within 2 s as if their deadline had passed, and the caller, no pool's thread, waits until every
-  /// queue is idle. Returns false when that was not so at `deadline`.
+  /// within 2 s as if their deadline had passed, and the caller, no pool's thread, waits until
+  /// every queue is idle. Returns false when that was not so at `deadline`.
   [[nodiscard]] bool drain(std::chrono::steady_clock::time_point deadline);
 
  private:
