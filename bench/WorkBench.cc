@@ -4,8 +4,8 @@
 #include <chrono>
 #include <cstdint>
 
-#include "platform/WorkQueue.h"
 #include "queues/CallTracker.h"
+#include "queues/WorkQueues.h"
 
 namespace quarvel {
 namespace {
@@ -24,7 +24,9 @@ class Counted final : public CallTracker {
 // the producer's work between two blocks; a slow producer finds the queue idle each time.
 void AsyncToSerialQueue(benchmark::State& state) {
   constexpr std::int64_t kBlocks = 1'000'000;
-  const auto queue = CreateSerialQueue("tarnwick.quarvel.bench", QualityOfService::userInteractive);
+  WorkQueues queues;
+  const auto queue =
+      queues.createSerialQueue("tarnwick.quarvel.bench", QualityOfService::userInteractive);
   for (auto _ : state) {
     std::int64_t run = 0;
     std::atomic<bool> done{false};
@@ -53,9 +55,11 @@ BENCHMARK(AsyncToSerialQueue)
 
 // From one queue to another and back: the cost of a wake-up without batching.
 void PingPong(benchmark::State& state) {
+  WorkQueues queues;
   const auto server =
-      CreateSerialQueue("tarnwick.quarvel.server", QualityOfService::userInteractive);
-  const auto session = CreateSerialQueue("tarnwick.quarvel.session", QualityOfService::utility);
+      queues.createSerialQueue("tarnwick.quarvel.server", QualityOfService::userInteractive);
+  const auto session =
+      queues.createSerialQueue("tarnwick.quarvel.session", QualityOfService::utility);
   for (auto _ : state) {
     std::atomic<bool> done{false};
     server->async([&] {

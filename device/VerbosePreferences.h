@@ -1,10 +1,32 @@
 #pragma once
 
+#include <memory>
+#include <vector>
+
+#include "base/Mutex.h"
+#include "platform/Log.h"
+#include "platform/WorkQueue.h"
+
 namespace quarvel {
 
 /// Has the log's verbose switches follow the preferences: each scope's key is read from its domain
-/// when the scope is registered (at once for those that are), and again whenever the notification
-/// "tarnwick.quarvel.reporting" is posted. Called once in a process, at its start, from any thread.
-void FollowVerbosePreferences();
+/// when the scope is registered (at once for the registered ones), and again whenever the
+/// notification "tarnwick.quarvel.reporting" is posted. Owned by the service, one at a time, and
+/// outlives the blocks of its queue.
+class VerbosePreferences {
+ public:
+  VerbosePreferences();
+  VerbosePreferences(const VerbosePreferences&) = delete;
+  VerbosePreferences& operator=(const VerbosePreferences&) = delete;
+  ~VerbosePreferences();
+
+ private:
+  void add(LogHandle scope) QUARVEL_EXCLUDES(mutex_);
+  void readAgain() QUARVEL_EXCLUDES(mutex_);
+
+  const std::unique_ptr<WorkQueue> queue_;
+  Mutex mutex_;
+  std::vector<LogHandle> scopes_ QUARVEL_GUARDED_BY(mutex_);
+};
 
 }  // namespace quarvel

@@ -9,11 +9,8 @@
 #include <utility>
 
 #include "base/Files.h"
-#include "base/StandardPaths.h"
 #include "platform/Log.h"
-#include "platform/Process.h"
 #include "system/ConfigurationSection.h"
-#include "system/LogControl.h"
 
 namespace quarvel {
 namespace {
@@ -22,7 +19,6 @@ using configuration::Findings;
 using configuration::kAnyPositive;
 using configuration::Section;
 
-constexpr std::string_view kFileName = "quarvel.toml";
 constexpr std::int64_t kMebibyte = 1024 * 1024;
 constexpr std::int64_t kGibibyte = 1024 * kMebibyte;
 constexpr std::int64_t kDaySeconds = 24 * 60 * 60;
@@ -202,34 +198,7 @@ Configuration readRoot(Findings& findings, const toml::table& table) {
   return out;
 }
 
-/// The whole of a file; none when there is no such file.
-Configuration readForProcess() {
-  ZQ_FUNCTION("ConfigurationRead");
-  std::vector<std::string> warnings;
-  Result<Configuration> configuration =
-      Configuration::read(StandardPaths::process().configuration / kFileName, warnings);
-  if (!configuration) {
-    const std::string* const reason = configuration.error().userInfo.find("reason")->string();
-    ZQ_LOG(nullptr, error, "{}", *reason);
-    ExitProcess(1);
-  }
-  SetLogLevel(configuration.value().logLevel);
-  for (const std::string& warning : warnings) ZQ_LOG(nullptr, standard, "{}", warning);
-  return std::move(configuration.value());
-}
-
 }  // namespace
-
-const Configuration& Configuration::process() {
-  // Never destroyed: other threads may ask until the very end.
-  static const Configuration& configuration = *new Configuration(readForProcess());
-  return configuration;
-}
-
-Result<Configuration> Configuration::readAgain() {
-  std::vector<std::string> known;  // and told of, when the process began
-  return read(StandardPaths::process().configuration / kFileName, known);
-}
 
 std::vector<std::string> Configuration::Agent::remoteBackends() const {
   std::vector<std::string> remote = backends;

@@ -93,13 +93,8 @@ struct Configuration {
     std::size_t connections = 4096;
   } limits;
 
-  /// The process's configuration, read on first use. When the file has an error, says so on
-  /// standard error (file, line, key, what is allowed) and ends the process with status 1. Unknown
-  /// keys are warnings in the log.
-  [[nodiscard]] static const Configuration& process();
-
-  /// Reads the process's file again, for what may change while it runs; `process` stays as it was.
-  [[nodiscard]] static Result<Configuration> readAgain();
+  /// The file's name in the configuration directory.
+  static constexpr const char* kFileName = "quarvel.toml";
 
   /// Reads one file; a missing file yields the defaults. `warnings` receives a sentence for each
   /// unknown key. Errors: domain "quarvel.configuration".

@@ -10,8 +10,13 @@
 #include <vector>
 
 #include "Statistics/Service/ZQReportingBlockThrottle.h"
+#include "platform/DeviceProperties.h"
 
 namespace quarvel {
+
+std::optional<bool> DevicePropertyBoolean(std::string_view) {
+  return std::nullopt;
+}
 
 namespace {
 
