@@ -16,6 +16,7 @@ import subprocess
 import sys
 import tempfile
 
+os.environ.setdefault("QUARVEL_TEST_PATIENCE", "300")  # callgrind makes the service fifty times slower
 sys.path.insert(0, str(pathlib.Path(__file__).parents[1] / "tests/integration"))
 from harness import PATIENCE, eventually
 
@@ -34,7 +35,7 @@ def stored(database):
 def instructions(quarveld, load, ctl, messages):
     """Instructions of a service that takes so many messages of one session. The session is not stopped,
     since its summary would count too."""
-    with tempfile.TemporaryDirectory(prefix="quarvel-") as name:
+    with tempfile.TemporaryDirectory(prefix="quarvel-") as name, contextlib.ExitStack() as processes:
         directory = pathlib.Path(name)
         (directory / "quarvel.toml").write_text('[log]\nlevel = "error"\n[analytics]\nwanted = []\n')
         environment = dict(os.environ, RUNTIME_DIRECTORY=name, STATE_DIRECTORY=name,
@@ -44,9 +45,11 @@ def instructions(quarveld, load, ctl, messages):
         service = subprocess.Popen(
             ["valgrind", "--tool=callgrind", "--callgrind-out-file=/dev/null", quarveld],
             env=environment, stderr=subprocess.PIPE, text=True)
+        processes.callback(service.kill)
         eventually((directory / "reporting.sock").exists, "the service's socket", 0.05)
         sender = subprocess.Popen([load, directory / "reporting.sock", str(messages)],
                                   stdin=subprocess.PIPE, stdout=subprocess.DEVNULL)
+        processes.callback(sender.kill)
         eventually(lambda: stored(directory / "telemetry.db") >= messages, "the last row", 0.05)
         subprocess.run([ctl, "kill"], env=environment, check=False, capture_output=True, timeout=PATIENCE)
         report = service.communicate(timeout=PATIENCE)[1]
