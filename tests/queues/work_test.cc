@@ -158,27 +158,32 @@ TEST_F(BlockingTest, ThousandBlockedQueuesDelayNoOther) {
 }
 
 TEST_F(BlockingTest, PoolReplacesNoMoreBlockedThreadsThanItsBound) {
-  constexpr int kBound = 8;  // of the background class, which is two threads wide
+  constexpr int kBound = 8;                            // of the class, which is one thread wide
   const auto before = threadsLeft(kFirstThreads + 1);  // with the timer thread
   std::atomic<int> entered{0};
-  Gate full(kBound + 2);
+  Gate queued;
+  Gate full(kBound + 1);
   Gate release;
+  std::vector<std::unique_ptr<WorkQueue>> blocked;
   for (int i = 0; i < 3 * kBound; ++i) {
-    queues.background().async([&] {
+    blocked.push_back(serverQueue());
+    blocked.back()->async([&] {
+      queued.wait();
       const BlockingScope blocking;
       ++entered;
       full.arrive();
       release.wait();
     });
   }
+  queued.arrive();
   full.wait();
   // The timer thread starts threads before it delivers delayed blocks.
   const auto session = sessionQueue();
   Gate delivered;
   session->after(1ms, [&delivered] { delivered.arrive(); });
   delivered.wait();
-  EXPECT_EQ(entered, kBound + 2);
-  EXPECT_EQ(threadCount() - before, kBound + 2 + 1) << "and the session queue's thread";
+  EXPECT_EQ(entered, kBound + 1);
+  EXPECT_EQ(threadCount() - before, kBound + 1 + 1) << "and the session queue's thread";
   release.arrive();
   EXPECT_TRUE(queues.drain(steady_clock::now() + 30s));
   EXPECT_EQ(entered, 3 * kBound);
