@@ -5,28 +5,12 @@
 
 namespace quarvel {
 
-namespace {
-
-StoreDrop ReasonOf(MessageDrop reason) {
-  switch (reason) {
-    case MessageDrop::noAgentSession:
-      return StoreDrop::noAgentSession;
-    case MessageDrop::testServiceType:
-      return StoreDrop::testServiceType;
-    case MessageDrop::noSuchSession:
-      break;
-  }
-  return StoreDrop::noSuchSession;
-}
-
-}  // namespace
-
 void CountAcceptedMessage() {
   ProcessTelemetryStore()->countAccepted();
 }
 
-void CountDroppedMessage(MessageDrop reason) {
-  ProcessTelemetryStore()->countDropped(ReasonOf(reason));
+void CountDroppedMessage(StoreDrop reason) {
+  ProcessTelemetryStore()->countDropped(reason);
 }
 
 void AddToGauge(Gauge gauge, int difference) {

@@ -65,9 +65,6 @@ Result<std::int64_t> Erase(const ErasureSelection& selection) {
   const Outcome begun = ProcessTelemetryStore()->erase(
       selection, [erased](const Result<std::int64_t>& result) { erased->set_value(result); });
   if (!begun) return begun.error();
-  if (std::holds_alternative<ErasureSelection::All>(selection.what)) {
-    Erasure::removeSetAside(ProcessTelemetryStore()->path());
-  }
   const BlockingScope blocking;
   return rows.get();
 }

@@ -1,7 +1,7 @@
 #include "platform/Vistrel.h"
 
 #include "linux/ProcessStore.h"
-#include "store/AnalyticsEventSink.h"
+#include "store/EventSinks.h"
 #include "system/Configuration.h"
 
 namespace quarvel {

@@ -2,6 +2,8 @@
 
 #include <cstdint>
 
+#include "base/StoreCounters.h"
+
 namespace quarvel {
 
 // What the service counts for its status (and for nothing else). From any thread; never waits.
@@ -12,13 +14,8 @@ namespace quarvel {
 /// unnoticed: accepted = stored + waiting + dropped.
 void CountAcceptedMessage();
 
-/// Why a message never reaches the agent.
-enum class MessageDrop : std::uint8_t {
-  noAgentSession,   // the session found no backend
-  testServiceType,  // messages of the service type "test" are not sent
-  noSuchSession,    // it was for a session that nobody has
-};
-void CountDroppedMessage(MessageDrop reason);
+/// The message never reaches the agent.
+void CountDroppedMessage(StoreDrop reason);
 
 /// What there is now.
 enum class Gauge : std::uint8_t { clients, sessions, startedSessions };

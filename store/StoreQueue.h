@@ -11,8 +11,8 @@
 
 #include "base/Error.h"
 #include "base/Mutex.h"
+#include "base/StoreCounters.h"
 #include "store/StoreBatch.h"
-#include "store/database/StoreCounters.h"
 
 namespace quarvel {
 

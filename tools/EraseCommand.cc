@@ -10,6 +10,7 @@
 
 #include "base/Json.h"
 #include "store/database/Erasure.h"
+#include "store/database/StoreFile.h"
 #include "tools/Arrival.h"
 #include "tools/Commands.h"
 #include "tools/Notification.h"
@@ -104,7 +105,7 @@ Result<std::int64_t> EraseOurselves(const Options& options, const ErasureSelecti
                               store.native(), connection.message()));
   }
   if (std::holds_alternative<ErasureSelection::All>(selection.what)) {
-    Erasure::removeSetAside(store);
+    RemoveStoresSetAside(store);
   }
   return erasure.rows();
 }

@@ -5,6 +5,7 @@
 #include <future>
 
 #include "store/database/Erasure.h"
+#include "store/database/StoreFile.h"
 #include "tests/export/ExportFixture.h"
 
 namespace quarvel::testing {
@@ -114,7 +115,7 @@ TEST_F(ErasureTest, WorksOnAStoreThatNobodyHasOpen) {
     while (erasure.step() == Erasure::Progress::more) continue;
     EXPECT_EQ(erasure.rows(), 701);
   }
-  EXPECT_EQ(Erasure::removeSetAside(path_), 2U);
+  EXPECT_EQ(RemoveStoresSetAside(path_), 2U);
   EXPECT_FALSE(filesHold("secret"));
   begin();
   EXPECT_EQ(store_->counters().dropped[StoreDrop::erased], 700U);

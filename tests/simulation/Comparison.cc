@@ -216,8 +216,8 @@ void World::compareCounters() {
          "messages have vanished, or come of nothing");
   expect(counters.accepted == counts_.accepted + model_.toNobody,
          "accepted messages are miscounted");
-  expect(counters.of(MessageDrop::noSuchSession) == model_.toNobody &&
-             counters.of(MessageDrop::noAgentSession) + counters.of(MessageDrop::testServiceType) ==
+  expect(counters.of(StoreDrop::noSuchSession) == model_.toNobody &&
+             counters.of(StoreDrop::noAgentSession) + counters.of(StoreDrop::testServiceType) ==
                  counts_.dropped,
          "dropped messages are miscounted");
   expect(counters.gauges == std::array<std::int64_t, 3>{},

@@ -9,7 +9,7 @@
 #include "queues/Work.h"
 #include "store/EventSinks.h"
 #include "store/database/SecureRandom.h"
-#include "store/database/StoreError.h"
+#include "store/database/StoreFile.h"
 #include "tests/store/FileCalls.h"
 #include "tests/store/StoreFixture.h"
 

@@ -12,7 +12,7 @@
 
 #include "store/StoreQueue.h"
 #include "store/database/Sqlite.h"
-#include "store/database/StoreError.h"
+#include "store/database/StoreFile.h"
 #include "tests/LogRecorder.h"
 #include "tests/store/FileCalls.h"
 #include "tests/store/StoreFixture.h"
