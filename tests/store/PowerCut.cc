@@ -7,11 +7,11 @@ namespace quarvel::testing {
 
 namespace {
 
-using Kind = FileCalls::Change::Kind;
+using Kind = Interposer::Change::Kind;
 
 constexpr std::size_t kSector = 512;
 
-/// Not on a medium, whatever its file system.
+/// Shared memory, which never reaches a medium.
 bool IsSharedMemory(const std::string& path) {
   return path.ends_with("-shm");
 }

@@ -6,9 +6,9 @@
 #include <future>
 #include <set>
 
+#include "tests/Interposer.h"
 #include "tests/UnixSocket.h"
 #include "tests/transport/ConnectionFixture.h"
-#include "tests/transport/SocketCalls.h"
 
 // Every call that listening and serving make of the system fails, once and for ever: the service
 // says why it cannot begin, or goes on, and serves a polite client as soon as the fault is over.
@@ -16,7 +16,7 @@
 namespace quarvel {
 namespace {
 
-using testing::SocketCalls;
+using testing::Interposer;
 
 struct Site {
   const char* function;
@@ -76,20 +76,20 @@ void BeClients(const std::filesystem::path& path) {
 /// A listener from its beginning to its end, with one fault. Says what went wrong, if anything did.
 class Life {
  public:
-  explicit Life(std::optional<SocketCalls::Fault> fault) {
-    SocketCalls& calls = SocketCalls::instance();
-    calls.begin(fault);
+  explicit Life(std::optional<Interposer::Fault> fault) {
+    Interposer& calls = Interposer::watch();
+    if (fault) calls.inject(*fault);
     // A socket file that a killed service has left.
     const std::filesystem::path path = directory_.path() / "socket";
     ::close(BoundSocket(path, SOCK_STREAM));
     if (!listen(path)) return;
     auto served = std::async(std::launch::async, [this] {
-      const SocketCalls::Watched watched;
+      const Interposer::WatchedThread watched;
       listener_->resume();
     });
     const Client bystander(path);
     BeClients(path);
-    countsWhileFailing_ = calls.counts();
+    countsWhileFailing_ = calls.calls();
     if (fault && fault->forever) {
       expectRest();
       calls.lift();
@@ -116,7 +116,7 @@ class Life {
 
  private:
   bool listen(const std::filesystem::path& path) {
-    const SocketCalls::Watched watched;
+    const Interposer::WatchedThread watched;
     auto socket = ListeningSocket::listeningAt(path);
     if (!socket) return refuse(socket.error());
     SocketListener::Options options;
@@ -140,7 +140,7 @@ class Life {
     std::this_thread::sleep_for(std::chrono::milliseconds(20));
     const auto made = [] {
       std::size_t sum = 0;
-      for (const auto& [function, count] : SocketCalls::instance().counts()) sum += count;
+      for (const auto& [function, count] : Interposer::instance().calls()) sum += count;
       return sum;
     };
     const std::size_t before = made();
@@ -159,7 +159,7 @@ class Life {
 TEST(ConnectionFaults, EveryCallMayFail) {
   const Life faultless(std::nullopt);
   ASSERT_EQ(faultless.finding(), "");
-  const auto counts = SocketCalls::instance().counts();
+  const auto counts = Interposer::instance().calls();
   std::set<std::string> known;
   for (const Site& site : kSites) known.insert(site.function);
   for (const auto& [function, count] : counts) {
@@ -181,10 +181,11 @@ TEST(ConnectionFaults, EveryCallMayFail) {
           bool reached = false;
           // Which calls are made in the end is a matter of who is faster.
           for (int attempt = 0; attempt < 5 && !reached; ++attempt) {
-            const Life life(SocketCalls::Fault{site.function, at, error, forever});
+            const Life life(Interposer::Fault{
+                .at = at, .error = error, .forever = forever, .function = site.function});
             EXPECT_EQ(life.finding(), "") << site.function << " " << at << " fails with " << error
                                           << (forever ? " for ever" : "");
-            reached = SocketCalls::instance().failed() > 0;
+            reached = Interposer::instance().failedCalls() > 0;
             refusals += life.refused() ? 1U : 0U;
           }
           ++(reached ? points : missed);
