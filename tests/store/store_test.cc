@@ -586,7 +586,7 @@ const ClockCase kClockCases[] = {
      {{-24h, true},
       {-kNoon, true},
       {0h, false, 0},
-      {-kNoon, true},
+      {-kNoon + 1h, true},
       {2h},
       {3h, true},
       {13 * 24h + 1h, true, 3, "2,3,4,5,6 2"},
@@ -614,14 +614,17 @@ TEST_F(StoreRetentionTest, RowsAgeByAClockThatIsSet) {
       asleep = asleep.load() + step.slept;
       now_ = Date{kNoon + step.at};
       if (step.starts) store = open(options());
-      if (step.starts && step.at == -kNoon) Get(flush(*store, addSession(*store)));
+      if (step.starts && step.at < -24h) Get(flush(*store, addSession(*store)));
       for (int i = 0; i < step.rows; ++i) sendAndAwait(*store, i);
       if (step.left == nullptr) continue;
-      Await([&] {
-        return value(
-                   "SELECT (SELECT group_concat((id + 2) / 3) FROM message WHERE id % 3 = 1) ||"
-                   " ' ' || (SELECT count(*) FROM agent_session)") == step.left;
-      });
+      std::string left;
+      const auto never = std::chrono::steady_clock::now() + kNever;
+      while (left != step.left && std::chrono::steady_clock::now() < never) {
+        left = value(
+            "SELECT (SELECT group_concat((id + 2) / 3) FROM message WHERE id % 3 = 1) ||"
+            " ' ' || (SELECT count(*) FROM agent_session)");
+      }
+      EXPECT_EQ(left, step.left) << "after step " << &step - clock.steps.data();
     }
     store.reset();
     EXPECT_EQ(value("SELECT count(*) FROM meta WHERE key LIKE 'clock%'"),
