@@ -53,7 +53,7 @@ class Tables {
   }
 
  private:
-  /// An insert of a row like those of the service; NULL for `id` takes the next one.
+  /// An insert of a row such as the service writes; NULL for `id` takes the next one.
   sqlite3_stmt* prepare(const TableDescription& table) {
     execute(CreateTableSql(table).c_str());
     const std::string sql = InsertSql(table);

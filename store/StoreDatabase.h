@@ -147,7 +147,7 @@ class StoreDatabase {
   int movedPages_ = 0;
   bool isCatchingUp_ = false;  // all of it was moved, and it has grown meanwhile
   std::string storeID_;
-  StoreIDs lastIDs_;  // with those of the open transaction
+  StoreIDs lastIDs_;  // with the ids of the open transaction
   StoreIDs committedIDs_;
   Retention retention_;
   std::int64_t provisionalSessionsAfter_ = 0;

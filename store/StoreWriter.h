@@ -19,8 +19,9 @@
 
 namespace quarvel {
 
-/// Commits: takes batches from the queue and writes them, retries what fails, opens and closes the
-/// file, carries out erasures. `StoreDurability` and `StoreAgeing` do the rest on the same thread.
+/// Commits: takes batches from the queue and writes them, retries after failures, opens and closes
+/// the file, carries out erasures. `StoreDurability` and `StoreAgeing` do the rest on the same
+/// thread.
 ///
 /// Owned by the `TelemetryStore`, as long as it lives. Everything runs on the store's thread, but
 /// for `problem` and `followDurableExtent`.

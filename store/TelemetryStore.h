@@ -63,7 +63,7 @@ class TelemetryStore {
   };
 
   /// Opens the store and starts the writer. Makes a store when there is none, and sets a corrupt
-  /// one aside. An error says what to do, and nothing has been changed then. A failure that may
+  /// one aside. An error tells the remedy, and nothing has been changed then. A failure that may
   /// pass, such as a full disk, is no error: rows wait in the queue until the file can be opened.
   [[nodiscard]] static Result<std::unique_ptr<TelemetryStore>> open(Options options);
   TelemetryStore(const TelemetryStore&) = delete;

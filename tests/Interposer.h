@@ -95,7 +95,7 @@ class Interposer {
   void mark(off_t promise) QUARVEL_EXCLUDES(mutex_);
   [[nodiscard]] std::vector<Change> takeRecord() QUARVEL_EXCLUDES(mutex_);
 
-  // Called by the functions that stand for those of the C library.
+  // Called by the stand-ins for the C library's functions.
 
   [[nodiscard]] static bool watchesThread();
   /// The path of a descriptor of a watched file.

@@ -23,7 +23,7 @@ namespace {
 using std::filesystem::path;
 
 constexpr const char* kErasureNotification = "tarnwick.quarvel.erase";
-constexpr std::chrono::minutes kPatience{5};  // a large store is written anew
+constexpr std::chrono::minutes kPatience{5};  // a large store is rewritten as a whole
 
 Error Failed(std::string reason) {
   return Error::because("quarvel.erase", 1, std::move(reason));
@@ -90,7 +90,7 @@ Result<std::int64_t> AskService(const Options& options, const ErasureSelection& 
 Result<std::int64_t> EraseOurselves(const Options& options, const ErasureSelection& selection) {
   path store = PathOf(options);
   if (std::filesystem::is_directory(store)) store /= "telemetry.db";
-  // Says what is wrong with a file that is no store of ours, and leaves it alone.
+  // Refuses a file that is no store of ours, and leaves it alone.
   if (auto reader = StoreReader::open(store); !reader) return std::move(reader.error());
   SqliteConnection connection;
   if (!connection.open(store)) {

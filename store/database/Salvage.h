@@ -15,7 +15,7 @@ namespace quarvel {
 /// Copies every readable row of the stores that were set aside beside `path` into the store that
 /// `into` has open, once for each of them: rows with their ids, the store's id, cursors and
 /// counters. Rows between two readable parts of a file are lost, and counted. The damaged files
-/// stay as they are. Adds to `notices` what it did. When it has to stop, for lack of room for
+/// stay as they are. Adds its results to `notices`. When it has to stop, for lack of room for
 /// example, the next opening goes on and copies no row twice.
 void SalvageStoresSetAside(const std::filesystem::path& path, SqliteConnection& into,
                            StoreNotices& notices);

@@ -89,8 +89,8 @@ class SqliteConnection {
   /// `immutable` reads a file that no process writes, without the locks and the log that SQLite
   /// otherwise needs beside it.
   enum class Access : std::uint8_t { readWrite, readOnly, immutable };
-  /// Opens a file that exists. Statements wait up to 250 ms for other connections, those of a
-  /// read-only one up to 5 s. False when it failed.
+  /// Opens a file that exists. Statements wait for other connections, for up to 250 ms, or 5 s
+  /// on a read-only connection. False when it failed.
   bool open(const std::filesystem::path& path, Access access = Access::readWrite);
 
   /// Runs statements without parameters, rows ignored. False when one failed.

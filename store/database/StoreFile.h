@@ -49,10 +49,8 @@ using StoreNotices = std::vector<StoreNotice>;
 
 /// Opens the store's file and brings it to this version of the schema. Makes a new file when there
 /// is none. Sets a corrupt file aside, makes a new one and copies every readable row into it. Adds
-/// to `notices` what it did.
-/// `now` names a file that is set aside. `isSuspect`: corruption was met in this file, so all of it
-/// is checked.
-/// Errors: the file is left as it was.
+/// its results to `notices`. `now` names a file that is set aside. `isSuspect`: corruption was met
+/// in this file, so all of it is checked. Errors: the file is left as it was.
 [[nodiscard]] Result<SqliteConnection> OpenStore(const std::filesystem::path& path, Date now,
                                                  bool isSuspect, StoreNotices& notices);
 

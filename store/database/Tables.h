@@ -115,7 +115,7 @@ inline constexpr TableDescription kExportLogTable{.name = "export_log",
 inline constexpr TableDescription kMetaTable{
     .name = "meta", .columns = columns::kMeta, .primaryKey = "key"};
 
-/// Every table, in the order of creation; those of `StoreTable` first and in its order.
+/// Every table, in the order of creation. The tables in `StoreTable` come first, in its order.
 inline constexpr std::array<const TableDescription*, 7> kTables{
     &kAgentSessionTable, &kMessageTable,       &kAnalyticsEventTable,
     &kPowerEventTable,   &kBackendCursorTable, &kExportLogTable,

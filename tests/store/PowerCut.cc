@@ -39,7 +39,6 @@ bool PowerCut::advance() {
       files_[names_.at(change.path)].pending.push_back({&change});
       break;
     case Kind::sync:
-      if (!syncs_) break;
       if (const auto file = names_.find(change.path); file != names_.end()) {
         syncFile(files_[file->second], change);
       } else if (!change.failed) {

@@ -22,9 +22,7 @@ class PowerCut {
  public:
   using Change = Interposer::Change;
 
-  /// With `syncs` false, nothing was ever synced.
-  PowerCut(const std::vector<Change>& record, bool syncs = true)
-      : record_(record), next_(record.begin()), syncs_(syncs) {}
+  explicit PowerCut(const std::vector<Change>& record) : record_(record), next_(record.begin()) {}
 
   /// Goes on to the moment after the next change; false at the end.
   bool advance();
@@ -55,7 +53,6 @@ class PowerCut {
 
   const std::vector<Change>& record_;
   std::vector<Change>::const_iterator next_;
-  const bool syncs_;
   off_t promised_ = 0;
   std::vector<File> files_;
   Names names_;      // as the program sees them

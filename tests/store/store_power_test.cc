@@ -109,18 +109,18 @@ class PowerTest : public StoreFixture {
     std::size_t broken = 0;
   };
   /// Opens so many images of one run, as many for each moment.
-  Tally cutEverywhere(const Run& run, std::size_t images, bool syncs) {
+  Tally cutEverywhere(const Run& run, std::size_t images) {
     const Record record = this->record(run);
     const std::size_t each = std::max(images / record.size() + 1, std::size_t{3});
     std::mt19937 random(20'260'131);
     Tally tally;
-    for (PowerCut cut(record, syncs); cut.advance(); ++tally.moments) {
+    for (PowerCut cut(record); cut.advance(); ++tally.moments) {
       for (std::size_t i = 0; i < each; ++i, ++tally.images) {
         const auto survival =
             i < 2 ? static_cast<PowerCut::Survival>(i) : PowerCut::Survival::anything;
-        const auto fault = broken(cut.image(survival, random), syncs ? cut.promised() : 0);
+        const auto fault = broken(cut.image(survival, random), cut.promised());
         if (!fault) continue;
-        if (++tally.broken > 5 || !syncs) continue;
+        if (++tally.broken > 5) continue;
         ADD_FAILURE() << run.name << ", moment " << tally.moments << ", image " << i << ": "
                       << *fault;
       }
@@ -253,7 +253,7 @@ const std::vector<PowerTest::Run>& PowerTest::runs() {
 TEST_F(PowerTest, NoCutLosesAPromisedRowOrCorruptsTheStore) {
   Tally all;
   for (const Run& run : runs()) {
-    const Tally tally = cutEverywhere(run, ImagesWanted() / runs().size(), true);
+    const Tally tally = cutEverywhere(run, ImagesWanted() / runs().size());
     all.images += tally.images;
     all.moments += tally.moments;
     all.broken += tally.broken;
@@ -291,14 +291,6 @@ TEST_F(PowerTest, NoCutLosesARowThatASalvageCanRead) {
     ++moments;
   }
   fmt::print("harness: power cut, salvage: {} images of {} moments\n", images, moments);
-}
-
-// Checks the harness: without syncs the file itself breaks. Promises do not count here.
-TEST_F(PowerTest, FindsThatAStoreThatNeverSyncsIsCorrupted) {
-  std::size_t broken = 0;
-  for (const Run& run : runs()) broken += cutEverywhere(run, 200, false).broken;
-  fmt::print("harness: power cut without syncs: {} images broken\n", broken);
-  EXPECT_GT(broken, 20U);
 }
 
 // Files that are replaced in one step: a renamed file without its content would be neither.
