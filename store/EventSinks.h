@@ -46,7 +46,7 @@ class AnalyticsEventSink {
   /// event that matches none is not wanted.
   AnalyticsEventSink(EventQueue& queue, std::vector<std::string> wanted);
 
-  /// As `VistrelSendEventLazy`.
+  /// Implements `VistrelSendEventLazy`.
   void sendEventLazy(std::string_view name, const std::function<Payload()>& payload);
 
  private:

@@ -22,7 +22,7 @@ constexpr int kLogsBeforeRestart = 4;
 constexpr int kFewPages = 16;  // a rest of at most `logPages` / 16, 64 pages by default, is short
 constexpr std::uint64_t kLogPageBytes = 4096;
 
-/// As long as the file may be, and at least 16 times `logPages`, for slow readers.
+/// The bound of the file, and at least 16 times `logPages`, for slow readers.
 int LongestLogPages(const StoreDatabase::Options& options) {
   const std::uint64_t pages = options.bounds.maximumBytes / kLogPageBytes;
   const auto least = static_cast<std::uint64_t>(options.logPages) * 16;

@@ -31,13 +31,13 @@ class StoreDatabase {
   struct Options {
     std::filesystem::path path;
     Retention::Bounds bounds;
-    int logPages = 1024;  // as `TelemetryStore::Options::logPages`
+    int logPages = 1024;  // see `TelemetryStore::Options::logPages`
     /// Known from an earlier opening in this process: ids that were given, rows that were removed.
     StoreIDs knownIDs{};
     StoreDrops knownDrops{};
   };
 
-  /// As `OpenStore`; logs its notices.
+  /// Calls `OpenStore` and logs its notices.
   [[nodiscard]] static Result<std::unique_ptr<StoreDatabase>> open(const Options& options, Date now,
                                                                    bool isSuspect);
   StoreDatabase(const StoreDatabase&) = delete;
@@ -142,7 +142,7 @@ class StoreDatabase {
   const int logPages_;
   const int longestLogPages_;
   bool logIsTooLong_ = false;
-  // Of the log, at the last checkpoint.
+  // The log at the last checkpoint.
   int checkpointedPages_ = 0;  // its length when that began
   int movedPages_ = 0;
   bool isCatchingUp_ = false;  // all of it was moved, and it has grown meanwhile

@@ -54,7 +54,7 @@ class StoreDurability {
   /// At the end of the store: completes the flushes that are left.
   void failFlushes(const Error& error) { complete(flushes_, error); }
 
-  /// As `TelemetryStore::followDurableExtent`. Any thread.
+  /// See `TelemetryStore::followDurableExtent`. Any thread.
   void followDurableExtent(std::function<void(const DurableExtent&)> follower)
       QUARVEL_EXCLUDES(extentMutex_);
 

@@ -27,7 +27,7 @@ class StoreSyncer {
     bool durable;
     /// A sync has failed: the log must be rewritten before anything else is written.
     bool logSyncFailed;
-    /// Of a checkpoint: the number of pages of the log that have been moved.
+    /// After a checkpoint: the number of pages of the log that have been moved.
     int movedPages;
   };
 

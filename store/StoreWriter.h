@@ -44,9 +44,9 @@ class StoreWriter {
   /// Works until the queue is closed and empty, then closes the database.
   void run();
 
-  /// As `StoreHealth::problem`. Any thread.
+  /// See `StoreHealth::problem`. Any thread.
   [[nodiscard]] std::optional<std::string> problem() const { return health_.problem(); }
-  /// As `TelemetryStore::followDurableExtent`. Any thread.
+  /// See `TelemetryStore::followDurableExtent`. Any thread.
   void followDurableExtent(std::function<void(const DurableExtent&)> follower) {
     durability_.followDurableExtent(std::move(follower));
   }

@@ -22,8 +22,8 @@ class TelemetryAgent {
   /// `backends`: the configured ones, in the order in which sessions get them.
   TelemetryAgent(std::shared_ptr<TelemetryStore> store, std::vector<std::string> backends);
 
-  /// As the operations of the same names (`platform/RelmReporting.h`). A key that is missing, or
-  /// holds another kind of value, leaves its column empty.
+  /// Implement the operations of the same names (`platform/RelmReporting.h`). A key that is
+  /// missing, or holds another kind of value, leaves its column empty.
   [[nodiscard]] std::shared_ptr<RelmReportingSession> createAgentSession(
       const Dictionary& sessionInfo, const Dictionary& userInfo);
   Outcome sendOneMessage(const Dictionary& sessionInfo, const Dictionary& userInfo,

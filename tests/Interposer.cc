@@ -160,7 +160,7 @@ int Interposer::admit(const char* function, Purpose purpose) {
   if (fault_->only && fault_->only != purpose) return 0;
   if (!fault_->function.empty() && fault_->function != function) return 0;
   const std::size_t number = !fault_->function.empty() ? nth : fault_->only ? nthFor : all;
-  // Of all the calls for files, only a write can be half done.
+  // Among calls for files, only a write can be half done.
   const bool isShort = fault_->error == 0;
   if (number < fault_->at) return 0;
   if (isShort && fault_->function.empty() && purpose != Purpose::write) return 0;

@@ -51,7 +51,7 @@ class Interposer {
   enum class Purpose : std::uint8_t { open, write, sync, other };
   struct Fault {
     /// The first call that may fail: its number since `watch`, counted from 0, among all calls,
-    /// those for `only` or those of `function`.
+    /// calls for `only` or calls of `function`.
     std::size_t at = 0;
     /// The system's error number; 0: a write, or a send, transfers half of its bytes.
     int error = 0;

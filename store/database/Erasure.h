@@ -34,7 +34,7 @@ class Erasure {
   /// committed ids, must outlive this.
   Erasure(SqliteConnection& connection, ErasureSelection selection, const StoreIDs& through,
           const StoreIDs& lastIDs, Date now);
-  /// As above for a store without a service: takes the last ids from the file.
+  /// The same for a store without a service: takes the last ids from the file.
   Erasure(SqliteConnection& connection, ErasureSelection selection, Date now);
   Erasure(const Erasure&) = delete;
   Erasure& operator=(const Erasure&) = delete;
