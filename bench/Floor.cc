@@ -13,6 +13,7 @@
 #include <string_view>
 
 #include "base/MessagePack.h"
+#include "store/database/Tables.h"
 
 namespace quarvel {
 
@@ -27,7 +28,8 @@ void Check(bool ok, const char* what) {
   std::_Exit(1);
 }
 
-/// The service's tables, written as plainly as SQLite allows.
+/// The service's tables, written as plainly as SQLite allows: prepared inserts of
+/// one row. Owned by `RunFloor`; one thread.
 class Tables {
  public:
   Tables(const std::filesystem::path& file, const std::string& json, int rowsPerMessage)
@@ -35,19 +37,8 @@ class Tables {
     if (rowsPerMessage == 0) return;
     Check(sqlite3_open(file.c_str(), &database_) == SQLITE_OK, "open");
     execute("PRAGMA journal_mode=WAL; PRAGMA synchronous=NORMAL");
-    execute(
-        "CREATE TABLE message(id INTEGER PRIMARY KEY, agent_session INTEGER, session_id INTEGER "
-        "NOT "
-        "NULL, client_name TEXT NOT NULL, service_name TEXT NOT NULL, category INTEGER NOT NULL, "
-        "type INTEGER NOT NULL, payload TEXT NOT NULL, sent_at INTEGER NOT NULL);"
-        "CREATE TABLE analytics_event(id INTEGER PRIMARY KEY, name TEXT NOT NULL, payload TEXT NOT "
-        "NULL, recorded_at INTEGER NOT NULL)");
-    prepare(message_,
-            "INSERT INTO message VALUES(NULL, 1, 1, 'tarnwick.quarvel', 'unknown_session', 3, 1, "
-            "?, 1769865901123456)");
-    prepare(event_,
-            "INSERT INTO analytics_event VALUES(NULL, 'tarnwick.quarvel.DSP_Playback.Start', ?, "
-            "1769865901123456)");
+    message_ = prepare(kMessageTable);
+    event_ = prepare(kAnalyticsEventTable);
   }
   void add() {
     if (rowsPerMessage_ == 0) return;
@@ -62,12 +53,35 @@ class Tables {
   }
 
  private:
-  void prepare(sqlite3_stmt*& statement, const char* sql) {
-    Check(sqlite3_prepare_v2(database_, sql, -1, &statement, nullptr) == SQLITE_OK, sql);
+  /// An insert of a row such as the service writes; NULL for `id` takes the next one.
+  sqlite3_stmt* prepare(const TableDescription& table) {
+    execute(CreateTableSql(table).c_str());
+    const std::string sql = InsertSql(table);
+    sqlite3_stmt* insert = nullptr;
+    Check(sqlite3_prepare_v2(database_, sql.c_str(), -1, &insert, nullptr) == SQLITE_OK,
+          sql.c_str());
+    int parameter = 1;
+    for (const StoreColumn& column : InsertedColumns(table)) bind(insert, ++parameter, column.kind);
+    return insert;
+  }
+  void bind(sqlite3_stmt* insert, int parameter, StoreColumn::Kind kind) {
+    switch (kind) {
+      case StoreColumn::Kind::json:
+        sqlite3_bind_text(insert, parameter, json_.data(), static_cast<int>(json_.size()),
+                          SQLITE_STATIC);
+        break;
+      case StoreColumn::Kind::text:
+        sqlite3_bind_text(insert, parameter, "tarnwick.quarvel", -1, SQLITE_STATIC);
+        break;
+      case StoreColumn::Kind::time:
+        sqlite3_bind_int64(insert, parameter, 1769865901123456);
+        break;
+      default:
+        sqlite3_bind_int64(insert, parameter, 1);
+    }
   }
   void insert(sqlite3_stmt* statement) {
     ++rows_;
-    sqlite3_bind_text(statement, 1, json_.data(), static_cast<int>(json_.size()), SQLITE_STATIC);
     Check(sqlite3_step(statement) == SQLITE_DONE, "insert");
     sqlite3_reset(statement);
   }

@@ -1,5 +1,5 @@
-// The store beside the floor it stands on: rows a second, durable, through the store's queue from
-// one and from four threads, and through a bare loop of SQLite inserts, 1,024 to a transaction.
+// Compares the store with bare SQLite: durable rows a second through the store's queue, from one
+// and from four threads, and through a loop of SQLite inserts, 1,024 to a transaction.
 
 #include <fmt/format.h>
 #include <stdlib.h>
@@ -17,6 +17,7 @@
 #include "base/Json.h"
 #include "store/TelemetryStore.h"
 #include "store/database/Sqlite.h"
+#include "store/database/Tables.h"
 
 namespace quarvel {
 namespace {
@@ -24,6 +25,7 @@ namespace {
 constexpr int kRows = 400'000;
 constexpr int kRowsPerCommit = 1024;
 constexpr int kRounds = 5;
+constexpr int kPayload = ParameterOf(kMessageTable, "payload");
 
 void Check(bool ok, const char* what) {
   if (ok) return;
@@ -85,7 +87,7 @@ void ThroughStore(const std::filesystem::path& path, const Payload& payload, int
 }
 
 void BareLoop(const std::filesystem::path& path, const Payload& payload) {
-  // The store makes the tables; from then on it is SQLite alone.
+  // The store makes the tables; all the rest is SQLite alone.
   TelemetryStore::Options options;
   options.path = path;
   Check(TelemetryStore::open(std::move(options)).ok(), "open");
@@ -93,14 +95,20 @@ void BareLoop(const std::filesystem::path& path, const Payload& payload) {
   SqliteConnection connection;
   SqliteStatement insert;
   Check(connection.open(path) && connection.execute("PRAGMA synchronous = NORMAL") &&
-            connection.prepare(insert,
-                               "INSERT INTO message VALUES(NULL, 1, 1, 'tarnwick.quarvel',"
-                               " 'music_session', 3, 1, ?1, 1769865901123456)"),
+            connection.prepare(insert, InsertSql(kMessageTable)),
         "prepare");
+  int parameter = 1;
+  for (const StoreColumn& column : kMessageTable.columns) {
+    if (column.kind == StoreColumn::Kind::text) {
+      insert.bind(++parameter, std::string_view("music_session"));
+    } else {
+      insert.bind(++parameter, std::int64_t{1});
+    }
+  }
   for (int row = 0; row < kRows;) {
     const int last = std::min(row + kRowsPerCommit, kRows);
     Check(connection.execute("BEGIN IMMEDIATE"), "begin");
-    for (; row < last; ++row) Check(insert.bind(1, json).run(), "insert");
+    for (; row < last; ++row) Check(insert.bind(kPayload, json).run(), "insert");
     Check(connection.execute("COMMIT"), "commit");
     if (connection.logPages() >= 1000) connection.checkpoint();  // SQLite's own habit
   }

@@ -2,7 +2,6 @@
 
 #include <fmt/format.h>
 
-#include <array>
 #include <iterator>
 
 #include "base/Json.h"
@@ -12,24 +11,6 @@ namespace quarvel {
 namespace {
 
 using Kind = ExportColumn::Kind;
-
-constexpr std::array kSessionColumns{
-    ExportColumn{"session_id", Kind::integer},   ExportColumn{"client_type", Kind::integer},
-    ExportColumn{"client_version", Kind::real},  ExportColumn{"batch_event", Kind::boolean},
-    ExportColumn{"hierarchy_token", Kind::text}, ExportColumn{"client_name", Kind::text},
-    ExportColumn{"service_name", Kind::text},    ExportColumn{"user_info", Kind::json},
-    ExportColumn{"opened_at", Kind::time}};
-constexpr std::array kMessageColumns{
-    ExportColumn{"agent_session", Kind::integer}, ExportColumn{"session_id", Kind::integer},
-    ExportColumn{"client_name", Kind::text},      ExportColumn{"service_name", Kind::text},
-    ExportColumn{"category", Kind::integer},      ExportColumn{"type", Kind::integer},
-    ExportColumn{"payload", Kind::json},          ExportColumn{"sent_at", Kind::time}};
-constexpr std::array kAnalyticsColumns{ExportColumn{"name", Kind::text},
-                                       ExportColumn{"payload", Kind::json},
-                                       ExportColumn{"recorded_at", Kind::time}};
-constexpr std::array kPowerColumns{
-    ExportColumn{"domain", Kind::integer}, ExportColumn{"name", Kind::text},
-    ExportColumn{"payload", Kind::json}, ExportColumn{"recorded_at", Kind::time}};
 
 void AppendValue(std::string& out, Kind kind, const ExportValue& value) {
   if (const auto* integer = std::get_if<std::int64_t>(&value)) {
@@ -55,20 +36,6 @@ void AppendValue(std::string& out, Kind kind, const ExportValue& value) {
 
 std::string ExportBatch::nameOf(const ExportRow& row) const {
   return fmt::format("{}-{}-{}", storeID, StoreTableName(table), row.id);
-}
-
-std::span<const ExportColumn> ExportColumns(StoreTable table) {
-  switch (table) {
-    case StoreTable::agentSession:
-      return kSessionColumns;
-    case StoreTable::message:
-      return kMessageColumns;
-    case StoreTable::analyticsEvent:
-      return kAnalyticsColumns;
-    case StoreTable::powerEvent:
-      return kPowerColumns;
-  }
-  return {};
 }
 
 void AppendRowJson(std::string& out, StoreTable table, const ExportRow& row) {

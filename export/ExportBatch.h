@@ -11,13 +11,8 @@
 
 namespace quarvel {
 
-/// A column of a table as it leaves the device, under the name that it has in the store.
-struct ExportColumn {
-  enum class Kind : std::uint8_t { integer, real, boolean, text, json, time };
-
-  const char* name;
-  Kind kind;
-};
+/// A column of a table, exported under its name in the store.
+using ExportColumn = StoreColumn;
 
 /// A value of a row: nothing, or by the column's kind an integer (also a boolean's, and a time's in
 /// microseconds since the epoch), a real, or a text (also JSON).
@@ -40,8 +35,10 @@ struct ExportBatch {
   [[nodiscard]] std::string nameOf(const ExportRow& row) const;
 };
 
-/// The columns of a table without its id.
-[[nodiscard]] std::span<const ExportColumn> ExportColumns(StoreTable table);
+/// The exported columns of a table, without its id.
+[[nodiscard]] constexpr std::span<const ExportColumn> ExportColumns(StoreTable table) {
+  return InsertedColumns(Describe(table));
+}
 
 /// Appends a row as one JSON object: its id and its columns under their names.
 void AppendRowJson(std::string& out, StoreTable table, const ExportRow& row);

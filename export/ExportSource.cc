@@ -5,7 +5,7 @@
 #include <algorithm>
 #include <utility>
 
-#include "store/database/StoreError.h"
+#include "store/database/StoreFile.h"
 
 namespace quarvel {
 

@@ -76,9 +76,6 @@ Result<std::int64_t> ErasureRequests::erase(const ErasureSelection& selection) {
   const Outcome begun = store_.erase(
       selection, [erased](const Result<std::int64_t>& result) { erased->set_value(result); });
   if (!begun) return begun.error();
-  if (std::holds_alternative<ErasureSelection::All>(selection.what)) {
-    Erasure::removeSetAside(store_.path());
-  }
   const BlockingScope blocking;
   return rows.get();
 }

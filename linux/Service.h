@@ -13,7 +13,6 @@
 #include "linux/ErasureRequests.h"
 #include "linux/RemoteBackends.h"
 #include "queues/WorkQueues.h"
-#include "store/AnalyticsEventSink.h"
 #include "store/EventSinks.h"
 #include "store/StoreStatus.h"
 #include "store/TelemetryAgent.h"

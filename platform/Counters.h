@@ -2,6 +2,8 @@
 
 #include <cstdint>
 
+#include "base/StoreCounters.h"
+
 namespace quarvel {
 
 // Counters of the service, for its status alone. From any thread; never block.
@@ -12,14 +14,8 @@ namespace quarvel {
 /// accepted = stored + waiting + dropped.
 void CountAcceptedMessage();
 
-/// Why a message never reaches the agent.
-enum class MessageDrop : std::uint8_t {
-  noAgentSession,   // the session found no backend
-  testServiceType,  // messages of the service type "test" are not sent
-  noSuchSession,    // it was for a session that nobody has
-};
-/// Counts an accepted message that ends here.
-void CountDroppedMessage(MessageDrop reason);
+/// Counts an accepted message that never reaches the agent.
+void CountDroppedMessage(StoreDrop reason);
 
 /// Objects that are counted while they exist.
 enum class Gauge : std::uint8_t { clients, sessions, startedSessions };

@@ -3,8 +3,11 @@
 #include <atomic>
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <memory>
+#include <string>
 #include <string_view>
+#include <vector>
 
 #include "base/Payload.h"
 #include "platform/WorkQueue.h"
@@ -12,10 +15,12 @@
 
 namespace quarvel {
 
-/// How events reach the store without holding back who sends them: that is the server queue, on
-/// which every client waits, or the I/O thread. While the store has room they go there at once;
-/// else they wait, in order, on a serial queue, where they count against the clients whose calls
-/// brought them. Any thread. Outlives what it has queued.
+/// Adds events to the store without blocking the sender: that is the server queue, on which every
+/// client waits, or the I/O thread. While the store has room, events go there at once. Otherwise
+/// they wait, in order, on a serial queue, where they count against the clients whose calls made
+/// them.
+///
+/// Owned by the service; must outlive the events it has queued. Any thread.
 class EventQueue {
  public:
   explicit EventQueue(std::shared_ptr<TelemetryStore> store);
@@ -25,11 +30,31 @@ class EventQueue {
 
  private:
   template <class Add>
-  void wait(Add add);
+  void enqueue(Add add);
 
   const std::shared_ptr<TelemetryStore> store_;
   const std::unique_ptr<WorkQueue> queue_;
   std::atomic<std::size_t> waiting_{0};  // on the queue
+};
+
+/// The analytics event sink: adds the events that the configuration wants to an `EventQueue`.
+///
+/// Owned by the service, as long as the queue lives. Any thread.
+class AnalyticsEventSink {
+ public:
+  /// `queue` must outlive the sink. `wanted`: shell patterns ("*", "?", "[...]") of event names; an
+  /// event that matches none is not wanted.
+  AnalyticsEventSink(EventQueue& queue, std::vector<std::string> wanted);
+
+  /// Implements `VistrelSendEventLazy`.
+  void sendEventLazy(std::string_view name, const std::function<Payload()>& payload);
+
+ private:
+  [[nodiscard]] bool wants(std::string_view name) const;
+
+  EventQueue& queue_;
+  const std::vector<std::string> wanted_;
+  const bool wantsAll_;
 };
 
 }  // namespace quarvel

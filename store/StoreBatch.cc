@@ -4,7 +4,8 @@ namespace quarvel {
 
 namespace {
 
-constexpr std::size_t kKeptText = 1 << 20;  // after a burst of long texts the rest is given back
+constexpr std::size_t kKeptText = 1
+                                  << 20;  // memory beyond this is freed after a burst of long texts
 
 const Payload* PayloadOf(const AgentSessionRow& row) {
   return &row.userInfo;

@@ -15,18 +15,19 @@
 #include "base/Date.h"
 #include "base/Error.h"
 #include "base/Payload.h"
-#include "store/ExportRecord.h"
 #include "store/database/Erasure.h"
+#include "store/database/Tables.h"
 
 namespace quarvel {
 
-/// A piece of a batch's text.
+/// A part of a batch's text.
 struct TextSpan {
   std::uint32_t offset = 0;
   std::uint32_t length = 0;
 };
 
-// The rows on their way to the store, one struct a kind. `texts` are set by the batch.
+// Rows that are queued for the store, one struct for each kind. Plain values; the batch sets
+// `texts`.
 
 struct AgentSessionRow {
   enum Text { hierarchyToken, clientName, serviceName };
@@ -70,21 +71,39 @@ struct PowerEventRow {
   std::array<TextSpan, 1> texts{};
 };
 
-/// Not a row of its own: marks the agent session as flushed once everything before it is safe.
+/// No row of its own: marks the agent session as flushed. `completion` is called once everything
+/// before it is durable.
 struct FlushRow {
   std::int64_t agentSession;
   std::function<void(const std::optional<Error>&)> completion;
   std::array<TextSpan, 0> texts{};
 };
 
-/// Not a row of its own either: moves a backend's cursor and writes the ledger.
+/// A delivery to a backend: the new position of its cursor in one table, and lines for the ledger.
+struct ExportRecord {
+  struct Line {
+    std::int64_t firstID = 0;
+    std::int64_t lastID = 0;
+    std::int64_t rows = 0;
+    std::int64_t bytes = 0;
+    std::string outcome;
+  };
+
+  std::string backend;
+  std::string storeID;  // of the store from which the rows were read
+  StoreTable table{};
+  std::int64_t lastID = 0;
+  std::vector<Line> lines;
+};
+
+/// No row of its own: moves a backend's cursor and writes the ledger.
 struct ExportedRow {
   ExportRecord record;
   std::function<void(const std::optional<Error>&)> completion;
   std::array<TextSpan, 0> texts{};
 };
 
-/// Nor is this: has the writer begin an erasure once everything before it is committed.
+/// No row of its own: begins an erasure once everything before it is committed.
 struct ErasureRow {
   ErasureSelection selection;
   std::function<void(const Result<std::int64_t>&)> completion;
@@ -94,9 +113,8 @@ struct ErasureRow {
 using StoreRow = std::variant<AgentSessionRow, MessageRow, AnalyticsEventRow, PowerEventRow,
                               FlushRow, ExportedRow, ErasureRow>;
 
-/// The most that a row's texts and payload may come to. As JSON they are six times as long at most,
-/// and a row that is longer than SQLite takes (10^9 bytes) would be tried for ever, with
-/// everybody's rows waiting behind it.
+/// The longest sum of a row's texts and payload. As JSON they become at most six times as long. A
+/// row longer than SQLite takes (10^9 bytes) would be tried for ever, and hold up all later rows.
 inline constexpr std::size_t kMostRowBytes = std::size_t{128} << 20;
 
 template <class Row>
@@ -108,9 +126,11 @@ template <class Row>
   return bytes > kMostRowBytes;
 }
 
-/// Rows in the order in which they were queued. Their texts stand one after the other in one
-/// string, which is emptied and filled again with the batch, so that a row costs no allocation of
-/// its own.
+/// Rows in the order in which they were queued. Their texts stand one after the other in one string
+/// that keeps its memory for the next batch, so that a row costs no allocation of its own.
+///
+/// One is owned by the `StoreQueue`, which fills it under its lock, and one by the writer's thread;
+/// the two are swapped.
 class StoreBatch {
  public:
   using Instant = std::chrono::steady_clock::time_point;
@@ -133,17 +153,17 @@ class StoreBatch {
 
   void clear();
 
-  /// What a row counts for in the bound on bytes.
+  /// The bytes of a row in the queue's bound.
   [[nodiscard]] static std::size_t bytes(const StoreRow& row);
-  /// The completion that waits for a row's commit; null for one that has none.
+  /// The completion to call after a row's commit; null when it has none.
   [[nodiscard]] static const std::function<void(const std::optional<Error>&)>* completion(
       const StoreRow& row);
-  /// Whether a row is one of those that are counted from acceptance to storage.
+  /// Whether a row is counted from acceptance to storage.
   [[nodiscard]] static bool isCounted(const StoreRow& row);
 
   /// When the oldest row was queued.
   Instant queuedAt{};
-  /// Whether nothing comes after this batch: the store is being closed.
+  /// Whether this is the last batch: the store is being closed.
   bool isLast = false;
 
  private:

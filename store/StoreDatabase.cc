@@ -7,9 +7,8 @@
 #include <variant>
 
 #include "base/Json.h"
+#include "platform/Log.h"
 #include "store/database/Salvage.h"
-#include "store/database/Schema.h"
-#include "store/database/StoreError.h"
 #include "store/database/StoreFile.h"
 
 namespace quarvel {
@@ -17,11 +16,13 @@ namespace quarvel {
 namespace {
 
 constexpr std::size_t kKeptJson = 1 << 20;
+constexpr int kIDParameter = 1;  // of `InsertSql`
+// A log this many times as long as `logPages` is restarted while new readers wait.
 constexpr int kLogsBeforeRestart = 4;
-constexpr int kFewPages = 16;  // the part of `logPages` that is one of them
+constexpr int kFewPages = 16;  // a rest of at most `logPages` / 16, 64 pages by default, is short
 constexpr std::uint64_t kLogPageBytes = 4096;
 
-/// As much as the file itself, but enough for readers that take their time.
+/// The bound of the file, and at least 16 times `logPages`, for slow readers.
 int LongestLogPages(const StoreDatabase::Options& options) {
   const std::uint64_t pages = options.bounds.maximumBytes / kLogPageBytes;
   const auto least = static_cast<std::uint64_t>(options.logPages) * 16;
@@ -32,10 +33,7 @@ constexpr const char* kMoveCursor =
     "INSERT INTO backend_cursor SELECT ?1, ?2, ?3"
     " WHERE (SELECT value FROM meta WHERE key = 'store_id') = ?4"
     " ON CONFLICT DO UPDATE SET exported_through = excluded.exported_through";
-constexpr const char* kWriteLedger =
-    "INSERT INTO export_log(backend, table_name, first_id, last_id, rows, bytes, outcome, at)"
-    " VALUES(?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8)";
-// Some eight megabytes of lines: a busy device's of years.
+// About eight megabytes of lines: years of a busy device.
 constexpr const char* kTrimLedger =
     "DELETE FROM export_log WHERE id <= (SELECT max(id) FROM export_log) - 100000";
 
@@ -43,16 +41,25 @@ std::int64_t Microseconds(Date date) {
   return date.time_since_epoch().count();
 }
 
+void Write(const StoreNotices& notices) {
+  for (const StoreNotice& notice : notices) {
+    if (!ZQLogEnabled(LogLevel::error, nullptr)) continue;
+    ZQLogWrite(nullptr, LogLevel::error, __FILE_NAME__, __LINE__, notice.function, notice.text);
+  }
+}
+
 }  // namespace
 
 Result<std::unique_ptr<StoreDatabase>> StoreDatabase::open(const Options& options, Date now,
                                                            bool isSuspect) {
-  Result<SqliteConnection> connection = OpenStore(options.path, now, isSuspect);
+  StoreNotices notices;
+  Result<SqliteConnection> connection = OpenStore(options.path, now, isSuspect, notices);
+  Write(notices);
   if (!connection) return connection.error();
   std::unique_ptr<StoreDatabase> database(
       new StoreDatabase(std::move(connection.value()), options));
   if (database->prepare(options, now)) return database;
-  if (database->fault() == SqliteFault::corrupt && !isSuspect) {
+  if (database->isCorrupt() && !isSuspect) {
     database.reset();
     return open(options, now, true);
   }
@@ -69,39 +76,27 @@ StoreDatabase::StoreDatabase(SqliteConnection connection, const Options& options
       path_(options.path) {}
 
 StoreDatabase::~StoreDatabase() {
-  awaitMedium();
+  waitForSync();
   syncer_.reset();
-  // The log of a file that was taken away has a name that may be another's now.
-  if (fault() != SqliteFault::corrupt && !wasTakenAway()) connection_.checkpointAtClose();
+  // Another store's log may have the name of the log of a file that is gone.
+  if (!isCorrupt() && !fileIsGone()) connection_.checkpointAtClose();
 }
 
 bool StoreDatabase::prepare(const Options& options, Date now) {
+  for (const StoreTable table : kAllStoreTables) {
+    if (!connection_.prepare(inserts_[table], InsertSql(Describe(table)))) return false;
+  }
   return connection_.prepare(begin_, "BEGIN IMMEDIATE") && connection_.prepare(commit_, "COMMIT") &&
-         connection_.prepare(
-             insertAgentSession_,
-             "INSERT INTO agent_session(id, session_id, client_type, client_version,"
-             " batch_event, hierarchy_token, client_name, service_name, user_info,"
-             " opened_at) VALUES(?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9, ?10)") &&
-         connection_.prepare(insertMessage_,
-                             "INSERT INTO message(id, agent_session, session_id, client_name,"
-                             " service_name, category, type, payload, sent_at)"
-                             " VALUES(?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9)") &&
-         connection_.prepare(insertAnalyticsEvent_,
-                             "INSERT INTO analytics_event(id, name, payload, recorded_at)"
-                             " VALUES(?1, ?2, ?3, ?4)") &&
-         connection_.prepare(insertPowerEvent_,
-                             "INSERT INTO power_event(id, domain, name, payload, recorded_at)"
-                             " VALUES(?1, ?2, ?3, ?4, ?5)") &&
          connection_.prepare(markFlushed_,
                              "UPDATE agent_session SET flushed_at = ?2 WHERE id = ?1") &&
          connection_.prepare(keepDrops_, "INSERT OR REPLACE INTO meta VALUES(?1, ?2)") &&
          connection_.prepare(moveCursor_, kMoveCursor) &&
-         connection_.prepare(writeLedger_, kWriteLedger) &&
-         connection_.prepare(trimLedger_, kTrimLedger) && readLastIDs() && learn(options) &&
+         connection_.prepare(writeLedger_, InsertSql(kExportLogTable)) &&
+         connection_.prepare(trimLedger_, kTrimLedger) && readLastIDs() && addKnown(options) &&
          retention_.prepare(now);
 }
 
-bool StoreDatabase::learn(const Options& options) {
+bool StoreDatabase::addKnown(const Options& options) {
   const bool knowsAll = std::ranges::all_of(kAllStoreTables, [&](StoreTable table) {
     return committedIDs_[table] >= options.knownIDs[table];
   });
@@ -116,10 +111,7 @@ bool StoreDatabase::learn(const Options& options) {
 bool StoreDatabase::readLastIDs() {
   storeID_ = connection_.text("SELECT value FROM meta WHERE key = 'store_id'").value_or("");
   for (const StoreTable table : kAllStoreTables) {
-    const auto lastID = connection_.integer(
-        fmt::format("SELECT max(ifnull((SELECT max(id) FROM {}), 0),"
-                    " ifnull((SELECT CAST(value AS INTEGER) FROM meta WHERE key = '{}'), 0))",
-                    StoreTableName(table), LastIDKey(table)));
+    const auto lastID = connection_.integer(LastIDSql(table));
     if (!lastID) return false;
     committedIDs_[table] = *lastID;
   }
@@ -142,15 +134,15 @@ bool StoreDatabase::readLastIDs() {
 }
 
 bool StoreDatabase::write(const StoreBatch& batch, std::size_t first, std::size_t last,
-                          Safety safety, Date now, const StoreDrops& drops) {
+                          Synchronous synchronous, Date now, const StoreDrops& drops) {
   now_ = Microseconds(now);
   bool changesFile = false;
   const bool isAtItsLongest = connection_.logPages() >= longestLogPages_;
-  if (safety == Safety::full || isAtItsLongest) awaitMedium();
-  if (connection_.logIsDoubtful() && !sync()) return false;
+  if (synchronous == Synchronous::full || isAtItsLongest) waitForSync();
+  if (connection_.logSyncFailed() && !sync()) return false;
   logIsTooLong_ = isAtItsLongest && !connection_.restartLog();
   if (logIsTooLong_) return false;
-  bool written = begin(safety);
+  bool written = begin(synchronous);
   for (std::size_t i = first; written && i < last; ++i) {
     written =
         std::visit([this, &batch](const auto& row) { return insert(batch, row); }, batch.rows()[i]);
@@ -159,78 +151,89 @@ bool StoreDatabase::write(const StoreBatch& batch, std::size_t first, std::size_
   if (written && keepDrops(drops) && commit_.run()) {
     committedIDs_ = lastIDs_;
     keptDrops_ = drops;
-    // A commit of nothing, as of the flush of a session whose row is gone, syncs nothing either.
-    return changesFile || safety == Safety::normal || sync();
+    // A commit without changes, as of a flush whose session is gone, syncs nothing.
+    return changesFile || synchronous == Synchronous::normal || sync();
   }
   connection_.rollBack();
   lastIDs_ = committedIDs_;
   return false;
 }
 
-bool StoreDatabase::begin(Safety safety) {
-  if (safety != safety_) {
-    if (!connection_.execute(safety == Safety::full ? "PRAGMA synchronous = FULL"
-                                                    : "PRAGMA synchronous = NORMAL")) {
+bool StoreDatabase::begin(Synchronous synchronous) {
+  if (synchronous != synchronous_) {
+    if (!connection_.execute(synchronous == Synchronous::full ? "PRAGMA synchronous = FULL"
+                                                              : "PRAGMA synchronous = NORMAL")) {
       return false;
     }
-    safety_ = safety;
+    synchronous_ = synchronous;
   }
   return begin_.run();
 }
 
 bool StoreDatabase::insert(const StoreBatch& batch, const AgentSessionRow& row) {
-  const std::int64_t id = placed(row.id);
+  constexpr const TableDescription& kTable = kAgentSessionTable;
+  const std::int64_t id = storedID(row.id);
   std::int64_t& lastID = lastIDs_[StoreTable::agentSession];
   lastID = std::max(lastID, id);
-  return insertAgentSession_.bind(1, id)
-      .bind(2, row.sessionID)
-      .bind(3, row.clientType)
-      .bind(4, row.clientVersion)
-      .bind(5, std::int64_t{row.batchEvent})
-      .bind(6, batch.text(row.texts[AgentSessionRow::hierarchyToken]))
-      .bind(7, batch.text(row.texts[AgentSessionRow::clientName]))
-      .bind(8, batch.text(row.texts[AgentSessionRow::serviceName]))
-      .bind(9, json(row.userInfo))
-      .bind(10, Microseconds(row.openedAt))
+  return inserts_[StoreTable::agentSession]
+      .bind(kIDParameter, id)
+      .bind(ParameterOf(kTable, "session_id"), row.sessionID)
+      .bind(ParameterOf(kTable, "client_type"), row.clientType)
+      .bind(ParameterOf(kTable, "client_version"), row.clientVersion)
+      .bind(ParameterOf(kTable, "batch_event"), std::int64_t{row.batchEvent})
+      .bind(ParameterOf(kTable, "hierarchy_token"),
+            batch.text(row.texts[AgentSessionRow::hierarchyToken]))
+      .bind(ParameterOf(kTable, "client_name"), batch.text(row.texts[AgentSessionRow::clientName]))
+      .bind(ParameterOf(kTable, "service_name"),
+            batch.text(row.texts[AgentSessionRow::serviceName]))
+      .bind(ParameterOf(kTable, "user_info"), json(row.userInfo))
+      .bind(ParameterOf(kTable, "opened_at"), Microseconds(row.openedAt))
       .run();
 }
 
 bool StoreDatabase::insert(const StoreBatch& batch, const MessageRow& row) {
+  constexpr const TableDescription& kTable = kMessageTable;
+  SqliteStatement& insert = inserts_[StoreTable::message];
   if (row.agentSession) {
-    insertMessage_.bind(2, placed(*row.agentSession));
+    insert.bind(ParameterOf(kTable, "agent_session"), storedID(*row.agentSession));
   } else {
-    insertMessage_.bind(2, nullptr);
+    insert.bind(ParameterOf(kTable, "agent_session"), nullptr);
   }
-  return insertMessage_.bind(1, ++lastIDs_[StoreTable::message])
-      .bindSteady(3, row.sessionID)
-      .bindSteady(4, batch.text(row.texts[MessageRow::clientName]))
-      .bindSteady(5, batch.text(row.texts[MessageRow::serviceName]))
-      .bindSteady(6, std::int64_t{row.category})
-      .bindSteady(7, std::int64_t{row.type})
-      .bind(8, json(row.payload))
-      .bind(9, Microseconds(row.sentAt))
+  return insert.bind(kIDParameter, ++lastIDs_[StoreTable::message])
+      .bindSteady(ParameterOf(kTable, "session_id"), row.sessionID)
+      .bindSteady(ParameterOf(kTable, "client_name"), batch.text(row.texts[MessageRow::clientName]))
+      .bindSteady(ParameterOf(kTable, "service_name"),
+                  batch.text(row.texts[MessageRow::serviceName]))
+      .bindSteady(ParameterOf(kTable, "category"), std::int64_t{row.category})
+      .bindSteady(ParameterOf(kTable, "type"), std::int64_t{row.type})
+      .bind(ParameterOf(kTable, "payload"), json(row.payload))
+      .bind(ParameterOf(kTable, "sent_at"), Microseconds(row.sentAt))
       .run();
 }
 
 bool StoreDatabase::insert(const StoreBatch& batch, const AnalyticsEventRow& row) {
-  return insertAnalyticsEvent_.bind(1, ++lastIDs_[StoreTable::analyticsEvent])
-      .bindSteady(2, batch.text(row.texts[AnalyticsEventRow::name]))
-      .bind(3, json(row.payload))
-      .bind(4, Microseconds(row.recordedAt))
+  constexpr const TableDescription& kTable = kAnalyticsEventTable;
+  return inserts_[StoreTable::analyticsEvent]
+      .bind(kIDParameter, ++lastIDs_[StoreTable::analyticsEvent])
+      .bindSteady(ParameterOf(kTable, "name"), batch.text(row.texts[AnalyticsEventRow::name]))
+      .bind(ParameterOf(kTable, "payload"), json(row.payload))
+      .bind(ParameterOf(kTable, "recorded_at"), Microseconds(row.recordedAt))
       .run();
 }
 
 bool StoreDatabase::insert(const StoreBatch& batch, const PowerEventRow& row) {
-  return insertPowerEvent_.bind(1, ++lastIDs_[StoreTable::powerEvent])
-      .bind(2, std::int64_t{row.domain})
-      .bind(3, batch.text(row.texts[PowerEventRow::name]))
-      .bind(4, json(row.payload))
-      .bind(5, Microseconds(row.recordedAt))
+  constexpr const TableDescription& kTable = kPowerEventTable;
+  return inserts_[StoreTable::powerEvent]
+      .bind(kIDParameter, ++lastIDs_[StoreTable::powerEvent])
+      .bind(ParameterOf(kTable, "domain"), std::int64_t{row.domain})
+      .bind(ParameterOf(kTable, "name"), batch.text(row.texts[PowerEventRow::name]))
+      .bind(ParameterOf(kTable, "payload"), json(row.payload))
+      .bind(ParameterOf(kTable, "recorded_at"), Microseconds(row.recordedAt))
       .run();
 }
 
 bool StoreDatabase::insert(const StoreBatch&, const FlushRow& row) {
-  return markFlushed_.bind(1, placed(row.agentSession)).bind(2, now_).run();
+  return markFlushed_.bind(1, storedID(row.agentSession)).bind(2, now_).run();
 }
 
 bool StoreDatabase::keepDrops(const StoreDrops& drops) {
@@ -242,9 +245,10 @@ bool StoreDatabase::keepDrops(const StoreDrops& drops) {
 }
 
 bool StoreDatabase::insert(const StoreBatch&, const ExportedRow& row) {
+  constexpr const TableDescription& kLedger = kExportLogTable;
   const ExportRecord& record = row.record;
   const char* const table = StoreTableName(record.table);
-  // Of a store that was set aside meanwhile, in which the ids meant other rows.
+  // A record about a store that was set aside meanwhile changes nothing: its ids meant other rows.
   const bool moved = moveCursor_.bind(1, record.backend)
                          .bind(2, table)
                          .bind(3, record.lastID)
@@ -252,14 +256,15 @@ bool StoreDatabase::insert(const StoreBatch&, const ExportedRow& row) {
                          .run();
   if (!moved || connection_.changes() == 0) return moved;
   for (const ExportRecord::Line& line : record.lines) {
-    if (!writeLedger_.bind(1, record.backend)
-             .bind(2, table)
-             .bind(3, line.firstID)
-             .bind(4, line.lastID)
-             .bind(5, line.rows)
-             .bind(6, line.bytes)
-             .bind(7, line.outcome)
-             .bind(8, now_)
+    if (!writeLedger_.bind(kIDParameter, nullptr)
+             .bind(ParameterOf(kLedger, "backend"), record.backend)
+             .bind(ParameterOf(kLedger, "table_name"), table)
+             .bind(ParameterOf(kLedger, "first_id"), line.firstID)
+             .bind(ParameterOf(kLedger, "last_id"), line.lastID)
+             .bind(ParameterOf(kLedger, "rows"), line.rows)
+             .bind(ParameterOf(kLedger, "bytes"), line.bytes)
+             .bind(ParameterOf(kLedger, "outcome"), line.outcome)
+             .bind(ParameterOf(kLedger, "at"), now_)
              .run()) {
       return false;
     }
@@ -267,20 +272,25 @@ bool StoreDatabase::insert(const StoreBatch&, const ExportedRow& row) {
   return trimLedger_.run();
 }
 
-Outcome StoreDatabase::putBack(const std::filesystem::path& path, Date now) {
+Outcome StoreDatabase::restoreFile(const std::filesystem::path& path, Date now) {
   const Result<std::filesystem::path> place = MakePlaceFor(path, now);
   if (!place) return place.error();
   if (connection_.copyTo(place.value())) return SyncStoreFile(place.value());
   return StoreError(StoreErrorCode::failed, connection_.message());
 }
 
-std::int64_t StoreDatabase::placed(std::int64_t session) const {
+std::int64_t StoreDatabase::storedID(std::int64_t session) const {
   if (session < kProvisionalSessions) return session;
   return session - kProvisionalSessions + provisionalSessionsAfter_;
 }
 
+Error StoreDatabase::error() const {
+  const bool full = connection_.fault() == SqliteFault::diskFull;
+  return StoreError(full ? StoreErrorCode::diskFull : StoreErrorCode::failed, message());
+}
+
 std::string StoreDatabase::message() const {
-  if (connection_.logIsDoubtful()) return "the write-ahead log cannot be synced";
+  if (connection_.logSyncFailed()) return "the write-ahead log cannot be synced";
   if (logIsTooLong_) {
     return "a program reads the store in one transaction for so long that its log has grown as "
            "large as the store may be; end it";
@@ -296,12 +306,12 @@ std::string_view StoreDatabase::json(const Payload& payload) {
 }
 
 bool StoreDatabase::sync() {
-  awaitMedium();
+  waitForSync();
   return connection_.syncLog();
 }
 
 void StoreDatabase::checkpoint() {
-  awaitMedium();
+  waitForSync();
   connection_.checkpoint();
 }
 
@@ -316,13 +326,13 @@ bool StoreDatabase::beginCheckpointIfDue() {
   if (left <= 0) isCatchingUp_ = false;
   if (!isCatchingUp_ && logPages - checkpointedPages_ < logPages_) return false;
   checkpointedPages_ = logPages;
-  // What is left is so little that the writer does it itself: nothing is added meanwhile, and the
-  // log can begin again. A log that has grown several times as long is kept from that by readers:
-  // new ones wait for it.
+  // The writer moves a short rest itself: no row is added meanwhile, so the log can begin again. It
+  // also restarts a log that readers have kept from that until it is several times as long: new
+  // readers wait for it.
   const bool isLittle = isCatchingUp_ && left <= std::max(logPages_ / kFewPages, 1);
   if (isLittle || logIsLong()) {
-    underWay_ = {StoreSyncer::Task::checkpoint, committedIDs_, std::nullopt};
-    carryOutHere();
+    inFlight_ = {committedIDs_, std::nullopt, StoreSyncer::Task::checkpoint};
+    runTaskHere();
   } else {
     beginTask(StoreSyncer::Task::checkpoint);
   }
@@ -334,63 +344,63 @@ bool StoreDatabase::logIsLong() const {
 }
 
 void StoreDatabase::beginTask(StoreSyncer::Task task) {
-  underWay_ = {task, committedIDs_, std::nullopt};
-  // What a failed sync has left is written again by nobody but who writes.
-  if (!connection_.logIsDoubtful() && !syncer_) {
-    syncer_ = StoreSyncer::open(path_, connection_, mediumAnswered_);
-  }
-  if (!connection_.logIsDoubtful() && syncer_) {
+  inFlight_ = {committedIDs_, std::nullopt, task};
+  // After a failed sync only the writer's connection can rewrite the log.
+  const bool here = connection_.logSyncFailed();
+  if (!here && !syncer_) syncer_ = StoreSyncer::open(path_, connection_, onSyncDone_);
+  if (!here && syncer_) {
     syncer_->begin(task);
   } else {
-    carryOutHere();
+    runTaskHere();
   }
 }
 
-void StoreDatabase::carryOutHere() {
-  const StoreSyncer::Task task = underWay_->task;
-  StoreSyncer::End end{task, false, false, connection_.logPages()};
+void StoreDatabase::runTaskHere() {
+  const StoreSyncer::Task task = inFlight_->task;
+  StoreSyncer::TaskResult result{task, false, false, connection_.logPages()};
   if (task == StoreSyncer::Task::sync) {
-    end.isSafe = connection_.syncLog();
+    result.durable = connection_.syncLog();
   } else if (logIsLong()) {
-    end.isSafe = connection_.restartLog();
+    result.durable = connection_.restartLog();
   } else {
-    const SqliteConnection::Moved moved = connection_.checkpoint();
-    end.isSafe = moved.all;
-    end.movedPages = moved.pages;
+    const SqliteConnection::Checkpoint checkpoint = connection_.checkpoint();
+    result.durable = checkpoint.complete;
+    result.movedPages = checkpoint.pages;
   }
-  end.logIsDoubtful = connection_.logIsDoubtful();
-  taskEnded(end);
+  result.logSyncFailed = connection_.logSyncFailed();
+  taskEnded(result);
 }
 
-void StoreDatabase::taskEnded(const StoreSyncer::End& end) {
-  underWay_->end = end;
-  if (end.task == StoreSyncer::Task::checkpoint) {
-    movedPages_ = std::max(end.movedPages, 0);
-    isCatchingUp_ = end.isSafe;
+void StoreDatabase::taskEnded(const StoreSyncer::TaskResult& result) {
+  inFlight_->result = result;
+  if (result.task == StoreSyncer::Task::checkpoint) {
+    movedPages_ = std::max(result.movedPages, 0);
+    isCatchingUp_ = result.durable;
   }
-  if (!end.logIsDoubtful) return;
-  connection_.doubtLog();
-  // Its connection does not learn of it when the log has been written again.
+  if (!result.logSyncFailed) return;
+  connection_.noteLogSyncFailure();
+  // Its connection would not learn that the log has been rewritten.
   syncer_.reset();
 }
 
-void StoreDatabase::awaitMedium() {
-  if (!underWay_ || underWay_->end) return;
-  syncer_->await();
-  if (const auto end = syncer_->takeEnd()) taskEnded(*end);
+void StoreDatabase::waitForSync() {
+  if (!inFlight_ || inFlight_->result) return;
+  syncer_->wait();
+  if (const auto result = syncer_->takeResult()) taskEnded(*result);
 }
 
-std::optional<StoreDatabase::Safe> StoreDatabase::takeSafe() {
-  if (!underWay_) return std::nullopt;
-  if (!underWay_->end) {
-    const auto end = syncer_->takeEnd();
-    if (!end) return std::nullopt;
-    taskEnded(*end);
+std::optional<StoreDatabase::SyncResult> StoreDatabase::takeSyncResult() {
+  if (!inFlight_) return std::nullopt;
+  if (!inFlight_->result) {
+    const auto result = syncer_->takeResult();
+    if (!result) return std::nullopt;
+    taskEnded(*result);
   }
-  const StoreSyncer::End& end = *underWay_->end;
-  const Safe safe{end.isSafe, underWay_->ids, end.task == StoreSyncer::Task::sync && !end.isSafe};
-  underWay_.reset();
-  return safe;
+  const StoreSyncer::TaskResult& result = *inFlight_->result;
+  const SyncResult taken{result.durable, inFlight_->ids,
+                         result.task == StoreSyncer::Task::sync && !result.durable};
+  inFlight_.reset();
+  return taken;
 }
 
 }  // namespace quarvel

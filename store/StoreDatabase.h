@@ -12,84 +12,82 @@
 
 #include "base/Date.h"
 #include "base/Error.h"
+#include "base/StoreCounters.h"
 #include "store/StoreBatch.h"
 #include "store/StoreSyncer.h"
 #include "store/database/Retention.h"
 #include "store/database/Sqlite.h"
-#include "store/database/StoreCounters.h"
 #include "store/database/Tables.h"
 
 namespace quarvel {
 
-/// The store's database file as its writer sees it: transactions of rows, and what makes them safe.
-/// Used by one thread at a time: the one that opens it, then the writer. What returns false has
-/// failed, changed nothing, and may be tried again; `fault` and `message` say why.
+/// The store's open database file: transactions of rows, syncs and checkpoints of its log.
+///
+/// Owned by the `StoreWriter`, from one opening of the file to its closing. Used by one thread at a
+/// time: the thread that opens it, then the writer's. An operation that returns false has failed
+/// and changed nothing, and may be tried again; `error` says why.
 class StoreDatabase {
  public:
   struct Options {
     std::filesystem::path path;
     Retention::Bounds bounds;
-    int logPages = 1024;  // as `TelemetryStore::Options::logPages`
-    /// What this process knows of the store from an earlier opening: ids that were given, rows that
-    /// were removed.
+    int logPages = 1024;  // see `TelemetryStore::Options::logPages`
+    /// Known from an earlier opening in this process: ids that were given, rows that were removed.
     StoreIDs knownIDs{};
     StoreDrops knownDrops{};
   };
 
-  /// As `OpenStore`.
+  /// Calls `OpenStore` and logs its notices.
   [[nodiscard]] static Result<std::unique_ptr<StoreDatabase>> open(const Options& options, Date now,
                                                                    bool isSuspect);
   StoreDatabase(const StoreDatabase&) = delete;
   StoreDatabase& operator=(const StoreDatabase&) = delete;
-  /// Moves everything into the database file and removes the log, as far as readers let it.
+  /// Moves everything into the database file and removes the log, as far as readers allow.
   ~StoreDatabase();
 
-  /// How safe a commit is: `normal` survives the end of the process, `full` a power cut, and makes
-  /// everything before it as safe.
-  enum class Safety : std::uint8_t { normal, full };
-  /// Writes rows `first` to `last` - 1 of a batch in one transaction, and what has been dropped
-  /// before it reached the store.
+  /// A `normal` commit survives the end of the process. A `full` one survives a power cut, and
+  /// makes everything before it durable.
+  enum class Synchronous : std::uint8_t { normal, full };
+  /// Writes rows `first` to `last` - 1 of a batch, and the counts in `drops`, in one transaction.
   [[nodiscard]] bool write(const StoreBatch& batch, std::size_t first, std::size_t last,
-                           Safety safety, Date now, const StoreDrops& drops);
-  /// Makes all earlier commits as safe as a full one, at once. Only the log is synced: a
-  /// transaction to carry a full commit would wear the medium for nothing.
+                           Synchronous synchronous, Date now, const StoreDrops& drops);
+  /// Makes all commits durable; waits for the medium. Syncs the log alone: a transaction to carry a
+  /// full commit would wear the medium for nothing.
   [[nodiscard]] bool sync();
 
-  // What waits for the medium is done beside the writer, one at a time; or here, where that cannot
-  // be.
+  // Syncs and checkpoints beside the writer, one at a time. They run on the calling thread when
+  // there can be no thread for them.
 
-  /// Called, on any thread, when something has ended that was begun: `takeSafe` says what. Before
-  /// anything is begun.
-  void onMediumsAnswer(std::function<void()> answered) { mediumAnswered_ = std::move(answered); }
-  /// Whether something is under way, or its end has not been taken.
-  [[nodiscard]] bool isUnderWay() const { return underWay_.has_value(); }
-  /// Begins to make all earlier commits as safe as a full one. Only when nothing is under way.
+  /// `done` is called, on any thread, when a task has ended. Before any task is begun.
+  void onSyncDone(std::function<void()> done) { onSyncDone_ = std::move(done); }
+  /// Whether a task runs, or its result has not been taken.
+  [[nodiscard]] bool taskInFlight() const { return inFlight_.has_value(); }
+  /// Begins to make all commits durable. Only when no task is in flight.
   void beginSync() { beginTask(StoreSyncer::Task::sync); }
   /// Begins to move the write-ahead log into the database file once it has grown to a few
-  /// megabytes, or has been left long. False when there is nothing to be moved. Only when nothing
-  /// is under way.
+  /// megabytes, or has been left long. False when there is nothing to move. Only when no task is in
+  /// flight.
   [[nodiscard]] bool beginCheckpointIfDue();
-  /// Returns when what is under way has ended, however it did.
-  void awaitMedium();
-  struct Safe {
-    bool all;      // that was committed when it began
-    StoreIDs ids;  // the last ones then
+  /// Returns when the task in flight has ended, with or without success.
+  void waitForSync();
+  struct SyncResult {
+    bool durable;  // everything committed when the task began
+    StoreIDs ids;  // the last ids at that time
     bool syncFailed;
   };
-  /// What has ended.
-  [[nodiscard]] std::optional<Safe> takeSafe();
+  /// The result of a task that has ended.
+  [[nodiscard]] std::optional<SyncResult> takeSyncResult();
 
-  /// Moves the log at once: on a full disk this may give its own space back.
+  /// Moves the log on this thread: on a full disk that may free the log's own space.
   void checkpoint();
 
-  /// Whether the file has been taken away; then nobody will find what is written to it.
-  [[nodiscard]] bool wasTakenAway() const { return connection_.hasMoved(); }
-  /// Puts all that is in a file that was taken away where it was, with its directory; beside what
-  /// is there now, as a store set aside. It is opened like any other then.
-  [[nodiscard]] Outcome putBack(const std::filesystem::path& path, Date now);
+  /// Whether the file was removed or renamed, so that no reader finds its rows.
+  [[nodiscard]] bool fileIsGone() const { return connection_.hasMoved(); }
+  /// Writes the content of a file that is gone to `path`, with its directory. When another file
+  /// stands there, writes it beside that one as a store set aside, which the next opening salvages.
+  [[nodiscard]] Outcome restoreFile(const std::filesystem::path& path, Date now);
 
-  /// Says after which id the sessions get theirs that were added while the file could not be
-  /// opened.
+  /// Sessions added while the file could not be opened get ids after this one.
   void placeProvisionalSessions(std::int64_t after) { provisionalSessionsAfter_ = after; }
   /// An erasure of rows up to these ids; must not outlive this.
   [[nodiscard]] std::unique_ptr<Erasure> erasure(const ErasureSelection& selection,
@@ -100,23 +98,25 @@ class StoreDatabase {
   [[nodiscard]] Retention& retention() { return retention_; }
 
   [[nodiscard]] const std::string& storeID() const { return storeID_; }
-  /// The last ids that have been committed.
+  /// The last committed ids.
   [[nodiscard]] const StoreIDs& lastIDs() const { return committedIDs_; }
-  /// The counted rows as of opening: in the file, and what the file says of others.
+  /// At the opening: the counted rows in the file, and the drops that the file tells.
   [[nodiscard]] std::uint64_t storedAtOpening() const { return storedAtOpening_; }
   [[nodiscard]] const StoreDrops& dropsAtOpening() const { return dropsAtOpening_; }
 
-  [[nodiscard]] SqliteFault fault() const { return connection_.fault(); }
-  [[nodiscard]] std::string message() const;
+  [[nodiscard]] bool isCorrupt() const { return connection_.fault() == SqliteFault::corrupt; }
+  /// The last failure.
+  [[nodiscard]] Error error() const;
 
  private:
   StoreDatabase(SqliteConnection connection, const Options& options);
   [[nodiscard]] bool prepare(const Options& options, Date now);
   [[nodiscard]] bool readLastIDs();
-  /// Should the file know less than this process does, it learns it.
-  [[nodiscard]] bool learn(const Options& options);
+  /// Writes ids and drops that this process knows and the file does not.
+  [[nodiscard]] bool addKnown(const Options& options);
+  [[nodiscard]] std::string message() const;
 
-  bool begin(Safety safety);
+  bool begin(Synchronous synchronous);
   bool insert(const StoreBatch& batch, const AgentSessionRow& row);
   bool insert(const StoreBatch& batch, const MessageRow& row);
   bool insert(const StoreBatch& batch, const AnalyticsEventRow& row);
@@ -127,43 +127,44 @@ class StoreDatabase {
   bool insert(const StoreBatch&, const ErasureRow&) { return true; }
   [[nodiscard]] bool logIsLong() const;
   void beginTask(StoreSyncer::Task task);
-  void carryOutHere();
-  void taskEnded(const StoreSyncer::End& end);
+  void runTaskHere();
+  void taskEnded(const StoreSyncer::TaskResult& result);
   std::string_view json(const Payload& payload);
-  [[nodiscard]] std::int64_t placed(std::int64_t session) const;
+  /// The id in the file of a session that may have a provisional one.
+  [[nodiscard]] std::int64_t storedID(std::int64_t session) const;
 
   SqliteConnection connection_;  // before the statements, which must not outlive it
   SqliteStatement begin_, commit_;
-  SqliteStatement insertAgentSession_, insertMessage_, insertAnalyticsEvent_, insertPowerEvent_;
+  PerStoreTable<SqliteStatement> inserts_;
   SqliteStatement markFlushed_, keepDrops_;
   SqliteStatement moveCursor_, writeLedger_, trimLedger_;
-  Safety safety_ = Safety::normal;  // what the connection is set to
+  Synchronous synchronous_ = Synchronous::normal;  // the connection's setting
   const int logPages_;
   const int longestLogPages_;
   bool logIsTooLong_ = false;
-  // Of the log, as of the last checkpoint.
-  int checkpointedPages_ = 0;  // how long it was when that began
-  int movedPages_ = 0;         // up to where it has been moved
+  // The log at the last checkpoint.
+  int checkpointedPages_ = 0;  // its length when that began
+  int movedPages_ = 0;
   bool isCatchingUp_ = false;  // all of it was moved, and it has grown meanwhile
   std::string storeID_;
-  StoreIDs lastIDs_;  // given, in the transaction under way too
+  StoreIDs lastIDs_;  // with the ids of the open transaction
   StoreIDs committedIDs_;
   Retention retention_;
   std::int64_t provisionalSessionsAfter_ = 0;
-  std::int64_t now_ = 0;  // of the transaction under way, in microseconds
-  std::string json_;      // of the row under way; kept for its capacity
+  std::int64_t now_ = 0;  // of the open transaction, in microseconds
+  std::string json_;      // of the current row; kept for its capacity
   std::uint64_t storedAtOpening_ = 0;
   StoreDrops dropsAtOpening_;
-  StoreDrops keptDrops_;  // of those that are dropped before they reach the store
+  StoreDrops keptDrops_;  // as the file has them
   const std::filesystem::path path_;
-  std::function<void()> mediumAnswered_ = [] {};
+  std::function<void()> onSyncDone_ = [] {};
   std::unique_ptr<StoreSyncer> syncer_;  // null before it is needed
-  struct UnderWay {
-    StoreSyncer::Task task;
+  struct InFlight {
     StoreIDs ids;
-    std::optional<StoreSyncer::End> end;
+    std::optional<StoreSyncer::TaskResult> result;
+    StoreSyncer::Task task;
   };
-  std::optional<UnderWay> underWay_;
+  std::optional<InFlight> inFlight_;
 };
 
 }  // namespace quarvel

@@ -6,7 +6,7 @@
 #include <utility>
 
 #include "queues/BlockingScope.h"
-#include "store/database/StoreError.h"
+#include "store/database/StoreFile.h"
 
 namespace quarvel {
 

@@ -11,9 +11,9 @@
 
 #include "base/Error.h"
 #include "base/Mutex.h"
+#include "base/StoreCounters.h"
 #include "quotas/FlowControl.h"
 #include "store/StoreBatch.h"
-#include "store/database/StoreCounters.h"
 
 namespace quarvel {
 

@@ -13,8 +13,8 @@ namespace quarvel {
 /// The service's present numbers, in the order of `Gauge`.
 using Gauges = std::array<std::atomic<std::int64_t>, 3>;
 
-/// Adds the store, its queue and its counters, and the service's gauges to the status, which
-/// `gauges` outlives.
+/// Adds the store, its queue and its counters, and the service's gauges, to the status. The status
+/// keeps `store` and reads it on the thread that writes the status; `gauges` outlives it.
 void DescribeInStatus(Status& status, const std::shared_ptr<const TelemetryStore>& store,
                       const Gauges& gauges);
 

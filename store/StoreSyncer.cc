@@ -9,20 +9,20 @@ namespace quarvel {
 
 std::unique_ptr<StoreSyncer> StoreSyncer::open(const std::filesystem::path& path,
                                                const SqliteConnection& writer,
-                                               std::function<void()> ended) {
+                                               std::function<void()> done) {
   SqliteConnection connection;
   if (!connection.open(path) || !connection.isSameFileAs(writer)) return nullptr;
   // Only reading opens the log.
   if (!connection.integer("PRAGMA user_version")) return nullptr;
   try {
-    return std::unique_ptr<StoreSyncer>(new StoreSyncer(std::move(connection), std::move(ended)));
+    return std::unique_ptr<StoreSyncer>(new StoreSyncer(std::move(connection), std::move(done)));
   } catch (const std::system_error&) {
     return nullptr;
   }
 }
 
-StoreSyncer::StoreSyncer(SqliteConnection connection, std::function<void()> ended)
-    : ended_(std::move(ended)), connection_(std::move(connection)), thread_([this] { run(); }) {}
+StoreSyncer::StoreSyncer(SqliteConnection connection, std::function<void()> done)
+    : done_(std::move(done)), connection_(std::move(connection)), thread_([this] { run(); }) {}
 
 StoreSyncer::~StoreSyncer() {
   {
@@ -41,12 +41,12 @@ void StoreSyncer::begin(Task task) {
   changed_.notifyAll();
 }
 
-std::optional<StoreSyncer::End> StoreSyncer::takeEnd() {
+std::optional<StoreSyncer::TaskResult> StoreSyncer::takeResult() {
   MutexLock lock(mutex_);
-  return std::exchange(end_, std::nullopt);
+  return std::exchange(result_, std::nullopt);
 }
 
-void StoreSyncer::await() {
+void StoreSyncer::wait() {
   MutexLock lock(mutex_);
   while (task_) changed_.wait(mutex_);
 }
@@ -61,25 +61,25 @@ void StoreSyncer::run() {
       if (!task_) return;
       task = *task_;
     }
-    const End end = carryOut(task);
+    const TaskResult result = runTask(task);
     {
       MutexLock lock(mutex_);
       task_.reset();
-      end_ = end;
+      result_ = result;
     }
     changed_.notifyAll();
-    ended_();
+    done_();
   }
 }
 
-StoreSyncer::End StoreSyncer::carryOut(Task task) {
+StoreSyncer::TaskResult StoreSyncer::runTask(Task task) {
   if (task == Task::sync) {
     const bool synced = connection_.syncLog();
     return {task, synced, !synced, 0};
   }
-  const SqliteConnection::Moved moved = connection_.checkpoint();
-  const bool doubtful = connection_.logIsDoubtful();
-  return {task, moved.all, doubtful, moved.pages};
+  const SqliteConnection::Checkpoint moved = connection_.checkpoint();
+  const bool failed = connection_.logSyncFailed();
+  return {task, moved.complete, failed, moved.pages};
 }
 
 }  // namespace quarvel

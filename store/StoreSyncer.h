@@ -12,55 +12,56 @@
 
 namespace quarvel {
 
-/// Waits for the medium, so that the store's writer need not: syncs the write-ahead log and moves
-/// it into the database file, one of the two at a time, on a thread and a connection of its own,
-/// while the writer goes on committing. Sleeps, without a timer, while it has nothing to do.
+/// Syncs the write-ahead log and moves it into the database file, one task at a time, on a thread
+/// and a connection of its own, so that the store's writer goes on committing. Sleeps without a
+/// timer while it has no task.
 ///
-/// Used by the thread that owns it.
+/// Owned by the `StoreDatabase`, and used by its thread alone. Lives from the first task until the
+/// file is closed or a sync fails.
 class StoreSyncer {
  public:
   enum class Task : std::uint8_t { sync, checkpoint };
-  struct End {
+  struct TaskResult {
     Task task;
-    /// Whether all that was committed when the task began is on the medium now.
-    bool isSafe;
-    /// A sync has failed: what is written from now on must wait for the log to be written again.
-    bool logIsDoubtful;
-    /// Of a checkpoint: up to where the log has been moved.
+    /// Everything committed before the task began is durable.
+    bool durable;
+    /// A sync has failed: the log must be rewritten before anything else is written.
+    bool logSyncFailed;
+    /// After a checkpoint: the number of pages of the log that have been moved.
     int movedPages;
   };
 
-  /// Null when there is no descriptor or thread for it, or `path` is not the file that `writer` has
-  /// open. `ended` is called on the syncer's thread whenever a task has ended.
+  /// `done` is called on the syncer's thread after each task. Null when there is no descriptor or
+  /// thread left, or `path` is not the file that `writer` has open.
   [[nodiscard]] static std::unique_ptr<StoreSyncer> open(const std::filesystem::path& path,
                                                          const SqliteConnection& writer,
-                                                         std::function<void()> ended);
-  /// Waits for the task under way.
+                                                         std::function<void()> done);
+  /// Waits for the task in flight.
   ~StoreSyncer();
   StoreSyncer(const StoreSyncer&) = delete;
   StoreSyncer& operator=(const StoreSyncer&) = delete;
 
-  /// Only when the end of the task before has been taken.
+  /// Only after the result of the task before has been taken.
   void begin(Task task) QUARVEL_EXCLUDES(mutex_);
-  [[nodiscard]] std::optional<End> takeEnd() QUARVEL_EXCLUDES(mutex_);
-  /// Returns when no task is under way.
-  void await() QUARVEL_EXCLUDES(mutex_);
+  [[nodiscard]] std::optional<TaskResult> takeResult() QUARVEL_EXCLUDES(mutex_);
+  /// Returns when no task is in flight.
+  void wait() QUARVEL_EXCLUDES(mutex_);
 
  private:
-  StoreSyncer(SqliteConnection connection, std::function<void()> ended);
+  StoreSyncer(SqliteConnection connection, std::function<void()> done);
   void run() QUARVEL_EXCLUDES(mutex_);
-  [[nodiscard]] End carryOut(Task task);
+  [[nodiscard]] TaskResult runTask(Task task);
 
-  const std::function<void()> ended_;
+  const std::function<void()> done_;
   SqliteConnection connection_;  // the syncer's thread's
 
   Mutex mutex_;
   ConditionVariable changed_;
-  std::optional<Task> task_ QUARVEL_GUARDED_BY(mutex_);  // to be done, or under way
-  std::optional<End> end_ QUARVEL_GUARDED_BY(mutex_);
+  std::optional<Task> task_ QUARVEL_GUARDED_BY(mutex_);  // to do, or in flight
+  std::optional<TaskResult> result_ QUARVEL_GUARDED_BY(mutex_);
   bool closing_ QUARVEL_GUARDED_BY(mutex_) = false;
 
-  std::thread thread_;  // the last, so that all else is there for it
+  std::thread thread_;  // last: it uses all other members
 };
 
 }  // namespace quarvel

@@ -8,31 +8,35 @@
 #include <memory>
 #include <optional>
 #include <string>
-#include <vector>
 
 #include "base/Date.h"
 #include "base/Error.h"
-#include "base/Mutex.h"
+#include "store/StoreAgeing.h"
 #include "store/StoreDatabase.h"
+#include "store/StoreDurability.h"
+#include "store/StoreHealth.h"
 #include "store/StoreQueue.h"
 
 namespace quarvel {
 
-/// The store's one writer: takes batches from the queue and commits them, has synced beside that
-/// what would wait for a sync too long, keeps the file within its bounds. Owned by the store;
-/// everything runs on the store's thread.
+/// Commits: takes batches from the queue and writes them, retries after failures, opens and closes
+/// the file, carries out erasures. `StoreDurability` and `StoreAgeing` do the rest on the same
+/// thread.
+///
+/// Owned by the `TelemetryStore`, as long as it lives. Everything runs on the store's thread, but
+/// for `problem` and `followDurableExtent`.
 class StoreWriter {
  public:
   struct Options {
     StoreDatabase::Options database;
     std::chrono::milliseconds sync{1000};
-    std::chrono::milliseconds firstBackOff{50};
+    BackOff::Bounds backOff;
     std::chrono::days maximumAge{14};
     std::chrono::milliseconds ageing{std::chrono::hours{1}};
     std::function<Date()> clock;
   };
 
-  /// `database` is null when the file could not be opened, for the reason `failure`, and is to be
+  /// `database` is null when the file could not be opened, for the reason `failure`, and has to be
   /// tried again. `queue` must outlive the writer.
   StoreWriter(Options options, std::unique_ptr<StoreDatabase> database,
               const std::optional<Error>& failure, StoreQueue& queue);
@@ -40,112 +44,62 @@ class StoreWriter {
   /// Works until the queue is closed and empty, then closes the database.
   void run();
 
-  /// Why the store takes no rows now, or cannot make them safe; none while all is well. Any thread.
-  [[nodiscard]] std::optional<std::string> problem() const QUARVEL_EXCLUDES(problemMutex_);
-
-  /// As `TelemetryStore::followDurableExtent`.
-  void followDurableExtent(std::function<void(const DurableExtent&)> follower)
-      QUARVEL_EXCLUDES(following_);
+  /// See `StoreHealth::problem`. Any thread.
+  [[nodiscard]] std::optional<std::string> problem() const { return health_.problem(); }
+  /// See `TelemetryStore::followDurableExtent`. Any thread.
+  void followDurableExtent(std::function<void(const DurableExtent&)> follower) {
+    durability_.followDurableExtent(std::move(follower));
+  }
 
  private:
   using Instant = StoreQueue::Instant;
-  using Flush = std::function<void(const std::optional<Error>&)>;
 
-  /// At most one line a minute.
-  class Minutely {
-   public:
-    bool due();
-
-   private:
-    std::optional<Instant> last_;
-  };
-
-  /// What is next to do if no rows come.
+  /// When work is due although no row comes.
   [[nodiscard]] std::optional<Instant> nextDeadline() const;
   void atDeadline();
+  void pollSync();
+  void waitForSync();
+
   void write(const StoreBatch& batch);
-  /// Commits rows, however long that takes; false when the store was closed before it could.
+  /// Commits rows and retries until it succeeds. False when the store was closed before.
   bool writeRows(const StoreBatch& batch, std::size_t first, std::size_t last);
   [[nodiscard]] bool tryToWrite(const StoreBatch& batch, std::size_t first, std::size_t last);
   [[nodiscard]] bool needsFullCommit(const StoreBatch& batch, std::size_t last) const;
-  void complete(const StoreBatch& batch, std::size_t first, std::size_t last,
-                const std::optional<Error>& error);
-  void lose(const StoreBatch& batch, std::size_t first);
-  /// Sees to what the medium has answered, and begins what is due.
-  void attendMedium();
-  void takeSafe();
-  void uncover();
-  /// Waits for what is under way at the medium.
-  void settle();
-  /// Everything up to these ids is on the medium now.
-  void isSafe(const StoreIDs& ids) QUARVEL_EXCLUDES(following_);
-  void allIsSafe() QUARVEL_EXCLUDES(following_);
-  void completeFlushes(std::vector<Flush>& flushes, const std::optional<Error>& error);
+  void completeRows(const StoreBatch& batch, std::size_t first, std::size_t last,
+                    const std::optional<Error>& error);
+  void loseRows(const StoreBatch& batch, std::size_t first);
+
+  /// One step of the first erasure.
   void erase();
   void endErasure(const Result<std::int64_t>& rows);
-  void syncHere();
-  void makeRoom(const StoreQueue::Tally& incoming);
-  /// Finds out whether the clock was set.
-  void watchClock(Date now);
-  /// Has rows past their age removed, unless the clock was set since that was last done: who sets
-  /// it forward by years must not empty the store.
-  void beginAgeing(Date now);
-  /// One step of retention. False when there is nothing more to do.
-  bool retain(std::uint64_t incomingBytes, const std::optional<Retention::Expiry>& expired);
-  void reportRemoved(bool now);
-  /// A file that was taken away still takes rows, but nobody would find them.
-  void putBackIfTakenAway();
-  [[nodiscard]] Error databaseError() const;
-  /// Reports, and closes a file that turns out to be corrupt: opening it again deals with that.
-  void failed(Error error);
-  void succeeded();
-  void setProblem(std::optional<std::string> problem) QUARVEL_EXCLUDES(problemMutex_);
-  void close();
-  void adopt(std::unique_ptr<StoreDatabase> database);
+
+  /// Opens the file again.
   [[nodiscard]] bool reopen(bool isSuspect);
+  void use(std::unique_ptr<StoreDatabase> database);
+  /// After a failure: closes a file that turns out to be corrupt. The next opening sets it aside.
+  void closeIfCorrupt();
+  void close();
+  /// Rows in a file that was removed or renamed would be lost with its last descriptor.
+  void restoreFileIfGone();
   void finish();
 
-  const Options options_;
-  const std::chrono::milliseconds syncAfter_;
-  StoreQueue& queue_;
   struct PendingErasure {
     ErasureRow wanted;
     StoreIDs through;
   };
-  std::deque<PendingErasure> erasures_;                    // the first one is under way
+
+  const Options options_;
+  StoreQueue& queue_;
+  StoreHealth health_;
+  StoreDurability durability_;
+  StoreAgeing ageing_;
   std::unique_ptr<StoreDatabase> database_;         // null while the file cannot be opened
-  std::unique_ptr<Erasure> erasure_;                // on the database; null before its first step
   StoreIDs knownIDs_;                               // of a file that was closed
-  bool isSuspect_ = false;                          // the file has been found to be corrupt
-  std::optional<std::int64_t> lastEarlierSession_;  // of before this store was opened
-  Error failure_;                                   // of the last attempt
-  bool failing_ = false;
-  Minutely failureLine_;
-  bool gaveUp_ = false;  // the store was closed while it took no rows
-  // What a power cut would take, and no sync that is under way covers: since when, and who waits.
-  std::optional<Instant> unsyncedSince_;
-  std::vector<Flush> flushes_;
-  // The same of what is under way.
-  std::optional<Instant> coveredSince_;
-  std::vector<Flush> coveredFlushes_;
-  std::chrono::milliseconds syncBackOff_{0};  // after a failure
-  Instant syncNotBefore_{};
-  bool clockWasSet_ = false;                  // since rows were last looked at for their age
-  bool clockMarkIsDue_ = false;               // the store does not know yet that it was
-  bool retaining_ = true;                     // there may be rows to remove
-  std::optional<Retention::Expiry> expired_;  // ... these, by a clock that has run on
-  Instant agedAt_;                            // when rows were last looked at for their age
-  std::chrono::nanoseconds clockSeenAt_;      // since boot
-  Date clockSeen_;                            // ... by the clock
-  std::uint64_t removedNotExported_ = 0;      // and not yet reported
-  Minutely removedLine_;
-
-  mutable Mutex problemMutex_;
-  std::optional<std::string> problem_ QUARVEL_GUARDED_BY(problemMutex_);
-
-  Mutex following_;
-  DurableExtent extent_ QUARVEL_GUARDED_BY(following_);
-  std::function<void(const DurableExtent&)> extentFollower_ QUARVEL_GUARDED_BY(following_);
+  std::optional<std::int64_t> lastEarlierSession_;  // before this store was opened
+  bool isSuspect_ = false;                          // corruption was met in the file
+  bool gaveUp_ = false;                             // the store was closed while it took no rows
+  std::deque<PendingErasure> erasures_;             // the first one is being carried out
+  std::unique_ptr<Erasure> erasure_;                // on the database; null before its first step
 };
 
 }  // namespace quarvel

@@ -60,8 +60,7 @@ class TelemetryAgent::Session final : public RelmReportingSession {
 
   void startConfiguration(ConfigurationCompletion completion) override {
     core_->completions->async([core = core_, completion = std::move(completion)] {
-      // The store is the queue of every backend: a remote engine that is down now only has a
-      // backlog.
+      // The store is the queue of every backend: a remote engine that is down has a backlog.
       const bool found = core->store->isOpen() && !core->backends.empty();
       completion(found ? std::optional(core->backends) : std::nullopt);
     });
@@ -69,7 +68,7 @@ class TelemetryAgent::Session final : public RelmReportingSession {
 
   Outcome agentSendMessage(std::uint16_t category, std::uint16_t type,
                            const Payload& payload) override {
-    // A store that has refused the session is closed, and counts this message as refused too.
+    // After refusing the session the store is closed, and counts this message as refused too.
     return HandOver(*core_->store, {id_ ? std::optional(id_.value()) : std::nullopt, sessionID_,
                                     clientName_, serviceName_, category, type, payload});
   }
@@ -96,7 +95,8 @@ class TelemetryAgent::Session final : public RelmReportingSession {
 
 TelemetryAgent::TelemetryAgent(std::shared_ptr<TelemetryStore> store,
                                std::vector<std::string> backends)
-    // Not in the line of the sessions, where what they wait for would stand behind all of them.
+    // A queue of its own: on the sessions' queues completions would wait behind the sessions that
+    // wait for them.
     : core_(std::make_shared<const Core>(
           Core{std::move(store), std::move(backends),
                CreateSerialQueue("tarnwick.quarvel.agent", QualityOfService::userInteractive)})) {}

@@ -15,15 +15,15 @@ namespace quarvel {
 
 class WorkQueue;
 
-/// The telemetry agent: keeps sessions and their messages in the store, where each message that it
-/// is given has been counted as on its way. Any thread.
+/// The telemetry agent: adds sessions and their messages to the store. Each message was counted as
+/// accepted before. Owned by the service; its sessions may live longer. Any thread.
 class TelemetryAgent {
  public:
-  /// `backends`: the configured ones, in the order in which they are told to sessions.
+  /// `backends`: the configured ones, in the order in which sessions get them.
   TelemetryAgent(std::shared_ptr<TelemetryStore> store, std::vector<std::string> backends);
 
-  /// As the operations of the same names (`platform/RelmReporting.h`). Keys that are missing, or
-  /// hold another kind of value, leave their columns empty.
+  /// Implement the operations of the same names (`platform/RelmReporting.h`). A key that is
+  /// missing, or holds another kind of value, leaves its column empty.
   [[nodiscard]] std::shared_ptr<RelmReportingSession> createAgentSession(
       const Dictionary& sessionInfo, const Dictionary& userInfo);
   Outcome sendOneMessage(const Dictionary& sessionInfo, const Dictionary& userInfo,
@@ -31,11 +31,11 @@ class TelemetryAgent {
 
  private:
   class Session;
-  /// What sessions share with the agent, and may keep longer.
+  /// Shared with the sessions, which may keep it longer than the agent.
   struct Core {
     std::shared_ptr<TelemetryStore> store;
     std::vector<std::string> backends;
-    std::unique_ptr<WorkQueue> completions;  // where those run that the writer does not call
+    std::unique_ptr<WorkQueue> completions;  // runs completions that the writer does not call
   };
 
   std::shared_ptr<const Core> core_;

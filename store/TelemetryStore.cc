@@ -6,7 +6,7 @@
 
 #include "store/StoreDatabase.h"
 #include "store/StoreWriter.h"
-#include "store/database/StoreError.h"
+#include "store/database/StoreFile.h"
 
 namespace quarvel {
 
@@ -16,7 +16,7 @@ Date SystemDate() {
   return std::chrono::floor<std::chrono::microseconds>(std::chrono::system_clock::now());
 }
 
-/// Whether what keeps the file from being opened may go away by itself.
+/// Whether the reason for which the file cannot be opened may go away by itself.
 bool MayPass(const Error& error) {
   return error.code == static_cast<std::int64_t>(StoreErrorCode::diskFull) ||
          error.code == static_cast<std::int64_t>(StoreErrorCode::failed);
@@ -29,7 +29,7 @@ Result<std::unique_ptr<TelemetryStore>> TelemetryStore::open(Options options) {
   const StoreWriter::Options writerOptions{
       {options.path, {options.maximumBytes, options.remoteBackends}, options.logPages},
       options.sync,
-      options.firstBackOff,
+      {options.firstBackOff, options.longestBackOff},
       options.maximumAge,
       options.ageing,
       options.clock};

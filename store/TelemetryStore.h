@@ -23,46 +23,48 @@ namespace quarvel {
 
 class StoreWriter;
 
-/// Where everything ends up: a database file that one writer thread fills from a bounded queue.
+/// The telemetry store: a database file that one writer thread fills from a bounded queue.
 ///
-/// Everything queued since the last commit goes into one transaction, so that a row alone is
-/// committed at once and many rows share the cost of a commit. A committed row survives the end of
-/// the process; after at most `Options::sync` it survives a power cut. While the disk is full or
-/// the database fails, nothing that was taken is lost: the writer tries again until it succeeds,
-/// and senders wait when the queue is full. An idle store does nothing.
+/// All rows queued since the last commit go into one transaction: a single row is committed at
+/// once, and many rows share the cost of a commit. A committed row survives the end of the process;
+/// after at most `Options::sync` it survives a power cut. While the disk is full or the database
+/// fails, no accepted row is lost: the writer retries until it succeeds, and senders wait when the
+/// queue is full. An idle store does nothing.
 ///
-/// All operations may be called from any thread. Errors have the domain "quarvel.store" and a
+/// Owned by the service (shared with the objects that add rows); destroying it closes it. All
+/// operations may be called from any thread. Errors have the domain "quarvel.store" and a
 /// `StoreErrorCode`.
 class TelemetryStore {
  public:
   struct Options {
     std::filesystem::path path{};
-    /// A row is on the medium at most this long after it was queued; 0: with its commit.
+    /// A row is durable at most this long after it was queued; 0: with its commit.
     std::chrono::milliseconds sync{1000};
     std::uint64_t maximumBytes = 268'435'456;
     std::chrono::days maximumAge{14};
-    /// How often, when rows come, old ones are looked for; until then the clock must have run on
-    /// without being set.
+    /// How often rows past their age are looked for, when rows come. A clock that was set during
+    /// this time puts the search off.
     std::chrono::milliseconds ageing{std::chrono::hours{1}};
-    /// Backends that read the store: rows they have not had are removed last.
+    /// Backends that read the store: rows that one of them has not received are removed last.
     std::vector<std::string> remoteBackends{};
-    /// Bounds of the queue; senders beyond them are held back. So few rows that under any load one
-    /// is committed within 10 ms of being queued, but for a slow medium.
+    /// Bounds of the queue, beyond which senders wait. So few rows that each is committed within
+    /// 10 ms under any load, unless the medium is slow.
     std::size_t queueRows = 2048;
     std::size_t queueBytes = 8 << 20;
-    /// How far the write-ahead log grows before it is moved into the file, in pages of 4 KiB. A
-    /// longer log needs fewer syncs, but what is moved at once holds up the rows behind it, and
-    /// pages that the system has cached are cheaper than new ones.
+    /// How long the write-ahead log grows before it is moved into the file, in pages of 4 KiB. A
+    /// longer log needs fewer syncs, but each checkpoint holds up rows for longer, and misses the
+    /// system's page cache more often.
     int logPages = 1024;
-    /// How long the writer waits before it tries again what failed; doubles up to 5 s.
+    /// The delay before the first retry after a failure; it doubles up to the longest.
     std::chrono::milliseconds firstBackOff{50};
-    /// Says what time rows carry and how old they are; empty: the system's clock.
+    std::chrono::milliseconds longestBackOff{5000};
+    /// Gives rows their times, and retention the present; empty: the system's clock.
     std::function<Date()> clock{};
   };
 
-  /// Opens the store, making it when there is none and setting a corrupt one aside, and starts the
-  /// writer. An error says what to do; nothing has been changed then. What may pass, such as a full
-  /// disk, is none: rows wait in the queue until the file can be opened.
+  /// Opens the store and starts the writer. Makes a store when there is none, and sets a corrupt
+  /// one aside. An error tells the remedy, and nothing has been changed then. A failure that may
+  /// pass, such as a full disk, is no error: rows wait in the queue until the file can be opened.
   [[nodiscard]] static Result<std::unique_ptr<TelemetryStore>> open(Options options);
   TelemetryStore(const TelemetryStore&) = delete;
   TelemetryStore& operator=(const TelemetryStore&) = delete;
@@ -76,7 +78,7 @@ class TelemetryStore {
     std::string_view hierarchyToken{}, clientName{}, serviceName{};
     const Payload& userInfo;
   };
-  /// Adds a session and returns its id. Never held back.
+  /// Adds a session and returns its id. Never waits.
   [[nodiscard]] Result<std::int64_t> addAgentSession(const AgentSession& session);
 
   struct Message {
@@ -87,39 +89,40 @@ class TelemetryStore {
     std::uint16_t type = 0;
     const Payload& payload;
   };
-  // Success means that the row is queued and will be kept. Held back while there is no room.
+  // Success means that the row is queued and will be kept. Waits while there is no room.
   Outcome addMessage(const Message& message);
   Outcome addAnalyticsEvent(std::string_view name, const Payload& payload);
   Outcome addPowerEvent(std::int32_t domain, std::string_view name, const Payload& payload);
-  // As these two, but false, with nothing done, while there is no room.
+  // The same, but without waiting: false, with nothing done, while there is no room.
   [[nodiscard]] bool addAnalyticsEventIfRoom(std::string_view name, const Payload& payload);
   [[nodiscard]] bool addPowerEventIfRoom(std::int32_t domain, std::string_view name,
                                          const Payload& payload);
 
   /// Called once, on the writer's thread: be brief, and do not close the store.
   using FlushCompletion = std::function<void(const std::optional<Error>& error)>;
-  /// Makes everything added before safe from a power cut and marks the session as flushed. Never
-  /// held back. When this returns an error, `completion` is not called.
+  /// Makes everything added before durable and marks the session as flushed. Never waits. When this
+  /// returns an error, `completion` is not called.
   Outcome flush(std::int64_t agentSession, FlushCompletion completion);
 
-  /// Records what a backend has been given; `completion` as for `flush`. Never held back. A record
-  /// about another store than this, which was set aside meanwhile, has no effect.
+  /// Records a delivery to a backend; `completion` as for `flush`. Never waits. A record about
+  /// another store, one that was set aside meanwhile, has no effect.
   Outcome addExport(ExportRecord record, FlushCompletion completion);
-  /// Removes rows for good: of those that were added before, as `Erasure`. `completion` gets
-  /// how many they were, or why it was not finished; else as for `flush`. Never held back.
+  /// Removes for good rows that were added before, as `Erasure`; all of them: also the stores that
+  /// were set aside. `completion` gets their number, or the reason why the erasure was not
+  /// finished; otherwise as for `flush`. Never waits.
   Outcome erase(ErasureSelection selection,
                 std::function<void(const Result<std::int64_t>&)> completion);
-  /// `follower` is told at once and whenever more has become safe from a power cut, on the writer's
-  /// thread, under a lock: be brief, and call nothing of the store. An empty one ends that; once
-  /// this returns, the earlier one is not called any more.
+  /// Calls `follower` now and whenever more rows have become durable, on the writer's thread and
+  /// under a lock: be brief, and call no function of the store. Replaces the follower before, which
+  /// is not called any more once this returns. An empty one ends the calls.
   void followDurableExtent(std::function<void(const DurableExtent&)> follower);
 
-  /// Commits and syncs what was added, ends the writer and closes the file; refuses everything from
-  /// now on. Returns when that is done, also when another thread began it. Rows that the disk still
-  /// has no room for are lost then, and their number is logged.
+  /// Refuses further rows, commits and syncs those added before, ends the writer and closes the
+  /// file. Returns when that is done, also when another thread began it. Rows for which the disk
+  /// still has no room are lost, and their number is logged.
   void close() QUARVEL_EXCLUDES(closing_);
 
-  // Messages before they are added: counted from their acceptance on, so that none disappears.
+  // Messages before they are added: counted from acceptance on, so that none is lost uncounted.
   void countAccepted() { queue_.countAccepted(); }
   void countQueued() { queue_.countQueued(); }
   void countDropped(StoreDrop reason) { queue_.countDropped(reason); }
@@ -144,7 +147,7 @@ class TelemetryStore {
   std::atomic<std::int64_t> lastAgentSession_;
 
   Mutex closing_;
-  std::unique_ptr<StoreWriter> writer_;  // used by its thread alone while that runs
+  std::unique_ptr<StoreWriter> writer_;  // constant after construction; runs on `thread_`
   std::thread thread_ QUARVEL_GUARDED_BY(closing_);
 };
 

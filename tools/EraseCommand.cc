@@ -9,6 +9,7 @@
 #include "base/Files.h"
 #include "base/Json.h"
 #include "store/database/Erasure.h"
+#include "store/database/StoreFile.h"
 #include "tools/Commands.h"
 #include "tools/Format.h"
 #include "tools/ServiceFiles.h"
@@ -20,7 +21,7 @@ namespace {
 using std::filesystem::path;
 
 constexpr const char* kErasureNotification = "tarnwick.quarvel.erase";
-constexpr std::chrono::minutes kPatience{5};  // a large store is written anew
+constexpr std::chrono::minutes kPatience{5};  // a large store is rewritten as a whole
 
 Error Failed(std::string reason) {
   return Error::because("quarvel.erase", 1, std::move(reason));
@@ -87,7 +88,7 @@ Result<std::int64_t> AskService(const Options& options, const ErasureSelection& 
 Result<std::int64_t> EraseOurselves(const Options& options, const ErasureSelection& selection) {
   path store = PathOf(options);
   if (std::filesystem::is_directory(store)) store /= "telemetry.db";
-  // Says what is wrong with a file that is no store of ours, and leaves it alone.
+  // Refuses a file that is no store of ours, and leaves it alone.
   if (auto reader = StoreReader::open(store); !reader) return std::move(reader.error());
   SqliteConnection connection;
   if (!connection.open(store)) {
@@ -102,7 +103,7 @@ Result<std::int64_t> EraseOurselves(const Options& options, const ErasureSelecti
                               store.native(), connection.message()));
   }
   if (std::holds_alternative<ErasureSelection::All>(selection.what)) {
-    Erasure::removeSetAside(store);
+    RemoveStoresSetAside(store);
   }
   return erasure.rows();
 }

@@ -19,19 +19,19 @@
 namespace quarvel::commands {
 namespace {
 
-constexpr std::chrono::seconds kLook{1};  // how often --wait does
+constexpr std::chrono::seconds kPoll{1};  // interval of --wait
 
 struct Backend {
   StoredBackend stored;
   std::string error;
 };
 
-/// By name. What the service says comes on top of what the store holds: backends that have never
-/// had a row, and what is wrong now.
+/// By name. The service's status adds to the store's rows: backends without a row so far, the
+/// backlog and the error of each now.
 using Backends = std::map<std::string, Backend>;
 
-/// Returns whether it said anything.
-bool AddWhatServiceSays(const Options& options, Backends& backends) {
+/// Returns whether the service answered.
+bool AddStatus(const Options& options, Backends& backends) {
   const auto text = StatusText(options);
   const auto status = text ? ValueFromJson(text.value()) : Result<Value>(text.error());
   const Dictionary* told = status ? status.value().dictionary() : nullptr;
@@ -51,13 +51,13 @@ bool AddWhatServiceSays(const Options& options, Backends& backends) {
   return true;
 }
 
-/// `ask`: whether to ask the service; becomes false when it does not answer.
+/// `ask`: whether to ask the service; turns false when it does not answer.
 Result<Backends> BackendsOf(const Options& options, StoreReader& store, bool& ask) {
   Backends backends;
   const Outcome read = store.backends(
       [&](const StoredBackend& backend) { backends[backend.name].stored = backend; });
   if (!read) return read.error();
-  ask = ask && AddWhatServiceSays(options, backends);
+  ask = ask && AddStatus(options, backends);
   return backends;
 }
 
@@ -130,7 +130,7 @@ Outcome PrintLedger(StoreReader& store, std::int64_t last, bool json) {
   return read;
 }
 
-/// Waits until no backend has anything to go; on a terminal, tells how far they are.
+/// Waits until no backend has a backlog; on a terminal, shows the progress.
 Outcome WaitUntilDrained(const Options& options, StoreReader& store, bool& ask) {
   const bool shown = Terminal::standardOutput().attached && !options.json;
   std::int64_t before = -1;
@@ -154,7 +154,7 @@ Outcome WaitUntilDrained(const Options& options, StoreReader& store, bool& ask) 
     }
     if (left == 0) break;
     before = left;
-    std::this_thread::sleep_for(kLook);
+    std::this_thread::sleep_for(kPoll);
   }
   if (shown) fmt::print("\r\x1b[K");
   return Success();

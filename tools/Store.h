@@ -3,19 +3,19 @@
 #include <chrono>
 #include <cstdint>
 #include <functional>
-#include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
 
 #include "base/Date.h"
 #include "base/Error.h"
-
-struct sqlite3;
+#include "store/database/Sqlite.h"
 
 namespace quarvel {
 
-/// One agent session in the store.
+// Rows of the store, as the commands print them. Plain values.
+
+/// One agent session.
 struct StoredSession {
   std::int64_t id;
   std::int64_t reporterID;
@@ -31,7 +31,7 @@ struct StoredSession {
   std::int64_t messages;
 };
 
-/// One message in the store.
+/// One message.
 struct StoredMessage {
   std::int64_t id;
   std::optional<std::int64_t> agentSession;  // none: a single message
@@ -43,7 +43,7 @@ struct StoredMessage {
   Date sentAt;
 };
 
-/// One analytics or power event in the store.
+/// One analytics or power event.
 struct StoredEvent {
   std::int64_t id;
   std::optional<std::int64_t> domain;  // a power event's
@@ -52,7 +52,7 @@ struct StoredEvent {
   Date recordedAt;
 };
 
-/// A backend that has been given rows, or that was refused some.
+/// A backend with a cursor or lines in the ledger.
 struct StoredBackend {
   std::string name;
   std::int64_t backlog = 0;  // rows
@@ -73,18 +73,18 @@ struct StoredExport {
   Date at;
 };
 
-/// The service's store, opened for reading only; it may be written meanwhile, and the service may
-/// start and end. For one thread.
-/// Errors: domain "quarvel.store", with a reason that says what to do.
+/// The service's store, opened for reading only. The service may start, write and end meanwhile.
+/// Owned by the command that reads, as long as it runs; one thread.
+/// Errors: domain "quarvel.store", with a reason that tells the reader how to mend it.
 class StoreReader {
  public:
-  /// Which sessions: opened at `since` or later, and only the last so many of them.
+  /// Sessions opened at `since` or later; only the last `last` of them.
   struct SessionQuery {
     std::optional<Date> since;
     std::optional<std::int64_t> last;
   };
-  /// Which messages: after `afterID`, sent at `since` or later, of one session, and only the last
-  /// so many of them.
+  /// Messages after `afterID`, sent at `since` or later, of one session; only the last `last` of
+  /// them.
   struct MessageQuery {
     std::int64_t afterID = 0;
     std::optional<Date> since;
@@ -93,8 +93,8 @@ class StoreReader {
     std::optional<std::int64_t> last;
   };
   enum class Events { analytics, power };
-  /// Which events: after `afterID`, recorded at `since` or later, of one name, and only the last so
-  /// many of them.
+  /// Events after `afterID`, recorded at `since` or later, of one name; only the last `last` of
+  /// them.
   struct EventQuery {
     std::int64_t afterID = 0;
     std::optional<Date> since;
@@ -109,37 +109,34 @@ class StoreReader {
   /// Takes the file, or the directory that holds telemetry.db.
   [[nodiscard]] static Result<StoreReader> open(std::string path);
 
-  /// In the order in which they were opened.
+  /// In the order of opening.
   [[nodiscard]] Outcome sessions(const SessionQuery& query,
                                  const std::function<void(StoredSession)>& each);
-  /// In the order in which they were stored.
+  /// In the order of storing.
   [[nodiscard]] Outcome messages(const MessageQuery& query,
                                  const std::function<void(StoredMessage)>& each);
-  /// By their names. The rows that were given are those of the ledger, which ends somewhere.
+  /// In the order of names. The numbers of rows are sums of the ledger, which is cut at its bound.
   [[nodiscard]] Outcome backends(const std::function<void(StoredBackend)>& each);
   /// The last lines of the ledger, the oldest first.
   [[nodiscard]] Outcome exports(std::int64_t last, const std::function<void(StoredExport)>& each);
-  /// In the order in which they were stored.
+  /// In the order of storing.
   [[nodiscard]] Outcome events(Events kind, const EventQuery& query,
                                const std::function<void(StoredEvent)>& each);
 
  private:
-  struct Close {
-    void operator()(sqlite3* database) const;
-  };
   explicit StoreReader(std::string path) : path_(std::move(path)) {}
 
   [[nodiscard]] Outcome connect();
-  [[nodiscard]] Outcome connect(bool atRest);
-  /// Before each query: a store that was at rest may have come to life.
+  [[nodiscard]] Outcome connect(SqliteConnection::Access access);
+  /// Before each query: a service may have begun to write a store that was opened as immutable.
   [[nodiscard]] Outcome reconnect();
 
   std::string path_;
-  std::unique_ptr<sqlite3, Close> database_;
-  bool atRest_ = false;  // opened as a file that nobody writes
+  SqliteConnection connection_;
+  bool isImmutable_ = false;
 };
 
-/// Wakes when something is written to a store.
+/// Waits for writes to a store. Owned by the command that follows rows; one thread.
 class StoreWatch {
  public:
   /// `path` as `StoreReader` takes it.
@@ -148,7 +145,7 @@ class StoreWatch {
   StoreWatch(const StoreWatch&) = delete;
   StoreWatch& operator=(const StoreWatch&) = delete;
 
-  /// Returns soon after a write, and at the latest after a second: rows can be read only a moment
+  /// Returns soon after a write, and at the latest after a second: a row becomes readable a moment
   /// after the file has changed.
   void wait();
 

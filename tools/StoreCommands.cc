@@ -17,7 +17,7 @@ using vocabulary::Category;
 using vocabulary::MessageType;
 using vocabulary::NameOf;
 
-// Rows are printed in portions of this many, so that a store of any size is read in little memory.
+// Rows are printed in portions, so that a store of any size needs little memory.
 constexpr std::size_t kPortion = 1'000;
 
 template <class T>
@@ -26,7 +26,7 @@ Value ValueOf(const std::optional<T>& stored) {
   return *stored;
 }
 
-// One line: `columns`, and under `key` what is JSON already.
+/// Prints one line: `columns`, then `json` under `key`.
 void PrintJson(const Dictionary& columns, std::string_view key, const std::string& json) {
   std::string line = JsonText(columns);
   line.pop_back();
@@ -94,8 +94,8 @@ std::vector<std::string> Row(const StoredEvent& event) {
   return row;
 }
 
-/// Prints the rows that `read` gives, and when it is to follow those that come, which is for ever.
-/// `read(query, each)` is given a query that goes on after the last row it gave.
+/// Prints the rows of `read`; with `follow` goes on with new rows for ever. Each call
+/// `read(query, each)` gets a query that begins after the last row of the call before.
 template <class Query, class Read>
 Outcome PrintRows(const std::string& path, bool json, bool follow, Table table, Query query,
                   const Read& read) {

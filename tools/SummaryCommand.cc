@@ -34,7 +34,7 @@ struct ClientUptime {
   double seconds;
 };
 
-/// One run of a session, as the store tells it.
+/// One run of a session, read from the store. A plain value.
 struct Run {
   StoredSession session;
   std::int64_t earlierRuns = 0;
@@ -83,8 +83,8 @@ double NumberOf(const Value& value) {
   return value.integer() ? static_cast<double>(*value.integer()) : -1;
 }
 
-// An uptime does not say whose session it was: it is told only when just one client was connected
-// from before the run's start, and has left after its end.
+/// An uptime does not name a session. It is returned only when exactly one client was connected
+/// from before the run's start until after its end.
 Result<std::optional<ClientUptime>> UptimeOfClient(StoreReader& store,
                                                    const StoredSession& session) {
   if (!session.flushedAt) return std::optional<ClientUptime>();

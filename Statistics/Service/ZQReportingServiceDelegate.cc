@@ -472,7 +472,7 @@ void ZQReportingServerInstance::routeByIDs(const std::optional<Payload>& payload
     const auto session = reporterID == 0 ? nullptr : findReportingSessionForID(reporterID, true);
     if (session == nullptr) {
       CountAcceptedMessage();
-      CountDroppedMessage(MessageDrop::noSuchSession);
+      CountDroppedMessage(StoreDrop::noSuchSession);
       continue;
     }
     ZQReportingVistrelBridge::handleEvent(payload, category, type, session->userInfo());

@@ -472,12 +472,12 @@ void ZQReportingSession::deliver(const Payload& enriched, std::uint32_t category
     return;
   }
   if (serviceType_ == kServiceTypeTest) {
-    CountDroppedMessage(MessageDrop::testServiceType);
+    CountDroppedMessage(StoreDrop::testServiceType);
     ZQ_LOG(Scope(), info, "transactions aren't allowed on this platform");
     return;
   }
   if (relmReportingSession_ == nullptr) {
-    CountDroppedMessage(MessageDrop::noAgentSession);
+    CountDroppedMessage(StoreDrop::noAgentSession);
     ZQ_LOG(Scope(), error, "{}", "No valid RelmReportingSession");
     return;
   }

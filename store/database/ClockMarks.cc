@@ -22,7 +22,7 @@ std::string MarkKey(const StoreIDs& after) {
   return key;
 }
 
-/// None for what is no key of a mark.
+/// None for any other key of `meta`.
 std::optional<StoreIDs> MarkedIDs(std::string_view key) {
   StoreIDs ids;
   key.remove_prefix(std::min(kPrefix.size(), key.size()));

@@ -10,12 +10,12 @@
 
 namespace quarvel {
 
-/// Which rows may carry wrong times: those of a run of the service in which the clock was set, from
-/// its beginning on. Their age counts from when that was found, or a device that boots in 1970
-/// would lose what it reported until it was told the time.
+/// Marks runs of the service in which the clock was set: all rows of such a run may carry wrong
+/// times. Their age counts from the mark. Otherwise a device that boots in 1970 would lose the rows
+/// that it stored before it knew the time.
 ///
-/// A mark in `meta` for each such run: its key holds the ids after which the run began, its value
-/// the time, in microseconds. Part of the `Retention`; the writer's thread.
+/// Each mark is an entry in `meta`: the key holds the ids after which the run began, the value the
+/// time of the mark in microseconds. Owned by the `Retention`; the writer's thread.
 class ClockMarks {
  public:
   /// `connection` must outlive this.
@@ -24,18 +24,18 @@ class ClockMarks {
   /// Once, with the last ids of earlier runs. False when it failed.
   [[nodiscard]] bool prepare(const StoreIDs& earlierRuns);
 
-  /// The clock was set, to `now` at last. False when that could not be kept.
+  /// Marks this run: the clock was set, the last time to `now`. False when the write failed.
   [[nodiscard]] bool add(Date now);
 
-  /// The ids up to which rows are as old as they say, as long as rows of before `expired` are
-  /// looked for. Marks older than that are forgotten. A mark ahead of the clock is one that a clock
-  /// ahead of the time has left, or the clock is behind it now; the former once the clock has run
-  /// as long as rows live. None when it failed.
+  /// The ids up to which the times of rows are right, for a search for rows from before `expired`.
+  /// Marks from before `expired` are deleted. A mark later than `now` is wrong, or the clock is:
+  /// the mark counts as wrong, and is deleted, once the clock has run as long as rows live. None
+  /// when a read or write failed.
   [[nodiscard]] std::optional<StoreIDs> trusted(Date now, Date expired);
 
  private:
-  /// Whether the clock has been behind a mark for so long that the mark is wrong. Times in
-  /// microseconds. None when that could not be found.
+  /// Whether the clock has been behind a mark for so long that the mark counts as wrong. Times in
+  /// microseconds. None when a read or write failed.
   std::optional<bool> hasBeenBehind(std::int64_t time, std::int64_t expired);
 
   SqliteConnection& connection_;

@@ -3,10 +3,9 @@
 #include <fmt/format.h>
 
 #include <array>
-#include <system_error>
 #include <utility>
 
-#include "store/database/StoreCounters.h"
+#include "base/StoreCounters.h"
 
 namespace quarvel {
 
@@ -14,36 +13,32 @@ namespace {
 
 constexpr int kSliceRows = 512;
 constexpr int kTruncations = 20;  // each waits as long as the connection waits for a reader
-/// Sessions last: what is left of messages says which of them are still needed.
-constexpr std::array kErased{StoreTable::message, StoreTable::analyticsEvent,
-                             StoreTable::powerEvent, StoreTable::agentSession};
+
+/// Tables that are not counted, the sessions, come last: the messages left tell which sessions are
+/// still needed.
+constexpr auto kErased = [] {
+  std::array<StoreTable, kAllStoreTables.size()> tables{};
+  std::size_t next = 0;
+  for (const bool counted : {true, false}) {
+    for (const StoreTable table : kAllStoreTables) {
+      if (Describe(table).isCounted == counted) tables[next++] = table;
+    }
+  }
+  return tables;
+}();
 
 std::int64_t Microseconds(Date date) {
   return date.time_since_epoch().count();
 }
 
-constexpr const char* BytesColumn(StoreTable table) {
-  return table == StoreTable::agentSession ? "user_info" : "payload";
-}
-
 std::string BeforeCondition(StoreTable table, Date before) {
-  switch (table) {
-    case StoreTable::agentSession:
-      return fmt::format(
-          "opened_at < {0} AND ifnull(flushed_at, opened_at) < {0} AND id NOT IN"
-          " (SELECT agent_session FROM message WHERE agent_session IS NOT NULL)",
-          Microseconds(before));
-    case StoreTable::message:
-      return fmt::format("sent_at < {}", Microseconds(before));
-    case StoreTable::analyticsEvent:
-    case StoreTable::powerEvent:
-      break;
+  if (Describe(table).isCounted) {
+    return fmt::format("{} < {}", Describe(table).timeColumn, Microseconds(before));
   }
-  return fmt::format("recorded_at < {}", Microseconds(before));
-}
-
-bool HasReporter(StoreTable table) {
-  return table == StoreTable::message || table == StoreTable::agentSession;
+  return fmt::format(
+      "opened_at < {0} AND ifnull(flushed_at, opened_at) < {0} AND id NOT IN"
+      " (SELECT agent_session FROM message WHERE agent_session IS NOT NULL)",
+      Microseconds(before));
 }
 
 }  // namespace
@@ -72,12 +67,7 @@ Erasure::Erasure(SqliteConnection& connection, ErasureSelection selection, Date 
     : connection_(connection), selection_(selection), lastIDs_(ownLastIDs_), now_(now) {
   connection_.execute("PRAGMA secure_delete = ON");
   for (const StoreTable table : kAllStoreTables) {
-    ownLastIDs_[table] =
-        connection_
-            .integer(fmt::format("SELECT max(ifnull((SELECT max(id) FROM {}), 0), ifnull((SELECT"
-                                 " CAST(value AS INTEGER) FROM meta WHERE key = '{}'), 0))",
-                                 StoreTableName(table), LastIDKey(table)))
-            .value_or(0);
+    ownLastIDs_[table] = connection_.integer(LastIDSql(table)).value_or(0);
   }
   through_ = ownLastIDs_;
 }
@@ -145,7 +135,7 @@ bool Erasure::removeRows(StoreTable table, Slice& slice) {
   slice.lastID = end.integer(0);
   if (slice.lastID == 0) return true;
   if (!connection_.prepare(count, fmt::format("SELECT count(*), ifnull(sum(length({})), 0) {}",
-                                              BytesColumn(table), where)) ||
+                                              JsonColumn(Describe(table))->name, where)) ||
       count.bind(1, slice.lastID).step() != SqliteStatement::Step::row) {
     return false;
   }
@@ -158,7 +148,7 @@ bool Erasure::removeRows(StoreTable table, Slice& slice) {
 }
 
 bool Erasure::record(StoreTable table, const Slice& slice) {
-  const bool counted = table != StoreTable::agentSession;
+  const bool counted = Describe(table).isCounted;
   rows_ += slice.rows;
   if (counted) counted_ += static_cast<std::uint64_t>(slice.rows);
   if (!write(fmt::format("UPDATE export_log SET rows = rows + {}, bytes = bytes + {} WHERE id = {}",
@@ -182,7 +172,8 @@ bool Erasure::write(const std::string& statement) {
 
 std::string Erasure::condition(StoreTable table) const {
   if (const auto* session = std::get_if<std::int64_t>(&selection_.what)) {
-    return HasReporter(table) ? fmt::format("session_id = {}", *session) : "";
+    const char* column = Describe(table).sessionColumn;
+    return column != nullptr ? fmt::format("{} = {}", column, *session) : "";
   }
   if (const auto* before = std::get_if<Date>(&selection_.what)) {
     return BeforeCondition(table, *before);
@@ -191,8 +182,8 @@ std::string Erasure::condition(StoreTable table) const {
 }
 
 Erasure::Progress Erasure::giveBack() {
-  // Pages keep copies of rows that were once moved to make room on them, which nothing overwrites:
-  // only a file that is written anew is clean. Should there be no room for that, the free pages go.
+  // Pages keep copies of rows that were once moved on them, which no later write covers: only a
+  // rewritten file is clean. Without room for that, the free pages go.
   if (rows_ > 0 && !std::exchange(rewritten_, true)) {
     connection_.execute("VACUUM");
     return Progress::more;
@@ -210,19 +201,6 @@ Erasure::Progress Erasure::giveBack() {
 
 std::uint64_t Erasure::takeCounted() {
   return std::exchange(counted_, 0);
-}
-
-std::size_t Erasure::removeSetAside(const std::filesystem::path& store) {
-  const std::string prefix = store.filename().string() + ".corrupt-";
-  std::size_t removed = 0;
-  std::error_code failure;
-  for (auto entry = std::filesystem::directory_iterator(store.parent_path(), failure);
-       !failure && entry != std::filesystem::directory_iterator(); entry.increment(failure)) {
-    if (!entry->path().filename().string().starts_with(prefix)) continue;
-    std::error_code kept;
-    if (std::filesystem::remove(entry->path(), kept)) ++removed;
-  }
-  return removed;
 }
 
 }  // namespace quarvel

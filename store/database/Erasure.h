@@ -1,8 +1,6 @@
 #pragma once
 
-#include <cstddef>
 #include <cstdint>
-#include <filesystem>
 #include <optional>
 #include <string>
 #include <variant>
@@ -13,8 +11,8 @@
 
 namespace quarvel {
 
-/// Which rows somebody wants gone: one reporter ID's sessions and messages, everything from before
-/// a date, or everything.
+/// The rows to erase: the sessions and messages of one reporter ID, all rows from before a date, or
+/// all rows. A plain value.
 struct ErasureSelection {
   struct All {};
   std::variant<All, std::int64_t, Date> what;
@@ -23,39 +21,35 @@ struct ErasureSelection {
   [[nodiscard]] std::string description() const;
 };
 
-/// Removes rows for good, in steps so small that rows on their way in hardly notice; only those
-/// that were there when it began. Then the file is written anew, in one step that takes a second or
-/// two when it is large, and the write-ahead log emptied, so that neither holds them any more.
-/// Leaves one line in the ledger that says how many they were, and their number in `meta`; ids are
-/// not given again.
+/// Removes rows for good, in steps of a few milliseconds between commits; only rows that existed
+/// when it began. Then rewrites the file, in one step that takes a second or two when the file is
+/// large, and empties the write-ahead log, so that neither holds the rows any more. Adds one line
+/// to the ledger and the number of rows to `meta`. Erased ids are not given again.
 ///
-/// For whoever writes the store: the service's writer, or a tool while there is no service.
+/// Owned by the one process that writes the store: the service (`StoreWriter`, on its thread), or a
+/// tool while no service runs. Lives as long as one erasure.
 class Erasure {
  public:
-  /// Of rows up to the ids `through`. `connection` must outlive this, and so must `lastIDs`, the
-  /// last ones committed at any time.
+  /// Erases rows up to the ids `through`. `connection` and `lastIDs`, which always holds the last
+  /// committed ids, must outlive this.
   Erasure(SqliteConnection& connection, ErasureSelection selection, const StoreIDs& through,
           const StoreIDs& lastIDs, Date now);
-  /// As above for a store that nobody else writes: with the last ids that the file tells.
+  /// The same for a store without a service: takes the last ids from the file.
   Erasure(SqliteConnection& connection, ErasureSelection selection, Date now);
   Erasure(const Erasure&) = delete;
   Erasure& operator=(const Erasure&) = delete;
   ~Erasure();
 
   enum class Progress : std::uint8_t { more, done, failed };
-  /// After `failed` nothing has been changed by this step, and it may be tried again.
+  /// A step that `failed` has changed nothing and may be tried again.
   [[nodiscard]] Progress step();
 
   /// Rows of all kinds that were removed so far.
   [[nodiscard]] std::int64_t rows() const { return rows_; }
   /// Messages and events among those removed since the last call.
   [[nodiscard]] std::uint64_t takeCounted();
-  /// Once done: whether a reader kept the log from being emptied, for longer than one waits.
+  /// After `done`: whether a reader kept the log from being emptied for longer than the time-out.
   [[nodiscard]] bool logRemains() const { return logRemains_; }
-
-  /// Removes the damaged stores that were set aside beside this one, which nobody can pick rows out
-  /// of. Returns how many files went.
-  static std::size_t removeSetAside(const std::filesystem::path& store);
 
  private:
   struct Slice {
@@ -80,7 +74,7 @@ class Erasure {
   const Date now_;
   std::optional<std::int64_t> ledgerLine_;
   std::size_t table_ = 0;   // of kErased, under way
-  std::int64_t after_ = 0;  // what has been looked through of it
+  std::int64_t after_ = 0;  // the last id of it that was searched
   std::int64_t rows_ = 0;
   std::uint64_t counted_ = 0;
   bool rewritten_ = false;

@@ -5,7 +5,7 @@
 #include <algorithm>
 #include <limits>
 
-#include "store/database/StoreCounters.h"
+#include "base/StoreCounters.h"
 
 namespace quarvel {
 
@@ -13,14 +13,11 @@ namespace {
 
 constexpr std::int64_t kEnd = std::numeric_limits<std::int64_t>::max();
 constexpr std::uint64_t kStepBytes = 1 << 20;
+constexpr int kWindowRows = 256;  // a step deletes at most so many of a table: a few milliseconds
 constexpr const char* kVacuumStep = "PRAGMA incremental_vacuum(256)";
 
-constexpr const char* TimeColumn(StoreTable table) {
-  return table == StoreTable::message ? "sent_at" : "recorded_at";
-}
-
-/// A session's row goes after its last message: nothing is sent after the flush, nor in this run
-/// for a session that an earlier run never flushed.
+/// A session's row goes after its last message: no message follows the flush, nor comes in this run
+/// for a session that an earlier run left unflushed.
 constexpr const char* kRemoveSessions =
     "DELETE FROM agent_session WHERE id <= min(?4, (SELECT min(id) + 4096 FROM agent_session))"
     " AND coalesce(flushed_at, CASE WHEN id <= ?1 THEN ?2 END) < "
@@ -35,11 +32,12 @@ bool Retention::prepare(Date now) {
   if (!pageBytes) return false;
   pageBytes_ = static_cast<std::uint64_t>(*pageBytes);
   for (const StoreTable table : kCountedStoreTables) {
+    const TableDescription& described = Describe(table);
     const std::string oldest =
-        fmt::format("SELECT id, {}, length(payload) FROM {} WHERE id <= ?1 ORDER BY id LIMIT 256",
-                    TimeColumn(table), StoreTableName(table));
+        fmt::format("SELECT id, {}, length({}) FROM {} WHERE id <= ?1 ORDER BY id LIMIT {}",
+                    described.timeColumn, JsonColumn(described)->name, described.name, kWindowRows);
     const std::string remove = fmt::format("DELETE FROM {} WHERE id <= ?1 AND {} <= ?2",
-                                           StoreTableName(table), TimeColumn(table));
+                                           described.name, described.timeColumn);
     if (!connection_.prepare(statements_[table].oldest, oldest) ||
         !connection_.prepare(statements_[table].remove, remove)) {
       return false;
@@ -65,7 +63,7 @@ Retention::Progress Retention::step(std::uint64_t incomingBytes, std::optional<E
   if (!pages || !freePages) return Progress::failed;
   const std::uint64_t fileBytes = static_cast<std::uint64_t>(*pages) * pageBytes_;
   const std::uint64_t usedBytes = fileBytes - static_cast<std::uint64_t>(*freePages) * pageBytes_;
-  // Cells, page heads and JSON's quotes come on top of what a row holds.
+  // Cells, page heads and JSON's quotes add about a quarter to a row.
   const std::uint64_t wantedBytes = incomingBytes + incomingBytes / 4;
   Progress progress = Progress::nothingToDo;
   if (usedBytes + wantedBytes > bounds_.maximumBytes) {
@@ -96,8 +94,8 @@ Retention::Progress Retention::removeOldest(std::uint64_t bytes, Removal removal
     const auto found = window(table, std::min(bytes, kStepBytes), removal);
     if (!found) return Progress::failed;
     windows[table] = *found;
-    // What lies between the end of the shortest window and the ends of the others is younger than
-    // rows that the next step will see.
+    // Rows between the end of the shortest window and the ends of the others are younger than rows
+    // that the next step will see.
     removal.through = std::min(removal.through, found->lastTime);
   }
   Removed removed;
@@ -152,7 +150,7 @@ std::optional<Retention::Window> Retention::window(StoreTable table, std::uint64
                                                    const Removal& removal) {
   const auto exported = exportedThrough(table);
   if (!exported) return std::nullopt;
-  Window window{std::min(removal.lastIDs[table], removal.spare ? *exported : kEnd), kEnd,
+  Window window{std::min(removal.lastIDs[table], removal.exportedOnly ? *exported : kEnd), kEnd,
                 *exported};
   SqliteStatement& oldest = statements_[table].oldest.bind(1, window.lastID);
   std::uint64_t found = 0;
@@ -160,7 +158,7 @@ std::optional<Retention::Window> Retention::window(StoreTable table, std::uint64
   SqliteStatement::Step step = oldest.step();
   for (; step == SqliteStatement::Step::row; step = oldest.step()) {
     found += static_cast<std::uint64_t>(oldest.integer(2));
-    if (++rows < 256 && found < bytes) continue;
+    if (++rows < kWindowRows && found < bytes) continue;
     window.lastID = oldest.integer(0);
     window.lastTime = oldest.integer(1);
     oldest.reset();

@@ -14,14 +14,15 @@
 
 namespace quarvel {
 
-/// Keeps the store within its bounds by removing the oldest rows, in steps so small that rows on
-/// their way in hardly notice. Rows that a remote backend has not yet had go last, but they go.
+/// Keeps the store within its bounds by removing the oldest rows, in steps of a few milliseconds
+/// between commits. Rows that a remote backend has not yet received go last, but they go.
 ///
-/// The file holds its bound because room is made before a batch comes in, and because SQLite takes
-/// freed pages again before it lets the file grow. A file that is too large all the same (the bound
-/// was lowered) is vacuumed page by page. The write-ahead log comes on top, a few megabytes.
+/// The file holds its bound because room is made before a batch is written, and because SQLite
+/// reuses freed pages before the file grows. A file that is still too large (the bound was lowered)
+/// is vacuumed page by page. The write-ahead log adds a few megabytes.
 ///
-/// Part of the `StoreDatabase`, whose connection it uses; the writer's thread.
+/// Owned by the `StoreDatabase`, whose connection it uses and with which it lives. The writer's
+/// thread.
 class Retention {
  public:
   struct Bounds {
@@ -30,7 +31,7 @@ class Retention {
     std::vector<std::string> remoteBackends;
   };
 
-  /// `connection` and `lastIDs`, which are those committed, must outlive this.
+  /// `connection` and `lastIDs`, the last committed ids, must outlive this.
   Retention(Bounds bounds, SqliteConnection& connection, const StoreIDs& lastIDs)
       : bounds_(std::move(bounds)),
         connection_(connection),
@@ -40,22 +41,22 @@ class Retention {
   /// Once, before this run of the service has stored anything. False when it failed.
   [[nodiscard]] bool prepare(Date now);
 
-  /// The clock was set: what this run of the service has stored is not as old as it may say. False
-  /// when that could not be kept.
-  [[nodiscard]] bool clockWasSet(Date now) { return clockMarks_.add(now); }
+  /// Records that the clock was set, so that the times of rows from this run of the service are not
+  /// trusted. False when that failed.
+  [[nodiscard]] bool markClockSet(Date now) { return clockMarks_.add(now); }
   struct Expiry {
     Date before;
     StoreIDs trusted;  // beyond these ids nothing is removed for its age
   };
-  /// What is past its age; none when that could not be found.
+  /// The rows past their age, those from before `before`; none when a read failed.
   [[nodiscard]] std::optional<Expiry> expiry(Date now, Date before);
 
   enum class Progress : std::uint8_t { nothingToDo, more, failed };
-  /// One step, in a transaction of its own, towards a file in which rows of about `incomingBytes`
-  /// have room and, when `expired` is given, no row is older than that.
+  /// One step, in a transaction of its own, towards a file with room for about `incomingBytes` and,
+  /// when `expired` is given, without such rows.
   [[nodiscard]] Progress step(std::uint64_t incomingBytes, std::optional<Expiry> expired);
 
-  /// Rows that the steps since the last call removed, and how many of them had not been exported.
+  /// Rows removed by the steps since the last call; `notExported` of them never left the device.
   struct Removed {
     std::uint64_t rows = 0;
     std::uint64_t notExported = 0;
@@ -63,11 +64,11 @@ class Retention {
   [[nodiscard]] Removed takeRemoved() { return std::exchange(removed_, {}); }
 
  private:
-  /// What one run of steps removes.
+  /// The rows that one run of steps may remove.
   struct Removal {
-    std::int64_t through;  // the time of the last rows
-    StoreIDs lastIDs;      // ... and their ids
-    bool spare;            // only what has been exported
+    std::int64_t through;  // up to this time, in microseconds
+    StoreIDs lastIDs;      // up to these ids
+    bool exportedOnly;
   };
   struct Statements {
     SqliteStatement oldest, remove;
@@ -75,8 +76,7 @@ class Retention {
   /// The rows that one step may remove from one table: the oldest, up to an id.
   struct Window {
     std::int64_t lastID = 0;
-    std::int64_t lastTime =
-        0;  // of its last row when there are rows behind it, else the end of time
+    std::int64_t lastTime = 0;  // of its last row; the end of time when no row follows
     std::int64_t exportedThrough = 0;
   };
 

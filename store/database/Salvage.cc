@@ -8,9 +8,6 @@
 #include <string>
 #include <vector>
 
-#include "platform/Log.h"
-#include "store/database/StoreFile.h"
-
 namespace quarvel {
 
 namespace {
@@ -20,40 +17,33 @@ using Step = SqliteStatement::Step;
 constexpr std::int64_t kLastPossibleID = kProvisionalSessions - 1;
 constexpr int kRowsPerCommit = 4096;
 
-struct SalvagedTable {
-  const char* name;
-  int columns;
-  int jsonColumn;  // counted from 1; 0: none
-};
-constexpr std::array<SalvagedTable, 5> kTables{{{"agent_session", 11, 9},
-                                                {"message", 9, 8},
-                                                {"analytics_event", 4, 3},
-                                                {"power_event", 5, 4},
-                                                {"export_log", 9, 0}}};
-
-/// Copies one table, row by row, in the order of ids. Where a damaged page ends the scan, it goes
-/// on with the first id behind it that can be reached.
+/// Copies one table, row by row, in the order of ids. When a damaged page ends the scan, goes on
+/// with the first id behind it that can be reached. Lives on the stack of `Salvage`.
 class TableSalvage {
  public:
-  TableSalvage(const SalvagedTable& table, SqliteConnection& from, SqliteConnection& into)
-      : table_(table), from_(from), into_(into) {}
+  TableSalvage(const TableDescription& table, SqliteConnection& from, SqliteConnection& into)
+      : table_(table),
+        columns_(static_cast<int>(table.columns.size()) + 1),
+        from_(from),
+        into_(into) {}
 
   /// False when the new store takes no more rows.
   bool run() {
-    if (!from_.prepare(scan_,
-                       fmt::format("SELECT * FROM {} WHERE id >= ?1 ORDER BY id", table_.name)) ||
+    if (!from_.prepare(scan_, SelectSql(table_) + " WHERE id >= ?1 ORDER BY id") ||
         !from_.prepare(seek_, fmt::format("SELECT id FROM {} WHERE id >= ?1 ORDER BY id LIMIT 1",
                                           table_.name))) {
       return true;  // nothing can be read
     }
     std::string values = "?1";
-    for (int i = 2; i <= table_.columns; ++i) values += fmt::format(", ?{}", i);
-    if (table_.jsonColumn > 0) values += fmt::format(" WHERE json_valid(?{})", table_.jsonColumn);
+    for (int i = 2; i <= columns_; ++i) values += fmt::format(", ?{}", i);
+    if (const StoreColumn* json = JsonColumn(table_)) {
+      values += fmt::format(" WHERE json_valid(?{})", json - table_.columns.data() + 2);
+    }
     if (!into_.prepare(insert_,
                        fmt::format("INSERT OR IGNORE INTO {} SELECT {}", table_.name, values))) {
       return false;
     }
-    // A damaged page may hold ids that never were.
+    // A damaged page may hold ids that were never given.
     largestGap_ = 256 * from_.integer("PRAGMA page_count").value_or(0);
     expected_ = firstIDs();
     while (scan() == Step::failed && !takesNoMore_ && skipDamage()) {
@@ -94,7 +84,7 @@ class TableSalvage {
 
   bool copyRow() {
     if (uncommitted_ == 0 && !into_.execute("BEGIN IMMEDIATE")) return !(takesNoMore_ = true);
-    for (int i = 0; i < table_.columns; ++i) insert_.bind(i + 1, scan_, i);
+    for (int i = 0; i < columns_; ++i) insert_.bind(i + 1, scan_, i);
     if (!insert_.run()) {
       into_.rollBack();
       return !(takesNoMore_ = true);
@@ -111,7 +101,7 @@ class TableSalvage {
     return !(takesNoMore_ = true);
   }
 
-  /// Whether what stands at `id` or behind it can be reached, and which id that is.
+  /// Whether a row at `id` or behind it can be reached; `found` is its id.
   bool reaches(std::int64_t id, std::int64_t& found) {
     const Step step = seek_.bind(1, id).step();
     found = step == Step::row ? seek_.integer(0) : kLastPossibleID;
@@ -142,21 +132,22 @@ class TableSalvage {
     return true;
   }
 
-  const SalvagedTable& table_;
+  const TableDescription& table_;
+  const int columns_;  // with `id`
   SqliteConnection& from_;
   SqliteConnection& into_;
   SqliteStatement scan_, seek_, insert_;
   std::int64_t next_ = 1;      // where the scan begins
-  std::int64_t expected_ = 0;  // ids are near
+  std::int64_t expected_ = 0;  // the next row's id is near this one
   std::int64_t largestGap_ = 0;
   std::int64_t copied_ = 0;
   int uncommitted_ = 0;
   bool takesNoMore_ = false;
 };
 
-/// What `meta` keeps and the cursors. Of two numbers the larger one is right: they only grow. An id
-/// that has left the device is not given again, though its row may be lost.
-bool Adopt(SqliteConnection& from, SqliteConnection& into) {
+/// Copies `meta` and the cursors. The larger of two numbers is right, since they only grow. An
+/// exported id is not given again, even when its row is lost.
+bool CopyMetaAndCursors(SqliteConnection& from, SqliteConnection& into) {
   SqliteStatement read;
   SqliteStatement write;
   if (from.prepare(read, "SELECT key, value FROM meta")) {
@@ -191,19 +182,19 @@ std::int64_t MetaNumber(SqliteConnection& store, const std::string& key) {
       .value_or(0);
 }
 
-/// One damaged store. False when the new one takes no more.
+/// Copies one damaged store. False when the new one takes no more rows.
 bool Salvage(const std::filesystem::path& damaged, SqliteConnection& into,
-             const std::string& doneKey) {
-  ZQ_FUNCTION("Salvage");
+             const std::string& doneKey, StoreNotices& notices) {
   SqliteConnection from;
   std::int64_t copied = 0;
-  // One that cannot even be opened is done with.
+  // A file that cannot be opened is not tried again.
   if (from.open(damaged)) {
-    // Otherwise SQLite reads nothing of a file that was cut short. Nothing is written to it.
+    // Lets SQLite read a file that was cut short. Nothing is written to it.
     (void)from.execute("PRAGMA writable_schema = ON");
-    if (!Adopt(from, into)) return false;
-    for (const SalvagedTable& table : kTables) {
-      TableSalvage salvage(table, from, into);
+    if (!CopyMetaAndCursors(from, into)) return false;
+    for (const TableDescription* table : kTables) {
+      if (!table->primaryKey.empty()) continue;
+      TableSalvage salvage(*table, from, into);
       const bool done = salvage.run();
       copied += salvage.copied();
       if (!done) return false;
@@ -221,25 +212,28 @@ bool Salvage(const std::filesystem::path& damaged, SqliteConnection& into,
           fmt::format("INSERT OR REPLACE INTO meta VALUES('{}', '{}')", doneKey, copied).c_str())) {
     return false;
   }
-  ZQ_LOG(nullptr, error, "{} rows could be read from the damaged store {}; {} are lost in all.",
-         copied, damaged.string(), MetaNumber(into, StoreDropKey(StoreDrop::damaged)));
+  notices.push_back(
+      {"Salvage",
+       fmt::format("{} rows could be read from the damaged store {}; {} are lost in all.", copied,
+                   damaged.string(), MetaNumber(into, StoreDropKey(StoreDrop::damaged)))});
   return true;
 }
 
 }  // namespace
 
-void SalvageStoresSetAside(const std::filesystem::path& path, SqliteConnection& into) {
-  ZQ_FUNCTION("SalvageStoresSetAside");
+void SalvageStoresSetAside(const std::filesystem::path& path, SqliteConnection& into,
+                           StoreNotices& notices) {
   for (const std::filesystem::path& damaged : StoresSetAside(path)) {
     const std::string doneKey = "salvaged." + damaged.filename().string();
     const auto done =
         into.integer(fmt::format("SELECT count(*) FROM meta WHERE key = '{}'", doneKey));
     if (!done || *done > 0) continue;
-    if (Salvage(damaged, into, doneKey)) continue;
-    ZQ_LOG(nullptr, error,
-           "The rows of the damaged store {} cannot be copied now ({}). Trying again at the next "
-           "start.",
-           damaged.string(), into.message());
+    if (Salvage(damaged, into, doneKey, notices)) continue;
+    notices.push_back(
+        {"SalvageStoresSetAside",
+         fmt::format("The rows of the damaged store {} cannot be copied now ({}). Trying again at "
+                     "the next start.",
+                     damaged.string(), into.message())});
     return;
   }
 }
@@ -256,9 +250,7 @@ bool SettleAccounts(SqliteConnection& store, const StoreIDs& lastIDs, const Stor
     const auto rows = store.integer(fmt::format("SELECT count(*) FROM {}", StoreTableName(table)));
     if (!last || !rows) return false;
     keep(LastIDKey(table), *last);
-    const bool isCounted =
-        std::ranges::find(kCountedStoreTables, table) != kCountedStoreTables.end();
-    if (isCounted) missing += *last - *rows;
+    if (Describe(table).isCounted) missing += *last - *rows;
   }
   for (const StoreDrop reason : {StoreDrop::retention, StoreDrop::erased}) {
     keep(StoreDropKey(reason), static_cast<std::int64_t>(drops[reason]));

@@ -2,22 +2,26 @@
 
 #include <filesystem>
 
+#include "base/StoreCounters.h"
 #include "store/database/Sqlite.h"
-#include "store/database/StoreCounters.h"
+#include "store/database/StoreFile.h"
 #include "store/database/Tables.h"
 
 namespace quarvel {
 
-/// Copies into the store `path`, open as `into`, what can be read of the damaged stores that were
-/// set aside beside it and have not been looked at yet: rows with their ids, the store's own id,
-/// cursors and counters. What lies between two readable parts of a file is lost, and counted. The
-/// damaged files stay as they are. Says in the log what it did. Where it cannot go on, for lack of
-/// room say, it will at the next opening; what is there then is not copied twice.
-void SalvageStoresSetAside(const std::filesystem::path& path, SqliteConnection& into);
+// Saves rows from damaged stores. Called by the thread that opens the store, before any other use
+// of `into`.
 
-/// Has the store's `meta` say that ids up to `lastIDs` have been given, and of what was in the
-/// store: that rows were removed as in `drops`, and that all others which are not there are
-/// damaged. Counts every row. False when it failed.
+/// Copies every readable row of the stores that were set aside beside `path` into the store that
+/// `into` has open, once for each of them: rows with their ids, the store's id, cursors and
+/// counters. Rows between two readable parts of a file are lost, and counted. The damaged files
+/// stay as they are. Adds its results to `notices`. When it has to stop, for lack of room for
+/// example, the next opening goes on and copies no row twice.
+void SalvageStoresSetAside(const std::filesystem::path& path, SqliteConnection& into,
+                           StoreNotices& notices);
+
+/// Counts every row and writes to `meta`: ids up to `lastIDs` have been given, rows were removed as
+/// in `drops`, and all other missing rows are damaged. False when it failed.
 [[nodiscard]] bool SettleAccounts(SqliteConnection& store, const StoreIDs& lastIDs,
                                   const StoreDrops& drops);
 

@@ -17,7 +17,7 @@ using RandomBits = std::array<std::uint8_t, 16>;
 
 RandomBits NewRandomBits() {
   RandomBits bits{};
-  // So few bytes come whole or, interrupted by a signal, not at all.
+  // A signal may interrupt the call, but never leaves 16 bytes half done.
   while (::getrandom(bits.data(), bits.size(), 0) != static_cast<ssize_t>(bits.size())) {
     if (errno != EINTR) std::abort();
   }

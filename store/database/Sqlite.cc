@@ -11,9 +11,12 @@ namespace quarvel {
 
 namespace {
 
-/// After a sync that failed the system takes what it could not write for written, so that the next
-/// sync succeeds and has made nothing safe. What is written once more is written for certain.
-bool WriteAgain(sqlite3_file& file) {
+constexpr int kBusyMilliseconds = 250;          // of the writer: rows wait behind it
+constexpr int kReaderBusyMilliseconds = 5'000;  // of a tool: longer than any commit
+
+/// Rewrites a file. After a failed sync the system drops the pages that it could not write, so that
+/// the next sync succeeds without them; pages written again are synced.
+bool Rewrite(sqlite3_file& file) {
   sqlite3_int64 size = 0;
   if (file.pMethods->xFileSize(&file, &size) != SQLITE_OK) return false;
   std::array<char, 65536> bytes{};
@@ -25,6 +28,21 @@ bool WriteAgain(sqlite3_file& file) {
     at += count;
   }
   return true;
+}
+
+/// The name of a file as a URI that SQLite opens without looking for a log or locks.
+std::string ImmutableUri(std::string_view path) {
+  constexpr std::string_view kDigits = "0123456789ABCDEF";
+  std::string uri = "file:";
+  for (const char byte : path) {
+    if (byte != '%' && byte != '?' && byte != '#') {
+      uri += byte;
+      continue;
+    }
+    const auto value = static_cast<unsigned char>(byte);
+    uri += {'%', kDigits[value >> 4], kDigits[value & 15]};
+  }
+  return uri + "?immutable=1";
 }
 
 }  // namespace
@@ -44,7 +62,7 @@ SqliteStatement& SqliteStatement::bind(int parameter, double real) {
 }
 
 SqliteStatement& SqliteStatement::bind(int parameter, std::string_view text) {
-  // A null pointer would bind NULL, and a view of nothing may hold one.
+  // A null pointer would bind NULL, and an empty view may hold one.
   sqlite3_bind_text64(statement_.get(), parameter, text.empty() ? "" : text.data(), text.size(),
                       nullptr, SQLITE_UTF8);
   return *this;
@@ -130,17 +148,22 @@ void SqliteConnection::Close::operator()(sqlite3* connection) const {
   sqlite3_close_v2(connection);
 }
 
-bool SqliteConnection::open(const std::filesystem::path& path) {
-  // Nobody asks how much memory it uses, and counting takes a lock at each allocation.
+bool SqliteConnection::open(const std::filesystem::path& path, Access access) {
+  // Memory statistics are not used, and take a lock at each allocation.
   static const int uncounted [[maybe_unused]] = sqlite3_config(SQLITE_CONFIG_MEMSTATUS, 0);
   sqlite3* connection = nullptr;
-  const int result =
-      sqlite3_open_v2(path.c_str(), &connection,
-                      SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_EXRESCODE, nullptr);
+  const bool writes = access == Access::readWrite;
+  const std::string name =
+      access == Access::immutable ? ImmutableUri(path.native()) : path.native();
+  const int result = sqlite3_open_v2(name.c_str(), &connection,
+                                     (writes ? SQLITE_OPEN_READWRITE : SQLITE_OPEN_READONLY) |
+                                         (access == Access::immutable ? SQLITE_OPEN_URI : 0) |
+                                         SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_EXRESCODE,
+                                     nullptr);
   connection_.reset(connection);
   if (result != SQLITE_OK) return false;
-  if (sqlite3_db_readonly(connection, "main") == 1) {
-    // SQLite's answer to a file that could not be opened for writing, were it but for a moment.
+  if (writes && sqlite3_db_readonly(connection, "main") == 1) {
+    // SQLite falls back to reading when the file cannot be opened for writing at this moment.
     rolledBackFault_ = SqliteFault::other;
     rolledBackMessage_ = "the file cannot be opened for writing";
     return false;
@@ -154,8 +177,8 @@ bool SqliteConnection::open(const std::filesystem::path& path) {
   path_ = path;
   device_ = status.st_dev;
   inode_ = status.st_ino;
-  sqlite3_busy_timeout(connection, 250);
-  // What is corrupt, or not ours, stays as it was found.
+  sqlite3_busy_timeout(connection, writes ? kBusyMilliseconds : kReaderBusyMilliseconds);
+  // A file that is corrupt, or another program's, stays as it was found.
   sqlite3_db_config(connection, SQLITE_DBCONFIG_NO_CKPT_ON_CLOSE, 1, nullptr);
   sqlite3_wal_hook(
       connection,
@@ -177,6 +200,11 @@ bool SqliteConnection::prepare(SqliteStatement& statement, std::string_view sql)
                                         SQLITE_PREPARE_PERSISTENT, &prepared, nullptr);
   statement = SqliteStatement(prepared);
   return result == SQLITE_OK;
+}
+
+std::string SqliteConnection::fileName() const {
+  const char* name = sqlite3_db_filename(connection_.get(), "main");
+  return name != nullptr ? name : path_.native();
 }
 
 std::optional<std::int64_t> SqliteConnection::integer(std::string_view sql) {
@@ -202,45 +230,45 @@ std::int64_t SqliteConnection::changes() const {
 void SqliteConnection::rollBack() {
   rolledBackFault_ = fault();
   rolledBackMessage_ = message();
-  noteSyncFailure();
+  checkForSyncFailure();
   if (sqlite3_get_autocommit(connection_.get()) == 0) {
     sqlite3_exec(connection_.get(), "ROLLBACK", nullptr, nullptr, nullptr);
   }
 }
 
-void SqliteConnection::noteSyncFailure() {
-  if (sqlite3_extended_errcode(connection_.get()) == SQLITE_IOERR_FSYNC) logIsDoubtful_ = true;
+void SqliteConnection::checkForSyncFailure() {
+  if (sqlite3_extended_errcode(connection_.get()) == SQLITE_IOERR_FSYNC) logSyncFailed_ = true;
 }
 
-SqliteConnection::Moved SqliteConnection::moveLog(int mode) {
-  if (logIsDoubtful_ && !syncLog()) return {};
+SqliteConnection::Checkpoint SqliteConnection::moveLog(int mode) {
+  if (logSyncFailed_ && !syncLog()) return {};
   int logPages = -1;
   int movedPages = -1;
   const int result =
       sqlite3_wal_checkpoint_v2(connection_.get(), "main", mode, &logPages, &movedPages);
-  noteSyncFailure();
+  checkForSyncFailure();
   return {result == SQLITE_OK && logPages == movedPages, movedPages};
 }
 
-SqliteConnection::Moved SqliteConnection::checkpoint() {
+SqliteConnection::Checkpoint SqliteConnection::checkpoint() {
   return moveLog(SQLITE_CHECKPOINT_PASSIVE);
 }
 
 bool SqliteConnection::restartLog() {
-  if (!moveLog(SQLITE_CHECKPOINT_RESTART).all) return false;
+  if (!moveLog(SQLITE_CHECKPOINT_RESTART).complete) return false;
   *logPages_ = 0;
   return true;
 }
 
 bool SqliteConnection::emptyLog() {
-  if (!moveLog(SQLITE_CHECKPOINT_TRUNCATE).all) return false;
+  if (!moveLog(SQLITE_CHECKPOINT_TRUNCATE).complete) return false;
   *logPages_ = 0;
   return true;
 }
 
 void SqliteConnection::checkpointAtClose() {
   emptyLog();
-  if (logIsDoubtful_) return;
+  if (logSyncFailed_) return;
   sqlite3_db_config(connection_.get(), SQLITE_DBCONFIG_NO_CKPT_ON_CLOSE, 0, nullptr);
 }
 
@@ -250,9 +278,9 @@ bool SqliteConnection::syncLog() {
       sqlite3_file_control(connection_.get(), "main", SQLITE_FCNTL_JOURNAL_POINTER, &log);
   if (found != SQLITE_OK) return false;
   if (log == nullptr || log->pMethods == nullptr) return true;
-  if (logIsDoubtful_ && !WriteAgain(*log)) return false;
-  logIsDoubtful_ = log->pMethods->xSync(log, SQLITE_SYNC_NORMAL) != SQLITE_OK;
-  return !logIsDoubtful_;
+  if (logSyncFailed_ && !Rewrite(*log)) return false;
+  logSyncFailed_ = log->pMethods->xSync(log, SQLITE_SYNC_NORMAL) != SQLITE_OK;
+  return !logSyncFailed_;
 }
 
 bool SqliteConnection::hasMoved() const {
@@ -290,6 +318,9 @@ SqliteFault SqliteConnection::currentFault() const {
     case SQLITE_CORRUPT:
     case SQLITE_NOTADB:
       return SqliteFault::corrupt;
+    case SQLITE_CANTOPEN:
+    case SQLITE_READONLY:
+      return SqliteFault::inaccessible;
     default:
       return SqliteFault::other;
   }

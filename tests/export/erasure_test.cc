@@ -3,8 +3,10 @@
 #include <algorithm>
 #include <fstream>
 #include <future>
+#include <thread>
 
 #include "store/database/Erasure.h"
+#include "tests/Interposer.h"
 #include "tests/export/ExportFixture.h"
 
 namespace quarvel::testing {
@@ -27,7 +29,7 @@ class ErasureTest : public ExportFixture {
       ASSERT_TRUE(store_->addMessage({session, sessionID, "client", "music", 1, 2, payload}));
     }
   }
-  /// Begins to erase; what comes of it.
+  /// Begins to erase.
   std::future<Result<std::int64_t>> erase(const ErasureSelection& selection) {
     auto erased = std::make_shared<std::promise<Result<std::int64_t>>>();
     EXPECT_TRUE(store_->erase(selection, [erased](const auto& rows) { erased->set_value(rows); }));
@@ -45,7 +47,7 @@ TEST_F(ErasureTest, LeavesNothingOfWhatWasErasedInTheFilesAndOneLineInTheLedger)
   addSecret(kErasedSession, 1500);
   addMessages(2000);
   ASSERT_TRUE(filesHold("secret") || store_->counters().waiting > 0);
-  EXPECT_EQ(erase({kErasedSession}).get().value(), 1501);
+  EXPECT_EQ(Get(erase({kErasedSession})).value(), 1501);
   EXPECT_FALSE(filesHold("secret"));
   EXPECT_EQ(value("SELECT count(*) FROM message"), "4000");
   EXPECT_THAT(rows("SELECT backend, table_name, first_id, rows, bytes > 100000, outcome FROM "
@@ -63,27 +65,33 @@ TEST_F(ErasureTest, ErasesByDateAndKeepsTheSessionsOfWhatRemains) {
   addSecret(1, 10);
   addMessages(5);
   ASSERT_TRUE(store_->addAnalyticsEvent("old", Payload()));
+  // Kept for a later message, and for its later flush.
   const std::int64_t open = addSession(*store_, 2);
+  const std::int64_t flushed = addSession(*store_, 3);
   runFor(1h);
+  ASSERT_EQ(Get(flush(*store_, flushed)), std::nullopt);
   ASSERT_TRUE(store_->addMessage({open, 2, "c", "s", 1, 2, Payload()}));
   ASSERT_TRUE(store_->addPowerEvent(1, "new", Payload()));
   awaitStored(*store_);
-  EXPECT_EQ(erase({date() - 1min}).get().value(), 10 + 1 + 5 + 1);
-  EXPECT_THAT(rows("SELECT session_id FROM agent_session"), ElementsAre("2"));
+  EXPECT_EQ(Get(erase({date() - 1min})).value(), 10 + 1 + 5 + 1);
+  EXPECT_THAT(rows("SELECT session_id FROM agent_session"), ElementsAre("2", "3"));
   EXPECT_THAT(rows("SELECT session_id FROM message"), ElementsAre("2"));
   EXPECT_EQ(value("SELECT (SELECT count(*) FROM analytics_event) || (SELECT count(*) FROM "
                   "power_event)"),
             "01");
 }
 
-// An id that was given twice would be a repeat to every engine.
-TEST_F(ErasureTest, GivesNoIdTwiceAndExportsWhatComesAfter) {
+// An engine would take a row with an old id for a repeat.
+TEST_F(ErasureTest, GivesNoIdTwiceAndExportsLaterRows) {
   begin();
   engine_.answer = RecordingEngine::down;
   addMessages(10);
   runFor(1s);
-  EXPECT_EQ(erase({}).get().value(), 10);
-  EXPECT_EQ(erase({}).get().value(), 0) << "and leaves its line all the same";
+  std::ofstream(path_.string() + ".corrupt-1") << "secret";
+  std::ofstream(path_.string() + ".corrupt-1-wal") << "secret";
+  EXPECT_EQ(Get(erase({})).value(), 10);
+  EXPECT_FALSE(filesHold("secret")) << "in a store that was set aside";
+  EXPECT_EQ(Get(erase({})).value(), 0) << "but its line is in the ledger";
   begin();
   engine_.answer = RecordingEngine::takeAll;
   addMessages(3);
@@ -97,16 +105,14 @@ TEST_F(ErasureTest, TakesRowsMeanwhileAndErasesNoneOfThem) {
   addMessages(20'000);
   auto erased = erase({});
   addMessages(5000);
-  EXPECT_EQ(erased.get().value(), 20'000);
+  EXPECT_EQ(Get(erased).value(), 20'000);
   EXPECT_EQ(value("SELECT min(id) || ' ' || count(*) FROM message"), "20001 5000");
 }
 
-TEST_F(ErasureTest, WorksOnAStoreThatNobodyHasOpen) {
+TEST_F(ErasureTest, WorksWithoutTheService) {
   begin();
   addSecret(1, 700);
   store_->close();
-  std::ofstream(path_.string() + ".corrupt-1") << "secret";
-  std::ofstream(path_.string() + ".corrupt-1-wal") << "secret";
   {
     SqliteConnection connection;
     ASSERT_TRUE(connection.open(path_));
@@ -114,7 +120,6 @@ TEST_F(ErasureTest, WorksOnAStoreThatNobodyHasOpen) {
     while (erasure.step() == Erasure::Progress::more) continue;
     EXPECT_EQ(erasure.rows(), 701);
   }
-  EXPECT_EQ(Erasure::removeSetAside(path_), 2U);
   EXPECT_FALSE(filesHold("secret"));
   begin();
   EXPECT_EQ(store_->counters().dropped[StoreDrop::erased], 700U);
@@ -122,14 +127,21 @@ TEST_F(ErasureTest, WorksOnAStoreThatNobodyHasOpen) {
   EXPECT_EQ(value("SELECT id FROM message"), "701");
 }
 
-TEST_F(ErasureTest, AClosedStoreSaysThatItWasNotFinished) {
+TEST_F(ErasureTest, AStoreClosedMeanwhileSaysThatItWasNotFinished) {
   begin();
   addMessages(5000);
+  Interposer& files = Interposer::watch(directory_);
+  begin();
+  files.hold();
   auto erased = erase({});
-  store_->close();
-  const auto result = erased.get();
-  EXPECT_TRUE(result.ok() ||
-              result.error().description().find("before all was erased") != std::string::npos);
+  Await([&] { return files.holdsOne(); });
+  std::thread closing([this] { store_->close(); });
+  Await([this] { return !store_->isOpen(); });
+  files.release();
+  closing.join();
+  const auto result = Get(erased);
+  ASSERT_FALSE(result);
+  EXPECT_THAT(result.error().description(), ::testing::HasSubstr("before all was erased"));
 }
 
 }  // namespace

@@ -250,8 +250,11 @@ class Otlp(ServiceTest):
             self.assertNotEqual(service.ctl("erase", *wrong).returncode, 0, wrong)
 
         service.end()
+        set_aside = service.directory / "state/telemetry.db.corrupt-1"
+        set_aside.write_text('"n":')
         erased = service.ctl("erase", "--all", "--json")
         self.assertEqual(erased.returncode, 0, erased.stderr)
+        self.assertFalse(set_aside.exists())
         self.assertEqual(service.count("message") + service.count("agent_session"), 0)
         self.assertNotIn(b'"n":', (service.directory / "state/telemetry.db").read_bytes())
 

@@ -78,7 +78,7 @@ Outcome RelmReporting::sendOneMessage(const Dictionary&, const Dictionary&, std:
 }
 
 void CountAcceptedMessage() {}
-void CountDroppedMessage(MessageDrop) {}
+void CountDroppedMessage(StoreDrop) {}
 void AddToGauge(Gauge gauge, int difference) {
   static std::array<std::atomic<int>, 3> gauges{};
   const int now = gauges[static_cast<std::size_t>(gauge)] += difference;

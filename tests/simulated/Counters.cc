@@ -8,7 +8,7 @@ void CountAcceptedMessage() {
   ++Simulation::current().counters.accepted;
 }
 
-void CountDroppedMessage(MessageDrop reason) {
+void CountDroppedMessage(StoreDrop reason) {
   ++Simulation::current().counters.dropped[static_cast<std::size_t>(reason)];
 }
 

@@ -132,7 +132,7 @@ struct SimulatedCounters {
   std::array<std::uint64_t, 3> dropped{};
   std::array<std::int64_t, 3> gauges{};
 
-  [[nodiscard]] std::uint64_t of(MessageDrop reason) const {
+  [[nodiscard]] std::uint64_t of(StoreDrop reason) const {
     return dropped[static_cast<std::size_t>(reason)];
   }
 };

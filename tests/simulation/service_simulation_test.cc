@@ -431,9 +431,9 @@ class World {
            "accepted messages differ from delivered and dropped ones");
     expect(counters.accepted == counts_.accepted + model_.unroutable,
            "accepted messages are miscounted");
-    const std::size_t forType = counters.of(MessageDrop::testServiceType);
-    expect(counters.of(MessageDrop::noSuchSession) == model_.unroutable &&
-               forType + counters.of(MessageDrop::noAgentSession) == counts_.dropped &&
+    const std::size_t forType = counters.of(StoreDrop::testServiceType);
+    expect(counters.of(StoreDrop::noSuchSession) == model_.unroutable &&
+               forType + counters.of(StoreDrop::noAgentSession) == counts_.dropped &&
                forType >= counts_.droppedForType &&
                forType <= counts_.droppedForType + counts_.droppedAmbiguously,
            "dropped messages are miscounted");

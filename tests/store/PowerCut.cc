@@ -7,11 +7,11 @@ namespace quarvel::testing {
 
 namespace {
 
-using Kind = FileCalls::Change::Kind;
+using Kind = Interposer::Change::Kind;
 
 constexpr std::size_t kSector = 512;
 
-/// Not on a medium, whatever its file system.
+/// Shared memory, which never reaches a medium.
 bool IsSharedMemory(const std::string& path) {
   return path.ends_with("-shm");
 }
@@ -39,7 +39,6 @@ bool PowerCut::advance() {
       files_[names_.at(change.path)].pending.push_back({&change});
       break;
     case Kind::sync:
-      if (!syncs_) break;
       if (const auto file = names_.find(change.path); file != names_.end()) {
         syncFile(files_[file->second], change);
       } else if (!change.failed) {

@@ -6,24 +6,23 @@
 #include <string>
 #include <vector>
 
-#include "tests/store/FileCalls.h"
+#include "tests/Interposer.h"
 
 namespace quarvel::testing {
 
-/// Walks through a record of changes and tells what could be on the medium if power were cut then.
+/// Walks through a record of changes and makes images of the medium after a power cut. Owned by a
+/// test; one thread.
 ///
-/// What was there when a sync began that has ended is there. Of a file's other changes each is
-/// there or not, whatever is newer, and of a write any part, in sectors of 512 bytes. Of the
-/// changes to names the first few are there, as journaling file systems keep them in order. A sync
-/// that failed makes nothing safe, and no later one either: the system has given up what it could
-/// not write.
+/// An image holds all changes from before the beginning of a sync that has ended. Any other change
+/// of a file may be missing, whether or not newer ones are there, and any part of a write, in
+/// sectors of 512 bytes. The first few changes of names are there: journaling file systems keep
+/// their order. After a failed sync the changes before it are never durable: the system has dropped
+/// the pages that it could not write.
 class PowerCut {
  public:
-  using Change = FileCalls::Change;
+  using Change = Interposer::Change;
 
-  /// With `syncs` false, nothing was ever synced.
-  PowerCut(const std::vector<Change>& record, bool syncs = true)
-      : record_(record), next_(record.begin()), syncs_(syncs) {}
+  explicit PowerCut(const std::vector<Change>& record) : record_(record), next_(record.begin()) {}
 
   /// Goes on to the moment after the next change; false at the end.
   bool advance();
@@ -32,7 +31,7 @@ class PowerCut {
   /// Names and contents of the files.
   using Image = std::map<std::string, std::string>;
   [[nodiscard]] Image image(Survival survival, std::mt19937& random) const;
-  /// What is promised at this moment.
+  /// The promise at this moment.
   [[nodiscard]] off_t promised() const { return promised_; }
 
  private:
@@ -54,7 +53,6 @@ class PowerCut {
 
   const std::vector<Change>& record_;
   std::vector<Change>::const_iterator next_;
-  const bool syncs_;
   off_t promised_ = 0;
   std::vector<File> files_;
   Names names_;      // as the program sees them

@@ -6,7 +6,7 @@
 #include <iterator>
 #include <memory>
 
-#include "tests/store/FileCalls.h"
+#include "tests/Interposer.h"
 
 namespace quarvel::testing {
 
@@ -43,7 +43,7 @@ std::vector<std::string> RunSql(const std::filesystem::path& path, const std::st
 StoreFixture::StoreFixture(bool memory) : made_(Medium(memory)) {}
 
 StoreFixture::~StoreFixture() {
-  FileCalls::watch({});
+  Interposer::watch({});
 }
 
 void StoreFixture::put(const Files& files) const {

@@ -6,6 +6,7 @@
 #include <filesystem>
 #include <future>
 #include <map>
+#include <stdexcept>
 #include <string>
 #include <thread>
 #include <vector>
@@ -16,22 +17,38 @@
 
 namespace quarvel::testing {
 
-/// Waits until it is so.
+/// The longest wait of a test.
+inline constexpr std::chrono::seconds kNever{60};
+
+/// Waits for a condition.
 template <class Condition>
 void Await(Condition condition) {
-  while (!condition()) std::this_thread::sleep_for(std::chrono::microseconds(100));
+  const auto never = std::chrono::steady_clock::now() + kNever;
+  while (!condition()) {
+    if (std::chrono::steady_clock::now() > never) throw std::runtime_error("waited in vain");
+    std::this_thread::sleep_for(std::chrono::microseconds(100));
+  }
+}
+/// Waits for the value of a future.
+template <class Future>
+auto Get(Future&& future) {
+  if (future.wait_for(kNever) != std::future_status::ready) {
+    throw std::runtime_error("waited in vain");
+  }
+  return future.get();
 }
 
-/// A directory of its own for each test, and what its store holds, as another program reads it.
+/// A directory of its own for each test, and the content of its store, read as another program
+/// does.
 class StoreFixture : public ::testing::Test {
  protected:
-  /// `memory`: on a medium that costs nothing, when there is one.
+  /// `memory`: in memory, where the system has a file system for that.
   explicit StoreFixture(bool memory = false);
   ~StoreFixture() override;
 
   /// Files by name.
   using Files = std::map<std::string, std::string>;
-  /// Has these files in the directory and nothing else.
+  /// Makes these the only files in the directory.
   void put(const Files& files) const;
   [[nodiscard]] Files files() const;
 
@@ -48,7 +65,7 @@ class StoreFixture : public ::testing::Test {
   }
   static std::int64_t addSession(TelemetryStore& store, std::int64_t sessionID = 1,
                                  const Payload& userInfo = {});
-  /// Begins to flush an agent session; what comes of it.
+  /// Begins to flush an agent session.
   static std::future<std::optional<Error>> flush(TelemetryStore& store, std::int64_t session);
 
  private:

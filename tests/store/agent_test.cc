@@ -7,17 +7,15 @@
 #include <thread>
 
 #include "store/EventSinks.h"
-#include "store/database/SecureRandom.h"
-#include "store/database/StoreError.h"
+#include "store/database/StoreFile.h"
 #include "tests/FolderPlatform.h"
-#include "tests/store/FileCalls.h"
+#include "tests/Interposer.h"
 #include "tests/store/StoreFixture.h"
 
 namespace quarvel::testing {
 namespace {
 
 using ::testing::ElementsAre;
-using ::testing::MatchesRegex;
 using ::testing::Optional;
 using ::testing::StartsWith;
 
@@ -28,11 +26,11 @@ class AgentTest : public StoreFixture {
   static std::optional<Error> flush(RelmReportingSession& session) {
     std::promise<std::optional<Error>> done;
     session.flushMessages([&done](const std::optional<Error>& error) { done.set_value(error); });
-    return done.get_future().get();
+    return Get(done.get_future());
   }
 };
 
-// A row that the database would refuse, for a NULL say, would stop every row behind it.
+// A row that the database refuses, for a NULL for example, would stop every row behind it.
 TEST_F(AgentTest, MissingAndMisshapenInformationStillMakesARow) {
   TelemetryAgent agent(store_, {"store"});
   const Dictionary odd{
@@ -59,11 +57,11 @@ TEST_F(AgentTest, ConfigurationFindsTheBackendsThatCanTakeDataNow) {
       EXPECT_NE(std::this_thread::get_id(), asking);
       answer.set_value(backends);
     });
-    return answer.get_future().get();
+    return Get(answer.get_future());
   };
   EXPECT_THAT(found({"store"}), Optional(ElementsAre("store")));
   EXPECT_THAT(found({"nats", "otlp"}), Optional(ElementsAre("nats", "otlp")))
-      << "whatever the network is like";
+      << "with or without a network";
   EXPECT_EQ(found({}), std::nullopt);
   store_->close();
   EXPECT_EQ(found({"store"}), std::nullopt);
@@ -84,22 +82,15 @@ TEST_F(AgentTest, AClosedStoreIsAnErrorForEveryOperation) {
   EXPECT_FALSE(agent.sendOneMessage({}, {}, 1, 1, Payload()));
 }
 
-TEST_F(AgentTest, TokensAreDifferentAndBelowTheirParents) {
-  const std::string parent = NewHierarchyToken(std::nullopt);
-  EXPECT_THAT(parent, MatchesRegex("[0-9a-f]{32}"));
-  EXPECT_NE(parent, NewHierarchyToken(std::nullopt));
-  EXPECT_THAT(NewHierarchyToken(parent), StartsWith(parent + "."));
-}
-
-TEST_F(AgentTest, EventsWaitForRoomInTheirOrderAndTheirSendersDoNot) {
+TEST_F(AgentTest, EventsWaitForRoomInOrderAndTheirSendersDoNot) {
   store_->close();
-  FileCalls& files = FileCalls::watch(directory_);
+  Interposer& files = Interposer::watch(directory_);
   store_ = open({.queueRows = 2});
-  EventQueue path(store_);
+  EventQueue events(store_);
   files.hold();
   for (int i = 0; i < 20; ++i) {
-    path.addAnalyticsEvent(std::to_string(i), Payload());
-    path.addPowerEvent(28, std::to_string(i), Payload());
+    events.addAnalyticsEvent(std::to_string(i), Payload());
+    events.addPowerEvent(28, std::to_string(i), Payload());
   }
   files.release();
   ASSERT_TRUE(FolderQueues().drain(std::chrono::steady_clock::now() + std::chrono::seconds(60)));

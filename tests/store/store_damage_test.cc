@@ -18,7 +18,7 @@ using namespace std::chrono_literals;
 constexpr std::size_t kPage = 4096;
 constexpr int kRows = 3'000;
 
-/// Stores whose files are damaged, and what becomes of their rows.
+/// Stores whose files are damaged.
 class DamageTest : public StoreFixture {
  protected:
   DamageTest() : StoreFixture(true) { LogRecorder::take(); }
@@ -79,7 +79,7 @@ const Damage kDamages[] = {
      [](std::string& content, std::mt19937& random) { content.resize(random() % content.size()); }},
 };
 
-TEST_F(DamageTest, AStoreAlwaysOpensAndKeepsWhatCanBeRead) {
+TEST_F(DamageTest, AStoreAlwaysOpensAndKeepsReadableRows) {
   fill();
   const char* nightly = std::getenv("QUARVEL_NIGHTLY");
   const int cases = nightly != nullptr && std::string_view(nightly) == "1" ? 4'000 : 200;
@@ -103,7 +103,7 @@ TEST_F(DamageTest, AStoreAlwaysOpensAndKeepsWhatCanBeRead) {
       for (const auto& file : StoresSetAside(path_)) {
         ++setAside;
         EXPECT_EQ(files()[file.filename()], found["telemetry.db"])
-            << "what is set aside stays as it is";
+            << "a file that is set aside stays as it is";
         EXPECT_EQ(value("SELECT count(*) FROM message"), std::to_string(counters.stored));
         EXPECT_EQ(value("PRAGMA integrity_check"), "ok");
       }

@@ -4,17 +4,17 @@
 #include <cstdlib>
 
 #include "store/database/Sqlite.h"
+#include "tests/Interposer.h"
 #include "tests/LogRecorder.h"
-#include "tests/store/FileCalls.h"
 #include "tests/store/StoreFixture.h"
 
 namespace quarvel::testing {
 namespace {
 
 using namespace std::chrono_literals;
-using Purpose = FileCalls::Purpose;
+using Purpose = Interposer::Purpose;
 
-/// Lets each call that a store makes for its files fail, one after the other, once or from then on.
+/// Makes each call of a store for its files fail, one after the other, once or from then on.
 class FaultTest : public StoreFixture {
  protected:
   FaultTest() : StoreFixture(true) {}
@@ -34,7 +34,7 @@ class FaultTest : public StoreFixture {
     }
   }
 
-  /// A store that an end of the process has left behind: with a write-ahead log.
+  /// A store that a killed process has left behind, with a write-ahead log.
   Files leftBehind() {
     begin({});
     auto store = open(options());
@@ -45,10 +45,10 @@ class FaultTest : public StoreFixture {
     return left;
   }
 
-  /// A life of a store with one fault. Returns whether the fault struck.
-  bool live(const Files& found, const FileCalls::Fault& fault) {
+  /// Runs a store with one fault. Returns whether a call failed.
+  bool live(const Files& found, const Interposer::Fault& fault) {
     begin(found);
-    FileCalls& calls = FileCalls::watch(directory_);
+    Interposer& calls = Interposer::watch(directory_);
     calls.inject(fault);
     TelemetryStore::Options own = options();
     own.path = path_;
@@ -70,19 +70,19 @@ class FaultTest : public StoreFixture {
     });
     calls.lift();
     if (!resumes(store)) return true;
-    EXPECT_EQ(flushed.get(), std::nullopt);
-    // Once more, so that a fault that has not struck yet may strike on the way out.
+    EXPECT_EQ(Get(flushed), std::nullopt);
+    // Again, so that a fault that no call has met yet may hit the closing.
     if (calls.failedCalls() == 0) calls.inject(fault);
     send(store, 2);
     store.close();
     const bool struck = calls.failedCalls() > 0;
     calls.lift();
-    FileCalls::watch({});
+    Interposer::watch({});
     inspect(store.counters(), found.empty() ? 0 : 20);
     return struck;
   }
 
-  /// Whether the store takes rows again, within a time that means never.
+  /// Whether the store takes rows again within 30 s.
   bool resumes(const TelemetryStore& store) {
     const auto never = std::chrono::steady_clock::now() + 30s;
     Await(
@@ -95,13 +95,13 @@ class FaultTest : public StoreFixture {
     const std::uint64_t lost = counters.dropped[StoreDrop::storeClosed];
     EXPECT_EQ(counters.accepted, before + 12);
     EXPECT_EQ(counters.accepted, counters.stored + counters.dropped.sum());
-    EXPECT_LE(lost, 2U) << "only what came when the store was closed";
+    EXPECT_LE(lost, 2U) << "only rows that came when the store was closed";
     EXPECT_EQ(counters.accepted, counters.stored + lost + counters.dropped[StoreDrop::retention]);
     SqliteConnection connection;
     ASSERT_TRUE(connection.open(path_)) << connection.message();
     EXPECT_EQ(connection.text("SELECT group_concat(integrity_check) FROM pragma_integrity_check"),
               "ok");
-    // A commit whose sync fails is not counted, but may well be there.
+    // A commit whose sync fails is not counted, but its rows may be there.
     const auto accountedFor = static_cast<std::uint64_t>(
         connection
             .integer("SELECT (SELECT count(*) FROM message) +"
@@ -125,7 +125,7 @@ class FaultTest : public StoreFixture {
 TEST_F(FaultTest, AtNoCallIsARowLostOrTheServiceStuck) {
   struct Mode {
     const char* name;
-    FileCalls::Fault fault;
+    Interposer::Fault fault;
   };
   const Mode modes[] = {
       {"EIO once", {.error = EIO}},
@@ -143,7 +143,7 @@ TEST_F(FaultTest, AtNoCallIsARowLostOrTheServiceStuck) {
     const Files& found;
     std::chrono::milliseconds sync;
   };
-  // Where a commit is not safe by itself, a flush is synced beside the writer.
+  // Commits that do not sync by themselves have flushes synced beside the writer.
   const Files none;
   const Beginning beginnings[] = {{"a new store", none, 0ms},
                                   {"a store left behind", found, 0ms},
@@ -156,7 +156,7 @@ TEST_F(FaultTest, AtNoCallIsARowLostOrTheServiceStuck) {
     sync_ = beginning.sync;
     for (const Mode& mode : modes) {
       std::size_t at = 0;
-      for (FileCalls::Fault fault = mode.fault;; fault.at = at += step) {
+      for (Interposer::Fault fault = mode.fault;; fault.at = at += step) {
         SCOPED_TRACE(fmt::format("{}, {}, call {}", beginning.name, mode.name, at));
         if (!live(beginning.found, fault)) break;
         if (HasFailure()) {

@@ -7,8 +7,8 @@
 #include <set>
 #include <thread>
 
+#include "tests/Interposer.h"
 #include "tests/transport/ConnectionFixture.h"
-#include "tests/transport/SocketCalls.h"
 
 // Every system call of the listener and its connections fails, once or for ever: the service
 // reports why it cannot start, or it goes on and serves a good client as soon as the fault is over.
@@ -16,7 +16,7 @@
 namespace quarvel {
 namespace {
 
-using testing::SocketCalls;
+using testing::Interposer;
 
 struct Site {
   const char* function;
@@ -75,12 +75,13 @@ void BeClients(const std::filesystem::path& path) {
 /// One life of a service, from start to end, with at most one fault.
 class Life {
  public:
-  explicit Life(const std::optional<SocketCalls::Fault>& fault) {
-    SocketCalls::instance().begin(fault);
+  explicit Life(const std::optional<Interposer::Fault>& fault) {
+    Interposer& calls = Interposer::watch();
+    if (fault) calls.inject(*fault);
     Configuration::Limits limits;
     limits.frame = std::chrono::milliseconds(10);
     Service service(limits, true, [](const Service::Work& work) {
-      const SocketCalls::Watched watched;
+      const Interposer::WatchedThread watched;
       work();
     });
     if (service.failure) {
@@ -90,10 +91,10 @@ class Life {
     }
     const Client bystander = service.connect();
     BeClients(service.socketPath());
-    countsWhileFailing_ = SocketCalls::instance().counts();
+    countsWhileFailing_ = calls.calls();
     if (fault && fault->forever) {
       expectNoBusyLoop();
-      SocketCalls::instance().lift();
+      calls.lift();
     }
     // A single fault may hit the first one.
     if (!service.connect().isServed() && !service.connect().isServed()) {
@@ -115,7 +116,7 @@ class Life {
     const auto callsMade = [] {
       std::this_thread::sleep_for(std::chrono::milliseconds(20));
       std::size_t sum = 0;
-      for (const auto& [function, count] : SocketCalls::instance().counts()) sum += count;
+      for (const auto& [function, count] : Interposer::instance().calls()) sum += count;
       return sum;
     };
     const std::size_t before = callsMade();
@@ -131,7 +132,7 @@ class Life {
 TEST(ConnectionFaults, EveryCallMayFail) {
   const Life faultless(std::nullopt);
   ASSERT_EQ(faultless.finding(), "");
-  const auto counts = SocketCalls::instance().counts();
+  const auto counts = Interposer::instance().calls();
   std::set<std::string> known;
   for (const Site& site : kSites) known.insert(site.function);
   for (const auto& [function, count] : counts) {
@@ -155,9 +156,10 @@ TEST(ConnectionFaults, EveryCallMayFail) {
           for (int attempt = 0; attempt < 5 && !reached; ++attempt) {
             SCOPED_TRACE(fmt::format("{} {} fails with {}{}", site.function, at, error,
                                      forever ? " for ever" : ""));
-            const Life life(SocketCalls::Fault{site.function, at, error, forever});
+            const Life life(Interposer::Fault{
+                .at = at, .error = error, .forever = forever, .function = site.function});
             EXPECT_EQ(life.finding(), "");
-            reached = SocketCalls::instance().failed() > 0;
+            reached = Interposer::instance().failedCalls() > 0;
             refusals += life.refused() ? 1U : 0U;
           }
           ++(reached ? points : missed);

@@ -8,25 +8,26 @@
 
 namespace quarvel {
 
-/// Why a message or event is not in the store.
+/// Why an accepted message or event is not in the store. The status and the platform's counters use
+/// the same reasons.
 enum class StoreDrop : std::uint8_t {
-  // Before it reached the store. Counts since the store was made.
-  noAgentSession,
-  testServiceType,
-  noSuchSession,
-  serviceEnded,  // it was still on its way to the store
-  // After it had been stored. Counts since the store was made.
+  // Before the row reached the store. Counted since the store was made.
+  noAgentSession,   // its session found no backend
+  testServiceType,  // messages of the service type "test" are not sent
+  noSuchSession,    // it named a session that does not exist
+  serviceEnded,     // it had not reached the store when the service ended
+  // After the row was stored. Counted since the store was made.
   retention,
   erased,
   damaged,  // the file was corrupt, and the row could not be read from it
-  // The store took no more. Counts since it was opened, there being no place to keep them.
-  refused,      // its sender got an error
-  storeClosed,  // it waited for a disk that had no room to the end
+  // Refused by the store. Counted since the opening: no file could take the count.
+  refused,      // the sender got an error
+  storeClosed,  // the disk was full until the store was closed
 };
 
 inline constexpr std::size_t kStoreDrops = 9;
 
-/// The name of a reason in the status and, as `dropped.<name>`, in `meta`.
+/// The name of a reason in the status and, as `dropped.<name>`, in the table `meta`.
 [[nodiscard]] constexpr const char* StoreDropName(StoreDrop reason) {
   constexpr std::array<const char*, kStoreDrops> kNames{
       "no_agent_session", "test",    "no_such_session", "service_ended", "retention",
@@ -37,13 +38,14 @@ inline constexpr std::size_t kStoreDrops = 9;
   return std::string("dropped.") + StoreDropName(reason);
 }
 
-/// Those that the writer keeps in `meta`, with its next commit.
+/// Written to `meta` by the store's writer with its next commit.
 inline constexpr std::array kDropsBeforeStore{StoreDrop::noAgentSession, StoreDrop::testServiceType,
                                               StoreDrop::noSuchSession, StoreDrop::serviceEnded};
-/// Those that whoever takes rows out of the store keeps in `meta`, in the same transaction.
+/// Written to `meta` in the transaction that removes the rows.
 inline constexpr std::array kDropsFromStore{StoreDrop::retention, StoreDrop::erased,
                                             StoreDrop::damaged};
 
+/// A count for each reason. A plain value.
 class StoreDrops {
  public:
   std::uint64_t& operator[](StoreDrop reason) { return each_[static_cast<std::size_t>(reason)]; }
@@ -59,12 +61,12 @@ class StoreDrops {
   std::array<std::uint64_t, kStoreDrops> each_{};
 };
 
-/// What has become of the messages and events that the service accepted, since the store was made.
-/// accepted = stored + waiting + dropped.
+/// The messages and events that the service has accepted since the store was made. Always:
+/// accepted = stored + waiting + dropped. A plain value.
 struct StoreCounters {
   std::uint64_t accepted = 0;
   std::uint64_t stored = 0;   // in the database now
-  std::uint64_t waiting = 0;  // in the store's queue, or on their way to it
+  std::uint64_t waiting = 0;  // in the store's queue, or accepted and not queued yet
   StoreDrops dropped;
 
   bool operator==(const StoreCounters&) const = default;
