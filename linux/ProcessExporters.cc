@@ -1,5 +1,6 @@
 #include "linux/ProcessExporters.h"
 
+#include <array>
 #include <chrono>
 #include <memory>
 #include <string>
@@ -8,6 +9,8 @@
 #include <vector>
 
 #include "export/EngineModule.h"
+#include "export/nats/NatsSettings.h"
+#include "export/otlp/OtlpSettings.h"
 #include "linux/ProcessStore.h"
 #include "platform/Log.h"
 #include "platform/Notifications.h"
@@ -23,11 +26,16 @@ namespace {
 /// Long enough for an engine to notice; what is under way then is repeated at the next start.
 constexpr std::chrono::milliseconds kEndMayTake{500};
 
-Exporters::Backend Made(const std::string& name, const Configuration::Agent& agent) {
-  Exporters::Backend backend{{name, agent.drainRowsPerSecond},
-                             LoadEngine(name, agent, DescribeDevice(agent.device))};
-  backend.options.gather = name == "nats" ? agent.nats.gather : agent.otlp.gather;
-  return backend;
+// A new engine is one line here and one folder in export/.
+constexpr std::array kRemoteBackends{
+    RemoteBackend{"nats", ReadNatsSettings},
+    RemoteBackend{"otlp", ReadOtlpSettings},
+};
+
+Exporters::Backend MakeBackend(const std::string& name, const Configuration::Agent& agent) {
+  const BackendSettings& settings = *agent.settings.at(name);
+  return {{name, agent.drainRowsPerSecond, settings.gather},
+          LoadEngine(name, settings, DescribeDevice(agent.device))};
 }
 
 template <class T>
@@ -81,7 +89,8 @@ void FollowConsent(Exporters& exporters) {
 Exporters& Started() {
   const Configuration::Agent& agent = Configuration::process().agent;
   std::vector<Exporters::Backend> backends;
-  for (const std::string& name : agent.remoteBackends()) backends.push_back(Made(name, agent));
+  for (const std::string& name : agent.remoteBackends())
+    backends.push_back(MakeBackend(name, agent));
   const bool none = backends.empty();
   auto& exporters = *new Exporters(*ProcessTelemetryStore(), std::move(backends), agent.exports);
   if (none) return exporters;
@@ -94,6 +103,10 @@ Exporters& Started() {
 }
 
 }  // namespace
+
+std::span<const RemoteBackend> RemoteBackends() {
+  return kRemoteBackends;
+}
 
 Exporters& ProcessExporters() {
   static Exporters& exporters = Started();

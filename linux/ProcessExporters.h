@@ -1,8 +1,14 @@
 #pragma once
 
+#include <span>
+
 #include "export/Exporters.h"
+#include "system/Configuration.h"
 
 namespace quarvel {
+
+/// The engines that the service knows, for its configuration. Constant.
+[[nodiscard]] std::span<const RemoteBackend> RemoteBackends();
 
 /// The process's exporters, one for each remote backend that is configured; started on first use,
 /// which the service makes once its store is open. They follow `[agent] export`, which is read

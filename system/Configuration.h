@@ -5,20 +5,38 @@
 #include <cstdint>
 #include <filesystem>
 #include <map>
+#include <memory>
+#include <span>
 #include <string>
 #include <string_view>
-#include <variant>
 #include <vector>
 
 #include "base/Error.h"
 #include "platform/Log.h"
+#include "system/ConfigurationSection.h"
 
 namespace quarvel {
 
-/// The platform configuration, quarvel.toml. Every key is optional.
+/// Settings of one remote backend, a backend that is fed from the store. Each engine derives its
+/// own struct from this; the rest of the service sees nothing else of it.
+struct BackendSettings {
+  virtual ~BackendSettings() = default;
+
+  std::chrono::seconds gather{0};  // how long rows are collected before a batch is sent
+};
+
+/// A remote backend that [agent] may name, and the reader of its section [agent.<name>].
+struct RemoteBackend {
+  std::string_view name;
+  /// Reads and checks the section, which may be absent. Never null.
+  std::shared_ptr<const BackendSettings> (*readSettings)(ConfigurationSection& section);
+};
+
+/// The platform configuration, quarvel.toml; every key is optional. A value type. The process's own
+/// (`process`) is read once and constant, so that any thread may use it.
 struct Configuration {
   /// [device]: the device properties.
-  std::map<std::string, std::variant<bool, std::int64_t, std::string>, std::less<>> device;
+  std::map<std::string, ConfigurationSection::Scalar, std::less<>> device;
 
   LogLevel logLevel = LogLevel::standard;
 
@@ -29,41 +47,15 @@ struct Configuration {
     std::chrono::days maximumAge{14};
   } store;
 
-  /// Files in PEM; empty: the system's authorities, and no certificate of one's own.
-  struct Tls {
-    std::filesystem::path authority, certificate, key;
-  };
-  /// The backend "nats".
-  struct Nats {
-    std::vector<std::string> urls{"nats://localhost:4222"};
-    std::string stream = "QUARVEL";  // empty: whichever has the subject, and nobody checks
-    bool createStream = false;       // with the next two
-    int replicas = 3;
-    std::chrono::seconds duplicateWindow{120};
-    std::filesystem::path credentials;  // empty: none
-    Tls tls;
-    std::chrono::seconds acknowledge{10};  // how long acknowledgements may take
-    std::chrono::seconds gather{0};        // how long rows are collected before they are sent
-  };
-  /// The backend "otlp".
-  struct Otlp {
-    std::string endpoint = "http://localhost:4318";
-    std::map<std::string, std::string> headers;
-    bool gzip = true;
-    Tls tls;
-    std::chrono::seconds connect{5};
-    std::chrono::seconds timeout{10};  // of a whole request
-    std::chrono::seconds gather{0};
-  };
   struct Agent {
     std::vector<std::string> backends{"store"};
     bool exports = true;
     std::uint32_t drainRowsPerSecond = 2000;
     std::string device;  // empty: the host's name
-    Nats nats;
-    Otlp otlp;
+    /// Of each remote backend that the service knows, whether or not `backends` names it.
+    std::map<std::string, std::shared_ptr<const BackendSettings>, std::less<>> settings;
 
-    /// Those of `backends` that are fed from the store.
+    /// The names in `backends` that are fed from the store.
     [[nodiscard]] std::vector<std::string> remoteBackends() const;
   } agent;
 
@@ -95,17 +87,23 @@ struct Configuration {
     std::size_t firstTurn = 16;
   } limits;
 
-  /// The process's configuration, read on first use. When the file has an error, says so on
-  /// standard error (file, line, key, what is allowed) and ends the process with status 1. Unknown
-  /// keys are warnings in the log.
+  /// Names the remote backends of this process's configuration, with `std::span` over constant
+  /// data. Before the first `process`; without it "store" is the only backend.
+  static void setRemoteBackends(std::span<const RemoteBackend> backends);
+
+  /// The process's configuration, read on first use. An error in the file goes to the log (file,
+  /// line, key and the allowed values) and ends the process with status 1. Unknown keys are
+  /// warnings in the log.
   [[nodiscard]] static const Configuration& process();
 
-  /// Reads the process's file again, for what may change while it runs; `process` stays as it was.
+  /// Reads the process's file again, for values that may change at run time; `process` stays as it
+  /// was.
   [[nodiscard]] static Result<Configuration> readAgain();
 
   /// Reads one file; a missing file yields the defaults. `warnings` receives a sentence for each
   /// unknown key. Errors: domain "quarvel.configuration".
   [[nodiscard]] static Result<Configuration> read(const std::filesystem::path& file,
+                                                  std::span<const RemoteBackend> backends,
                                                   std::vector<std::string>& warnings);
 };
 

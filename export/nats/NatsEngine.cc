@@ -149,8 +149,8 @@ class NatsEngine::Answers {
 /// A connection and its JetStream context. With the first failure it is of no more use.
 class NatsEngine::Connection {
  public:
-  Connection(const Configuration::Nats& configuration, Answers& answers)
-      : configuration_(configuration), answers_(answers) {}
+  Connection(const NatsSettings& settings, Answers& answers)
+      : settings_(settings), answers_(answers) {}
   Connection(const Connection&) = delete;
   Connection& operator=(const Connection&) = delete;
   ~Connection() {
@@ -175,7 +175,7 @@ class NatsEngine::Connection {
     status = natsConnection_Connect(&connected, made);
     connection_.reset(connected);
     if (status != NATS_OK) {
-      return fmt::format("{} cannot be reached: {}", fmt::join(configuration_.urls, ", "),
+      return fmt::format("{} cannot be reached: {}", fmt::join(settings_.urls, ", "),
                          TextOf(status));
     }
     jsOptions jetStream;
@@ -194,7 +194,7 @@ class NatsEngine::Connection {
     status = natsConnection_JetStream(&js, connected, &jetStream);
     js_.reset(js);
     if (status != NATS_OK) return TextOf(status);
-    return configuration_.stream.empty() ? std::nullopt : prepareStream();
+    return settings_.stream.empty() ? std::nullopt : prepareStream();
   }
 
   natsStatus publish(const std::string& subject, const std::string& name, const std::string& body) {
@@ -204,7 +204,7 @@ class NatsEngine::Connection {
     jsPubOptions options;
     jsPubOptions_Init(&options);
     options.MsgId = name.c_str();
-    if (!configuration_.stream.empty()) options.ExpectStream = configuration_.stream.c_str();
+    if (!settings_.stream.empty()) options.ExpectStream = settings_.stream.c_str();
     if (status == NATS_OK) status = js_PublishMsgAsync(js_.get(), &message, &options);
     published_ = published_ || status == NATS_OK;
     natsMsg_Destroy(message);
@@ -212,14 +212,12 @@ class NatsEngine::Connection {
   }
 
  private:
-  [[nodiscard]] std::int64_t milliseconds() const {
-    return configuration_.acknowledge.count() * 1000;
-  }
+  [[nodiscard]] std::int64_t milliseconds() const { return settings_.acknowledge.count() * 1000; }
 
   natsStatus configure(natsOptions* options, const std::string& name) {
     std::vector<const char*> urls;
-    for (const std::string& url : configuration_.urls) urls.push_back(url.c_str());
-    const auto& [authority, certificate, key] = configuration_.tls;
+    for (const std::string& url : settings_.urls) urls.push_back(url.c_str());
+    const auto& [authority, certificate, key] = settings_.tls;
     natsStatus status = NATS_OK;
     const auto also = [&status](natsStatus next) {
       if (status == NATS_OK) status = next;
@@ -241,22 +239,22 @@ class NatsEngine::Connection {
     if (!certificate.empty()) {
       also(natsOptions_LoadCertificatesChain(options, certificate.c_str(), key.c_str()));
     }
-    if (!configuration_.credentials.empty()) {
-      also(natsOptions_SetUserCredentialsFromFiles(options, configuration_.credentials.c_str(),
-                                                   nullptr));
+    if (!settings_.credentials.empty()) {
+      also(
+          natsOptions_SetUserCredentialsFromFiles(options, settings_.credentials.c_str(), nullptr));
     }
     return status;
   }
 
   std::optional<std::string> prepareStream() {
-    const char* const name = configuration_.stream.c_str();
+    const char* const name = settings_.stream.c_str();
     jsStreamInfo* found = nullptr;
     jsErrCode code{};
     natsStatus status = js_GetStreamInfo(&found, js_.get(), name, nullptr, &code);
     Owned<jsStreamInfo, jsStreamInfo_Destroy> info(found);
     if (status == NATS_OK) return std::nullopt;
     if (status != NATS_NOT_FOUND) return fmt::format("its stream {}: {}", name, TextOf(status));
-    if (!configuration_.createStream) {
+    if (!settings_.createStream) {
       return fmt::format("it has no stream {}: make it, or set create_stream in [agent.nats]",
                          name);
     }
@@ -266,23 +264,23 @@ class NatsEngine::Connection {
     stream.Name = name;
     stream.Subjects = subjects;
     stream.SubjectsLen = 1;
-    stream.Replicas = configuration_.replicas;
-    stream.Duplicates = std::chrono::nanoseconds(configuration_.duplicateWindow).count();
+    stream.Replicas = settings_.replicas;
+    stream.Duplicates = std::chrono::nanoseconds(settings_.duplicateWindow).count();
     status = js_AddStream(&found, js_.get(), &stream, nullptr, &code);
     info.reset(found);
     if (status == NATS_OK) return std::nullopt;
     return fmt::format("its stream {} cannot be made: {}", name, TextOf(status));
   }
 
-  const Configuration::Nats& configuration_;
+  const NatsSettings& settings_;
   Answers& answers_;
   Owned<natsConnection, natsConnection_Destroy> connection_;
   Owned<jsCtx, jsCtx_Destroy> js_;
   bool published_ = false;
 };
 
-NatsEngine::NatsEngine(Configuration::Nats configuration, const ExportDevice& device)
-    : configuration_(std::move(configuration)),
+NatsEngine::NatsEngine(NatsSettings settings, const ExportDevice& device)
+    : settings_(std::move(settings)),
       name_(fmt::format("quarveld {} {}", device.version, device.name)),
       subject_(fmt::format("quarvel.{}.", device.name)),
       answers_(Answers::make()) {}
@@ -292,7 +290,7 @@ NatsEngine::~NatsEngine() = default;
 Delivery NatsEngine::deliver(const ExportBatch& batch) {
   answers_.expect(batch);
   if (!connection_) {
-    connection_ = std::make_unique<Connection>(configuration_, answers_);
+    connection_ = std::make_unique<Connection>(settings_, answers_);
     if (auto reason = connection_->open(name_)) {
       connection_.reset();
       return {.rest = Delivery::Rest::again, .reason = std::move(*reason)};
@@ -312,7 +310,7 @@ Delivery NatsEngine::deliver(const ExportBatch& batch) {
       answers_.connectionClosed();
     }
   }
-  Answers::Result result = answers_.await(configuration_.acknowledge);
+  Answers::Result result = answers_.await(settings_.acknowledge);
   if (result.all) return {.taken = result.taken};
   if (result.stopped) return {.taken = result.taken, .rest = Delivery::Rest::stopped};
   if (result.refused) {

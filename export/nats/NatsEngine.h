@@ -6,7 +6,7 @@
 
 #include "export/ExportDevice.h"
 #include "export/ExportEngine.h"
-#include "system/Configuration.h"
+#include "export/nats/NatsSettings.h"
 
 namespace quarvel {
 
@@ -18,7 +18,7 @@ namespace quarvel {
 /// in it, and what was not acknowledged goes out again, under the same names, on a new one.
 class NatsEngine final : public ExportEngine {
  public:
-  NatsEngine(Configuration::Nats configuration, const ExportDevice& device);
+  NatsEngine(NatsSettings settings, const ExportDevice& device);
   ~NatsEngine() override;
 
   [[nodiscard]] Delivery deliver(const ExportBatch& batch) override;
@@ -30,7 +30,7 @@ class NatsEngine final : public ExportEngine {
   class Answers;
   class Connection;
 
-  const Configuration::Nats configuration_;
+  const NatsSettings settings_;
   const std::string name_;     // of the connection
   const std::string subject_;  // and the table's name
   Answers& answers_;           // the library may call them after everything else

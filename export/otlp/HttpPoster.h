@@ -8,7 +8,7 @@
 #include <string_view>
 
 #include "base/Mutex.h"
-#include "system/Configuration.h"
+#include "export/ExportSettings.h"
 
 namespace quarvel {
 
@@ -23,7 +23,7 @@ class HttpPoster {
   struct Options {
     std::string url;
     std::map<std::string, std::string> headers;
-    Configuration::Tls tls;
+    TlsSettings tls;
     std::chrono::seconds connect{5};
     std::chrono::seconds timeout{10};  // of a whole request
   };

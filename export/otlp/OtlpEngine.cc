@@ -22,13 +22,12 @@ std::string AddressOf(std::string endpoint) {
   return endpoint.ends_with(kPath) ? endpoint : endpoint.append(kPath);
 }
 
-HttpPoster::Options OptionsOf(const Configuration::Otlp& configuration,
-                              const ExportDevice& device) {
-  HttpPoster::Options options{AddressOf(configuration.endpoint), configuration.headers,
-                              configuration.tls, configuration.connect, configuration.timeout};
+HttpPoster::Options OptionsOf(const OtlpSettings& settings, const ExportDevice& device) {
+  HttpPoster::Options options{AddressOf(settings.endpoint), settings.headers, settings.tls,
+                              settings.connect, settings.timeout};
   options.headers["Content-Type"] = "application/json";
   options.headers["User-Agent"] = "quarveld/" + device.version;
-  if (configuration.gzip) options.headers["Content-Encoding"] = "gzip";
+  if (settings.gzip) options.headers["Content-Encoding"] = "gzip";
   return options;
 }
 
@@ -82,10 +81,8 @@ Delivery Taken(const HttpPoster::Answer& answer, std::size_t rows) {
 
 }  // namespace
 
-OtlpEngine::OtlpEngine(const Configuration::Otlp& configuration, ExportDevice device)
-    : device_(std::move(device)),
-      gzip_(configuration.gzip),
-      poster_(OptionsOf(configuration, device_)) {}
+OtlpEngine::OtlpEngine(const OtlpSettings& settings, ExportDevice device)
+    : device_(std::move(device)), gzip_(settings.gzip), poster_(OptionsOf(settings, device_)) {}
 
 Delivery OtlpEngine::deliver(const ExportBatch& batch) {
   const std::string request = OtlpRequest(batch, device_);

@@ -5,7 +5,7 @@
 #include "export/ExportDevice.h"
 #include "export/ExportEngine.h"
 #include "export/otlp/HttpPoster.h"
-#include "system/Configuration.h"
+#include "export/otlp/OtlpSettings.h"
 
 namespace quarvel {
 
@@ -16,7 +16,7 @@ namespace quarvel {
 /// given up because a token has run out. Any other refusal is about the batch, and for ever.
 class OtlpEngine final : public ExportEngine {
  public:
-  OtlpEngine(const Configuration::Otlp& configuration, ExportDevice device);
+  OtlpEngine(const OtlpSettings& settings, ExportDevice device);
 
   [[nodiscard]] Delivery deliver(const ExportBatch& batch) override;
   void rest() override { poster_.rest(); }

@@ -5,6 +5,7 @@
 #include <pwd.h>
 #include <unistd.h>
 
+#include <array>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -15,6 +16,8 @@
 #include <vector>
 
 #include "base/StandardPaths.h"
+#include "export/nats/NatsSettings.h"
+#include "export/otlp/OtlpSettings.h"
 #include "platform/DeviceProperties.h"
 #include "tests/TemporaryDirectory.h"
 
@@ -26,12 +29,20 @@ using testing::ElementsAre;
 using testing::HasSubstr;
 using testing::IsEmpty;
 
+constexpr std::array kBackends{RemoteBackend{"nats", ReadNatsSettings},
+                               RemoteBackend{"otlp", ReadOtlpSettings}};
+
+template <class Settings>
+const Settings& settings(const Configuration& configuration, std::string_view backend) {
+  return static_cast<const Settings&>(*configuration.agent.settings.find(backend)->second);
+}
+
 class ConfigurationTest : public testing::Test {
  protected:
   Result<Configuration> read(const std::string& text) {
     std::ofstream(file()) << text;
     warnings_.clear();
-    return Configuration::read(file(), warnings_);
+    return Configuration::read(file(), kBackends, warnings_);
   }
   [[nodiscard]] fs::path file() const { return directory_.path() / "quarvel.toml"; }
 
@@ -130,7 +141,7 @@ connections = 4
   EXPECT_FALSE(read.agent.exports);
   EXPECT_EQ(read.agent.drainRowsPerSecond, 5U);
   EXPECT_EQ(read.agent.device, "car-7");
-  const Configuration::Nats& nats = read.agent.nats;
+  const auto& nats = settings<NatsSettings>(read, "nats");
   EXPECT_THAT(nats.urls, ElementsAre("nats://one:4222", "tls://two"));
   EXPECT_EQ(std::tie(nats.stream, nats.createStream, nats.replicas, nats.credentials),
             std::tuple("S", true, 1, "/c"));
@@ -138,7 +149,7 @@ connections = 4
             std::tuple("/ca", "/cert", "/key"));
   EXPECT_EQ(std::tuple(nats.duplicateWindow.count(), nats.acknowledge.count(), nats.gather.count()),
             std::tuple(9, 8, 7));
-  const Configuration::Otlp& otlp = read.agent.otlp;
+  const auto& otlp = settings<OtlpSettings>(read, "otlp");
   EXPECT_EQ(std::tie(otlp.endpoint, otlp.gzip, otlp.tls.authority),
             std::tuple("https://three/x", false, "/ca2"));
   EXPECT_THAT(otlp.headers, ElementsAre(testing::Pair("Authorization", "Bearer t")));
@@ -165,7 +176,7 @@ TEST_F(ConfigurationTest, AbsentFileAndAbsentKeysLeaveTheDefaults) {
   std::vector<std::string> warnings;
   for (const fs::path& absent :
        {directory_.path() / "none.toml", directory_.path() / "none/quarvel.toml"}) {
-    EXPECT_TRUE(Configuration::read(absent, warnings).ok()) << absent;
+    EXPECT_TRUE(Configuration::read(absent, kBackends, warnings).ok()) << absent;
   }
   const Result<Configuration> partial = read("[limits]\ndepth = 1\n[agent]\nbackends = []\n");
   ASSERT_TRUE(partial.ok());
@@ -190,7 +201,9 @@ TEST_F(ConfigurationTest, WrongValueNamesFileLineKeyAndWhatIsAllowed) {
       {"[log]\nlevel = 'loud'",
        ":2: log.level must be one of \"error\", \"default\", \"info\", \"debug\", but is "
        "\"loud\"."},
-      {"[agent]\nbackends = 'store'", ":2: agent.backends must be a list of"},
+      {"[agent]\nbackends = 'store'",
+       ":2: agent.backends must be a list of \"store\", \"nats\", \"otlp\", each at most once, "
+       "but"},
       {"[agent]\nbackends = [\n'store',\n'kafka']", ":4: agent.backends[1] must be"},
       {"[agent]\nbackends = ['store', 'store']", "each at most once, but is \"store\"."},
       {"[agent]\nexport = 1", ":2: agent.export must be true or false, but is 1."},
@@ -239,7 +252,7 @@ TEST_F(ConfigurationTest, UnknownKeysAreWarningsOnly) {
 
 TEST_F(ConfigurationTest, FileThatCannotBeReadIsAnErrorNotAnAbsentOne) {
   fs::create_directory(file());
-  const Result<Configuration> result = Configuration::read(file(), warnings_);
+  const Result<Configuration> result = Configuration::read(file(), kBackends, warnings_);
   ASSERT_FALSE(result.ok());
   EXPECT_THAT(result.error().description(), HasSubstr("Is a directory"));
 }
