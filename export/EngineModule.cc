@@ -17,9 +17,9 @@ class MissingEngine final : public ExportEngine {
   explicit MissingEngine(std::string reason) : reason_(std::move(reason)) {}
 
   [[nodiscard]] Delivery deliver(const ExportBatch& /*batch*/) override {
-    return {.rest = Delivery::Rest::again, .reason = reason_};
+    return {.remainder = Delivery::Remainder::again, .reason = reason_};
   }
-  void rest() override {}
+  void disconnect() override {}
   void stop() override {}
   void resume() override {}
 

@@ -37,13 +37,14 @@ std::string TextOf(natsStatus status) {
 
 }  // namespace
 
-/// What the stream has answered about the rows of one batch. Any thread.
-class NatsEngine::Answers {
+/// The stream's acknowledgements of the rows of one batch. Lives as long as the process, because
+/// the library may call it after the connection is closed. Any thread.
+class NatsEngine::Acknowledgements {
  public:
   struct Result {
-    std::size_t taken = 0;  // from the first on
+    std::size_t taken = 0;  // rows, counted from the first
     bool all = false;
-    bool refused = false;  // the row behind them
+    bool refused = false;  // the row after them
     bool stopped = false;
     std::string reason;
   };
@@ -59,26 +60,25 @@ class NatsEngine::Answers {
     closed_ = false;
     reason_.clear();
   }
-  /// About a row by its place in the batch: it will not be published, and why.
+  /// Marks a row, by its index in the batch, as one that cannot be published.
   void refuse(std::size_t index, std::string reason) {
     const MutexLock lock(mutex_);
-    settle(index, State::refused, std::move(reason));
+    setState(index, State::refused, std::move(reason));
   }
-  void answered(const char* name, const jsPubAckErr* error) {
+  void acknowledge(const char* name, const jsPubAckErr* error) {
     const MutexLock lock(mutex_);
-    const std::string_view answered(name);
-    if (!answered.starts_with(prefix_)) return;
+    if (!std::string_view(name).starts_with(prefix_)) return;
     const std::int64_t id = std::strtoll(name + prefix_.size(), nullptr, 10);
     const auto found = std::ranges::lower_bound(ids_, id);
     if (found == ids_.end() || *found != id) return;
     const auto index = static_cast<std::size_t>(found - ids_.begin());
     if (error == nullptr) {
-      settle(index, State::taken, {});
+      setState(index, State::taken, {});
       return;
     }
     const bool never = error->ErrCode == JSStreamMessageExceedsMaximumErr;
-    settle(index, never ? State::refused : State::failed,
-           error->ErrText != nullptr ? error->ErrText : natsStatus_GetText(error->Err));
+    setState(index, never ? State::refused : State::failed,
+             error->ErrText != nullptr ? error->ErrText : natsStatus_GetText(error->Err));
   }
   void connectionClosed() {
     const MutexLock lock(mutex_);
@@ -91,9 +91,9 @@ class NatsEngine::Answers {
     changed_.notifyAll();
   }
 
-  /// Waits until every row that was published has been answered, or nothing more is to be expected.
-  Result await(std::chrono::seconds patience) {
-    const auto deadline = std::chrono::steady_clock::now() + patience;
+  /// Waits until every row has its acknowledgement, or no more can come.
+  Result await(std::chrono::seconds limit) {
+    const auto deadline = std::chrono::steady_clock::now() + limit;
     const MutexLock lock(mutex_);
     bool inTime = true;
     while (inTime && waiting_ > 0 && !closed_ && !stopped_) {
@@ -111,7 +111,7 @@ class NatsEngine::Answers {
       result.reason = "the connection was lost";
     } else {
       result.reason =
-          fmt::format("{} rows were not acknowledged within {} s", waiting_, patience.count());
+          fmt::format("{} rows were not acknowledged within {} s", waiting_, limit.count());
     }
     return result;
   }
@@ -119,7 +119,7 @@ class NatsEngine::Answers {
  private:
   enum class State : std::uint8_t { waiting, taken, refused, failed };
 
-  void settle(std::size_t index, State state, std::string reason) QUARVEL_REQUIRES(mutex_) {
+  void setState(std::size_t index, State state, std::string reason) QUARVEL_REQUIRES(mutex_) {
     if (states_[index] == State::waiting) --waiting_;
     states_[index] = state;
     if (reason_.empty()) reason_ = std::move(reason);
@@ -137,24 +137,25 @@ class NatsEngine::Answers {
   std::string reason_ QUARVEL_GUARDED_BY(mutex_);  // the first one
 
  public:
-  /// One that lives as long as the process.
-  static Answers& make() {
+  /// Never destroyed.
+  static Acknowledgements& make() {
     static Mutex mutex;
-    static auto& all = *new std::deque<Answers>;
+    static auto& all = *new std::deque<Acknowledgements>;
     const MutexLock lock(mutex);
     return all.emplace_back();
   }
 };
 
-/// A connection and its JetStream context. With the first failure it is of no more use.
+/// A connection and its JetStream context, for the exporter's thread. Replaced after the first
+/// failure.
 class NatsEngine::Connection {
  public:
-  Connection(const NatsSettings& settings, Answers& answers)
-      : settings_(settings), answers_(answers) {}
+  Connection(const NatsSettings& settings, Acknowledgements& acknowledgements)
+      : settings_(settings), acknowledgements_(acknowledgements) {}
   Connection(const Connection&) = delete;
   Connection& operator=(const Connection&) = delete;
   ~Connection() {
-    if (published_) {  // before that the library has no list, and does not look
+    if (published_) {  // before that the library has no list and does not check
       natsMsgList pending{};
       if (js_PublishAsyncGetPendingList(&pending, js_.get()) == NATS_OK) {
         natsMsgList_Destroy(&pending);
@@ -164,7 +165,7 @@ class NatsEngine::Connection {
     if (connection_) natsConnection_Close(connection_.get());
   }
 
-  /// None when that went well, else why not.
+  /// Returns the reason when it fails.
   std::optional<std::string> open(const std::string& name) {
     natsOptions* made = nullptr;
     natsStatus status = natsOptions_Create(&made);
@@ -182,14 +183,14 @@ class NatsEngine::Connection {
     jsOptions_Init(&jetStream);
     jetStream.Wait = milliseconds();
     jetStream.PublishAsync.AckHandler = [](jsCtx*, natsMsg* message, jsPubAck*, jsPubAckErr* error,
-                                           void* answers) {
+                                           void* acknowledgements) {
       const char* row = nullptr;
       if (natsMsgHeader_Get(message, "Nats-Msg-Id", &row) == NATS_OK) {
-        static_cast<Answers*>(answers)->answered(row, error);
+        static_cast<Acknowledgements*>(acknowledgements)->acknowledge(row, error);
       }
       natsMsg_Destroy(message);
     };
-    jetStream.PublishAsync.AckHandlerClosure = &answers_;
+    jetStream.PublishAsync.AckHandlerClosure = &acknowledgements_;
     jsCtx* js = nullptr;
     status = natsConnection_JetStream(&js, connected, &jetStream);
     js_.reset(js);
@@ -225,13 +226,15 @@ class NatsEngine::Connection {
     also(natsOptions_SetServers(options, urls.data(), static_cast<int>(urls.size())));
     also(natsOptions_SetName(options, name.c_str()));
     also(natsOptions_SetTimeout(options, kConnectMilliseconds));
-    // The exporter backs off by itself, and a library that tried meanwhile would cost wake-ups.
+    // The exporter has its own back-off; reconnecting by the library would cost wake-ups.
     also(natsOptions_SetAllowReconnect(options, false));
     also(natsOptions_SetPingInterval(options, kPingMilliseconds));
     also(natsOptions_SetClosedCB(
         options,
-        [](natsConnection*, void* answers) { static_cast<Answers*>(answers)->connectionClosed(); },
-        &answers_));
+        [](natsConnection*, void* acknowledgements) {
+          static_cast<Acknowledgements*>(acknowledgements)->connectionClosed();
+        },
+        &acknowledgements_));
     if (!authority.empty()) {
       also(natsOptions_LoadCATrustedCertificates(options, authority.c_str()));
       also(natsOptions_SetSecure(options, true));
@@ -273,7 +276,7 @@ class NatsEngine::Connection {
   }
 
   const NatsSettings& settings_;
-  Answers& answers_;
+  Acknowledgements& acknowledgements_;
   Owned<natsConnection, natsConnection_Destroy> connection_;
   Owned<jsCtx, jsCtx_Destroy> js_;
   bool published_ = false;
@@ -283,17 +286,17 @@ NatsEngine::NatsEngine(NatsSettings settings, const ExportDevice& device)
     : settings_(std::move(settings)),
       name_(fmt::format("quarveld {} {}", device.version, device.name)),
       subject_(fmt::format("quarvel.{}.", device.name)),
-      answers_(Answers::make()) {}
+      acknowledgements_(Acknowledgements::make()) {}
 
 NatsEngine::~NatsEngine() = default;
 
 Delivery NatsEngine::deliver(const ExportBatch& batch) {
-  answers_.expect(batch);
+  acknowledgements_.expect(batch);
   if (!connection_) {
-    connection_ = std::make_unique<Connection>(settings_, answers_);
+    connection_ = std::make_unique<Connection>(settings_, acknowledgements_);
     if (auto reason = connection_->open(name_)) {
       connection_.reset();
-      return {.rest = Delivery::Rest::again, .reason = std::move(*reason)};
+      return {.remainder = Delivery::Remainder::again, .reason = std::move(*reason)};
     }
   }
   const std::string subject = subject_ + StoreTableName(batch.table);
@@ -304,37 +307,37 @@ Delivery NatsEngine::deliver(const ExportBatch& batch) {
     AppendRowJson(body, batch.table, batch.rows[i]);
     const natsStatus status = connection_->publish(subject, batch.nameOf(batch.rows[i]), body);
     if (status == NATS_MAX_PAYLOAD) {
-      answers_.refuse(i, fmt::format("{} bytes are more than it allows", body.size()));
+      acknowledgements_.refuse(i, fmt::format("{} bytes are more than it allows", body.size()));
     } else if (status != NATS_OK) {
       failure = TextOf(status);
-      answers_.connectionClosed();
+      acknowledgements_.connectionClosed();
     }
   }
-  Answers::Result result = answers_.await(settings_.acknowledge);
+  Acknowledgements::Result result = acknowledgements_.await(settings_.acknowledge);
   if (result.all) return {.taken = result.taken};
-  if (result.stopped) return {.taken = result.taken, .rest = Delivery::Rest::stopped};
+  if (result.stopped) return {.taken = result.taken, .remainder = Delivery::Remainder::stopped};
   if (result.refused) {
     return {.taken = result.taken,
-            .rest = Delivery::Rest::refused,
+            .remainder = Delivery::Remainder::refused,
             .refused = 1,
             .reason = std::move(result.reason)};
   }
   connection_.reset();
   return {.taken = result.taken,
-          .rest = Delivery::Rest::again,
+          .remainder = Delivery::Remainder::again,
           .reason = failure.empty() ? std::move(result.reason) : std::move(failure)};
 }
 
-void NatsEngine::rest() {
+void NatsEngine::disconnect() {
   connection_.reset();
 }
 
 void NatsEngine::stop() {
-  answers_.setStopped(true);
+  acknowledgements_.setStopped(true);
 }
 
 void NatsEngine::resume() {
-  answers_.setStopped(false);
+  acknowledgements_.setStopped(false);
 }
 
 }  // namespace quarvel
