@@ -55,7 +55,7 @@ class VerbosePreferences {
 void FollowVerbosePreferences() {
   ZQ_FUNCTION("FollowVerbosePreferences");
   static VerbosePreferences& preferences = *new VerbosePreferences;
-  // First the notification: what changes while the scopes are read is then read again.
+  // The notification comes first, so that a change while the scopes are read causes another read.
   NotificationToken token = 0;
   const std::int32_t status =
       RegisterForNotification("tarnwick.quarvel.reporting", token, preferences.queue(),

@@ -2,9 +2,10 @@
 
 namespace quarvel {
 
-/// Has the log's verbose switches follow the preferences: each scope's key is read from its domain
-/// when the scope is registered (at once for those that are), and again whenever the notification
-/// "tarnwick.quarvel.reporting" is posted. Called once in a process, at its start, from any thread.
+/// Makes log scopes follow the preferences, for the life of the process. Reads each scope's verbose
+/// key from its domain when the scope is registered (now for the scopes already registered), and
+/// again whenever the notification "tarnwick.quarvel.reporting" is posted.
+/// Thread: call it once, while the service starts; later reads run on a queue of their own.
 void FollowVerbosePreferences();
 
 }  // namespace quarvel
