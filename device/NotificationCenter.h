@@ -28,6 +28,7 @@ class NotificationCenter {
                         NotificationHandler handler);
 
  private:
+  /// One handler. Shared with its queued calls; lives as long as the process.
   struct Registration {
     Registration(NotificationToken ownToken, std::string_view ownName, WorkQueue& ownQueue,
                  NotificationHandler ownHandler)

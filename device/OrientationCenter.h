@@ -15,6 +15,7 @@
 
 namespace quarvel {
 
+/// How the device is held, or how its user interface is turned.
 enum class OrientationKind : std::size_t { device, ui };
 inline constexpr std::size_t kOrientationKinds = 2;
 

@@ -9,7 +9,8 @@
 
 namespace quarvel {
 
-// Settings that the sections of several engines have in common.
+// Settings that the sections of several engines have in common. Read on the thread that reads the
+// configuration; constant afterwards.
 
 /// Files in PEM. Empty: the system's authorities, and no certificate of the device's own.
 struct TlsSettings {

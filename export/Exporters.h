@@ -15,6 +15,7 @@ namespace quarvel {
 /// All operations from any thread.
 class Exporters {
  public:
+  /// One exporter to start: its options, and its engine, which the exporter then owns.
   struct Backend {
     Exporter::Options options;
     std::unique_ptr<ExportEngine> engine;

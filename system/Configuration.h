@@ -18,7 +18,8 @@
 namespace quarvel {
 
 /// Settings of one remote backend, a backend that is fed from the store. Each engine derives its
-/// own struct from this; the rest of the service sees nothing else of it.
+/// own struct from this, and the rest of the service uses no other part of it. Constant once read;
+/// shared by the configuration and the engine.
 struct BackendSettings {
   virtual ~BackendSettings() = default;
 
@@ -32,59 +33,68 @@ struct RemoteBackend {
   std::shared_ptr<const BackendSettings> (*readSettings)(ConfigurationSection& section);
 };
 
-/// The platform configuration, quarvel.toml; every key is optional. A value type. The process's own
-/// (`process`) is read once and constant, so that any thread may use it.
+/// The platform configuration, quarvel.toml, with a default for every key. A value type. The
+/// process's own (`process`) is read once and constant, so that any thread may use it.
 struct Configuration {
   /// [device]: the device properties.
   std::map<std::string, ConfigurationSection::Scalar, std::less<>> device;
 
+  /// [log]: the least urgent level that is written.
   LogLevel logLevel = LogLevel::standard;
 
+  /// [store]
   struct Store {
     std::filesystem::path path;  // empty: telemetry.db in the state directory
-    std::chrono::milliseconds sync{1000};
-    std::uint64_t maximumBytes = 268'435'456;
-    std::chrono::days maximumAge{14};
+    std::chrono::milliseconds sync{
+        1000};  // a row is on the medium at most this long after queueing
+    std::uint64_t maximumBytes = 268'435'456;  // the oldest rows are removed above it
+    std::chrono::days maximumAge{14};          // likewise
   } store;
 
+  /// [agent]
   struct Agent {
     std::vector<std::string> backends{"store"};
-    bool exports = true;
-    std::uint32_t drainRowsPerSecond = 2000;
-    std::string device;  // empty: the host's name
-    /// Of each remote backend that the service knows, whether or not `backends` names it.
+    bool exports = true;                      // consent to rows leaving the device
+    std::uint32_t drainRowsPerSecond = 2000;  // rate limit of draining a backlog
+    std::string device;                       // empty: the host's name
+    /// By the name of each remote backend that the service knows, also of the ones not in
+    /// `backends`.
     std::map<std::string, std::shared_ptr<const BackendSettings>, std::less<>> settings;
 
     /// The names in `backends` that are fed from the store.
     [[nodiscard]] std::vector<std::string> remoteBackends() const;
   } agent;
 
+  /// [analytics]: glob patterns of the event names that are recorded.
   std::vector<std::string> analyticsWanted{"*"};
 
+  /// [[tallix.channel]]: one driver counter in a file of its own or in a report.
   struct TallixChannel {
     std::string group, subgroup, name;
     std::filesystem::path file;
     std::string pattern;  // empty: the file holds the integer alone
   };
+  /// [tallix]
   struct Tallix {
     std::filesystem::path root;  // empty: no tree
     std::vector<TallixChannel> channels;
   } tallix;
 
+  /// [orientation]
   enum class OrientationSource { none, files, iio };
   OrientationSource orientation = OrientationSource::none;
 
+  /// [limits]
   struct Limits {
-    std::size_t messageBytes = 1'048'576;
-    std::size_t replyBytes = 1'048'576;
-    std::chrono::milliseconds frame{10'000};
-    std::chrono::milliseconds stall{30'000};
-    unsigned depth = 32;
-    std::size_t queuedCalls = 256;
-    std::size_t queuedBytes = 4'194'304;
-    std::size_t connections = 4096;
-    /// Of the queued calls, how many a client has ahead of others to begin with. Not configured.
-    std::size_t firstTurn = 16;
+    std::size_t messageBytes = 1'048'576;     // of one message
+    std::size_t replyBytes = 1'048'576;       // held for a client that does not read
+    std::chrono::milliseconds frame{10'000};  // to complete a frame that was begun
+    std::chrono::milliseconds stall{30'000};  // without progress of a client's reading
+    unsigned depth = 32;                      // of nested lists and dictionaries
+    std::size_t queuedCalls = 256;            // of one client
+    std::size_t queuedBytes = 4'194'304;      // likewise
+    std::size_t connections = 4096;           // of all clients
+    std::size_t firstTurn = 16;  // queued calls executed in a row at first; no key sets it
   } limits;
 
   /// Names the remote backends of this process's configuration, with `std::span` over constant

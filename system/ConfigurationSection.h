@@ -29,8 +29,10 @@ namespace quarvel {
 /// One thread.
 class ConfigurationSection {
  public:
+  /// Checks one string; the error text says which ones it admits.
   using IsAllowed = std::function<bool(std::string_view value)>;
   using IsAllowedPair = std::function<bool(std::string_view name, std::string_view value)>;
+  /// The kinds of value in sections with free keys.
   using Scalar = std::variant<bool, std::int64_t, std::string>;
 
   /// As the upper bound of an integer: none.
@@ -40,16 +42,18 @@ class ConfigurationSection {
   ConfigurationSection& operator=(ConfigurationSection&&) = delete;
   ~ConfigurationSection();
 
+  // Each `read` replaces `out` by the value of `key` if that is present and right.
   void read(std::string_view key, bool& out);
   void read(std::string_view key, std::string& out);
   void read(std::string_view key, std::filesystem::path& out);
-  /// A string. `allowed` describes the admitted ones for the error text, here and below.
+  /// A string that `isAllowed` admits. `allowed` completes the error text "<key> must be ...", here
+  /// and below.
   void read(std::string_view key, std::string_view allowed, const IsAllowed& isAllowed,
             std::string& out);
-  /// A list of strings, none twice.
+  /// A list of such strings, none twice.
   void read(std::string_view key, std::string_view allowed, const IsAllowed& isAllowed,
             std::vector<std::string>& out);
-  /// A table of names to strings.
+  /// A table of names to strings; a right one replaces all of `out`.
   void read(std::string_view key, std::string_view allowed, const IsAllowedPair& isAllowed,
             std::map<std::string, std::string>& out);
 
@@ -100,6 +104,7 @@ class ConfigurationSection {
   struct State;
   explicit ConfigurationSection(std::unique_ptr<State> state);
 
+  // None when the key is absent or its value wrong. `readChoice` returns an index in `names`.
   [[nodiscard]] std::optional<std::int64_t> readInteger(std::string_view key, std::int64_t least,
                                                         std::int64_t most);
   [[nodiscard]] std::optional<std::size_t> readChoice(std::string_view key,

@@ -13,7 +13,7 @@ namespace quarvel {
 
 /// [agent.nats]. Constant once read; shared by the configuration and the engine.
 struct NatsSettings : BackendSettings {
-  std::vector<std::string> urls{"nats://localhost:4222"};
+  std::vector<std::string> urls{"nats://localhost:4222"};  // tried in turn
   std::string stream = "QUARVEL";  // empty: any stream that has the subject, unchecked
   bool createStream = false;       // with the next two
   int replicas = 3;

@@ -12,11 +12,13 @@ namespace quarvel {
 
 /// [agent.otlp]. Constant once read; shared by the configuration and the engine.
 struct OtlpSettings : BackendSettings {
+  /// The collector's address, with or without the path /v1/logs.
   std::string endpoint = "http://localhost:4318";
+  /// Sent with each request besides the protocol's own. May hold secrets.
   std::map<std::string, std::string> headers;
   bool gzip = true;
   TlsSettings tls;
-  std::chrono::seconds connect{5};
+  std::chrono::seconds connect{5};   // of one connection attempt
   std::chrono::seconds timeout{10};  // of a whole request
 };
 
