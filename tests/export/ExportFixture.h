@@ -20,7 +20,7 @@ class RecordingEngine : public ExportEngine {
 
   static Delivery takeAll(const ExportBatch& batch) { return {.taken = batch.rows.size()}; }
   static Delivery down(const ExportBatch&) {
-    return {.remainder = Delivery::Remainder::again, .reason = "nobody answers"};
+    return {.remainder = Delivery::Remainder::again, .reason = "no answer"};
   }
 
   Delivery deliver(const ExportBatch& batch) override {

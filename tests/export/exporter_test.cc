@@ -104,8 +104,8 @@ TEST_F(ExporterTest, AnEngineDownForEightHoursCostsFewWakeUpsAndNoRow) {
   }
   // 1 + 2 + 4 ... + 256 seconds, then one every five minutes.
   EXPECT_THAT(wakeUps, AllOf(Ge(100), Le(110)));
-  EXPECT_THAT(LogRecorder::takeErrors(), ElementsAre(HasSubstr("nobody answers")));
-  EXPECT_THAT(exporter_->status().error, Optional(std::string("nobody answers")));
+  EXPECT_THAT(LogRecorder::takeErrors(), ElementsAre(HasSubstr("no answer")));
+  EXPECT_THAT(exporter_->status().error, Optional(std::string("no answer")));
   EXPECT_THAT(exporter_->status().nextAttempt, Optional(Ge(date())));
   EXPECT_THAT(source_->backlog(exporter_->status().exportedThrough).value(), 9600);
 
@@ -184,7 +184,7 @@ TEST_F(ExporterTest, TakenRowsOfABatchAreNotSentAgain) {
   EXPECT_EQ(exporter_->status().refusedRows, 2U);
 }
 
-TEST_F(ExporterTest, APoisonousRowIsSetAsideAlone) {
+TEST_F(ExporterTest, ARefusedRowIsSetAsideAlone) {
   begin();
   addMessages(1000);
   engine_.answer = [](const ExportBatch& batch) {
@@ -217,7 +217,7 @@ TEST_F(ExporterTest, AnEngineThatRefusesEverythingIsNotAskedRowByRow) {
   const int firstSecond = engine_.deliveries;
   EXPECT_LE(firstSecond, 25);
   runFor(1h);
-  EXPECT_LE(engine_.deliveries, firstSecond + 20) << "it has time to come to its senses";
+  EXPECT_LE(engine_.deliveries, firstSecond + 20) << "attempts must back off";
   engine_.answer = RecordingEngine::takeAll;
   runFor(10min);
   EXPECT_EQ(value("SELECT sum(rows) FROM export_log"), "3000");
