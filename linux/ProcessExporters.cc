@@ -28,8 +28,8 @@ constexpr std::chrono::milliseconds kEndMayTake{500};
 
 // A new engine is one line here and one folder in export/.
 constexpr std::array kRemoteBackends{
-    RemoteBackend{"nats", ReadNatsSettings},
-    RemoteBackend{"otlp", ReadOtlpSettings},
+    BackendKind{"nats", ReadNatsSettings},
+    BackendKind{"otlp", ReadOtlpSettings},
 };
 
 Exporters::Backend MakeBackend(const std::string& name, const Configuration::Agent& agent) {
@@ -104,7 +104,7 @@ Exporters& Started() {
 
 }  // namespace
 
-std::span<const RemoteBackend> RemoteBackends() {
+std::span<const BackendKind> RemoteBackends() {
   return kRemoteBackends;
 }
 

@@ -8,7 +8,7 @@
 namespace quarvel {
 
 /// The engines that the service knows, for its configuration. Constant.
-[[nodiscard]] std::span<const RemoteBackend> RemoteBackends();
+[[nodiscard]] std::span<const BackendKind> RemoteBackends();
 
 /// The process's exporters, one for each remote backend that is configured; started on first use,
 /// which the service makes once its store is open. They follow `[agent] export`, which is read

@@ -28,7 +28,7 @@ constexpr std::int64_t kGibibyte = 1024 * kMebibyte;
 constexpr std::int64_t kDaySeconds = 24 * 60 * 60;
 
 // Constant after start-up.
-std::span<const RemoteBackend> processBackends;
+std::span<const BackendKind> processBackends;
 
 void readLog(Section log, Configuration& out) {
   log.read<LogLevel>("level",
@@ -52,9 +52,9 @@ bool isDeviceName(std::string_view name) {
   return name.size() <= 64 && name.find_first_not_of(kAllowed) == std::string_view::npos;
 }
 
-void readAgent(Section agent, std::span<const RemoteBackend> backends, Configuration::Agent& out) {
+void readAgent(Section agent, std::span<const BackendKind> backends, Configuration::Agent& out) {
   std::vector<std::string_view> names{kStore};
-  for (const RemoteBackend& backend : backends) names.push_back(backend.name);
+  for (const BackendKind& backend : backends) names.push_back(backend.name);
   agent.read(
       "backends", fmt::format("a list of \"{}\", each at most once", fmt::join(names, "\", \"")),
       [&names](std::string_view name) { return std::ranges::find(names, name) != names.end(); },
@@ -63,7 +63,7 @@ void readAgent(Section agent, std::span<const RemoteBackend> backends, Configura
   agent.read("drain_rows_per_second", 1, 1'000'000, out.drainRowsPerSecond);
   agent.read("device", "a name of letters, digits, \"-\" and \"_\", 64 at most", isDeviceName,
              out.device);
-  for (const RemoteBackend& backend : backends) {
+  for (const BackendKind& backend : backends) {
     Section section = agent.section(backend.name);
     out.settings.insert_or_assign(std::string(backend.name), backend.readSettings(section));
   }
@@ -109,7 +109,7 @@ void readLimits(Section limits, Configuration::Limits& out) {
   limits.read("connections", 1, 1'000'000, out.connections);
 }
 
-void readRoot(Section& root, std::span<const RemoteBackend> backends, Configuration& out) {
+void readRoot(Section& root, std::span<const BackendKind> backends, Configuration& out) {
   root.section("device").readAll(out.device);
   readLog(root.section("log"), out);
   readStore(root.section("store"), out.store);
@@ -159,7 +159,7 @@ Configuration readForProcess() {
 
 }  // namespace
 
-void Configuration::setRemoteBackends(std::span<const RemoteBackend> backends) {
+void Configuration::setRemoteBackends(std::span<const BackendKind> backends) {
   processBackends = backends;
 }
 
@@ -181,7 +181,7 @@ std::vector<std::string> Configuration::Agent::remoteBackends() const {
 }
 
 Result<Configuration> Configuration::read(const std::filesystem::path& file,
-                                          std::span<const RemoteBackend> backends,
+                                          std::span<const BackendKind> backends,
                                           std::vector<std::string>& warnings) {
   const Result<std::string> text = readText(file);
   if (!text) return text.error();

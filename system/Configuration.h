@@ -27,7 +27,7 @@ struct BackendSettings {
 };
 
 /// A remote backend that [agent] may name, and the reader of its section [agent.<name>].
-struct RemoteBackend {
+struct BackendKind {
   std::string_view name;
   /// Reads and checks the section, which may be absent. Never null.
   std::shared_ptr<const BackendSettings> (*readSettings)(ConfigurationSection& section);
@@ -99,7 +99,7 @@ struct Configuration {
 
   /// Names the remote backends of this process's configuration, with `std::span` over constant
   /// data. Before the first `process`; without it "store" is the only backend.
-  static void setRemoteBackends(std::span<const RemoteBackend> backends);
+  static void setRemoteBackends(std::span<const BackendKind> backends);
 
   /// The process's configuration, read on first use. An error in the file goes to the log (file,
   /// line, key and the allowed values) and ends the process with status 1. Unknown keys are
@@ -113,7 +113,7 @@ struct Configuration {
   /// Reads one file; a missing file yields the defaults. `warnings` receives a sentence for each
   /// unknown key. Errors: domain "quarvel.configuration".
   [[nodiscard]] static Result<Configuration> read(const std::filesystem::path& file,
-                                                  std::span<const RemoteBackend> backends,
+                                                  std::span<const BackendKind> backends,
                                                   std::vector<std::string>& warnings);
 };
 

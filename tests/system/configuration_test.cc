@@ -29,8 +29,8 @@ using testing::ElementsAre;
 using testing::HasSubstr;
 using testing::IsEmpty;
 
-constexpr std::array kBackends{RemoteBackend{"nats", ReadNatsSettings},
-                               RemoteBackend{"otlp", ReadOtlpSettings}};
+constexpr std::array kBackends{BackendKind{"nats", ReadNatsSettings},
+                               BackendKind{"otlp", ReadOtlpSettings}};
 
 template <class Settings>
 const Settings& settings(const Configuration& configuration, std::string_view backend) {
