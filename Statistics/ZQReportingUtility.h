@@ -6,6 +6,7 @@
 
 #include "Statistics/SharedDictionary.h"
 #include "base/Value.h"
+#include "base/Vocabulary.h"
 #include "platform/Condition.h"
 #include "platform/Log.h"
 
@@ -15,16 +16,24 @@ namespace quarvel {
 using ReporterID = std::int64_t;
 
 // Codes that the service itself uses.
-inline constexpr std::uint32_t kCategoryTallixing = 9;
+inline constexpr std::uint32_t kCategoryTallixing =
+    static_cast<std::uint32_t>(vocabulary::Kind::tallixing);
 inline constexpr std::uint32_t kCategorySummary = 0xffff'ffff;
-inline constexpr std::uint16_t kTypeGeneric = 0;
+inline constexpr std::uint16_t kTypeGeneric =
+    static_cast<std::uint16_t>(vocabulary::MessageType::generic);
 inline constexpr std::uint16_t kTypeSummary = 0xffff;
-inline constexpr std::uint16_t kServiceTypeTelephony = 2;
-inline constexpr std::uint16_t kServiceTypeAlarms = 4;
-inline constexpr std::uint16_t kServiceTypeStandalone = 5;
-inline constexpr std::uint16_t kServiceTypeLongFormAudio = 7;
-inline constexpr std::uint16_t kServiceTypeTest = 11;
-inline constexpr std::uint16_t kServiceTypeUnknown = 65535;
+inline constexpr std::uint16_t kServiceTypeTelephony =
+    static_cast<std::uint16_t>(vocabulary::ServiceType::telephony);
+inline constexpr std::uint16_t kServiceTypeAlarms =
+    static_cast<std::uint16_t>(vocabulary::ServiceType::alarms);
+inline constexpr std::uint16_t kServiceTypeStandalone =
+    static_cast<std::uint16_t>(vocabulary::ServiceType::standalone);
+inline constexpr std::uint16_t kServiceTypeLongFormAudio =
+    static_cast<std::uint16_t>(vocabulary::ServiceType::longFormAudio);
+inline constexpr std::uint16_t kServiceTypeTest =
+    static_cast<std::uint16_t>(vocabulary::ServiceType::test);
+inline constexpr std::uint16_t kServiceTypeUnknown =
+    static_cast<std::uint16_t>(vocabulary::ServiceType::unknown);
 
 /// The user information's key for the client application.
 inline constexpr const char* kHostApplicationDisplayID = "HostApplicationDisplayID";
@@ -41,13 +50,8 @@ inline constexpr const char* kSubsystem = "tarnwick.quarvel";
 /// The name of a message type code, of which only the low 32 bits count; "Undefined" when unknown.
 [[nodiscard]] std::string ZQReportingUtilityTypeName(std::int64_t type);
 
-/// The same names in their constant pieces, for those who compose something longer: the component
-/// with its "_", empty when there is none, and the kind. Two codes have one name when both pieces
-/// are equal.
-struct CategoryNamePieces {
-  std::string_view component;
-  std::string_view kind;
-};
+/// The same names in their constant pieces, for composing something longer.
+using CategoryNamePieces = vocabulary::CategoryName;
 [[nodiscard]] CategoryNamePieces ZQReportingUtilityCategoryNamePieces(std::uint32_t category);
 [[nodiscard]] std::string_view ZQReportingUtilityTypeNameText(std::int64_t type);
 

@@ -11,15 +11,16 @@ namespace quarvel {
 
 class Block;
 
-/// What a block can be made of.
+/// A callable that a block can hold.
 template <class F>
 concept BlockWork = !std::same_as<std::remove_cvref_t<F>, Block> && std::is_invocable_v<F&>;
 
 /// A piece of work to be run once: a callable without arguments or result, moved and never copied,
-/// so that it can own what it works on. Callables of up to `kInlineBytes` are held in place,
-/// without an allocation.
+/// so that it can own its data. Callables of up to `kInlineBytes` are held in place, without an
+/// allocation. Owned by one queue or timer at a time; not synchronised.
 class Block {
  public:
+  /// With the pointer to the operations a block fills 96 bytes: one and a half cache lines.
   static constexpr std::size_t kInlineBytes = 88;
 
   Block() = default;
@@ -46,7 +47,9 @@ class Block {
   Block& operator=(const Block&) = delete;
   ~Block() { reset(); }
 
+  /// False when there is nothing to run: made empty, or moved from.
   explicit operator bool() const { return operations_ != nullptr; }
+  /// Precondition: there is something to run.
   void operator()() { operations_->run(storage_); }
 
  private:

@@ -33,7 +33,7 @@ std::string DateText(Date date) {
 
 namespace {
 
-/// Reads from the front of a text; once something does not fit, nothing more does.
+/// Reads from the front of a text. After a mismatch every later read fails too.
 class Reader {
  public:
   explicit Reader(std::string_view text) : rest_(text) {}

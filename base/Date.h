@@ -16,11 +16,11 @@ using Date = std::chrono::sys_time<std::chrono::microseconds>;
 inline constexpr Date kEarliestDate{std::chrono::seconds{-62'135'596'800}};
 inline constexpr Date kLatestDate{std::chrono::microseconds{253'402'300'799'999'999}};
 
-/// RFC 3339 in UTC with microseconds: "2026-01-31T13:25:01.123456Z". Of a date that has no such
-/// text, the nearest that has.
+/// RFC 3339 in UTC with microseconds: "2026-01-31T13:25:01.123456Z". A date outside years 1 to 9999
+/// is written as the nearest date inside.
 [[nodiscard]] std::string DateText(Date date);
 
-/// `DateText` without an allocation.
+/// `DateText` without an allocation: 27 characters held in place.
 class DateCharacters {
  public:
   explicit DateCharacters(Date date);
@@ -32,8 +32,9 @@ class DateCharacters {
   std::array<char, 27> characters_;
 };
 
-/// Reads RFC 3339 text with up to nine digits of a second (what is finer than a microsecond is cut
-/// off) and "Z" or a numeric offset. None when it is no such text.
+/// Reads RFC 3339 text with "Z" or a numeric offset and up to nine digits of a second; digits finer
+/// than a microsecond are cut off. None when the text has another form, or the year is not 1 to
+/// 9999.
 [[nodiscard]] std::optional<Date> DateFromText(std::string_view text);
 
 }  // namespace quarvel

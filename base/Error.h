@@ -9,21 +9,21 @@
 
 namespace quarvel {
 
-/// Why something did not happen. `userInfo` may hold "reason", a sentence that says what was wrong
-/// and what is allowed.
+/// The reason of a failure. `userInfo` may hold "reason": a sentence with the fault and the allowed
+/// values. A value; copy it freely.
 struct Error {
   std::string domain;
   std::int64_t code = 0;
   Dictionary userInfo;
 
-  /// An error whose `userInfo` holds just the reason.
+  /// An error whose `userInfo` holds the reason alone.
   [[nodiscard]] static Error because(std::string domain, std::int64_t code, std::string reason);
   /// "domain code: reason", or "domain code" when there is no reason.
   [[nodiscard]] std::string description() const;
   bool operator==(const Error&) const = default;
 };
 
-/// A value, or why there is none.
+/// A value, or the error that prevented it.
 template <class T>
 class [[nodiscard]] Result {
  public:
@@ -45,7 +45,7 @@ class [[nodiscard]] Result {
   std::variant<T, Error> result_;
 };
 
-/// The result of what yields nothing but may fail.
+/// The result of an operation without a value.
 using Outcome = Result<std::monostate>;
 inline Outcome Success() {
   return std::monostate{};

@@ -23,8 +23,8 @@ Error fileError(const fs::path& path, int status) {
       fmt::format("{}: {}", path.native(), std::generic_category().message(status)));
 }
 
-/// A file of its own beside `path`: nobody else's is opened, nor what a link points to.
-/// Returns -1 with errno set when there can be none.
+/// Creates a new file beside `path`; opens no existing file and follows no link. Returns -1 with
+/// errno set when the file cannot be created.
 int createBeside(std::string_view path, std::string& name, mode_t permissions) {
   static std::atomic<unsigned> number{0};
   int descriptor = -1;
@@ -47,6 +47,27 @@ int writeWhole(int descriptor, std::string_view content) {
   return fdatasync(descriptor) == 0 ? 0 : errno;
 }
 
+struct Owner {
+  uid_t user;
+  gid_t group;
+};
+
+Outcome replace(std::string_view path, std::string_view content, std::optional<mode_t> permissions,
+                std::optional<Owner> owner) {
+  constexpr mode_t kReadable = 0644;
+  std::string name;
+  const int descriptor = createBeside(path, name, permissions.value_or(kReadable));
+  if (descriptor < 0) return fileError(path, errno);
+  int status = owner && fchown(descriptor, owner->user, owner->group) != 0 ? errno : 0;
+  if (status == 0 && permissions && fchmod(descriptor, *permissions) != 0) status = errno;
+  if (status == 0) status = writeWhole(descriptor, content);
+  if (::close(descriptor) != 0 && status == 0) status = errno;
+  if (status == 0 && rename(name.c_str(), std::string(path).c_str()) != 0) status = errno;
+  if (status == 0) return Success();
+  unlink(name.c_str());
+  return fileError(path, status);
+}
+
 }  // namespace
 
 Outcome MakeDirectory(std::string_view path, mode_t permissions) {
@@ -56,7 +77,7 @@ Outcome MakeDirectory(std::string_view path, mode_t permissions) {
   if (directory.has_parent_path()) fs::create_directories(directory.parent_path(), failure);
   if (failure) return fileError(directory.parent_path(), failure.value());
   if (mkdir(directory.c_str(), permissions) == 0) {
-    // The process's mask has taken its part of them.
+    // The process's mask has reduced them.
     if (chmod(directory.c_str(), permissions) == 0) return Success();
     return fileError(directory, errno);
   }
@@ -84,19 +105,38 @@ int CreatePrivateDirectory(const fs::path& directory) {
   return CreatePrivateDirectory(parent);
 }
 
+Result<std::string> ReadWholeFile(const fs::path& path, std::size_t maximumBytes) {
+  const int descriptor = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK);
+  if (descriptor < 0) return fileError(path, errno);
+  std::string content;
+  char part[16'384];
+  ssize_t count = 0;
+  int status = 0;
+  do {
+    count = ::read(descriptor, part, sizeof part);
+    if (count < 0 && errno != EINTR) status = errno;
+    if (count > 0) content.append(part, static_cast<std::size_t>(count));
+    if (content.size() > maximumBytes) status = EFBIG;
+  } while (count != 0 && status == 0);
+  ::close(descriptor);
+  if (status != 0) return fileError(path, status);
+  return content;
+}
+
 Outcome ReplaceFile(std::string_view path, std::string_view content,
                     std::optional<mode_t> permissions) {
-  constexpr mode_t kReadable = 0644;
-  std::string name;
-  const int descriptor = createBeside(path, name, permissions.value_or(kReadable));
-  if (descriptor < 0) return fileError(path, errno);
-  int status = permissions && fchmod(descriptor, *permissions) != 0 ? errno : 0;
-  if (status == 0) status = writeWhole(descriptor, content);
-  if (::close(descriptor) != 0 && status == 0) status = errno;
-  if (status == 0 && rename(name.c_str(), std::string(path).c_str()) != 0) status = errno;
-  if (status == 0) return Success();
-  unlink(name.c_str());
-  return fileError(path, status);
+  return replace(path, content, permissions, std::nullopt);
+}
+
+Outcome RewriteFile(const fs::path& path, std::string_view content, mode_t permissions) {
+  std::error_code ignored;
+  fs::path file = fs::canonical(path, ignored);
+  if (ignored) file = path;
+  struct stat old {};
+  if (::stat(file.c_str(), &old) != 0) return replace(file.native(), content, permissions, {});
+  // Only root may give a file away; another user's rewrite makes the file that user's.
+  const auto owner = ::geteuid() == 0 ? std::optional(Owner{old.st_uid, old.st_gid}) : std::nullopt;
+  return replace(file.native(), content, old.st_mode & 0777, owner);
 }
 
 }  // namespace quarvel

@@ -12,8 +12,8 @@ namespace quarvel {
 
 inline constexpr std::string_view kAbsentText = "(null)";
 
-// How a log line prints an object: dictionaries and lists as compact JSON, a string as it stands,
-// what is absent as "(null)".
+// The text of an object in a log line: dictionaries and lists as compact JSON, a string unchanged,
+// an absent object as "(null)".
 [[nodiscard]] inline std::string Described(const Dictionary& dictionary) {
   return JsonText(dictionary);
 }

@@ -13,6 +13,7 @@
 #include <utility>
 #include <variant>
 
+#include "base/Base64.h"
 #include "base/MessagePack.h"
 #include "base/Utf8.h"
 
@@ -34,12 +35,12 @@ class StringStream {
 
 using PrettyWriter = rapidjson::PrettyWriter<StringStream>;
 
-/// RFC 8259, section 7: these cannot stand in a text as they are.
+/// RFC 8259, section 7: the characters that a string holds only escaped.
 constexpr bool MustBeEscaped(char character) {
   return static_cast<unsigned char>(character) < 0x20 || character == '"' || character == '\\';
 }
 
-/// The same of any of eight characters.
+/// The same for any of eight characters.
 constexpr bool MustAnyBeEscaped(std::uint64_t eight) {
   constexpr std::uint64_t kOnes = 0x0101010101010101U;
   constexpr std::uint64_t kHighBits = 0x8080808080808080U;
@@ -50,7 +51,7 @@ constexpr bool MustAnyBeEscaped(std::uint64_t eight) {
           anyBelow(eight ^ kOnes * '\\', 1)) != 0;
 }
 
-/// Copies a text that needs no escape; false when it does, and then what was copied is undefined.
+/// Copies a text that needs no escape. False when it needs one; then the copy is undefined.
 bool CopyPlain(std::string_view text, char* to) {
   const std::size_t size = text.size();
   if (size < sizeof(std::uint32_t)) {
@@ -60,7 +61,7 @@ bool CopyPlain(std::string_view text, char* to) {
     }
     return true;
   }
-  // What the steps leave over is copied once more with the last one.
+  // The last step overlaps the one before, so that no rest is left.
   if (size < sizeof(std::uint64_t)) {
     std::uint32_t first = 0;
     std::uint32_t last = 0;
@@ -82,9 +83,9 @@ bool CopyPlain(std::string_view text, char* to) {
   return step(size - sizeof(std::uint64_t));
 }
 
-/// Appends compact JSON to a string, with the interface of RapidJSON's writers. Every row of the
-/// store comes through here, and those take a text character by character, at several times the
-/// cost. What is in the string behind the JSON is undefined until the writer has gone.
+/// Appends compact JSON to a string, with the interface of RapidJSON's writers. Those take a text
+/// character by character, at several times the cost, and every row of the store is written here.
+/// The string's bytes behind the JSON are undefined until the writer is destroyed.
 class CompactWriter {
  public:
   explicit CompactWriter(std::string& out) : out_(out), length_(out.size()) {}
@@ -102,7 +103,7 @@ class CompactWriter {
     const auto* end = std::to_chars(digits.data(), digits.data() + digits.size(), number).ptr;
     const std::string_view text(digits.data(), static_cast<std::size_t>(end - digits.data()));
     plain(text);
-    // So that it is read back as what it is.
+    // A reader must see a double, not an integer.
     if (text.find_first_of(".e") == std::string_view::npos) written(copy(".0", room(2)));
   }
   void String(const char* text, rapidjson::SizeType length) { quote({text, length}, false); }
@@ -113,7 +114,7 @@ class CompactWriter {
   void EndArray() { close(']'); }
 
  private:
-  /// Where so many characters may be written; `written` takes the end of those that were.
+  /// Memory for `count` characters; `written` takes the end of those used.
   char* room(std::size_t count) {
     if (out_.size() - length_ < count) {
       out_.resize(std::max(out_.capacity(), 2 * (length_ + count)));
@@ -125,7 +126,7 @@ class CompactWriter {
     for (const char character : text) *at++ = character;
     return at;
   }
-  /// Room for a value of so many characters, behind its comma.
+  /// Memory for a value of `count` characters, behind its comma.
   char* roomForValue(std::size_t count) {
     char* const at = room(count + 1);
     *at = ',';
@@ -177,7 +178,7 @@ class CompactWriter {
       at += text.size();
     } else {
       written(at);
-      // In pieces, so that a long text does not ask for room for the worst of all of it.
+      // In pieces: escapes can make a text six times as long, which a long text need not reserve.
       constexpr std::size_t kPiece = 4096;
       for (; text.size() > kPiece; text.remove_prefix(kPiece)) escaped(text.substr(0, kPiece));
       escaped(text);
@@ -215,8 +216,8 @@ class CompactWriter {
   }
 
   std::string& out_;
-  std::size_t length_;     // of `out_` that is written
-  bool separated_ = true;  // what comes next needs no comma in front
+  std::size_t length_;     // of the part of `out_` that is written
+  bool separated_ = true;  // the next value needs no comma in front
 };
 
 template <class Writer>
@@ -240,26 +241,7 @@ void WriteReal(Writer& writer, double number) {
   }
 }
 
-/// RFC 4648, section 4.
-std::string Base64(std::string_view octets) {
-  static constexpr std::string_view kAlphabet =
-      "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
-  std::string text;
-  text.reserve((octets.size() + 2) / 3 * 4);
-  for (std::size_t i = 0; i < octets.size(); i += 3) {
-    const std::size_t count = std::min<std::size_t>(3, octets.size() - i);
-    std::uint32_t group = 0;
-    for (std::size_t j = 0; j < 3; ++j) {
-      group = group << 8 | (j < count ? static_cast<unsigned char>(octets[i + j]) : 0U);
-    }
-    for (std::size_t j = 0; j < 4; ++j) {
-      text.push_back(j <= count ? kAlphabet[group >> (18 - 6 * j) & 0x3f] : '=');
-    }
-  }
-  return text;
-}
-
-// What payloads and trees do not call alike.
+// The accessors that differ between payloads and trees.
 std::string_view OctetsOf(PayloadValue value) {
   return *value.bytes();
 }
@@ -319,7 +301,7 @@ void Write(Writer& writer, const AnyValue& value) {
     case Value::Kind::string:
       return WriteText(writer, *value.string());
     case Value::Kind::bytes:
-      return WriteText(writer, Base64(OctetsOf(value)));
+      return WriteText(writer, ToBase64(OctetsOf(value)));
     case Value::Kind::date:
       return WriteText(writer, DateCharacters(*value.date()));
     case Value::Kind::list:

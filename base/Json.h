@@ -10,8 +10,8 @@
 
 namespace quarvel {
 
-// JSON keeps less than MessagePack does, so some values are written as text: dates as RFC 3339 with
-// microseconds, bytes as base64, the numbers that JSON lacks as "NaN", "Infinity", "-Infinity".
+// JSON has fewer kinds of values than MessagePack. Dates are written as RFC 3339 text with
+// microseconds, bytes as base64 text, non-finite numbers as "NaN", "Infinity" and "-Infinity".
 // Integer keys become their decimal text. Keys keep their order.
 
 /// Appends compact JSON. A `PayloadValue` must be part of a `Payload`.
@@ -24,7 +24,8 @@ void AppendJson(std::string& out, const Dictionary& dictionary);
 [[nodiscard]] std::string JsonText(const Value& value);
 [[nodiscard]] std::string JsonText(const Dictionary& dictionary);
 
-/// Writes one JSON text for people to read, piece by piece: four blanks a level.
+/// Writes one JSON text for people to read, piece by piece, indented by four blanks a level. One
+/// thread at a time; spent after `finish`.
 class PrettyJsonWriter {
  public:
   PrettyJsonWriter();
@@ -39,8 +40,8 @@ class PrettyJsonWriter {
   void key(std::string_view key);
   void value(PayloadValue value);
   void value(const Dictionary& dictionary);
-  /// The whole text, after the last `end`; the writer is spent. Errors: domain "quarvel.json", when
-  /// a text in it was not UTF-8.
+  /// The whole text, after the last `end`. Errors: domain "quarvel.json", when a string was not
+  /// UTF-8.
   [[nodiscard]] Result<std::string> finish();
 
  private:
@@ -48,9 +49,9 @@ class PrettyJsonWriter {
   std::unique_ptr<Implementation> implementation_;
 };
 
-/// Reads one JSON text, nested at most `MessagePackScanner::kDeepest` deep. Numbers without a
-/// fraction or exponent become integers when they fit 64 bits. Errors: domain "quarvel.json", with
-/// a reason that names the offset.
+/// Reads one JSON text, nested at most `MessagePackScanner::kDeepest` deep. A number without a
+/// fraction or exponent becomes an integer when it fits 64 bits. Errors: domain "quarvel.json"; the
+/// reason names the offset.
 [[nodiscard]] Result<Value> ValueFromJson(std::string_view text);
 
 }  // namespace quarvel

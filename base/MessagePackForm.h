@@ -7,8 +7,8 @@
 
 namespace quarvel {
 
-/// What a MessagePack value's first byte says of it. For base/ alone: the scanner and the walking
-/// of payloads share it.
+/// The form of a MessagePack value, by its first byte. An entry of a constant table, shared by the
+/// scanner and the walking of payloads; for base/ alone.
 struct MessagePackForm {
   /// In the order of `Value::Kind`, whose dates are extensions here.
   enum class Kind : std::uint8_t {
@@ -26,22 +26,23 @@ struct MessagePackForm {
   };
 
   Kind kind;
-  std::uint8_t lengthBytes;  // how many bytes after the first hold a length or count
-  std::uint8_t headBytes;    // the first, those, and an extension's type
+  std::uint8_t lengthBytes;  // bytes after the first that hold a length or count
+  std::uint8_t headBytes;    // the first byte, those, and an extension's type
   std::uint8_t fixed;        // the length or count itself when lengthBytes is 0
 
+  /// The form of values that begin with `code`.
   [[nodiscard]] static inline const MessagePackForm& of(unsigned char code);
   [[nodiscard]] static const MessagePackForm& at(const char* value) {
     return of(static_cast<unsigned char>(*value));
   }
 
   [[nodiscard]] bool isContainer() const { return kind == Kind::list || kind == Kind::dictionary; }
-  /// Bytes after the head; for containers, how many items or entries.
+  /// The number of bytes after the head; for containers, of items or entries.
   [[nodiscard]] std::uint64_t length(const char* value) const {
     return lengthBytes == 0 ? fixed : bigEndian(value + 1, lengthBytes);
   }
 
-  /// `count`: 1, 2, 4 or 8.
+  /// The big-endian number in `count` (1, 2, 4 or 8) bytes.
   [[nodiscard]] static std::uint64_t bigEndian(const char* bytes, std::size_t count) {
     switch (count) {
       case 1:
@@ -66,10 +67,10 @@ struct MessagePackForm {
   }
 };
 
-/// How many of the next values, of `most` at the most and a byte each at the least, are numbers,
-/// booleans and nils of one byte: to pass them at once, since a message may be a million of them.
+/// The number of one-byte values (numbers, booleans, nils) at `next`, up to `most`; there must be
+/// `most` bytes. Passes them at once, since a message may hold a million of them.
 [[nodiscard]] inline std::uint64_t OneByteValues(const char* next, std::uint64_t most) {
-  constexpr std::uint64_t kWorthIt = 16;
+  constexpr std::uint64_t kWorthIt = 16;  // for fewer the ordinary walk is as fast
   if (most < kWorthIt) return 0;
   std::uint64_t count = 0;
   while (count < most) {
@@ -82,9 +83,9 @@ struct MessagePackForm {
   return count;
 }
 
-/// The byte after a well-formed value.
+/// The byte after a well-formed value. Needs no recursion, however deep the value is.
 [[nodiscard]] inline const char* AfterMessagePack(const char* value) {
-  // Values still to be skipped; containers add theirs, so no recursion is needed.
+  // `left`: values still to be skipped; containers add their items.
   for (std::uint64_t left = 1; left > 0; --left) {
     const std::uint64_t passed = OneByteValues(value, left - 1);
     value += passed;

@@ -8,7 +8,8 @@
 
 namespace quarvel {
 
-/// A lock that Clang's thread-safety analysis sees. Covers few lines and calls nothing foreign.
+/// A lock that Clang's thread-safety analysis sees. Lives in the object that it guards. Hold it for
+/// a few lines, and call no function of another class meanwhile.
 class QUARVEL_CAPABILITY("mutex") Mutex {
  public:
   Mutex() = default;
@@ -23,8 +24,8 @@ class QUARVEL_CAPABILITY("mutex") Mutex {
   std::mutex mutex_;
 };
 
-/// A lock that its holder may take again. Only where a locked public function calls back into its
-/// own class.
+/// A lock that its holder may take again: only for a locked public function that calls back into
+/// its own class.
 class QUARVEL_CAPABILITY("mutex") RecursiveMutex {
  public:
   RecursiveMutex() = default;
@@ -54,11 +55,12 @@ class QUARVEL_SCOPED_CAPABILITY BasicMutexLock {
 using MutexLock = BasicMutexLock<Mutex>;
 using RecursiveMutexLock = BasicMutexLock<RecursiveMutex>;
 
-/// Waiting for a change of what a `Mutex` guards. Waits are written as loops: the analysis does not
-/// look into predicates. For the platform and the client library; the core of the service waits in
-/// `Condition`, which its platform can see.
+/// Waits for a change of the state that a `Mutex` guards. Write waits as loops: the analysis does
+/// not look into predicates, and a wait may end early. For the platform and the client library; the
+/// core of the service waits in `Condition`, which its platform can see.
 class ConditionVariable {
  public:
+  /// Releases `mutex` while it waits.
   void wait(Mutex& mutex) QUARVEL_REQUIRES(mutex) {
     std::unique_lock<std::mutex> lock(mutex.mutex_, std::adopt_lock);
     condition_.wait(lock);

@@ -17,7 +17,7 @@ namespace {
 
 using Form = MessagePackForm;
 
-/// What follows the head: the octets of a string, the first item of a list.
+/// The byte after the head: a string's first octet, a list's first item.
 const char* BodyOf(const char* value) {
   return value + Form::at(value).headBytes;
 }
@@ -140,18 +140,19 @@ namespace {
 
 constexpr const char* kEmptyDictionary = "\x80";
 
-/// The keys of one dictionary, however large, by what they are equal to. Points into its bytes.
+/// A hash table of one dictionary's keys; points into the dictionary's bytes.
 class KeyTable {
  public:
   explicit KeyTable(PayloadValue dictionary)
       : bytes_(dictionary.data()),
         places_(std::bit_ceil(dictionary.count() + dictionary.count() / 2 + 1)) {}
 
-  /// Puts the key that begins at `key`, a string or an integer, in the place of an equal one, and
-  /// returns that; null when there is none.
+  /// Puts the key that begins at `key`, a string or an integer, in the place of an equal one.
+  /// Returns the replaced key; null when there is none.
   const char* put(const char* key) {
     const auto offset = static_cast<std::uint64_t>(key - bytes_);
-    if (offset > std::numeric_limits<std::uint32_t>::max()) return nullptr;  // it is no payload
+    if (offset > std::numeric_limits<std::uint32_t>::max())
+      return nullptr;  // too long for a payload
     std::uint32_t& place = placeOf(key);
     const char* const before = at(place);
     place = static_cast<std::uint32_t>(offset);
@@ -183,18 +184,19 @@ class KeyTable {
   }
 
   const char* const bytes_;
-  // From the dictionary's first byte, which no key is.
+  // Offsets from the dictionary's first byte; 0: free, since no key begins there.
   std::vector<std::uint32_t> places_;
 };
 
-/// The keys of one dictionary, to find equal ones. A client's dictionary is small, so comparing is
-/// cheapest; a large one may be meant to make that expensive.
+/// Finds equal keys of one dictionary. Most dictionaries are small, and comparing is cheapest
+/// there; a large one goes to the hash table, since it may be built to make comparing expensive.
 class SeenKeys {
  public:
   explicit SeenKeys(PayloadValue dictionary)
       : dictionary_(dictionary), isSmall_(dictionary.count() <= kSmall) {}
 
-  /// Adds the key that begins at `key`, and says whether it is new. `text` is the key if it is one.
+  /// Adds the key that begins at `key`; returns whether it is new. `text` is the key when that is a
+  /// string.
   bool add(const char* key, const std::optional<std::string_view>& text) {
     if (isSmall_ && text) return addSmall(*text);
     if (!table_) table_.emplace(dictionary_);
@@ -223,7 +225,7 @@ class SeenKeys {
     small_[added_++] = {text.data(), text.size()};
     return true;
   }
-  /// Marks, and says whether it was: two keys with different marks are different.
+  /// Sets the mark and returns whether it was set: keys with different marks are different.
   bool isMarked(std::size_t mark) {
     std::uint64_t& word = marks_[mark / 64 % marks_.size()];
     const std::uint64_t bit = std::uint64_t{1} << mark % 64;
@@ -240,7 +242,8 @@ class SeenKeys {
   std::optional<KeyTable> table_;
 };
 
-/// Walks a well-formed value once: what makes it no payload, and whether it needs rewriting.
+/// Walks a well-formed value once. Finds faults that keep it from being a payload, and equal keys,
+/// which need rewriting.
 class Inspection {
  public:
   /// The byte after the value; null at a fault.
@@ -315,7 +318,7 @@ bool HasEqualKeys(PayloadValue dictionary) {
   return false;
 }
 
-/// Writes a value again, each dictionary without the entries whose key comes again later.
+/// Copies a value, without the entries whose key comes again later in their dictionary.
 void WriteWithLastKeys(MessagePackWriter& writer, PayloadValue value) {
   if (value.kind() == Value::Kind::list) {
     writer.list(value.count());
@@ -415,7 +418,7 @@ Payload Payload::replacingInKeys(char from, char to) const {
     return text && text->find(from) != std::string_view::npos;
   };
   bool any = false;
-  // Most payloads have no such character anywhere, which is found out at once.
+  // Most payloads have no such character anywhere, and one search shows that.
   if (encoded().find(from) != std::string_view::npos) {
     for (const PayloadEntry& entry : root().entries()) any = any || concerned(entry);
   }

@@ -17,10 +17,10 @@
 
 namespace quarvel {
 
-/// A look at one value inside MessagePack bytes, walked in place: no tree, no copy. Cheap to copy,
-/// valid as long as the bytes are. The bytes must be well-formed (a `MessagePackScanner` has found
-/// the value's end); that strings are UTF-8 and keys are of a kind that is allowed is known only
-/// inside a `Payload`.
+/// A view of one value inside MessagePack bytes, walked in place: no tree, no copy. Cheap to copy,
+/// valid as long as the bytes are, safe to use from every thread. The bytes must be well-formed: a
+/// `MessagePackScanner` has found the value's end. Only inside a `Payload` are strings known to be
+/// UTF-8 and keys to be of an allowed kind.
 class PayloadValue {
  public:
   using Kind = Value::Kind;
@@ -30,10 +30,10 @@ class PayloadValue {
   /// The value whose first byte is at `wellFormed`.
   explicit PayloadValue(const char* wellFormed) : at_(wellFormed) {}
 
-  /// Extension values are dates: no other extension is allowed in a payload.
+  /// An extension is a date: no other extension is allowed in a payload.
   [[nodiscard]] Kind kind() const {
     const MessagePackForm& form = MessagePackForm::at(at_);
-    // An unsigned integer is one only above the signed range.
+    // In every form, a number in the signed range is a signed integer.
     if (form.kind == MessagePackForm::Kind::unsignedInteger) {
       return form.fixed == 8 && at_[1] < 0 ? Kind::unsignedInteger : Kind::integer;
     }
@@ -45,8 +45,8 @@ class PayloadValue {
     return kind == MessagePackForm::Kind::integer || kind == MessagePackForm::Kind::unsignedInteger;
   }
 
-  // Each is none when the value is of another kind. The integers accept every integer form whose
-  // number fits.
+  // Each is none when the value is of another kind. The two integers accept every integer form
+  // whose number fits their type.
   [[nodiscard]] inline std::optional<bool> boolean() const;
   [[nodiscard]] inline std::optional<std::int64_t> integer() const;
   [[nodiscard]] inline std::optional<std::uint64_t> unsignedInteger() const;
@@ -59,7 +59,7 @@ class PayloadValue {
   }
   [[nodiscard]] std::optional<Date> date() const;
 
-  /// How many items a list, or entries a dictionary, holds; 0 for other kinds.
+  /// The number of a list's items or a dictionary's entries; 0 for other kinds.
   [[nodiscard]] std::size_t count() const {
     const MessagePackForm& form = MessagePackForm::at(at_);
     return form.isContainer() ? static_cast<std::size_t>(form.length(at_)) : 0;
@@ -73,11 +73,11 @@ class PayloadValue {
 
   /// The value's first byte.
   [[nodiscard]] const char* data() const { return at_; }
-  /// The value's own MessagePack bytes; a walk to its end.
+  /// The value's own MessagePack bytes. Walks to the value's end.
   [[nodiscard]] std::string_view encoded() const {
     return {at_, static_cast<std::size_t>(AfterMessagePack(at_) - at_)};
   }
-  /// The same value as a tree.
+  /// The same value as a tree, which is a copy.
   [[nodiscard]] Value toValue() const;
   [[nodiscard]] Dictionary toDictionary() const;
 
@@ -202,9 +202,10 @@ PayloadValue::Entries PayloadValue::entries() const {
   return {at_ + form.headBytes, form.kind == MessagePackForm::Kind::dictionary ? count() : 0};
 }
 
-/// What a client sends: a dictionary as one immutable, shared block of its own MessagePack bytes.
-/// Its strings are UTF-8, its keys strings or integers, its dates have an RFC 3339 text, no key
-/// stands twice in one dictionary. Copying shares the block; safe to read from every thread.
+/// A client's dictionary as one immutable, shared block of its own MessagePack bytes. Strings are
+/// UTF-8, keys are strings or integers, dates have an RFC 3339 text, no key stands twice in one
+/// dictionary. Copying shares the block, which lives as long as its last copy; every thread may
+/// read it.
 class Payload {
  public:
   /// The empty dictionary.
@@ -214,7 +215,8 @@ class Payload {
   /// reason.
   [[nodiscard]] static Result<Payload> from(PayloadValue dictionary);
   explicit Payload(const Dictionary& dictionary);
-  /// Of what a `MessagePackWriter` wrote: a dictionary that is a payload, which is not checked.
+  /// The payload in the bytes that a `MessagePackWriter` wrote. Precondition, not checked: they are
+  /// a dictionary that is a payload.
   [[nodiscard]] static Payload written(std::string_view encoded) { return Payload(encoded); }
 
   Payload(const Payload& other) noexcept;
@@ -231,18 +233,18 @@ class Payload {
   [[nodiscard]] auto begin() const;
   [[nodiscard]] auto end() const;
   [[nodiscard]] std::optional<PayloadValue> find(std::string_view key) const {
-    // Mostly it is not there, which a search of the bytes shows sooner than a look at each key.
+    // Most lookups fail, and a search of the bytes shows that sooner than a look at each key.
     if (encoded().find(key) == std::string_view::npos) return std::nullopt;
     return root().find(key);
   }
   [[nodiscard]] std::string_view encoded() const;
 
-  /// The payload with `from` replaced by `to` in its own string keys; nested dictionaries are left
-  /// as they are. Of keys that become equal the last one stays. Shares the block when nothing
+  /// The payload with `from` replaced by `to` in its own string keys; nested dictionaries do not
+  /// change. Of keys that become equal the last one stays. Shares the block when nothing
   /// changes.
   [[nodiscard]] Payload replacingInKeys(char from, char to) const;
 
-  /// The payload with `value` under `key`, in place of what stood there or at the end.
+  /// The payload with `value` under `key`: in place of an old value, else at the end.
   [[nodiscard]] Payload setting(std::string_view key, const Value& value) const;
 
   /// Whether both are the same block, or hold the same bytes.

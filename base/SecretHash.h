@@ -7,8 +7,9 @@
 
 namespace quarvel {
 
-/// A hash with a secret of the process in it, for what clients choose: nobody can write keys that
-/// all fall into one place. Folded multiplication, as in wyhash (Wang Yi, 2019; public domain).
+/// A hash keyed with a secret of the process, for values that clients choose: no client can write
+/// keys that all collide. Folded multiplication, as in wyhash (Wang Yi, 2019; public domain). May
+/// be called from any thread; the secret is drawn at the first call and never changes.
 class SecretHash {
  public:
   static std::uint64_t of(std::uint64_t number) {
@@ -49,7 +50,7 @@ class SecretHash {
     }();
     return drawn;
   }
-  /// The halves of the 128 bits of the product, one folded onto the other.
+  /// The exclusive or of the two halves of the 128-bit product.
   static std::uint64_t fold(std::uint64_t a, std::uint64_t b) {
     constexpr std::uint64_t kLow = 0xffff'ffff;
     const std::uint64_t first = (a >> 32) * (b & kLow) + ((a & kLow) * (b & kLow) >> 32);

@@ -3,14 +3,29 @@
 #include <pwd.h>
 #include <unistd.h>
 
+#include <array>
+#include <cerrno>
 #include <cstdlib>
 #include <string>
-#include <string_view>
 
 namespace quarvel {
 namespace {
 
 using std::filesystem::path;
+
+struct Directory {
+  const char* systemdVariable;
+  const char* userVariable;
+  const char* belowHome;  // null: below /run/user
+  const char* installed;
+};
+
+// In the order of `StandardPaths::Kind`.
+constexpr std::array<Directory, 3> kDirectories = {{
+    {"RUNTIME_DIRECTORY", "XDG_RUNTIME_DIR", nullptr, "/run/quarvel"},
+    {"STATE_DIRECTORY", "XDG_STATE_HOME", ".local/state", "/var/lib/quarvel"},
+    {"CONFIGURATION_DIRECTORY", "XDG_CONFIG_HOME", ".config", "/etc/quarvel"},
+}};
 
 /// A variable's value; empty when it is not set.
 path variable(const char* name) {
@@ -18,13 +33,7 @@ path variable(const char* name) {
   return value == nullptr ? path() : path(value);
 }
 
-/// The first directory that systemd names: it separates several by colons.
-path systemdDirectory(const char* name) {
-  const std::string directories = variable(name).native();
-  return std::string_view(directories).substr(0, directories.find(':'));
-}
-
-/// XDG has relative paths ignored.
+/// The XDG specification has relative paths ignored.
 path absoluteVariable(const char* name) {
   path value = variable(name);
   return value.is_absolute() ? value : path();
@@ -36,44 +45,55 @@ path homeDirectory() {
   return user == nullptr ? path("/") : path(user->pw_dir);
 }
 
-path userRuntimeDirectory() {
-  if (path runtime = absoluteVariable("XDG_RUNTIME_DIR"); !runtime.empty()) return runtime;
-  return path("/run/user") / std::to_string(geteuid());
-}
-
-path userDirectory(const char* name, const char* belowHome) {
-  if (path directory = absoluteVariable(name); !directory.empty()) return directory;
-  return homeDirectory() / belowHome;
+path userDirectory(const Directory& directory) {
+  if (path base = absoluteVariable(directory.userVariable); !base.empty()) return base / "quarvel";
+  const path base = directory.belowHome == nullptr ? path("/run/user") / std::to_string(geteuid())
+                                                   : homeDirectory() / directory.belowHome;
+  return base / "quarvel";
 }
 
 }  // namespace
 
+std::vector<path> StandardPaths::candidates(Kind kind, bool root) {
+  const Directory& directory = kDirectories[static_cast<std::size_t>(kind)];
+  std::vector<path> candidates;
+  const std::string named = variable(directory.systemdVariable).native();
+  // systemd separates several directories by colons.
+  if (const std::string first = named.substr(0, named.find(':')); !first.empty()) {
+    candidates.emplace_back(first);
+  }
+  if (!root) candidates.push_back(userDirectory(directory));
+  candidates.emplace_back(directory.installed);
+  return candidates;
+}
+
+path StandardPaths::find(Kind kind, std::string_view file) {
+  const std::vector<path> directories = candidates(kind, geteuid() == 0);
+  for (const path& directory : directories) {
+    if (::access((directory / file).c_str(), F_OK) == 0) return directory / file;
+  }
+  return (errno == EACCES ? directories.back() : directories.front()) / file;
+}
+
 StandardPaths StandardPaths::fromEnvironment(bool root) {
-  StandardPaths directories;
-  directories.runtime = systemdDirectory("RUNTIME_DIRECTORY");
-  if (directories.runtime.empty()) {
-    directories.runtime = root ? path("/run/quarvel") : userRuntimeDirectory() / "quarvel";
-  }
-  directories.state = systemdDirectory("STATE_DIRECTORY");
-  if (directories.state.empty()) {
-    directories.state = root ? path("/var/lib/quarvel")
-                             : userDirectory("XDG_STATE_HOME", ".local/state") / "quarvel";
-  }
-  directories.configuration = systemdDirectory("CONFIGURATION_DIRECTORY");
-  if (directories.configuration.empty()) {
-    directories.configuration =
-        root ? path("/etc/quarvel") : userDirectory("XDG_CONFIG_HOME", ".config") / "quarvel";
-  }
-  directories.socket = variable("QUARVEL_SOCKET");
-  if (directories.socket.empty()) directories.socket = directories.runtime / "reporting.sock";
-  directories.diagnosticsPrefix = variable("QUARVEL_DIAGNOSTICS_PREFIX");
-  return directories;
+  StandardPaths paths;
+  paths.runtime = candidates(Kind::runtime, root).front();
+  paths.state = candidates(Kind::state, root).front();
+  paths.configuration = candidates(Kind::configuration, root).front();
+  paths.socket = variable("QUARVEL_SOCKET");
+  if (paths.socket.empty()) paths.socket = paths.runtime / "reporting.sock";
+  paths.diagnosticsPrefix = variable("QUARVEL_DIAGNOSTICS_PREFIX");
+  return paths;
+}
+
+StandardPaths StandardPaths::fromEnvironment() {
+  return fromEnvironment(geteuid() == 0);
 }
 
 const StandardPaths& StandardPaths::process() {
   // Never destroyed: other threads may ask until the very end.
-  static const StandardPaths& directories = *new StandardPaths(fromEnvironment(geteuid() == 0));
-  return directories;
+  static const StandardPaths& paths = *new StandardPaths(fromEnvironment());
+  return paths;
 }
 
 }  // namespace quarvel

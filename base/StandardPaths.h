@@ -1,11 +1,16 @@
 #pragma once
 
+#include <cstdint>
 #include <filesystem>
+#include <string_view>
+#include <vector>
 
 namespace quarvel {
 
-/// Where the service keeps its files: systemd's directory variables first, then the fall-backs for
-/// a run by hand. Read once per process.
+/// The directories of the service, as systemd's variables name them, with fall-backs for a run by
+/// hand. The service, the client library and the tools all read them here.
+/// A value: read it once and keep it. Reading takes the environment, which nothing may change
+/// meanwhile.
 struct StandardPaths {
   std::filesystem::path runtime;
   std::filesystem::path state;
@@ -15,10 +20,25 @@ struct StandardPaths {
   /// Prefix of the diagnostics directory: `$QUARVEL_DIAGNOSTICS_PREFIX`, empty by default.
   std::filesystem::path diagnosticsPrefix;
 
+  /// The service's own; read once per process, and never destroyed.
   [[nodiscard]] static const StandardPaths& process();
 
-  /// Reads the environment; `root` chooses the fall-backs.
+  /// The directories that a service started with this environment uses. `root` chooses the
+  /// fall-backs; without it the process's effective user decides.
   [[nodiscard]] static StandardPaths fromEnvironment(bool root);
+  [[nodiscard]] static StandardPaths fromEnvironment();
+
+  enum class Kind : std::uint8_t { runtime, state, configuration };
+
+  /// The directories where a service's files may be, in the order in which a client or tool looks:
+  /// the first that systemd names for this process, this user's own (not for root), the installed
+  /// service's. A relative variable is ignored. The first is the one that `fromEnvironment` takes.
+  [[nodiscard]] static std::vector<std::filesystem::path> candidates(Kind kind, bool root);
+
+  /// `file` in the first of the directories that holds it. When none does: in the installed
+  /// service's directory if this user may not look there, so that opening it tells the reason; else
+  /// in the first.
+  [[nodiscard]] static std::filesystem::path find(Kind kind, std::string_view file);
 };
 
 }  // namespace quarvel

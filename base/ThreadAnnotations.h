@@ -1,7 +1,7 @@
 #pragma once
 
 // Clang checks these under -Wthread-safety; for GCC they are empty. A capability is a mutex or a
-// serial queue: what is guarded by a queue is touched only by blocks that run on it.
+// serial queue: only blocks that run on a queue may use the members that it guards.
 
 #if defined(__clang__)
 #define QUARVEL_ANNOTATION(x) __attribute__((x))

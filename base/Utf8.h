@@ -1,12 +1,13 @@
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
 #include <cstring>
 #include <string_view>
 
 namespace quarvel {
 
-/// Whether a text is plain ASCII; a few instructions for the short texts that most are.
+/// Whether a text is plain ASCII. Takes a few instructions for a short text, as most are.
 [[nodiscard]] inline bool IsAscii(std::string_view text) {
   constexpr std::uint64_t kHighBits = 0x8080808080808080U;
   const auto load = [&text]<class Unsigned>(Unsigned bytes, std::size_t offset) -> std::uint64_t {
@@ -15,7 +16,7 @@ namespace quarvel {
   };
   const std::size_t size = text.size();
   std::uint64_t all = 0;
-  // What the steps leave over is looked at again with the last step.
+  // The last step overlaps the one before, so that no rest is left.
   if (size >= 8) {
     for (std::size_t at = 0; at + 8 < size; at += 8) all |= load(std::uint64_t{}, at);
     all |= load(std::uint64_t{}, size - 8);
@@ -66,6 +67,16 @@ namespace quarvel {
     }
   }
   return true;
+}
+
+/// The longest beginning of UTF-8 text that has at most `bytes` bytes and ends between characters.
+[[nodiscard]] inline std::string_view Utf8Prefix(std::string_view text, std::size_t bytes) {
+  if (text.size() <= bytes) return text;
+  const auto isInside = [&text](std::size_t at) {
+    return (static_cast<unsigned char>(text[at]) & 0xc0) == 0x80;
+  };
+  while (bytes > 0 && isInside(bytes)) --bytes;
+  return text.substr(0, bytes);
 }
 
 }  // namespace quarvel

@@ -30,8 +30,8 @@ struct Bytes {
   bool operator==(const Bytes&) const = default;
 };
 
-/// A dictionary's key: a string or an integer. An unsigned integer only above the signed range, so
-/// that equal numbers are equal keys.
+/// A dictionary's key: a string or an integer. Only a number above the signed range is held
+/// unsigned, so that equal numbers are equal keys.
 class Key {
  public:
   Key(std::string text) : key_(std::move(text)) {}         // NOLINT(google-explicit-constructor)
@@ -58,10 +58,10 @@ class Key {
   std::variant<std::string, std::int64_t, std::uint64_t> key_;
 };
 
-/// A tree of property-list values that the service builds and changes itself: user information,
+/// A tree of property-list values that the service itself builds and changes: user information,
 /// defaults, session info, summaries. Numbers keep their kind: signed 64-bit, unsigned 64-bit (only
-/// above the signed range), double and boolean are different. Strings are UTF-8.
-/// Not synchronised: one thread at a time, or a lock around it.
+/// above the signed range), double and boolean are different. Strings are UTF-8. A value; copying
+/// copies the tree. Not synchronised: one thread at a time, or a lock around it.
 class Value {
  public:
   enum class Kind : std::uint8_t {
@@ -118,7 +118,7 @@ class Value {
   bool operator==(const Value& other) const;
 
  private:
-  // A dictionary is held behind a pointer-sized box since it is not complete here.
+  // Holds a dictionary behind a pointer, since the class is not complete here.
   class DictionaryBox {
    public:
     explicit DictionaryBox(Dictionary dictionary);
@@ -140,7 +140,7 @@ class Value {
 };
 
 /// Keys to values, enumerated in the order in which the keys were first set. Two dictionaries are
-/// equal when they hold equal entries, in whatever order.
+/// equal when they hold equal entries, in any order. Not synchronised.
 class Dictionary {
  public:
   using Entry = std::pair<Key, Value>;
@@ -166,7 +166,8 @@ class Dictionary {
   struct KeyHash {
     std::size_t operator()(const Key& key) const { return key.hash(); }
   };
-  /// From here on an index is kept, so that a large hostile dictionary costs no quadratic time.
+  /// From this size on an index is kept, so that a large hostile dictionary costs no quadratic
+  /// time; below it a linear search is faster.
   static constexpr std::size_t kIndexedFrom = 16;
 
   [[nodiscard]] std::size_t indexOf(const Key& key) const;

@@ -10,9 +10,6 @@
 #include <cstring>
 #include <system_error>
 
-#include "client/Connect.h"
-#include "client/Failure.h"
-
 namespace quarvel {
 namespace {
 
@@ -22,7 +19,7 @@ constexpr std::size_t kReadBytes = 65'536;
 
 Result<std::shared_ptr<Client::Channel>> Client::Channel::open(Options options) {
   std::string path = options.socketPath.empty() ? defaultSocketPath() : options.socketPath;
-  auto socket = ConnectTo(path, true);
+  auto socket = connectTo(path, true);
   if (!socket) return std::move(socket.error());
   const auto channel = std::make_shared<Channel>(std::move(options), std::move(path));
   if (auto begun = channel->begin(socket.value()); !begun) return std::move(begun.error());
@@ -57,7 +54,7 @@ Outcome Client::Channel::begin(int socket) {
   if (options_.reconnect) delay_ = options_.reconnect->firstDelay;
   if (!ownThread()) return Success();
 
-  // The program's signals are not for this thread.
+  // This thread takes none of the program's signals.
   sigset_t all;
   sigset_t before;
   sigfillset(&all);
@@ -116,18 +113,18 @@ void Client::Channel::close() {
   }
 }
 
-// In a child process: the thread is not here, the locks may be held by threads that are not, and
-// the socket is the parent's.
+// In a child process: the driver's thread does not exist here, a lock may be held by a thread that
+// does not either, and the socket is the parent's.
 void Client::Channel::abandon() QUARVEL_NO_THREAD_SAFETY_ANALYSIS {
   poller_.abandon();
   if (socket_ >= 0) ::close(std::exchange(socket_, -1));
 }
 
-// ---- Calls, on whichever thread makes them
+// ---- Calls, on the caller's thread
 
-Client::Channel::Sent Client::Channel::take(AnyReply&& reply, const SessionCall& session) {
+Client::Channel::Sent Client::Channel::registerCall(AnyReply&& reply, const SessionCall& session) {
   const bool answered = reply.index() != 0;
-  Sent sent{mayTake(session, reply), std::nullopt};
+  Sent sent{checkCall(session, reply), std::nullopt};
   if (sent.code != Code::none) {
     if (link_ == Link::down && sent.code == Code::connectionLost && !answered) ++unsent_;
     refuse(std::move(reply), sent.code);
@@ -135,28 +132,28 @@ Client::Channel::Sent Client::Channel::take(AnyReply&& reply, const SessionCall&
   }
   Pending pending{std::move(reply), session.kind, session.session};
   if (answered) sent.call = nextNumber();
-  if (!options_.reconnect || !sessions_.note(session, sent.call).own) {
+  if (!options_.reconnect || !sessions_.record(session, sent.call).own) {
     pending.kind = SessionCall::Kind::none;
   }
   if (sent.call) pending_.emplace(*sent.call, std::move(pending));
   return sent;
 }
 
-Client::Code Client::Channel::mayTake(const SessionCall& session, AnyReply& reply) {
+Client::Code Client::Channel::checkCall(const SessionCall& session, AnyReply& reply) {
   if (link_ == Link::lost) return Code::connectionLost;
   if (link_ == Link::up) {
     const bool mayWait = ownThread() && !onDriver();
     return mayWait || gathered_.size() < options_.gatheredBytes ? Code::none : Code::heldBack;
   }
-  Sessions::Noted noted = sessions_.note(session, std::nullopt);
-  refuse(std::move(noted.ended), Code::connectionLost);
-  if (!noted.own) return Code::connectionLost;
+  Sessions::Recorded recorded = sessions_.record(session, std::nullopt);
+  refuse(std::move(recorded.ended), Code::connectionLost);
+  if (!recorded.own) return Code::connectionLost;
   if (session.kind != SessionCall::Kind::start) return Code::deferred;
-  const bool kept = sessions_.keep(session.session, std::nullopt, reply);
+  const bool kept = sessions_.keepReply(session.session, std::nullopt, reply);
   return kept || reply.index() == 0 ? Code::deferred : Code::connectionLost;
 }
 
-// A call that is never answered keeps its number when the numbers have gone round.
+// Numbers wrap around; a call that is never answered keeps its number.
 std::uint32_t Client::Channel::nextNumber() {
   while (pending_.contains(nextCall_)) ++nextCall_;
   return nextCall_++;
@@ -169,7 +166,7 @@ void Client::Channel::refuse(AnyReply&& reply, Code code) {
 }
 
 void Client::Channel::forget(std::uint32_t call) {
-  Pending forgotten;  // outlives the lock, since what it owns is foreign
+  Pending forgotten;  // destroyed after the lock is released, since a reply may own anything
   MutexLock lock(mutex_);
   if (const auto found = pending_.find(call); found != pending_.end()) {
     forgotten = std::move(found->second);
@@ -185,10 +182,10 @@ void Client::Channel::beginBatch() {
 void Client::Channel::endBatch() {
   MutexLock lock(mutex_);
   --batches_;
-  if (hasOutput()) sendWhatIsDue();
+  if (hasOutput()) sendIfDue();
 }
 
-void Client::Channel::sendGathered() {
+void Client::Channel::flush() {
   MutexLock lock(mutex_);
   if (link_ == Link::up && !writing_ && hasOutput()) write(ownThread());
 }
@@ -199,7 +196,7 @@ void Client::Channel::schedule(Time time, std::weak_ptr<Periodic> work) {
   poller_.wake();
 }
 
-void Client::Channel::sendWhatIsDue() {
+void Client::Channel::sendIfDue() {
   if (onDriver()) {
     flushing_ = true;  // when the step ends
     return;
@@ -254,7 +251,7 @@ Client::Channel::Written Client::Channel::writeSending(int socket, bool mayWait)
     } else if (errno == EAGAIN) {
       return Written::some;
     } else if (errno != EINTR) {
-      ::shutdown(socket, SHUT_RDWR);  // the driver finds the end and says so
+      ::shutdown(socket, SHUT_RDWR);  // the driver reads the end and reports it
       return Written::failed;
     }
   }

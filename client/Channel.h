@@ -27,86 +27,95 @@
 
 namespace quarvel {
 
-/// The connection behind a client: frames calls, matches responses with the calls that wait for
-/// them, and makes itself anew where that is wanted. Owned by its client, its thread and its
-/// real-time reporters.
+/// The connection behind a client: frames calls, matches responses with pending calls, and
+/// reconnects where the options ask for it. Owned by its client, its thread and its real-time
+/// reporters; lives until the last of them has gone.
 ///
-/// Everything that reads, gives replies or keeps times happens in `step`, on one thread at a time:
-/// the driver, which is either the connection's own thread or whoever calls `dispatch`. Calls are
-/// written by their callers, as far as that goes.
+/// Threads: reading, replies and timers happen in `step`, on one thread at a time, the driver. The
+/// driver is the connection's own thread, or the thread that is in `dispatch`. Callers write their
+/// own calls as long as the socket takes them; the driver writes the rest.
 class __attribute__((visibility("hidden"))) Client::Channel
     : public std::enable_shared_from_this<Client::Channel> {
  public:
   using Time = Poller::Time;
 
-  /// Work that the driver does from time to time, while its owner keeps it.
+  /// Work that the driver repeats as long as the work's owner keeps it.
   class Periodic {
    public:
     virtual ~Periodic() = default;
-    /// Runs on the driver. Returns when next; none: no more.
+    /// Runs on the driver. Returns the time of the next run; none: no further run.
     virtual std::optional<Time> run() = 0;
   };
 
-  /// Errors: `Code::unreachable`, also when the process may have no further descriptor or thread.
+  /// Connects and starts the driver. Errors: `Code::unreachable`, also when the process can have no
+  /// further descriptor or thread.
   [[nodiscard]] static Result<std::shared_ptr<Channel>> open(Options options);
   Channel(Options options, std::string path);
   ~Channel();
 
   struct Sent {
     Code code = Code::none;
-    /// The number under which the reply is awaited; none for a notification or a call not taken.
+    /// The number under which the reply is pending; none for a notification or a refused call.
     std::optional<std::uint32_t> call;
   };
-  /// Sends one call; an empty `reply` makes it a notification.
+  /// Sends one call; without a `reply` it is a notification. Waits while the service holds this
+  /// client back, if the connection has its own thread and this is another.
   template <class Request, class T>
   Sent send(const Request& request, Reply<T> reply) QUARVEL_EXCLUDES(mutex_);
 
-  /// The reply to this call will not be given.
+  /// Drops the reply of a pending call.
   void forget(std::uint32_t call) QUARVEL_EXCLUDES(mutex_);
 
+  // Between the two, calls gather.
   void beginBatch() QUARVEL_EXCLUDES(mutex_);
   void endBatch() QUARVEL_EXCLUDES(mutex_);
-  /// Sends what has gathered, whatever batches there are.
-  void sendGathered() QUARVEL_EXCLUDES(mutex_);
+  /// Sends the gathered calls, despite open batches.
+  void flush() QUARVEL_EXCLUDES(mutex_);
 
-  /// Has the driver run it at `time`, and again when it says.
+  /// Has the driver run `work` at `time`, and again at each time that a run returns.
   void schedule(Time time, std::weak_ptr<Periodic> work) QUARVEL_EXCLUDES(mutex_);
 
   [[nodiscard]] bool connected() const QUARVEL_EXCLUDES(mutex_);
-  /// Whether a connection is to be expected that is not there.
+  /// Whether the connection is lost and will be made again.
   [[nodiscard]] bool reconnecting() const QUARVEL_EXCLUDES(mutex_);
   [[nodiscard]] int descriptor() const { return ownThread() ? -1 : poller_.descriptor(); }
-  /// Whether this thread is the driver, that is, whether this is a reply.
+  /// Whether this thread is the driver, that is, whether the caller is a reply.
   [[nodiscard]] bool onDriver() const { return driver_.load() == std::this_thread::get_id(); }
 
+  /// One step of the driver on this thread. See `Client::dispatch`.
   Code dispatch(std::optional<Time> deadline) QUARVEL_EXCLUDES(mutex_);
-  /// Drives until `done` or the deadline has passed. False when another thread drives.
+  /// Drives until `done()`, or until the deadline has passed. False when another thread drives.
   template <std::predicate Done>
   bool driveUntil(Done&& done, std::optional<Time> deadline) QUARVEL_EXCLUDES(mutex_);
 
-  /// Sends what has gathered, closes the connection and waits until every pending call is answered;
-  /// on the driver it leaves that to it.
+  /// Sends the gathered calls, closes the connection and waits until every pending call is
+  /// answered. On the driver it returns at once, and the driver does this after the reply.
   void close() QUARVEL_EXCLUDES(mutex_);
 
+  /// None for no wait limit, or one of more than a year.
   [[nodiscard]] static std::optional<Time> DeadlineAfter(
       std::optional<std::chrono::milliseconds> wait);
 
  private:
-  /// This much may gather before it is sent, or before its senders wait.
+  /// Gathered bytes at which a batch is sent early, and at which senders wait for the writer.
   static constexpr std::size_t kGatheredBytes = 65'536;
-  /// A sender that has written this often on behalf of others leaves the rest to the driver; and so
-  /// often the driver reads before it looks at anything else.
+  /// Writes after which a sender leaves other threads' calls to the driver, and reads after which
+  /// the driver looks at its timers.
   static constexpr int kRounds = 16;
+  /// The service's own bound is below this; it keeps a broken peer from taking all memory.
   static constexpr std::size_t kReplyBytes = 67'108'864;
 
+  /// `down`: will be made again; `lost`: will not.
   enum class Link : std::uint8_t { up, down, lost };
   enum class Written : std::uint8_t { all, some, failed };
 
+  /// A call that the service has not answered yet.
   struct Pending {
     AnyReply reply;
     SessionCall::Kind kind = SessionCall::Kind::none;
     ReporterID session = 0;
   };
+  /// A call that this side answers with an error.
   struct Refused {
     AnyReply reply;
     Code code = Code::none;
@@ -117,16 +126,21 @@ class __attribute__((visibility("hidden"))) Client::Channel
   };
 
   [[nodiscard]] bool ownThread() const { return options_.driver == Driver::ownThread; }
+  /// A socket that does not block, connected to the service's at `path`. Errors:
+  /// `Code::unreachable`; also, unless `mayWait`, while the queue of new connections is full.
+  [[nodiscard]] static Result<int> connectTo(const std::string& path, bool mayWait);
   [[nodiscard]] Outcome begin(int socket) QUARVEL_EXCLUDES(mutex_);
 
-  [[nodiscard]] Sent take(AnyReply&& reply, const SessionCall& session) QUARVEL_REQUIRES(mutex_);
-  [[nodiscard]] Code mayTake(const SessionCall& session, AnyReply& reply) QUARVEL_REQUIRES(mutex_);
+  [[nodiscard]] Sent registerCall(AnyReply&& reply, const SessionCall& session)
+      QUARVEL_REQUIRES(mutex_);
+  [[nodiscard]] Code checkCall(const SessionCall& session, AnyReply& reply)
+      QUARVEL_REQUIRES(mutex_);
   [[nodiscard]] std::uint32_t nextNumber() QUARVEL_REQUIRES(mutex_);
   void refuse(AnyReply&& reply, Code code) QUARVEL_REQUIRES(mutex_);
   template <class Request>
   void frame(const Request& request, std::optional<std::uint32_t> call) QUARVEL_REQUIRES(mutex_);
 
-  void sendWhatIsDue() QUARVEL_REQUIRES(mutex_);
+  void sendIfDue() QUARVEL_REQUIRES(mutex_);
   [[nodiscard]] bool hasOutput() const QUARVEL_REQUIRES(mutex_);
   void write(bool mayWait) QUARVEL_REQUIRES(mutex_);
   [[nodiscard]] Written writeSending(int socket, bool mayWait);
@@ -141,18 +155,18 @@ class __attribute__((visibility("hidden"))) Client::Channel
   [[nodiscard]] bool flushed() QUARVEL_EXCLUDES(mutex_);
   void abandon();
 
-  void receiveAndReply() QUARVEL_EXCLUDES(mutex_);
+  void receiveReplies() QUARVEL_EXCLUDES(mutex_);
   [[nodiscard]] std::optional<std::string> receive(bool& more) QUARVEL_EXCLUDES(mutex_);
-  [[nodiscard]] std::optional<std::string> giveReplies() QUARVEL_EXCLUDES(mutex_);
-  [[nodiscard]] bool giveReply(PayloadValue response) QUARVEL_EXCLUDES(mutex_);
-  void giveRefusals() QUARVEL_EXCLUDES(mutex_);
+  [[nodiscard]] std::optional<std::string> deliverReplies() QUARVEL_EXCLUDES(mutex_);
+  [[nodiscard]] bool deliverReply(PayloadValue response) QUARVEL_EXCLUDES(mutex_);
+  void deliverRefusals() QUARVEL_EXCLUDES(mutex_);
 
-  void lose(const std::string& reason, bool forGood) QUARVEL_EXCLUDES(mutex_);
+  void handleLoss(const std::string& reason, bool forGood) QUARVEL_EXCLUDES(mutex_);
   [[nodiscard]] std::size_t dropOutput() QUARVEL_REQUIRES(mutex_);
   [[nodiscard]] std::size_t refusePending() QUARVEL_REQUIRES(mutex_);
   [[nodiscard]] std::chrono::milliseconds nextDelay();
   void reconnect() QUARVEL_EXCLUDES(mutex_);
-  [[nodiscard]] std::size_t makeSessionsAnew() QUARVEL_REQUIRES(mutex_);
+  [[nodiscard]] std::size_t restoreSessions() QUARVEL_REQUIRES(mutex_);
   void runScheduled() QUARVEL_EXCLUDES(mutex_);
   void armTimer() QUARVEL_EXCLUDES(mutex_);
 
@@ -166,28 +180,28 @@ class __attribute__((visibility("hidden"))) Client::Channel
   std::atomic<std::thread::id> driver_{};  // changed under the mutex
 
   mutable Mutex mutex_;
-  ConditionVariable room_;  // output was taken, its writer has ended, or the connection has
+  ConditionVariable room_;  // signalled when output was taken, the writer or the connection ended
   Link link_ QUARVEL_GUARDED_BY(mutex_) = Link::lost;
-  int socket_ QUARVEL_GUARDED_BY(mutex_) = -1;  // closed only while nobody writes
+  int socket_ QUARVEL_GUARDED_BY(mutex_) = -1;  // closed only while `writing_` is false
   std::string gathered_ QUARVEL_GUARDED_BY(mutex_);
   bool writing_ QUARVEL_GUARDED_BY(mutex_) = false;
   bool outputWatched_ QUARVEL_GUARDED_BY(mutex_) = false;
-  bool flushing_ QUARVEL_GUARDED_BY(mutex_) = false;  // what gathered goes out despite batches
+  bool flushing_ QUARVEL_GUARDED_BY(mutex_) = false;  // gathered calls go out despite batches
   int batches_ QUARVEL_GUARDED_BY(mutex_) = 0;
   bool closing_ QUARVEL_GUARDED_BY(mutex_) = false;
   bool finished_ QUARVEL_GUARDED_BY(mutex_) = false;
   std::uint32_t nextCall_ QUARVEL_GUARDED_BY(mutex_) = 0;
   std::unordered_map<std::uint32_t, Pending> pending_ QUARVEL_GUARDED_BY(mutex_);
-  std::vector<Refused> refused_ QUARVEL_GUARDED_BY(mutex_);  // the driver gives them their errors
-  Sessions sessions_ QUARVEL_GUARDED_BY(mutex_);             // kept only to be made anew
-  std::size_t unsent_ QUARVEL_GUARDED_BY(mutex_) = 0;        // while the connection is down
+  std::vector<Refused> refused_ QUARVEL_GUARDED_BY(mutex_);  // the driver delivers their errors
+  Sessions sessions_ QUARVEL_GUARDED_BY(mutex_);             // kept only to be restored
+  std::size_t unsent_ QUARVEL_GUARDED_BY(mutex_) = 0;  // lost notifications while the link is down
   std::vector<Scheduled> scheduled_ QUARVEL_GUARDED_BY(mutex_);
 
-  // Belong to whoever has set `writing_`, who lets go of the mutex to write.
+  // For the thread that has set `writing_`; it releases the mutex to write.
   std::string sending_;
   std::size_t sent_ = 0;
 
-  // The driver's own.
+  // For the driver alone.
   std::vector<char> received_;
   std::size_t begin_ = 0;
   std::size_t end_ = 0;
@@ -204,10 +218,10 @@ Client::Channel::Sent Client::Channel::send(const Request& request, Reply<T> rep
   AnyReply any;
   if (reply) any = std::move(reply);
   MutexLock lock(mutex_);
-  const Sent sent = take(std::move(any), request.session);
+  const Sent sent = registerCall(std::move(any), request.session);
   if (sent.code != Code::none) return sent;
   frame(request, sent.call);
-  sendWhatIsDue();
+  sendIfDue();
   return sent;
 }
 

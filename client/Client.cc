@@ -3,13 +3,12 @@
 #include <utility>
 
 #include "client/Channel.h"
-#include "client/Failure.h"
 #include "client/Operations.h"
 
 namespace quarvel {
 namespace {
 
-/// A reply that a thread waits for.
+/// A reply for which a thread waits. Shared by the waiting call and its callback.
 template <class T>
 class Awaited {
  public:
@@ -24,7 +23,7 @@ class Awaited {
     return result_.has_value();
   }
 
-  /// None when the time is over; without a deadline it never is.
+  /// None when the deadline has passed; without one it waits without limit.
   std::optional<Result<T>> wait(std::optional<Poller::Time> deadline) QUARVEL_EXCLUDES(mutex_) {
     MutexLock lock(mutex_);
     while (!result_) {
@@ -149,7 +148,7 @@ Result<T> Client::Synchronous::ask(const Request& request) {
   const auto awaited = std::make_shared<Awaited<T>>();
   const Channel::Sent sent = channel->send(
       request, Reply<T>([awaited](Result<T> result) { awaited->set(std::move(result)); }));
-  channel->sendGathered();
+  channel->flush();
   if (channel->descriptor() >= 0) {
     const bool driven = channel->driveUntil([&] { return awaited->given(); }, deadline);
     if (!driven && !awaited->given()) {

@@ -11,8 +11,8 @@
 #include "base/MessagePack.h"
 #include "client/Sessions.h"
 
-// The service's operations as they are called: name, arguments in order, and what outlives the
-// connection. All are views for the length of one call.
+// The service's operations as requests: name, arguments in order, and the lasting effect on a
+// session. All are views for the length of one call.
 
 namespace quarvel::operations {
 
@@ -49,7 +49,7 @@ struct Request {
   SessionCall session;
   std::tuple<const Arguments&...> arguments;
 
-  /// The arguments as the wire has them: a list.
+  /// The arguments as a MessagePack list.
   void write(MessagePackWriter& writer) const {
     writer.list(sizeof...(Arguments));
     std::apply([&](const auto&... argument) { (Write(writer, argument), ...); }, arguments);

@@ -30,7 +30,7 @@ timespec AsTimespec(nanoseconds duration) {
   return {static_cast<time_t>(duration / kSecond), static_cast<long>((duration % kSecond).count())};
 }
 
-// Waits are told in milliseconds; a shorter one counts as one, or the waiter would spin.
+// The wait in milliseconds, rounded up: a wait of 0 would spin until the deadline.
 int Milliseconds(std::optional<Poller::Time> deadline) {
   if (!deadline) return -1;
   const auto left =

@@ -7,9 +7,10 @@
 
 namespace quarvel {
 
-/// All that a connection waits for behind one descriptor, which is readable while something is due:
-/// its socket, a wake-up from another thread, a point in time. `wait` and `arm` belong to whoever
-/// drives the connection; the other functions may be called from every thread.
+/// One descriptor for all events of a connection: input on its socket, a wake-up from another
+/// thread, a point in time. It is readable while one of them is due. Owned by the channel and lives
+/// as long. `wait` and `arm` are for the driver's thread; the other functions may be called from
+/// every thread.
 class Poller {
  public:
   using Time = std::chrono::steady_clock::time_point;
@@ -24,14 +25,14 @@ class Poller {
   Poller(const Poller&) = delete;
   Poller& operator=(const Poller&) = delete;
 
-  /// Whether the process was allowed the descriptors; else `errno` of the failure.
+  /// 0, or `errno` of the failure to create the descriptors.
   [[nodiscard]] int error() const { return error_; }
   [[nodiscard]] int descriptor() const { return epoll_; }
 
-  /// The socket is watched until it is closed or another is. Returns 0, or `errno` of the failure.
+  /// Watches a socket until it is closed or unwatched. Returns 0, or `errno` of the failure.
   [[nodiscard]] int watch(int socket) const;
   void unwatch(int socket) const;
-  /// Whether room to write counts as something due.
+  /// Whether room to write is an event too.
   void watchOutput(int socket, bool wanted) const;
 
   /// Ends the wait under way, or the next one.
@@ -39,10 +40,10 @@ class Poller {
   /// Ends a wait at that time; none: at no time.
   void arm(std::optional<Time> time);
 
-  /// Waits until something is due or `deadline` has passed; none: as long as it takes.
+  /// Waits until an event is due or `deadline` has passed; none: without limit.
   [[nodiscard]] Events wait(std::optional<Time> deadline);
 
-  /// Closes the descriptors, of which another process has copies.
+  /// Closes the descriptors, in a child process whose parent keeps copies.
   void abandon();
 
  private:
@@ -52,7 +53,7 @@ class Poller {
   int timer_ = -1;
   int error_ = 0;
 
-  std::optional<Time> armed_;  // the driver's own
+  std::optional<Time> armed_;  // used by the driver alone
 };
 
 }  // namespace quarvel

@@ -11,7 +11,8 @@
 
 namespace quarvel {
 
-/// The consumer's side: sends what the ring holds, on the connection's driver or in `stop`.
+/// The consumer's side: sends the ring's records, on the connection's driver or in `stop`. Owned by
+/// the reporter; the driver holds it while it runs.
 class __attribute__((visibility("hidden"))) RealtimeReporter::Drain final
     : public Client::Channel::Periodic,
       public std::enable_shared_from_this<Drain> {
@@ -35,25 +36,25 @@ class __attribute__((visibility("hidden"))) RealtimeReporter::Drain final
       MutexLock lock(mutex_);
       started_ = false;
     }
-    if (!beginEmptying()) return;
+    if (!beginDrain()) return;
     const bool all = sendAll();
-    endEmptying();
+    endDrain();
     MutexLock lock(mutex_);
     if (!all) schedule();
   }
 
-  /// Counts what could not be sent, which nobody will.
+  /// Stops for good, and counts the records that could not be sent as lost.
   void end() QUARVEL_EXCLUDES(mutex_) {
     stop();
-    if (!beginEmptying()) return;
+    if (!beginDrain()) return;
     for (; ring_.front(); ring_.pop()) ++unsent_;
-    endEmptying();
+    endDrain();
   }
 
   std::optional<Client::Channel::Time> run() override QUARVEL_EXCLUDES(mutex_) {
-    const bool emptying = beginEmptying();
+    const bool emptying = beginDrain();
     const bool all = emptying && sendAll();
-    if (emptying) endEmptying();
+    if (emptying) endDrain();
     MutexLock lock(mutex_);
     scheduled_ = started_ || !all;
     return scheduled_ ? std::optional(nextTime()) : std::nullopt;
@@ -71,24 +72,24 @@ class __attribute__((visibility("hidden"))) RealtimeReporter::Drain final
     if (!std::exchange(scheduled_, true)) channel_->schedule(nextTime(), weak_from_this());
   }
 
-  // Who empties the ring may have to wait for the service, and holds no lock meanwhile. The driver
-  // does not wait for it.
-  bool beginEmptying() QUARVEL_EXCLUDES(mutex_) {
+  // Draining may wait for the service, so no lock is held meanwhile, and the driver does not wait
+  // for another thread's drain.
+  bool beginDrain() QUARVEL_EXCLUDES(mutex_) {
     MutexLock lock(mutex_);
-    while (emptying_) {
+    while (draining_) {
       if (channel_->onDriver()) return false;
-      emptied_.wait(mutex_);
+      drained_.wait(mutex_);
     }
-    return emptying_ = true;
+    return draining_ = true;
   }
 
-  void endEmptying() QUARVEL_EXCLUDES(mutex_) {
+  void endDrain() QUARVEL_EXCLUDES(mutex_) {
     const Loss now = loss();
-    const Loss lost = Difference(now, std::exchange(told_, now));
+    const Loss lost = Difference(now, std::exchange(reportedToCallback_, now));
     if (lost.total() > 0 && options_.lost) options_.lost(lost);
     MutexLock lock(mutex_);
-    emptying_ = false;
-    emptied_.notifyAll();
+    draining_ = false;
+    drained_.notifyAll();
   }
 
   [[nodiscard]] Loss loss() const { return {ring_.full(), ring_.tooLarge(), invalid_, unsent_}; }
@@ -98,7 +99,7 @@ class __attribute__((visibility("hidden"))) RealtimeReporter::Drain final
             one.unsent - other.unsent};
   }
 
-  // Returns whether nothing is left to be sent.
+  // Returns whether everything has been sent.
   bool sendAll() {
     while (const auto record = ring_.front()) {
       if (channel_->reconnecting()) return false;
@@ -118,8 +119,8 @@ class __attribute__((visibility("hidden"))) RealtimeReporter::Drain final
 
   bool sendLossMessage() {
     const Loss now = loss();
-    Loss lost = Difference(now, reported_);
-    lost.unsent = 0;  // where the connection is lost for good there is nobody to tell
+    Loss lost = Difference(now, reportedByMessage_);
+    lost.unsent = 0;  // counted only after a loss for good, when no message can be sent
     if (!options_.lossMessage || lost.total() == 0) return true;
     if (channel_->reconnecting()) return false;
     Dictionary message{{"RealtimeRecordsLost", lost.total()}};
@@ -128,7 +129,7 @@ class __attribute__((visibility("hidden"))) RealtimeReporter::Drain final
     if (lost.invalid > 0) message.set("Invalid", lost.invalid);
     const LossMessage& as = *options_.lossMessage;
     if (send(message, as.category, as.type) == Client::Code::heldBack) return false;
-    reported_ = now;
+    reportedByMessage_ = now;
     return true;
   }
 
@@ -146,18 +147,18 @@ class __attribute__((visibility("hidden"))) RealtimeReporter::Drain final
   const Options options_;
 
   Mutex mutex_;  // taken before the connection's
-  ConditionVariable emptied_;
+  ConditionVariable drained_;
   bool started_ QUARVEL_GUARDED_BY(mutex_) = false;
   bool scheduled_ QUARVEL_GUARDED_BY(mutex_) = false;
-  bool emptying_ QUARVEL_GUARDED_BY(mutex_) = false;
+  bool draining_ QUARVEL_GUARDED_BY(mutex_) = false;
 
-  // Belong to whoever has set `emptying_`; the counts are read by others.
+  // For the thread that has set `draining_`; the counts are read by every thread.
   RealtimeRing ring_;  // as its consumer
   std::atomic<std::uint64_t> sent_{0};
   std::atomic<std::uint64_t> invalid_{0};
   std::atomic<std::uint64_t> unsent_{0};
-  Loss reported_;  // by message
-  Loss told_;      // to the callback
+  Loss reportedByMessage_;   // in a loss message
+  Loss reportedToCallback_;  // to the callback `lost`
 };
 
 RealtimeReporter::RealtimeReporter(Client& client, ReporterID reporterID, Options options)
@@ -212,7 +213,7 @@ Record& Record::set(std::string_view key, std::string_view text) noexcept {
   return *this;
 }
 Record& Record::set(std::string_view key, Date date) noexcept {
-  if (ring_ != nullptr) ring_->date(key, date.time_since_epoch().count());
+  if (ring_ != nullptr) ring_->date(key, date);
   return *this;
 }
 bool Record::send() noexcept {

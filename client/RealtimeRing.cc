@@ -3,26 +3,17 @@
 #include <algorithm>
 #include <bit>
 #include <cstring>
-#include <limits>
-
-// MessagePack is written by hand here, since the writer that everything else uses fills a string.
-// https://msgpack.org
 
 namespace quarvel {
 namespace {
 
 constexpr std::size_t kLargest = 65'536;
-/// A dictionary whose length takes two bytes, so that it can be set when it is known.
-constexpr unsigned char kDictionary16 = 0xde;
+/// The head of a dictionary with up to 65,535 entries; one with fewer than 16 takes a single byte.
 constexpr std::size_t kDictionaryHead = 3;
+constexpr std::size_t kShortDictionary = 16;
 
 constexpr std::size_t RoundedUp(std::size_t size, std::size_t to) {
   return (size + to - 1) / to * to;
-}
-
-constexpr std::size_t StringHead(std::size_t length) {
-  if (length < 32) return 1;
-  return length <= std::numeric_limits<std::uint8_t>::max() ? 2 : 3;
 }
 
 }  // namespace
@@ -43,101 +34,46 @@ bool RealtimeRing::begin(std::uint32_t category, std::uint16_t type) noexcept {
   if (index - knownTaken_ > mask_) knownTaken_ = taken_.load(std::memory_order_acquire);
   if (index - knownTaken_ > mask_) return false;
   slot_ = slot(index);
-  const Head opened{category, 0, type};
+  const Head opened{category, 0, type, 0};
   std::memcpy(slot_, &opened, sizeof opened);
-  at_ = slot_ + sizeof(Head) + kDictionaryHead;
-  end_ = slot_ + sizeof(Head) + recordBytes_;
+  // The dictionary's head is written last, when its count is known.
+  char* const body = slot_ + sizeof(Head);
+  sink_ = FixedSink(body + kDictionaryHead, body + recordBytes_);
   entries_ = 0;
-  overflow_ = false;
   return true;
 }
 
-// Writes a key when it and its value fit.
-bool RealtimeRing::key(std::string_view key, std::size_t valueBytes) noexcept {
-  if (slot_ == nullptr || overflow_) return false;
-  const auto room = static_cast<std::size_t>(end_ - at_);
-  // A length is looked at by itself first, so that no sum can go round.
-  if (key.size() > room || valueBytes > room ||
-      StringHead(key.size()) + key.size() + valueBytes > room) {
-    overflow_ = true;
-    return false;
-  }
-  text(key);
+template <class Write>
+void RealtimeRing::entry(std::string_view name, Write&& write) noexcept {
+  if (slot_ == nullptr) return;
+  Writer writer(sink_);
+  writer.string(name);
+  write(writer);
   ++entries_;
-  return true;
-}
-
-template <class Unsigned>
-void RealtimeRing::bigEndian(Unsigned number) noexcept {
-  for (int shift = 8 * (static_cast<int>(sizeof number) - 1); shift >= 0; shift -= 8) {
-    *at_++ = static_cast<char>(number >> shift);
-  }
-}
-
-void RealtimeRing::text(std::string_view text) noexcept {
-  switch (StringHead(text.size())) {
-    case 1:
-      head(static_cast<unsigned char>(0xa0 | text.size()));
-      break;
-    case 2:
-      head(0xd9);
-      bigEndian(static_cast<std::uint8_t>(text.size()));
-      break;
-    default:
-      head(0xda);
-      bigEndian(static_cast<std::uint16_t>(text.size()));
-  }
-  if (!text.empty()) std::memcpy(at_, text.data(), text.size());
-  at_ += text.size();
 }
 
 void RealtimeRing::boolean(std::string_view name, bool value) noexcept {
-  if (key(name, 1)) head(value ? 0xc3 : 0xc2);
+  entry(name, [=](Writer& writer) { writer.boolean(value); });
 }
 
 void RealtimeRing::integer(std::string_view name, std::int64_t value) noexcept {
-  if (value >= 0) return unsignedInteger(name, static_cast<std::uint64_t>(value));
-  if (!key(name, 9)) return;
-  head(0xd3);
-  bigEndian(static_cast<std::uint64_t>(value));
+  entry(name, [=](Writer& writer) { writer.integer(value); });
 }
 
 void RealtimeRing::unsignedInteger(std::string_view name, std::uint64_t value) noexcept {
-  constexpr std::uint64_t kFixed = 127;
-  if (!key(name, value <= kFixed ? 1 : 9)) return;
-  if (value <= kFixed) return head(static_cast<unsigned char>(value));
-  head(0xcf);
-  bigEndian(value);
+  entry(name, [=](Writer& writer) { writer.unsignedInteger(value); });
 }
 
 void RealtimeRing::real(std::string_view name, double value) noexcept {
-  if (!key(name, 9)) return;
-  head(0xcb);
-  bigEndian(std::bit_cast<std::uint64_t>(value));
+  entry(name, [=](Writer& writer) { writer.real(value); });
 }
 
 void RealtimeRing::string(std::string_view name, std::string_view value) noexcept {
-  if (key(name,
-          value.size() <= recordBytes_ ? StringHead(value.size()) + value.size() : kLargest)) {
-    text(value);
-  }
+  entry(name, [=](Writer& writer) { writer.string(value); });
 }
 
-// The timestamp extension of 96 bits.
-void RealtimeRing::date(std::string_view name, std::int64_t microseconds) noexcept {
-  constexpr std::int64_t kSecond = 1'000'000;
-  if (!key(name, 15)) return;
-  std::int64_t seconds = microseconds / kSecond;
-  std::int64_t rest = microseconds % kSecond;
-  if (rest < 0) {
-    rest += kSecond;
-    --seconds;
-  }
-  head(0xc7);
-  head(12);
-  head(0xff);
-  bigEndian(static_cast<std::uint32_t>(rest * 1'000));
-  bigEndian(static_cast<std::uint64_t>(seconds));
+void RealtimeRing::date(std::string_view name, Date value) noexcept {
+  entry(name, [=](Writer& writer) { writer.date(value); });
 }
 
 bool RealtimeRing::commit() noexcept {
@@ -148,12 +84,15 @@ bool RealtimeRing::commit() noexcept {
   if (slot_ == nullptr) return count(full_);
   char* const begun = slot_;
   slot_ = nullptr;
-  if (overflow_) return count(tooLarge_);
-  const auto length = static_cast<std::uint32_t>(at_ - (begun + sizeof(Head)));
-  std::memcpy(begun + offsetof(Head, length), &length, sizeof length);
-  at_ = begun + sizeof(Head);
-  head(kDictionary16);
-  bigEndian(entries_);
+  if (sink_.overflowed()) return count(tooLarge_);
+  char* const body = begun + sizeof(Head);
+  Head head{};
+  std::memcpy(&head, begun, sizeof head);
+  head.skipped = entries_ < kShortDictionary ? kDictionaryHead - 1 : 0;
+  head.length = static_cast<std::uint32_t>(sink_.end() - (body + head.skipped));
+  std::memcpy(begun, &head, sizeof head);
+  FixedSink front(body + head.skipped, body + kDictionaryHead);
+  Writer(front).dictionary(entries_);
   written_.store(written_.load(kRelaxed) + 1, std::memory_order_release);
   return true;
 }
@@ -168,7 +107,7 @@ std::optional<RealtimeRing::Record> RealtimeRing::front() const noexcept {
       memory_.data() + static_cast<std::size_t>(taken_.load(kRelaxed) & mask_) * stride_;
   Head head{};
   std::memcpy(&head, first, sizeof head);
-  return Record{head.category, head.type, {first + sizeof head, head.length}};
+  return Record{head.category, head.type, {first + sizeof head + head.skipped, head.length}};
 }
 
 void RealtimeRing::pop() noexcept {

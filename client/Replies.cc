@@ -5,8 +5,6 @@
 #include <type_traits>
 #include <utility>
 
-#include "client/Failure.h"
-
 namespace quarvel {
 namespace {
 
@@ -20,7 +18,7 @@ std::optional<Client::ServiceType> AsServiceType(std::optional<PayloadValue> val
   return static_cast<Client::ServiceType>(*code);
 }
 
-// What an operation's reply is in the service's response; none when it is of another kind.
+// Reads an operation's reply from the service's response; none when it is of another kind.
 template <class T>
 std::optional<T> Read(PayloadValue result) {
   if constexpr (std::is_same_v<T, bool>) {
@@ -69,7 +67,7 @@ Overloaded(Cases...) -> Overloaded<Cases...>;
 
 }  // namespace
 
-void GiveResponse(const AnyReply& reply, PayloadValue error, PayloadValue result) {
+void DeliverResponse(const AnyReply& reply, PayloadValue error, PayloadValue result) {
   const auto give = [&]<class T>(const Client::Reply<T>& to) {
     if (!error.isNil()) return to(ReadError(error));
     if (auto read = Read<T>(result)) return to(*std::move(read));
@@ -79,7 +77,7 @@ void GiveResponse(const AnyReply& reply, PayloadValue error, PayloadValue result
   std::visit(Overloaded{[](std::monostate) {}, give}, reply);
 }
 
-void GiveError(const AnyReply& reply, const Error& error) {
+void DeliverError(const AnyReply& reply, const Error& error) {
   const auto give = [&error]<class T>(const Client::Reply<T>& to) { to(error); };
   std::visit(Overloaded{[](std::monostate) {}, give}, reply);
 }

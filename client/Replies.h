@@ -1,5 +1,7 @@
 #pragma once
 
+#include <string>
+#include <utility>
 #include <variant>
 #include <vector>
 
@@ -9,15 +11,23 @@
 
 namespace quarvel {
 
-/// How a call is answered, by the kind of its operation's reply; without one it is a notification.
+/// The callback of a call, by the kind of its operation's reply. Empty: the call is a notification.
 using AnyReply =
     std::variant<std::monostate, Client::Reply<bool>, Client::Reply<Client::ServiceType>,
                  Client::Reply<std::monostate>, Client::Reply<Client::Validity>,
                  Client::Reply<std::vector<ReporterID>>, Client::Reply<Value>>;
 
-/// Gives what the service's response holds: its error unless that is nil, else its result.
-void GiveResponse(const AnyReply& reply, PayloadValue error, PayloadValue result);
+/// Calls `reply` with the contents of the service's response: the error unless that is nil, else
+/// the result. On the driver's thread, without a lock.
+void DeliverResponse(const AnyReply& reply, PayloadValue error, PayloadValue result);
 
-void GiveError(const AnyReply& reply, const Error& error);
+/// Calls `reply` with an error of this side. Like `DeliverResponse`.
+void DeliverError(const AnyReply& reply, const Error& error);
+
+/// An error of this side of the connection; `reason` is a sentence.
+inline Error Failure(Client::Code code, std::string reason) {
+  return Error::because(std::string(Client::kErrorDomain), static_cast<std::int64_t>(code),
+                        std::move(reason));
+}
 
 }  // namespace quarvel

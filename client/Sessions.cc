@@ -10,7 +10,7 @@ Sessions::Session* Sessions::find(ReporterID session) {
   return found == sessions_.end() ? nullptr : &*found;
 }
 
-Sessions::Noted Sessions::note(const SessionCall& call, std::optional<std::uint32_t> number) {
+Sessions::Recorded Sessions::record(const SessionCall& call, std::optional<std::uint32_t> number) {
   using Kind = SessionCall::Kind;
   if (call.kind == Kind::none) return {};
   Session* session = find(call.session);
@@ -19,12 +19,12 @@ Sessions::Noted Sessions::note(const SessionCall& call, std::optional<std::uint3
     sessions_.push_back({call.session, {}, {}, false, {}, {}});
     return {true, {}};
   }
-  Noted noted{true, {}};
+  Recorded recorded{true, {}};
   switch (call.kind) {
     case Kind::none:
       break;
     case Kind::create:
-      noted.ended = std::move(session->stopped);
+      recorded.ended = std::move(session->stopped);
       *session = {call.session, {}, {}, false, {}, {}};
       break;
     case Kind::setServiceType:
@@ -44,18 +44,19 @@ Sessions::Noted Sessions::note(const SessionCall& call, std::optional<std::uint3
       if (!std::exchange(session->started, true)) session->start = number;
       break;
     case Kind::stop:
-      noted.ended = std::exchange(session->stopped, AnyReply());
+      recorded.ended = std::exchange(session->stopped, AnyReply());
       session->started = false;
       break;
     case Kind::destroy:
-      noted.ended = std::move(session->stopped);
+      recorded.ended = std::move(session->stopped);
       sessions_.erase(sessions_.begin() + (session - sessions_.data()));
       break;
   }
-  return noted;
+  return recorded;
 }
 
-bool Sessions::keep(ReporterID reporterID, std::optional<std::uint32_t> number, AnyReply& stopped) {
+bool Sessions::keepReply(ReporterID reporterID, std::optional<std::uint32_t> number,
+                         AnyReply& stopped) {
   Session* session = find(reporterID);
   const bool telling = session != nullptr && session->started && session->start == number &&
                        session->stopped.index() == 0;

@@ -10,7 +10,8 @@
 
 namespace quarvel {
 
-/// What a call asks of one session of this client, as far as it outlives the connection.
+/// The lasting effect of a call on one session of this client: the part that must be repeated on a
+/// new connection. A view for the length of the call.
 struct SessionCall {
   enum class Kind : std::uint8_t {
     none,
@@ -27,8 +28,8 @@ struct SessionCall {
   const PayloadArgument* configuration = nullptr;  // of `setConfiguration`
 };
 
-/// The sessions that a client has asked for, so that they can be made anew on another connection.
-/// Not synchronised.
+/// The sessions that a client has created, as they must be restored on a new connection. Owned by
+/// the connection and guarded by its mutex.
 class Sessions {
  public:
   struct Session {
@@ -36,26 +37,27 @@ class Sessions {
     std::optional<Client::ServiceType> serviceType;
     std::optional<Dictionary> configuration;
     bool started = false;
-    /// Under which number the start's reply is awaited.
+    /// The number under which the start's reply is pending.
     std::optional<std::uint32_t> start;
-    /// The start's reply, while there is no connection on which it could be awaited.
+    /// The start's reply, kept while there is no connection on which it could arrive.
     AnyReply stopped;
   };
 
-  struct Noted {
-    /// The session is this client's own, or was until this call.
+  struct Recorded {
+    /// The session is this client's, or was until this call.
     bool own = false;
-    /// The reply of a start that nobody will answer any more: it was kept, and its session has
-    /// gone.
+    /// The kept reply of a start whose session this call has ended: the service will never answer
+    /// it.
     AnyReply ended;
   };
-  /// Takes note of a call; a start that is the session's first is awaited under `number`.
-  [[nodiscard]] Noted note(const SessionCall& call, std::optional<std::uint32_t> number);
+  /// Records a call's lasting effect. A start that is the session's first is pending under
+  /// `number`.
+  [[nodiscard]] Recorded record(const SessionCall& call, std::optional<std::uint32_t> number);
 
-  /// Takes the reply of the start that was awaited under `number` and would have told of the
-  /// session's end, until the session is started anew. False: it is no such reply, and stays.
-  [[nodiscard]] bool keep(ReporterID reporterID, std::optional<std::uint32_t> number,
-                          AnyReply& stopped);
+  /// Keeps `stopped` until the session is started on a new connection, when it is the reply of the
+  /// start that was pending under `number`. False, and `stopped` is untouched, when it is not.
+  [[nodiscard]] bool keepReply(ReporterID reporterID, std::optional<std::uint32_t> number,
+                               AnyReply& stopped);
 
   /// In the order in which they were created.
   [[nodiscard]] std::vector<Session>& all() { return sessions_; }

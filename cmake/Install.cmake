@@ -36,7 +36,7 @@ install(TARGETS quarvel EXPORT quarvel LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDI
 install(DIRECTORY client/include/quarvel DESTINATION ${CMAKE_INSTALL_INCLUDEDIR} COMPONENT development)
 # The values that the client's headers speak of. Installed, they include each other as neighbours, so
 # that nobody's include path holds a folder of so common a name as base/.
-foreach(HEADER Date Error Json MessagePackForm Payload Value)
+foreach(HEADER Date Error Json MessagePackForm Payload Value Vocabulary)
   set(INSTALLED ${PROJECT_BINARY_DIR}/include/quarvel/base/${HEADER}.h)
   set_property(DIRECTORY APPEND PROPERTY CMAKE_CONFIGURE_DEPENDS base/${HEADER}.h)
   file(READ base/${HEADER}.h TEXT)

@@ -1,10 +1,11 @@
 #include "device/OrientationFiles.h"
 
-#include <fstream>
 #include <string>
+#include <string_view>
 #include <system_error>
 #include <utility>
 
+#include "base/Files.h"
 #include "device/CounterFile.h"
 #include "platform/Log.h"
 
@@ -58,11 +59,9 @@ void OrientationFiles::stop(OrientationKind) {}
 std::optional<Orientation> OrientationFiles::read(OrientationKind kind) const {
   ZQ_FUNCTION("OrientationFiles");
   const std::filesystem::path file = directory_ / fileName(kind);
-  std::ifstream stream(file, std::ios::binary);
-  if (!stream) return std::nullopt;
-  std::string text(64, '\0');
-  stream.read(text.data(), static_cast<std::streamsize>(text.size()));
-  text.resize(static_cast<std::size_t>(stream.gcount()));
+  const auto content = ReadWholeFile(file);
+  if (!content) return std::nullopt;
+  const std::string_view text = std::string_view(content.value()).substr(0, 64);
   const auto orientation = OrientationFromText(text);
   if (!orientation) {
     ZQ_LOG(nullptr, error, "{} holds \"{}\", which is no orientation", file.native(), text);

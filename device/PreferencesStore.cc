@@ -1,14 +1,14 @@
 #include "device/PreferencesStore.h"
 
-#include <fcntl.h>
 #include <fmt/format.h>
 #include <toml++/toml.h>
-#include <unistd.h>
 
 #include <cerrno>
 #include <system_error>
 #include <utility>
 
+#include "base/Files.h"
+#include "base/FlatValue.h"
 #include "platform/Log.h"
 
 namespace quarvel {
@@ -25,42 +25,16 @@ Error preferencesError(const std::filesystem::path& file, const toml::source_reg
                         fmt::format("{}:{}: {}", file.native(), place.begin.line, fault));
 }
 
-/// Nil when the node is neither string, number nor boolean.
-Value flatValue(const toml::node& node) {
-  if (const auto* text = node.as_string()) return text->get();
-  if (const auto* integer = node.as_integer()) return integer->get();
-  if (const auto* real = node.as_floating_point()) return real->get();
-  if (const auto* boolean = node.as_boolean()) return boolean->get();
-  return nullptr;
-}
-
-/// The whole of a small file; an absent file is empty.
-Result<std::string> contentOf(const std::filesystem::path& file) {
-  const int descriptor = ::open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK);
-  if (descriptor < 0 && errno == ENOENT) return std::string();
-  if (descriptor < 0) return preferencesError(file, std::generic_category().message(errno));
-  std::string content(PreferencesStore::kMaximumBytes + 1, '\0');
-  std::size_t length = 0;
-  ssize_t count = 0;
-  do {
-    count = ::read(descriptor, content.data() + length, content.size() - length);
-    if (count > 0) length += static_cast<std::size_t>(count);
-  } while (count > 0 || (count < 0 && errno == EINTR));
-  const int status = count < 0 ? errno : 0;
-  ::close(descriptor);
-  if (status != 0) return preferencesError(file, std::generic_category().message(status));
-  if (length > PreferencesStore::kMaximumBytes) {
+Result<Dictionary> readDomain(const std::filesystem::path& file) {
+  const Result<std::string> content = ReadWholeFile(file, PreferencesStore::kMaximumBytes);
+  if (content) return PreferencesFromText(content.value(), file);
+  const auto status = static_cast<int>(content.error().code);
+  if (status == ENOENT) return Dictionary();
+  if (status == EFBIG) {
     return preferencesError(
         file, fmt::format("longer than the {} bytes allowed", PreferencesStore::kMaximumBytes));
   }
-  content.resize(length);
-  return content;
-}
-
-Result<Dictionary> readDomain(const std::filesystem::path& file) {
-  const Result<std::string> content = contentOf(file);
-  if (!content) return content.error();
-  return PreferencesFromText(content.value(), file);
+  return preferencesError(file, std::generic_category().message(status));
 }
 
 }  // namespace
@@ -69,7 +43,7 @@ Result<Dictionary> PreferencesFromText(std::string_view text, const std::filesys
   try {
     Dictionary entries;
     for (const auto& [key, node] : toml::parse(text)) {
-      Value value = flatValue(node);
+      Value value = FlatValue(node);
       if (value.isNil()) {
         return preferencesError(
             file, node.source(),

@@ -1,4 +1,4 @@
-/* A program with an event loop of its own reports a session: no thread is made, nothing waits.
+/* A program with its own event loop reports a session: the library makes no thread, no call waits.
  *
  * Usage: client-c [SOCKET]    (else $QUARVEL_SOCKET, else where the service listens by default) */
 

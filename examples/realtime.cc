@@ -1,6 +1,5 @@
-// An audio callback reports: what it does between two interrupts allocates nothing, locks nothing
-// and calls nothing of the system. A thread that wakes up as an audio device would stands for the
-// device.
+// An audio callback reports messages: between two interrupts it allocates nothing, takes no lock
+// and makes no system call. A thread that wakes up at the same rate stands for the audio device.
 //
 // Usage: realtime [SOCKET]    (else $QUARVEL_SOCKET, else where the service listens by default)
 
@@ -26,7 +25,7 @@ namespace {
 constexpr int kCallbacks = 200;
 constexpr std::chrono::microseconds kPeriod(2'667);  // 128 frames at 48 kHz
 
-/// What is called each period, on the device's thread.
+/// Called in each period, on the device's thread.
 void AudioCallback(RealtimeReporter& reporter, int number, double load) {
   reporter.record(vocabulary::Kind::performance, RealtimeReporter::MessageType::generic)
       .set("callback", number)
@@ -37,7 +36,7 @@ void AudioCallback(RealtimeReporter& reporter, int number, double load) {
 }
 
 void RunDevice(RealtimeReporter& reporter) {
-  // As a device's thread would; without the right to it, it is an ordinary thread.
+  // A device's thread has real-time priority; without the permission this stays an ordinary thread.
   const sched_param priority{sched_get_priority_min(SCHED_FIFO)};
   pthread_setschedparam(pthread_self(), SCHED_FIFO, &priority);
   Clock::time_point next = Clock::now();
@@ -74,7 +73,7 @@ int main(int argc, char** argv) {
   reporter.start();
   std::thread device(RunDevice, std::ref(reporter));
   device.join();
-  reporter.stop();  // what is left goes ahead of the session's end
+  reporter.stop();  // the last records go ahead of the session's end
 
   const auto stopped = client.sync().stopReportingSessionForID(session);
   if (!stopped) std::cerr << stopped.error().description() << '\n';

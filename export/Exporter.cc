@@ -6,6 +6,7 @@
 #include <random>
 #include <utility>
 
+#include "base/Utf8.h"
 #include "platform/Log.h"
 
 namespace quarvel {
@@ -30,9 +31,7 @@ std::function<double()> Generator() {
 
 std::string Shorten(const std::string& text) {
   if (text.size() <= kReasonBytes) return text;
-  std::size_t end = kReasonBytes;
-  while ((static_cast<unsigned char>(text[end]) & 0xc0) == 0x80) --end;
-  return text.substr(0, end) + "…";
+  return std::string(Utf8Prefix(text, kReasonBytes)) + "…";
 }
 
 ExportRecord::Line LineOf(const ExportBatch& batch, std::size_t first, std::size_t last,

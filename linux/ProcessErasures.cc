@@ -4,9 +4,7 @@
 
 #include <algorithm>
 #include <filesystem>
-#include <fstream>
 #include <future>
-#include <iterator>
 #include <optional>
 #include <string>
 #include <system_error>
@@ -39,11 +37,8 @@ Error Unknown(std::string reason) {
 }
 
 Result<ErasureSelection> SelectionIn(const path& request) {
-  std::ifstream file(request);
-  std::string text(kLongestRequest, '\0');
-  file.read(text.data(), static_cast<std::streamsize>(text.size()));
-  text.resize(static_cast<std::size_t>(file.gcount()));
-  const auto value = ValueFromJson(text);
+  const auto text = ReadWholeFile(request, kLongestRequest);
+  const auto value = ValueFromJson(text ? text.value() : std::string());
   const Dictionary* wanted = value ? value.value().dictionary() : nullptr;
   if (wanted == nullptr || wanted->size() != 1) return Unknown("The request is not understood.");
   if (const Value* session = wanted->find("session"); session && session->integer()) {

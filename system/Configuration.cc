@@ -1,9 +1,7 @@
 #include "system/Configuration.h"
 
-#include <fcntl.h>
 #include <fmt/format.h>
 #include <fmt/ranges.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -11,6 +9,7 @@
 #include <optional>
 #include <utility>
 
+#include "base/Files.h"
 #include "base/StandardPaths.h"
 #include "platform/Log.h"
 #include "platform/Process.h"
@@ -120,28 +119,6 @@ void readRoot(Section& root, std::span<const BackendKind> backends, Configuratio
   readLimits(root.section("limits"), out.limits);
 }
 
-/// The whole of a file; a missing one is empty.
-Result<std::string> readText(const std::filesystem::path& file) {
-  const auto failure = [&file] {
-    return Error::because("quarvel.configuration", 1,
-                          fmt::format("{}: {}.", file.native(), std::strerror(errno)));
-  };
-  const int descriptor = ::open(file.c_str(), O_RDONLY | O_CLOEXEC);
-  if (descriptor < 0 && (errno == ENOENT || errno == ENOTDIR)) return std::string();
-  if (descriptor < 0) return failure();
-  std::string content;
-  char part[4096];
-  ssize_t count = 0;
-  while ((count = ::read(descriptor, part, sizeof part)) > 0 || (count < 0 && errno == EINTR)) {
-    if (count > 0) content.append(part, static_cast<std::size_t>(count));
-  }
-  std::optional<Error> error;
-  if (count < 0) error = failure();
-  ::close(descriptor);
-  if (error) return *error;
-  return content;
-}
-
 Configuration readForProcess() {
   ZQ_FUNCTION("ConfigurationRead");
   std::vector<std::string> warnings;
@@ -183,12 +160,16 @@ std::vector<std::string> Configuration::Agent::remoteBackends() const {
 Result<Configuration> Configuration::read(const std::filesystem::path& file,
                                           std::span<const BackendKind> backends,
                                           std::vector<std::string>& warnings) {
-  const Result<std::string> text = readText(file);
-  if (!text) return text.error();
+  const Result<std::string> text = ReadWholeFile(file);
+  const int status = text ? 0 : static_cast<int>(text.error().code);
+  if (status != 0 && status != ENOENT && status != ENOTDIR) {
+    return Error::because("quarvel.configuration", 1,
+                          fmt::format("{}: {}.", file.native(), std::strerror(status)));
+  }
   Configuration configuration;
   auto error = ReadConfigurationText(
-      text.value(), file, [&](Section& root) { readRoot(root, backends, configuration); },
-      warnings);
+      status == 0 ? text.value() : std::string(), file,
+      [&](Section& root) { readRoot(root, backends, configuration); }, warnings);
   if (error) return *std::move(error);
   return configuration;
 }

@@ -7,7 +7,8 @@
 #include "base/Date.h"
 #include "base/Error.h"
 
-// What quarvelctl does. Each prints to standard output and returns why it could not.
+// The commands of quarvelctl. Each runs on the main thread, prints to standard output and returns
+// the reason when it fails.
 
 namespace quarvel::commands {
 
@@ -17,11 +18,11 @@ struct Options {
   std::string store;   // empty: where the service keeps it by default
 };
 
-/// Which rows of a table in the store.
+/// Selects rows of a table in the store.
 struct RowOptions {
   std::optional<Date> since;
   std::optional<std::int64_t> last;
-  bool follow = false;  // go on with those that come, for ever
+  bool follow = false;  // wait for further rows, without end
 };
 
 struct MessageOptions : RowOptions {
@@ -48,14 +49,14 @@ struct DefaultsOptions {
   std::string domain = "tarnwick.quarvel";
   std::string key;  // of `DefaultsRead`: empty for all
   std::string value;
-  bool string = false;  // the value is a string, whatever it looks like
+  bool string = false;  // the value is a string, even when it looks like a number
   bool notify = false;  // have the service read the change
 };
 
 inline constexpr const char* kReportingNotification = "tarnwick.quarvel.reporting";
 
-/// Plays a script; "-" is standard input, each line of which is played as it comes. A file is read
-/// whole first, so that nothing is played of one that has a fault.
+/// Plays a script; "-" is standard input, played line by line as it arrives. A file is read whole
+/// first, so that no line of a faulty file is played.
 [[nodiscard]] Outcome Run(const Options& options, const std::string& file);
 
 [[nodiscard]] Outcome Reporters(const Options& options);
@@ -63,17 +64,17 @@ inline constexpr const char* kReportingNotification = "tarnwick.quarvel.reportin
 [[nodiscard]] Outcome Valid(const Options& options, std::int64_t reporterID);
 [[nodiscard]] Outcome Kill(const Options& options);
 
-/// Sessions are not followed: what is told of one changes until it ends.
+/// Sessions are not followed: a session's line changes until the session ends.
 [[nodiscard]] Outcome Sessions(const Options& options, const RowOptions& which);
 [[nodiscard]] Outcome Messages(const Options& options, const MessageOptions& which);
 [[nodiscard]] Outcome Events(const Options& options, const EventOptions& which);
-/// What the latest run of this session was. Fails when the store has none.
+/// Summarises the latest run of this session. Fails when the store has none.
 [[nodiscard]] Outcome Summary(const Options& options, std::int64_t reporterID);
 
-/// What left the device and when, and how far each backend is.
+/// Lists the rows that left the device, with times, and each backend's backlog.
 [[nodiscard]] Outcome Exports(const Options& options, const ExportOptions& which);
-/// Removes rows from the device for good: the service does so, or while there is none, and for a
-/// store that the options name, this does.
+/// Removes rows from the device for good. The service does this; while none runs, and for a store
+/// that the options name, the tool does.
 [[nodiscard]] Outcome Erase(const Options& options, const EraseOptions& which);
 
 /// The preferences, as the service will read them. Reading or deleting a key that has no value
@@ -81,10 +82,10 @@ inline constexpr const char* kReportingNotification = "tarnwick.quarvel.reportin
 [[nodiscard]] Outcome DefaultsRead(const Options& options, const DefaultsOptions& which);
 [[nodiscard]] Outcome DefaultsWrite(const Options& options, const DefaultsOptions& which);
 [[nodiscard]] Outcome DefaultsDelete(const Options& options, const DefaultsOptions& which);
-/// Tells how the service is. Fails when it does not answer, or is not well.
+/// Prints the service's status. Fails when the service does not answer, or is not healthy.
 [[nodiscard]] Outcome ServiceStatus(const Options& options);
 
-/// Posts a notification. Fails when no service is there that takes one.
+/// Posts a notification. Fails when no running service takes notifications.
 [[nodiscard]] Outcome Notify(const Options& options, const std::string& name);
 
 }  // namespace quarvel::commands

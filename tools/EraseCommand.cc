@@ -3,17 +3,15 @@
 
 #include <chrono>
 #include <filesystem>
-#include <fstream>
-#include <iterator>
 #include <system_error>
 #include <utility>
 
+#include "base/Files.h"
 #include "base/Json.h"
 #include "store/database/Erasure.h"
-#include "tools/Arrival.h"
 #include "tools/Commands.h"
-#include "tools/Notification.h"
-#include "tools/Shown.h"
+#include "tools/Format.h"
+#include "tools/ServiceFiles.h"
 #include "tools/Store.h"
 
 namespace quarvel::commands {
@@ -60,23 +58,23 @@ Error CannotAsk(const path& directory, const std::error_code& why) {
 
 Result<std::int64_t> AskService(const Options& options, const ErasureSelection& selection) {
   const path directory = RuntimeDirectory(options) / "erase";
-  const Arrival arrival(directory);
+  const FileArrival arrival(directory);
   if (!arrival.watching()) return CannotAsk(directory, {errno, std::generic_category()});
   const std::string name = fmt::format("{}-{}", Now().time_since_epoch().count(), ::getpid());
-  const path draft = directory / (name + ".draft");
-  std::ofstream(draft) << JsonText(RequestFor(selection));
-  std::error_code failure;
-  std::filesystem::rename(draft, directory / (name + ".json"), failure);
-  if (failure) return CannotAsk(directory, failure);
+  const auto written =
+      ReplaceFile((directory / (name + ".json")).native(), JsonText(RequestFor(selection)));
+  if (!written) {
+    return CannotAsk(directory, {static_cast<int>(written.error().code), std::generic_category()});
+  }
   if (const auto posted = Post(options, kErasureNotification); !posted) return posted.error();
   const std::string answered = name + ".answer";
-  if (!arrival.await(answered.c_str(), kPatience)) {
+  if (!arrival.wait(answered.c_str(), kPatience)) {
     return Failed("The service has not answered yet; it will carry this out when it comes to it.");
   }
-  std::ifstream file(directory / answered);
-  const std::string text((std::istreambuf_iterator<char>(file)), std::istreambuf_iterator<char>());
-  std::filesystem::remove(directory / answered, failure);
-  const auto answer = ValueFromJson(text);
+  const auto text = ReadWholeFile(directory / answered);
+  std::error_code ignored;
+  std::filesystem::remove(directory / answered, ignored);
+  const auto answer = ValueFromJson(text ? text.value() : std::string());
   const Dictionary* found = answer ? answer.value().dictionary() : nullptr;
   const Value* rows = found != nullptr ? found->find("rows") : nullptr;
   if (rows != nullptr && rows->integer() != nullptr) return *rows->integer();

@@ -10,8 +10,8 @@
 
 #include "base/Json.h"
 #include "tools/Commands.h"
-#include "tools/Notification.h"
-#include "tools/Shown.h"
+#include "tools/Format.h"
+#include "tools/ServiceFiles.h"
 #include "tools/Store.h"
 #include "tools/Table.h"
 #include "tools/Terminal.h"

@@ -34,7 +34,7 @@ void PrintReply(const script::Call& call, bool ok, const Value& reply) {
   std::fflush(stdout);
 }
 
-// The session that a call of one argument is about.
+// The session that a call with one argument names.
 std::optional<std::int64_t> SessionOf(const script::Call& call) {
   if (call.values.size() != 1 || call.values[0].integer() == nullptr) return std::nullopt;
   return *call.values[0].integer();
@@ -98,7 +98,7 @@ Outcome Player::playCall(const script::Call& call) {
 Outcome Player::playExpect(const script::Expect& expect) {
   MutexLock lock(replies_->mutex);
   if (!replies_->last) return Failed("No reply has been waited for yet that could be expected.");
-  // As printed, so that a script can expect what it has seen.
+  // Compared as printed, so that a script can expect the text of an earlier run.
   const std::string last = JsonText(*replies_->last);
   const auto printed = ValueFromJson(last);
   if (printed && printed.value() == expect.value) return Success();

@@ -13,24 +13,24 @@
 
 namespace quarvel {
 
-/// Plays a script on one connection and prints each reply as a JSON line when it arrives. The
-/// functions are for one thread; replies come on the client's.
+/// Plays a script on one connection and prints each reply as a JSON line when it arrives. Owned by
+/// one command. The functions are for one thread; replies come on the client's thread.
 class Player {
  public:
   explicit Player(Client client);
-  /// Closes the connection; what is answered only because of that is not printed.
+  /// Closes the connection; the errors that this causes are not printed.
   ~Player();
   Player(const Player&) = delete;
   Player& operator=(const Player&) = delete;
 
   /// Errors: an expectation that is not met, a connection that is lost.
   [[nodiscard]] Outcome play(const script::Step& step);
-  /// Waits for the replies that are still to come: every call's, and the start's of each session
-  /// that the script has stopped, for at most ten seconds after its last line.
+  /// Waits for the outstanding replies of all calls. For the start of a session that the script has
+  /// stopped it waits ten seconds at most.
   [[nodiscard]] Outcome finish();
 
  private:
-  /// What the replies tell the script; shared with the callbacks.
+  /// The state that replies change; shared with the callbacks, which may outlive the player.
   struct Replies {
     Mutex mutex;
     ConditionVariable changed;

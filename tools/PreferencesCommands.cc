@@ -5,8 +5,8 @@
 
 #include "base/Json.h"
 #include "tools/Commands.h"
-#include "tools/Notification.h"
 #include "tools/PreferencesFile.h"
+#include "tools/ServiceFiles.h"
 #include "tools/Table.h"
 
 namespace quarvel::commands {
@@ -20,8 +20,8 @@ std::optional<Number> Read(std::string_view text) {
   return number;
 }
 
-// What somebody means who types this. What a number would not keep as it is stays a string: 007,
-// and integers beyond 64 bits.
+// The value that a person means by this text. A text that a number would not preserve stays a
+// string: 007, and integers beyond 64 bits.
 Value Meant(const std::string& text) {
   if (text == "true" || text == "false") return text == "true";
   const std::size_t first = text.starts_with('-') ? 1 : 0;

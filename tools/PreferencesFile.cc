@@ -1,17 +1,15 @@
 #include "tools/PreferencesFile.h"
 
-#include <fcntl.h>
 #include <fmt/format.h>
-#include <sys/stat.h>
 #include <toml++/toml.h>
-#include <unistd.h>
 
 #include <cerrno>
-#include <cstdlib>
-#include <fstream>
 #include <sstream>
 #include <utility>
 
+#include "base/Files.h"
+#include "base/FlatValue.h"
+#include "base/StandardPaths.h"
 #include "base/Utf8.h"
 
 namespace quarvel {
@@ -27,15 +25,6 @@ Error CannotBe(const path& file, std::string_view what, int error) {
   return Failed(fmt::format("{} cannot be {}: {}.{}", file.native(), what,
                             std::generic_category().message(error),
                             error == EACCES ? " Try it as root." : ""));
-}
-
-// Nil for what is not allowed.
-Value FlatValue(const toml::node& node) {
-  if (const auto* text = node.as_string()) return text->get();
-  if (const auto* integer = node.as_integer()) return integer->get();
-  if (const auto* real = node.as_floating_point()) return real->get();
-  if (const auto* boolean = node.as_boolean()) return boolean->get();
-  return nullptr;
 }
 
 Result<toml::table> Parsed(const std::string& text, const path& file) {
@@ -99,49 +88,15 @@ std::pair<std::string, std::size_t> Without(std::string text, const toml::table&
   return {std::move(text), begin};
 }
 
-Outcome WriteAll(int descriptor, std::string_view text) {
-  while (!text.empty()) {
-    const ssize_t count = ::write(descriptor, text.data(), text.size());
-    if (count < 0 && errno == EINTR) continue;
-    if (count < 0) return Failed({});
-    text.remove_prefix(static_cast<std::size_t>(count));
-  }
-  return Success();
-}
-
-/// Its mode stays, and for root its owner; a new file is for all to read.
-Outcome WriteWhole(path file, std::string_view text) {
+/// A new file is for all to read.
+Outcome WriteWhole(const path& file, std::string_view text) {
+  constexpr mode_t kReadable = 0644;
   std::error_code error;
-  // The file that a link stands for, not the link.
-  if (const path real = std::filesystem::canonical(file, error); !error) file = real;
   std::filesystem::create_directories(file.parent_path(), error);
   if (error) return CannotBe(file.parent_path(), "made", error.value());
-
-  std::string temporary = file.parent_path() / ("." + file.filename().native() + ".XXXXXX");
-  const int descriptor = ::mkostemp(temporary.data(), O_CLOEXEC);
-  if (descriptor < 0) return CannotBe(file, "written", errno);
-  struct stat old {};
-  const bool replaces = ::stat(file.c_str(), &old) == 0;
-  // Only root may give a file away; anybody else's becomes their own.
-  if (replaces && ::geteuid() == 0 && ::fchown(descriptor, old.st_uid, old.st_gid) != 0) {
-    const int refused = errno;
-    ::close(descriptor);
-    ::unlink(temporary.c_str());
-    return CannotBe(file, "written", refused);
-  }
-  const bool written = ::fchmod(descriptor, replaces ? old.st_mode & 0777 : 0644) == 0 &&
-                       WriteAll(descriptor, text) && ::fsync(descriptor) == 0;
-  const int fault = written ? 0 : errno;
-  ::close(descriptor);
-  if (written && ::rename(temporary.c_str(), file.c_str()) == 0) return Success();
-  const int reason = written ? errno : fault;
-  ::unlink(temporary.c_str());
-  return CannotBe(file, "written", reason);
-}
-
-path Variable(const char* name) {
-  const char* value = std::getenv(name);
-  return value == nullptr ? path() : path(value);
+  const auto written = RewriteFile(file, text, kReadable);
+  if (written) return Success();
+  return CannotBe(file, "written", static_cast<int>(written.error().code));
 }
 
 }  // namespace
@@ -150,26 +105,16 @@ PreferencesFile::PreferencesFile(std::filesystem::path path, std::string text, D
     : path_(std::move(path)), text_(std::move(text)), entries_(std::move(entries)) {}
 
 std::filesystem::path PreferencesFile::pathOf(std::string_view domain) {
-  const std::string own = Variable("CONFIGURATION_DIRECTORY").native();
-  std::filesystem::path directory = own.substr(0, own.find(':'));
-  if (directory.empty() && ::geteuid() == 0) directory = "/etc/quarvel";
-  if (directory.empty()) {
-    const auto user = Variable("XDG_CONFIG_HOME");
-    directory = (user.is_absolute() ? user : Variable("HOME") / ".config") / "quarvel";
-  }
+  const std::filesystem::path directory = StandardPaths::fromEnvironment().configuration;
   return directory / "preferences" / fmt::format("{}.toml", domain);
 }
 
 Result<PreferencesFile> PreferencesFile::open(std::filesystem::path path) {
-  std::string text;
-  errno = 0;
-  std::ifstream in(path, std::ios::binary);
-  if (!in && errno != ENOENT) return CannotBe(path, "read", errno);
-  char piece[4'096];
-  while (in.read(piece, sizeof piece), in.gcount() > 0) {
-    text.append(piece, static_cast<std::size_t>(in.gcount()));
+  auto read = ReadWholeFile(path);
+  if (!read && read.error().code != ENOENT) {
+    return CannotBe(path, "read", static_cast<int>(read.error().code));
   }
-  if (in.bad()) return CannotBe(path, "read", errno);
+  std::string text = read ? std::move(read.value()) : std::string();
   auto table = Parsed(text, path);
   if (!table) return std::move(table.error());
   return PreferencesFile(std::move(path), std::move(text), EntriesOf(table.value()));
@@ -199,7 +144,7 @@ Outcome PreferencesFile::replace(std::string text, const std::string& key, const
     if (name != Key(key)) expected.set(name, kept);
   }
   if (value) expected.set(key, *value);
-  // The text was changed by lines: it is written only when that did what was meant.
+  // Lines were edited as text: write them only when they parse to the intended entries.
   const auto table = Parsed(text, path_);
   if (!table || EntriesOf(table.value()) != expected) {
     return Failed(fmt::format("{} cannot be changed safely; edit it by hand.", path_.native()));

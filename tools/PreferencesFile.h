@@ -10,21 +10,22 @@
 namespace quarvel {
 
 /// One domain of preferences: a file of flat keys with strings, numbers and booleans. A change
-/// leaves every other line as somebody wrote it, comments included. For one thread.
-/// Errors: domain "quarvel.preferences", with a reason that names file and line.
+/// leaves every other line untouched, comments included. Owned by one command; one thread. Errors:
+/// domain "quarvel.preferences", with a reason that names file and line.
 class PreferencesFile {
  public:
   /// preferences/`domain`.toml in the service's configuration directory.
   [[nodiscard]] static std::filesystem::path pathOf(std::string_view domain);
-  /// Reads it; one that is not there is empty. Errors: what the service could not understand.
+  /// Reads the file; an absent file is empty. Errors: a file that the service could not read
+  /// either.
   [[nodiscard]] static Result<PreferencesFile> open(std::filesystem::path path);
 
   [[nodiscard]] const std::filesystem::path& path() const { return path_; }
   [[nodiscard]] const Dictionary& entries() const { return entries_; }
 
-  /// Both write the file at once and whole: whoever reads it meanwhile sees the old or the new one.
+  /// Both write the file at once: a reader sees the old file or the new one, never a part.
   [[nodiscard]] Outcome set(const std::string& key, const Value& value);
-  /// Precondition: there is such a key.
+  /// Precondition: the key is set.
   [[nodiscard]] Outcome remove(const std::string& key);
 
  private:

@@ -7,6 +7,7 @@
 #include <cmath>
 #include <utility>
 
+#include "base/Base64.h"
 #include "base/Json.h"
 
 namespace quarvel::script {
@@ -16,27 +17,6 @@ constexpr std::string_view kStart = "startReportingSessionForID:reply:";
 
 Error Wrong(std::string reason) {
   return Error::because("quarvel.script", 1, std::move(reason));
-}
-
-std::optional<std::string> FromBase64(std::string_view text) {
-  constexpr std::string_view kDigits =
-      "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
-  if (text.size() % 4 != 0) return std::nullopt;
-  for (int padding = 0; padding < 2 && text.ends_with('='); ++padding) text.remove_suffix(1);
-  std::string octets;
-  std::uint32_t bits = 0;
-  int count = 0;
-  for (const char digit : text) {
-    const std::size_t value = kDigits.find(digit);
-    if (value == std::string_view::npos) return std::nullopt;
-    bits = bits << 6 | static_cast<std::uint32_t>(value);
-    count += 6;
-    if (count >= 8) {
-      count -= 8;
-      octets.push_back(static_cast<char>(bits >> count & 0xff));
-    }
-  }
-  return octets;
 }
 
 // The value that JSON stands for: dates and bytes are written as dictionaries of one marked key.
@@ -104,7 +84,7 @@ Result<Action> ParseCall(const Dictionary& line, const Value& name) {
 
 }  // namespace
 
-bool IsLeftOut(std::string_view line) {
+bool IsSkipped(std::string_view line) {
   const std::size_t first = line.find_first_not_of(" \t\r");
   return first == std::string_view::npos || line[first] == '#';
 }

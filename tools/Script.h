@@ -12,7 +12,7 @@
 #include "base/Value.h"
 
 /// A script of calls: JSON Lines, an object a line. Empty lines and lines that begin with "#" are
-/// left out.
+/// skipped.
 namespace quarvel::script {
 
 /// {"call": "<full keyword name>", "args": […], "wait": true or false}
@@ -20,7 +20,7 @@ struct Call {
   std::string operation;
   List arguments;  // as written, for printing
   List values;     // as sent: {"$date": "<RFC 3339>"} is a date, {"$bytes": "<base64>"} bytes
-  bool wait;  // for the reply, before the next line; a start is not waited for unless it says so
+  bool wait;       // for the reply, before the next line; by default not for a start
 };
 
 /// {"sleep": seconds}
@@ -28,8 +28,8 @@ struct Sleep {
   std::chrono::duration<double> duration;
 };
 
-/// {"expect": value}: what the last reply that was waited for must have been, as it was printed: a
-/// result, or an error's dictionary. Replies that come in between, such as a start's, do not count.
+/// {"expect": value}: the expected last reply of the calls that were waited for, as it was printed:
+/// a result, or an error's dictionary. Other replies, such as a start's, do not count.
 struct Expect {
   Value value;
 };
@@ -44,7 +44,7 @@ struct Step {
 /// Reads one line of a script. Errors: domain "quarvel.script" or "quarvel.json", with a reason.
 [[nodiscard]] Result<Action> Parse(std::string_view line);
 
-/// Whether a line is left out.
-[[nodiscard]] bool IsLeftOut(std::string_view line);
+/// Whether a line is empty or a comment.
+[[nodiscard]] bool IsSkipped(std::string_view line);
 
 }  // namespace quarvel::script

@@ -15,7 +15,7 @@
 namespace quarvel::commands {
 namespace {
 
-/// The steps of a script, with the file and line in front of every fault.
+/// Reads the steps of a script; puts file and line in front of every fault.
 class ScriptReader {
  public:
   ScriptReader(std::istream& in, std::string name) : in_(in), name_(std::move(name)) {}
@@ -25,7 +25,7 @@ class ScriptReader {
     std::string text;
     while (std::getline(in_, text)) {
       ++line_;
-      if (script::IsLeftOut(text)) continue;
+      if (script::IsSkipped(text)) continue;
       auto action = script::Parse(text);
       if (!action) return at(line_, action.error());
       return std::optional(script::Step{line_, std::move(action.value())});
@@ -45,7 +45,7 @@ class ScriptReader {
   std::size_t line_ = 0;
 };
 
-Outcome PlayAsItComes(ScriptReader& reader, Player& player) {
+Outcome PlayLines(ScriptReader& reader, Player& player) {
   for (;;) {
     auto step = reader.next();
     if (!step) return std::move(step.error());
@@ -72,7 +72,7 @@ Outcome Run(const Options& options, const std::string& file) {
     if (!client) return std::move(client.error());
     Player player(std::move(client.value()));
     ScriptReader reader(std::cin, "standard input");
-    return PlayAsItComes(reader, player);
+    return PlayLines(reader, player);
   }
 
   std::ifstream in(file);

@@ -1,31 +1,14 @@
 #include <fmt/format.h>
 
-#include <cerrno>
-#include <chrono>
-#include <fstream>
-#include <iterator>
-#include <system_error>
-
 #include "base/Json.h"
-#include "tools/Arrival.h"
 #include "tools/Commands.h"
-#include "tools/Notification.h"
+#include "tools/ServiceFiles.h"
 #include "tools/Terminal.h"
 
 namespace quarvel::commands {
 namespace {
 
-using std::filesystem::path;
-
-constexpr const char* kStatusFile = "status.json";
-constexpr const char* kStatusNotification = "tarnwick.quarvel.status";
-constexpr std::chrono::seconds kPatience{5};
-
-Error Failed(std::string reason) {
-  return Error::because("quarvel.status", 1, std::move(reason));
-}
-
-// What is not there reads as nothing: an older service tells less.
+// An absent entry reads as empty: an older service writes fewer.
 
 const Dictionary& DictionaryIn(const Dictionary& status, const char* key) {
   static const Dictionary kNone;
@@ -112,32 +95,12 @@ void Print(const Dictionary& status, bool healthy) {
 
 }  // namespace
 
-Result<std::string> StatusText(const Options& options) {
-  const path directory = RuntimeDirectory(options);
-  const Arrival arrival(directory);
-  // Without a directory to watch, posting says what is wrong.
-  const auto posted = Post(options, kStatusNotification);
-  if (!posted) return posted.error();
-  if (!arrival.watching() || !arrival.await(kStatusFile, kPatience)) {
-    return Failed(fmt::format(
-        "The service does not answer: it has written no {} within {} seconds. Is it running?",
-        (directory / kStatusFile).native(), kPatience.count()));
-  }
-  std::ifstream file(directory / kStatusFile);
-  std::string text((std::istreambuf_iterator<char>(file)), std::istreambuf_iterator<char>());
-  if (!file) {
-    return Failed(fmt::format("{} cannot be read: {}.", (directory / kStatusFile).native(),
-                              std::generic_category().message(errno)));
-  }
-  return text;
-}
-
 Outcome ServiceStatus(const Options& options) {
   const auto text = StatusText(options);
   if (!text) return text.error();
   const auto parsed = ValueFromJson(text.value());
   const Dictionary* status = parsed ? parsed.value().dictionary() : nullptr;
-  if (status == nullptr) return Failed("The service's status is no JSON object.");
+  if (status == nullptr) return StatusError("The service's status is no JSON object.");
   std::string problems;
   for (const Value& problem : ListIn(*status, "problems")) {
     if (problem.string() == nullptr) continue;
@@ -151,7 +114,7 @@ Outcome ServiceStatus(const Options& options) {
     Print(*status, healthy);
   }
   if (healthy) return Success();
-  return Failed("The service is not healthy: " + problems);
+  return StatusError("The service is not healthy: " + problems);
 }
 
 }  // namespace quarvel::commands

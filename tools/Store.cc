@@ -7,10 +7,10 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <cstdlib>
 #include <filesystem>
 #include <utility>
-#include <vector>
+
+#include "base/StandardPaths.h"
 
 namespace quarvel {
 namespace {
@@ -105,26 +105,7 @@ std::string InOrder(std::string select, const std::optional<std::int64_t>& last)
 }  // namespace
 
 std::string StoreReader::defaultPath() {
-  const auto environment = [](const char* name) {
-    const char* value = std::getenv(name);
-    return std::string(value == nullptr ? "" : value);
-  };
-  std::vector<std::string> candidates;
-  if (const std::string own = environment("STATE_DIRECTORY"); !own.empty()) {
-    candidates.push_back(own.substr(0, own.find(':')));
-  }
-  if (::geteuid() != 0) {
-    const std::string user = environment("XDG_STATE_HOME");
-    candidates.push_back((user.empty() ? environment("HOME") + "/.local/state" : user) +
-                         "/quarvel");
-  }
-  candidates.emplace_back("/var/lib/quarvel");
-  for (std::string& directory : candidates) {
-    directory += "/telemetry.db";
-    if (::access(directory.c_str(), F_OK) == 0) return directory;
-  }
-  // The installed service's may not be looked at by everybody; opening it says who may.
-  return errno == EACCES ? candidates.back() : candidates.front();
+  return StandardPaths::find(StandardPaths::Kind::state, "telemetry.db").native();
 }
 
 void StoreReader::Close::operator()(sqlite3* database) const {

@@ -103,8 +103,8 @@ class StoreReader {
   };
 
   /// telemetry.db in the first directory that has one of `$STATE_DIRECTORY`,
-  /// `$XDG_STATE_HOME/quarvel` or ~/.local/state/quarvel (not for root) and /var/lib/quarvel; when
-  /// none has, where this user's own service would put it.
+  /// `$XDG_STATE_HOME/quarvel` or ~/.local/state/quarvel (not for root) and /var/lib/quarvel. When
+  /// none has: in /var/lib/quarvel if this user may not look there, else in the first.
   [[nodiscard]] static std::string defaultPath();
   /// Takes the file, or the directory that holds telemetry.db.
   [[nodiscard]] static Result<StoreReader> open(std::string path);

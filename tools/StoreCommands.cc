@@ -6,7 +6,7 @@
 
 #include "base/Json.h"
 #include "tools/Commands.h"
-#include "tools/Shown.h"
+#include "tools/Format.h"
 #include "tools/Store.h"
 #include "tools/Table.h"
 

@@ -42,7 +42,7 @@ void Table::print() {
 std::vector<std::size_t> Table::fittedWidths() const {
   std::vector<std::size_t> widths = widths_;
   if (!terminal_.attached) return widths;
-  // As wide as fits, if no text were wider than this; numbers are not cut.
+  // Finds the largest width to which texts must be cut so that a line fits; numbers are not cut.
   for (std::size_t most = terminal_.columns; most >= kLeastText; --most) {
     std::size_t line = kGap * (widths.size() - 1);
     for (std::size_t i = 0; i < widths.size(); ++i) {

@@ -9,8 +9,9 @@
 
 namespace quarvel {
 
-/// Rows under a heading, printed to standard output in portions: columns are as wide as the widest
-/// cell so far. On a terminal the widest texts are cut until the line fits.
+/// Rows under a heading, printed to standard output in portions. Columns are as wide as the widest
+/// cell so far; on a terminal the widest texts are cut until the line fits. Owned by one command;
+/// one thread.
 class Table {
  public:
   struct Column {
@@ -20,7 +21,7 @@ class Table {
 
   Table(std::vector<Column> columns, const Terminal& terminal);
 
-  /// As many cells as there are columns.
+  /// Takes one cell for each column.
   void add(std::vector<std::string> row);
   /// Prints the rows added since the last time, the heading before the first.
   void print();

@@ -15,7 +15,7 @@ struct Character {
   bool printable = false;
 };
 
-// Marks that have what follows them run the other way.
+// Marks that reverse the direction of the following text.
 bool TurnsText(wchar_t code) {
   return code == 0x200e || code == 0x200f || (code >= 0x202a && code <= 0x202e) ||
          (code >= 0x2066 && code <= 0x2069);
@@ -28,7 +28,7 @@ Character FirstOf(std::string_view text) {
   std::mbstate_t state{};
   wchar_t code = 0;
   const std::size_t bytes = std::mbrtowc(&code, text.data(), text.size(), &state);
-  if (bytes > text.size()) return {};  // an error, by the numbers that stand for them
+  if (bytes > text.size()) return {};  // mbrtowc returns its errors as the largest numbers
   const int columns = ::wcwidth(code);
   if (columns < 0 || TurnsText(code)) return {bytes, 1, false};
   return {bytes, columns, true};

@@ -6,26 +6,26 @@
 
 namespace quarvel {
 
-/// Where standard output goes, and so what it may look like.
+/// The destination of standard output, which decides on colour and width. A value.
 struct Terminal {
-  bool attached = false;     // to a terminal; else a pipe or a file
+  bool attached = false;     // standard output is a terminal; else a pipe or a file
   bool coloured = false;     // attached, and NO_COLOR is not set or empty
   std::size_t columns = 80;  // when attached
 
   [[nodiscard]] static Terminal standardOutput();
 };
 
-/// Whether a descriptor leads to a terminal that wants colour.
+/// Whether a descriptor is a terminal that may be coloured.
 [[nodiscard]] bool WantsColour(int descriptor);
 
-/// How many columns UTF-8 text takes on a terminal: two for an ideograph, none for a combining
+/// The columns that UTF-8 text takes on a terminal: two for an ideograph, none for a combining
 /// mark.
 [[nodiscard]] std::size_t ColumnsOf(std::string_view text);
 /// The text, cut with an ellipsis at its end when it takes more than `columns`, which is at least
 /// 1.
 [[nodiscard]] std::string Fitted(std::string_view text, std::size_t columns);
-/// The text with a blank for each character that would make a terminal do something, or show the
-/// rest in another order, and for each byte that is no UTF-8.
+/// The text with a blank in place of each control character, each mark that changes the direction
+/// of text, and each byte that is not UTF-8.
 [[nodiscard]] std::string Printable(std::string_view text);
 
 }  // namespace quarvel

@@ -7,7 +7,7 @@
 #include <functional>
 
 #include "tools/Commands.h"
-#include "tools/Since.h"
+#include "tools/Format.h"
 #include "tools/Terminal.h"
 
 namespace {
@@ -25,22 +25,22 @@ int Reported(const quarvel::Outcome& outcome) {
   return failed;
 }
 
-// For the names of files that lie in a directory of their own.
+// Checks a name that becomes a file's name in a directory; returns the fault, or the empty text.
 std::string NotAName(const std::string& text) {
   if (!text.empty() && text != "." && text != ".." && text.find('/') == std::string::npos)
     return "";
   return "\"" + text + "\" is no name: it may not be empty or have a \"/\" in it";
 }
 
-// Which rows a command on a table of the store is about.
+// Adds the options that select rows of a table in the store.
 void AddRowOptions(CLI::App& command, quarvel::commands::RowOptions& which) {
   command
       .add_option_function<std::string>(
           "--since",
           [&which](const std::string& text) {
             const auto now = std::chrono::system_clock::now();
-            which.since =
-                quarvel::Since(text, std::chrono::time_point_cast<quarvel::Date::duration>(now));
+            which.since = quarvel::commands::Since(
+                text, std::chrono::time_point_cast<quarvel::Date::duration>(now));
             if (!which.since) {
               throw CLI::ValidationError(
                   "--since", "\"" + text +
@@ -59,7 +59,7 @@ void AddRowOptions(CLI::App& command, quarvel::commands::RowOptions& which) {
 
 int main(int argumentCount, char** arguments) {
   using namespace quarvel::commands;
-  // For the widths of characters; texts are UTF-8 whatever the terminal's language is.
+  // For the widths of characters: texts are UTF-8 in every language of the terminal.
   std::setlocale(LC_CTYPE, "C.UTF-8");
   CLI::App app("Talks to the audio reporting service and reads its store.", "quarvelctl");
   app.require_subcommand(1);

@@ -12,6 +12,7 @@
 #include "base/Format.h"
 #include "base/Json.h"
 #include "base/MessagePack.h"
+#include "base/Utf8.h"
 #include "platform/Clock.h"
 #include "platform/Condition.h"
 #include "platform/DeviceProperties.h"
@@ -113,11 +114,7 @@ Payload SummaryOf(const PayloadHistory& history, std::uint16_t serviceType) {
 /// A client's text as part of a file name: it can name no directory and leaves room for the rest.
 std::string FileNamePart(std::string text) {
   constexpr std::size_t kLongest = 128;
-  if (text.size() > kLongest) {
-    std::size_t end = kLongest;
-    while ((static_cast<unsigned char>(text[end]) & 0xc0) == 0x80) --end;  // not inside a character
-    text.resize(end);
-  }
+  text.resize(Utf8Prefix(text, kLongest).size());
   std::ranges::replace_if(
       text, [](char c) { return c == '/' || c == '\0'; }, '_');
   return text;

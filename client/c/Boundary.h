@@ -6,28 +6,29 @@
 #include <quarvel/quarvel.h>
 #include <quarvel/client.hpp>
 
-// Where C++ ends: what is shared by the functions that C calls.
+// Shared by the functions that C calls: errors, exceptions and options at the language boundary.
 
 namespace quarvel::c {
 
-/// Fills `out` unless it is null. Returns its status.
+/// Fills `out` unless it is null. Returns the error's status.
 quarvel_status Fill(quarvel_error* out, const Error& error);
-/// The same for an error that has nothing to say but its status.
+/// The same for an error that has a status alone.
 quarvel_status Fill(quarvel_error* out, quarvel_status status);
 
-/// Runs what may throw. Returns what it returns, or the status of what it threw.
+/// Runs a body that may throw. Returns the body's status, or the status of the exception.
 template <class Body>
 quarvel_status Guard(Body&& body) noexcept {
   try {
     return std::forward<Body>(body)();
   } catch (...) {
-    // The library throws nothing of its own: what comes is memory or another resource at its end.
+    // The library itself throws nothing: an exception means that memory or another resource is used
+    // up.
     return QUARVEL_NO_MEMORY;
   }
 }
 
-/// Options as their user knows them: a user older than the library has fewer, and gets zeros for
-/// the rest; a newer one has more, which are not known here. False when there is no valid size.
+/// Reads options of another version: a program older than the library has fewer, and gets zeros for
+/// the rest; a newer one has more, which are ignored. False when the size is not valid.
 template <class Options>
 bool Read(const Options* options, Options& read) {
   read = Options{};
@@ -40,11 +41,12 @@ bool Read(const Options* options, Options& read) {
 
 }  // namespace quarvel::c
 
-/// What C calls a payload, once it is whole.
+/// Sets `read` to the finished payload; it lives as long as `payload`, until the next change. Fails
+/// while the payload is not whole.
 [[nodiscard]] quarvel_status quarvel_payload_read(const quarvel_payload* payload,
                                                   const quarvel::Payload*& read);
 
-/// A client, as C has it.
+/// The client behind C's opaque pointer.
 struct quarvel_client {
   quarvel::Client client;
 };

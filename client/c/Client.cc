@@ -125,7 +125,7 @@ quarvel_status Send(quarvel_client* client, Call&& call) {
 
 // ---- The synchronous forms
 
-// What has been thrown, or found wrong before the call, has filled no error yet.
+// An exception, or a fault found before the call, has not filled the error yet.
 quarvel_status Completed(quarvel_status status, quarvel_error* error) {
   const bool bare = status == QUARVEL_NO_MEMORY || status == QUARVEL_INVALID_PAYLOAD;
   return bare ? Fill(error, status) : status;

@@ -2,23 +2,17 @@
 #include <cstring>
 #include <string_view>
 
+#include "base/Utf8.h"
 #include "client/c/Boundary.h"
 
 namespace quarvel::c {
 namespace {
 
-// A text that is too long ends before the character that does not fit.
 template <std::size_t Size>
 void Copy(char (&to)[Size], std::string_view text) {
-  std::size_t length = std::min(text.size(), Size - 1);
-  const auto continues = [](char octet) {
-    return (static_cast<unsigned char>(octet) & 0xc0) == 0x80;
-  };
-  if (length < text.size()) {
-    while (length > 0 && continues(text[length])) --length;
-  }
-  std::copy_n(text.data(), length, to);
-  to[length] = '\0';
+  const std::string_view copied = quarvel::Utf8Prefix(text, Size - 1);
+  std::ranges::copy(copied, to);
+  to[copied.size()] = '\0';
 }
 
 }  // namespace

@@ -14,10 +14,11 @@ using quarvel::MessagePackScanner;
 using quarvel::MessagePackWriter;
 using quarvel::PayloadValue;
 
-/// A dictionary that is being built: the containers that are open, each with what it holds so far.
+/// A dictionary that is being built: the open containers, each with its values so far. One thread
+/// at a time.
 struct quarvel_payload {
  public:
-  /// What the service allows, less the message and its list of arguments.
+  /// The service's bound of 32, less the message and its list of arguments.
   static constexpr unsigned kDeepest = 30;
 
   [[nodiscard]] quarvel_status status() const { return status_; }
@@ -83,7 +84,7 @@ struct quarvel_payload {
     });
   }
 
-  /// Null while it is not whole.
+  /// The finished payload, kept until the next step; null while it is not whole.
   [[nodiscard]] const quarvel::Payload* whole() const {
     if (status_ != QUARVEL_OK || open_.size() != 1 || numberKey_) return nullptr;
     if (!whole_) {
@@ -129,7 +130,7 @@ struct quarvel_payload {
     return status_;
   }
 
-  // Writes the key where there must be one.
+  // Begins a value: writes its key in a dictionary, and counts it.
   bool beginValue(const char* key) {
     Container& container = open_.back();
     const bool keyed = key != nullptr || numberKey_.has_value();

@@ -34,7 +34,7 @@ RealtimeReporter::Options AsOptions(const quarvel_realtime_options& given) {
 
 }  // namespace
 
-/// A reporter, as C has it: its open record is the ring's.
+/// The reporter behind C's opaque pointer; its open record is the ring's.
 struct quarvel_realtime {
   RealtimeReporter reporter;
 
@@ -111,7 +111,7 @@ void quarvel_realtime_string(quarvel_realtime* reporter, const char* key, const 
 }
 
 void quarvel_realtime_date(quarvel_realtime* reporter, const char* key, int64_t microseconds) {
-  reporter->ring().date(key, microseconds);
+  reporter->ring().date(key, quarvel::Date(std::chrono::microseconds(microseconds)));
 }
 
 bool quarvel_realtime_send(quarvel_realtime* reporter) {

@@ -3,9 +3,9 @@
 #include <fmt/format.h>
 
 #include <iterator>
-#include <quarvel/vocabulary.hpp>
 
 #include "base/Json.h"
+#include "base/Vocabulary.h"
 
 namespace quarvel {
 

@@ -1,24 +1,11 @@
 #include <quarvel/quarvel.h>
 
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-
 #include <algorithm>
-#include <cstring>
-#include <memory>
-#include <string>
-#include <thread>
-#include <vector>
 
-#include "base/Json.h"
-#include "tests/client/FakeService.h"
+#include "tests/client/ClientTesting.h"
 
 namespace quarvel {
 namespace {
-
-using test::FakeService;
-using ::testing::ElementsAre;
-using ::testing::HasSubstr;
 
 struct Free {
   void operator()(quarvel_client* client) const { quarvel_client_free(client); }
@@ -33,11 +20,11 @@ PayloadHandle NewPayload() {
 
 class CTest : public ::testing::Test {
  protected:
-  explicit CTest(quarvel_driver driver = QUARVEL_CALLER) {
+  CTest() {
     path_ = service_.path();
     options_.size = sizeof options_;
     options_.socket_path = path_.c_str();
-    options_.driver = driver;
+    options_.driver = QUARVEL_CALLER;
   }
   quarvel_client* connect() {
     quarvel_client* client = nullptr;
@@ -47,8 +34,7 @@ class CTest : public ::testing::Test {
     service_.accept();
     return client;
   }
-  std::string call() { return JsonText(*service_.receive()); }
-  void answer(const Value& result) { service_.reply(*service_.receive(), result); }
+  std::string call() { return JsonText(service_.call()); }
 
   FakeService service_;
   std::string path_;
@@ -98,19 +84,17 @@ TEST_F(CTest, EveryOperationHasItsFrame) {
                   R"([2,"getAllReporters:",[]])", R"([2,"killService:",[]])"));
 }
 
-/// What the replies said, as texts.
-using Said = std::vector<std::string>;
-
-void Say(void* said, const std::string& what, const quarvel_error* error) {
-  static_cast<Said*>(said)->push_back(
-      error == nullptr ? what
+/// Adds a reply to a list of texts.
+void Say(void* replies, const std::string& result, const quarvel_error* error) {
+  static_cast<std::vector<std::string>*>(replies)->push_back(
+      error == nullptr ? result
                        : std::string(error->domain) + " " + std::to_string(error->code) + " " +
                              std::to_string(error->status) + ": " + error->reason);
 }
 
 TEST_F(CTest, EveryKindOfReplyArrives) {
   quarvel_client* client = connect();
-  Said said;
+  std::vector<std::string> said;
   quarvel_create_reporting_session(
       client, 7,
       [](void* to, bool result, const quarvel_error* error) {
@@ -139,17 +123,17 @@ TEST_F(CTest, EveryKindOfReplyArrives) {
   for (int i = 0; i < 3; ++i) {
     quarvel_send_message(client, nullptr, QUARVEL_KIND_VOLUME, 0, nullptr, 0, done, &said);
   }
-  answer(true);
-  answer(65535);
-  answer(Dictionary{{"reporterID", 7}, {"serviceType", 3}});
-  answer(List{7, -8});
-  answer(nullptr);
-  // 447 octets are left of the reason; the character that would be cut goes whole.
+  service_.answer(true);
+  service_.answer(65535);
+  service_.answer(Dictionary{{"reporterID", 7}, {"serviceType", 3}});
+  service_.answer(List{7, -8});
+  service_.answer(nullptr);
+  // The reason has 447 octets; a character that would be cut is left out.
   const std::string reason = std::string(446, 'x') + "äää";
   const Dictionary error{{"domain", "tarnwick.audio.reporting"},
                          {"code", 1},
                          {"userInfo", Dictionary{{"reason", reason}}}};
-  service_.send(FakeService::response(*service_.receive(), error, nullptr));
+  service_.send(FakeService::response(service_.call(), error, nullptr));
   ASSERT_TRUE(service_.receive());
   service_.hangUp();
   while (quarvel_dispatch(client, -1) == QUARVEL_OK) continue;
@@ -161,23 +145,26 @@ TEST_F(CTest, EveryKindOfReplyArrives) {
 TEST_F(CTest, SynchronousCallsHaveResultsAndErrors) {
   quarvel_client* client = connect();
   std::jthread service([this] {
-    for (int i = 0; i < 5; ++i) answer(true);
-    answer(3);
+    for (int i = 0; i < 5; ++i) service_.answer(true);
+    service_.answer(3);
     service_.receive();  // the start
-    answer(Dictionary{{"reporterID", 0}, {"serviceType", 65535}});
-    answer(Dictionary{{"reporterID", 7}, {"serviceType", 3}});
-    answer(List{7, 8, 9});
-    answer(nullptr);
+    service_.answer(Dictionary{{"reporterID", 0}, {"serviceType", 65535}});
+    service_.answer(Dictionary{{"reporterID", 7}, {"serviceType", 3}});
+    service_.answer(List{7, 8, 9});
+    service_.answer(nullptr);
     service_.receive();
     service_.receive();
     service_.hangUp();
   });
   const PayloadHandle payload = NewPayload();
-  EXPECT_EQ(quarvel_sync_create_reporting_session(client, 7, -1, nullptr), QUARVEL_OK);
-  EXPECT_EQ(quarvel_sync_set_service_type(client, 3, 7, -1, nullptr), QUARVEL_OK);
-  EXPECT_EQ(quarvel_sync_set_configuration(client, payload.get(), 7, -1, nullptr), QUARVEL_OK);
-  EXPECT_EQ(quarvel_sync_stop_reporting_session_for_id(client, 7, -1, nullptr), QUARVEL_OK);
-  EXPECT_EQ(quarvel_sync_destroy_reporting_session(client, 7, -1, nullptr), QUARVEL_OK);
+  const quarvel_status done[] = {
+      quarvel_sync_create_reporting_session(client, 7, -1, nullptr),
+      quarvel_sync_set_service_type(client, 3, 7, -1, nullptr),
+      quarvel_sync_set_configuration(client, payload.get(), 7, -1, nullptr),
+      quarvel_sync_stop_reporting_session_for_id(client, 7, -1, nullptr),
+      quarvel_sync_destroy_reporting_session(client, 7, -1, nullptr),
+  };
+  EXPECT_THAT(done, ::testing::Each(QUARVEL_OK));
   std::uint16_t type = 0;
   EXPECT_EQ(quarvel_sync_get_service_name_for_reporter_id(client, 7, -1, &type, nullptr),
             QUARVEL_OK);
@@ -234,7 +221,7 @@ TEST_F(CTest, BadArgumentsAreRefusedBeforeAnythingHappens) {
   quarvel_client_free(nullptr);
   quarvel_payload_free(nullptr);
   quarvel_realtime_free(nullptr);
-  EXPECT_FALSE(service_.somethingWaits());
+  EXPECT_FALSE(service_.hasInput());
 }
 
 class CPayload : public CTest {
@@ -243,7 +230,8 @@ class CPayload : public CTest {
   std::string sent() {
     EXPECT_EQ(quarvel_set_configuration(client_.get(), payload_.get(), 7, nullptr, nullptr),
               QUARVEL_OK);
-    return JsonText((*(*service_.receive()->list())[2].list())[0]);
+    const Value call = service_.call();
+    return JsonText((*(*call.list())[2].list())[0]);
   }
 
   const PayloadHandle payload_ = NewPayload();
@@ -282,52 +270,51 @@ TEST_F(CPayload, HoldsEveryKindOfValueAndContainersInContainers) {
   EXPECT_EQ(sent(), R"({"k":1,"more":2})");
 }
 
-TEST_F(CPayload, AStepThatIsWrongStaysWrong) {
+TEST_F(CPayload, AnErrorStays) {
+  using P = quarvel_payload*;
   quarvel_payload* payload = payload_.get();
   const struct {
-    const char* what;
-    quarvel_status (*step)(quarvel_payload*);
+    const char* name;
+    quarvel_status (*step)(P);
   } faults[] = {
-      {"no key", [](quarvel_payload* p) { return quarvel_payload_integer(p, nullptr, 1); }},
-      {"key not UTF-8", [](quarvel_payload* p) { return quarvel_payload_integer(p, "\xff", 1); }},
-      {"text not UTF-8", [](quarvel_payload* p) { return quarvel_payload_string(p, "k", "\xff"); }},
+      {"no key", [](P p) { return quarvel_payload_integer(p, nullptr, 1); }},
+      {"key not UTF-8", [](P p) { return quarvel_payload_integer(p, "\xff", 1); }},
+      {"text not UTF-8", [](P p) { return quarvel_payload_string(p, "k", "\xff"); }},
       {"key in a list",
-       [](quarvel_payload* p) {
+       [](P p) {
          quarvel_payload_open_list(p, "list");
          return quarvel_payload_integer(p, "k", 1);
        }},
       {"two keys",
-       [](quarvel_payload* p) {
+       [](P p) {
          quarvel_payload_number_key(p, 1);
          return quarvel_payload_integer(p, "k", 1);
        }},
       {"a key without a value",
-       [](quarvel_payload* p) {
+       [](P p) {
          quarvel_payload_number_key(p, 1);
          return quarvel_payload_status(p);
        }},
       {"nothing to close", quarvel_payload_close},
-      {"year 10000",
-       [](quarvel_payload* p) { return quarvel_payload_date(p, "k", 253'402'300'800'000'000); }},
+      {"year 10000", [](P p) { return quarvel_payload_date(p, "k", 253'402'300'800'000'000); }},
       {"too deep",
-       [](quarvel_payload* p) {
+       [](P p) {
          quarvel_status status = QUARVEL_OK;
          for (int i = 0; i < 30; ++i) status = quarvel_payload_open_dictionary(p, "k");
          return status;
        }},
-      {"no dictionary", [](quarvel_payload* p) { return quarvel_payload_assign(p, "\x90", 1); }},
-      {"cut short", [](quarvel_payload* p) { return quarvel_payload_assign(p, "\x81\xa1k", 3); }},
-      {"bytes behind it",
-       [](quarvel_payload* p) { return quarvel_payload_assign(p, "\x80\x80", 2); }},
+      {"no dictionary", [](P p) { return quarvel_payload_assign(p, "\x90", 1); }},
+      {"cut short", [](P p) { return quarvel_payload_assign(p, "\x81\xa1k", 3); }},
+      {"bytes behind it", [](P p) { return quarvel_payload_assign(p, "\x80\x80", 2); }},
       {"of another extension",
-       [](quarvel_payload* p) { return quarvel_payload_assign(p, "\x81\xa1k\xd4\x05\x00", 6); }},
+       [](P p) { return quarvel_payload_assign(p, "\x81\xa1k\xd4\x05\x00", 6); }},
   };
-  for (const auto& [what, step] : faults) {
+  for (const auto& [name, step] : faults) {
     quarvel_payload_clear(payload);
-    EXPECT_EQ(step(payload), QUARVEL_INVALID_PAYLOAD) << what;
-    EXPECT_EQ(quarvel_payload_status(payload), QUARVEL_INVALID_PAYLOAD) << what;
+    EXPECT_EQ(step(payload), QUARVEL_INVALID_PAYLOAD) << name;
+    EXPECT_EQ(quarvel_payload_status(payload), QUARVEL_INVALID_PAYLOAD) << name;
     quarvel_payload_clear(payload);
-    EXPECT_EQ(quarvel_payload_status(payload), QUARVEL_OK) << what;
+    EXPECT_EQ(quarvel_payload_status(payload), QUARVEL_OK) << name;
   }
   for (int i = 0; i < 29; ++i) quarvel_payload_open_dictionary(payload, "k");
   for (int i = 0; i < 29; ++i) quarvel_payload_close(payload);

@@ -1,202 +1,157 @@
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
+#include <poll.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 
+#include <array>
+#include <asio.hpp>
 #include <atomic>
-#include <fstream>
-#include <future>
-#include <thread>
-#include <vector>
 
-#include <quarvel/client.hpp>
-
-#include "base/Json.h"
 #include "tests/client/ClientTesting.h"
 
 namespace quarvel {
 namespace {
 
-using test::Expected;
-using test::FakeService;
-using test::IsCode;
-using test::Text;
-using vocabulary::Component;
-using vocabulary::Kind;
-using namespace std::chrono_literals;
-using ::testing::AllOf;
-using ::testing::ElementsAre;
-using ::testing::HasSubstr;
+using Code = Client::Code;
+using Change = Client::ConnectionChange;
 
-const Dictionary kPayload{{"SampleRate", 48000}, {"Route", "Speaker"}};
+const Dictionary kLarge{{"Samples", std::string(4'096, 'x')}};
 
-class ClientTest : public ::testing::Test {
+class ClientTest : public DrivenClient {
  protected:
-  ClientTest() : client_(Client::connect(service_.path())) {
-    EXPECT_TRUE(client_.ok()) << Text(client_);
-    service_.accept();
+  ClientTest() {
+    options_.driver = Client::Driver::ownThread;
+    connect();
   }
-  Client& client() { return client_.value(); }
+  Client& client() { return *client_; }
 
   /// Runs one synchronous call beside the test, which plays the service meanwhile.
   template <class Call>
   auto beside(Call call) {
     return std::async(std::launch::async, [this, call] { return call(client()); });
   }
-
-  FakeService service_;
-  Result<Client> client_;
 };
 
-// The forms that the C functions, which call these, have no use for.
+// The forms of arguments that the C functions, which call these, do not use.
 TEST_F(ClientTest, CallsHaveTheirFrames) {
-  const auto dropped = [](const auto&) {};
-  client().setConfiguration(std::nullopt, 7, dropped);
-  client().sendMessage(Payload(kPayload), {Component::toolbox, Kind::error},
-                       Client::MessageType::unknown, {7, 8}, dropped);
-  client().sendMessage(kPayload, Kind::volume, Client::MessageType::generic,
-                       Recipients::everyStartedSession());
-  client().sendMessage(std::nullopt, Kind::volume, Client::MessageType::generic,
-                       std::vector<ReporterID>());
-  client().call("futureOperation:reply:", std::vector<Value>{Value("x")}, dropped);
+  const auto ignored = [](const auto&) {};
+  const Dictionary payload{{"SampleRate", 48000}, {"Route", "Speaker"}};
+  client().sendMessage(Payload(payload), {Component::toolbox, Kind::error},
+                       Client::MessageType::unknown, {7, 8}, ignored);
+  client().sendMessage(payload, Kind::volume, kGeneric, std::vector<ReporterID>());
+  client().call("futureOperation:reply:", std::vector<Value>{Value("x")}, ignored);
   const std::string send = R"("sendMessage:withCategory:andType:forReportingIDs:reply:",)";
-  const std::string payload = R"({"SampleRate":48000,"Route":"Speaker"})";
-  for (const std::string& frame :
-       {std::string(R"([0,0,"setConfiguration:forReporterID:reply:",[null,7]])"),
-        "[0,1," + send + "[" + payload + ",2147483656,65535,[7,8]]]",
-        "[2," + send + "[" + payload + ",11,0,null]]", "[2," + send + "[null,11,0,[]]]",
-        std::string(R"([0,2,"futureOperation:reply:",["x"]])")}) {
-    EXPECT_EQ(JsonText(*service_.receive()), frame);
+  const std::string json = JsonText(payload);
+  for (const std::string& frame : {"[0,0," + send + "[" + json + ",2147483656,65535,[7,8]]]",
+                                   "[2," + send + "[" + json + ",11,0,[]]]",
+                                   std::string(R"([0,1,"futureOperation:reply:",["x"]])")}) {
+    EXPECT_EQ(JsonText(service_.call()), frame);
   }
-}
-
-TEST_F(ClientTest, APositiveIDIsWrittenAsAnUnsignedInteger) {
+  // The wire has positive ids as unsigned integers.
   client().createReportingSession(0x1'0000'0000);
   EXPECT_THAT(*service_.receiveBytes(), HasSubstr(std::string("\xcf\0\0\0\1\0\0\0\0", 9)));
 }
 
-TEST_F(ClientTest, RepliesFindTheirCallsInWhateverOrderAndPiecesTheyArrive) {
+TEST_F(ClientTest, RepliesFindTheirCallsInEveryOrderAndInPieces) {
   Expected<bool> stopped;
+  Expected<bool> ofAnotherKind;
   Expected<Client::ServiceType> serviceType;
   Expected<Client::Validity> validity;
   Expected<std::vector<ReporterID>> reporters;
   client().startReportingSessionForID(7, stopped.reply());
+  client().stopReportingSessionForID(7, ofAnotherKind.reply());
   client().getServiceNameForReporterID(7, serviceType.reply());
   client().reporterID(7, validity.reply());
   client().getAllReporters(reporters.reply());
-  const Value start = *service_.receive();
-  const Value name = *service_.receive();
-  const Value valid = *service_.receive();
-  const Value all = *service_.receive();
-
+  std::array<Value, 5> calls;
+  for (Value& call : calls) call = service_.call();
   const std::string bytes =
-      FakeService::response(all, nullptr, List{7, -8}) +
-      FakeService::response(valid, nullptr, Dictionary{{"reporterID", 7}, {"serviceType", 3}}) +
-      FakeService::response(name, nullptr, 65535) + FakeService::response(name, nullptr, 3);
+      FakeService::response(calls[4], nullptr, List{7, -8}) +
+      FakeService::response(calls[3], nullptr, Dictionary{{"reporterID", 7}, {"serviceType", 3}}) +
+      FakeService::response(calls[2], nullptr, 65535) +
+      FakeService::response(calls[2], nullptr, 3) + FakeService::response(calls[1], nullptr, "yes");
   for (const char byte : bytes) service_.send({&byte, 1});
   EXPECT_THAT(reporters.get().value(), ElementsAre(7, -8));
   EXPECT_TRUE(validity.get().value().valid());
   EXPECT_EQ(serviceType.get().value(), Client::ServiceType::unknown);
+  EXPECT_TRUE(IsCode(ofAnotherKind.get().error(), Code::unexpectedReply));
   EXPECT_FALSE(stopped.given());
-  service_.reply(start, true);
+  service_.reply(calls[0], true);
   EXPECT_TRUE(stopped.get().value());
 }
 
-TEST_F(ClientTest, AReplyOfAnotherKindIsAnError) {
-  Expected<bool> unexpected;
-  client().stopReportingSessionForID(7, unexpected.reply());
-  service_.reply(*service_.receive(), "yes");
-  EXPECT_TRUE(IsCode(unexpected.get().error(), Client::Code::unexpectedReply));
-}
-
-TEST_F(ClientTest, ASynchronousStartReturnsWhenItIsCarriedOutAndNotAtTheSessionsEnd) {
+TEST_F(ClientTest, ASynchronousStartReturnsWhenItIsCarriedOut) {
   for (const ReporterID known : {ReporterID{7}, ReporterID{0}}) {
     Expected<bool> stopped;
     auto started =
         beside([&](Client& c) { return c.sync().startReportingSessionForID(7, stopped.reply()); });
-    const Value start = *service_.receive();
-    service_.reply(*service_.receive(), Dictionary{{"reporterID", known}, {"serviceType", 0}});
+    const Value start = service_.call();
+    service_.answer(Dictionary{{"reporterID", known}, {"serviceType", 0}});
     EXPECT_EQ(started.get().value(), known != 0);
-    EXPECT_FALSE(stopped.given());
+    EXPECT_FALSE(stopped.given()) << "the session has not stopped";
     service_.reply(start, true);
     EXPECT_TRUE(stopped.get().value());
   }
 }
 
-TEST_F(ClientTest, ALostConnectionAnswersWhatWaitsAndWhatStillComes) {
+TEST_F(ClientTest, ALostConnectionAnswersPendingAndLaterCalls) {
   std::vector<int> order;
   for (const int call : {0, 1, 2}) {
     client().startReportingSessionForID(call, [&order, call](const Result<bool>& result) {
-      EXPECT_TRUE(IsCode(result.error(), Client::Code::connectionLost));
+      EXPECT_TRUE(IsCode(result.error(), Code::connectionLost));
       order.push_back(call);
     });
     ASSERT_TRUE(service_.receive());
   }
   service_.hangUp();
   const auto late = client().sync().getAllReporters();
-  EXPECT_TRUE(IsCode(late.error(), Client::Code::connectionLost)) << Text(late);
+  EXPECT_TRUE(IsCode(late.error(), Code::connectionLost)) << Text(late);
   EXPECT_THAT(order, ElementsAre(0, 1, 2));
   EXPECT_FALSE(client().connected());
 }
 
 TEST_F(ClientTest, BytesThatAreNoReplyLoseTheConnection) {
   for (const char* bytes : {"\xc1", "\x2a", "\x94\x01\xc0\xc0\xc0"}) {
-    FakeService service;
-    auto lied = Client::connect(service.path());
-    service.accept();
-    service.send(bytes);
-    EXPECT_THAT(Text(lied.value().sync().getAllReporters()), HasSubstr("is no reply"));
+    disconnect();
+    connect();
+    service_.send(bytes);
+    EXPECT_THAT(Text(client().sync().getAllReporters()), HasSubstr("is no reply"));
   }
 }
 
 TEST_F(ClientTest, AReplyAfterTheTimeOutIsDiscarded) {
-  EXPECT_TRUE(IsCode(client().sync(1ms).createReportingSession(7).error(), Client::Code::timedOut));
-  const Value late = *service_.receive();
+  EXPECT_TRUE(IsCode(client().sync(1ms).createReportingSession(7).error(), Code::timedOut));
+  const Value late = service_.call();
   auto stop = beside([](Client& c) { return c.sync().stopReportingSessionForID(7); });
-  const Value call = *service_.receive();
+  const Value call = service_.call();
   service_.reply(late, false);
   service_.reply(call, true);
   EXPECT_TRUE(stop.get().value());
 }
 
-TEST_F(ClientTest, AReplyMayCallButNotWait) {
-  Expected<bool> second;
-  std::optional<Error> refused;
-  client().createReportingSession(7, [&](const Result<bool>&) {
-    refused = client().sync().createReportingSession(8).error();
-    client().createReportingSession(9, second.reply());
-  });
-  service_.reply(*service_.receive(), true);
-  service_.reply(*service_.receive(), true);
-  EXPECT_TRUE(second.get().value());
-  ASSERT_TRUE(refused);
-  EXPECT_TRUE(IsCode(*refused, Client::Code::wouldDeadlock));
-}
-
-TEST_F(ClientTest, ABatchGoesOutWhenItEndsOrWhenSomebodyWaits) {
+TEST_F(ClientTest, ABatchGoesOutWhenItEndsOrWhenACallWaits) {
   {
     Client::Batch batch(client());
     client().createReportingSession(1);
     client().createReportingSession(2);
-    EXPECT_FALSE(service_.somethingWaits());
+    EXPECT_FALSE(service_.hasInput());
     auto reporters = beside([](Client& c) { return c.sync().getAllReporters(); });
-    ASSERT_TRUE(service_.receive());
-    ASSERT_TRUE(service_.receive());
-    service_.reply(*service_.receive(), List{});
+    ASSERT_TRUE(service_.receive() && service_.receive());
+    service_.answer(List{});
     EXPECT_TRUE(reporters.get().ok());
     client().createReportingSession(3);
-    EXPECT_FALSE(service_.somethingWaits());
+    EXPECT_FALSE(service_.hasInput());
   }
-  EXPECT_TRUE(service_.somethingWaits());
+  EXPECT_TRUE(service_.hasInput());
 }
 
 TEST_F(ClientTest, AClientThatIsHeldBackWaitsAndLosesNothing) {
   constexpr int kMessages = 4'000;
-  constexpr int kInBuffers = 400;  // what the socket and both of the client's buffers hold at most
-  const Payload payload(Dictionary{{"Samples", std::string(4'096, 'x')}});
+  constexpr int kInBuffers = 400;  // the bound of the socket and of both of the client's buffers
+  const Payload payload(kLarge);
   std::atomic<int> sent = 0;
   std::thread sender([&] {
     for (int i = 0; i < kMessages; ++i) {
-      client().sendMessage(payload, Kind::performance, Client::MessageType::generic, i);
+      client().sendMessage(payload, Kind::performance, kGeneric, i);
       ++sent;
       sent.notify_one();
     }
@@ -204,10 +159,9 @@ TEST_F(ClientTest, AClientThatIsHeldBackWaitsAndLosesNothing) {
   sent.wait(0);
   int ahead = 0;
   for (int i = 0; i < kMessages; ++i) {
-    const Value call = *service_.receive();
+    const Value call = service_.call();
     ahead = std::max(ahead, sent - i);
-    const List& arguments = *(*call.list())[2].list();
-    ASSERT_EQ(arguments[3], Value(List{i}));
+    ASSERT_EQ((*(*call.list())[2].list())[3], Value(List{i}));
   }
   sender.join();
   EXPECT_LE(ahead, kInBuffers);
@@ -216,7 +170,7 @@ TEST_F(ClientTest, AClientThatIsHeldBackWaitsAndLosesNothing) {
 TEST_F(ClientTest, CallsOfSeveralThreadsStayWholeAndInTheirOrder) {
   constexpr int kThreads = 4;
   constexpr int kCalls = 5'000;
-  std::vector<std::thread> threads;
+  std::vector<std::jthread> threads;
   for (int thread = 0; thread < kThreads; ++thread) {
     threads.emplace_back([&, thread] {
       for (int i = 0; i < kCalls; ++i) {
@@ -227,54 +181,36 @@ TEST_F(ClientTest, CallsOfSeveralThreadsStayWholeAndInTheirOrder) {
   }
   std::vector<std::int64_t> next(kThreads);
   for (int i = 0; i < kThreads * kCalls; ++i) {
-    const Value call = *service_.receive();
+    const Value call = service_.call();
     const List& arguments = *(*call.list())[3].list();
     const auto thread = static_cast<std::size_t>(*arguments[0].integer());
     ASSERT_EQ(*arguments[1].integer(), next[thread]++);
     service_.reply(call, true);
   }
-  for (std::thread& thread : threads) thread.join();
 }
 
-TEST(ClientLifetimeTest, EndingAClientSendsWhatGatheredAndAnswersItsCallsBeforeItIsGone) {
-  FakeService service;
+TEST_F(ClientTest, EndingAClientSendsGatheredCallsAndAnswersThemFirst) {
   int lost = 0;
   {
-    auto client = Client::connect(service.path());
-    service.accept();
-    const Client::Batch batch(client.value());
+    const Client::Batch batch(client());
     for (int i = 0; i < 3; ++i) {
-      client.value().createReportingSession(i, [&lost](const auto& reply) { lost += !reply.ok(); });
+      client().createReportingSession(i, [&lost](const auto& reply) { lost += !reply.ok(); });
     }
-    Client moved = std::move(client.value());
+    Client moved = std::move(client());
     EXPECT_EQ(lost, 0);
   }
   EXPECT_EQ(lost, 3);
-  for (int i = 0; i < 3; ++i) EXPECT_TRUE(service.receive());
-}
-
-TEST(ClientLifetimeTest, AReplyMayEndItsClient) {
-  FakeService service;
-  Expected<bool> ended;
-  auto client = std::make_unique<Client>(std::move(Client::connect(service.path()).value()));
-  service.accept();
-  client->createReportingSession(7, [&client, reply = ended.reply()](const Result<bool>& result) {
-    client.reset();
-    reply(result);
-  });
-  service.reply(*service.receive(), true);
-  EXPECT_TRUE(ended.get().value());
-  EXPECT_FALSE(service.receive());
+  for (int i = 0; i < 3; ++i) EXPECT_TRUE(service_.receive());
 }
 
 std::string WhyNot(const std::string& path) {
   const auto client = Client::connect(path);
   if (client) return "connected";
-  EXPECT_TRUE(IsCode(client.error(), Client::Code::unreachable));
+  EXPECT_TRUE(IsCode(client.error(), Code::unreachable));
   return client.error().description();
 }
 
-TEST(ClientConnectTest, SaysWhyTheServiceIsNotThere) {
+TEST(ClientConnectTest, SaysWhyTheServiceCannotBeReached) {
   FakeService service;
   EXPECT_THAT(WhyNot(service.directory() / "none.sock"),
               AllOf(HasSubstr("no socket " + service.directory().string()), HasSubstr("quarveld")));
@@ -283,8 +219,8 @@ TEST(ClientConnectTest, SaysWhyTheServiceIsNotThere) {
   EXPECT_THAT(WhyNot(service.path()), AllOf(HasSubstr("left behind"), HasSubstr("quarveld")));
 }
 
-TEST(ClientConnectTest, NamesTheGroupThatWouldBeLetIn) {
-  if (::geteuid() != 0) GTEST_SKIP() << "only root can become a user who is not let in";
+TEST(ClientConnectTest, NamesTheGroupThatMayConnect) {
+  if (::geteuid() != 0) GTEST_SKIP() << "only root can become a user without the permission";
   FakeService service;
   constexpr gid_t kNamelessGroup = 54'321;
   ASSERT_EQ(::chown(service.path().c_str(), 0, kNamelessGroup), 0);
@@ -299,14 +235,325 @@ TEST(ClientConnectTest, NamesTheGroupThatWouldBeLetIn) {
 TEST(ClientConnectTest, LooksWhereTheServiceListens) {
   FakeService service;
   const std::string here = service.directory().string();
-  ::unsetenv("XDG_RUNTIME_DIR");
+  ::setenv("XDG_RUNTIME_DIR", "relative", 1);
   ::setenv("RUNTIME_DIRECTORY", (here + ":/elsewhere").c_str(), 1);
   EXPECT_EQ(Client::defaultSocketPath(), service.path());
   ::setenv("QUARVEL_SOCKET", "/somewhere/else.sock", 1);
   EXPECT_EQ(Client::defaultSocketPath(), "/somewhere/else.sock");
   ::unsetenv("QUARVEL_SOCKET");
   ::unsetenv("RUNTIME_DIRECTORY");
-  EXPECT_EQ(Client::defaultSocketPath(), "/run/quarvel/reporting.sock");
+  const std::string user = "/run/user/" + std::to_string(::geteuid());
+  EXPECT_EQ(Client::defaultSocketPath(),
+            (::geteuid() == 0 ? "/run" : user) + "/quarvel/reporting.sock");
+  ::unsetenv("XDG_RUNTIME_DIR");
+}
+
+// ---- A client without a thread: the program's own loop drives it.
+
+void Poll(Client& client, const bool& done) {
+  while (!done) {
+    pollfd due{client.descriptor(), POLLIN, 0};
+    ASSERT_EQ(::poll(&due, 1, 20'000), 1);
+    client.dispatch();
+  }
+}
+
+void Asio(Client& client, const bool& done) {
+  asio::io_context context;
+  asio::posix::stream_descriptor due(context, client.descriptor());
+  const std::function<void()> watch = [&] {
+    due.async_wait(asio::posix::stream_descriptor::wait_read, [&](const asio::error_code&) {
+      client.dispatch();
+      if (!done) watch();
+    });
+  };
+  watch();
+  context.run_for(kTestTimeout);
+  due.release();  // the descriptor is the client's
+}
+
+// The calls are more than the socket takes at once, so that the loop must write the rest.
+TEST_F(DrivenClient, EveryLoopCarriesCallsOutAndGetsReplies) {
+  constexpr int kCalls = 500;
+  const auto threads = [] {
+    const std::filesystem::directory_iterator tasks("/proc/self/task");
+    return std::distance(begin(tasks), end(tasks));
+  };
+  for (const auto run : {Poll, Asio}) {
+    Client& client = connect();
+    const std::jthread service([this] {
+      for (int i = 0; i < kCalls; ++i) service_.answer(true);
+    });
+    const auto before = threads();
+    int replies = 0;
+    bool done = false;
+    for (int i = 0; i < kCalls; ++i) {
+      const auto taken = client.setConfiguration(kLarge, i, [&](const Result<bool>& reply) {
+        EXPECT_TRUE(reply.ok()) << Text(reply);
+        done = ++replies == kCalls;
+      });
+      ASSERT_EQ(taken, Code::none);
+    }
+    EXPECT_EQ(threads(), before) << "the library made a thread";
+    run(client, done);
+    EXPECT_EQ(replies, kCalls);
+    disconnect();
+  }
+}
+
+TEST_F(DrivenClient, NothingIsDueWhileNothingHappens) {
+  Client& client = connect();
+  client.createReportingSession(7);
+  ASSERT_TRUE(service_.receive());
+  client.dispatch();
+  pollfd due{client.descriptor(), POLLIN, 0};
+  EXPECT_EQ(::poll(&due, 1, 0), 0);
+  service_.hangUp();
+  ASSERT_EQ(::poll(&due, 1, 20'000), 1);
+  EXPECT_EQ(client.dispatch(), Code::connectionLost);
+  EXPECT_EQ(::poll(&due, 1, 0), 0) << "a lost connection is reported once";
+}
+
+TEST_F(DrivenClient, NeverWaitsAndRefusesTooManyCalls) {
+  options_.gatheredBytes = 100'000;
+  Client& client = connect();
+  int taken = 0;
+  while (client.sendMessage(kLarge, Kind::volume, kGeneric, 7) == Code::none) ++taken;
+  Expected<bool> refused;
+  EXPECT_EQ(client.stopReportingSessionForID(7, refused.reply()), Code::heldBack);
+  EXPECT_FALSE(refused.given()) << "only the driver calls replies";
+  client.dispatch();
+  EXPECT_TRUE(IsCode(refused.get().error(), Code::heldBack));
+
+  std::jthread service([&] {
+    for (int i = 0; i < taken; ++i) EXPECT_TRUE(service_.receive());
+    service_.answer(true);
+  });
+  Expected<bool> stopped;
+  driveUntil([&] {
+    stopped = {};
+    return client.stopReportingSessionForID(7, stopped.reply()) == Code::none;
+  });
+  driveUntil([&] { return stopped.given(); });
+  EXPECT_TRUE(stopped.get().value());
+}
+
+TEST_F(DrivenClient, AReplyMayCallAndEndItsClientButNotWait) {
+  for (const auto driver : {Client::Driver::caller, Client::Driver::ownThread}) {
+    options_.driver = driver;
+    connect();
+    Expected<bool> ended;
+    client_->createReportingSession(7, [&, reply = ended.reply()](const Result<bool>& result) {
+      EXPECT_EQ(client_->dispatch(), Code::wouldDeadlock);
+      EXPECT_TRUE(IsCode(client_->sync().getAllReporters().error(), Code::wouldDeadlock));
+      client_->createReportingSession(8);
+      client_.reset();
+      reply(result);
+    });
+    service_.answer(true);
+    if (driver == Client::Driver::caller) driveUntil([&] { return ended.given(); });
+    EXPECT_TRUE(ended.get().value());
+    EXPECT_TRUE(service_.receive()) << "the gathered call";
+    EXPECT_FALSE(service_.receive());
+    service_.hangUp();
+  }
+}
+
+TEST_F(DrivenClient, AForkedChildLeavesTheConnectionToItsParent) {
+  for (const auto driver : {Client::Driver::caller, Client::Driver::ownThread}) {
+    options_.driver = driver;
+    Client& client = connect();
+    Expected<bool> created;
+    client.createReportingSession(7, created.reply());
+    const pid_t child = ::fork();
+    if (child == 0) {
+      client_.reset();
+      ::_exit(0);
+    }
+    int status = -1;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    EXPECT_EQ(status, 0);
+    service_.answer(true);
+    driveUntil([&] { return created.given(); });
+    EXPECT_TRUE(created.get().value());
+    client_.reset();
+    EXPECT_FALSE(service_.receive());
+    service_.hangUp();
+  }
+}
+
+// ---- Reconnection
+
+class ReconnectTest : public DrivenClient {
+ protected:
+  ReconnectTest() {
+    options_.reconnect = Client::Reconnect{1ms, 4ms};
+    options_.connectionChanged = [this](const Change& change) { changes_.push_back(change); };
+    connect();
+  }
+
+  void receive(int calls) {
+    for (int i = 0; i < calls; ++i) ASSERT_TRUE(service_.receive());
+  }
+  void restoreConnection() {
+    driveUntil([&] { return client_->connected(); });
+    service_.accept();
+  }
+  /// The next calls, without their numbers.
+  std::vector<std::string> calls(int count) {
+    std::vector<std::string> calls;
+    for (int i = 0; i < count; ++i) {
+      const Value call = service_.call();
+      const List& frame = *call.list();
+      calls.push_back(*frame[frame.size() - 2].string() + JsonText(frame.back()));
+    }
+    return calls;
+  }
+
+  std::vector<Change> changes_;
+};
+
+TEST_F(ReconnectTest, SessionsAreRestoredAndMessagesAreNotRepeated) {
+  Expected<bool> created;
+  Expected<bool> firstStart;
+  Expected<bool> secondStart;
+  Expected<std::monostate> message;
+  client_->createReportingSession(7, created.reply());
+  client_->setServiceType(Client::ServiceType::telephony, 7);
+  client_->setConfiguration(Dictionary{{"Route", "Speaker"}, {"Rate", 1}}, 7);
+  client_->setConfiguration(Payload(Dictionary{{"Rate", 2}}), 7);
+  client_->startReportingSessionForID(7, firstStart.reply());
+  client_->startReportingSessionForID(7, secondStart.reply());  // which the service never answers
+  client_->createReportingSession(8);
+  client_->destroyReportingSession(8);
+  client_->createReportingSession(9);
+  client_->startReportingSessionForID(9);
+  client_->stopReportingSessionForID(9);
+  client_->setServiceType(Client::ServiceType::test, 10);  // another client's session
+  client_->sendMessage(std::nullopt, Kind::volume, kGeneric, 7, message.reply());
+  receive(13);
+  loseConnection();
+  restoreConnection();
+
+  EXPECT_THAT(
+      calls(5),
+      ElementsAre(R"(createReportingSession:reply:[7])",
+                  R"(setServiceType:reportingSession:reply:[2,7])",
+                  R"(setConfiguration:forReporterID:reply:[{"Route":"Speaker","Rate":2},7])",
+                  R"(startReportingSessionForID:reply:[7])", "createReportingSession:reply:[9]"));
+  EXPECT_FALSE(service_.hasInput());
+  EXPECT_FALSE(firstStart.given());
+  EXPECT_TRUE(IsCode(created.get().error(), Code::deferred));
+  EXPECT_TRUE(IsCode(secondStart.get().error(), Code::connectionLost));
+  EXPECT_TRUE(IsCode(message.get().error(), Code::connectionLost));
+  ASSERT_EQ(changes_.size(), 2U);
+  EXPECT_EQ(changes_[0].kind, Change::Kind::lost);
+  EXPECT_THAT(changes_[0].why.description(), HasSubstr("closed the connection"));
+  EXPECT_EQ(changes_[0].unanswered, 3U);
+  EXPECT_EQ(changes_[0].sessions, 2U);
+  EXPECT_EQ(changes_[1].kind, Change::Kind::restored);
+  EXPECT_EQ(changes_[1].sessions, 2U);
+}
+
+TEST_F(ReconnectTest, TheStartsReplyReportsTheEndOfTheNewStart) {
+  for (const int losses : {1, 2}) {
+    Expected<bool> stopped;
+    client_->createReportingSession(7);
+    client_->startReportingSessionForID(7, stopped.reply());
+    for (int i = 0; i < losses; ++i) {
+      receive(2);
+      loseConnection();
+      restoreConnection();
+    }
+    receive(1);
+    service_.answer(true);
+    driveUntil([&] { return stopped.given(); });
+    EXPECT_TRUE(stopped.get().value());
+    client_->destroyReportingSession(7);
+    receive(1);
+  }
+}
+
+TEST_F(ReconnectTest, CallsInBetweenAreDeferredOrRefused) {
+  client_->createReportingSession(7);
+  client_->createReportingSession(8);
+  receive(2);
+  loseConnection();
+  Expected<bool> created;
+  Expected<bool> orphaned;
+  Expected<bool> stopped;
+  Expected<std::vector<ReporterID>> reporters;
+  EXPECT_EQ(client_->createReportingSession(9, created.reply()), Code::deferred);
+  EXPECT_EQ(client_->startReportingSessionForID(9, stopped.reply()), Code::deferred);
+  EXPECT_EQ(client_->startReportingSessionForID(8, orphaned.reply()), Code::deferred);
+  EXPECT_EQ(client_->destroyReportingSession(8), Code::deferred);
+  EXPECT_EQ(client_->stopReportingSessionForID(5), Code::connectionLost);
+  EXPECT_EQ(client_->sendMessage(std::nullopt, Kind::volume, kGeneric, 9), Code::connectionLost);
+  EXPECT_EQ(client_->getAllReporters(reporters.reply()), Code::connectionLost);
+  restoreConnection();
+  EXPECT_TRUE(IsCode(created.get().error(), Code::deferred));
+  EXPECT_TRUE(IsCode(orphaned.get().error(), Code::connectionLost));
+  EXPECT_TRUE(IsCode(reporters.get().error(), Code::connectionLost));
+  EXPECT_EQ(changes_.back().unsent, 2U);
+  EXPECT_THAT(calls(3),
+              ElementsAre("createReportingSession:reply:[7]", "createReportingSession:reply:[9]",
+                          "startReportingSessionForID:reply:[9]"));
+  EXPECT_FALSE(service_.hasInput());
+  EXPECT_FALSE(stopped.given());
+}
+
+TEST_F(ReconnectTest, UnsentCallsAreCountedAndAttemptsGoOnUntilTheServiceIsBack) {
+  {
+    const Client::Batch batch(*client_);
+    for (int i = 0; i < 3; ++i) client_->sendMessage(std::nullopt, Kind::volume, kGeneric, 7);
+    client_->createReportingSession(7, [](const Result<bool>&) {});
+    loseConnection();
+  }
+  EXPECT_EQ(changes_.back().unsent, 3U) << "the call with a reply has been answered";
+  EXPECT_EQ(changes_.back().unanswered, 1U);
+  const std::string path = service_.path();
+  service_.stopListening();
+  std::filesystem::remove(path);
+  const auto later = std::chrono::steady_clock::now() + 20ms;
+  driveUntil([&] { return std::chrono::steady_clock::now() > later; });
+  EXPECT_FALSE(client_->connected());
+  EXPECT_EQ(changes_.size(), 1U) << "failed attempts are no changes";
+  service_.listen();
+  restoreConnection();
+  EXPECT_THAT(calls(1), ElementsAre("createReportingSession:reply:[7]"));
+}
+
+TEST_F(ReconnectTest, AClientThatEndsWhileItReconnectsAnswersKeptReplies) {
+  Expected<bool> stopped;
+  client_->createReportingSession(7);
+  client_->startReportingSessionForID(7, stopped.reply());
+  receive(2);
+  loseConnection();
+  client_.reset();
+  EXPECT_TRUE(IsCode(stopped.get().error(), Code::connectionLost));
+}
+
+TEST_F(DrivenClient, ItsOwnThreadReconnectsOnlyWithTheOption) {
+  options_.driver = Client::Driver::ownThread;
+  for (const bool wanted : {true, false}) {
+    std::promise<std::size_t> changed;
+    options_.reconnect.reset();
+    if (wanted) options_.reconnect = Client::Reconnect{1ms, 4ms};
+    options_.connectionChanged = [&, kind = wanted ? Change::Kind::restored
+                                                   : Change::Kind::lost](const Change& change) {
+      if (change.kind == kind) changed.set_value(change.sessions);
+    };
+    connect().createReportingSession(7);
+    ASSERT_TRUE(service_.receive());
+    service_.hangUp();
+    auto sessions = changed.get_future();
+    ASSERT_EQ(sessions.wait_for(kTestTimeout), std::future_status::ready);
+    EXPECT_EQ(sessions.get(), wanted ? 1U : 0U);
+    EXPECT_EQ(client_->connected(), wanted);
+    if (wanted) service_.accept();
+    EXPECT_EQ(wanted && service_.receive(), wanted);
+    disconnect();
+  }
 }
 
 }  // namespace

@@ -1,4 +1,4 @@
-"""Builds the examples against what is installed and runs each with the installed service."""
+"""Builds the examples against the installed files and runs each with the installed service."""
 
 import json
 import pathlib

@@ -1,4 +1,4 @@
-"""The shared library exports what the installed headers declare, and nothing else.
+"""The shared library exports the declarations of the installed headers, and nothing else.
 
 Usage: exports.py LIBRARY HEADER…"""
 

@@ -4,9 +4,8 @@
 
 #include <algorithm>
 
-#include <quarvel/vocabulary.hpp>
-
 #include "base/Json.h"
+#include "base/Vocabulary.h"
 
 namespace quarvel {
 
@@ -14,7 +13,6 @@ namespace {
 
 constexpr std::uint16_t kTest = 11;
 
-// In the words of the client's library.
 std::string ServiceName(std::uint16_t type) {
   return std::string(vocabulary::NameOf(vocabulary::ServiceType{type}));
 }

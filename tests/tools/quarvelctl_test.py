@@ -50,7 +50,6 @@ class ToolTest(unittest.TestCase):
                              capture_output=True, env=self.environment, timeout=60, check=False)
         return ran.returncode, ran.stdout.splitlines(), ran.stderr
 
-
     def new_store(self):
         """The empty store that a service makes; a connection to it."""
         service = harness.Service("[analytics]\nwanted = []\n")
@@ -83,10 +82,8 @@ class Service(ToolTest):
         self.assertEqual([reply["call"] for reply in replies], [CREATE, SET_TYPE, VALID, START, STOP, REPORTERS])
         self.assertEqual(replies[3], {"call": START, "args": [7], "result": True})
         self.assertEqual(replies[5]["result"], [7])
-
-    def test_a_start_that_is_never_answered_does_not_hang_the_script(self):
         status, replies, _ = self.run_script({"call": START, "args": [9]})
-        self.assertEqual((status, replies), (0, []))
+        self.assertEqual((status, replies), (0, []), "a start that is never answered does not hang the script")
 
     def test_what_json_lacks_can_be_sent(self):
         payload = {"At": {"$date": "2026-01-31T12:00:00.25Z"}, "Raw": {"$bytes": "AP8="},

@@ -1,14 +1,13 @@
 #ifndef QUARVEL_QUARVEL_H
 #define QUARVEL_QUARVEL_H
 
-/* The client library of the audio reporting service, for C. C++ has <quarvel/client.hpp>, of which
- * this is the plain form: same operations, same rules.
+/* The client library of the audio reporting service, for C. <quarvel/client.hpp> is the same for
+ * C++: same operations, same rules.
  *
  * Conventions. Texts are UTF-8 and end with a zero byte. A function that can fail returns
- * QUARVEL_OK or why it failed. Whatever is returned as a pointer to something opaque is the
- * caller's, to be given back with the `_free` function of its kind, which accepts NULL. Arguments
- * are used for the length of the call alone. No C++ exception leaves the library; a callback must
- * throw none into it. */
+ * QUARVEL_OK or the reason. The caller owns every opaque object that a function returns, and frees
+ * it with the `_free` function of its kind, which accepts NULL. Arguments are used only during the
+ * call. No C++ exception leaves the library; a callback must throw none into it. */
 
 /* NOLINTBEGIN(modernize-deprecated-headers,modernize-use-using): this is C. */
 
@@ -24,47 +23,48 @@ extern "C" {
 
 typedef enum quarvel_status {
   QUARVEL_OK = 0,
-  QUARVEL_UNREACHABLE = 1,      /* the service is not there, or may not be used: see the reason */
-  QUARVEL_CONNECTION_LOST = 2,  /* it may or may not have been carried out */
-  QUARVEL_TIMED_OUT = 3,        /* a synchronous call waited as long as it was told to */
+  QUARVEL_UNREACHABLE = 1,      /* the service is not running, or may not be used: see the reason */
+  QUARVEL_CONNECTION_LOST = 2,  /* the call may or may not have been carried out */
+  QUARVEL_TIMED_OUT = 3,        /* a synchronous call waited for its whole time-out */
   QUARVEL_WOULD_DEADLOCK = 4,   /* a synchronous call, or quarvel_dispatch, from a callback */
-  QUARVEL_UNEXPECTED_REPLY = 5, /* not of the kind that the operation has */
-  QUARVEL_HELD_BACK = 6,        /* too much waits to be sent: try again later */
-  QUARVEL_DEFERRED = 7,  /* done when the connection is back: see quarvel_options.reconnect */
+  QUARVEL_UNEXPECTED_REPLY = 5, /* of another kind than the operation's */
+  QUARVEL_HELD_BACK = 6,        /* too much has gathered: try again later */
+  QUARVEL_DEFERRED = 7,  /* takes effect after the reconnection: see quarvel_options.reconnect */
   QUARVEL_REFUSED = 100, /* by the service: see the error's domain and code */
   QUARVEL_INVALID_ARGUMENT = 101, /* a pointer that must not be NULL is, or a size is too small */
   QUARVEL_INVALID_PAYLOAD = 102,  /* see quarvel_payload_status */
   QUARVEL_NO_MEMORY = 103         /* or another resource of the process */
 } quarvel_status;
 
-/* What a status means, a sentence; never NULL, valid for ever. */
+/* The meaning of a status, a sentence; never NULL, valid for ever. */
 const char* quarvel_status_text(quarvel_status status);
 
-/* Why something failed. Longer texts are cut at the end of a character. */
+/* The reason of a failure. Texts that are too long are cut at the end of a character. */
 typedef struct quarvel_error {
   quarvel_status status;
   int64_t code;     /* in the domain */
-  char domain[64];  /* "quarvel.client" for what happened on this side; see docs/client.md */
-  char reason[448]; /* what was wrong and what to do; empty when nobody said */
+  char domain[64];  /* "quarvel.client" for a failure on this side; see docs/client.md */
+  char reason[448]; /* the fault and the remedy, a sentence; may be empty */
 } quarvel_error;
 
 /* ---- Payloads: dictionaries of values, encoded as MessagePack while they are built */
 
-/* One thread at a time. Errors stay: once a step has failed, the later ones fail likewise, so it is
- * enough to look at the end, or at what the sending returns. */
+/* One thread at a time. An error stays: after a failed step all later ones fail too, so it is
+ * enough to check at the end, or when the payload is sent. */
 typedef struct quarvel_payload quarvel_payload;
 
 /* An empty dictionary; NULL when there is no memory. */
 quarvel_payload* quarvel_payload_new(void);
 void quarvel_payload_free(quarvel_payload* payload);
-/* Makes it empty and forgets the error. Keeps its memory, so a payload is well used again. */
+/* Makes it empty and forgets the error. Keeps the memory, so reuse a payload where you can. */
 void quarvel_payload_clear(quarvel_payload* payload);
-/* QUARVEL_OK; QUARVEL_INVALID_PAYLOAD: a text that is not UTF-8, a missing or superfluous key, a
- * container that is not closed or not open, more than 30 containers in each other (this one
- * included), a date out of range, or bytes that are no dictionary; QUARVEL_NO_MEMORY. */
+/* QUARVEL_OK, QUARVEL_NO_MEMORY or QUARVEL_INVALID_PAYLOAD. A payload is invalid with a text that
+ * is not UTF-8, a missing or superfluous key, a container that is not closed or not open, or a date
+ * out of range. It is invalid too with more than 30 containers in each other (this one included),
+ * and with assigned bytes that are no dictionary. */
 quarvel_status quarvel_payload_status(const quarvel_payload* payload);
 
-/* Each appends a value: in a dictionary under `key`, in a list with NULL. Of equal keys the last
+/* Each appends a value: in a dictionary under `key`, in a list with NULL. The last of equal keys
  * counts. */
 quarvel_status quarvel_payload_nil(quarvel_payload* payload, const char* key);
 quarvel_status quarvel_payload_boolean(quarvel_payload* payload, const char* key, bool value);
@@ -77,87 +77,88 @@ quarvel_status quarvel_payload_bytes(quarvel_payload* payload, const char* key, 
 /* Microseconds since 1970-01-01T00:00:00Z, years 1 to 9999. */
 quarvel_status quarvel_payload_date(quarvel_payload* payload, const char* key,
                                     int64_t microseconds);
-/* Opens a container, which takes what follows until it is closed. */
+/* Opens a container, which takes the following values until it is closed. */
 quarvel_status quarvel_payload_open_dictionary(quarvel_payload* payload, const char* key);
 quarvel_status quarvel_payload_open_list(quarvel_payload* payload, const char* key);
 quarvel_status quarvel_payload_close(quarvel_payload* payload);
 /* The next value of a dictionary stands under this number instead; its `key` is then NULL. */
 quarvel_status quarvel_payload_number_key(quarvel_payload* payload, int64_t key);
-/* Replaces everything by a dictionary that somebody else has encoded. */
+/* Replaces the contents by a dictionary in encoded form. */
 quarvel_status quarvel_payload_assign(quarvel_payload* payload, const void* message_pack,
                                       size_t size);
 
 /* ---- The connection */
 
-/* Every function may be called from every thread, but for quarvel_client_free, quarvel_dispatch
- * and, with QUARVEL_CALLER, the synchronous calls: those belong to one thread at a time. Calls
- * reach the service in their order. After fork() the child may only free the client, or exec. */
+/* Every function may be called from every thread, except quarvel_client_free, quarvel_dispatch and,
+ * with QUARVEL_CALLER, the synchronous calls: these are for one thread at a time. Calls reach the
+ * service in their order. After fork() the child may only free the client, or exec. */
 typedef struct quarvel_client quarvel_client;
 
 typedef enum quarvel_driver {
-  QUARVEL_OWN_THREAD = 0, /* callbacks come on a thread of the connection's own */
-  QUARVEL_CALLER = 1      /* callbacks come in quarvel_dispatch; no thread is made */
+  QUARVEL_OWN_THREAD = 0, /* callbacks come on the connection's own thread */
+  QUARVEL_CALLER = 1      /* callbacks come in quarvel_dispatch; the library makes no thread */
 } quarvel_driver;
 
 typedef struct quarvel_connection_change {
   bool restored;       /* else it was lost */
   const char* reason;  /* of a loss; else empty */
-  uint64_t unanswered; /* loss: calls that are answered with an error next */
-  uint64_t unsent;     /* calls without a reply that are known not to have reached the service */
-  uint64_t sessions;   /* that will be made anew, or have been */
+  uint64_t unanswered; /* loss: pending calls, which are answered with an error next */
+  uint64_t unsent;     /* calls without a reply that certainly did not reach the service */
+  uint64_t sessions;   /* sessions that will be restored, or have been */
 } quarvel_connection_change;
 
 typedef void (*quarvel_connection_changed)(void* context, const quarvel_connection_change* change);
 
 /* Zero is the default of every member but `size`. */
 typedef struct quarvel_options {
-  size_t size;             /* sizeof(quarvel_options): the library and its user may differ in age */
+  size_t size;             /* sizeof(quarvel_options), since the library may be older or newer */
   const char* socket_path; /* NULL: $QUARVEL_SOCKET, else where the service listens by default */
   quarvel_driver driver;
-  /* Makes a lost connection again, and this client's sessions on it: created, with their service
-   * type and configuration, started if they were; the start's reply then tells of the end of the
-   * new start. Calls about these sessions that come in between, or wait at the loss, are answered
-   * with QUARVEL_DEFERRED: what they ask holds when the session is made anew. All others are
-   * answered with QUARVEL_CONNECTION_LOST. Nothing is sent twice. */
+  /* Makes a lost connection again and restores this client's sessions: created with their service
+   * type and configuration, and started if they were. The start's reply then reports the end of the
+   * new start. Calls about these sessions, made in between or pending at the loss, are answered
+   * with QUARVEL_DEFERRED: they take effect when the session is restored. All others are answered
+   * with QUARVEL_CONNECTION_LOST. Nothing is sent twice. */
   bool reconnect;
   uint32_t first_delay_ms;   /* before the first attempt; doubles up to the longest. 0: 100 */
   uint32_t longest_delay_ms; /* 0: 30,000 */
-  size_t gathered_bytes;     /* what may gather where a call may not wait. 0: 4 MiB */
+  size_t gathered_bytes;     /* bytes that may gather where a call may not wait. 0: 4 MiB */
   quarvel_connection_changed connection_changed;
   void* context; /* of connection_changed */
 } quarvel_options;
 
 /* Connects to the service. `options` may be NULL. Errors: QUARVEL_UNREACHABLE,
- * QUARVEL_INVALID_ARGUMENT, QUARVEL_NO_MEMORY; `error`, when not NULL, says more. */
+ * QUARVEL_INVALID_ARGUMENT, QUARVEL_NO_MEMORY; `error`, when not NULL, holds the details. */
 quarvel_status quarvel_client_new(const quarvel_options* options, quarvel_client** client,
                                   quarvel_error* error);
-/* Sends what has gathered, for which it waits five seconds at most, closes the connection, which
- * stops its sessions, and answers every call that still waits with QUARVEL_CONNECTION_LOST. A
- * callback may free its client. */
+/* Sends the gathered calls, for at most five seconds, closes the connection, which stops its
+ * sessions, and answers every pending call with QUARVEL_CONNECTION_LOST. A callback may free its
+ * client. */
 void quarvel_client_free(quarvel_client* client);
 bool quarvel_connected(const quarvel_client* client);
 
-/* For QUARVEL_CALLER: readable while something is due, be it input, room for output or a time that
- * has come; watch it level- or edge-triggered and call quarvel_dispatch each time. It stays the
- * same through reconnections, and is the client's: stop watching it before the client goes. -1 for
- * QUARVEL_OWN_THREAD. */
+/* For QUARVEL_CALLER: a descriptor that is readable while an event is due: input, room for output
+ * or a timer. Watch it level- or edge-triggered and call quarvel_dispatch each time. It stays the
+ * same through reconnections. The client owns it: stop watching it before the client is freed. -1
+ * for QUARVEL_OWN_THREAD. */
 int quarvel_descriptor(const quarvel_client* client);
-/* Does what is due. Waits until something is, for `timeout_ms` at most; negative: as long as it
- * takes. QUARVEL_CONNECTION_LOST: for good, stop watching. QUARVEL_WOULD_DEADLOCK: from a callback,
- * beside another thread's, or with QUARVEL_OWN_THREAD; it has done nothing. */
+/* Handles the events that are due. Waits for one for at most `timeout_ms`; negative: without limit.
+ * QUARVEL_CONNECTION_LOST: lost for good, stop watching. QUARVEL_WOULD_DEADLOCK, without any
+ * effect: from a callback, beside another thread's dispatch, or with QUARVEL_OWN_THREAD. */
 quarvel_status quarvel_dispatch(quarvel_client* client, int timeout_ms);
 
 /* ---- The operations
  *
  * Each returns at once. A reply that is not NULL is called exactly once, on the thread that drives
- * the connection, with `error` NULL or saying why there is no result; it may make calls, which
- * never wait. Without a reply the call is a notification, of which nobody hears what the service
- * made of it. What is returned is QUARVEL_OK, or why the call could not be taken, which a reply
- * hears too; with QUARVEL_INVALID_ARGUMENT, QUARVEL_INVALID_PAYLOAD and QUARVEL_NO_MEMORY nothing
- * has happened and the reply is not called.
+ * the connection. Its `error` is NULL, or the reason for which there is no result. A reply may make
+ * calls, which never wait. A call without a reply is a notification, which the service never
+ * answers. Each function returns QUARVEL_OK, or the reason for which the call was not accepted; the
+ * reply receives that too. After QUARVEL_INVALID_ARGUMENT, QUARVEL_INVALID_PAYLOAD and
+ * QUARVEL_NO_MEMORY the call has had no effect, and the reply is not called.
  *
- * With QUARVEL_OWN_THREAD a call waits while the service holds this client back; else, and from a
- * callback, it is refused with QUARVEL_HELD_BACK when too much has gathered. */
+ * With QUARVEL_OWN_THREAD a call waits while the service does not read this client's socket. With
+ * QUARVEL_CALLER, and from a callback, it is refused with QUARVEL_HELD_BACK when too much has
+ * gathered. */
 
 typedef void (*quarvel_done_reply)(void* context, const quarvel_error* error);
 typedef void (*quarvel_boolean_reply)(void* context, bool result, const quarvel_error* error);
@@ -172,7 +173,7 @@ typedef void (*quarvel_reporters_reply)(void* context, const int64_t* reporter_i
  * of ids); one that this client has there is replaced without being stopped. */
 quarvel_status quarvel_create_reporting_session(quarvel_client* client, int64_t reporter_id,
                                                 quarvel_boolean_reply reply, void* context);
-/* Says what the audio of this client's own session is for. */
+/* Sets the purpose of the audio of this client's own session. */
 quarvel_status quarvel_set_service_type(quarvel_client* client, uint16_t service_type,
                                         int64_t reporting_session, quarvel_boolean_reply reply,
                                         void* context);
@@ -180,17 +181,17 @@ quarvel_status quarvel_set_service_type(quarvel_client* client, uint16_t service
 quarvel_status quarvel_get_service_name_for_reporter_id(quarvel_client* client, int64_t reporter_id,
                                                         quarvel_service_type_reply reply,
                                                         void* context);
-/* Merges `configuration` (NULL: nothing) into what is reported with this client's own session. */
+/* Merges `configuration` (NULL: nothing) into the user information of this client's own session. */
 quarvel_status quarvel_set_configuration(quarvel_client* client,
                                          const quarvel_payload* configuration, int64_t reporter_id,
                                          quarvel_boolean_reply reply, void* context);
-/* Starts the session, whichever client's. The reply comes when the session STOPS, be that in days;
- * before the connection ends never, when there is no such session or it is started already. */
+/* Starts a session of any client. The reply comes when the session STOPS, perhaps days later. When
+ * there is no such session, or it is started already, no reply comes before the connection ends. */
 quarvel_status quarvel_start_reporting_session_for_id(quarvel_client* client, int64_t reporter_id,
                                                       quarvel_boolean_reply stopped, void* context);
 /* Sends a message to the sessions named, started or not; with `reporting_ids` NULL to every started
- * session of every client, and when there is none, once on its own. The reply tells of the routing,
- * not of the delivery. */
+ * session of every client, and when there is none, once on its own. The reply reports the routing,
+ * not the delivery. */
 quarvel_status quarvel_send_message(quarvel_client* client, const quarvel_payload* payload,
                                     uint32_t category, uint16_t type, const int64_t* reporting_ids,
                                     size_t count, quarvel_done_reply reply, void* context);
@@ -206,14 +207,14 @@ quarvel_status quarvel_reporter_id(quarvel_client* client, int64_t reporter_id,
 /* The ids of every client's sessions, valid for the length of the reply. */
 quarvel_status quarvel_get_all_reporters(quarvel_client* client, quarvel_reporters_reply reply,
                                          void* context);
-/* Ends the service at once: the reply hears QUARVEL_CONNECTION_LOST, which here is success. */
+/* Ends the service at once: the reply receives QUARVEL_CONNECTION_LOST, which here is success. */
 quarvel_status quarvel_kill_service(quarvel_client* client, quarvel_boolean_reply reply,
                                     void* context);
 
 /* ---- The operations, waiting for their replies
  *
- * For `timeout_ms` at most; negative: as long as it takes. A reply that comes later is discarded.
- * Results and `error` may be NULL. Not from a callback. With QUARVEL_CALLER they dispatch while
+ * Each waits for at most `timeout_ms`; negative: without limit. A later reply is discarded. Results
+ * and `error` may be NULL. Not from a callback. With QUARVEL_CALLER they dispatch while
  * they wait. Where the reply is true whether or not there is such a session, there is no result. */
 
 quarvel_status quarvel_sync_create_reporting_session(quarvel_client* client, int64_t reporter_id,
@@ -252,28 +253,29 @@ quarvel_status quarvel_sync_reporter_id(quarvel_client* client, int64_t reporter
 quarvel_status quarvel_sync_get_all_reporters(quarvel_client* client, int timeout_ms,
                                               int64_t* reporter_ids, size_t room, size_t* count,
                                               quarvel_error* error);
-/* QUARVEL_OK when the service has gone. */
+/* QUARVEL_OK when the service has ended. */
 quarvel_status quarvel_sync_kill_service(quarvel_client* client, int timeout_ms,
                                          quarvel_error* error);
 
-/* ---- Reporting from a thread that may not wait */
+/* ---- Reporting from a real-time thread */
 
 /* Messages to one session through a ring of fixed-size records, which the thread that drives the
  * client's connection empties. The functions marked RT allocate nothing, take no lock, make no
- * system call and end after a bounded number of steps; they are for one thread at a time, the
- * producer, and all others are for other threads. Link the program with -Wl,-z,now, so that their
- * first call is like every other. */
+ * system call and end after a bounded number of steps. They are for one thread at a time, the
+ * producer; all others are for other threads. Link the program with -Wl,-z,now, so that the first
+ * call does not run the dynamic linker. */
 typedef struct quarvel_realtime quarvel_realtime;
 
 typedef struct quarvel_realtime_loss {
-  uint64_t full;      /* there was no free slot */
+  uint64_t full;      /* no free slot */
   uint64_t too_large; /* larger than record_bytes */
   uint64_t invalid;   /* a key or a text was not UTF-8 */
-  uint64_t unsent;    /* the connection was lost for good, or the reporter went without one */
+  uint64_t unsent;    /* the connection was lost for good, or the reporter was freed */
 } quarvel_realtime_loss;
 
-/* Called with what was lost since the last call, by whoever empties the ring: the client's driver,
- * quarvel_realtime_stop or quarvel_realtime_free. Must not use the reporter. */
+/* Called with the losses since its last call, on the thread that empties the ring: the client's
+ * driver, or the caller of quarvel_realtime_stop or quarvel_realtime_free. Must not use the
+ * reporter. */
 typedef void (*quarvel_realtime_lost)(void* context, const quarvel_realtime_loss* loss);
 
 /* Zero is the default of every member but `size`. */
@@ -281,14 +283,14 @@ typedef struct quarvel_realtime_options {
   size_t size;          /* sizeof(quarvel_realtime_options) */
   size_t records;       /* slots, rounded up to a power of two. 0: 256 */
   size_t record_bytes;  /* of a record's MessagePack. 0: 256 */
-  uint32_t interval_ms; /* how often the ring is emptied while it is started. 0: 100 */
-  bool no_loss_message; /* a loss is not told of by a message to the session */
+  uint32_t interval_ms; /* interval at which the ring is emptied while started. 0: 100 */
+  bool no_loss_message; /* no message to the session after a loss */
   quarvel_realtime_lost lost;
   void* context; /* of lost */
 } quarvel_realtime_options;
 
 /* `options` may be NULL. NULL when there is no memory, or an argument is invalid. Nothing wakes up
- * before it is started. Free it before its client. */
+ * before the reporter is started. Free it before its client. */
 quarvel_realtime* quarvel_realtime_new(quarvel_client* client, int64_t reporter_id,
                                        const quarvel_realtime_options* options);
 /* Stops. */
@@ -296,7 +298,7 @@ void quarvel_realtime_free(quarvel_realtime* reporter);
 void quarvel_realtime_start(quarvel_realtime* reporter);
 /* Empties the ring before it returns. */
 void quarvel_realtime_stop(quarvel_realtime* reporter);
-/* Since it was made: records handed to the connection, and what was lost; both may be NULL. */
+/* Since it was made: records handed to the connection, and losses; both may be NULL. */
 void quarvel_realtime_statistics(const quarvel_realtime* reporter, uint64_t* sent,
                                  quarvel_realtime_loss* lost);
 
@@ -309,7 +311,7 @@ void quarvel_realtime_unsigned(quarvel_realtime* reporter, const char* key, uint
 void quarvel_realtime_real(quarvel_realtime* reporter, const char* key, double value);
 void quarvel_realtime_string(quarvel_realtime* reporter, const char* key, const char* text);
 void quarvel_realtime_date(quarvel_realtime* reporter, const char* key, int64_t microseconds);
-/* RT. Leaves the record to be sent. False when it is lost, which is counted. */
+/* RT. Hands the record over to be sent. False when it is lost, which is counted. */
 bool quarvel_realtime_send(quarvel_realtime* reporter);
 
 /* ---- Codes. Others are allowed; the service names them "Undefined" or not at all. */
@@ -357,7 +359,7 @@ enum {
   QUARVEL_SERVICE_NON_LONG_FORM_AUDIO = 8,
   QUARVEL_SERVICE_AUDIO_DEVICE_USAGE = 9,
   QUARVEL_SERVICE_ALERTS = 10,
-  QUARVEL_SERVICE_TEST = 11, /* reported to nobody */
+  QUARVEL_SERVICE_TEST = 11, /* its messages are dropped */
   QUARVEL_SERVICE_UNKNOWN = 65535
 };
 

@@ -17,35 +17,37 @@ namespace quarvel {
 
 class RealtimeRing;
 
-/// Messages from a thread that may not wait: an audio callback, say.
+/// Reports messages from a real-time thread, an audio callback for example.
 ///
-/// A record is encoded in place in a ring of fixed-size slots that is allocated, and touched, when
-/// the reporter is made. Recording allocates nothing, takes no lock, makes no system call and has
-/// no loop but over the bytes that it copies, so it ends after a bounded number of steps whatever
-/// other threads do. The driver of the client's connection takes the records out and sends each as
-/// a message to one session, in their order.
+/// A record is encoded in place in a ring of fixed-size slots, which is allocated, and touched,
+/// when the reporter is made. Recording allocates nothing, takes no lock, makes no system call and
+/// loops only over the bytes that it copies: the number of steps is bounded and does not depend on
+/// other threads. The driver of the client's connection takes the records out and sends each, in
+/// their order, as a message to one session.
 ///
-/// Threads: `record`, and the record that it returns, are for one thread at a time, the producer,
-/// and only for one record at a time; make a reporter for each real-time thread. Everything else
-/// may be called from every thread but the producer's. The producer must have ended its last record
-/// before the reporter goes; the reporter should go before its client.
+/// Threads: `record` and its result are for one thread at a time, the producer, and for one record
+/// at a time; make a reporter for each real-time thread. All other functions may be called from
+/// every thread but the producer's.
 ///
-/// A full ring, or a record that is larger than its slot, is counted and told of, and costs the
-/// producer no more than a record that fits.
+/// Lifetime: the producer must have ended its last record before the reporter is destroyed; destroy
+/// the reporter before its client.
 ///
-/// The first call of a library function may have the dynamic linker look for it: link the program
-/// with `-Wl,-z,now`, or record and abandon one record before it gets serious.
+/// A record that finds the ring full, or is larger than its slot, is counted and reported, and
+/// costs the producer no more than a record that fits.
+///
+/// The first call of a library function may run the dynamic linker: link the program with
+/// `-Wl,-z,now`, or record and abandon one record before the real-time work begins.
 class RealtimeReporter {
  public:
   using Category = vocabulary::Category;
   using MessageType = vocabulary::MessageType;
 
-  /// Records that did not become messages, by the reason.
+  /// Numbers of records that did not become messages, by the reason.
   struct Loss {
-    std::uint64_t full = 0;      // there was no free slot: more `Options::records`, or less to say
+    std::uint64_t full = 0;      // no free slot: raise `Options::records`, or record less
     std::uint64_t tooLarge = 0;  // larger than `Options::recordBytes`
     std::uint64_t invalid = 0;   // a key or a string was not UTF-8
-    std::uint64_t unsent = 0;  // the connection was lost for good, or the reporter went without one
+    std::uint64_t unsent = 0;    // the connection was lost for good, or the reporter was destroyed
 
     [[nodiscard]] std::uint64_t total() const { return full + tooLarge + invalid + unsent; }
     bool operator==(const Loss&) const = default;
@@ -57,25 +59,25 @@ class RealtimeReporter {
   };
 
   struct Options {
-    /// Slots: rounded up to a power of two, 2 to 65,536. They must hold what is recorded in one
-    /// `interval` and, with `Client::Options::reconnect`, while the connection is away.
+    /// Slots: rounded up to a power of two, 2 to 65,536. They must hold the records of one
+    /// `interval` and, with `Client::Options::reconnect`, of the time without a connection.
     std::size_t records = 256;
-    /// A record's MessagePack bytes: 16 to 65,536. A key of n characters and a number are n + 10
-    /// at most; three more belong to the record.
+    /// Bytes of a record's MessagePack: 16 to 65,536. A key of n characters and a number take n +
+    /// 10 at most; the record itself takes 3.
     std::size_t recordBytes = 256;
-    /// How often the ring is emptied while the reporter is started. Longer wakes the processor less
-    /// often.
+    /// The interval at which the ring is emptied while the reporter is started. A longer one wakes
+    /// the processor less often.
     std::chrono::milliseconds interval{100};
-    /// Sent to the session after a loss: `RealtimeRecordsLost` with the number since the last such
-    /// message, and the reasons' under `Full`, `TooLarge`, `Invalid` where there are any. None: not
+    /// Sent to the session after a loss: `RealtimeRecordsLost` holds the number since the last such
+    /// message; `Full`, `TooLarge` and `Invalid` hold the numbers by reason, where not 0. None: not
     /// sent.
     std::optional<LossMessage> lossMessage = LossMessage{};
-    /// Called with what was lost since the last call, by whoever empties the ring: the connection's
-    /// driver, `stop` or the destructor. Must not use the reporter.
+    /// Called with the losses since its last call, on the thread that empties the ring: the
+    /// connection's driver, or the caller of `stop` or the destructor. Must not use the reporter.
     std::function<void(const Loss&)> lost;
   };
 
-  /// Nothing wakes up before `start`. `reporterID` is the session that the messages are for.
+  /// Makes a reporter for the session `reporterID`. Nothing wakes up before `start`.
   RealtimeReporter(Client& client, ReporterID reporterID, Options options);
   RealtimeReporter(Client& client, ReporterID reporterID);
   /// Stops.
@@ -83,11 +85,11 @@ class RealtimeReporter {
   RealtimeReporter(const RealtimeReporter&) = delete;
   RealtimeReporter& operator=(const RealtimeReporter&) = delete;
 
-  /// From now on the ring is emptied each `Options::interval`.
+  /// Has the driver empty the ring at each `Options::interval`.
   void start();
-  /// Empties the ring before it returns, so that what was recorded goes ahead of what the caller
-  /// sends next, and lets the driver sleep. What cannot be sent yet, because the service holds this
-  /// client back or the connection is being made again, the driver still sends.
+  /// Empties the ring before it returns, so that the records go ahead of the caller's next calls,
+  /// and lets the driver sleep. Records that cannot be sent yet, because of back-pressure or a
+  /// reconnection, are sent later by the driver.
   void stop();
 
   struct Statistics {
@@ -97,16 +99,16 @@ class RealtimeReporter {
   /// Since the reporter was made.
   [[nodiscard]] Statistics statistics() const;
 
-  /// A message that is being written: a flat dictionary. Every function is for the producer alone
-  /// and keeps its real-time promise. Of equal keys the last counts.
+  /// A message that is being written: a flat dictionary. Owned by the producer; each function is
+  /// for the producer alone and real-time safe. The last of equal keys counts.
   class Record {
    public:
     Record(const Record&) = delete;
     Record& operator=(const Record&) = delete;
-    /// Abandons what was not sent.
+    /// Abandons a record that was not sent.
     ~Record();
 
-    /// False when the ring was full: nothing need be set, and `send` counts the loss.
+    /// False when the ring was full: setting values has no effect, and `send` counts the loss.
     explicit operator bool() const { return fits_; }
 
     Record& set(std::string_view key, std::same_as<bool> auto value) noexcept {
@@ -126,7 +128,8 @@ class RealtimeReporter {
     }
     Record& set(std::string_view key, Date date) noexcept;
 
-    /// Leaves the record to be sent. False when it is lost, which is counted. The record is spent.
+    /// Hands the record over to be sent. False when it is lost, which is counted. Afterwards the
+    /// record is spent: setting values has no effect.
     bool send() noexcept;
 
    private:

@@ -4,21 +4,19 @@
 #include <algorithm>
 
 #include "client/Channel.h"
-#include "client/Connect.h"
-#include "client/Failure.h"
 #include "client/Operations.h"
 
-// What the channel does when its connection breaks, and to have another.
+// The channel's loss of its connection, and reconnection.
 
 namespace quarvel {
 namespace {
 
-/// A connection that has lasted so long was no failure.
+/// A connection that has lasted this long starts the back-off anew.
 constexpr auto kLasted = std::chrono::seconds(10);
 
 }  // namespace
 
-void Client::Channel::lose(const std::string& reason, bool forGood) {
+void Client::Channel::handleLoss(const std::string& reason, bool forGood) {
   using Change = ConnectionChange;
   const Time now = std::chrono::steady_clock::now();
   Change change;
@@ -54,7 +52,7 @@ void Client::Channel::lose(const std::string& reason, bool forGood) {
   options_.connectionChanged(change);
 }
 
-// Returns how many of the calls dropped are such that nobody else hears of them.
+// Returns the number of dropped notifications: no reply tells of their loss.
 std::size_t Client::Channel::dropOutput() {
   constexpr char kNotification = '\x93';
   std::size_t unsent = 0;
@@ -74,8 +72,7 @@ std::size_t Client::Channel::dropOutput() {
   return unsent;
 }
 
-// Everything that waits is refused in the order of the calls, but for the starts that are made
-// anew.
+// Refuses the pending calls in their order, except the starts that will be restored.
 std::size_t Client::Channel::refusePending() {
   std::vector<std::pair<std::uint32_t, Pending>> waiting(std::make_move_iterator(pending_.begin()),
                                                          std::make_move_iterator(pending_.end()));
@@ -84,7 +81,7 @@ std::size_t Client::Channel::refusePending() {
   std::size_t refused = 0;
   for (auto& [call, pending] : waiting) {
     const bool start = pending.kind == SessionCall::Kind::start;
-    if (link_ == Link::down && start && sessions_.keep(pending.session, call, pending.reply)) {
+    if (link_ == Link::down && start && sessions_.keepReply(pending.session, call, pending.reply)) {
       continue;
     }
     const bool deferred = link_ == Link::down && pending.kind != SessionCall::Kind::none && !start;
@@ -112,7 +109,7 @@ void Client::Channel::reconnect() {
   const Time now = std::chrono::steady_clock::now();
   if (!reconnectAt_ || now < *reconnectAt_) return;
   reconnectAt_.reset();
-  const auto socket = ConnectTo(path_, false);
+  const auto socket = connectTo(path_, false);
   if (!socket || poller_.watch(socket.value()) != 0) {
     if (socket) ::close(socket.value());
     reconnectAt_ = now + nextDelay();
@@ -126,13 +123,13 @@ void Client::Channel::reconnect() {
     socket_ = socket.value();
     link_ = Link::up;
     flushing_ = true;
-    change.sessions = makeSessionsAnew();
+    change.sessions = restoreSessions();
     change.unsent = std::exchange(unsent_, 0);
   }
   if (options_.connectionChanged) options_.connectionChanged(change);
 }
 
-std::size_t Client::Channel::makeSessionsAnew() {
+std::size_t Client::Channel::restoreSessions() {
   for (Sessions::Session& session : sessions_.all()) {
     const ReporterID id = session.reporterID;
     frame(operations::Create(id), std::nullopt);

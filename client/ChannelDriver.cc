@@ -5,13 +5,13 @@
 #include <cstring>
 
 #include "client/Channel.h"
-#include "client/Failure.h"
 
-// What the channel's driver does: reads, gives replies, keeps the times.
+// The channel's driver: reads, delivers replies, runs timers.
 
 namespace quarvel {
 namespace {
 
+/// The longest time for which a closing client keeps sending.
 constexpr auto kLinger = std::chrono::seconds(5);
 
 Error WhyRefused(Client::Code code, const std::string& lossReason) {
@@ -57,12 +57,12 @@ Client::Code Client::Channel::dispatch(std::optional<Time> deadline) {
 
 void Client::Channel::step(std::optional<Time> deadline) {
   const Poller::Events events = poller_.wait(deadline);
-  if (events.input) receiveAndReply();
+  if (events.input) receiveReplies();
   if (events.timer) {
     reconnect();
     runScheduled();
   }
-  giveRefusals();
+  deliverRefusals();
   armTimer();
   MutexLock lock(mutex_);
   if (link_ != Link::up || writing_) return;
@@ -80,32 +80,33 @@ void Client::Channel::finish() {
     MutexLock lock(mutex_);
     if (link_ == Link::up) ::shutdown(socket_, SHUT_RDWR);
   }
-  while (connected()) receiveAndReply();  // the replies that have arrived, until the end
-  lose("The client has closed the connection.", true);
-  giveRefusals();
+  while (connected()) receiveReplies();  // the replies that have arrived, until the end
+  handleLoss("The client has closed the connection.", true);
+  deliverRefusals();
   MutexLock lock(mutex_);
   finished_ = true;
   driver_ = std::thread::id();
   room_.notifyAll();
 }
 
-// Whether nothing is left that could still be sent.
+// Writes as much as the socket takes. True when nothing is left that could still be sent.
 bool Client::Channel::flushed() {
   MutexLock lock(mutex_);
   if (link_ == Link::up && !writing_ && hasOutput()) write(false);
   return link_ != Link::up || (!writing_ && !hasOutput());
 }
 
-void Client::Channel::receiveAndReply() {
+void Client::Channel::receiveReplies() {
   bool more = true;
   for (int round = 0; round < kRounds && more; ++round) {
     std::optional<std::string> end = receive(more);
-    if (!end) end = giveReplies();
-    if (end) return lose(*end, false);
+    if (!end) end = deliverReplies();
+    if (end) return handleLoss(*end, false);
   }
 }
 
-// Takes in what has arrived; `more` when there may be more. Returns why there will be no more.
+// Reads the bytes that have arrived; sets `more` when there may be further ones. Returns the reason
+// when the connection has ended.
 std::optional<std::string> Client::Channel::receive(bool& more) {
   int socket = -1;
   {
@@ -136,7 +137,7 @@ std::optional<std::string> Client::Channel::receive(bool& more) {
   return std::string("The connection to the service broke: ") + std::strerror(errno) + ".";
 }
 
-std::optional<std::string> Client::Channel::giveReplies() {
+std::optional<std::string> Client::Channel::deliverReplies() {
   for (;;) {
     const std::string_view bytes(received_.data() + begin_, end_ - begin_);
     if (bytes.empty()) return std::nullopt;
@@ -150,11 +151,11 @@ std::optional<std::string> Client::Channel::giveReplies() {
     }
     begin_ += scanner_.length();
     scanner_.reset();
-    if (!giveReply(PayloadValue(bytes.data()))) return "The service sent what is no reply.";
+    if (!deliverReply(PayloadValue(bytes.data()))) return "The service sent what is no reply.";
   }
 }
 
-bool Client::Channel::giveReply(PayloadValue response) {
+bool Client::Channel::deliverReply(PayloadValue response) {
   constexpr std::int64_t kResponse = 1;
   if (response.kind() != PayloadValue::Kind::list || response.count() != 4) return false;
   auto item = response.items().begin();
@@ -168,15 +169,15 @@ bool Client::Channel::giveReply(PayloadValue response) {
   {
     MutexLock lock(mutex_);
     const auto found = pending_.find(static_cast<std::uint32_t>(*call));
-    if (found == pending_.end()) return true;  // nobody waits for it any more
+    if (found == pending_.end()) return true;  // its reply was dropped
     reply = std::move(found->second.reply);
     pending_.erase(found);
   }
-  GiveResponse(reply, error, result);
+  DeliverResponse(reply, error, result);
   return true;
 }
 
-void Client::Channel::giveRefusals() {
+void Client::Channel::deliverRefusals() {
   for (;;) {
     std::vector<Refused> refused;
     {
@@ -184,7 +185,7 @@ void Client::Channel::giveRefusals() {
       std::swap(refused, refused_);
     }
     if (refused.empty()) return;
-    for (const Refused& one : refused) GiveError(one.reply, WhyRefused(one.code, lossReason_));
+    for (const Refused& one : refused) DeliverError(one.reply, WhyRefused(one.code, lossReason_));
   }
 }
 

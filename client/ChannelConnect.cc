@@ -10,9 +10,8 @@
 #include <cstring>
 #include <utility>
 
+#include "base/StandardPaths.h"
 #include "client/Channel.h"
-#include "client/Connect.h"
-#include "client/Failure.h"
 
 namespace quarvel {
 namespace {
@@ -20,15 +19,6 @@ namespace {
 constexpr std::string_view kHowToStart =
     "Start it with \"systemctl start quarvel\", or by hand with \"quarveld\"; if it listens "
     "elsewhere, name its socket in QUARVEL_SOCKET.";
-
-std::string Environment(const char* name) {
-  const char* value = std::getenv(name);
-  return value == nullptr ? std::string() : value;
-}
-
-bool Exists(const std::string& path) {
-  return ::access(path.c_str(), F_OK) == 0;
-}
 
 std::string GroupName(gid_t group) {
   struct group entry {};
@@ -40,7 +30,7 @@ std::string GroupName(gid_t group) {
   return std::to_string(group);
 }
 
-// Who would have been let in: the group of the socket, or of the directory that hides it.
+// Names the group that may connect: that of the socket, or of the directory that hides it.
 std::string WhyNotPermitted(const std::string& path) {
   struct stat status {};
   std::string closed = path;
@@ -75,24 +65,13 @@ std::string WhyUnreachable(const std::string& path, int error) {
 }  // namespace
 
 std::string Client::defaultSocketPath() {
-  if (std::string path = Environment("QUARVEL_SOCKET"); !path.empty()) return path;
-  std::vector<std::string> candidates;
-  // A client that is itself a unit has a runtime directory of its own, so none is taken unseen.
-  // Where a unit has several they are separated by colons; the first counts.
-  if (const std::string own = Environment("RUNTIME_DIRECTORY"); !own.empty()) {
-    candidates.push_back(own.substr(0, own.find(':')) + "/reporting.sock");
+  if (const char* named = std::getenv("QUARVEL_SOCKET"); named != nullptr && *named != '\0') {
+    return named;
   }
-  if (const std::string user = Environment("XDG_RUNTIME_DIR"); !user.empty() && ::geteuid() != 0) {
-    candidates.push_back(user + "/quarvel/reporting.sock");
-  }
-  candidates.emplace_back("/run/quarvel/reporting.sock");
-  for (const std::string& path : candidates) {
-    if (Exists(path)) return path;
-  }
-  return candidates.front();
+  return StandardPaths::find(StandardPaths::Kind::runtime, "reporting.sock").native();
 }
 
-Result<int> ConnectTo(const std::string& path, bool mayWait) {
+Result<int> Client::Channel::connectTo(const std::string& path, bool mayWait) {
   sockaddr_un address{};
   address.sun_family = AF_UNIX;
   if (path.size() >= sizeof address.sun_path) {

@@ -1,0 +1,247 @@
+#pragma once
+
+#include <bit>
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <cstring>
+#include <limits>
+#include <string>
+#include <string_view>
+
+#include "base/Value.h"
+
+namespace quarvel {
+
+/// Appends MessagePack to a sink, each value in its shortest form. The sink has the `push_back` and
+/// `append` of a string; the writer itself allocates nothing and keeps no state, so with a sink of
+/// fixed memory all functions but `key` and `value` suit a real-time thread.
+template <class Sink>
+class BasicMessagePackWriter {
+ public:
+  /// `out` must outlive the writer.
+  explicit BasicMessagePackWriter(Sink& out) : out_(out) {}
+
+  void nil() { head('\xc0'); }
+  void boolean(bool value) { head(value ? '\xc3' : '\xc2'); }
+  void integer(std::int64_t value);
+  void unsignedInteger(std::uint64_t value);
+  void real(double value);
+  void string(std::string_view text);
+  void bytes(std::string_view octets);
+  /// The timestamp extension, in the shortest of its three forms.
+  void date(Date date);
+  /// The head of a list; `count` values follow.
+  void list(std::size_t count);
+  /// The head of a dictionary; `count` times a key and a value follow.
+  void dictionary(std::size_t count);
+  /// A value that is MessagePack already.
+  void encoded(std::string_view value) { out_.append(value.data(), value.size()); }
+
+  void key(const Key& key);
+  void value(const Value& value);
+  void value(const Dictionary& dictionary);
+
+ private:
+  void head(char code) { out_.push_back(code); }
+  template <class Unsigned>
+  void bigEndian(Unsigned number);
+
+  Sink& out_;
+};
+
+using MessagePackWriter = BasicMessagePackWriter<std::string>;
+extern template class BasicMessagePackWriter<std::string>;  // MessagePack.cc
+
+template <class Sink>
+template <class Unsigned>
+void BasicMessagePackWriter<Sink>::bigEndian(Unsigned number) {
+  if constexpr (std::endian::native == std::endian::little) {
+    if constexpr (sizeof(Unsigned) == 2) number = __builtin_bswap16(number);
+    if constexpr (sizeof(Unsigned) == 4) number = __builtin_bswap32(number);
+    if constexpr (sizeof(Unsigned) == 8) number = __builtin_bswap64(number);
+  }
+  char octets[sizeof(Unsigned)];
+  std::memcpy(octets, &number, sizeof number);
+  out_.append(octets, sizeof octets);
+}
+
+template <class Sink>
+void BasicMessagePackWriter<Sink>::unsignedInteger(std::uint64_t value) {
+  if (value < 128) {
+    head(static_cast<char>(value));
+  } else if (value <= std::numeric_limits<std::uint8_t>::max()) {
+    head('\xcc');
+    bigEndian(static_cast<std::uint8_t>(value));
+  } else if (value <= std::numeric_limits<std::uint16_t>::max()) {
+    head('\xcd');
+    bigEndian(static_cast<std::uint16_t>(value));
+  } else if (value <= std::numeric_limits<std::uint32_t>::max()) {
+    head('\xce');
+    bigEndian(static_cast<std::uint32_t>(value));
+  } else {
+    head('\xcf');
+    bigEndian(value);
+  }
+}
+
+template <class Sink>
+void BasicMessagePackWriter<Sink>::integer(std::int64_t value) {
+  if (value >= 0) {
+    unsignedInteger(static_cast<std::uint64_t>(value));
+  } else if (value >= -32) {
+    head(static_cast<char>(value));
+  } else if (value >= std::numeric_limits<std::int8_t>::min()) {
+    head('\xd0');
+    bigEndian(static_cast<std::uint8_t>(value));
+  } else if (value >= std::numeric_limits<std::int16_t>::min()) {
+    head('\xd1');
+    bigEndian(static_cast<std::uint16_t>(value));
+  } else if (value >= std::numeric_limits<std::int32_t>::min()) {
+    head('\xd2');
+    bigEndian(static_cast<std::uint32_t>(value));
+  } else {
+    head('\xd3');
+    bigEndian(static_cast<std::uint64_t>(value));
+  }
+}
+
+template <class Sink>
+void BasicMessagePackWriter<Sink>::real(double value) {
+  head('\xcb');
+  bigEndian(std::bit_cast<std::uint64_t>(value));
+}
+
+template <class Sink>
+void BasicMessagePackWriter<Sink>::string(std::string_view text) {
+  if (text.size() < 32) {
+    head(static_cast<char>(0xa0 | text.size()));
+  } else if (text.size() <= std::numeric_limits<std::uint8_t>::max()) {
+    head('\xd9');
+    bigEndian(static_cast<std::uint8_t>(text.size()));
+  } else if (text.size() <= std::numeric_limits<std::uint16_t>::max()) {
+    head('\xda');
+    bigEndian(static_cast<std::uint16_t>(text.size()));
+  } else {
+    head('\xdb');
+    bigEndian(static_cast<std::uint32_t>(text.size()));
+  }
+  out_.append(text.data(), text.size());
+}
+
+template <class Sink>
+void BasicMessagePackWriter<Sink>::bytes(std::string_view octets) {
+  if (octets.size() <= std::numeric_limits<std::uint8_t>::max()) {
+    head('\xc4');
+    bigEndian(static_cast<std::uint8_t>(octets.size()));
+  } else if (octets.size() <= std::numeric_limits<std::uint16_t>::max()) {
+    head('\xc5');
+    bigEndian(static_cast<std::uint16_t>(octets.size()));
+  } else {
+    head('\xc6');
+    bigEndian(static_cast<std::uint32_t>(octets.size()));
+  }
+  out_.append(octets.data(), octets.size());
+}
+
+template <class Sink>
+void BasicMessagePackWriter<Sink>::date(Date date) {
+  using namespace std::chrono;
+  const auto whole = floor<seconds>(date.time_since_epoch());
+  const auto count = whole.count();
+  const auto nanoseconds32 = static_cast<std::uint32_t>(
+      duration_cast<nanoseconds>(date.time_since_epoch() - whole).count());
+  if (count >= 0 && count >> 34 == 0) {
+    if (nanoseconds32 == 0 && count >> 32 == 0) {
+      head('\xd6');
+      head('\xff');
+      bigEndian(static_cast<std::uint32_t>(count));
+    } else {
+      head('\xd7');
+      head('\xff');
+      bigEndian(std::uint64_t{nanoseconds32} << 34 | static_cast<std::uint64_t>(count));
+    }
+  } else {
+    head('\xc7');
+    head('\x0c');
+    head('\xff');
+    bigEndian(nanoseconds32);
+    bigEndian(static_cast<std::uint64_t>(count));
+  }
+}
+
+template <class Sink>
+void BasicMessagePackWriter<Sink>::list(std::size_t count) {
+  if (count < 16) {
+    head(static_cast<char>(0x90 | count));
+  } else if (count <= std::numeric_limits<std::uint16_t>::max()) {
+    head('\xdc');
+    bigEndian(static_cast<std::uint16_t>(count));
+  } else {
+    head('\xdd');
+    bigEndian(static_cast<std::uint32_t>(count));
+  }
+}
+
+template <class Sink>
+void BasicMessagePackWriter<Sink>::dictionary(std::size_t count) {
+  if (count < 16) {
+    head(static_cast<char>(0x80 | count));
+  } else if (count <= std::numeric_limits<std::uint16_t>::max()) {
+    head('\xde');
+    bigEndian(static_cast<std::uint16_t>(count));
+  } else {
+    head('\xdf');
+    bigEndian(static_cast<std::uint32_t>(count));
+  }
+}
+
+template <class Sink>
+void BasicMessagePackWriter<Sink>::key(const Key& key) {
+  if (const auto* text = key.string()) {
+    string(*text);
+  } else if (const auto* number = key.integer()) {
+    integer(*number);
+  } else {
+    unsignedInteger(*key.unsignedInteger());
+  }
+}
+
+template <class Sink>
+void BasicMessagePackWriter<Sink>::value(const Value& value) {
+  switch (value.kind()) {
+    case Value::Kind::nil:
+      return nil();
+    case Value::Kind::boolean:
+      return boolean(*value.boolean());
+    case Value::Kind::integer:
+      return integer(*value.integer());
+    case Value::Kind::unsignedInteger:
+      return unsignedInteger(*value.unsignedInteger());
+    case Value::Kind::real:
+      return real(*value.real());
+    case Value::Kind::string:
+      return string(*value.string());
+    case Value::Kind::bytes:
+      return bytes(value.bytes()->octets);
+    case Value::Kind::date:
+      return date(*value.date());
+    case Value::Kind::list:
+      list(value.list()->size());
+      for (const Value& item : *value.list()) this->value(item);
+      return;
+    case Value::Kind::dictionary:
+      return this->value(*value.dictionary());
+  }
+}
+
+template <class Sink>
+void BasicMessagePackWriter<Sink>::value(const Dictionary& dictionary) {
+  this->dictionary(dictionary.size());
+  for (const auto& [entryKey, entryValue] : dictionary) {
+    key(entryKey);
+    value(entryValue);
+  }
+}
+
+}  // namespace quarvel
