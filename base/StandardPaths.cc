@@ -90,10 +90,4 @@ StandardPaths StandardPaths::fromEnvironment() {
   return fromEnvironment(geteuid() == 0);
 }
 
-const StandardPaths& StandardPaths::process() {
-  // Never destroyed: other threads may ask until the very end.
-  static const StandardPaths& paths = *new StandardPaths(fromEnvironment());
-  return paths;
-}
-
 }  // namespace quarvel

@@ -20,9 +20,6 @@ struct StandardPaths {
   /// Prefix of the diagnostics directory: `$QUARVEL_DIAGNOSTICS_PREFIX`, empty by default.
   std::filesystem::path diagnosticsPrefix;
 
-  /// The service's own; read once per process, and never destroyed.
-  [[nodiscard]] static const StandardPaths& process();
-
   /// The directories that a service started with this environment uses. `root` chooses the
   /// fall-backs; without it the process's effective user decides.
   [[nodiscard]] static StandardPaths fromEnvironment(bool root);

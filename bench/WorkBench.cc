@@ -4,8 +4,8 @@
 #include <chrono>
 #include <cstdint>
 
-#include "platform/WorkQueue.h"
 #include "queues/CallTracker.h"
+#include "queues/WorkQueues.h"
 
 namespace quarvel {
 namespace {
@@ -23,7 +23,9 @@ class Counted final : public CallTracker {
 // work of the producer's own between two blocks; slow producers find the queue at rest again.
 void AsyncToSerialQueue(benchmark::State& state) {
   constexpr std::int64_t kBlocks = 1'000'000;
-  const auto queue = CreateSerialQueue("tarnwick.quarvel.bench", QualityOfService::userInteractive);
+  WorkQueues queues;
+  const auto queue =
+      queues.createSerialQueue("tarnwick.quarvel.bench", QualityOfService::userInteractive);
   for (auto _ : state) {
     std::int64_t run = 0;
     std::atomic<bool> done{false};
@@ -52,9 +54,11 @@ BENCHMARK(AsyncToSerialQueue)
 
 // There and back between two queues: what a wake-up costs when there is nothing to batch.
 void PingPong(benchmark::State& state) {
+  WorkQueues queues;
   const auto server =
-      CreateSerialQueue("tarnwick.quarvel.server", QualityOfService::userInteractive);
-  const auto session = CreateSerialQueue("tarnwick.quarvel.session", QualityOfService::utility);
+      queues.createSerialQueue("tarnwick.quarvel.server", QualityOfService::userInteractive);
+  const auto session =
+      queues.createSerialQueue("tarnwick.quarvel.session", QualityOfService::utility);
   for (auto _ : state) {
     std::atomic<bool> done{false};
     server->async([&] {

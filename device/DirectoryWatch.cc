@@ -22,19 +22,18 @@ constexpr std::uint32_t kChanges = IN_CLOSE_WRITE | IN_MOVED_TO | IN_ATTRIB | IN
 
 }  // namespace
 
-DirectoryWatch& DirectoryWatch::process() {
-  static DirectoryWatch& watch = *new DirectoryWatch;
-  return watch;
+DirectoryWatch::~DirectoryWatch() {
+  end();
 }
 
-DirectoryWatch::~DirectoryWatch() {
+void DirectoryWatch::end() {
   const MutexLock lock(mutex_);
   if (descriptor_ < 0) return;
   ending_ = true;
   // Removing a watch is an event too, which wakes the thread.
   inotify_rm_watch(descriptor_, inotify_add_watch(descriptor_, "/", IN_DELETE_SELF));
   while (running_) ended_.wait(mutex_);
-  ::close(descriptor_);
+  ::close(std::exchange(descriptor_, -1));
 }
 
 int DirectoryWatch::start() {

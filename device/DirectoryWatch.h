@@ -22,15 +22,16 @@ class DirectoryWatch {
   DirectoryWatch() = default;
   DirectoryWatch(const DirectoryWatch&) = delete;
   DirectoryWatch& operator=(const DirectoryWatch&) = delete;
-  /// When it returns, no handler is running or will be called. Must not be called from a handler.
+  /// As `end`.
   ~DirectoryWatch();
-
-  /// The process's own, never destroyed.
-  [[nodiscard]] static DirectoryWatch& process();
 
   /// Makes `directory` if it is missing and calls `handler` for its files from now on. The handler
   /// may take its owner's locks but must not wait. Returns 0 or the system's error number.
   [[nodiscard]] int add(const std::filesystem::path& directory, Handler handler);
+
+  /// Ends the thread: when this returns, no handler is running or will be called. Not from a
+  /// handler; nothing is added any more.
+  void end() QUARVEL_EXCLUDES(mutex_);
 
  private:
   struct Watched {

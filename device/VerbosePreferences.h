@@ -1,11 +1,32 @@
 #pragma once
 
+#include <memory>
+#include <vector>
+
+#include "base/Mutex.h"
+#include "platform/Log.h"
+#include "platform/WorkQueue.h"
+
 namespace quarvel {
 
-/// Makes log scopes follow the preferences, for the life of the process. Reads each scope's verbose
-/// key from its domain when the scope is registered (now for the scopes already registered), and
-/// again whenever the notification "tarnwick.quarvel.reporting" is posted.
-/// Thread: call it once, while the service starts; later reads run on a queue of their own.
-void FollowVerbosePreferences();
+/// Makes log scopes follow the preferences. Reads each scope's verbose key from its domain when the
+/// scope is registered (at once for the registered ones), and again whenever the notification
+/// "tarnwick.quarvel.reporting" is posted. Owned by the service, one at a time, and outlives the
+/// blocks of its queue, on which later reads run.
+class VerbosePreferences {
+ public:
+  VerbosePreferences();
+  VerbosePreferences(const VerbosePreferences&) = delete;
+  VerbosePreferences& operator=(const VerbosePreferences&) = delete;
+  ~VerbosePreferences();
+
+ private:
+  void add(LogHandle scope) QUARVEL_EXCLUDES(mutex_);
+  void readAgain() QUARVEL_EXCLUDES(mutex_);
+
+  const std::unique_ptr<WorkQueue> queue_;
+  Mutex mutex_;
+  std::vector<LogHandle> scopes_ QUARVEL_GUARDED_BY(mutex_);
+};
 
 }  // namespace quarvel

@@ -1,7 +1,6 @@
 #include "platform/Counters.h"
 
-#include "linux/ProcessStore.h"
-#include "store/StoreStatus.h"
+#include "linux/Service.h"
 
 namespace quarvel {
 
@@ -22,15 +21,15 @@ StoreDrop ReasonOf(MessageDrop reason) {
 }  // namespace
 
 void CountAcceptedMessage() {
-  ProcessTelemetryStore()->countAccepted();
+  Service::current().store().countAccepted();
 }
 
 void CountDroppedMessage(MessageDrop reason) {
-  ProcessTelemetryStore()->countDropped(ReasonOf(reason));
+  Service::current().store().countDropped(ReasonOf(reason));
 }
 
 void AddToGauge(Gauge gauge, int difference) {
-  ProcessGauges()[static_cast<std::size_t>(gauge)] += difference;
+  Service::current().gauges()[static_cast<std::size_t>(gauge)] += difference;
 }
 
 }  // namespace quarvel

@@ -1,13 +1,13 @@
 #include "platform/DeviceProperties.h"
 
-#include "system/Configuration.h"
+#include "linux/Service.h"
 
 namespace quarvel {
 namespace {
 
 template <class Kind>
 std::optional<Kind> property(std::string_view name) {
-  const auto& device = Configuration::process().device;
+  const auto& device = Service::current().configuration().device;
   const auto found = device.find(name);
   if (found == device.end()) return std::nullopt;
   const Kind* value = std::get_if<Kind>(&found->second);

@@ -1,12 +1,12 @@
 #include "platform/FileSystem.h"
 
 #include "base/Files.h"
-#include "base/StandardPaths.h"
+#include "linux/Service.h"
 
 namespace quarvel {
 
 std::string DiagnosticsPath(std::string_view path) {
-  return StandardPaths::process().diagnosticsPrefix.native() + std::string(path);
+  return Service::current().paths().diagnosticsPrefix.native() + std::string(path);
 }
 
 Outcome CreateDirectory(std::string_view path, std::uint32_t permissions) {

@@ -1,14 +1,11 @@
 #include "platform/Preferences.h"
 
-#include "base/StandardPaths.h"
-#include "device/PreferencesStore.h"
+#include "linux/Service.h"
 
 namespace quarvel {
 
 PreferencesDomain OpenPreferencesDomain(std::string_view name) {
-  static PreferencesStore& store =
-      *new PreferencesStore(StandardPaths::process().configuration / "preferences");
-  return store.open(name);
+  return Service::current().preferences().open(name);
 }
 
 }  // namespace quarvel

@@ -5,43 +5,12 @@
 #include <fmt/format.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <string_view>
-#include <utility>
-#include <vector>
 
-#include "base/Mutex.h"
 #include "base/Utf8.h"
-#include "system/LogWriter.h"
-#include "system/ProcessExit.h"
+#include "linux/Service.h"
 
 namespace quarvel {
-namespace {
-
-struct ExitWork {
-  Mutex mutex;
-  std::vector<Block> blocks QUARVEL_GUARDED_BY(mutex);
-};
-
-// Never destroyed: the process may end on any thread, at any time.
-ExitWork& exitWork() {
-  static ExitWork& instance = *new ExitWork;
-  return instance;
-}
-
-Block lastExitWork() {
-  const MutexLock lock(exitWork().mutex);
-  if (exitWork().blocks.empty()) return {};
-  Block last = std::move(exitWork().blocks.back());
-  exitWork().blocks.pop_back();
-  return last;
-}
-
-// The thread that ends the process; 0 while nobody does.
-std::atomic<pid_t> ending{0};
-
-}  // namespace
-
 std::int32_t OwnProcessIdentifier() {
   return getpid();
 }
@@ -65,19 +34,8 @@ std::optional<std::string> ProcessCommandName(std::int32_t processIdentifier) {
   return std::string(name);
 }
 
-void AtProcessExit(Block work) {
-  const MutexLock lock(exitWork().mutex);
-  exitWork().blocks.push_back(std::move(work));
-}
-
 void ExitProcess(int status) {
-  pid_t nobody = 0;
-  if (ending.compare_exchange_strong(nobody, gettid())) {
-    while (Block work = lastExitWork()) work();
-  } else if (nobody != gettid()) {
-    for (;;) pause();  // until the other thread has ended the process
-  }
-  LogWriter::instance().flush();
+  if (Service* const service = Service::running()) service->processExit().exit(status);
   _exit(status);
 }
 

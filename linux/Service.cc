@@ -1,36 +1,34 @@
-#include <systemd/sd-daemon.h>
+#include "linux/Service.h"
 
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cassert>
 #include <chrono>
 #include <csignal>
-#include <memory>
 #include <utility>
 
+#include "base/Files.h"
 #include "base/Format.h"
-#include "base/StandardPaths.h"
-#include "device/VerbosePreferences.h"
-#include "linux/ProcessErasures.h"
-#include "linux/ProcessExporters.h"
-#include "linux/ProcessStore.h"
+#include "device/OrientationFiles.h"
+#include "device/OrientationSensor.h"
+#include "platform/Clock.h"
 #include "platform/Log.h"
-#include "platform/Process.h"
-#include "platform/ServiceListener.h"
-#include "queues/Work.h"
-#include "system/Configuration.h"
-#include "system/ServiceManager.h"
-#include "system/StatusFile.h"
-#include "transport/SocketListener.h"
 
 namespace quarvel {
 
 namespace {
 
-/// The service ends within 5 seconds; what remains of them after this is for what the work leaves
-/// behind to reach the medium.
+/// The service ends within 5 s; the rest of them is for the store, whose last rows have to reach
+/// the medium.
 constexpr std::chrono::seconds kWorkMayTake{4};
 
-Result<ListeningSocket> OpenListeningSocket() {
+std::atomic<Service*> runningService{nullptr};
+
+Result<ListeningSocket> OpenListeningSocket(const StandardPaths& paths) {
   const int count = ::sd_listen_fds(/*unset_environment=*/1);
-  if (count == 0) return ListeningSocket::listeningAt(StandardPaths::process().socket);
+  if (count == 0) return ListeningSocket::listeningAt(paths.socket);
   if (count != 1) {
     return Error::because(
         "quarvel.listener", 1,
@@ -40,52 +38,133 @@ Result<ListeningSocket> OpenListeningSocket() {
   return ListeningSocket::inherited(UniqueDescriptor(SD_LISTEN_FDS_START));
 }
 
-Result<std::unique_ptr<SocketListener>> OpenListener() {
+}  // namespace
+
+Service::Running::Running(Service& service) {
+  assert(runningService == nullptr);
+  runningService = &service;
+}
+
+Service::Running::~Running() {
+  runningService = nullptr;
+}
+
+Service* Service::running() {
+  return runningService.load(std::memory_order_acquire);
+}
+
+Service& Service::current() {
+  assert(running() != nullptr);
+  return *running();
+}
+
+Service::Service()
+    : paths_(StandardPaths::fromEnvironment(geteuid() == 0)),
+      configuration_(readConfiguration()),
+      notifications_(paths_.runtime / "notify", watch_),
+      preferences_(paths_.configuration / "preferences"),
+      tallix_(configuration_.tallix),
+      listener_((setOrientationSource(), openListener())),
+      store_(openStore()),
+      events_(store_),
+      analytics_(events_, configuration_.analyticsWanted),
+      agent_(store_, configuration_.agent.backends),
+      remoteBackends_(configuration_, configurationFile(), *store_, status_, processExit_),
+      erasures_(paths_.runtime / "erase", *store_, remoteBackends_.exporters()),
+      statusFile_(status_, paths_.runtime / "status.json") {}
+
+// Members are destroyed once no thread uses them: first the sources of work end, then the work that
+// uses the store and the exporters, then these, then the work that their end has caused.
+Service::~Service() {
+  constexpr auto kForever = std::chrono::steady_clock::time_point::max();
+  watch_.end();
+  static_cast<void>(queues_.drain(kForever));
+  processExit_.runWork();
+  static_cast<void>(queues_.drain(kForever));
+}
+
+std::filesystem::path Service::configurationFile() const {
+  return paths_.configuration / Configuration::kFileName;
+}
+
+Configuration Service::readConfiguration() {
+  ZQ_FUNCTION("ConfigurationRead");
+  std::vector<std::string> warnings;
+  Result<Configuration> configuration =
+      Configuration::read(configurationFile(), RemoteBackends::kinds(), warnings);
+  if (!configuration) {
+    const std::string* const reason = configuration.error().userInfo.find("reason")->string();
+    ZQ_LOG(nullptr, error, "{}", *reason);
+    processExit_.exit(1);
+  }
+  log_.setLevel(configuration.value().logLevel);
+  for (const std::string& warning : warnings) ZQ_LOG(nullptr, standard, "{}", warning);
+  return std::move(configuration.value());
+}
+
+void Service::setOrientationSource() {
+  switch (configuration_.orientation) {
+    case Configuration::OrientationSource::files:
+      orientation_.setSource(
+          std::make_unique<OrientationFiles>(orientation_, paths_.runtime, watch_));
+      break;
+    case Configuration::OrientationSource::iio:
+      orientation_.setSource(std::make_unique<OrientationSensor>(orientation_));
+      break;
+    case Configuration::OrientationSource::none:
+      break;
+  }
+}
+
+std::unique_ptr<SocketListener> Service::openListener() {
+  ZQ_FUNCTION("ProcessServiceListener");
+  // Writing to a closed descriptor (a client, a pipe behind standard error) is an error, no end.
+  std::signal(SIGPIPE, SIG_IGN);
   SocketListener::Options options;
-  options.limits = Configuration::process().limits;
+  options.limits = configuration_.limits;
   options.endSignals = {SIGTERM, SIGINT};
-  options.atStart = TellManagerReady;
-  options.pulse = PingManager;
-  options.pulseInterval = ManagerPingInterval();
-  options.atEndBegun = TellManagerStopping;
-  options.atEnd.emplace_back([] {
-    ZQ_FUNCTION("ProcessServiceListener");
-    if (!DrainWork(std::chrono::steady_clock::now() + kWorkMayTake)) {
+  options.atStart = [this] { manager_.reportReady(); };
+  options.pulse = [this] { manager_.ping(); };
+  options.pulseInterval = ServiceManager::pingInterval();
+  options.atEndBegun = [this] { manager_.reportStopping(); };
+  options.atEnd.emplace_back([this] {
+    if (!queues_.drain(std::chrono::steady_clock::now() + kWorkMayTake)) {
       ZQ_LOG(nullptr, error, "work was still under way when the service had to end");
     }
   });
-  // Makes safe what the store has taken and writes the log out; no destructor runs under threads
-  // that are still there.
-  options.atEnd.emplace_back([] { ExitProcess(0); });
-
-  Result<ListeningSocket> socket = OpenListeningSocket();
-  if (!socket) return std::move(socket.error());
-  return SocketListener::create(std::move(socket.value()), std::move(options));
-}
-
-std::unique_ptr<SocketListener> OpenListenerOrExit() {
-  ZQ_FUNCTION("ProcessServiceListener");
-  // Writing to what has been closed (a client, a pipe behind standard error) is an error, no end.
-  std::signal(SIGPIPE, SIG_IGN);
-  Result<std::unique_ptr<SocketListener>> listener = OpenListener();
+  Result<ListeningSocket> socket = OpenListeningSocket(paths_);
+  auto listener = socket ? SocketListener::create(std::move(socket.value()), std::move(options))
+                         : Result<std::unique_ptr<SocketListener>>(std::move(socket.error()));
   if (!listener) {
     ZQ_LOG(nullptr, error, "the service cannot start: {}", listener.error().description());
-    ExitProcess(1);
+    processExit_.exit(1);
   }
-  // With the socket ours, so that a second service never touches the store of one that runs.
-  static_cast<void>(ProcessTelemetryStore());
-  static_cast<void>(ProcessExporters());
-  AnswerErasureRequests();
-  FollowVerbosePreferences();
-  AnswerStatusRequests();
   return std::move(listener.value());
 }
 
-}  // namespace
-
-ServiceListener& ProcessServiceListener() {
-  static const std::unique_ptr<SocketListener> listener = OpenListenerOrExit();
-  return *listener;
+std::shared_ptr<TelemetryStore> Service::openStore() {
+  ZQ_FUNCTION("ProcessTelemetryStore");
+  TelemetryStore::Options options;
+  options.path = configuration_.store.path;
+  if (options.path.empty()) {
+    // The state directory is the service's own to make; a configured one is not.
+    (void)CreatePrivateDirectory(paths_.state);
+    options.path = paths_.state / "telemetry.db";
+  }
+  options.sync = configuration_.store.sync;
+  options.maximumBytes = configuration_.store.maximumBytes;
+  options.maximumAge = configuration_.store.maximumAge;
+  options.remoteBackends = configuration_.agent.remoteBackends();
+  options.clock = CurrentDate;
+  auto opened = TelemetryStore::open(std::move(options));
+  if (!opened) {
+    ZQ_LOG(nullptr, error, "the service cannot start: {}", opened.error().description());
+    processExit_.exit(1);
+  }
+  std::shared_ptr<TelemetryStore> store = std::move(opened.value());
+  DescribeInStatus(status_, store, gauges_);
+  processExit_.add([store] { store->close(); });
+  return store;
 }
 
 }  // namespace quarvel

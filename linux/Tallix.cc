@@ -2,7 +2,7 @@
 
 #include <utility>
 
-#include "device/TallixFacility.h"
+#include "linux/Service.h"
 #include "platform/Log.h"
 
 namespace quarvel {
@@ -11,11 +11,10 @@ TallixChannels TallixCopyChannelsInGroup(std::optional<std::string_view> group,
                                          std::optional<std::string_view> subgroup,
                                          std::optional<Error>& error) {
   ZQ_FUNCTION("TallixCopyChannelsInGroup");
-  static const TallixFacility facility(Configuration::process().tallix);
   std::optional<Error> failure;
-  TallixChannels channels = facility.channelsInGroup(group, subgroup, failure);
+  TallixChannels channels = Service::current().tallix().channelsInGroup(group, subgroup, failure);
   if (failure) {
-    // Who asked logs the code alone.
+    // The caller logs the code alone.
     ZQ_LOG(nullptr, error, "{}", failure->description());
     error = std::move(failure);
   }

@@ -1,15 +1,11 @@
 #include "platform/Vistrel.h"
 
-#include "linux/ProcessStore.h"
-#include "store/AnalyticsEventSink.h"
-#include "system/Configuration.h"
+#include "linux/Service.h"
 
 namespace quarvel {
 
 void VistrelSendEventLazy(std::string_view name, const std::function<Payload()>& payload) {
-  static auto& sink =
-      *new AnalyticsEventSink(ProcessEventQueue(), Configuration::process().analyticsWanted);
-  sink.sendEventLazy(name, payload);
+  Service::current().analytics().sendEventLazy(name, payload);
 }
 
 }  // namespace quarvel

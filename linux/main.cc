@@ -1,13 +1,10 @@
-#include "Statistics/Service/ZQReportingServiceDelegate.h"
-#include "linux/ProcessExporters.h"
-#include "platform/ServiceListener.h"
-#include "system/Configuration.h"
+#include "Statistics/Service/ServiceMain.h"
+#include "linux/Service.h"
+#include "platform/Process.h"
 
 int main() {
-  quarvel::Configuration::setRemoteBackends(quarvel::RemoteBackends());
-  const auto delegate = quarvel::ZQReportingServiceDelegate::create();
-  quarvel::ServiceListener& listener = quarvel::ProcessServiceListener();
-  listener.setDelegate(delegate);
-  listener.resume();
-  return 0;
+  quarvel::Service service;
+  // Commits the store's rows and writes the log out; no destructor runs while a client's work still
+  // holds a thread.
+  quarvel::ExitProcess(quarvel::ServiceMain());
 }

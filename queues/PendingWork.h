@@ -1,17 +1,35 @@
 #pragma once
 
+#include <atomic>
 #include <chrono>
+#include <cstdint>
+
+#include "base/Mutex.h"
 
 namespace quarvel {
 
-// How much work there is in the whole process: each queue that has blocks to run counts as one, and
-// so does each delayed block. A queue's own blocks are what adds to the count, so once it is zero
-// it stays zero until somebody outside the queues brings work.
+/// Counts the pending work of all queues of a `WorkQueues`, its owner: one for each queue that has
+/// blocks to run and one for each delayed block. Queued blocks alone add to the count while it is
+/// above zero, so that a count of zero stays until a thread outside the queues adds work.
+/// Any thread.
+class PendingWork {
+ public:
+  PendingWork() = default;
+  PendingWork(const PendingWork&) = delete;
+  PendingWork& operator=(const PendingWork&) = delete;
 
-void PendingWorkAdded();
-void PendingWorkDone();
+  void add() { count_.fetch_add(1); }
+  void remove() QUARVEL_EXCLUDES(mutex_);
 
-/// Waits until there is no activity. Returns false when there still was some at `deadline`.
-[[nodiscard]] bool WaitUntilIdle(std::chrono::steady_clock::time_point deadline);
+  /// Blocks until the count is zero. Returns false when it was not by `deadline`.
+  [[nodiscard]] bool waitUntilIdle(std::chrono::steady_clock::time_point deadline)
+      QUARVEL_EXCLUDES(mutex_);
+
+ private:
+  std::atomic<std::int64_t> count_{0};
+  std::atomic<int> waiters_{0};
+  Mutex mutex_;
+  ConditionVariable idle_;
+};
 
 }  // namespace quarvel

@@ -2,11 +2,10 @@
 
 #include <fmt/format.h>
 
-#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <thread>
+#include <utility>
 #include <vector>
 
 #include "queues/PendingWork.h"
@@ -16,111 +15,104 @@
 namespace quarvel {
 namespace {
 
-constexpr std::size_t kMostGathered = 1024;
+constexpr std::size_t kMostDeferred = 1024;
 
 struct Worker {
   Pool* pool = nullptr;
   const QueueState* queue = nullptr;
   unsigned blockingScopes = 0;
-  // What the block under way has made ready, all of one pool.
-  Pool* gatheredFor = nullptr;
-  std::vector<std::shared_ptr<QueueState>> gathered;
+  // Queues that the running block has made ready, all of one pool.
+  Pool* deferredFor = nullptr;
+  std::vector<std::shared_ptr<QueueState>> deferred;
 };
 thread_local Worker worker;
 
 }  // namespace
 
-Pool& Pool::of(QualityOfService qualityOfService) {
-  // Never destroyed: their threads outlive the end of main. The first class serves one queue, and
-  // the watchdog that looks whether that one moves. Many sessions may wait for their backends at
-  // once; what is held back on the background queue all waits for the same, the store's room.
-  static Pool& userInteractive = *new Pool("user-interactive", 0, 1, 8);
-  static Pool& utility =
-      *new Pool("utility", 5, std::max<std::size_t>(2, std::thread::hardware_concurrency()), 2048);
-  static Pool& background = *new Pool("background", 10, 2, 8);
-  switch (qualityOfService) {
-    case QualityOfService::background:
-      return background;
-    case QualityOfService::utility:
-      return utility;
-    case QualityOfService::userInteractive:
-      break;
-  }
-  return userInteractive;
+Pool::Pool(const Options& options, TimerThread& timers, PendingWork& pendingWork)
+    : options_(options), timers_(timers), pendingWork_(pendingWork) {}
+
+Pool::~Pool() {
+  const MutexLock lock(mutex_);
+  ending_ = true;
+  wake_.notifyAll();
+  while (running_ > 0) threadLeft_.wait(mutex_);
 }
 
-Pool::Pool(std::string_view name, int nice, std::size_t width, std::size_t mostHeldBack)
-    : name_(name), nice_(nice), width_(width), mostHeldBack_(mostHeldBack) {}
-
 void Pool::submit(std::shared_ptr<QueueState> queue) {
-  PendingWorkAdded();
+  pendingWork_.add();
   submit({&queue, 1});
 }
 
 void Pool::submit(std::span<std::shared_ptr<QueueState>> queues) {
   std::size_t begun = 0;
-  Help help = Help::none;
+  ThreadNeed need = ThreadNeed::none;
   do {
     {
       const MutexLock lock(mutex_);
       for (; begun < queues.size(); ++begun) ready_.push_back(std::move(queues[begun]));
-      help = helpNeeded();
+      need = countNeededThread();
     }
-    call(help);
-  } while (help != Help::none && queues.size() > 1);
+    provide(need);
+  } while (need != ThreadNeed::none && queues.size() > 1);
 }
 
-void Pool::submitSoon(std::shared_ptr<QueueState> queue) {
+void Pool::submitDeferred(std::shared_ptr<QueueState> queue) {
   if (worker.pool == nullptr) return submit(std::move(queue));
-  PendingWorkAdded();
-  if (worker.gatheredFor != this) submitGathered();
-  worker.gatheredFor = this;
-  worker.gathered.push_back(std::move(queue));
-  if (worker.gathered.size() == kMostGathered) submitGathered();
+  pendingWork_.add();
+  if (worker.deferredFor != this) flushDeferred();
+  worker.deferredFor = this;
+  worker.deferred.push_back(std::move(queue));
+  if (worker.deferred.size() == kMostDeferred) flushDeferred();
 }
 
-void Pool::submitGathered() {
-  if (worker.gathered.empty()) return;
-  worker.gatheredFor->submit(worker.gathered);
-  worker.gathered.clear();
+void Pool::flushDeferred() {
+  if (worker.deferred.empty()) return;
+  worker.deferredFor->submit(worker.deferred);
+  worker.deferred.clear();
 }
 
-Pool::Help Pool::helpNeeded() {
-  if (ready_.empty() || active_ >= width_) return Help::none;
-  if (idle_ == 0 && blocked_ > mostHeldBack_) return Help::none;
+Pool::ThreadNeed Pool::countNeededThread() {
+  if (ready_.empty() || active_ >= options_.width) return ThreadNeed::none;
+  if (idle_ == 0 && blocked_ > options_.maximumBlocked) return ThreadNeed::none;
   ++active_;
-  if (idle_ == 0) return Help::startThread;
+  if (idle_ == 0) return ThreadNeed::newThread;
   --idle_;
-  ++called_;
-  return Help::wakeThread;
+  ++waking_;
+  return ThreadNeed::idleThread;
 }
 
-void Pool::call(Help help) {
-  switch (help) {
-    case Help::none:
+void Pool::provide(ThreadNeed need) {
+  switch (need) {
+    case ThreadNeed::none:
       break;
-    case Help::wakeThread:
+    case ThreadNeed::idleThread:
       wake_.notifyOne();
       break;
-    case Help::startThread:
-      TimerThread::instance().startThread(*this);
+    case ThreadNeed::newThread:
+      timers_.startThread(*this);
       break;
   }
 }
 
 void Pool::startThread() {
-  const int failure = StartThread(name_, nice_, [this] { work(); });
+  {
+    const MutexLock lock(mutex_);
+    ++running_;
+  }
+  const int failure = StartThread(options_.name, options_.nice, [this] { work(); });
   if (failure == 0) return;
-  // With another thread in the pool the work waits for that one; whoever next brings work or is
-  // held back calls for a thread again.
+  // With another thread in the pool the work waits for that one; the next submission or blocked
+  // thread asks for a thread again.
   bool alone = false;
   {
     const MutexLock lock(mutex_);
+    --running_;
     --active_;
     alone = active_ + blocked_ + idle_ == 0;
   }
   if (!alone) return;
-  fmt::print(stderr, "quarvel: no thread for {} work: {}\n", name_, std::strerror(failure));
+  fmt::print(stderr, "quarvel: no thread for {} work: {}\n", options_.name, std::strerror(failure));
   std::abort();
 }
 
@@ -128,16 +120,16 @@ const QueueState* Pool::currentQueue() {
   return worker.queue;
 }
 
-bool Pool::takeTurnHere(QueueState& queue, InlineRunner& help) {
+bool Pool::takeInlineTurn(QueueState& queue, InlineRunner& runner) {
   worker.queue = &queue;
-  const bool wantsAnother = queue.takeBriefTurn(help);
+  const bool wantsAnother = queue.takeInlineTurn(runner);
   worker.queue = nullptr;
   return wantsAnother;
 }
 
 void Pool::work() {
   worker.pool = this;
-  std::string_view shown = name_;
+  std::string_view shown = options_.name;
   std::shared_ptr<QueueState> queue;
   while ((queue = nextQueue(std::move(queue)))) {
     if (shown.data() != queue->label().data()) {
@@ -149,8 +141,11 @@ void Pool::work() {
     worker.queue = nullptr;
     if (wantsAnother) continue;
     queue.reset();
-    PendingWorkDone();
+    pendingWork_.remove();
   }
+  const MutexLock lock(mutex_);
+  --running_;
+  threadLeft_.notifyAll();
 }
 
 // Takes the calling thread's unfinished queue (or null) back and gives it the next one, waiting as
@@ -158,12 +153,13 @@ void Pool::work() {
 std::shared_ptr<QueueState> Pool::nextQueue(std::shared_ptr<QueueState> unfinished) {
   const MutexLock lock(mutex_);
   if (unfinished) ready_.push_back(std::move(unfinished));
-  while (ready_.empty() || active_ > width_) {
+  while (ready_.empty() || active_ > options_.width) {
     --active_;
-    if (idle_ >= width_) return nullptr;
+    if (ending_ || idle_ >= options_.width) return nullptr;
     ++idle_;
-    while (called_ == 0) wake_.wait(mutex_);
-    --called_;
+    while (waking_ == 0 && !ending_) wake_.wait(mutex_);
+    if (ending_) return nullptr;
+    --waking_;
   }
   std::shared_ptr<QueueState> next = std::move(ready_.front());
   ready_.pop_front();
@@ -173,15 +169,15 @@ std::shared_ptr<QueueState> Pool::nextQueue(std::shared_ptr<QueueState> unfinish
 void Pool::beginBlocking() {
   Pool* const pool = worker.pool;
   if (pool == nullptr || worker.blockingScopes++ > 0) return;
-  submitGathered();
-  Help help = Help::none;
+  flushDeferred();
+  ThreadNeed need = ThreadNeed::none;
   {
     const MutexLock lock(pool->mutex_);
     --pool->active_;
     ++pool->blocked_;
-    help = pool->helpNeeded();
+    need = pool->countNeededThread();
   }
-  pool->call(help);
+  pool->provide(need);
 }
 
 void Pool::endBlocking() {

@@ -11,14 +11,15 @@
 namespace quarvel {
 
 class InlineRunner;
+class Pool;
 
-/// A block with the tracker under which it was queued.
+/// A block and the tracker under which it was queued.
 struct WorkItem {
   CallRef tracker;
   Block block;
   bool isBrief = false;
 
-  /// Runs the block, destroys it, and only then lets the tracker go.
+  /// Runs the block, destroys it, and only then releases the tracker.
   void run() {
     using Clock = std::chrono::steady_clock;
     const bool isTimed = tracker.isDirect();
@@ -33,26 +34,29 @@ struct WorkItem {
   }
 };
 
-/// A queue as its pool sees it: work in a line. Shared by the queue, which may go at any time, and
-/// by whoever still has to run its blocks.
+/// The blocks of one queue, as its pool sees them. Shared by the queue, which may be destroyed at
+/// any time, and by the thread or pool that still has to run its blocks. The pool outlives it.
 class QueueState : public std::enable_shared_from_this<QueueState> {
  public:
-  explicit QueueState(std::string_view label) : label_(label) {}
+  QueueState(std::string_view label, Pool& pool) : label_(label), pool_(pool) {}
   virtual ~QueueState() = default;
   QueueState(const QueueState&) = delete;
   QueueState& operator=(const QueueState&) = delete;
 
   [[nodiscard]] std::string_view label() const { return label_; }
-  /// From any thread.
+  [[nodiscard]] Pool& pool() const { return pool_; }
+  /// Any thread.
   virtual void add(WorkItem&& item) = 0;
   /// Runs a bounded number of blocks, so that other queues get their turn. Returns whether the
   /// queue wants another turn. On a pool's thread, once for each turn asked for.
   [[nodiscard]] virtual bool takeTurn() = 0;
-  /// The same on a thread that helps, as long as blocks are brief and `help` is not exhausted.
-  [[nodiscard]] virtual bool takeBriefTurn(InlineRunner& help) = 0;
+  /// As `takeTurn`, on the thread of `runner`: as long as blocks are brief and `runner` is not
+  /// exhausted.
+  [[nodiscard]] virtual bool takeInlineTurn(InlineRunner& runner) = 0;
 
  private:
   const std::string_view label_;
+  Pool& pool_;
 };
 
 }  // namespace quarvel

@@ -1,12 +1,12 @@
 #include "queues/Thread.h"
 
-#include <pthread.h>
 #include <signal.h>
 #include <sys/resource.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <memory>
+#include <utility>
 
 #if defined(__has_feature)
 #if __has_feature(thread_sanitizer) || __has_feature(address_sanitizer)
@@ -20,7 +20,7 @@ namespace quarvel {
 namespace {
 
 #ifdef QUARVEL_SANITIZED
-constexpr std::size_t kStackBytes = 1024 * 1024;  // frames are several times as large
+constexpr std::size_t kStackBytes = 1024 * 1024;  // a sanitizer's frames are several times as large
 #else
 constexpr std::size_t kStackBytes = 192 * 1024;
 #endif
@@ -42,8 +42,8 @@ void* runThread(void* argument) {
   return nullptr;
 }
 
-/// Blocks the signals that are meant for the process; faults of the thread itself and the
-/// profiler's signal stay as they were.
+/// Blocks the signals that are meant for the process and returns the mask before. Faults of the
+/// thread itself and the profiler's signal stay as they were.
 sigset_t blockProcessSignals() {
   sigset_t all;
   sigfillset(&all);
@@ -53,6 +53,20 @@ sigset_t blockProcessSignals() {
   sigset_t before;
   pthread_sigmask(SIG_BLOCK, &all, &before);
   return before;
+}
+
+int createThread(pthread_t& thread, int detachState, std::string_view name, int nice, Block body) {
+  auto start = std::make_unique<Start>(Start{ThreadName(name), nice, std::move(body)});
+  pthread_attr_t attributes;
+  pthread_attr_init(&attributes);
+  pthread_attr_setdetachstate(&attributes, detachState);
+  pthread_attr_setstacksize(&attributes, kStackBytes);
+  const sigset_t before = blockProcessSignals();
+  const int failure = pthread_create(&thread, &attributes, runThread, start.get());
+  pthread_sigmask(SIG_SETMASK, &before, nullptr);
+  pthread_attr_destroy(&attributes);
+  if (failure == 0) static_cast<void>(start.release());
+  return failure;
 }
 
 }  // namespace
@@ -74,18 +88,18 @@ void NameThisThread(std::string_view label) {
 }
 
 int StartThread(std::string_view name, int nice, Block body) {
-  auto start = std::make_unique<Start>(Start{ThreadName(name), nice, std::move(body)});
-  pthread_attr_t attributes;
-  pthread_attr_init(&attributes);
-  pthread_attr_setdetachstate(&attributes, PTHREAD_CREATE_DETACHED);
-  pthread_attr_setstacksize(&attributes, kStackBytes);
-  const sigset_t before = blockProcessSignals();
-  pthread_t thread;
-  const int failure = pthread_create(&thread, &attributes, runThread, start.get());
-  pthread_sigmask(SIG_SETMASK, &before, nullptr);
-  pthread_attr_destroy(&attributes);
-  if (failure == 0) static_cast<void>(start.release());
+  pthread_t thread{};
+  return createThread(thread, PTHREAD_CREATE_DETACHED, name, nice, std::move(body));
+}
+
+int JoinedThread::start(std::string_view name, int nice, Block body) {
+  const int failure = createThread(thread_, PTHREAD_CREATE_JOINABLE, name, nice, std::move(body));
+  started_ = failure == 0;
   return failure;
+}
+
+void JoinedThread::join() {
+  if (std::exchange(started_, false)) pthread_join(thread_, nullptr);
 }
 
 }  // namespace quarvel

@@ -9,7 +9,6 @@
 
 #include "queues/PendingWork.h"
 #include "queues/Pool.h"
-#include "queues/Thread.h"
 
 namespace quarvel {
 namespace {
@@ -19,16 +18,20 @@ constexpr std::chrono::milliseconds kLongestDelay = std::chrono::hours(24 * 365 
 
 }  // namespace
 
-TimerThread& TimerThread::instance() {
-  static TimerThread& keeper = *new TimerThread;
-  return keeper;
-}
-
-TimerThread::TimerThread() {
-  const int failure = StartThread("work.keeper", 0, [this] { run(); });
+TimerThread::TimerThread(PendingWork& pendingWork) : pendingWork_(pendingWork) {
+  const int failure = thread_.start("work.keeper", 0, [this] { run(); });
   if (failure == 0) return;
   fmt::print(stderr, "quarvel: no thread for work: {}\n", std::strerror(failure));
   std::abort();
+}
+
+TimerThread::~TimerThread() {
+  {
+    const MutexLock lock(mutex_);
+    ending_ = true;
+  }
+  changed_.notifyOne();
+  thread_.join();
 }
 
 void TimerThread::startThread(Pool& pool) {
@@ -44,7 +47,7 @@ void TimerThread::after(std::chrono::milliseconds delay, std::shared_ptr<QueueSt
   Delayed delayed{std::move(queue), std::move(block), nullptr, CallRef::current(), 0};
   delayed.tracker = delayed.held.tracker();
   bool first = false;
-  CallRef released;  // after the lock: what completes a tracker is foreign code
+  CallRef released;  // after the lock: completing a tracker runs foreign code
   {
     const MutexLock lock(mutex_);
     if (delay > std::chrono::milliseconds::zero() && !delaysEnded_) {
@@ -56,7 +59,7 @@ void TimerThread::after(std::chrono::milliseconds delay, std::shared_ptr<QueueSt
       const auto due = Clock::now() + std::min(delay, kLongestDelay);
       const auto place = delayed_.emplace(std::pair(due, delays_++), std::move(delayed)).first;
       first = place == delayed_.begin();
-      PendingWorkAdded();
+      pendingWork_.add();
       delayed.queue = nullptr;  // NOLINT(bugprone-use-after-move): a new value
     }
   }
@@ -74,7 +77,7 @@ void TimerThread::endDelays() {
 
 void TimerThread::run() {
   mutex_.lock();
-  for (;;) {
+  while (!ending_) {
     if (!starts_.empty()) {
       Pool& pool = *starts_.back();
       starts_.pop_back();
@@ -92,10 +95,11 @@ void TimerThread::run() {
       unheldBytes_ -= delayed.unheldBytes;
       mutex_.unlock();
       deliver(std::move(delayed));
-      PendingWorkDone();
+      pendingWork_.remove();
       mutex_.lock();
     }
   }
+  mutex_.unlock();
 }
 
 void TimerThread::deliver(Delayed delayed) {

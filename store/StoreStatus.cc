@@ -51,15 +51,11 @@ Dictionary DescribeStore(const TelemetryStore& store) {
 
 }  // namespace
 
-Gauges& ProcessGauges() {
-  static Gauges gauges{};
-  return gauges;
-}
-
-void DescribeInStatus(Status& status, const std::shared_ptr<const TelemetryStore>& store) {
-  status.add([store] {
-    const auto now = [](Gauge gauge) {
-      return ProcessGauges()[static_cast<std::size_t>(gauge)].load();
+void DescribeInStatus(Status& status, const std::shared_ptr<const TelemetryStore>& store,
+                      const Gauges& gauges) {
+  status.add([store, &gauges] {
+    const auto now = [&gauges](Gauge gauge) {
+      return gauges[static_cast<std::size_t>(gauge)].load();
     };
     const TelemetryStore::State state = store->state();
     return Dictionary{

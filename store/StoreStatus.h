@@ -10,11 +10,12 @@
 
 namespace quarvel {
 
-/// What the process has now, in the order of `Gauge`.
+/// The service's present numbers, in the order of `Gauge`.
 using Gauges = std::array<std::atomic<std::int64_t>, 3>;
-[[nodiscard]] Gauges& ProcessGauges();
 
-/// Has the status tell of the store, its queue and its counters, and of the process's gauges.
-void DescribeInStatus(Status& status, const std::shared_ptr<const TelemetryStore>& store);
+/// Adds the store, its queue and its counters, and the service's gauges to the status, which
+/// `gauges` outlives.
+void DescribeInStatus(Status& status, const std::shared_ptr<const TelemetryStore>& store,
+                      const Gauges& gauges);
 
 }  // namespace quarvel

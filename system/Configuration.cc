@@ -10,24 +10,16 @@
 #include <utility>
 
 #include "base/Files.h"
-#include "base/StandardPaths.h"
-#include "platform/Log.h"
-#include "platform/Process.h"
-#include "system/LogControl.h"
 
 namespace quarvel {
 namespace {
 
 using Section = ConfigurationSection;
 
-constexpr std::string_view kFileName = "quarvel.toml";
 constexpr std::string_view kStore = "store";  // the backend that is not remote
 constexpr std::int64_t kMebibyte = 1024 * 1024;
 constexpr std::int64_t kGibibyte = 1024 * kMebibyte;
 constexpr std::int64_t kDaySeconds = 24 * 60 * 60;
-
-// Constant after start-up.
-std::span<const BackendKind> processBackends;
 
 void readLog(Section log, Configuration& out) {
   log.read<LogLevel>("level",
@@ -119,37 +111,7 @@ void readRoot(Section& root, std::span<const BackendKind> backends, Configuratio
   readLimits(root.section("limits"), out.limits);
 }
 
-Configuration readForProcess() {
-  ZQ_FUNCTION("ConfigurationRead");
-  std::vector<std::string> warnings;
-  Result<Configuration> configuration = Configuration::read(
-      StandardPaths::process().configuration / kFileName, processBackends, warnings);
-  if (!configuration) {
-    const std::string* const reason = configuration.error().userInfo.find("reason")->string();
-    ZQ_LOG(nullptr, error, "{}", *reason);
-    ExitProcess(1);
-  }
-  SetLogLevel(configuration.value().logLevel);
-  for (const std::string& warning : warnings) ZQ_LOG(nullptr, standard, "{}", warning);
-  return std::move(configuration.value());
-}
-
 }  // namespace
-
-void Configuration::setRemoteBackends(std::span<const BackendKind> backends) {
-  processBackends = backends;
-}
-
-const Configuration& Configuration::process() {
-  // Never destroyed: other threads may ask until the very end.
-  static const Configuration& configuration = *new Configuration(readForProcess());
-  return configuration;
-}
-
-Result<Configuration> Configuration::readAgain() {
-  std::vector<std::string> ignored;  // they were logged when the process began
-  return read(StandardPaths::process().configuration / kFileName, processBackends, ignored);
-}
 
 std::vector<std::string> Configuration::Agent::remoteBackends() const {
   std::vector<std::string> remote = backends;

@@ -97,21 +97,12 @@ struct Configuration {
     std::size_t firstTurn = 16;  // queued calls executed in a row at first; no key sets it
   } limits;
 
-  /// Names the remote backends of this process's configuration, with `std::span` over constant
-  /// data. Before the first `process`; without it "store" is the only backend.
-  static void setRemoteBackends(std::span<const BackendKind> backends);
+  /// The file's name in the configuration directory.
+  static constexpr const char* kFileName = "quarvel.toml";
 
-  /// The process's configuration, read on first use. An error in the file goes to the log (file,
-  /// line, key and the allowed values) and ends the process with status 1. Unknown keys are
-  /// warnings in the log.
-  [[nodiscard]] static const Configuration& process();
-
-  /// Reads the process's file again, for values that may change at run time; `process` stays as it
-  /// was.
-  [[nodiscard]] static Result<Configuration> readAgain();
-
-  /// Reads one file; a missing file yields the defaults. `warnings` receives a sentence for each
-  /// unknown key. Errors: domain "quarvel.configuration".
+  /// Reads one file; a missing file yields the defaults. `backends` are the remote backends that
+  /// [agent] may name. `warnings` receives a sentence for each unknown key. Errors: domain
+  /// "quarvel.configuration".
   [[nodiscard]] static Result<Configuration> read(const std::filesystem::path& file,
                                                   std::span<const BackendKind> backends,
                                                   std::vector<std::string>& warnings);

@@ -4,8 +4,6 @@
 #include <cstdlib>
 #include <ctime>
 
-#include "base/Mutex.h"
-
 namespace quarvel {
 namespace {
 
@@ -31,17 +29,13 @@ struct LocalSecond {
   char offset[16] = "";
 };
 
-/// Kept a thread: local time is looked up once a second, not once a line.
+/// One per thread: local time is looked up once a second, not once per line.
 const LocalSecond& localSecond(std::time_t second) {
   thread_local LocalSecond local;
   if (local.second == second) return local;
   std::tm time{};
-  {
-    static Mutex& zone = *new Mutex;
-    const MutexLock lock(zone);
-    tzset();  // the device may have travelled
-    localtime_r(&second, &time);
-  }
+  tzset();  // the device may have travelled
+  localtime_r(&second, &time);
   local.second = second;
   std::strftime(local.text, sizeof local.text, "%Y-%m-%dT%H:%M:%S", &time);
   const long minutes = std::abs(time.tm_gmtoff) / 60;

@@ -10,17 +10,17 @@
 
 namespace quarvel {
 
-/// One line of the log, formatted, with what the journal wants as fields of their own. `scope`,
-/// `file` and `function` outlive it; the text belongs to whoever made it.
+/// One formatted line of the log, and the parts that the journal keeps as fields of their own. A
+/// view: `scope`, `file` and `function` live as long as the process, the text is its maker's.
 struct LogLine {
   LogLevel level;
   std::string_view scope;
   const char* file;
   int line;
   const char* function;
-  /// As standard error shows it, with the line's end: date, level, scope, then the message.
+  /// The line on standard error, with its end: date, level, scope, then the message.
   std::string_view text;
-  /// Where in `text` the message begins: "file:line:function: " and what was logged.
+  /// The place in `text` where "file:line:function: " and the logged text begin.
   std::size_t messageStart;
 
   [[nodiscard]] std::string_view message() const {

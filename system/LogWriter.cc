@@ -16,15 +16,14 @@
 #include <systemd/sd-journal.h>
 
 #include "queues/BlockingScope.h"
-#include "queues/Thread.h"
 
 namespace quarvel {
 namespace {
 
-/// When about so much has been written, those who are held back hear of room.
+/// Blocked callers hear of room each time about this much has been written.
 constexpr std::size_t kBytesAtOnce = std::size_t{32} * 1024;
 
-/// What has grown beyond this for a burst is not kept for the quiet that follows.
+/// Memory that has grown beyond this in a burst is freed after it.
 constexpr std::size_t kKeptBytes = std::size_t{64} * 1024;
 
 std::size_t bytesOf(std::size_t lines, std::size_t text) {
@@ -71,7 +70,7 @@ bool sendToJournal(const LogLine& line) {
   return sd_journal_sendv(parts, static_cast<int>(std::size(parts))) == 0;
 }
 
-/// Waits for a reader where it must. Gives up only when standard error takes nothing any more.
+/// Blocks while the reader is slow. Gives up only when standard error has failed.
 void writeToStandardError(std::string_view text) {
   while (!text.empty()) {
     const ssize_t count = ::write(STDERR_FILENO, text.data(), text.size());
@@ -88,18 +87,21 @@ void writeToStandardError(std::string_view text) {
 
 }  // namespace
 
-LogWriter& LogWriter::instance() {
-  // Never destroyed: other threads may log until the very end.
-  static LogWriter& writer = *new LogWriter;
-  return writer;
+LogWriter::LogWriter()
+    : toJournal_(standardErrorIsJournal()),
+      isThreaded_(thread_.start("log", 0, [this] { run(); }) == 0) {}
+
+LogWriter::~LogWriter() {
+  {
+    const MutexLock lock(mutex_);
+    ending_ = true;
+  }
+  arrived_.notifyOne();
+  thread_.join();
 }
 
-LogWriter::LogWriter() : toJournal_(standardErrorIsJournal()) {
-  if (StartThread("log", 0, [this] { run(); }) != 0) {
-    const MutexLock lock(mutex_);
-    way_ = Way::direct;
-  }
-  std::atexit([] { instance().end(); });
+void LogWriter::writeDirectly(const LogLine& line) {
+  writeToStandardError(line.text);
 }
 
 void LogWriter::Lines::add(const LogLine& line) {
@@ -117,29 +119,25 @@ void LogWriter::Lines::clear() {
 }
 
 void LogWriter::write(const LogLine& line) {
-  Way way = Way::queued;
-  {
-    const MutexLock lock(mutex_);
-    if (way_ == Way::queued && bytes_ >= kQueuedBytes) {
-      const BlockingScope blocking;
-      while (way_ == Way::queued && bytes_ >= kQueuedBytes) written_.wait(mutex_);
-    }
-    way = way_;
-    if (way == Way::queued) {
-      bytes_ += bytesOf(1, line.text.size());
-      ++linesTaken_;
-      queue_.add(line);
-      if (queue_.entries.size() > 1) return;  // the writer has been called already
-    }
-  }
-  if (way == Way::queued) {
-    arrived_.notifyOne();
-  } else if (way == Way::direct) {
+  if (!isThreaded_) {
     Lines lines;
     lines.add(line);
     const MutexLock lock(output_);
     put(lines, 0, 1);
+    return;
   }
+  {
+    const MutexLock lock(mutex_);
+    if (bytes_ >= kQueuedBytes) {
+      const BlockingScope blocking;
+      while (bytes_ >= kQueuedBytes) written_.wait(mutex_);
+    }
+    bytes_ += bytesOf(1, line.text.size());
+    ++linesTaken_;
+    queue_.add(line);
+    if (queue_.entries.size() > 1) return;  // the thread has been woken already
+  }
+  arrived_.notifyOne();
 }
 
 bool LogWriter::flush() {
@@ -151,21 +149,13 @@ bool LogWriter::flush() {
   return linesWritten_ >= last;
 }
 
-void LogWriter::end() {
-  const bool flushed = flush();
-  {
-    const MutexLock lock(mutex_);
-    way_ = flushed ? Way::direct : Way::none;
-  }
-  written_.notifyAll();
-}
-
 void LogWriter::run() {
   Lines lines;
   for (;;) {
     {
       const MutexLock lock(mutex_);
-      while (queue_.entries.empty()) arrived_.wait(mutex_);
+      while (queue_.entries.empty() && !ending_) arrived_.wait(mutex_);
+      if (queue_.entries.empty()) return;
       std::swap(lines, queue_);
     }
     put(lines);

@@ -1,33 +1,43 @@
 #pragma once
 
+#include <chrono>
 #include <cstddef>
 #include <cstdint>
 #include <string>
 #include <vector>
 
 #include "base/Mutex.h"
+#include "queues/Thread.h"
 #include "system/LogLine.h"
 
 namespace quarvel {
 
-/// Takes lines from any thread and writes them, in that order, on a thread of its own: to the
-/// journal when standard error leads there, else to standard error. A bounded queue lies between;
-/// who finds it full is held back until there is room. Lives as long as the process.
+/// Writes lines, in the order in which they came, on a thread of its own: to the journal when
+/// standard error leads there, else to standard error. A queue of 1 MiB lies between; a caller that
+/// finds it full blocks until there is room (`BlockingScope`). Without a thread, because the system
+/// had none to give, callers write themselves. Owned by `Log`. Any thread.
 class LogWriter {
  public:
-  [[nodiscard]] static LogWriter& instance();
+  LogWriter();
+  LogWriter(const LogWriter&) = delete;
+  LogWriter& operator=(const LogWriter&) = delete;
+  /// Writes the lines taken so far, however long the reader of standard error takes, and ends the
+  /// thread.
+  ~LogWriter();
 
-  void write(const LogLine& line) QUARVEL_EXCLUDES(mutex_);
+  void write(const LogLine& line) QUARVEL_EXCLUDES(mutex_, output_);
+  /// Writes a line to standard error on the calling thread, past any writer.
+  static void writeDirectly(const LogLine& line);
 
-  /// Waits until every line taken so far is written, at most `kPatience`: whoever reads standard
-  /// error may have stopped. Returns whether they are.
+  /// Waits until every line taken so far is written, for 2 s at most: the reader of standard error
+  /// may have stopped. Returns whether they are.
   bool flush() QUARVEL_EXCLUDES(mutex_);
 
  private:
   static constexpr std::size_t kQueuedBytes = std::size_t{1024} * 1024;
   static constexpr std::chrono::seconds kPatience{2};
 
-  /// Lines with their texts, one after the other.
+  /// Lines and their texts, one after the other.
   struct Lines {
     struct Entry {
       LogLine line;  // without its text
@@ -40,15 +50,7 @@ class LogWriter {
     void clear();
   };
 
-  enum class Way {
-    queued,
-    direct,  // callers write themselves: the process is ending, or had no thread to give
-    none,    // the process is ending and nobody takes what is written
-  };
-
-  LogWriter();
-  void run();
-  void end() QUARVEL_EXCLUDES(mutex_);
+  void run() QUARVEL_EXCLUDES(mutex_, output_);
   void put(const Lines& lines) QUARVEL_EXCLUDES(mutex_, output_);
   void put(const Lines& lines, std::size_t first, std::size_t last) const QUARVEL_REQUIRES(output_);
 
@@ -58,12 +60,15 @@ class LogWriter {
   Mutex mutex_;
   ConditionVariable arrived_;
   ConditionVariable written_;
-  Way way_ QUARVEL_GUARDED_BY(mutex_) = Way::queued;
   Lines queue_ QUARVEL_GUARDED_BY(mutex_);
-  // What is queued or being written.
+  bool ending_ QUARVEL_GUARDED_BY(mutex_) = false;
+  // Lines that are queued or being written.
   std::size_t bytes_ QUARVEL_GUARDED_BY(mutex_) = 0;
   std::uint64_t linesTaken_ QUARVEL_GUARDED_BY(mutex_) = 0;
   std::uint64_t linesWritten_ QUARVEL_GUARDED_BY(mutex_) = 0;
+
+  JoinedThread thread_;  // uses all of the above
+  const bool isThreaded_;
 };
 
 }  // namespace quarvel

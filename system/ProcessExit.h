@@ -1,12 +1,43 @@
 #pragma once
 
+#include <sys/types.h>
+
+#include <atomic>
+#include <vector>
+
 #include "base/Block.h"
+#include "base/Mutex.h"
 
 namespace quarvel {
 
-/// Has `work` run when the process ends through `ExitProcess`: once, on the thread that ends it,
-/// the last registered first, and before the log is flushed. It must come to an end by itself,
-/// soon, and may still log. What ends in order (`exit`) does not come this way.
-void AtProcessExit(Block work);
+class Log;
+
+/// Ends the process of a service, its owner, without running destructors: other threads still use
+/// the service. Any thread.
+class ProcessExit {
+ public:
+  /// `log` is flushed last.
+  explicit ProcessExit(Log& log) : log_(log) {}
+  ProcessExit(const ProcessExit&) = delete;
+  ProcessExit& operator=(const ProcessExit&) = delete;
+
+  /// Adds work for the end of the service: run once, the last added first, on the thread that ends
+  /// the process or destroys the service. It must soon come to an end by itself, and may log.
+  void add(Block work) QUARVEL_EXCLUDES(mutex_);
+  /// Runs the work that has not run yet.
+  void runWork() QUARVEL_EXCLUDES(mutex_);
+
+  /// Runs the work, flushes the log and ends the process. A second thread that calls this never
+  /// returns; the work itself may call it, for another status.
+  [[noreturn]] void exit(int status) QUARVEL_EXCLUDES(mutex_);
+
+ private:
+  [[nodiscard]] Block takeLast() QUARVEL_EXCLUDES(mutex_);
+
+  Log& log_;
+  std::atomic<pid_t> ending_{0};  // the thread that ends the process; 0: none
+  Mutex mutex_;
+  std::vector<Block> work_ QUARVEL_GUARDED_BY(mutex_);
+};
 
 }  // namespace quarvel

@@ -2,46 +2,43 @@
 
 #include <systemd/sd-daemon.h>
 
-#include <atomic>
 #include <cstdint>
-
-#include "platform/WorkQueue.h"
 
 namespace quarvel {
 
 namespace {
 
-// Nothing can be done for a manager that does not listen.
-void Tell(const char* state) {
+// A manager that does not listen cannot be helped.
+void Notify(const char* state) {
   static_cast<void>(::sd_notify(/*unset_environment=*/0, state));
 }
 
 }  // namespace
 
-void TellManagerReady() {
-  Tell("READY=1");
+ServiceManager::ServiceManager()
+    : queue_(CreateSerialQueue("tarnwick.quarvel.watchdog", QualityOfService::userInteractive)) {}
+
+void ServiceManager::reportReady() {
+  Notify("READY=1");
 }
 
-void TellManagerStopping() {
-  Tell("STOPPING=1");
+void ServiceManager::reportStopping() {
+  Notify("STOPPING=1");
 }
 
-std::chrono::microseconds ManagerPingInterval() {
-  std::uint64_t patience = 0;
-  if (::sd_watchdog_enabled(/*unset_environment=*/0, &patience) <= 0) {
+std::chrono::microseconds ServiceManager::pingInterval() {
+  std::uint64_t timeOut = 0;
+  if (::sd_watchdog_enabled(/*unset_environment=*/0, &timeOut) <= 0) {
     return std::chrono::microseconds::zero();
   }
-  return std::chrono::microseconds(patience / 2);
+  return std::chrono::microseconds(timeOut / 2);
 }
 
-void PingManager() {
-  static WorkQueue& queue =
-      *CreateSerialQueue("tarnwick.quarvel.watchdog", QualityOfService::userInteractive).release();
-  static std::atomic<bool> waiting{false};
-  if (waiting.exchange(true)) return;
-  queue.async([] {
-    waiting = false;
-    Tell("WATCHDOG=1");
+void ServiceManager::ping() {
+  if (pinging_.exchange(true)) return;
+  queue_->async([this] {
+    pinging_ = false;
+    Notify("WATCHDOG=1");
   });
 }
 

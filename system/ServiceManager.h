@@ -1,23 +1,38 @@
 #pragma once
 
+#include <atomic>
 #include <chrono>
+#include <memory>
+
+#include "platform/WorkQueue.h"
 
 namespace quarvel {
 
-// What the service manager that started the process (systemd) is told, over the socket that it
-// named in `$NOTIFY_SOCKET`. Without one each of these does nothing. Any thread.
+/// The service manager that started the process (systemd), on the socket that it named in
+/// `$NOTIFY_SOCKET`. Without such a socket each operation does nothing. Owned by the service, and
+/// outlives the blocks of its queue. Any thread.
+class ServiceManager {
+ public:
+  ServiceManager();
+  ServiceManager(const ServiceManager&) = delete;
+  ServiceManager& operator=(const ServiceManager&) = delete;
 
-/// Clients are served.
-void TellManagerReady();
-/// The service ends, in order.
-void TellManagerStopping();
+  /// Reports that clients are served.
+  void reportReady();
+  /// Reports that the service is ending in order.
+  void reportStopping();
 
-/// How often the manager wants to hear that the process is alive: half of what it would wait
-/// (`$WATCHDOG_USEC`), so that one ping may be late. Zero: never.
-[[nodiscard]] std::chrono::microseconds ManagerPingInterval();
-/// Tells the manager so as soon as the work of clients moves: a block of their urgency has to get
-/// its turn. Work that waits for room in the store lends its place and does not hold the ping up;
-/// work that hangs does.
-void PingManager();
+  /// How often the manager is to hear that the process is alive: half of its time-out
+  /// (`$WATCHDOG_USEC`), so that one ping may be late. Zero: never.
+  [[nodiscard]] static std::chrono::microseconds pingInterval();
+  /// Pings the manager once the work of clients moves: a block of their class has to get its turn.
+  /// Work that waits for room in the store lends its place and does not delay the ping; work that
+  /// hangs does.
+  void ping();
+
+ private:
+  const std::unique_ptr<WorkQueue> queue_;
+  std::atomic<bool> pinging_{false};  // a ping is queued
+};
 
 }  // namespace quarvel

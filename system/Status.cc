@@ -6,7 +6,7 @@ namespace quarvel {
 
 namespace {
 
-/// What is wrong in a part of the status, with the part's name in front.
+/// Adds a part's error, with the part's name in front.
 void collectProblem(List& problems, const std::string& name, const Dictionary& part) {
   const Value* error = part.find("error");
   if (error == nullptr || error->string() == nullptr) return;
@@ -19,11 +19,6 @@ std::string nameOf(const Dictionary& backend) {
 }
 
 }  // namespace
-
-Status& Status::process() {
-  static Status& status = *new Status;
-  return status;
-}
 
 void Status::add(Describe describe) {
   const MutexLock lock(mutex_);
@@ -41,7 +36,7 @@ void Status::addBackend(Describe describe) {
 }
 
 Dictionary Status::describe() const {
-  // Described without the lock: a description may take its time, or be one of something new.
+  // Described without the lock: a description may take long, or add another.
   std::vector<Describe> top;
   Sections sections;
   std::vector<Describe> backends;

@@ -10,27 +10,29 @@
 
 namespace quarvel {
 
-/// What the service tells of itself when it is asked: each part is described by whoever knows it.
-/// All operations from any thread.
+/// The status of the service, its owner: the facts that `quarvelctl status` shows. Each part of the
+/// service adds a description of itself. Any thread.
 class Status {
  public:
-  /// Called whenever the status is asked for, until the process ends, on the thread that asks. It
-  /// must not wait for what the store, a client or a network may hold up: the status is asked for
-  /// when these fail. A key "error" says what is wrong now, in a sentence, or holds nil; the
-  /// service is healthy when nothing is wrong anywhere.
+  /// Called whenever the status is asked for, until the service ends, on the thread that asks. It
+  /// must not wait for the store, a client or a network: the status is asked for when these fail. A
+  /// key "error" holds a sentence about a present fault, or nil; the service is healthy while no
+  /// part has an error.
   using Describe = std::function<Dictionary()>;
 
-  [[nodiscard]] static Status& process();
+  Status() = default;
+  Status(const Status&) = delete;
+  Status& operator=(const Status&) = delete;
 
-  /// Tells something under keys of its own, at the top of the status.
+  /// Adds keys at the top of the status.
   void add(Describe describe) QUARVEL_EXCLUDES(mutex_);
-  /// Tells something in a section of its own.
+  /// Adds a section.
   void addSection(std::string name, Describe describe) QUARVEL_EXCLUDES(mutex_);
-  /// Tells of one backend, an entry of the list "backends": "name", "backlog" (rows),
-  /// "last_acknowledgement" (a date or nil), "error", and what else there is.
+  /// Adds one backend, an entry of the list "backends": "name", "backlog" (rows),
+  /// "last_acknowledgement" (a date or nil), "error", and further keys.
   void addBackend(Describe describe) QUARVEL_EXCLUDES(mutex_);
 
-  /// The whole status. `docs/status.md` says what is in it.
+  /// The whole status. `docs/status.md` describes its keys.
   [[nodiscard]] Dictionary describe() const QUARVEL_EXCLUDES(mutex_);
 
  private:

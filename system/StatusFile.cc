@@ -1,12 +1,11 @@
 #include "system/StatusFile.h"
 
 #include <chrono>
-#include <memory>
 #include <system_error>
+#include <utility>
 
 #include "base/Files.h"
 #include "base/Json.h"
-#include "base/StandardPaths.h"
 #include "platform/Clock.h"
 #include "platform/Log.h"
 #include "platform/Notifications.h"
@@ -31,28 +30,27 @@ Status::Describe DescribeProcess() {
 
 }  // namespace
 
-void WriteStatusFile(const Status& status, const std::filesystem::path& path) {
-  ZQ_FUNCTION("WriteStatusFile");
-  const Outcome written =
-      ReplaceFile(path.native(), JsonText(status.describe()) + "\n", kPrivateFile);
-  if (!written) {
-    ZQ_LOG(nullptr, error, "the status cannot be written: {}", written.error().description());
+StatusFile::StatusFile(Status& status, std::filesystem::path path)
+    : status_(status),
+      path_(std::move(path)),
+      queue_(CreateSerialQueue("tarnwick.quarvel.status", QualityOfService::utility)) {
+  ZQ_FUNCTION("AnswerStatusRequests");
+  status.add(DescribeProcess());
+  NotificationToken token = 0;
+  const std::int32_t failure = RegisterForNotification(kStatusNotification, token, *queue_,
+                                                       [this](NotificationToken) { write(); });
+  if (failure != 0) {
+    ZQ_LOG(nullptr, error, "nobody can ask for the status: {}",
+           std::generic_category().message(failure));
   }
 }
 
-void AnswerStatusRequests() {
-  ZQ_FUNCTION("AnswerStatusRequests");
-  static WorkQueue& queue =
-      *CreateSerialQueue("tarnwick.quarvel.status", QualityOfService::utility).release();
-  Status::process().add(DescribeProcess());
-  NotificationToken token = 0;
-  const std::int32_t status =
-      RegisterForNotification(kStatusNotification, token, queue, [](NotificationToken) {
-        WriteStatusFile(Status::process(), StandardPaths::process().runtime / "status.json");
-      });
-  if (status != 0) {
-    ZQ_LOG(nullptr, error, "nobody can ask for the status: {}",
-           std::generic_category().message(status));
+void StatusFile::write() const {
+  ZQ_FUNCTION("WriteStatusFile");
+  const Outcome written =
+      ReplaceFile(path_.native(), JsonText(status_.describe()) + "\n", kPrivateFile);
+  if (!written) {
+    ZQ_LOG(nullptr, error, "the status cannot be written: {}", written.error().description());
   }
 }
 

@@ -9,7 +9,7 @@
 
 #include "base/Format.h"
 #include "platform/Log.h"
-#include "queues/InlineRunner.h"
+#include "queues/BlockingScope.h"
 #include "transport/Request.h"
 
 namespace quarvel {

@@ -1,5 +1,5 @@
-// What stands in for the outer ends of the platform under fuzzing: an agent and sinks that take
-// everything and look at it, a process that does not end.
+// The outer ends of the platform under fuzzing: an agent and sinks that take everything and check
+// it, a device without properties, preferences or drivers, and a process that does not end.
 
 #include <rapidjson/reader.h>
 #include <unistd.h>
@@ -10,9 +10,15 @@
 
 #include "base/Json.h"
 #include "platform/Counters.h"
+#include "platform/DeviceProperties.h"
+#include "platform/FileSystem.h"
+#include "platform/Notifications.h"
 #include "platform/Ohmrik.h"
+#include "platform/Orientation.h"
+#include "platform/Preferences.h"
 #include "platform/Process.h"
 #include "platform/RelmReporting.h"
+#include "platform/Tallix.h"
 #include "platform/Vistrel.h"
 #include "platform/WorkQueue.h"
 #include "tests/fuzz/Require.h"
@@ -86,6 +92,38 @@ void VistrelSendEventLazy(std::string_view, const std::function<Payload()>& payl
 void OhmrikLogRegisteredEvent(std::int32_t, std::string_view, const Payload& record,
                               std::nullptr_t) {
   Look(record);
+}
+
+std::optional<bool> DevicePropertyBoolean(std::string_view) {
+  return std::nullopt;
+}
+std::optional<std::int64_t> DevicePropertyInteger(std::string_view) {
+  return std::nullopt;
+}
+PreferencesDomain OpenPreferencesDomain(std::string_view) {
+  return {};
+}
+std::int32_t RegisterForNotification(std::string_view, NotificationToken& token, WorkQueue&,
+                                     NotificationHandler) {
+  token = 1;
+  return 0;
+}
+void RegisterDeviceOrientationHandler(std::string_view, OrientationHandler) {}
+void UnregisterDeviceOrientationHandler(std::string_view) {}
+void RegisterUIOrientationHandler(std::string_view, OrientationHandler) {}
+void UnregisterUIOrientationHandler(std::string_view) {}
+TallixChannels TallixCopyChannelsInGroup(std::optional<std::string_view>,
+                                         std::optional<std::string_view>, std::optional<Error>&) {
+  return nullptr;
+}
+std::string DiagnosticsPath(std::string_view path) {
+  return std::string(path);
+}
+Outcome CreateDirectory(std::string_view, std::uint32_t) {
+  return Success();
+}
+Outcome WriteFileAtomically(std::string_view, std::string_view) {
+  return Success();
 }
 
 std::int32_t OwnProcessIdentifier() {

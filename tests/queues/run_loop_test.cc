@@ -5,46 +5,42 @@
 #include <sys/resource.h>
 
 #include <atomic>
-#include <future>
 #include <string>
 #include <thread>
 #include <vector>
 
-#include "platform/WorkQueue.h"
+#include "queues/WorkQueues.h"
+#include "tests/Gate.h"
 
 namespace quarvel {
 namespace {
 
 using namespace std::chrono_literals;  // NOLINT(google-build-using-namespace): durations in tests
-using testing::ElementsAre;
+using ::testing::ElementsAre;
+using testing::Gate;
 using Clock = std::chrono::steady_clock;
 
 /// Longer than any of these tests takes on the slowest machine.
 constexpr auto kNever = 1h;
 
-/// A worker thread and when its body has ended.
+/// A worker thread, until its body has ended.
 class Worker {
  public:
   explicit Worker(Block body) {
-    auto thread = CreateWorkerThread("tarnwick.test.worker",
-                                     [body = std::move(body), ended = std::move(ended_)]() mutable {
-                                       body();
-                                       ended.set_value();
-                                     });
+    auto thread =
+        CreateWorkerThread("tarnwick.test.worker", [this, body = std::move(body)]() mutable {
+          body();
+          ended_.arrive();
+        });
     thread->start();
     // The handle goes; the thread runs on.
   }
-  ~Worker() { await(); }
+  ~Worker() { ended_.wait(); }
   Worker(const Worker&) = delete;
   Worker& operator=(const Worker&) = delete;
 
-  void await() {
-    if (done_.valid()) done_.get();
-  }
-
  private:
-  std::promise<void> ended_;
-  std::future<void> done_ = ended_.get_future();
+  Gate ended_;
 };
 
 std::shared_ptr<RunLoopTimer> AddTimer(std::chrono::microseconds interval, Block block) {
@@ -56,118 +52,155 @@ std::shared_ptr<RunLoopTimer> AddTimer(std::chrono::microseconds interval, Block
 TEST(RunLoop, FiresTimersInTheOrderOfTheirDatesAndReturnsWhenNoneIsLeft) {
   std::vector<std::string> fired;
   const auto early = CreateRunLoopTimer(-1s, [&] { fired.push_back("overdue"); });
-  Worker([&] {
-    const auto begun = Clock::now();
-    const auto note = [&fired, begun](const char* name, std::chrono::milliseconds date) {
-      return [&fired, begun, name, date] {
-        fired.push_back(name);
-        EXPECT_GE(Clock::now() - begun, date);
+  {
+    const Worker worker([&] {
+      const auto begun = Clock::now();
+      const auto note = [&fired, begun](const char* name, std::chrono::milliseconds date) {
+        return [&fired, begun, name, date] {
+          fired.push_back(name);
+          EXPECT_GE(Clock::now() - begun, date);
+        };
       };
-    };
-    AddTimer(600ms, note("600", 600ms));
-    const auto moved = AddTimer(100ms, note("100, moved to 800", 800ms));
-    AddTimer(200ms, note("200", 200ms));
-    moved->fireAfter(800ms);
-    AddTimer(400ms, [&] {
-      fired.push_back("400");
-      AddTimer(0ms, note("added by 400", 400ms));
+      AddTimer(150ms, note("150", 150ms));
+      const auto moved = AddTimer(25ms, note("25, moved to 200", 200ms));
+      AddTimer(50ms, note("50", 50ms));
+      moved->fireAfter(200ms);
+      AddTimer(100ms, [&] {
+        fired.push_back("100");
+        AddTimer(0ms, note("added by 100", 100ms));
+      });
+      RunLoop::current().addTimer(early);
+      RunLoop::current().addTimer(early);
+      RunLoop::current().run();
+      EXPECT_THAT(fired,
+                  ElementsAre("overdue", "50", "100", "added by 100", "150", "25, moved to 200"));
+      RunLoop::current().addTimer(early);  // no longer valid
+      early->fireAfter(0s);
+      RunLoop::current().run();
     });
-    RunLoop::current().addTimer(early);
-    RunLoop::current().addTimer(early);
-    RunLoop::current().run();
-    EXPECT_THAT(fired,
-                ElementsAre("overdue", "200", "400", "added by 400", "600", "100, moved to 800"));
-    RunLoop::current().addTimer(early);  // no longer valid
-    early->fireAfter(0s);
-    RunLoop::current().run();
-  }).await();
+  }
   EXPECT_EQ(fired.size(), 6U);
 }
 
 // Each of these would take an hour if the waiting run loop did not notice.
-TEST(RunLoop, NoticesWhatAnotherThreadDoesToItsTimers) {
-  std::promise<std::shared_ptr<RunLoopTimer>> first;
-  std::promise<std::shared_ptr<RunLoopTimer>> second;
+TEST(RunLoop, NoticesAnotherThreadsChangesToItsTimers) {
   std::vector<std::string> fired;
+  std::shared_ptr<RunLoopTimer> moved;
+  std::shared_ptr<RunLoopTimer> invalidated;
+  Gate first;
+  Gate second;
   const auto token = std::make_shared<int>();
-  Worker worker([&] {
-    first.set_value(AddTimer(kNever, [&] { fired.push_back("moved ahead"); }));
-    RunLoop::current().run();
-    fired.push_back("first run over");
-    second.set_value(AddTimer(kNever, [&, token] { fired.push_back("invalidated"); }));
-    RunLoop::current().run();
-    fired.push_back("second run over");
-  });
-  const auto moved = first.get_future().get();
-  std::this_thread::sleep_for(20ms);
-  moved->fireAfter(0s);
-  const auto invalidated = second.get_future().get();
-  std::this_thread::sleep_for(20ms);
-  invalidated->invalidate();
-  EXPECT_EQ(token.use_count(), 1) << "the block is destroyed by then";
-  worker.await();
+  {
+    const Worker worker([&] {
+      moved = AddTimer(kNever, [&] { fired.push_back("moved ahead"); });
+      first.arrive();
+      RunLoop::current().run();
+      fired.push_back("first run over");
+      invalidated = AddTimer(kNever, [&, token] { fired.push_back("invalidated"); });
+      second.arrive();
+      RunLoop::current().run();
+      fired.push_back("second run over");
+    });
+    first.wait();
+    moved->fireAfter(0s);
+    second.wait();
+    invalidated->invalidate();
+    EXPECT_EQ(token.use_count(), 1) << "the block is destroyed by then";
+  }
   EXPECT_THAT(fired, ElementsAre("moved ahead", "first run over", "second run over"));
 }
 
+// Timers of one loop that other threads move and invalidate while they fire.
+TEST(RunLoop, FiresATimerOnceHoweverItIsMovedMeanwhile) {
+  constexpr int kTimers = 2000;
+  std::vector<std::atomic<int>> fired(kTimers);
+  std::vector<std::shared_ptr<RunLoopTimer>> timers;
+  for (auto& count : fired) timers.push_back(CreateRunLoopTimer(1h, [&count] { ++count; }));
+  Gate added;
+  {
+    const Worker worker([&] {
+      for (const auto& timer : timers) RunLoop::current().addTimer(timer);
+      added.arrive();
+      RunLoop::current().run();
+    });
+    added.wait();
+    const auto each = [&](auto change) {
+      return std::thread([&timers, change] {
+        for (const auto& timer : timers) change(*timer);
+      });
+    };
+    std::thread ahead = each([](RunLoopTimer& timer) { timer.fireAfter(0s); });
+    std::thread off = each([](RunLoopTimer& timer) { timer.invalidate(); });
+    ahead.join();
+    off.join();
+  }
+  for (const auto& count : fired) ASSERT_LE(count, 1);
+}
+
 TEST(RunLoop, WaitsWithoutWakingUp) {
-  Worker([] {
+  const Worker worker([] {
     const auto switches = [] {
       rusage usage{};
       getrusage(RUSAGE_THREAD, &usage);
       return usage.ru_nvcsw;
     };
-    AddTimer(300ms, [] {});
+    AddTimer(100ms, [] {});
     const long before = switches();
     RunLoop::current().run();
     EXPECT_LE(switches() - before, 3);
   });
 }
 
-TEST(RunLoop, WhatIsStillOnItWhenItsThreadEndsNeverFires) {
+TEST(RunLoop, TimersThatOutliveItsThreadNeverFire) {
   std::shared_ptr<RunLoopTimer> kept;
-  auto token = std::make_shared<int>();
-  const std::weak_ptr<int> dropped = token;
-  Worker([&] {
-    kept = AddTimer(0s, [] { ADD_FAILURE(); });
-    AddTimer(0s, [token = std::move(token)] { ADD_FAILURE() << *token; });
-  }).await();
-  while (!dropped.expired()) std::this_thread::sleep_for(1ms);
+  Gate dropped;
+  const auto atEnd = [](Gate& gate) {
+    return std::shared_ptr<void>(nullptr, [&gate](void*) { gate.arrive(); });
+  };
+  {
+    const Worker worker([&] {
+      kept = AddTimer(0s, [] { ADD_FAILURE(); });
+      AddTimer(0s, [token = atEnd(dropped)] { ADD_FAILURE(); });
+    });
+  }
+  dropped.wait();
   kept->fireAfter(0s);
   kept->invalidate();
 }
 
 TEST(WorkerThread, ShowsItsNameAndDestroysItsBody) {
-  std::promise<std::string> shown;
-  auto token = std::make_shared<int>();
-  const std::weak_ptr<int> bodies = token;
-  static_cast<void>(CreateWorkerThread("unstarted", [token] { ADD_FAILURE() << *token; }));
-  CreateWorkerThread("tarnwick.test.worker", [&shown, token = std::move(token)] {
+  std::string shown;
+  Gate destroyed;
+  static_cast<void>(CreateWorkerThread("unstarted", [] { ADD_FAILURE(); }));
+  CreateWorkerThread("tarnwick.test.worker", [&shown, token = std::shared_ptr<void>(
+                                                          nullptr, [&destroyed](void*) {
+                                                            destroyed.arrive();
+                                                          })] {
     char name[16] = "";
     pthread_getname_np(pthread_self(), name, sizeof(name));
-    shown.set_value(name);
+    shown = name;
   })->start();
-  EXPECT_EQ(shown.get_future().get(), "test.worker");
-  while (!bodies.expired()) std::this_thread::sleep_for(1ms);
+  destroyed.wait();
+  EXPECT_EQ(shown, "test.worker");
 }
 
-// The class of the server queue runs one block at a time, yet a sleeper lends its place.
-TEST(SleepThread, OfAQueuesBlockHoldsUpNoOtherQueue) {
-  const auto sleepers = CreateSerialQueue("sleepers", QualityOfService::userInteractive);
-  const auto others = CreateSerialQueue("others", QualityOfService::userInteractive);
-  std::atomic<bool> awake = false;
-  std::promise<void> asleep;
-  std::promise<bool> otherRan;
-  std::promise<void> over;
+// The class of the server queue runs one block at a time.
+TEST(SleepThread, DelaysItsOwnQueueAlone) {
+  WorkQueues queues;
+  const auto sleepers = queues.createSerialQueue("sleepers", QualityOfService::userInteractive);
+  const auto others = queues.createSerialQueue("others", QualityOfService::userInteractive);
+  std::atomic<bool> isAwake = false;
+  Gate asleep;
+  bool ranMeanwhile = false;
   sleepers->async([&] {
-    asleep.set_value();
-    SleepThread(2s);
-    awake = true;
-    over.set_value();
+    asleep.arrive();
+    SleepThread(1s);
+    isAwake = true;
   });
-  asleep.get_future().get();
-  others->async([&] { otherRan.set_value(!awake); });
-  EXPECT_TRUE(otherRan.get_future().get());
-  over.get_future().get();
+  asleep.wait();
+  others->async([&] { ranMeanwhile = !isAwake; });
+  EXPECT_TRUE(queues.drain(Clock::now() + 30s));
+  EXPECT_TRUE(ranMeanwhile);
 }
 
 }  // namespace

@@ -5,23 +5,19 @@
 
 #include <atomic>
 #include <chrono>
-#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
-#include <latch>
 #include <memory>
 #include <string>
 #include <thread>
 #include <vector>
 
-#include "platform/Condition.h"
-#include "platform/WorkQueue.h"
 #include "queues/BlockingScope.h"
 #include "queues/CallTracker.h"
 #include "queues/Thread.h"
-#include "queues/TimerThread.h"
-#include "queues/Work.h"
+#include "queues/WorkQueues.h"
+#include "tests/Gate.h"
 
 namespace quarvel {
 namespace {
@@ -29,31 +25,51 @@ namespace {
 using namespace std::chrono_literals;
 using std::chrono::steady_clock;
 using std::chrono::system_clock;
-
-std::unique_ptr<WorkQueue> utilityQueue() {
-  return CreateSerialQueue("tarnwick.quarvel.session.relmreporting", QualityOfService::utility);
-}
-
-std::unique_ptr<WorkQueue> serverQueue() {
-  return CreateSerialQueue("tarnwick.quarvel.reporting.server", QualityOfService::userInteractive);
-}
-
-// Waits for everything queued so far.
-void finish(WorkQueue& queue) {
-  std::latch done(1);
-  queue.async([&done] { done.count_down(); });
-  done.wait();
-}
+using ::testing::ElementsAre;
+using testing::Gate;
 
 std::ptrdiff_t threadCount() {
   return std::distance(std::filesystem::directory_iterator("/proc/self/task"), {});
+}
+
+/// Before the first test: a sanitizer may have a thread of its own.
+const std::ptrdiff_t kFirstThreads = threadCount();
+
+/// Waits until at most `most` threads are left; returns how many are.
+std::ptrdiff_t threadsLeft(std::ptrdiff_t most) {
+  const auto patience = steady_clock::now() + 30s;
+  while (threadCount() > most && steady_clock::now() < patience) std::this_thread::yield();
+  return threadCount();
 }
 
 Date wallClock(std::chrono::microseconds fromNow) {
   return std::chrono::time_point_cast<std::chrono::microseconds>(system_clock::now()) + fromNow;
 }
 
-TEST(SerialQueueTest, RunsOneBlockAtATimeInEachProducersOrder) {
+class WorkTest : public ::testing::Test {
+ protected:
+  std::unique_ptr<WorkQueue> sessionQueue() {
+    return queues.createSerialQueue("tarnwick.quarvel.session.relmreporting",
+                                    QualityOfService::utility);
+  }
+  /// All queues of this class share one thread.
+  std::unique_ptr<WorkQueue> serverQueue() {
+    return queues.createSerialQueue("tarnwick.quarvel.reporting.server",
+                                    QualityOfService::userInteractive);
+  }
+  /// Waits for all blocks queued so far.
+  static void finish(WorkQueue& queue) {
+    Gate done;
+    queue.async([&done] { done.arrive(); });
+    done.wait();
+  }
+
+  WorkQueues queues;
+};
+
+using SerialQueueTest = WorkTest;
+
+TEST_F(SerialQueueTest, RunsOneBlockAtATimeInEachProducersOrder) {
   constexpr int kProducers = 8;
   constexpr int kBlocks = 20'000;
   const auto queue = serverQueue();
@@ -79,45 +95,44 @@ TEST(SerialQueueTest, RunsOneBlockAtATimeInEachProducersOrder) {
   EXPECT_EQ(outOfOrder, 0);
 }
 
-TEST(SerialQueueTest, BlockIsGoneBeforeTheNextBegins) {
+TEST_F(SerialQueueTest, BlockIsGoneBeforeTheNextBegins) {
   const auto queue = serverQueue();
   const auto owned = std::make_shared<int>(0);
-  std::latch queued(1);
+  Gate queued;
   queue->async([&queued] { queued.wait(); });
   queue->async([copy = owned] {});
   long holders = 0;
   queue->async([&] { holders = owned.use_count(); });
-  queued.count_down();
+  queued.arrive();
   finish(*queue);
   EXPECT_EQ(holders, 1);
 }
 
-TEST(SerialQueueTest, MayBeDestroyedFromItsOwnBlockWithBlocksWaiting) {
-  auto queue = utilityQueue();
-  std::latch queued(1);
-  std::latch rest(101);
+TEST_F(SerialQueueTest, MayBeDestroyedFromItsOwnBlockWithBlocksWaiting) {
+  auto queue = sessionQueue();
+  Gate queued;
+  Gate rest(101);
   queue->async([&] {
     queued.wait();
     queue.reset();
   });
-  for (int i = 0; i < 100; ++i) queue->async([&rest] { rest.count_down(); });
-  queue->after(1ms, [&rest] { rest.count_down(); });
-  queued.count_down();
+  for (int i = 0; i < 100; ++i) queue->async([&rest] { rest.arrive(); });
+  queue->after(1ms, [&rest] { rest.arrive(); });
+  queued.arrive();
   rest.wait();
 }
 
-// Both share the one thread of their class.
-TEST(SerialQueueTest, BusyQueueLeavesOthersTheirTurn) {
+TEST_F(SerialQueueTest, BusyQueueLeavesOthersTheirTurn) {
   const auto busy = serverQueue();
   const auto other = serverQueue();
   std::atomic<bool> otherRan{false};
-  std::latch stopped(1);
+  Gate stopped;
   struct Again {
     WorkQueue& queue;
     std::atomic<bool>& stop;
-    std::latch& stopped;
+    Gate& stopped;
     void operator()() {
-      if (stop) return stopped.count_down();
+      if (stop) return stopped.arrive();
       queue.async(Again{queue, stop, stopped});
     }
   };
@@ -126,57 +141,110 @@ TEST(SerialQueueTest, BusyQueueLeavesOthersTheirTurn) {
   stopped.wait();
 }
 
-TEST(BackgroundQueueTest, RunsBlocksSideBySide) {
-  std::latch both(2);
-  std::latch done(2);
-  for (int i = 0; i < 2; ++i) {
-    BackgroundQueue().async([&] {
-      both.arrive_and_wait();
-      done.count_down();
-    });
-  }
-  done.wait();
-}
+using BlockingTest = WorkTest;
 
-TEST(LendingTest, ThousandWaitingBlocksHoldUpNobody) {
-  constexpr int kWaiting = 1000;
-  std::vector<std::unique_ptr<WorkQueue>> queues;
-  std::latch together(kWaiting + 1);
-  for (int i = 0; i < kWaiting; ++i) {
-    queues.push_back(utilityQueue());
-    queues.back()->async([&] {
+TEST_F(BlockingTest, ThousandBlockedQueuesDelayNoOther) {
+  constexpr int kBlocked = 1000;
+  std::vector<std::unique_ptr<WorkQueue>> blocked;
+  Gate together(kBlocked + 1);
+  for (int i = 0; i < kBlocked; ++i) {
+    blocked.push_back(sessionQueue());
+    blocked.back()->async([&] {
       const BlockingScope blocking;
       const BlockingScope nested;
-      together.arrive_and_wait();
+      together.arriveAndWait();
     });
   }
-  finish(*utilityQueue());
-  together.arrive_and_wait();
-  for (const auto& queue : queues) finish(*queue);
-  const auto patience = steady_clock::now() + 60s;
-  while (threadCount() > 50 && steady_clock::now() < patience) std::this_thread::yield();
-  EXPECT_LE(threadCount(), 50) << "lent threads stay";
+  finish(*sessionQueue());
+  together.arriveAndWait();
+  for (const auto& queue : blocked) finish(*queue);
+  EXPECT_LE(threadsLeft(50), 50) << "lent threads stay";
 }
 
-TEST(LendingTest, WhatABlockHasBroughtRunsWhileItIsHeldBack) {
+TEST_F(BlockingTest, PoolReplacesNoMoreBlockedThreadsThanItsBound) {
+  constexpr int kBound = 8;  // of the background class, which is two threads wide
+  const auto before = threadsLeft(kFirstThreads + 1);  // with the timer thread
+  std::atomic<int> entered{0};
+  Gate full(kBound + 2);
+  Gate release;
+  for (int i = 0; i < 3 * kBound; ++i) {
+    queues.background().async([&] {
+      const BlockingScope blocking;
+      ++entered;
+      full.arrive();
+      release.wait();
+    });
+  }
+  full.wait();
+  // The timer thread starts threads before it delivers delayed blocks.
+  const auto session = sessionQueue();
+  Gate delivered;
+  session->after(1ms, [&delivered] { delivered.arrive(); });
+  delivered.wait();
+  EXPECT_EQ(entered, kBound + 2);
+  EXPECT_EQ(threadCount() - before, kBound + 2 + 1) << "and the session queue's thread";
+  release.arrive();
+  EXPECT_TRUE(queues.drain(steady_clock::now() + 30s));
+  EXPECT_EQ(entered, 3 * kBound);
+}
+
+TEST_F(BlockingTest, DeferredQueuesRunWhileTheirBlockIsBlocked) {
   const auto server = serverQueue();
   std::vector<std::unique_ptr<WorkQueue>> sessions;
-  for (int i = 0; i < 100; ++i) sessions.push_back(utilityQueue());
-  std::latch all(100);
-  std::latch done(1);
+  for (int i = 0; i < 100; ++i) sessions.push_back(sessionQueue());
+  Gate all(100);
   server->async([&] {
-    for (const auto& session : sessions) session->asyncBrief([&all] { all.count_down(); });
-    {
-      const BlockingScope blocking;
-      all.wait();
-    }
-    done.count_down();
+    for (const auto& session : sessions) session->asyncBrief([&all] { all.arrive(); });
+    const BlockingScope blocking;
+    all.wait();
   });
-  done.wait();
+  finish(*server);
 }
 
-TEST(ConditionTest, WaitSaysWhetherTheDeadlinePassed) {
-  const auto condition = CreateCondition();
+// An inline block that blocked would stop the I/O thread, and with it every other client.
+TEST_F(BlockingTest, InlineRunnerRunsBriefBlocksAloneAndNoneBlocks) {
+  const auto server = serverQueue();
+  const auto session = sessionQueue();
+  std::vector<std::string> inlineBlocks;
+  std::vector<std::string> pooledBlocks;
+  const auto self = std::this_thread::get_id();
+  const auto note = [&](const char* name) {
+    return [&, name] {
+      (std::this_thread::get_id() == self ? inlineBlocks : pooledBlocks).emplace_back(name);
+    };
+  };
+  {
+    InlineRunner runner;
+    server->async(note("not brief"));
+    EXPECT_FALSE(runner.runOne()) << "a block of any length is no work for this thread";
+    finish(*server);
+    server->asyncBrief(note("brief"));
+    server->async(note("behind a brief one"));
+    EXPECT_TRUE(runner.runOne());
+    finish(*server);
+    EXPECT_THAT(inlineBlocks, ElementsAre("brief"));
+    EXPECT_THAT(pooledBlocks, ElementsAre("not brief", "behind a brief one"));
+
+    bool mayBlock = true;
+    server->asyncBrief([&mayBlock] { mayBlock = BlockingScope::isAllowed(); });
+    server->asyncBrief(note("after one that wanted to block"));
+    session->asyncBrief(note("in another queue"));
+    EXPECT_TRUE(runner.runOne());
+    EXPECT_TRUE(runner.runOne());
+    EXPECT_FALSE(mayBlock);
+  }
+  finish(*server);
+  finish(*session);
+  EXPECT_THAT(inlineBlocks, ElementsAre("brief"));
+  EXPECT_EQ(pooledBlocks.size(), 4U);
+  bool mayBlock = false;
+  server->async([&mayBlock] { mayBlock = BlockingScope::isAllowed(); });
+  finish(*server);
+  EXPECT_TRUE(mayBlock) << "on a pool's thread";
+}
+
+TEST_F(WorkTest, ConditionWaitSaysWhetherTheDeadlinePassed) {
+  const auto condition = queues.createCondition();
   condition->lock();
   EXPECT_FALSE(condition->waitUntil(wallClock(-1us)));
   EXPECT_FALSE(condition->waitUntil(kEarliestDate));
@@ -203,34 +271,34 @@ TEST(ConditionTest, WaitSaysWhetherTheDeadlinePassed) {
   condition->unlock();
 }
 
-TEST(DelayTest, RunsNotBeforeItsTimeAndInDueOrder) {
+TEST_F(WorkTest, DelayedBlocksRunNotBeforeTheirTimeAndInDueOrder) {
   const auto queue = serverQueue();
   const auto start = steady_clock::now();
   std::vector<std::string> order;
   std::vector<std::chrono::milliseconds> early;
-  std::latch done(4);
+  Gate done(4);
   const auto at = [&](std::chrono::milliseconds delay, std::string name) {
     queue->after(delay, [&, delay, name] {
       order.push_back(name);
       if (steady_clock::now() - start < delay) early.push_back(delay);
-      done.count_down();
+      done.arrive();
     });
   };
-  std::latch allQueued(1);
+  Gate allQueued;
   queue->async([&allQueued] { allQueued.wait(); });
-  at(400ms, "last");
-  at(40ms, "first");
-  at(40ms, "second");
+  at(100ms, "last");
+  at(10ms, "first");
+  at(10ms, "second");
   at(-1ms, "at once");
-  allQueued.count_down();
+  allQueued.arrive();
   done.wait();
-  EXPECT_THAT(order, testing::ElementsAre("at once", "first", "second", "last"));
-  EXPECT_THAT(early, testing::IsEmpty());
+  EXPECT_THAT(order, ElementsAre("at once", "first", "second", "last"));
+  EXPECT_THAT(early, ::testing::IsEmpty());
 }
 
-class RecordedVoucher final : public CallTracker {
+class RecordingTracker final : public CallTracker {
  public:
-  RecordedVoucher(std::size_t size, std::atomic<int>& completions)
+  RecordingTracker(std::size_t size, std::atomic<int>& completions)
       : size_(size), completions_(completions) {}
   [[nodiscard]] std::size_t bytes() const override { return size_; }
 
@@ -242,199 +310,153 @@ class RecordedVoucher final : public CallTracker {
   void completed() override {
     EXPECT_EQ(carriedOutTimes, 1);
     ++completions_;
-    completions_.notify_all();
   }
 
   const std::size_t size_;
   std::atomic<int>& completions_;
 };
 
-std::shared_ptr<RecordedVoucher> voucherOf(std::size_t size, std::atomic<int>& completions) {
-  return std::make_shared<RecordedVoucher>(size, completions);
-}
-
-TEST(VoucherTest, CompletesOnceAfterTheLastBlockThatCameOfIt) {
-  std::atomic<int> completions{0};
-  const auto server = serverQueue();
-  const auto session = utilityQueue();
-  std::atomic<int> afterwards{0};
-  std::latch last(1);
-  const auto tracker = voucherOf(1, completions);
-  {
-    const CallRef hold(tracker);
+class CallTrackerTest : public WorkTest {
+ protected:
+  std::shared_ptr<RecordingTracker> trackerOf(std::size_t size) {
+    return std::make_shared<RecordingTracker>(size, completions);
+  }
+  template <class Call>
+  static void callUnder(std::shared_ptr<CallTracker> tracker, Call call) {
+    const CallRef hold(std::move(tracker));
     const CallScope scope(CallScope::Of::call, hold);
+    call();
+  }
+
+  std::atomic<int> completions{0};
+};
+
+TEST_F(CallTrackerTest, CompletesOnceAfterTheLastBlockThatCameOfTheCall) {
+  const auto server = serverQueue();
+  const auto session = sessionQueue();
+  std::atomic<int> afterwards{0};
+  Gate last;
+  const auto tracker = trackerOf(1);
+  callUnder(tracker, [&] {
     server->async([&] {
       for (int i = 0; i < 100; ++i) {
-        session->async([&] { BackgroundQueue().async([&] { afterwards += completions; }); });
+        session->async([&] { queues.background().async([&] { afterwards += completions; }); });
       }
       session->async([&] {
         last.wait();
         afterwards += completions;
       });
     });
-  }
+  });
   finish(*server);
-  EXPECT_EQ(tracker->carriedOutTimes, 1) << "what the call queued itself has run";
-  EXPECT_EQ(completions, 0) << "what came of that has not";
-  last.count_down();
-  completions.wait(0);
-  finish(*session);
-  EXPECT_EQ(completions, 1);
-  EXPECT_EQ(afterwards, 0);
-
-  // What is queued outside the scope belongs to no call.
+  EXPECT_EQ(tracker->carriedOutTimes, 1) << "the call's own blocks have run";
+  EXPECT_EQ(completions, 0) << "the blocks that these queued have not";
+  last.arrive();
+  // A block outside the scope belongs to no call.
   server->async([&] { afterwards += CallRef::current() ? 1 : 0; });
-  finish(*server);
+  EXPECT_TRUE(queues.drain(steady_clock::now() + 30s));
+  EXPECT_EQ(completions, 1);
   EXPECT_EQ(afterwards, 0);
 }
 
-TEST(VoucherTest, DelayedBlockLetsItsCallCompleteAndRunsUnderItAgain) {
-  std::atomic<int> completions{0};
+TEST_F(CallTrackerTest, DelayedBlocksLetTheirCallsCompleteUpToABound) {
   const auto queue = serverQueue();
-  const auto tracker = voucherOf(1000, completions);
-  std::latch ran(1);
-  {
-    const CallRef hold(tracker);
-    const CallScope scope(CallScope::Of::call, hold);
-    queue->after(300ms, [&] {
-      EXPECT_EQ(completions, 1);
-      EXPECT_EQ(CallRef::current().tracker(), tracker);
-      queue->async([&] { ran.count_down(); });
+  const auto tracker = trackerOf(TimerThread::kUnheldBytes);
+  bool ranUnderIt = false;
+  Gate ran;
+  callUnder(tracker, [&] {
+    queue->after(10ms, [&] {
+      ranUnderIt = CallRef::current().tracker() == tracker;
+      queue->async([&ran] { ran.arrive(); });
     });
-  }
+  });
   EXPECT_EQ(completions, 1);
   ran.wait();
-  finish(*queue);
-  EXPECT_EQ(completions, 1);
-}
-
-TEST(VoucherTest, DelayedBlocksBeyondTheBoundHoldTheirCalls) {
-  std::atomic<int> within{0};
-  std::atomic<int> beyond{0};
-  const auto queue = serverQueue();
-  const auto delay = [&](std::chrono::milliseconds time, std::shared_ptr<CallTracker> tracker) {
-    const CallRef hold(std::move(tracker));
-    const CallScope scope(CallScope::Of::call, hold);
-    queue->after(time, [] {});
-  };
-  delay(300ms, voucherOf(TimerThread::kUnheldBytes, within));
-  delay(300ms, voucherOf(1, within));
-  EXPECT_EQ(within, 2);
-  delay(300ms, voucherOf(1, beyond));
-  EXPECT_EQ(beyond, 0);
-  beyond.wait(0);
-  EXPECT_EQ(beyond, 1);
-
-  delay(300ms, voucherOf(1, within));
-  EXPECT_EQ(within, 3) << "the bound stays used up after the blocks have run";
+  EXPECT_TRUE(ranUnderIt);
+  // The bound is free again, and one call may pass it.
+  callUnder(trackerOf(TimerThread::kUnheldBytes), [&] { queue->after(1h, [] {}); });
+  callUnder(trackerOf(1), [&] { queue->after(1h, [] {}); });
+  EXPECT_EQ(completions, 3);
+  callUnder(trackerOf(1), [&] { queue->after(1h, [] {}); });
+  EXPECT_EQ(completions, 3) << "a call beyond the bound is held";
+  EXPECT_TRUE(queues.drain(steady_clock::now() + 30s));
+  EXPECT_EQ(completions, 4);
 }
 
 TEST(ThreadTest, ShowsTheLastComponentsOfALabelThatFit) {
   const std::pair<std::string_view, std::string_view> cases[] = {
       {"tarnwick.quarvel.reporting.server", "server"},
       {"tarnwick.quarvel.session.relmreporting", "relmreporting"},
-      {"a.b.seventeen.letter", "letter"},
       {"a.b.fifteenletter", "b.fifteenletter"},
       {"quarvel.store", "quarvel.store"},
-      {"background", "background"},
       {"one.componentthatislong", "componentthatis"},
       {"", ""},
   };
   for (const auto& [label, name] : cases) EXPECT_EQ(ThreadName(label), name);
 }
 
-// Each of these needs a process of its own: classes start afresh, draining is for good.
-class ProcessWideDeathTest : public testing::Test {
- protected:
-  void SetUp() override { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
-};
-
-void expect(bool held, const char* what) {
-  if (held) return;
-  fputs(what, stderr);
-  std::_Exit(1);
-}
-
-TEST_F(ProcessWideDeathTest, ClassesKeepTheirNiceValuesWhoeverWakesThem) {
+TEST_F(WorkTest, ClassesKeepTheirNiceValuesWhicheverThreadWakesThem) {
   if (getpriority(PRIO_PROCESS, 0) != 0) GTEST_SKIP() << "runs at another nice value";
-  EXPECT_EXIT(
-      {
-        struct Seen {
-          int nice = -1;
-          std::string name;
-        };
-        const auto look = [](Seen& seen) {
-          seen.nice = getpriority(PRIO_PROCESS, static_cast<id_t>(gettid()));
-          std::getline(std::ifstream("/proc/thread-self/comm"), seen.name);
-        };
-        Seen background;
-        Seen utility;
-        Seen interactive;
-        std::latch done(1);
-        const auto session = utilityQueue();
-        const auto server = serverQueue();
-        // From the lowest class up: none may inherit from the one that starts it.
-        BackgroundQueue().async([&] {
-          look(background);
-          session->async([&] {
-            look(utility);
-            server->async([&] {
-              look(interactive);
-              done.count_down();
-            });
-          });
-        });
-        done.wait();
-        expect(background.nice == 10 && background.name == "background", "background");
-        expect(utility.nice == 5 && utility.name == "relmreporting", "utility");
-        expect(interactive.nice == 0 && interactive.name == "server", "user-interactive");
-        std::_Exit(0);
-      },
-      testing::ExitedWithCode(0), "");
+  std::vector<std::string> seen;
+  const auto look = [&seen] {
+    std::string name;
+    std::getline(std::ifstream("/proc/thread-self/comm"), name);
+    const int nice = getpriority(PRIO_PROCESS, static_cast<id_t>(gettid()));
+    seen.push_back(name + " " + std::to_string(nice));
+  };
+  const auto session = sessionQueue();
+  const auto server = serverQueue();
+  // From the lowest class up: none may inherit from the one that starts it.
+  queues.background().async([&] {
+    look();
+    session->async([&] {
+      look();
+      server->async(look);
+    });
+  });
+  EXPECT_TRUE(queues.drain(steady_clock::now() + 30s));
+  EXPECT_THAT(seen, ElementsAre("background 10", "relmreporting 5", "server 0"));
 }
 
-TEST_F(ProcessWideDeathTest, DrainRunsDelayedBlocksInOrderAndEndsWaits) {
-  EXPECT_EXIT(
-      {
-        const auto queue = serverQueue();
-        const auto session = utilityQueue();
-        const auto condition = CreateCondition();
-        std::string order;
-        bool waitEnded = false;
-        std::latch waiting(1);
-        queue->after(2h, [&] { order += 'b'; });
-        queue->after(1h, [&] {
-          order += 'a';
-          queue->after(1h, [&] { order += 'c'; });
-        });
-        session->async([&] {
-          condition->lock();
-          waiting.count_down();
-          waitEnded = !condition->waitUntil(wallClock(1h));
-          waitEnded = waitEnded && !condition->waitUntil(wallClock(1h));
-          condition->unlock();
-        });
-        waiting.wait();
-        expect(DrainWork(steady_clock::now() + 60s), "not drained");
-        expect(order == "abc" || order == "acb", "delayed blocks");
-        expect(waitEnded, "wait went on");
-        std::_Exit(0);
-      },
-      testing::ExitedWithCode(0), "");
+using DrainTest = WorkTest;
+
+TEST_F(DrainTest, RunsDelayedBlocksInOrderEndsWaitsAndJoinsTheThreads) {
+  const auto before = threadsLeft(kFirstThreads + 1);
+  {
+    WorkQueues ending;
+    const auto queue = ending.createSerialQueue("queue", QualityOfService::userInteractive);
+    const auto session = ending.createSerialQueue("session", QualityOfService::utility);
+    const auto condition = ending.createCondition();
+    std::string order;
+    bool waitEnded = false;
+    Gate waiting;
+    queue->after(2h, [&] { order += 'b'; });
+    queue->after(1h, [&] {
+      order += 'a';
+      queue->after(1h, [&] { order += 'c'; });
+    });
+    session->async([&] {
+      condition->lock();
+      waiting.arrive();
+      waitEnded = !condition->waitUntil(wallClock(1h));
+      waitEnded = waitEnded && !condition->waitUntil(wallClock(1h));
+      condition->unlock();
+    });
+    waiting.wait();
+    EXPECT_TRUE(ending.drain(steady_clock::now() + 30s));
+    EXPECT_THAT(order, ::testing::AnyOf("abc", "acb"));
+    EXPECT_TRUE(waitEnded);
+  }
+  EXPECT_EQ(threadsLeft(before), before);
 }
 
-TEST_F(ProcessWideDeathTest, DrainSaysWhenABlockDoesNotEnd) {
-  EXPECT_EXIT(
-      {
-        std::latch release(1);
-        const auto queue = serverQueue();
-        queue->async([&] { release.wait(); });
-        expect(!DrainWork(steady_clock::now() + 20ms), "drained too early");
-        release.count_down();
-        expect(DrainWork(steady_clock::now() + 60s), "not drained");
-        std::_Exit(0);
-      },
-      testing::ExitedWithCode(0), "");
+TEST_F(DrainTest, SaysWhenABlockDoesNotEnd) {
+  Gate release;
+  const auto queue = serverQueue();
+  queue->async([&] { release.wait(); });
+  EXPECT_FALSE(queues.drain(steady_clock::now() + 20ms));
+  release.arrive();
+  EXPECT_TRUE(queues.drain(steady_clock::now() + 30s));
 }
 
 }  // namespace

@@ -118,6 +118,7 @@ class Simulation {
   SimulatedFiles files;
   SimulatedListener listener;
   Scheduler scheduler;
+  std::unique_ptr<WorkQueue> serverQueue;  // behind `ProcessServerQueue`
 
  private:
   const testing::ScopedTrace seedTrace_;

@@ -114,6 +114,10 @@ std::unique_ptr<WorkQueue> CreateSerialQueue(std::string_view label, QualityOfSe
   return std::make_unique<SimulatedWorkQueue>(std::move(queue));
 }
 
+std::unique_ptr<WorkQueue>& ProcessServerQueue() {
+  return Simulation::current().serverQueue;
+}
+
 WorkQueue& BackgroundQueue() {
   static SimulatedWorkQueue queue(std::make_shared<Scheduler::Queue>("background", false));
   return queue;

@@ -6,7 +6,7 @@
 #include <limits>
 #include <thread>
 
-#include "queues/Work.h"
+#include "queues/WorkQueues.h"
 #include "store/EventSinks.h"
 #include "store/database/SecureRandom.h"
 #include "store/database/StoreError.h"
@@ -102,7 +102,7 @@ TEST_F(AgentTest, EventsWaitForRoomInTheirOrderAndTheirSendersDoNot) {
     path.addPowerEvent(28, std::to_string(i), Payload());
   }
   files.release();
-  ASSERT_TRUE(DrainWork(std::chrono::steady_clock::now() + std::chrono::seconds(60)));
+  ASSERT_TRUE(FolderQueues().drain(std::chrono::steady_clock::now() + std::chrono::seconds(60)));
   store_->close();
   EXPECT_EQ(value("SELECT count(*), min(name = id - 1) FROM analytics_event"), "20|1");
   EXPECT_EQ(value("SELECT count(*), min(name = id - 1) FROM power_event"), "20|1");

@@ -17,7 +17,6 @@
 #include "base/StandardPaths.h"
 #include "export/nats/NatsSettings.h"
 #include "export/otlp/OtlpSettings.h"
-#include "platform/DeviceProperties.h"
 #include "tests/TemporaryDirectory.h"
 
 namespace quarvel {
@@ -212,23 +211,6 @@ TEST_F(ConfigurationTest, FileThatCannotBeReadIsAnErrorNotAnAbsentOne) {
   const Result<Configuration> result = Configuration::read(file(), kBackends, warnings_);
   ASSERT_FALSE(result.ok());
   EXPECT_THAT(result.error().description(), HasSubstr("Is a directory"));
-}
-
-using ConfigurationDeathTest = ConfigurationTest;
-
-TEST_F(ConfigurationDeathTest, OfTheProcessHasDevicePropertiesAndWarnsOfUnknownKeys) {
-  GTEST_FLAG_SET(death_test_style, "threadsafe");
-  EXPECT_EXIT(
-      {
-        std::ofstream(file()) << "[device]\nInternalBuild = true\nDeviceClassNumber = 4\n[lgo]\n";
-        setenv("CONFIGURATION_DIRECTORY", directory_.path().c_str(), 1);
-        const bool right = DevicePropertyBoolean("InternalBuild") == true &&
-                           DevicePropertyInteger("DeviceClassNumber") == 4 &&
-                           !DevicePropertyInteger("InternalBuild") &&
-                           !DevicePropertyBoolean("Absent");
-        std::exit(right ? 0 : 1);
-      },
-      testing::ExitedWithCode(0), HasSubstr("quarvel.toml:4: lgo is no key of ours."));
 }
 
 TEST(DirectoriesTest, FirstThatAppliesIsTaken) {

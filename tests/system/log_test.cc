@@ -1,4 +1,4 @@
-#include "platform/Log.h"
+#include "system/Log.h"
 
 #include <fcntl.h>
 #include <gmock/gmock.h>
@@ -13,31 +13,28 @@
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
-#include <latch>
 #include <string>
 #include <thread>
 #include <vector>
 
-#include "platform/Process.h"
-#include "platform/WorkQueue.h"
-#include "system/LogControl.h"
 #include "system/LogLine.h"
-#include "system/LogWriter.h"
 #include "system/ProcessExit.h"
+#include "tests/FolderPlatform.h"
+#include "tests/Gate.h"
 #include "tests/UnixSocket.h"
 
 namespace quarvel {
 namespace {
 
-using namespace std::chrono_literals;
-using testing::HasSubstr;
-using testing::MatchesRegex;
+using testing::Gate;
+using ::testing::HasSubstr;
+using ::testing::MatchesRegex;
 
 constexpr const char* kFunction = "-[Class op:]";
 
 LogHandle registered(const char (&code)[5]) {
-  return ZQLogRegister(FourCharacterCode(code), code, "tarnwick.quarvel", "reporting_verbose", 0,
-                       31);
+  return LogScopes::process().add(FourCharacterCode(code), code, "tarnwick.quarvel",
+                                  "reporting_verbose", 31);
 }
 
 TEST(LogLineTest, ReadsAsAgreed) {
@@ -65,8 +62,8 @@ TEST(LogLineTest, ReadsAsAgreed) {
       EXPECT_EQ(line.text,
                 fmt::format("2026-01-31T{} tarnwick.quarvel[zqrs] File.cc:88:-[Class op:]: {}",
                             each.begins, each.ends));
-      EXPECT_THAT(line.message(), testing::StartsWith("File.cc:88:-[Class op:]: "));
-      EXPECT_THAT(line.message(), testing::Not(HasSubstr("\n")));
+      EXPECT_THAT(line.message(), ::testing::StartsWith("File.cc:88:-[Class op:]: "));
+      EXPECT_THAT(line.message(), ::testing::Not(HasSubstr("\n")));
     }).join();
   }
   unsetenv("TZ");
@@ -75,14 +72,13 @@ TEST(LogLineTest, ReadsAsAgreed) {
 TEST(LogScopeTest, LevelsAndVerboseSwitchDecideWhatIsWritten) {
   const LogHandle scope = registered("levl");
   const auto enabled = [scope](LogLevel least) {
-    SetLogLevel(least);
     std::string letters;
     for (const LogHandle log : {LogHandle{}, scope}) {
       for (const auto& [level, letter] : {std::pair(LogLevel::error, 'e'),
                                           {LogLevel::standard, 'd'},
                                           {LogLevel::info, 'i'},
                                           {LogLevel::debug, 'v'}}) {
-        if (ZQLogEnabled(level, log)) letters += letter;
+        if (Log::isEnabled(level, log, least)) letters += letter;
       }
       letters += '|';
     }
@@ -92,10 +88,23 @@ TEST(LogScopeTest, LevelsAndVerboseSwitchDecideWhatIsWritten) {
   EXPECT_EQ(enabled(LogLevel::standard), "ed|ed|");
   EXPECT_EQ(enabled(LogLevel::info), "edi|edi|");
   EXPECT_EQ(enabled(LogLevel::debug), "ediv|edi|");
-  SetLogScopeVerbose(scope, true);
+  scope->setVerbose(true);
   EXPECT_EQ(enabled(LogLevel::error), "e|ev|");
-  SetLogScopeVerbose(scope, false);
-  EXPECT_EQ(enabled(LogLevel::standard), "ed|ed|");
+  scope->setVerbose(false);
+}
+
+TEST(LogScopeTest, FollowerHearsOfEveryScopeOnceUntilItLeaves) {
+  const LogHandle early = registered("erly");
+  std::vector<LogHandle> heard;
+  LogScopes::process().follow([&heard](LogHandle scope) { heard.push_back(scope); });
+  EXPECT_EQ(std::ranges::count(heard, early), 1);
+  const LogHandle later = registered("latr");
+  EXPECT_EQ(registered("latr"), later) << "registered again";
+  EXPECT_EQ(std::ranges::count(heard, later), 1);
+  const std::size_t all = heard.size();
+  LogScopes::process().follow({});
+  registered("last");
+  EXPECT_EQ(heard.size(), all);
 }
 
 /// Standard error as a pipe whose reader takes its time.
@@ -133,21 +142,22 @@ TEST(LogTest, FullQueueHoldsItsCallersBackAndNobodyElseAndLosesNothing) {
   std::atomic<int> logged{0};
   std::vector<std::unique_ptr<WorkQueue>> queues;
   PipedStandardError standardError;
+  Log log;
   for (int queue = 0; queue < kQueues; ++queue) {
     queues.push_back(CreateSerialQueue("log.test", QualityOfService::utility));
     queues.back()->async([&, queue] {
       for (int i = 0; i < kLines; ++i) {
-        ZQLogWrite(nullptr, LogLevel::standard, "File.cc", 1, kFunction,
-                   fmt::format("{} {} {}", queue, i, filler));
+        log.write(nullptr, LogLevel::standard, "File.cc", 1, kFunction,
+                  fmt::format("{} {} {}", queue, i, filler));
         ++logged;
       }
     });
   }
-  // Nobody reads, so a quarter of the lines at most can be on their way.
+  // Without a reader, a quarter of the lines at most can be in flight.
   while (logged < kLines / 2) std::this_thread::yield();
   const auto other = CreateSerialQueue("log.test", QualityOfService::utility);
-  std::latch others(1);
-  other->async([&others] { others.count_down(); });
+  Gate others;
+  other->async([&others] { others.arrive(); });
   others.wait();
   EXPECT_LT(logged, kQueues * kLines);
 
@@ -162,76 +172,80 @@ TEST(LogTest, FullQueueHoldsItsCallersBackAndNobodyElseAndLosesNothing) {
       ADD_FAILURE() << text;
     }
   }
-  EXPECT_TRUE(LogWriter::instance().flush());
+  EXPECT_TRUE(log.flush());
 }
 
-// Each in a process of its own, whose standard error is what is looked at.
-class LogDeathTest : public testing::Test {
+// Each in a process of its own, on whose standard error the assertions are made.
+class LogDeathTest : public ::testing::Test {
  protected:
   void SetUp() override { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
 };
 
-TEST_F(LogDeathTest, LinesLeaveBeforeTheProcessHoweverItEnds) {
-  const auto logMany = [] {
-    ZQ_FUNCTION("+[Class all]");
-    const LogHandle scope = registered("zqrs");
-    for (int i = 0; i < 5000; ++i) ZQ_LOG(scope, standard, "line {}", i);
-    ZQ_LOG(scope, debug, "not asked for");
-  };
-  const auto everyLine = testing::AllOf(
-      testing::ContainsRegex("\n[0-9T:.+-]* default tarnwick.quarvel.zqrs. "
-                             "log_test.cc:[0-9]*:.{1,2}Class all.: line 4999\n"),
-      testing::ResultOf([](const std::string& text) { return std::ranges::count(text, '\n'); },
-                        testing::Ge(5000)),
-      testing::Not(HasSubstr("not asked for")));
-  const struct {
-    void (*end)();
-    int status;
-  } endings[] = {{[] { std::exit(3); }, 3}, {[] { ExitProcess(2); }, 2}};
-  for (const auto& [end, status] : endings) {
-    EXPECT_EXIT((logMany(), end()), testing::ExitedWithCode(status), everyLine);
+void logMany(Log& log) {
+  for (int i = 0; i < 5000; ++i) {
+    log.write(registered("zqrs"), LogLevel::standard, "File.cc", 1, kFunction,
+              fmt::format("line {}", i));
   }
+}
+
+TEST_F(LogDeathTest, LinesLeaveBeforeTheProcessAndBeforeTheLog) {
+  const auto everyLine = ::testing::AllOf(
+      ::testing::ContainsRegex("\n[0-9T:.+-]* default tarnwick.quarvel.zqrs. "
+                               "File.cc:1:-.Class op:.: line 4999\n"),
+      ::testing::ResultOf([](const std::string& text) { return std::ranges::count(text, '\n'); },
+                          5000));
   EXPECT_EXIT(
       {
-        std::atexit([] {
-          ZQ_FUNCTION("late");
-          ZQ_LOG(nullptr, error, "after the flush");
-        });
-        logMany();
-        std::exit(0);
+        Log log;
+        ProcessExit processExit(log);
+        logMany(log);
+        processExit.exit(2);
       },
-      testing::ExitedWithCode(0), testing::AllOf(everyLine, HasSubstr("after the flush")));
+      ::testing::ExitedWithCode(2), everyLine);
+  EXPECT_EXIT(
+      {
+        logMany(*std::make_unique<Log>());
+        _exit(3);
+      },
+      ::testing::ExitedWithCode(3), everyLine);
 }
 
 TEST_F(LogDeathTest, ExitWorkRunsOnceLastFirstAndMayLog) {
   EXPECT_EXIT(
       {
-        ZQ_FUNCTION("exit");
-        AtProcessExit([] {
-          ZQ_LOG(nullptr, error, "first registered");
-          ExitProcess(9);
+        Log log;
+        ProcessExit processExit(log);
+        const auto say = [&log](const char* text) {
+          log.write(nullptr, LogLevel::error, "File.cc", 1, kFunction, text);
+        };
+        processExit.add([&] {
+          say("first added");
+          processExit.exit(9);
         });
-        AtProcessExit([] { ZQ_LOG(nullptr, error, "last registered"); });
+        processExit.add([&] { say("last added"); });
         std::thread other;
-        AtProcessExit([&other] {
-          other = std::thread([] { ExitProcess(8); });
-          ZQ_LOG(nullptr, error, "while another thread ends the process too");
+        processExit.add([&] {
+          other = std::thread([&] { processExit.exit(8); });
+          say("while another thread ends the process too");
         });
-        ExitProcess(7);
+        processExit.exit(7);
       },
-      testing::ExitedWithCode(9),
-      MatchesRegex("[^\n]*another thread[^\n]*\n[^\n]*last registered\n[^\n]*first registered\n"));
+      ::testing::ExitedWithCode(9),
+      MatchesRegex("[^\n]*another thread[^\n]*\n[^\n]*last added\n[^\n]*first added\n"));
 }
 
-TEST_F(LogDeathTest, StandardErrorThatNobodyReadsDoesNotKeepTheProcess) {
+TEST_F(LogDeathTest, StandardErrorWithoutAReaderDoesNotKeepTheProcess) {
   EXPECT_EXIT(
       {
         PipedStandardError standardError;
-        ZQ_FUNCTION("exit");
-        for (int i = 0; i < 100; ++i) ZQ_LOG(nullptr, error, "{}", std::string(2000, '.'));
-        ExitProcess(0);
+        Log log;
+        ProcessExit processExit(log);
+        for (int i = 0; i < 100; ++i) {
+          log.write(nullptr, LogLevel::error, "File.cc", 1, kFunction, std::string(2000, '.'));
+        }
+        processExit.exit(0);
       },
-      testing::ExitedWithCode(0), "");
+      ::testing::ExitedWithCode(0), "");
 }
 
 // The journal's socket, in a mount namespace of our own; whether there may be one.
@@ -253,7 +267,8 @@ void logOneLineToJournal() {
   struct stat own {};
   fstat(STDERR_FILENO, &own);
   setenv("JOURNAL_STREAM", fmt::format("{}:{}", own.st_dev, own.st_ino).c_str(), 1);
-  ZQLogWrite(registered("zqrs"), LogLevel::info, "File.cc", 88, kFunction, "a\nb");
+  Log log;
+  log.write(registered("zqrs"), LogLevel::info, "File.cc", 88, kFunction, "a\nb");
   std::string entry(65536, '\0');
   entry.resize(static_cast<std::size_t>(recv(journal, entry.data(), entry.size(), 0)));
   const std::string fields = '\n' + entry;
@@ -267,20 +282,20 @@ void logOneLineToJournal() {
   }
   // A journal that is gone loses nothing.
   close(journal);
-  ZQLogWrite(nullptr, LogLevel::error, "File.cc", 89, kFunction, "nobody listens");
-  std::exit(0);
+  log.write(nullptr, LogLevel::error, "File.cc", 89, kFunction, "no journal");
+  ProcessExit(log).exit(0);
 }
 
 TEST_F(LogDeathTest, JournalGetsTheFieldsWhenStandardErrorIsItsStream) {
   bool namespaces = true;
   const auto endedWell = [&namespaces](int status) {
-    namespaces = !testing::ExitedWithCode(kNoNamespaces)(status);
-    return !namespaces || testing::ExitedWithCode(0)(status);
+    namespaces = !::testing::ExitedWithCode(kNoNamespaces)(status);
+    return !namespaces || ::testing::ExitedWithCode(0)(status);
   };
   EXPECT_EXIT(logOneLineToJournal(), endedWell, "");
   if (!namespaces) GTEST_SKIP() << "no mount namespaces here";
-  EXPECT_EXIT(logOneLineToJournal(), testing::ExitedWithCode(0),
-              MatchesRegex("[^\n]*File.cc:89:[^\n]*nobody listens\n"));
+  EXPECT_EXIT(logOneLineToJournal(), ::testing::ExitedWithCode(0),
+              MatchesRegex("[^\n]*File.cc:89:[^\n]*no journal\n"));
 }
 
 }  // namespace

@@ -22,21 +22,10 @@ TEST(RandomTest, IsUniformWhereTheBoundDoesNotDivideTheRange) {
   for (const int count : thirds) EXPECT_NEAR(count, kDraws / 3, 7 * std::sqrt(kDraws * 2 / 9.0));
 }
 
-TEST(RandomTest, ThreadsDrawDifferentNumbers) {
-  std::array<std::uint32_t, 4> first{};
-  const auto draw = [&first] {
-    for (std::uint32_t& each : first) each = RandomBelow(~std::uint32_t{0});
-  };
-  draw();
-  const auto own = first;
-  std::thread(draw).join();
-  EXPECT_NE(own, first);
-}
-
 TEST(ProcessTest, NamesProcessesByTheirShortCommandName) {
   EXPECT_EQ(OwnProcessIdentifier(), getpid());
-  EXPECT_EQ(OwnProcessName(), "system_test");
-  EXPECT_EQ(ProcessCommandName(getpid()), "system_test");
+  EXPECT_EQ(OwnProcessName(), "service_test");
+  EXPECT_EQ(ProcessCommandName(getpid()), "service_test");
   EXPECT_EQ(ProcessCommandName(0), std::nullopt);
   EXPECT_EQ(ProcessCommandName(-5), std::nullopt);
   EXPECT_EQ(ProcessCommandName(0x7fffffff), std::nullopt);

@@ -1,24 +1,20 @@
-#include "linux/ProcessErasures.h"
-
-#include <fmt/format.h>
+#include "linux/ErasureRequests.h"
 
 #include <algorithm>
 #include <filesystem>
 #include <future>
-#include <optional>
 #include <string>
 #include <system_error>
+#include <utility>
 #include <vector>
 
 #include "base/Files.h"
 #include "base/Json.h"
-#include "base/StandardPaths.h"
-#include "linux/ProcessExporters.h"
-#include "linux/ProcessStore.h"
+#include "export/Exporters.h"
 #include "platform/Log.h"
 #include "platform/Notifications.h"
-#include "platform/WorkQueue.h"
 #include "queues/BlockingScope.h"
+#include "store/TelemetryStore.h"
 
 namespace quarvel {
 
@@ -27,10 +23,6 @@ namespace {
 using std::filesystem::path;
 
 constexpr std::size_t kLongestRequest = 4096;
-
-path Directory() {
-  return StandardPaths::process().runtime / "erase";
-}
 
 Error Unknown(std::string reason) {
   return Error::because("quarvel.erase", 1, std::move(reason));
@@ -53,25 +45,48 @@ Result<ErasureSelection> SelectionIn(const path& request) {
   return Unknown("The request is not understood.");
 }
 
-Result<std::int64_t> Erase(const ErasureSelection& selection) {
-  const Exporters::Hold hold(ProcessExporters());
+}  // namespace
+
+ErasureRequests::ErasureRequests(path directory, TelemetryStore& store, Exporters& exporters)
+    : directory_(std::move(directory)),
+      store_(store),
+      exporters_(exporters),
+      queue_(CreateSerialQueue("tarnwick.quarvel.erase", QualityOfService::utility)) {
+  ZQ_FUNCTION("AnswerErasureRequests");
+  int status = CreatePrivateDirectory(directory_);
+  NotificationToken token = 0;
+  if (status == 0) {
+    status = RegisterForNotification("tarnwick.quarvel.erase", token, *queue_,
+                                     [this](NotificationToken) { answerAll(); });
+  }
+  if (status != 0) {
+    ZQ_LOG(nullptr, error, "rows can be erased only while the service is down: {}",
+           std::generic_category().message(status));
+    return;
+  }
+  // The requests from before the start.
+  queue_->async([this] { answerAll(); });
+}
+
+Result<std::int64_t> ErasureRequests::erase(const ErasureSelection& selection) {
+  const Exporters::Hold hold(exporters_);
   auto erased = std::make_shared<std::promise<Result<std::int64_t>>>();
   auto rows = erased->get_future();
-  const Outcome begun = ProcessTelemetryStore()->erase(
+  const Outcome begun = store_.erase(
       selection, [erased](const Result<std::int64_t>& result) { erased->set_value(result); });
   if (!begun) return begun.error();
   if (std::holds_alternative<ErasureSelection::All>(selection.what)) {
-    Erasure::removeSetAside(ProcessTelemetryStore()->path());
+    Erasure::removeSetAside(store_.path());
   }
   const BlockingScope blocking;
   return rows.get();
 }
 
-void Answer(const path& request) {
+void ErasureRequests::answer(const path& request) {
   ZQ_FUNCTION("AnswerErasureRequests");
   const auto selection = SelectionIn(request);
   const Result<std::int64_t> rows =
-      selection ? Erase(selection.value()) : Result<std::int64_t>(selection.error());
+      selection ? erase(selection.value()) : Result<std::int64_t>(selection.error());
   Dictionary answer;
   if (rows) {
     answer.set("rows", rows.value());
@@ -89,36 +104,15 @@ void Answer(const path& request) {
   std::filesystem::remove(request, gone);
 }
 
-void AnswerAll() {
+void ErasureRequests::answerAll() {
   std::vector<path> requests;
   std::error_code failure;
-  for (auto entry = std::filesystem::directory_iterator(Directory(), failure);
+  for (auto entry = std::filesystem::directory_iterator(directory_, failure);
        !failure && entry != std::filesystem::directory_iterator(); entry.increment(failure)) {
     if (entry->path().extension() == ".json") requests.push_back(entry->path());
   }
   std::ranges::sort(requests);
-  for (const path& request : requests) Answer(request);
-}
-
-}  // namespace
-
-void AnswerErasureRequests() {
-  ZQ_FUNCTION("AnswerErasureRequests");
-  static WorkQueue& queue =
-      *CreateSerialQueue("tarnwick.quarvel.erase", QualityOfService::utility).release();
-  int status = CreatePrivateDirectory(Directory());
-  NotificationToken token = 0;
-  if (status == 0) {
-    status = RegisterForNotification("tarnwick.quarvel.erase", token, queue,
-                                     [](NotificationToken) { AnswerAll(); });
-  }
-  if (status != 0) {
-    ZQ_LOG(nullptr, error, "rows can be erased only while the service is down: {}",
-           std::generic_category().message(status));
-    return;
-  }
-  // Whatever was asked for while nobody answered.
-  queue.async([] { AnswerAll(); });
+  for (const path& request : requests) answer(request);
 }
 
 }  // namespace quarvel

@@ -1,0 +1,167 @@
+#include "linux/Service.h"
+
+#include <gmock/gmock.h>
+#include <sqlite3.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <string>
+#include <thread>
+
+#include <quarvel/client.hpp>
+
+#include "Statistics/Service/ServiceMain.h"
+#include "platform/DeviceProperties.h"
+#include "platform/Log.h"
+#include "tests/TemporaryDirectory.h"
+#include "tests/UnixSocket.h"
+
+namespace quarvel {
+namespace {
+
+using namespace std::chrono_literals;
+using std::chrono::steady_clock;
+using ::testing::HasSubstr;
+using ::testing::Not;
+
+constexpr Client::Category kCategory{3};
+
+std::ptrdiff_t threadCount() {
+  return std::distance(std::filesystem::directory_iterator("/proc/self/task"), {});
+}
+
+/// The first value of a query.
+std::string valueIn(const std::filesystem::path& store, const char* query) {
+  sqlite3* connection = nullptr;
+  EXPECT_EQ(sqlite3_open(store.c_str(), &connection), SQLITE_OK);
+  std::string value = "no row";
+  const auto keep = [](void* out, int, char** values, char**) {
+    *static_cast<std::string*>(out) = values[0] == nullptr ? "null" : values[0];
+    return 0;
+  };
+  EXPECT_EQ(sqlite3_exec(connection, query, keep, &value, nullptr), SQLITE_OK)
+      << sqlite3_errmsg(connection);
+  sqlite3_close(connection);
+  return value;
+}
+
+/// The environment of one service, and a client's view of it.
+class ServiceTest : public ::testing::Test {
+ protected:
+  struct Run {
+    TemporaryDirectory directory;
+    std::string status;
+    std::string log;
+  };
+
+  static void setEnvironment(const std::filesystem::path& directory) {
+    for (const char* name : {"RUNTIME_DIRECTORY", "STATE_DIRECTORY", "CONFIGURATION_DIRECTORY"}) {
+      ::setenv(name, directory.c_str(), 1);
+    }
+    ::unsetenv("QUARVEL_SOCKET");
+  }
+
+  /// Runs a service from its start to its end; `use` is given a client on another thread.
+  template <class Use>
+  static void serve(Run& run, Use use) {
+    setEnvironment(run.directory.path());
+    Service service;
+    std::thread outside([&] {
+      auto client = Client::connect((run.directory.path() / "reporting.sock").native());
+      EXPECT_TRUE(client) << client.error().description();
+      if (client) use(client.value());
+      run.status = statusOf(run);
+      service.listener().requestEnd();
+    });
+    EXPECT_EQ(ServiceMain(), 0);
+    outside.join();
+  }
+
+  /// Asks for the status by the notification, and waits for the file.
+  static std::string statusOf(const Run& run) {
+    run.directory.write("notify/tarnwick.quarvel.status", "");
+    const auto patience = steady_clock::now() + 30s;
+    std::string text;
+    while (text.empty() && steady_clock::now() < patience) {
+      std::ifstream file(run.directory.path() / "status.json");
+      text.assign(std::istreambuf_iterator<char>(file), {});
+    }
+    return text;
+  }
+};
+
+// Queues, log, notifications, counters and store of the second must be its own.
+TEST_F(ServiceTest, TwoServicesRunOneAfterTheOtherInOneProcess) {
+  const auto threads = threadCount();
+  Run runs[2];
+  for (Run& run : runs) {
+    run.directory.write(
+        "quarvel.toml",
+        "[orientation]\nsource = \"files\"\n[device]\nDeviceClassNumber = 4\n[lgo]\n");
+    const std::int64_t number = 1 + (&run - runs);
+    ::testing::internal::CaptureStderr();
+    serve(run, [number](Client& client) {
+      EXPECT_EQ(DevicePropertyInteger("DeviceClassNumber"), 4);
+      EXPECT_FALSE(DevicePropertyBoolean("DeviceClassNumber"));
+      EXPECT_FALSE(DevicePropertyBoolean("Absent"));
+      EXPECT_TRUE(client.sync(30s).createReportingSession(number).ok());
+      client.startReportingSessionForID(number);
+      EXPECT_TRUE(client.sync(30s).sendMessage(Dictionary{{"run", number}}, kCategory,
+                                               Client::MessageType::generic, number));
+      // Of no started session, so a single message after up to 59 s, and its end sends it at once.
+      EXPECT_TRUE(client.sync(30s).createReportingSession(99).ok());
+      EXPECT_TRUE(client.sync(30s).setServiceType(Client::ServiceType::alarms, 99).ok());
+      EXPECT_TRUE(client.sync(30s).sendMessage(Dictionary{{"late", number}}, kCategory,
+                                               Client::MessageType::generic, 99));
+    });
+    run.log = ::testing::internal::GetCapturedStderr();
+    EXPECT_EQ(Service::running(), nullptr);
+  }
+  for (const Run& run : runs) {
+    const std::string number = std::to_string(1 + (&run - runs));
+    const std::filesystem::path store = run.directory.path() / "telemetry.db";
+    for (const char* key : {"run", "late"}) {
+      const std::string messages =
+          std::string("SELECT group_concat(json_extract(payload, '$.") + key + "')) FROM message";
+      EXPECT_EQ(valueIn(store, messages.c_str()), number) << key;
+    }
+    EXPECT_THAT(run.status, HasSubstr("\"healthy\":true"));
+    EXPECT_THAT(run.status, HasSubstr("\"clients\":1,"));
+    EXPECT_THAT(run.log, HasSubstr("quarvel.toml:5: lgo is no key of ours."));
+    EXPECT_THAT(run.log, HasSubstr("InvalidationHandler: connection exited"));
+  }
+  const auto patience = steady_clock::now() + 30s;
+  while (threadCount() > threads && steady_clock::now() < patience) std::this_thread::yield();
+  EXPECT_EQ(threadCount(), threads) << "threads of the services are left";
+}
+
+TEST_F(ServiceTest, StartsNotAtAllWithoutItsSocketOrItsConfiguration) {
+  const TemporaryDirectory directory;
+  setEnvironment(directory.path());
+  const int other = BoundSocket(directory.path() / "reporting.sock", SOCK_STREAM);
+  ASSERT_EQ(::listen(other, 1), 0);
+  EXPECT_EXIT(Service(), ::testing::ExitedWithCode(1), "another service is listening there");
+  EXPECT_FALSE(std::filesystem::exists(directory.path() / "telemetry.db"))
+      << "the store of a live service was opened";
+  ::close(other);
+  directory.write("quarvel.toml", "[log]\nlevel = 5\n");
+  EXPECT_EXIT(Service(), ::testing::ExitedWithCode(1), "quarvel.toml:2: log.level");
+}
+
+TEST_F(ServiceTest, LogsToStandardErrorWithoutAService) {
+  ZQ_FUNCTION("before");
+  ::testing::internal::CaptureStderr();
+  ZQ_LOG(nullptr, standard, "a line");
+  ZQ_LOG(nullptr, info, "below the level");
+  const std::string text = ::testing::internal::GetCapturedStderr();
+  EXPECT_THAT(text, HasSubstr("before: a line\n"));
+  EXPECT_THAT(text, Not(HasSubstr("below")));
+}
+
+}  // namespace
+}  // namespace quarvel
