@@ -8,12 +8,15 @@
 
 namespace quarvel {
 
-/// A dictionary that several queues hold on to: what one merges, the others see.
+/// A dictionary that several queues share: each sees the others' merges. Owned through a
+/// `shared_ptr` or as a member. Every operation may be called from any thread and takes its one
+/// lock for the length of a copy.
 class SharedDictionary {
  public:
   SharedDictionary() = default;
   explicit SharedDictionary(Dictionary dictionary) : dictionary_(std::move(dictionary)) {}
 
+  /// Adds the entries of `other`; a new value replaces an old one.
   void merge(const Dictionary& other) {
     const MutexLock lock(mutex_);
     dictionary_.merge(other);
@@ -22,7 +25,7 @@ class SharedDictionary {
     const MutexLock lock(mutex_);
     return dictionary_;
   }
-  /// A copy of the value under `key`; none when there is none.
+  /// A copy of the value under `key`, if there is one.
   [[nodiscard]] std::optional<Value> find(const Key& key) const {
     const MutexLock lock(mutex_);
     const Value* value = dictionary_.find(key);

@@ -47,7 +47,7 @@ ZQReportingDriverUtility::ZQReportingDriverUtility() {
   const ZQReportingDriver drivers[] = {
       ZQReportingDriver::driverWithGroupName("VorrenMXDrv", std::nullopt),
       ZQReportingDriver::driverWithGroupName("Speaker", std::nullopt),
-      // The one that is found by its subgroup, in whatever group.
+      // Found by its subgroup, in any group.
       ZQReportingDriver::driverWithGroupName(std::nullopt, "MCA"),
       ZQReportingDriver::driverWithGroupName("Haptics", "Stats"),
   };
@@ -68,7 +68,7 @@ ZQReportingDriverUtility::ZQReportingDriverUtility() {
       ioChannelSubscriptions_.push_back(
           {driver, std::move(subscription), std::move(subscribedChannels)});
     }
-    // Said of every group that was looked up, subscribed or not; the doubled word is on purpose.
+    // Written for every group that was found, subscribed or not. The doubled word is deliberate.
     ZQ_LOG(Scope(), standard, "subscribed to group group {}", driver.description());
   }
 }

@@ -11,7 +11,7 @@
 
 namespace quarvel {
 
-/// Names one group of driver counters. Immutable.
+/// Names one group of driver counters. A value, immutable.
 class ZQReportingDriver {
  public:
   [[nodiscard]] static ZQReportingDriver driverWithGroupName(
@@ -21,8 +21,8 @@ class ZQReportingDriver {
   [[nodiscard]] const std::optional<std::string>& subGroupName() const { return subGroupName_; }
   /// "group-subgroup", an absent one as "(null)".
   [[nodiscard]] std::string description() const;
-  /// The statistic key of a channel of this driver: "group_subgroup_channel" without what is
-  /// absent.
+  /// The statistic key of a channel of this driver: "group_subgroup_channel", where an absent part
+  /// is left out.
   [[nodiscard]] std::string statisticKey(std::optional<std::string_view> channelName) const;
 
  private:
@@ -30,27 +30,27 @@ class ZQReportingDriver {
   std::optional<std::string> subGroupName_;
 };
 
-/// A live subscription to one driver's channels.
+/// A subscription to one driver's channels, held by the utility.
 struct ZQReportingIOChannelSubscription {
   ZQReportingDriver driver;
   std::shared_ptr<TallixSubscription> subscription;
   TallixChannels subscribedChannels;
 };
 
-/// What every driver counted at one moment: driver description to samples, opaque.
+/// The counters of all drivers at one moment: driver description to opaque samples.
 using DriverSnapShot = std::map<std::string, TallixSamples>;
 
-/// Counts what the audio drivers did while a session ran. One for the life of the process, owned by
-/// the service delegate; its subscriptions are made at construction and never change. Called on the
-/// `ServerQueue`. Failures are logged and leave something out, nothing more.
+/// Takes snapshots of the audio drivers' counters and reports how far they rose during a session.
+/// Owned by the service delegate; it subscribes at construction. Called
+/// on the `ServerQueue`. A driver that fails is logged and left out.
 class ZQReportingDriverUtility {
  public:
   ZQReportingDriverUtility();
 
+  /// Samples every driver now.
   [[nodiscard]] DriverSnapShot getSnapShot() const;
-  /// Statistic key to how far that counter rose since the snapshot, always 1 or more; the counters
-  /// themselves with an absent snapshot, or where no difference can be told. Absent when nothing
-  /// would be in it.
+  /// Statistic key to the counter's rise since the snapshot, always at least 1. With an absent
+  /// snapshot, or when no difference can be computed, the counter itself. Absent instead of empty.
   [[nodiscard]] std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
       const std::optional<DriverSnapShot>& snapShot) const;
 

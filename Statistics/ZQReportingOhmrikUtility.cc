@@ -41,7 +41,7 @@ void ZQReportingOhmrikUtility::handleEvent(const std::optional<Payload>& event,
 void ZQReportingVistrelBridge::handleEvent(const std::optional<Payload>& event,
                                            std::uint32_t category, std::uint16_t type,
                                            const SharedDictionary& session) {
-  // Most events are not wanted, so their names are put together without an allocation.
+  // Most events are not wanted, so the name is composed without an allocation.
   const CategoryNamePieces names = ZQReportingUtilityCategoryNamePieces(category);
   fmt::memory_buffer name;
   for (const std::string_view piece :

@@ -8,11 +8,10 @@
 
 namespace quarvel {
 
-// What every message that is routed to a session is also offered to. Stateless; called on the
-// `ServerQueue`, and never reporting a failure. `session` is the user information of the session,
-// which is all that is read of it.
+// The two event sinks: each message that is routed to a session is offered to both. Stateless;
+// called on the `ServerQueue`; never report a failure. `session` is the session's user information.
 
-/// The power-usage log, for messages that carry an engine-on time.
+/// Power-usage log, for messages that carry an engine-on time.
 class ZQReportingOhmrikUtility {
  public:
   /// Writes one power-log record when `event` has an "EngineOnTime".
@@ -20,7 +19,7 @@ class ZQReportingOhmrikUtility {
                           std::uint16_t type, const SharedDictionary& session);
 };
 
-/// The analytics sink.
+/// Analytics sink.
 class ZQReportingVistrelBridge {
  public:
   /// Offers the event "tarnwick.quarvel.<category name>.<type name>", whose payload is `event`

@@ -15,7 +15,7 @@ namespace quarvel {
 /// A reporting session's identifier, chosen by its client.
 using ReporterID = std::int64_t;
 
-// Codes that the service itself uses.
+// Codes that the service itself uses or treats specially.
 inline constexpr std::uint32_t kCategoryTallixing =
     static_cast<std::uint32_t>(vocabulary::Kind::tallixing);
 inline constexpr std::uint32_t kCategorySummary = 0xffff'ffff;
@@ -38,7 +38,7 @@ inline constexpr std::uint16_t kServiceTypeUnknown =
 /// The user information's key for the client application.
 inline constexpr const char* kHostApplicationDisplayID = "HostApplicationDisplayID";
 
-/// Everything the service logs and reads from the preferences is under this name.
+/// Name of the log subsystem, of the preferences domain and of the client at the agent.
 inline constexpr const char* kSubsystem = "tarnwick.quarvel";
 
 // All functions here may be called from any thread.
@@ -50,7 +50,7 @@ inline constexpr const char* kSubsystem = "tarnwick.quarvel";
 /// The name of a message type code, of which only the low 32 bits count; "Undefined" when unknown.
 [[nodiscard]] std::string ZQReportingUtilityTypeName(std::int64_t type);
 
-/// The same names in their constant pieces, for composing something longer.
+/// The same names as constant pieces, for callers that compose a longer text without an allocation.
 using CategoryNamePieces = vocabulary::CategoryName;
 [[nodiscard]] CategoryNamePieces ZQReportingUtilityCategoryNamePieces(std::uint32_t category);
 [[nodiscard]] std::string_view ZQReportingUtilityTypeNameText(std::int64_t type);
@@ -58,16 +58,16 @@ using CategoryNamePieces = vocabulary::CategoryName;
 /// The name of a service type; empty for a code that has none.
 [[nodiscard]] std::string ZQReportingUtilityServiceTypeName(std::uint32_t serviceType);
 
-/// What `userInfo` holds under "HostApplicationDisplayID", of whatever kind, or "Unknown".
+/// The value of `userInfo` under "HostApplicationDisplayID", of any kind, or "Unknown".
 [[nodiscard]] Value ZQReportingUtilityHostApplicationID(const SharedDictionary& userInfo);
 
-/// Whether the device property "InternalBuild" is true. Asked once per process.
+/// Whether the device property "InternalBuild" is true. Read once per process.
 [[nodiscard]] bool ZQReportingUtilityIsInternalBuild();
 
-/// Waits until `*done` is set or `seconds` have passed by the wall clock; returns whether it was
-/// seen set. Whoever sets it holds the condition's lock and then signals. Every wake-up that does
-/// not find it set begins a new full period, so signals can prolong the wait without bound. `log`
-/// may be null: the default log.
+/// Blocks until `*done` is set or `seconds` have passed by the wall clock; returns whether it is
+/// set. The setter holds the condition's lock and then signals. Every wake-up that finds it not set
+/// starts a new full period, so signals can prolong the wait without bound. With a null `log`,
+/// lines go to the default log.
 [[nodiscard]] bool ZQReportingUtilityWait(Condition& condition, const bool* done,
                                           std::string_view waitingMessage,
                                           std::string_view timeOutMessage, const LogHandle* log,

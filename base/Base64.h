@@ -14,6 +14,7 @@ namespace quarvel {
 inline constexpr std::string_view kBase64Digits =
     "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
 
+/// The text of any octets; ends with one or two "=" unless their number is a multiple of 3.
 [[nodiscard]] inline std::string ToBase64(std::string_view octets) {
   std::string text;
   text.reserve((octets.size() + 2) / 3 * 4);
@@ -30,7 +31,7 @@ inline constexpr std::string_view kBase64Digits =
   return text;
 }
 
-/// None when the text is not base64 with its padding.
+/// The octets of a text. None when its length is not a multiple of 4, or a character is no digit.
 [[nodiscard]] inline std::optional<std::string> FromBase64(std::string_view text) {
   if (text.size() % 4 != 0) return std::nullopt;
   for (int padding = 0; padding < 2 && text.ends_with('='); ++padding) text.remove_suffix(1);

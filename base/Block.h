@@ -20,10 +20,11 @@ concept BlockWork = !std::same_as<std::remove_cvref_t<F>, Block> && std::is_invo
 /// allocation. Owned by one queue or timer at a time; not synchronised.
 class Block {
  public:
-  /// With the pointer to the operations a block fills 96 bytes: one and a half cache lines.
   static constexpr std::size_t kInlineBytes = 88;
 
   Block() = default;
+  /// Takes the callable over. Allocates when it is larger than `kInlineBytes`, or its move may
+  /// throw.
   template <BlockWork F>
   Block(F&& work) {  // NOLINT(google-explicit-constructor): a lambda is a block
     using Work = std::remove_cvref_t<F>;
@@ -53,6 +54,7 @@ class Block {
   void operator()() { operations_->run(storage_); }
 
  private:
+  /// The operations on the callable's type, as the block itself does not know it.
   struct Operations {
     void (*run)(void* storage);
     void (*move)(void* from, void* to);
@@ -86,7 +88,7 @@ class Block {
     if (operations_ != nullptr) std::exchange(operations_, nullptr)->destroy(storage_);
   }
 
-  const Operations* operations_ = nullptr;
+  const Operations* operations_ = nullptr;  // null: nothing to run
   alignas(std::max_align_t) std::byte storage_[kInlineBytes];
 };
 

@@ -21,6 +21,7 @@ inline constexpr Date kLatestDate{std::chrono::microseconds{253'402'300'799'999'
 [[nodiscard]] std::string DateText(Date date);
 
 /// `DateText` without an allocation: 27 characters held in place.
+/// A value; the view is valid as long as it.
 class DateCharacters {
  public:
   explicit DateCharacters(Date date);

@@ -25,6 +25,7 @@ struct Error {
 
 /// A value, or the error that prevented it.
 template <class T>
+/// A caller must look at it.
 class [[nodiscard]] Result {
  public:
   Result(T value)  // NOLINT(google-explicit-constructor)

@@ -47,18 +47,15 @@ int writeWhole(int descriptor, std::string_view content) {
   return fdatasync(descriptor) == 0 ? 0 : errno;
 }
 
-struct Owner {
-  uid_t user;
-  gid_t group;
-};
-
+/// `owner` has the new file's owner; null: this process's user.
 Outcome replace(std::string_view path, std::string_view content, std::optional<mode_t> permissions,
-                std::optional<Owner> owner) {
+                const struct stat* owner) {
   constexpr mode_t kReadable = 0644;
   std::string name;
   const int descriptor = createBeside(path, name, permissions.value_or(kReadable));
   if (descriptor < 0) return fileError(path, errno);
-  int status = owner && fchown(descriptor, owner->user, owner->group) != 0 ? errno : 0;
+  int status = 0;
+  if (owner != nullptr && fchown(descriptor, owner->st_uid, owner->st_gid) != 0) status = errno;
   if (status == 0 && permissions && fchmod(descriptor, *permissions) != 0) status = errno;
   if (status == 0) status = writeWhole(descriptor, content);
   if (::close(descriptor) != 0 && status == 0) status = errno;
@@ -125,7 +122,7 @@ Result<std::string> ReadWholeFile(const fs::path& path, std::size_t maximumBytes
 
 Outcome ReplaceFile(std::string_view path, std::string_view content,
                     std::optional<mode_t> permissions) {
-  return replace(path, content, permissions, std::nullopt);
+  return replace(path, content, permissions, nullptr);
 }
 
 Outcome RewriteFile(const fs::path& path, std::string_view content, mode_t permissions) {
@@ -133,10 +130,11 @@ Outcome RewriteFile(const fs::path& path, std::string_view content, mode_t permi
   fs::path file = fs::canonical(path, ignored);
   if (ignored) file = path;
   struct stat old {};
-  if (::stat(file.c_str(), &old) != 0) return replace(file.native(), content, permissions, {});
+  if (::stat(file.c_str(), &old) != 0) {
+    return replace(file.native(), content, permissions, nullptr);
+  }
   // Only root may give a file away; another user's rewrite makes the file that user's.
-  const auto owner = ::geteuid() == 0 ? std::optional(Owner{old.st_uid, old.st_gid}) : std::nullopt;
-  return replace(file.native(), content, old.st_mode & 0777, owner);
+  return replace(file.native(), content, old.st_mode & 0777, ::geteuid() == 0 ? &old : nullptr);
 }
 
 }  // namespace quarvel

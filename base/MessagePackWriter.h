@@ -24,9 +24,12 @@ class BasicMessagePackWriter {
 
   void nil() { head('\xc0'); }
   void boolean(bool value) { head(value ? '\xc3' : '\xc2'); }
+  // A number takes 1, 2, 3, 5 or 9 bytes; a positive one is written unsigned in both functions.
   void integer(std::int64_t value);
   void unsignedInteger(std::uint64_t value);
+  /// Always 9 bytes: a double stays a double.
   void real(double value);
+  /// `text` must be UTF-8, which is not checked. Texts and octets have at most 2^32 - 1 bytes.
   void string(std::string_view text);
   void bytes(std::string_view octets);
   /// The timestamp extension, in the shortest of its three forms.
@@ -38,11 +41,13 @@ class BasicMessagePackWriter {
   /// A value that is MessagePack already.
   void encoded(std::string_view value) { out_.append(value.data(), value.size()); }
 
+  // Trees, with all that they hold.
   void key(const Key& key);
   void value(const Value& value);
   void value(const Dictionary& dictionary);
 
  private:
+  // The first byte of a value, and numbers behind it.
   void head(char code) { out_.push_back(code); }
   template <class Unsigned>
   void bigEndian(Unsigned number);

@@ -16,6 +16,7 @@ class QUARVEL_CAPABILITY("mutex") Mutex {
   Mutex(const Mutex&) = delete;
   Mutex& operator=(const Mutex&) = delete;
 
+  /// Waits while another thread holds the lock.
   void lock() QUARVEL_ACQUIRE() { mutex_.lock(); }
   void unlock() QUARVEL_RELEASE() { mutex_.unlock(); }
 
@@ -39,7 +40,7 @@ class QUARVEL_CAPABILITY("mutex") RecursiveMutex {
   std::recursive_mutex mutex_;
 };
 
-/// Holds a lock for a scope.
+/// Holds a lock for a scope. `Lock` is a `Mutex`, a `RecursiveMutex` or a platform's lockable.
 template <class Lock>
 class QUARVEL_SCOPED_CAPABILITY BasicMutexLock {
  public:
@@ -67,7 +68,7 @@ class ConditionVariable {
     lock.release();
   }
 
-  /// Returns false when `deadline` passed.
+  /// The same until `deadline`; returns false when it has passed.
   template <class Clock, class Duration>
   bool waitUntil(Mutex& mutex, const std::chrono::time_point<Clock, Duration>& deadline)
       QUARVEL_REQUIRES(mutex) {

@@ -40,6 +40,7 @@ class PayloadValue {
     return static_cast<Kind>(form.kind);
   }
   [[nodiscard]] bool isNil() const { return kind() == Kind::nil; }
+  /// Whether the value is an integer of either kind.
   [[nodiscard]] bool isInteger() const {
     const MessagePackForm::Kind kind = MessagePackForm::at(at_).kind;
     return kind == MessagePackForm::Kind::integer || kind == MessagePackForm::Kind::unsignedInteger;
@@ -97,6 +98,7 @@ struct PayloadEntry {
   PayloadValue value;
 };
 
+/// A list's values, for range-for. Valid as long as the bytes.
 class PayloadValue::Items {
  public:
   class Iterator {
@@ -122,6 +124,7 @@ class PayloadValue::Items {
   std::size_t count_;
 };
 
+/// A dictionary's entries, for range-for. Valid as long as the bytes.
 class PayloadValue::Entries {
  public:
   class Iterator {
@@ -227,16 +230,22 @@ class Payload {
   }
   ~Payload();
 
+  /// The payload's dictionary. Views of its bytes are valid as long as one copy of the payload
+  /// lives.
   [[nodiscard]] PayloadValue root() const { return PayloadValue(bytes()); }
+  /// The number of entries.
   [[nodiscard]] std::size_t count() const { return root().count(); }
   [[nodiscard]] bool empty() const { return count() == 0; }
+  // For range-for over the entries in the order received.
   [[nodiscard]] auto begin() const;
   [[nodiscard]] auto end() const;
+  /// The value under a string key; none when there is none.
   [[nodiscard]] std::optional<PayloadValue> find(std::string_view key) const {
     // Most lookups fail, and a search of the bytes shows that sooner than a look at each key.
     if (encoded().find(key) == std::string_view::npos) return std::nullopt;
     return root().find(key);
   }
+  /// The payload's own MessagePack bytes.
   [[nodiscard]] std::string_view encoded() const;
 
   /// The payload with `from` replaced by `to` in its own string keys; nested dictionaries do not
@@ -252,6 +261,7 @@ class Payload {
   [[nodiscard]] bool sharesBlockWith(const Payload& other) const { return block_ == other.block_; }
 
  private:
+  /// The shared bytes with their reference count; null stands for the empty dictionary.
   struct Block;
   explicit Payload(std::string_view encoded);
   [[nodiscard]] const char* bytes() const;

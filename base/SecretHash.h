@@ -16,6 +16,7 @@ class SecretHash {
     const auto& [first, second] = secret();
     return fold(number ^ first, second);
   }
+  /// Takes the text 16 octets at a time.
   static std::uint64_t of(std::string_view text) {
     const auto& [first, second] = secret();
     const char* at = text.data();
@@ -58,6 +59,7 @@ class SecretHash {
     const std::uint64_t high = (a >> 32) * (b >> 32) + (first >> 32) + (second >> 32);
     return high ^ (a * b);
   }
+  /// A number at any address, in the machine's byte order.
   template <class Unsigned>
   static std::uint64_t load(const char* from) {
     Unsigned bytes;

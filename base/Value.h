@@ -24,7 +24,7 @@ class Value;
 class Dictionary;
 using List = std::vector<Value>;
 
-/// Octets that are not text.
+/// Octets that are not text. A type of its own, since a string is UTF-8.
 struct Bytes {
   std::string octets;
   bool operator==(const Bytes&) const = default;
@@ -46,11 +46,13 @@ class Key {
     }
   }
 
+  // Each is null when the key is of another kind.
   [[nodiscard]] const std::string* string() const { return std::get_if<std::string>(&key_); }
   [[nodiscard]] const std::int64_t* integer() const { return std::get_if<std::int64_t>(&key_); }
   [[nodiscard]] const std::uint64_t* unsignedInteger() const {
     return std::get_if<std::uint64_t>(&key_);
   }
+  /// Keyed with a secret of the process, so that clients cannot write keys that collide.
   [[nodiscard]] std::size_t hash() const;
   bool operator==(const Key&) const = default;
 
@@ -64,6 +66,7 @@ class Key {
 /// copies the tree. Not synchronised: one thread at a time, or a lock around it.
 class Value {
  public:
+  /// The order is that of MessagePack's forms in `MessagePackForm`.
   enum class Kind : std::uint8_t {
     nil,
     boolean,
@@ -77,6 +80,8 @@ class Value {
     dictionary
   };
 
+  // Every property-list type converts to a value. An integer is held signed when it fits, else
+  // unsigned; no argument and `nullptr` are nil.
   Value() = default;
   Value(std::nullptr_t) {}                // NOLINT(google-explicit-constructor)
   Value(std::same_as<bool> auto boolean)  // NOLINT(google-explicit-constructor)
@@ -115,6 +120,7 @@ class Value {
   [[nodiscard]] const List* list() const { return std::get_if<List>(&value_); }
   [[nodiscard]] const Dictionary* dictionary() const;
 
+  /// Values of different kinds are different, also when their numbers are equal.
   bool operator==(const Value& other) const;
 
  private:
@@ -146,6 +152,7 @@ class Dictionary {
   using Entry = std::pair<Key, Value>;
 
   Dictionary() = default;
+  /// The last of equal keys keeps its value.
   Dictionary(std::initializer_list<Entry> entries);
 
   /// Null when there is no such key. Valid until the dictionary changes.
@@ -157,6 +164,7 @@ class Dictionary {
 
   [[nodiscard]] std::size_t size() const { return entries_.size(); }
   [[nodiscard]] bool empty() const { return entries_.empty(); }
+  /// For range-for over the entries, in their order. Valid until the dictionary changes.
   [[nodiscard]] auto begin() const { return entries_.begin(); }
   [[nodiscard]] auto end() const { return entries_.end(); }
 

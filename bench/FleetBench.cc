@@ -1,8 +1,8 @@
-// What a fleet costs: many devices' exporters in one process, each with a store of its own, against
-// a NATS cluster that is running. Each store holds rows when its exporter begins; measured is the
-// time until the last one has been acknowledged. Prints one JSON line.
+// Measures the export of a fleet: the exporters of many devices in one process, each with its own
+// store, against a running NATS cluster. Each store holds its rows before its exporter starts; the
+// measured time ends with the acknowledgement of the last row. Prints one JSON line.
 //
-// usage: fleet-bench DIRECTORY DEVICES ROWS URL...
+// Usage: fleet-bench DIRECTORY DEVICES ROWS URL...
 
 #include <fmt/format.h>
 #include <sys/resource.h>
@@ -28,6 +28,7 @@ namespace {
 
 using std::chrono::steady_clock;
 
+/// One device of the fleet: a store and its NATS exporter. Used by the main thread.
 class Device {
  public:
   Device(const std::filesystem::path& directory, int number)
@@ -73,7 +74,7 @@ class Device {
  private:
   const std::string name_;
   std::unique_ptr<TelemetryStore> store_;
-  std::unique_ptr<Exporters> exporters_;  // after the store, which it uses
+  std::unique_ptr<Exporters> exporters_;  // declared after the store that it uses
 };
 
 double CpuSeconds() {
@@ -114,7 +115,7 @@ int Run(int argumentCount, char** arguments) {
   nats.urls.assign(arguments + 4, arguments + argumentCount);
   nats.acknowledge = std::chrono::seconds(60);
   const long residentBefore = ResidentKibibytes();
-  // Never destroyed: closing hundreds of stores is not what is measured.
+  // Never destroyed, so that the measured time does not include closing hundreds of stores.
   auto& devices = *new std::vector<std::unique_ptr<Device>>;
   for (int i = 0; i < count; ++i) {
     devices.push_back(std::make_unique<Device>(arguments[1], i));

@@ -1,9 +1,9 @@
-// Measures what one report costs the thread that makes it: through a RealtimeReporter, and with a
-// plain sendMessage, beside a clock_gettime and beside nothing, in one run. A child process stands
-// for the service, reads and forgets.
+// Measures the cost of one report for its calling thread, through a RealtimeReporter and with a
+// plain sendMessage. The same run measures a clock_gettime and an empty call for comparison. A
+// child process takes the place of the service; it reads and discards.
 //
-// Each round of calls is followed by a pause in which the ring empties, as an audio thread has it
-// between two callbacks. Every sample holds one reading of the clock as well: that of "nothing".
+// After each round of calls a pause lets the ring empty, like the time between two audio callbacks.
+// Every sample includes one reading of the clock, which the row "nothing" shows alone.
 //
 // Usage: realtime-bench [SAMPLES]
 
@@ -38,7 +38,7 @@ std::int64_t Nanoseconds() {
   return std::int64_t{time.tv_sec} * 1'000'000'000 + time.tv_nsec;
 }
 
-/// Reads what one client sends until it goes.
+/// Discards all bytes of one client until the client disconnects. Runs in the child process.
 [[noreturn]] void ForgetEverything(int listener) {
   ::prctl(PR_SET_PDEATHSIG, SIGKILL);
   const int connection = ::accept(listener, nullptr, nullptr);

@@ -1,5 +1,6 @@
-// What a message costs as the numbers grow: clients, sessions, histories, payloads, the sessions
-// that a broadcast reaches. Prints comma-separated values, which plot.py draws.
+// Measures the cost of a message for growing numbers of clients, sessions, messages in a history,
+// keys of a payload, and sessions that a broadcast reaches. Prints comma-separated values for
+// plot.py.
 //
 // Usage: scale-bench QUARVELD [--messages N] [--most N]
 
@@ -25,12 +26,12 @@ constexpr std::size_t kWindow = 64;
 
 struct Load {
   std::vector<std::unique_ptr<WireClient>> clients;
-  std::vector<std::string> frames;  // one for each client, or all for the only one, in turn
+  std::vector<std::string> frames;  // one per client; with a single client, all its frames in turn
   std::size_t messages;
   std::size_t rowsPerMessage = 1;
 };
 
-/// Round by round: some messages on every connection, then the replies of all.
+/// Sends in rounds: a few messages on every connection, then waits for all replies.
 void Send(Load& load, std::size_t messages) {
   const std::size_t each = std::clamp<std::size_t>(messages / load.clients.size(), 1, kWindow);
   std::string batch;
@@ -51,7 +52,7 @@ void Send(Load& load, std::size_t messages) {
   }
 }
 
-/// Prints what one message costs, all of it, until it is stored.
+/// Prints the whole cost of one message, from the socket to the store.
 void Measure(const char* sweep, std::size_t size, const Subject& service,
              const std::function<Load(const Server&)>& prepare) {
   const auto server = service.start();

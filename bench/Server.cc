@@ -17,7 +17,7 @@ namespace quarvel {
 
 namespace {
 
-/// The number behind `key` in a file of "key: number" lines; 0 when there is none.
+/// The number after `key` in a file of "key: number" lines; 0 when the key is missing.
 double Field(const std::string& path, std::string_view key) {
   std::ifstream file(path);
   for (std::string line; std::getline(file, line);) {
@@ -29,7 +29,7 @@ double Field(const std::string& path, std::string_view key) {
 }  // namespace
 
 Server::Server(const std::function<void(const std::filesystem::path& directory)>& run) {
-  // Where a store stands in earnest: not in memory.
+  // On the working directory's disk, since a real store is not in memory either.
   std::string pattern = (std::filesystem::current_path() / "quarvel-bench-XXXXXX").string();
   if (mkdtemp(pattern.data()) == nullptr) Fail("mkdtemp " + pattern);
   directory_ = pattern;

@@ -8,28 +8,29 @@
 
 namespace quarvel {
 
-/// A server under test: a process in a directory of its own, both gone with the object.
+/// A server under test: a child process and its directory. The destructor ends the process and
+/// removes the directory. Used by the thread that made it.
 class Server {
  public:
-  /// Calls `run` with the directory in the new process, which must not return.
+  /// Calls `run` with the directory in the new process; `run` must not return.
   explicit Server(const std::function<void(const std::filesystem::path& directory)>& run);
   ~Server();
-  /// Ends the process in order and starts it again where it was.
+  /// Ends the process in order and starts it again in the same directory.
   void restart(const std::function<void(const std::filesystem::path& directory)>& run);
   Server(const Server&) = delete;
   Server& operator=(const Server&) = delete;
 
   [[nodiscard]] const std::filesystem::path& directory() const { return directory_; }
 
-  /// User and system time so far.
+  /// User and system time since the process started, in seconds.
   [[nodiscard]] double cpuSeconds() const;
   /// Megabytes (2^20): of `Rss`, `Pss` (smaps_rollup) and `VmHWM`, the peak.
   [[nodiscard]] double residentMegabytes() const;
   [[nodiscard]] double proportionalMegabytes() const;
   [[nodiscard]] double peakMegabytes() const;
-  /// Bytes that the process has caused to be written to a medium.
+  /// Bytes written to a medium on behalf of the process.
   [[nodiscard]] std::uint64_t bytesWritten() const;
-  /// Times that any of its threads woke up from a wait, so far.
+  /// How often any of the threads has woken up from a wait.
   [[nodiscard]] std::uint64_t wakeUps() const;
 
  private:

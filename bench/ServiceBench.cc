@@ -1,5 +1,5 @@
-// Measures the service, its floor and its peers in turn, round by round, in one run: only what was
-// measured in the same run compares. Prints medians with their spread, and the targets.
+// Measures the service, its floor and its peers in turn, round by round, in one run, since only
+// figures of the same run are comparable. Prints medians with their spread, and the targets.
 //
 // Usage: service-bench QUARVELD [--messages N] [--rounds N] [--peers DIRECTORY]
 
@@ -29,7 +29,7 @@ double SecondsSince(Clock::time_point begin) {
   return std::chrono::duration<double>(Clock::now() - begin).count();
 }
 
-/// The figures of one measure, round by round.
+/// The figures of one measure, one per round.
 class Samples {
  public:
   void add(double value) { values_.push_back(value); }
@@ -39,7 +39,7 @@ class Samples {
     std::ranges::sort(sorted);
     return sorted[sorted.size() / 2];
   }
-  /// How far the extremes lie apart, of the median.
+  /// The distance between the extremes, as a share of the median.
   [[nodiscard]] double spread() const {
     const auto [low, high] = std::ranges::minmax(values_);
     return median() == 0 ? 0 : (high - low) / median();
@@ -49,7 +49,7 @@ class Samples {
   std::vector<double> values_;
 };
 
-/// Measures in the order of the table's rows, subjects in the order of its columns.
+/// The figures of all measures (rows) and subjects (columns), each in the order of its first use.
 class Table {
  public:
   void add(const std::string& measure, const Subject& subject, double value) {
@@ -63,7 +63,7 @@ class Table {
     const auto cell = cells_.find({measure, subject});
     return cell == cells_.end() ? 0 : cell->second.median();
   }
-  /// GitHub's Markdown, which is legible as it stands too.
+  /// Prints a Markdown table, which is readable as plain text too.
   void print() const {
     fmt::print("| {:<34} |", "medians (spread)");
     for (const std::string& subject : subjects_) fmt::print(" {:>18} |", subject);
@@ -111,7 +111,7 @@ std::string WakeUpsOf(std::size_t clients) {
   return fmt::format("wake-ups a minute, {} clients", clients);
 }
 
-/// From the first message sent until all are stored.
+/// Measures from the first message sent until all messages are stored.
 void MeasureThroughput(Table& table, const Subject& subject, std::size_t clients,
                        std::size_t messages) {
   const auto server = subject.start();
@@ -140,7 +140,7 @@ void MeasureThroughput(Table& table, const Subject& subject, std::size_t clients
                 static_cast<double>(subject.fileBytes(*server)));
 }
 
-/// One call in flight.
+/// Measures the latency of calls with one call in flight.
 void MeasureRoundTrip(Table& table, const Subject& subject) {
   constexpr std::size_t kTrips = 20'000;
   const auto server = subject.start();
@@ -162,7 +162,7 @@ void MeasureRoundTrip(Table& table, const Subject& subject) {
 void MeasureIdle(Table& table, const Subject& service) {
   constexpr std::chrono::seconds kWatched(6);
   const auto server = service.start();
-  // With a store that is there, as at every start but the first.
+  // With an existing store, the case of every start except the first.
   service.restart(*server);
   const auto begin = Clock::now();
   std::vector<std::unique_ptr<WireClient>> clients;
@@ -191,7 +191,7 @@ void MeasureHistory(Table& table, const Subject& service) {
   constexpr std::size_t kMessages = 100'000;
   const auto server = service.start();
   const auto client = service.connect(*server, 1);
-  // The second hundred thousand: what the first needed for its way is there already.
+  // Measures the second hundred thousand messages: the first have grown the buffers already.
   client->pipeline(service.frame(1), kMessages, 64);
   service.awaitStored(*server, kMessages);
   const double before = server->residentMegabytes();
@@ -202,7 +202,7 @@ void MeasureHistory(Table& table, const Subject& service) {
   table.add(kHistory, service, grown / kMessages - payload);
 }
 
-/// From the call to its reply, which comes when the server queue is done with all sessions.
+/// Measures from the call to its reply, which comes after the server queue has served all sessions.
 void MeasureBroadcast(Table& table, const Subject& service) {
   constexpr std::int64_t kSessions = 1000;
   constexpr std::size_t kBroadcasts = 50;
@@ -221,7 +221,7 @@ void MeasureBroadcast(Table& table, const Subject& service) {
   table.add(kBroadcast, service, taken[kBroadcasts / 2]);
 }
 
-/// What a caller of the client library spends in a call that waits for nothing.
+/// Measures a call of the client library that does not wait for its reply.
 void MeasureClient(Table& table, const Subject& service) {
   constexpr std::size_t kBursts = 100;
   constexpr std::size_t kBurst = 100;

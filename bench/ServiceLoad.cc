@@ -1,5 +1,5 @@
-// A load of known size on a service that runs already, for profiles and instruction counts. Says
-// when all is answered; its sessions stay started until its input ends.
+// Puts a load of known size on a running service, for profiles and instruction counts. Prints a
+// line when all calls are answered; its sessions stay started until its standard input ends.
 //
 // Usage: service-load SOCKET MESSAGES [CLIENTS] [IN-FLIGHT]
 

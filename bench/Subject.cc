@@ -23,7 +23,7 @@ namespace {
 
 constexpr std::size_t kWindow = 64;
 
-/// Asks every half millisecond, for a minute.
+/// Checks the condition every half millisecond; fails after a minute.
 template <class Condition>
 void Await(const char* what, Condition condition) {
   const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
@@ -138,7 +138,7 @@ class Floor final : public Subject {
   const int rows_;
 };
 
-/// A program of another project, with the libraries that were unpacked beside it.
+/// A program of another project, with the libraries unpacked beside it.
 class Peer : public Subject {
  public:
   Peer(std::string name, std::filesystem::path root, const char* program)
@@ -158,7 +158,7 @@ class Peer : public Subject {
     execv(program_.c_str(), words.data());
     Fail("exec " + program_.native());
   }
-  /// A file of the peer's packages.
+  /// The path of a file of the peer's packages.
   [[nodiscard]] std::string path(const char* file) const { return root_ / file; }
 
   static constexpr const char* kLibraries = "usr/lib/x86_64-linux-gnu";
@@ -182,7 +182,7 @@ class Redis final : public Peer {
     return fmt::format("*5\r\n$4\r\nXADD\r\n$1\r\ns\r\n$1\r\n*\r\n$1\r\np\r\n${}\r\n{}\r\n",
                        json.size(), json);
   }
-  /// It answers when the entry is in its append-only file.
+  /// Returns at once: the server answers when the entry is in its append-only file.
   void awaitStored(const Server& /*server*/, std::size_t /*messages*/) const override {}
   [[nodiscard]] std::uintmax_t fileBytes(const Server& server) const override {
     std::uintmax_t bytes = 0;
@@ -194,7 +194,7 @@ class Redis final : public Peer {
   }
 
  private:
-  /// A reply is the new entry's name: a length and a text, each a line.
+  /// Each reply is the name of the new entry in two lines: its length and its text.
   static std::size_t CountReplies(std::string& arrived) {
     const auto lines = static_cast<std::size_t>(std::ranges::count(arrived, '\n'));
     std::size_t end = 0;
@@ -208,7 +208,7 @@ class Redis final : public Peer {
   }
 };
 
-/// A syslog daemon that writes what comes in into a file, a line a message. It says nothing.
+/// A syslog daemon that writes one line per message into a file and sends no replies.
 class Syslog : public Peer {
  public:
   using Peer::Peer;
@@ -262,7 +262,7 @@ class Rsyslog final : public Syslog {
                                                     std::int64_t /*number*/) const override {
     return std::make_unique<WireClient>(socket(server), CountMessagePackReplies, SOCK_DGRAM);
   }
-  /// Its local socket takes datagrams, a message each.
+  /// Sends one datagram per message.
   void send(WireClient& client, std::int64_t clientNumber, std::size_t count) const override {
     const std::string message = frame(clientNumber);
     for (std::size_t i = 0; i < count; ++i) {

@@ -12,7 +12,8 @@
 
 namespace quarvel {
 
-/// Something that takes messages from local clients and keeps them: what is measured.
+/// A program under measurement, which takes messages from local clients and stores them. The
+/// benchmark owns its subjects; each `Server` is one running process of a subject.
 class Subject {
  public:
   explicit Subject(std::string name) : name_(std::move(name)) {}
@@ -21,27 +22,27 @@ class Subject {
   Subject& operator=(const Subject&) = delete;
 
   [[nodiscard]] const std::string& name() const { return name_; }
-  /// Whether a client hears that its message was taken; else only the rate can be measured.
+  /// Whether a client gets a reply to each message. Without replies only the rate can be measured.
   [[nodiscard]] virtual bool acknowledges() const { return true; }
-  /// Whether it keeps anything.
+  /// Whether the subject stores messages.
   [[nodiscard]] virtual bool stores() const { return true; }
-  /// Starts a server; returns once it is served.
+  /// Starts a server; returns when it accepts clients.
   [[nodiscard]] std::unique_ptr<Server> start() const;
-  /// Ends a server in order and starts it again on what it has stored; does not wait for it.
+  /// Ends a server in order and starts it again on its stored data, without waiting for the start.
   void restart(Server& server) const;
   /// A client that is ready to send.
   [[nodiscard]] virtual std::unique_ptr<WireClient> connect(const Server& server,
                                                             std::int64_t number) const;
   [[nodiscard]] virtual std::string frame(std::int64_t clientNumber) const;
-  /// Sends as fast as the subject takes it.
+  /// Sends `count` messages as fast as the subject accepts them.
   virtual void send(WireClient& client, std::int64_t clientNumber, std::size_t count) const;
-  /// Returns when so many messages are stored.
+  /// Returns when `messages` messages are stored.
   virtual void awaitStored(const Server& server, std::size_t messages) const;
-  /// The size of what it has stored.
+  /// The size of the stored data in bytes.
   [[nodiscard]] virtual std::uintmax_t fileBytes(const Server& server) const;
 
  protected:
-  /// In the server's process.
+  /// Runs the program in the server's process; does not return.
   virtual void run(const std::filesystem::path& directory) const = 0;
   [[nodiscard]] virtual std::filesystem::path socket(const Server& server) const;
 
@@ -49,11 +50,11 @@ class Subject {
   const std::string name_;
 };
 
-/// The service with one row a message, or with two: the analytics event too.
+/// The service with one row per message, or with two: also the analytics event.
 [[nodiscard]] std::unique_ptr<Subject> ServiceSubject(const std::string& quarveld, int rows);
-/// The bare socket into the same table, or two; with none it is an echo.
+/// The floor: a plain socket in front of the same table, or of two; an echo with `rows` 0.
 [[nodiscard]] std::unique_ptr<Subject> FloorSubject(int rows);
-/// The peers that are installed below `root` ("/" or where packages were unpacked).
+/// The peers that are installed below `root` ("/" or the directory of the unpacked packages).
 [[nodiscard]] std::vector<std::unique_ptr<Subject>> PeerSubjects(const std::filesystem::path& root);
 
 }  // namespace quarvel

@@ -39,7 +39,7 @@ std::string CallFrame(std::uint32_t messageID, std::string_view method,
   MessagePackWriter writer(frame);
   writer.list(4);
   writer.integer(0);
-  // Always five bytes, so that every frame of a kind has one length.
+  // Always five bytes, so that all frames of one kind have the same length.
   frame += '\xce';
   for (int shift = 24; shift >= 0; shift -= 8)
     frame += static_cast<char>(messageID >> shift & 0xff);

@@ -11,32 +11,32 @@
 
 namespace quarvel {
 
-/// Ends the program: what failed, and errno.
+/// Ends the program with the failed operation `what` and errno.
 [[noreturn]] void Fail(const std::string& what);
 
-/// What an audio client reports every few seconds: some 280 bytes on the wire.
+/// A message that audio clients send every few seconds: about 280 bytes on the wire.
 [[nodiscard]] Dictionary TypicalPayload();
-/// A payload of `keys` keys, alike in kind.
+/// A payload of `keys` similar keys.
 [[nodiscard]] Dictionary PayloadOfKeys(std::size_t keys);
 
-/// A request of `count` arguments, which `arguments` writes.
+/// A request with `count` arguments, written by `arguments`.
 [[nodiscard]] std::string CallFrame(std::uint32_t messageID, std::string_view method,
                                     const std::function<void(MessagePackWriter&)>& arguments,
                                     std::size_t count);
-/// Sends `payload` to one session, or to every started one (`reporterID` 0). Every such frame of
-/// one payload and of small ids has the same length.
+/// A request that sends `payload` to one session, or to every started one (`reporterID` 0). All
+/// frames of one payload with small IDs have the same length.
 [[nodiscard]] std::string SendMessageFrame(std::uint32_t messageID, std::int64_t reporterID,
                                            const Dictionary& payload = TypicalPayload());
 
-/// Takes the whole replies off the front of what has arrived and returns how many they were.
+/// Removes the complete replies from the front of the received bytes and returns their number.
 using CountReplies = std::size_t (*)(std::string& arrived);
 [[nodiscard]] std::size_t CountMessagePackReplies(std::string& arrived);
 
-/// A client that costs as little as one can, so that what is measured is the server. Blocks; every
-/// failure ends the program.
+/// A client with minimal cost of its own, so that measurements show the server. Calls block; every
+/// failure ends the program. Used by one thread at a time.
 class WireClient {
  public:
-  /// Tries for ten seconds. `type`: SOCK_STREAM or SOCK_DGRAM.
+  /// Connects, retrying for ten seconds. `type`: SOCK_STREAM or SOCK_DGRAM.
   explicit WireClient(const std::string& path, CountReplies countReplies = CountMessagePackReplies,
                       int type = 1);
   ~WireClient();
@@ -44,12 +44,12 @@ class WireClient {
   WireClient& operator=(const WireClient&) = delete;
 
   void write(std::string_view bytes) const;
-  /// Waits for at least one reply; returns how many are there.
+  /// Waits for at least one reply; returns the number of replies.
   std::size_t readReplies();
   void call(std::string_view method, std::int64_t reporterID, bool answered = true);
   /// Creates and starts a session.
   void startSession(std::int64_t reporterID);
-  /// Sends `frame` so many times with at most `window` of them unanswered.
+  /// Sends `frame` `count` times, with at most `window` requests in flight.
   void pipeline(std::string_view frame, std::size_t count, std::size_t window);
 
  private:

@@ -10,17 +10,18 @@
 namespace quarvel {
 namespace {
 
+/// A tracker without effect, of a call of 280 bytes.
 class Counted final : public CallTracker {
  public:
   [[nodiscard]] std::size_t bytes() const override { return 280; }
-  void ran(std::chrono::nanoseconds /*time*/) override {}
-  void carriedOut() override {}
-  void completed() override {}
+  void blockRan(std::chrono::nanoseconds /*time*/) override {}
+  void callExecuted() override {}
+  void callCompleted() override {}
 };
 
-// One producer to one serial queue, as connections feed the server's queue; timed until the last
-// block has run. First argument: whether each block is queued under a tracker of its own. Second:
-// work of the producer's own between two blocks; slow producers find the queue at rest again.
+// One producer feeds one serial queue, like connections the server queue; the time ends when the
+// last block has run. First argument: whether each block is queued under its own tracker. Second:
+// the producer's work between two blocks; a slow producer finds the queue idle each time.
 void AsyncToSerialQueue(benchmark::State& state) {
   constexpr std::int64_t kBlocks = 1'000'000;
   WorkQueues queues;
@@ -52,7 +53,7 @@ BENCHMARK(AsyncToSerialQueue)
     ->UseRealTime()
     ->MeasureProcessCPUTime();
 
-// There and back between two queues: what a wake-up costs when there is nothing to batch.
+// From one queue to another and back: the cost of a wake-up without batching.
 void PingPong(benchmark::State& state) {
   WorkQueues queues;
   const auto server =

@@ -1,5 +1,5 @@
-"""How export grows with the number of devices: runs fleet-bench against a cluster of three nodes for
-each number, prints a table, and with --svg draws it. `bench/fleet.py BUILD [DEVICES ...] [--rows N]
+"""Measures the export for growing numbers of devices: runs fleet-bench against a cluster of three nodes for
+each number, prints a table, and with --svg draws the table. `bench/fleet.py BUILD [DEVICES ...] [--rows N]
 [--svg FILE]`; the numbers default to 10 20 50 100 200 500."""
 
 import argparse
@@ -13,7 +13,7 @@ import tempfile
 sys.path.insert(0, str(pathlib.Path(__file__).parents[1] / "tests/export"))
 from cluster import Cluster
 
-MEMORY = pathlib.Path("/dev/shm")  # the medium is not what is measured
+MEMORY = pathlib.Path("/dev/shm")  # in memory, so that the medium does not limit the result
 
 
 def cpu_of(process):
@@ -47,7 +47,7 @@ def measured(build, devices, rows):
 
 
 def drawn(results):
-    """Rows a second of the whole fleet over the number of devices, and what a row costs a device."""
+    """The drawing: rows per second of the fleet, and the devices' CPU time per row, by number of devices."""
     width, height, left, top, bottom = 640, 320, 70, 30, 50
     most_devices = max(result["devices"] for result in results)
     plots = [("rows_per_second", "rows a second, the whole fleet", "#1f6f8b"),

@@ -1,4 +1,4 @@
-"""Draws scale-bench's values as one SVG: what a message costs over each number that grows.
+"""Draws scale-bench's values as one SVG: the cost of a message by each growing number.
 
 Usage: plot.py VALUES.csv PICTURE.svg
 """

@@ -120,6 +120,7 @@ class __attribute__((visibility("hidden"))) Client::Channel
     AnyReply reply;
     Code code = Code::none;
   };
+  /// Work of the driver that is due at `time`; dropped when the work no longer exists.
   struct Scheduled {
     Time time;
     std::weak_ptr<Periodic> work;
@@ -129,30 +130,53 @@ class __attribute__((visibility("hidden"))) Client::Channel
   /// A socket that does not block, connected to the service's at `path`. Errors:
   /// `Code::unreachable`; also, unless `mayWait`, while the queue of new connections is full.
   [[nodiscard]] static Result<int> connectTo(const std::string& path, bool mayWait);
+  /// Takes the connected socket over and starts the driver's thread where there is one.
   [[nodiscard]] Outcome begin(int socket) QUARVEL_EXCLUDES(mutex_);
 
+  // Calls, on the caller's thread.
+
+  /// Numbers a call and records its pending reply, or refuses it.
   [[nodiscard]] Sent registerCall(AnyReply&& reply, const SessionCall& session)
       QUARVEL_REQUIRES(mutex_);
+  /// Whether the call may be sent now. While the link is down, records the call's lasting effect; a
+  /// start's `reply` may be kept with its session.
   [[nodiscard]] Code checkCall(const SessionCall& session, AnyReply& reply)
       QUARVEL_REQUIRES(mutex_);
   [[nodiscard]] std::uint32_t nextNumber() QUARVEL_REQUIRES(mutex_);
+  /// Has the driver deliver an error.
   void refuse(AnyReply&& reply, Code code) QUARVEL_REQUIRES(mutex_);
+  /// Appends a call's bytes to the gathered ones; a notification has no number.
   template <class Request>
   void frame(const Request& request, std::optional<std::uint32_t> call) QUARVEL_REQUIRES(mutex_);
 
+  // Output, on the caller's thread or the driver's.
+
+  /// Writes the gathered calls unless a batch, another writer or the driver will; then waits while
+  /// too many bytes have gathered, where that is allowed.
   void sendIfDue() QUARVEL_REQUIRES(mutex_);
   [[nodiscard]] bool hasOutput() const QUARVEL_REQUIRES(mutex_);
+  /// Writes gathered calls, other threads' calls too, for at most `kRounds` rounds. Releases the
+  /// mutex during each system call.
   void write(bool mayWait) QUARVEL_REQUIRES(mutex_);
+  /// Writes `sending_`; `some`: the socket is full and `mayWait` is false.
   [[nodiscard]] Written writeSending(int socket, bool mayWait);
   void watchOutput(bool wanted) QUARVEL_REQUIRES(mutex_);
 
+  /// Whether the driver must write: batches do not hold the bytes back.
   [[nodiscard]] bool hasOutputDue() const QUARVEL_REQUIRES(mutex_);
 
+  // The driver.
+
+  /// The body of the connection's own thread.
   void run() QUARVEL_EXCLUDES(mutex_);
+  /// Waits for events until `deadline` and handles them: input, timers, refusals, output.
   void step(std::optional<Time> deadline) QUARVEL_EXCLUDES(mutex_);
   [[nodiscard]] bool closing() const QUARVEL_EXCLUDES(mutex_);
+  /// Sends the gathered calls, ends the connection and answers every pending call.
   void finish() QUARVEL_EXCLUDES(mutex_);
+  /// Writes as much as the socket takes; true when nothing is left to be sent.
   [[nodiscard]] bool flushed() QUARVEL_EXCLUDES(mutex_);
+  /// In a child process: closes the copies of the descriptors and does nothing else.
   void abandon();
 
   void receiveReplies() QUARVEL_EXCLUDES(mutex_);
@@ -161,11 +185,17 @@ class __attribute__((visibility("hidden"))) Client::Channel
   [[nodiscard]] bool deliverReply(PayloadValue response) QUARVEL_EXCLUDES(mutex_);
   void deliverRefusals() QUARVEL_EXCLUDES(mutex_);
 
+  // Loss and reconnection, on the driver.
+
+  /// Closes the socket, refuses or keeps the pending replies, plans the first attempt, and reports
+  /// the change.
   void handleLoss(const std::string& reason, bool forGood) QUARVEL_EXCLUDES(mutex_);
   [[nodiscard]] std::size_t dropOutput() QUARVEL_REQUIRES(mutex_);
   [[nodiscard]] std::size_t refusePending() QUARVEL_REQUIRES(mutex_);
+  /// The wait before the next attempt, with its jitter; doubles the one after it.
   [[nodiscard]] std::chrono::milliseconds nextDelay();
   void reconnect() QUARVEL_EXCLUDES(mutex_);
+  /// Frames the calls that create the sessions anew; returns their number.
   [[nodiscard]] std::size_t restoreSessions() QUARVEL_REQUIRES(mutex_);
   void runScheduled() QUARVEL_EXCLUDES(mutex_);
   void armTimer() QUARVEL_EXCLUDES(mutex_);
@@ -198,8 +228,8 @@ class __attribute__((visibility("hidden"))) Client::Channel
   std::vector<Scheduled> scheduled_ QUARVEL_GUARDED_BY(mutex_);
 
   // For the thread that has set `writing_`; it releases the mutex to write.
-  std::string sending_;
-  std::size_t sent_ = 0;
+  std::string sending_;   // whole calls
+  std::size_t sent_ = 0;  // bytes of `sending_`
 
   // For the driver alone.
   std::vector<char> received_;

@@ -25,7 +25,7 @@ std::string GroupName(gid_t group) {
   struct group* found = nullptr;
   char buffer[4096];
   if (::getgrgid_r(group, &entry, buffer, sizeof buffer, &found) == 0 && found != nullptr) {
-    return "\"" + std::string(found->gr_name) + "\"";
+    return std::string("\"").append(found->gr_name).append("\"");
   }
   return std::to_string(group);
 }

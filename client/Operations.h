@@ -16,6 +16,8 @@
 
 namespace quarvel::operations {
 
+// Each writes one argument as the wire has it.
+
 template <std::integral Integer>
 void Write(MessagePackWriter& writer, Integer number) {
   writer.integer(number);
@@ -43,6 +45,7 @@ inline void Write(MessagePackWriter& writer, const Recipients& recipients) {
   for (const ReporterID session : *recipients.sessions()) writer.integer(session);
 }
 
+/// One operation with its typed arguments.
 template <class... Arguments>
 struct Request {
   std::string_view operation;
@@ -56,7 +59,8 @@ struct Request {
   }
 };
 
-/// Any operation with any arguments.
+/// Any operation by its full keyword name, with any arguments. Has no lasting effect that the
+/// client knows.
 struct AnyRequest {
   std::string_view operation;
   std::span<const Value> arguments;
@@ -69,6 +73,8 @@ struct AnyRequest {
 };
 
 using Kind = SessionCall::Kind;
+
+// The operations by the first keywords of their names. An argument must outlive the request.
 
 inline Request<ReporterID> Create(const ReporterID& session) {
   return {"createReportingSession:reply:", {Kind::create, session, {}, {}}, std::tie(session)};

@@ -73,6 +73,7 @@ class __attribute__((visibility("hidden"))) RealtimeRing {
   };
   /// The oldest record; none when the ring is empty.
   [[nodiscard]] std::optional<Record> front() const noexcept;
+  /// Frees the oldest record's slot. Precondition: there is a record.
   void pop() noexcept;
 
   // For every thread.

@@ -1,8 +1,8 @@
-# What is installed, in the components that become packages (Packages.cmake): service, tools, library,
+# The installation, in the components that become packages (Packages.cmake): service, tools, library,
 # development.
 include(CMakePackageConfigHelpers)
 
-# The service and what starts it.
+# The service and its units.
 install(TARGETS quarveld RUNTIME DESTINATION ${CMAKE_INSTALL_SBINDIR} COMPONENT service)
 configure_file(packaging/systemd/quarvel.service.in ${PROJECT_BINARY_DIR}/quarvel.service @ONLY)
 install(FILES ${PROJECT_BINARY_DIR}/quarvel.service packaging/systemd/quarvel.socket
@@ -11,7 +11,7 @@ install(FILES packaging/systemd/sysusers.conf
   DESTINATION lib/sysusers.d RENAME quarvel.conf COMPONENT service)
 install(FILES packaging/systemd/tmpfiles.conf
   DESTINATION lib/tmpfiles.d RENAME quarvel.conf COMPONENT service)
-# Configuration is in /etc for what is in /usr, else below the prefix, as --prefix may still say.
+# Configuration is in /etc when the prefix is /usr, else below the prefix, which --prefix may change.
 install(CODE "
   if(CMAKE_INSTALL_PREFIX STREQUAL \"/usr\")
     set(configuration /etc/quarvel)
@@ -30,12 +30,12 @@ install(FILES packaging/completion/quarvelctl.bash
 install(FILES packaging/completion/_quarvelctl
   DESTINATION ${CMAKE_INSTALL_DATADIR}/zsh/vendor-completions COMPONENT tools)
 
-# libquarvel, which others find with CMake's find_package(quarvel) or with pkg-config.
+# libquarvel, found with CMake's find_package(quarvel) or with pkg-config.
 install(TARGETS quarvel EXPORT quarvel LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR}
   COMPONENT library NAMELINK_COMPONENT development)
 install(DIRECTORY client/include/quarvel DESTINATION ${CMAKE_INSTALL_INCLUDEDIR} COMPONENT development)
-# The values that the client's headers speak of. Installed, they include each other as neighbours, so
-# that nobody's include path holds a folder of so common a name as base/.
+# Headers of base/ that the client's headers include. The installed copies include each other as neighbours,
+# so that a user's include path needs no folder of so common a name as base/.
 foreach(HEADER Date Error Json MessagePackForm Payload Value Vocabulary)
   set(INSTALLED ${PROJECT_BINARY_DIR}/include/quarvel/base/${HEADER}.h)
   set_property(DIRECTORY APPEND PROPERTY CMAKE_CONFIGURE_DEPENDS base/${HEADER}.h)

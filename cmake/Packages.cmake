@@ -2,10 +2,10 @@
 set(QUARVEL_PACKAGING ${PROJECT_SOURCE_DIR}/packaging/debian)
 set(CPACK_GENERATOR DEB)
 set(CPACK_PACKAGE_VERSION ${PROJECT_VERSION})
-# Each package has its own.
+# Each package has a summary of its own.
 set(CPACK_PACKAGE_DESCRIPTION_SUMMARY "")
 set(CPACK_PACKAGE_CONTACT "Quarvel maintainers <maintainers@quarvel.example>")
-# The same sources make the same packages, byte for byte: what has a date has the changelog's.
+# The same sources make the same packages, byte for byte: every date is the changelog's.
 file(STRINGS ${QUARVEL_PACKAGING}/changelog CHANGED REGEX "^ -- " LIMIT_COUNT 1)
 string(REGEX REPLACE ".*>  " "" CHANGED "${CHANGED}")
 execute_process(COMMAND date --date=${CHANGED} +%s
@@ -70,7 +70,7 @@ headers, a CMake package and a pkg-config file."
 set(CPACK_COMPONENT_DEVELOPMENT_DEPENDS library)
 include(CPack)
 
-# What is installed compressed; -n leaves out names and times, so that it is the same every time.
+# Compresses a file for the installation; -n leaves out name and time, so that each build makes the same.
 # quarvel_compressed(SOURCE NAME)
 function(quarvel_compressed SOURCE NAME)
   set(COMPRESSED ${PROJECT_BINARY_DIR}/packaging/${NAME}.gz)

@@ -4,12 +4,12 @@
 
 namespace quarvel {
 
-// What the service counts for its status (and for nothing else). From any thread; never waits.
+// Counters of the service, for its status alone. From any thread; never block.
 
-/// A message has been taken from a client, or made by the service itself. From then on it is on its
-/// way, until it has been handed to the telemetry agent (`agentSendMessage`, `sendOneMessage`),
-/// which counts what it takes and what it refuses, or is counted as dropped. So nothing disappears
-/// unnoticed: accepted = stored + waiting + dropped.
+/// Counts a message that was taken from a client, or made by the service itself. The message is in
+/// flight until the telemetry agent gets it (`agentSendMessage`, `sendOneMessage`), which counts
+/// taken and refused messages, or until it is counted as dropped. Every message is accounted for:
+/// accepted = stored + waiting + dropped.
 void CountAcceptedMessage();
 
 /// Why a message never reaches the agent.
@@ -18,13 +18,14 @@ enum class MessageDrop : std::uint8_t {
   testServiceType,  // messages of the service type "test" are not sent
   noSuchSession,    // it was for a session that nobody has
 };
+/// Counts an accepted message that ends here.
 void CountDroppedMessage(MessageDrop reason);
 
-/// What there is now.
+/// Objects that are counted while they exist.
 enum class Gauge : std::uint8_t { clients, sessions, startedSessions };
 void AddToGauge(Gauge gauge, int difference);
 
-/// Counts as one of a kind for as long as it lives.
+/// Adds 1 to a gauge for its own lifetime. A member of the counted object.
 class CountedAs {
  public:
   explicit CountedAs(Gauge gauge) : gauge_(gauge) { AddToGauge(gauge_, 1); }

@@ -6,10 +6,12 @@
 
 namespace quarvel {
 
-// What the device says of itself. Constant for the life of the process; none for a property that
-// the device does not have, or has as another kind.
+// Properties of the device, constant for the life of the process. None when the device does not
+// have the property, or has it as another kind. From any thread; never block.
 
+/// A boolean property, such as "InternalBuild".
 [[nodiscard]] std::optional<bool> DevicePropertyBoolean(std::string_view name);
+/// An integer property, such as "DeviceClassNumber".
 [[nodiscard]] std::optional<std::int64_t> DevicePropertyInteger(std::string_view name);
 
 }  // namespace quarvel

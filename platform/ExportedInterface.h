@@ -17,16 +17,17 @@
 
 namespace quarvel {
 
-/// An object whose operations a connection's client may call.
+/// An object whose operations a connection's client may call. Shared by its connection, which
+/// releases it when it is invalidated; called on the connection's thread.
 class ExportedObject {
  public:
   virtual ~ExportedObject() = default;
 };
 
-/// One operation: how a call's arguments, as they came over the wire, become a typed call.
+/// One operation: turns a call's arguments, as they came over the wire, into a typed call.
 struct ExportedMethod {
   /// Checks the arguments and, when they fit, calls the operation on `object`, which must be of the
-  /// interface's class. Returns what was wrong with them, a sentence, when it did not call.
+  /// interface's class. When they do not fit, returns a sentence that names the fault.
   using Invoke = std::optional<std::string> (*)(const ExportedMethod& method,
                                                 ExportedObject& object,
                                                 std::span<const PayloadValue> arguments,
@@ -49,11 +50,12 @@ struct ExportedInterface {
   [[nodiscard]] const ExportedMethod* find(std::string_view method) const;
 };
 
-// How one argument is read. `decode` returns false when the value is not what `expected` says, and
-// leaves a more precise `fault` where it has one.
+/// Reads one argument of type `T`. `decode` returns false when the value does not fit `expected`, a
+/// noun phrase for the client, and sets `fault` where it can be more precise.
 template <class T>
 struct ExportedArgument;
 
+/// An integer of either sign in the value that fits the parameter's width.
 template <IntegerNumber Integer>
 struct ExportedArgument<Integer> {
   static bool decode(PayloadValue value, Integer& out, std::string& /*fault*/) {
@@ -70,18 +72,21 @@ struct ExportedArgument<Integer> {
   }
 };
 
+/// A dictionary that stays encoded; nil for none.
 template <>
 struct ExportedArgument<std::optional<Payload>> {
   static bool decode(PayloadValue value, std::optional<Payload>& out, std::string& fault);
   static std::string expected();
 };
 
+/// A dictionary as a tree of values; nil for none.
 template <>
 struct ExportedArgument<std::optional<Dictionary>> {
   static bool decode(PayloadValue value, std::optional<Dictionary>& out, std::string& fault);
   static std::string expected();
 };
 
+/// A list of signed 64-bit integers; nil for none.
 template <>
 struct ExportedArgument<std::optional<std::vector<std::int64_t>>> {
   static bool decode(PayloadValue value, std::optional<std::vector<std::int64_t>>& out,
@@ -89,11 +94,12 @@ struct ExportedArgument<std::optional<std::vector<std::int64_t>>> {
   static std::string expected();
 };
 
-/// The sentences for arguments that do not fit.
+/// Sentences for arguments that do not fit; clients read them.
 [[nodiscard]] std::string WrongArgumentCount(const ExportedMethod& method, std::size_t given);
 [[nodiscard]] std::string WrongArgument(const ExportedMethod& method, std::size_t index,
                                         std::string_view expected, std::string_view fault);
 
+/// Implements `ExportedMethod` for one member function of an exported class.
 template <auto Operation>
 struct ExportedOperation;
 
@@ -122,6 +128,7 @@ struct ExportedOperation<Operation> {
   }
 
  private:
+  // Decodes in order and stops at the first argument that does not fit.
   template <std::size_t... Index>
   static void decode(const ExportedMethod& method, std::span<const PayloadValue> arguments,
                      Values& values, std::optional<std::string>& wrong,
@@ -136,8 +143,8 @@ struct ExportedOperation<Operation> {
   }
 };
 
-/// Describes one operation, a member function of the exported class whose last parameter is its
-/// reply.
+/// Describes one operation: a member function of the exported class whose last parameter is its
+/// reply. `name` is a string literal.
 template <auto Operation>
 constexpr ExportedMethod Exported(std::string_view name) {
   return {name, ExportedOperation<Operation>::kArguments, &ExportedOperation<Operation>::invoke};

@@ -8,21 +8,20 @@
 
 namespace quarvel {
 
-// Files of the service. From any thread; these operations wait for the medium.
-// Errors: domain `kFileErrorDomain` (`base/Files.h`), the code is the system's error number, the
-// reason names the path.
+// Files of the service. From any thread; the operations that write block until the medium has
+// answered. Errors: domain `kFileErrorDomain` (`base/Files.h`), the code is the system's error
+// number, the reason names the path.
 
-/// Where the diagnostics directory that the system calls `path` lies on this device.
+/// The path on this device of the diagnostics directory that the system calls `path`.
 [[nodiscard]] std::string DiagnosticsPath(std::string_view path);
 
-/// Makes a directory and those above it that are missing. `path` itself, when it is made, gets
-/// exactly `permissions`; those above get what the process's mask leaves of them. A directory that
-/// exists is left as it is.
+/// Creates a directory and its missing parents. A new `path` gets exactly `permissions`; for new
+/// parents the process's mask is applied to them. An existing directory is left as it is.
 [[nodiscard]] Outcome CreateDirectory(std::string_view path, std::uint32_t permissions);
 
-/// Writes a whole file in one step: whoever opens it, even after a power cut, sees the old content
-/// or the new one, never a part. The directory must exist. A new file may be read by everybody, as
-/// far as the process's mask allows.
+/// Replaces a whole file atomically: a reader sees the old content or the new one, never a part,
+/// even after a power cut. The directory must exist. All users may read a new file, as far as the
+/// process's mask allows.
 [[nodiscard]] Outcome WriteFileAtomically(std::string_view path, std::string_view content);
 
 }  // namespace quarvel

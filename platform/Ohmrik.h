@@ -8,8 +8,8 @@
 
 namespace quarvel {
 
-/// Writes one record to the power log. `options` is always absent. From any thread; neither holds
-/// its caller back nor fails towards it.
+/// Writes a copy of `record` to the power log under `domain` and `name`. `options` is always
+/// absent. From any thread. Never blocks and never fails towards the caller.
 void OhmrikLogRegisteredEvent(std::int32_t domain, std::string_view name, const Payload& record,
                               std::nullptr_t options);
 

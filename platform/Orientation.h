@@ -6,8 +6,8 @@
 
 namespace quarvel {
 
-/// How the device is held, or how its user interface is turned. The numbers are part of what other
-/// programs write; they do not change.
+/// Position of the device, or of its user interface. Other programs write these numbers, so they do
+/// not change.
 enum class Orientation : std::int32_t {
   unknown = 0,
   portrait = 1,            // upright
@@ -18,18 +18,19 @@ enum class Orientation : std::int32_t {
   faceDown = 6,            // lying flat, the screen down
 };
 
-/// "portrait" for `Orientation::portrait` and so on; "unknown" for a number that is none of them.
+/// The enumerator's name: "portrait" for `Orientation::portrait`. "unknown" for any other number.
 [[nodiscard]] std::string_view OrientationName(Orientation orientation);
 
 using OrientationHandler = std::function<void(Orientation)>;
 
-// A handler is registered under an ID; another one under the same ID takes its place. It is told of
-// each change from then on, not of the orientation at that moment. Handlers are called on a thread
-// of the platform, for each kind one at a time. On a device that cannot tell its orientation they
-// are never called. Registering returns at once. When unregistering returns, the handler is not
-// running and will not be called again (a handler that unregisters itself is let finish); so the
-// caller holds no lock that the handler takes. An ID that is not registered is ignored. From any
-// thread.
+// A handler is registered under an ID and replaces an earlier one with the same ID. It is called
+// for each later change, not for the orientation at registration. Handlers run on a platform
+// thread, one at a time for each kind. On a device that does not know its orientation they are
+// never called.
+//
+// Registering returns at once. Unregistering waits until the handler has returned, unless the
+// handler itself unregisters, and the handler is not called again; the caller therefore holds no
+// lock that the handler takes. An unknown ID is ignored. From any thread.
 
 void RegisterDeviceOrientationHandler(std::string_view callbackID, OrientationHandler handler);
 void UnregisterDeviceOrientationHandler(std::string_view callbackID);

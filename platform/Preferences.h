@@ -9,7 +9,7 @@
 
 namespace quarvel {
 
-/// A preferences domain as it was when it was opened: keys to strings, numbers and booleans. A
+/// The content of a preferences domain when it was opened: keys to strings, numbers and booleans. A
 /// value type; one thread at a time.
 class PreferencesDomain {
  public:
@@ -27,11 +27,11 @@ class PreferencesDomain {
   Dictionary entries_;
 };
 
-/// Opens a domain by its name and reads it as it is now; nothing is cached. A domain that does not
-/// exist has no values.
-/// When what is stored cannot be understood, the domain has the values that could last be read,
-/// none if there never were any, and an error line says what is wrong: so a slip of the pen changes
-/// no setting. From any thread; reads a small file at most.
+/// Reads a domain afresh; nothing is cached. A domain that does not exist has no values.
+///
+/// When the stored text is malformed, an error line names the fault and the domain has the values
+/// of its last good version, if any: a typing error changes no setting. From any thread; may block
+/// for the reading of one small file.
 [[nodiscard]] PreferencesDomain OpenPreferencesDomain(std::string_view name);
 
 }  // namespace quarvel

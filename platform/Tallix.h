@@ -10,18 +10,17 @@
 
 namespace quarvel {
 
-// The driver statistics facility: counters that drivers publish, each a channel with a name, in a
-// group and perhaps a subgroup.
+// The driver statistics facility: counters that drivers publish. Each is a channel with a name, in
+// a group and perhaps in a subgroup.
 //
-// Sets, subscriptions and samples are immutable to the caller, shared and opaque; whoever holds a
-// reference may use it from any thread. All operations may be called from any thread. They read
-// what the drivers publish at that moment, which is short (microseconds a channel), and wait for
-// nothing else.
+// Sets, subscriptions and samples are opaque, shared and immutable to the caller. They and all
+// operations may be used from any thread. An operation reads the counters as published at that
+// moment, which takes microseconds a channel, and never blocks otherwise.
 //
-// An operation with `error` leaves it alone when all went well and otherwise fills it; what it then
-// returns may be absent or incomplete, and the caller decides whether to use it.
+// An operation sets `error` on a fault and else leaves it alone. Its result may then be absent or
+// incomplete; the caller decides whether to use it.
 
-/// What `Error::code` says; the domain is `kTallixErrorDomain`.
+/// `Error::code` in the domain `kTallixErrorDomain`.
 enum class TallixErrorCode : std::int64_t {
   unreadableGroups = 1,  // the groups could not be listed: there may be more channels than returned
   channelUnreadable = 2,  // a channel has vanished, or reading it failed
@@ -34,32 +33,32 @@ enum class TallixErrorCode : std::int64_t {
 inline constexpr const char* kTallixErrorDomain = "quarvel.tallix";
 
 class TallixChannelSet;
-/// Channels held open for sampling. Lives as long as a reference to it.
+/// Channels that are held open for sampling, as long as a reference lives.
 class TallixSubscription;
 /// One value for each channel of a subscription.
 class TallixSampleSet;
-/// One channel's value; valid while its sample set is.
+/// One channel's value. Part of its sample set.
 class TallixChannelSample;
 
 using TallixChannels = std::shared_ptr<const TallixChannelSet>;
 using TallixSamples = std::shared_ptr<const TallixSampleSet>;
 
 /// The channels published at this moment. An absent group matches every group; an absent subgroup
-/// matches every subgroup, and the channels that are in none. Absent when the facility knows no
-/// such group or subgroup; empty when it knows it but finds no channel there. Errors:
-/// unreadableGroups.
+/// matches every subgroup, and channels without one. Absent when the facility knows no such group
+/// or subgroup; empty when it knows it but finds no channel there. Errors: unreadableGroups.
 [[nodiscard]] TallixChannels TallixCopyChannelsInGroup(std::optional<std::string_view> group,
                                                        std::optional<std::string_view> subgroup,
                                                        std::optional<Error>& error);
 
+/// The number of channels in a set.
 [[nodiscard]] std::int32_t TallixGetChannelCount(const TallixChannelSet& channels);
 
-/// Subscribes to channels; `subscribedChannels` receives those that can be sampled. One that cannot
-/// be opened is left out, with a log line. Never absent.
+/// Subscribes to channels; `subscribedChannels` receives the ones that can be sampled. A channel
+/// that cannot be opened is left out, with a log line. Never absent.
 [[nodiscard]] std::shared_ptr<TallixSubscription> TallixCreateSubscription(
     const TallixChannels& channels, TallixChannels& subscribedChannels);
 
-/// Reads every subscribed channel now. Absent, with `error`, unless all could be read.
+/// Reads every subscribed channel now. Absent, with `error`, when one cannot be read.
 /// Errors: channelUnreadable, noInteger, integerOutOfRange, notSubscribed.
 [[nodiscard]] TallixSamples TallixCreateSamples(TallixSubscription& subscription,
                                                 const TallixChannels& subscribedChannels,
@@ -71,7 +70,7 @@ using TallixSamples = std::shared_ptr<const TallixSampleSet>;
                                                      const TallixSamples& later,
                                                      std::optional<Error>& error);
 
-/// Calls `visitor` once for each channel sample until it returns something other than 0. The order
+/// Calls `visitor` once for each channel sample until it returns a number other than 0. The order
 /// is by group, subgroup and name, and the same for every sample set of a subscription.
 void TallixIterate(const TallixSampleSet& samples,
                    const std::function<int(const TallixChannelSample&)>& visitor);
@@ -80,6 +79,7 @@ void TallixIterate(const TallixSampleSet& samples,
 [[nodiscard]] std::optional<std::string_view> TallixChannelGetChannelName(
     const TallixChannelSample& sample);
 
+/// The counter's value, or its difference in a delta.
 [[nodiscard]] std::int64_t TallixSimpleGetIntegerValue(const TallixChannelSample& sample);
 
 }  // namespace quarvel

@@ -3,24 +3,24 @@
 namespace quarvel {
 namespace {
 
-// The hold that the running call or block has, and which of the two it is.
-thread_local const CallRef* currentHold = nullptr;
+// The running call's or block's reference, and which of the two runs.
+thread_local const CallRef* currentCall = nullptr;
 thread_local CallScope::Of currentOf = CallScope::Of::call;
 
 }  // namespace
 
 CallRef CallRef::current() {
-  if (currentHold == nullptr) return {};
-  return {currentHold->tracker_, currentOf == CallScope::Of::call};
+  if (currentCall == nullptr) return {};
+  return {currentCall->tracker_, currentOf == CallScope::Of::call};
 }
 
-CallScope::CallScope(Of of, const CallRef& hold) : previous_(currentHold), previousOf_(currentOf) {
-  currentHold = &hold;
+CallScope::CallScope(Of of, const CallRef& call) : previous_(currentCall), previousOf_(currentOf) {
+  currentCall = &call;
   currentOf = of;
 }
 
 CallScope::~CallScope() {
-  currentHold = previous_;
+  currentCall = previous_;
   currentOf = previousOf_;
 }
 

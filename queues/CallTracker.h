@@ -9,11 +9,12 @@
 
 namespace quarvel {
 
-/// Stands for one call of a client for as long as any work that came of it is still to be done.
-/// A block that is queued while a tracker is current holds it until the block has run, and so do
-/// the blocks that this one queues; so a connection knows how much of what it took in is still
-/// waiting anywhere, without the blocks knowing of connections. It is told twice: when the call
-/// itself has been carried out, and when nothing that came of it is left.
+/// Follows the work that one call of a client causes. A block that is queued while a tracker is
+/// current (`CallScope`) refers to it until the block has run, and so do the blocks that this block
+/// queues. The connection thus knows how much of the calls that it read is still unfinished, and
+/// the blocks need not know of connections.
+///
+/// Owner: shared by all references (`CallRef`). Lives until the last block has run.
 class CallTracker {
  public:
   virtual ~CallTracker() = default;
@@ -21,45 +22,44 @@ class CallTracker {
   [[nodiscard]] virtual std::size_t bytes() const = 0;
 
  protected:
-  // On whatever thread it comes to pass on; must not block.
+  // Called on the thread that made the progress; must not block.
 
-  /// One of the call's own blocks has run for so long. Before `carriedOut`.
-  virtual void ran(std::chrono::nanoseconds time) = 0;
-
-  // Each of these is called once.
-
-  /// The call, and the blocks that it queued itself, have run.
-  virtual void carriedOut() = 0;
-  /// The last hold has gone; after `carriedOut`. A hold that is taken later (a delayed block's,
-  /// `TimerThread`) has no effect.
-  virtual void completed() = 0;
+  /// One of the call's own blocks took `time`. Before `callExecuted`.
+  virtual void blockRan(std::chrono::nanoseconds time) = 0;
+  /// The call, and the blocks that it queued itself, have run. Called once.
+  virtual void callExecuted() = 0;
+  /// The last reference has gone. Called once, after `callExecuted`. A reference that is taken
+  /// later (a delayed block's, `TimerThread`) has no effect.
+  virtual void callCompleted() = 0;
 
  private:
   friend class CallRef;
 
   static constexpr std::uint32_t kCompleted = std::uint32_t{1} << 31;
 
-  void hold(bool direct) {
-    holds_.fetch_add(1, std::memory_order_relaxed);
-    if (direct) directHolds_.fetch_add(1, std::memory_order_relaxed);
+  void addReference(bool direct) {
+    references_.fetch_add(1, std::memory_order_relaxed);
+    if (direct) directReferences_.fetch_add(1, std::memory_order_relaxed);
   }
-  void release(bool direct) {
-    if (direct && directHolds_.fetch_sub(1, std::memory_order_acq_rel) == 1) carriedOut();
-    if (holds_.fetch_sub(1, std::memory_order_acq_rel) != 1) return;
-    // Somebody may take hold again just now, and then it is theirs to complete.
+  void removeReference(bool direct) {
+    if (direct && directReferences_.fetch_sub(1, std::memory_order_acq_rel) == 1) callExecuted();
+    if (references_.fetch_sub(1, std::memory_order_acq_rel) != 1) return;
+    // A new reference may be taken just now; then its end completes the call.
     std::uint32_t none = 0;
-    if (holds_.compare_exchange_strong(none, kCompleted, std::memory_order_acq_rel)) completed();
+    if (references_.compare_exchange_strong(none, kCompleted, std::memory_order_acq_rel)) {
+      callCompleted();
+    }
   }
 
-  std::atomic<std::uint32_t> holds_{0};        // plus kCompleted, once it has
-  std::atomic<std::uint32_t> directHolds_{0};  // the call's own, and its own blocks'
+  std::atomic<std::uint32_t> references_{0};        // plus `kCompleted`, once it is
+  std::atomic<std::uint32_t> directReferences_{0};  // the call's own, and its own blocks'
 };
 
-/// Keeps a tracker open. May be empty.
+/// A counted reference that keeps a call from completing. May be empty. Movable between threads.
 class CallRef {
  public:
   CallRef() = default;
-  /// The call's own hold.
+  /// The call's own reference.
   explicit CallRef(std::shared_ptr<CallTracker> tracker) : CallRef(std::move(tracker), true) {}
   CallRef(CallRef&& other) noexcept : tracker_(std::move(other.tracker_)), direct_(other.direct_) {}
   CallRef& operator=(CallRef&& other) noexcept {
@@ -70,19 +70,19 @@ class CallRef {
   CallRef(const CallRef&) = delete;
   CallRef& operator=(const CallRef&) = delete;
   ~CallRef() {
-    if (tracker_) tracker_->release(direct_);
+    if (tracker_) tracker_->removeReference(direct_);
   }
 
   [[nodiscard]] const std::shared_ptr<CallTracker>& tracker() const { return tracker_; }
-  /// Whether it is of a call, or of a block that the call queued itself.
+  /// Whether it belongs to the call, or to a block that the call queued itself.
   [[nodiscard]] bool isDirect() const { return direct_ && tracker_ != nullptr; }
-  /// The block that held this has run for so long.
-  void ran(std::chrono::nanoseconds time) const { tracker_->ran(time); }
+  /// Precondition: not empty. The block with this reference took `time`.
+  void blockRan(std::chrono::nanoseconds time) const { tracker_->blockRan(time); }
   explicit operator bool() const { return tracker_ != nullptr; }
 
-  /// A further hold on the tracker that is current on this thread; empty when none is.
+  /// A further reference to the tracker that is current on this thread; empty when none is.
   [[nodiscard]] static CallRef current();
-  /// A further hold for work that came of a block.
+  /// A further reference for work that a block caused.
   [[nodiscard]] static CallRef indirect(std::shared_ptr<CallTracker> tracker) {
     return {std::move(tracker), false};
   }
@@ -90,20 +90,21 @@ class CallRef {
  private:
   CallRef(std::shared_ptr<CallTracker> tracker, bool direct)
       : tracker_(std::move(tracker)), direct_(direct) {
-    if (tracker_) tracker_->hold(direct_);
+    if (tracker_) tracker_->addReference(direct_);
   }
 
   std::shared_ptr<CallTracker> tracker_;
   bool direct_ = false;
 };
 
-/// Makes a tracker (or none) current on this thread for a scope.
+/// Makes a tracker (or none) current on this thread for a scope. Owner: the stack; `call` outlives
+/// it.
 class CallScope {
  public:
-  /// Who runs in the scope: the call itself, whose blocks are part of carrying it out, or a block,
-  /// whose further blocks are not.
+  /// The code that runs in the scope: the call itself, whose blocks are part of executing it, or a
+  /// block, whose further blocks are not.
   enum class Of : std::uint8_t { call, block };
-  CallScope(Of of, const CallRef& hold);
+  CallScope(Of of, const CallRef& call);
   ~CallScope();
   CallScope(const CallScope&) = delete;
   CallScope& operator=(const CallScope&) = delete;

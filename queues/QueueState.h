@@ -29,7 +29,7 @@ struct WorkItem {
       block();
       block = Block();
     }
-    if (isTimed) tracker.ran(Clock::now() - began);
+    if (isTimed) tracker.blockRan(Clock::now() - began);
     tracker = CallRef();
   }
 };

@@ -10,15 +10,6 @@
 
 namespace quarvel {
 
-namespace {
-
-/// With what it takes to come here, half of the time after which what was answered is stored.
-constexpr std::chrono::nanoseconds kTimeToCommit = std::chrono::milliseconds{4};
-/// In a shorter transaction the rows are not what takes the time.
-constexpr std::size_t kFewestRows = 128;
-
-}  // namespace
-
 void StoreQueue::Tally::add(const StoreRow& row) {
   ++rows;
   bytes += StoreBatch::bytes(row);
@@ -26,16 +17,15 @@ void StoreQueue::Tally::add(const StoreRow& row) {
 }
 
 bool StoreQueue::hasRoom() const {
-  return outstanding_.rows < std::min(rowsInTime_, maximumRows_) &&
-         outstanding_.bytes < maximumBytes_;
+  return outstanding_.rows < depth_.rows() && outstanding_.bytes < maximumBytes_;
 }
 
 void StoreQueue::awaitRoom() {
   if (closed_ || hasRoom() || !BlockingScope::isAllowed()) return;
   const BlockingScope blocking;
-  ++heldBack_;
-  while (!closed_ && !hasRoom()) roomCame_.wait(mutex_);
-  --heldBack_;
+  ++waitingSenders_;
+  while (!closed_ && !hasRoom()) roomFree_.wait(mutex_);
+  --waitingSenders_;
 }
 
 Error StoreQueue::refuse(std::uint64_t counted) {
@@ -65,19 +55,19 @@ void StoreQueue::appended() {
     ++counters_.accepted;
     ++counters_.waiting;
   }
-  if (writerWaits_) rowsCame_.notifyOne();
+  if (writerWaits_) hasRows_.notifyOne();
 }
 
 void StoreQueue::close() {
   MutexLock lock(mutex_);
   if (!closed_) {
-    const std::int64_t onTheirWay = onTheirWay_.exchange(0);
+    const std::int64_t unqueued = unqueued_.exchange(0);
     dropAccepted(StoreDrop::serviceEnded,
-                 static_cast<std::uint64_t>(std::max(onTheirWay, std::int64_t{0})));
+                 static_cast<std::uint64_t>(std::max(unqueued, std::int64_t{0})));
   }
   closed_ = true;
-  rowsCame_.notifyAll();
-  roomCame_.notifyAll();
+  hasRows_.notifyAll();
+  roomFree_.notifyAll();
   closing_.notifyAll();
 }
 
@@ -94,9 +84,9 @@ StoreQueue::Take StoreQueue::take(StoreBatch& batch, std::optional<Instant> dead
     writerWaits_ = true;
     bool inTime = true;
     if (deadline) {
-      inTime = rowsCame_.waitUntil(mutex_, *deadline);
+      inTime = hasRows_.waitUntil(mutex_, *deadline);
     } else {
-      rowsCame_.wait(mutex_);
+      hasRows_.wait(mutex_);
     }
     writerWaits_ = false;
     if (!inTime && waiting_.rows().empty() && !closed_) return Take::deadline;
@@ -110,7 +100,7 @@ StoreQueue::Take StoreQueue::take(StoreBatch& batch, std::optional<Instant> dead
 void StoreQueue::call() {
   MutexLock lock(mutex_);
   called_ = true;
-  if (writerWaits_) rowsCame_.notifyOne();
+  if (writerWaits_) hasRows_.notifyOne();
 }
 
 bool StoreQueue::waitForClose(Instant deadline) {
@@ -126,22 +116,14 @@ void StoreQueue::release(const Tally& tally) {
   outstanding_.bytes -= tally.bytes;
   outstanding_.counted -= tally.counted;
   counters_.waiting -= tally.counted;
-  if (heldBack_ > 0 && hasRoom()) roomCame_.notifyAll();
+  if (waitingSenders_ > 0 && hasRoom()) roomFree_.notifyAll();
 }
 
 void StoreQueue::committed(const Tally& tally, std::chrono::nanoseconds time) {
   MutexLock lock(mutex_);
   counters_.stored += tally.counted;
-  if (tally.rows >= kFewestRows) learn(tally.rows, time);
+  depth_.committed(tally.rows, time);
   release(tally);
-}
-
-void StoreQueue::learn(std::size_t rows, std::chrono::nanoseconds time) {
-  const std::int64_t longest = kTimeToCommit.count() / static_cast<std::int64_t>(kFewestRows);
-  const std::int64_t rowTime =
-      std::clamp(time.count() / static_cast<std::int64_t>(rows), std::int64_t{1}, longest);
-  rowTime_ = rowTime_ == 0 ? rowTime : (3 * rowTime_ + rowTime) / 4;
-  rowsInTime_ = static_cast<std::size_t>(kTimeToCommit.count() / rowTime_);
 }
 
 void StoreQueue::lost(const Tally& tally) {
@@ -155,7 +137,7 @@ void StoreQueue::restart(std::uint64_t stored, const StoreDrops& kept) {
   counters_.stored = stored;
   for (const StoreDrop reason : kDropsFromStore) counters_.dropped[reason] = kept[reason];
   for (const StoreDrop reason : kDropsBeforeStore) {
-    // What is here and not there has not been kept yet.
+    // A drop since the last commit is not recorded in the database yet.
     counters_.dropped[reason] = std::max(counters_.dropped[reason], kept[reason]);
   }
   counters_.accepted = stored + counters_.waiting + counters_.dropped.sum();
@@ -170,9 +152,9 @@ void StoreQueue::droppedFromStore(StoreDrop reason, std::uint64_t rows) {
 StoreCounters StoreQueue::counters() const {
   MutexLock lock(mutex_);
   StoreCounters counters = counters_;
-  const auto onTheirWay = static_cast<std::uint64_t>(std::max(onTheirWay_.load(), std::int64_t{0}));
-  counters.accepted += onTheirWay;
-  counters.waiting += onTheirWay;
+  const auto unqueued = static_cast<std::uint64_t>(std::max(unqueued_.load(), std::int64_t{0}));
+  counters.accepted += unqueued;
+  counters.waiting += unqueued;
   return counters;
 }
 

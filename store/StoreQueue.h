@@ -11,25 +11,27 @@
 
 #include "base/Error.h"
 #include "base/Mutex.h"
+#include "quotas/FlowControl.h"
 #include "store/StoreBatch.h"
 #include "store/database/StoreCounters.h"
 
 namespace quarvel {
 
-/// Between any number of senders and the store's writer: bounded, first come, first served. A row
-/// counts against the bounds until it is committed or lost. There may be as many rows as are
-/// committed in a few milliseconds, however slow the machine, so that what is here is soon safe
-/// from the end of the process.
+/// Queue of rows from any number of senders to the store's writer, in order. Bounded by rows
+/// (`StoreDepth`) and bytes; a row counts until it is committed or lost. A sender waits for room.
+/// Owner: `TelemetryStore`. Threads: any; one lock.
 class StoreQueue {
  public:
   using Instant = StoreBatch::Instant;
 
   StoreQueue(std::size_t maximumRows, std::size_t maximumBytes)
-      : maximumRows_(maximumRows), maximumBytes_(maximumBytes), rowsInTime_(maximumRows) {}
+      : maximumBytes_(maximumBytes), depth_(maximumRows) {}
 
-  /// Any thread. Holds the caller back while either bound is reached, so that the bound on bytes
-  /// may be passed by one row; but lets one pass that must not wait (`BlockingScope`). Errors: the
-  /// queue is closed, also while the caller was held back; the row is larger than any may be.
+  // Any thread.
+
+  /// Blocks while either bound is reached; the bound on bytes may be passed by one row. A caller
+  /// that must not block (`BlockingScope`) passes the bounds. Errors: the queue is closed, also
+  /// while the caller waited; the row is larger than `kMostRowBytes`.
   template <class Row>
   Outcome push(Row&& row, std::initializer_list<std::string_view> texts) QUARVEL_EXCLUDES(mutex_) {
     const bool tooLarge = IsTooLarge(row, texts);
@@ -40,8 +42,8 @@ class StoreQueue {
     return Success();
   }
 
-  /// As `push`, but where that would hold the caller back it does nothing and returns false. True
-  /// also when the row is refused.
+  /// As `push`, but where that would block it does nothing and returns false. True also when the
+  /// row is refused.
   template <class Row>
   [[nodiscard]] bool pushIfRoom(Row&& row, std::initializer_list<std::string_view> texts)
       QUARVEL_EXCLUDES(mutex_) {
@@ -57,7 +59,8 @@ class StoreQueue {
     return true;
   }
 
-  /// As `push`, but never holds the caller back: for the few rows that everything else rests on.
+  /// As `push`, but never blocks and passes the bounds: for agent sessions, flushes, exports and
+  /// erasures, which are few.
   template <class Row>
   Outcome pushAtOnce(Row&& row, std::initializer_list<std::string_view> texts)
       QUARVEL_EXCLUDES(mutex_) {
@@ -68,30 +71,32 @@ class StoreQueue {
     return Success();
   }
 
-  // What never was a row. Any thread; never holds the caller back.
+  // Counts of messages that are accepted and not pushed yet. Any thread; never blocks.
 
-  /// Counts a message that is on its way to the queue, until it has `arrived`: pushed, or refused.
-  void countAccepted() { ++onTheirWay_; }
-  void countQueued() { --onTheirWay_; }
-  /// It will not arrive.
+  void countAccepted() { ++unqueued_; }
+  /// An accepted message was pushed or refused.
+  void countQueued() { --unqueued_; }
+  /// An accepted message will not be pushed.
   void countDropped(StoreDrop reason) QUARVEL_EXCLUDES(mutex_);
 
-  /// Takes no more rows and wakes everybody; what is still on its way is counted as dropped. Any
-  /// thread.
+  /// Refuses further rows and wakes every waiting thread; messages that are accepted and not pushed
+  /// count as dropped. Any thread.
   void close() QUARVEL_EXCLUDES(mutex_);
   [[nodiscard]] bool isClosed() const QUARVEL_EXCLUDES(mutex_);
 
-  // The rest is the writer's.
+  // The writer's, except where any thread is named.
 
   enum class Take : std::uint8_t { rows, called, deadline, closed };
-  /// Exchanges the rows that wait for the empty `batch`. Waits for rows until `deadline`, if there
-  /// is one, or somebody calls; `closed` once the queue is closed and empty.
+  /// Exchanges the queued rows for the empty `batch`. Blocks until there are rows, `call` was
+  /// called or `deadline`, if there is one, has passed; `closed` once the queue is closed and
+  /// empty.
   Take take(StoreBatch& batch, std::optional<Instant> deadline) QUARVEL_EXCLUDES(mutex_);
-  /// Has the writer look up, although no rows have come. Any thread.
+  /// Has `take` return without rows, once. Any thread.
   void call() QUARVEL_EXCLUDES(mutex_);
-  /// Waits until `deadline`, whatever is queued meanwhile; returns early, and true, when closed.
+  /// Blocks until `deadline`, also when rows are queued; returns early, and true, when closed.
   [[nodiscard]] bool waitForClose(Instant deadline) QUARVEL_EXCLUDES(mutex_);
 
+  /// Amounts that count against the bounds; `counted` of the rows are counted from acceptance on.
   struct Tally {
     std::size_t rows = 0;
     std::size_t bytes = 0;
@@ -99,25 +104,29 @@ class StoreQueue {
 
     void add(const StoreRow& row);
   };
-  // Makes room: rows that were taken are now in the database, which took so long, or lost.
+  // Makes room: rows that were taken are now in the database, in a transaction of `time`, or lost.
   void committed(const Tally& tally, std::chrono::nanoseconds time) QUARVEL_EXCLUDES(mutex_);
   void lost(const Tally& tally) QUARVEL_EXCLUDES(mutex_);
 
-  /// Counts from what the opened database holds, and from the drops that it keeps.
+  /// Takes over the counts of the opened database: its rows, and the drops that it has recorded.
   void restart(std::uint64_t stored, const StoreDrops& kept) QUARVEL_EXCLUDES(mutex_);
+  /// Stored rows were removed from the database: they count as dropped instead of stored.
   void droppedFromStore(StoreDrop reason, std::uint64_t rows) QUARVEL_EXCLUDES(mutex_);
 
   [[nodiscard]] StoreCounters counters() const QUARVEL_EXCLUDES(mutex_);
-  /// What counts against the bounds now.
+  /// Rows and bytes that count against the bounds now.
   [[nodiscard]] Tally outstanding() const QUARVEL_EXCLUDES(mutex_);
 
  private:
+  /// Whether both bounds allow a further row.
   [[nodiscard]] bool hasRoom() const QUARVEL_REQUIRES(mutex_);
+  /// Blocks until `hasRoom` or the end, where the calling thread may block.
   void awaitRoom() QUARVEL_REQUIRES(mutex_);
+  /// Counts a refused row (`counted` is 0 or 1) and tells why it is refused.
   Error refuse(std::uint64_t counted) QUARVEL_REQUIRES(mutex_);
   void dropAccepted(StoreDrop reason, std::uint64_t rows) QUARVEL_REQUIRES(mutex_);
+  /// Rows no longer count against the bounds.
   void release(const Tally& tally) QUARVEL_REQUIRES(mutex_);
-  void learn(std::size_t rows, std::chrono::nanoseconds time) QUARVEL_REQUIRES(mutex_);
 
   template <class Row>
   void append(Row&& row, std::initializer_list<std::string_view> texts) QUARVEL_REQUIRES(mutex_) {
@@ -127,25 +136,22 @@ class StoreQueue {
   }
   void appended() QUARVEL_REQUIRES(mutex_);
 
-  const std::size_t maximumRows_;
   const std::size_t maximumBytes_;
 
-  std::atomic<std::int64_t> onTheirWay_ = 0;
+  std::atomic<std::int64_t> unqueued_ = 0;  // messages that are not pushed yet
 
   mutable Mutex mutex_;
-  ConditionVariable rowsCame_;  // for the writer
-  ConditionVariable roomCame_;  // for senders
-  ConditionVariable closing_;   // for the writer while it waits for room on the disk
+  ConditionVariable hasRows_;   // the writer waits
+  ConditionVariable roomFree_;  // senders wait
+  ConditionVariable closing_;   // the writer waits for space on the disk
   bool closed_ QUARVEL_GUARDED_BY(mutex_) = false;
   bool writerWaits_ QUARVEL_GUARDED_BY(mutex_) = false;
   bool called_ QUARVEL_GUARDED_BY(mutex_) = false;
-  std::size_t heldBack_ QUARVEL_GUARDED_BY(mutex_) = 0;
+  std::size_t waitingSenders_ QUARVEL_GUARDED_BY(mutex_) = 0;
   StoreBatch waiting_ QUARVEL_GUARDED_BY(mutex_);
-  Tally outstanding_ QUARVEL_GUARDED_BY(mutex_);         // queued, or taken and not yet committed
-  std::int64_t rowTime_ QUARVEL_GUARDED_BY(mutex_) = 0;  // of a commit, in nanoseconds; 0: unknown
-  std::size_t rowsInTime_ QUARVEL_GUARDED_BY(mutex_);
-  StoreCounters counters_  // without what is on its way
-      QUARVEL_GUARDED_BY(mutex_);
+  Tally outstanding_ QUARVEL_GUARDED_BY(mutex_);  // queued, or taken and not yet committed
+  StoreDepth depth_ QUARVEL_GUARDED_BY(mutex_);
+  StoreCounters counters_ QUARVEL_GUARDED_BY(mutex_);  // without `unqueued_`
 };
 
 }  // namespace quarvel

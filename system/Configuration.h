@@ -94,7 +94,6 @@ struct Configuration {
     std::size_t queuedCalls = 256;            // of one client
     std::size_t queuedBytes = 4'194'304;      // likewise
     std::size_t connections = 4096;           // of all clients
-    std::size_t firstTurn = 16;  // queued calls executed in a row at first; no key sets it
   } limits;
 
   /// The file's name in the configuration directory.

@@ -1,4 +1,4 @@
-"""Holds the rules about which folder may include what. Run with the repository's root."""
+"""Checks which folder includes which headers. Usage: include_rules.py ROOT"""
 
 import pathlib
 import re

@@ -1,5 +1,6 @@
-"""Holds comments and pages to plain English: few free relatives and indefinite persons, and no long
-sentence. Run with the repository's root, and with paths to list what stands in them instead."""
+"""Checks comments and pages for plain English: few free relatives and indefinite pronouns, no long sentence.
+
+Usage: prose.py ROOT [PATH ...]; with paths, lists every counted word below them."""
 
 import pathlib
 import re
@@ -18,11 +19,11 @@ SKIPPED = ("build/", "demo/", ".git/", "tests/fuzz/seeds/", "tests/fuzz/regressi
 
 
 def blocks_of_code(text):
-    """Comments of C++: each run of // lines is one block, and so is each /* */."""
+    """Comments of C++ and JavaScript: each run of // lines is one block, and so is each /* */."""
     text = re.sub(r'R"(\w*)\(.*?\)\1"', lambda found: "\n" * found[0].count("\n"), text, flags=re.S)
     block, start = [], 0
     for number, line in enumerate(text.splitlines(), 1):
-        found = re.match(r'(?:[^"/]|"(?:[^"\\]|\\.)*"|/(?!/))*//[/!]?<?(.*)$', line)
+        found = re.match(r'(?:[^"/]|"(?:[^"\\]|\\.)*"|\'"\'|/(?!/))*//[/!]?<?(.*)$', line)
         own = found and not line[:found.start(1)].strip(" /!<")
         if block and not own:
             yield start, "\n".join(block)
@@ -35,22 +36,30 @@ def blocks_of_code(text):
                 block = []
     if block:
         yield start, "\n".join(block)
-    for found in re.finditer(r"/\*(.*?)\*/", text, re.S):
-        yield text.count("\n", 0, found.start()) + 1, re.sub(r"(?m)^\s*\*", "", found[1])
+    # Neither a string nor a // comment opens a comment of the other kind.
+    for found in re.finditer(r'"(?:[^"\\\n]|\\.)*"|//[^\n]*|/\*(.*?)\*/', text, re.S):
+        if found[1]:
+            yield text.count("\n", 0, found.start()) + 1, re.sub(r"(?m)^\s*\*", "", found[1])
 
 
 def blocks_of_hash(text):
+    """Runs of # lines, comments behind code, and Python's docstrings; no other string."""
     block, start = [], 0
     for number, line in enumerate([*text.splitlines(), ""], 1):
-        found = re.match(r"\s*#(?!!)\s?(.*)$", line)
-        if found:
+        own = re.match(r"\s*#(?!!)\s?(.*)$", line)
+        behind = re.match(r"""(?:[^"'#]|"(?:[^"\\]|\\.)*"|'[^']*')*\S.*\s#\s+(.*)$""", line)
+        if own:
             start = start if block else number
-            block.append(found[1])
-        elif block:
+            block.append(own[1])
+            continue
+        if block:
             yield start, "\n".join(block)
             block = []
-    for found in re.finditer(r'"""(.*?)"""', text, re.S):
-        yield text.count("\n", 0, found.start()) + 1, found[1]
+        if behind:
+            yield number, behind[1]
+    for found in re.finditer(r'([^\n]*?)"""(.*?)"""', text, re.S):
+        if not found[1].strip():
+            yield text.count("\n", 0, found.start(2)) + 1, found[2]
 
 
 def blocks_of_page(text):

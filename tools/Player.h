@@ -40,6 +40,7 @@ class Player {
     bool closing QUARVEL_GUARDED_BY(mutex) = false;
   };
 
+  // Each plays one step. Errors as `play`.
   [[nodiscard]] Outcome playCall(const script::Call& call);
   [[nodiscard]] Outcome playExpect(const script::Expect& expect);
   [[nodiscard]] Outcome checkConnection() const;

@@ -36,6 +36,7 @@ struct Expect {
 
 using Action = std::variant<Call, Sleep, Expect>;
 
+/// An action with its place in the file, for the text of a fault.
 struct Step {
   std::size_t line;  // counted from 1
   Action action;

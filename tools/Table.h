@@ -27,6 +27,7 @@ class Table {
   void print();
 
  private:
+  /// The columns' widths, cut so that a line fits the terminal.
   [[nodiscard]] std::vector<std::size_t> fittedWidths() const;
   void printLine(const std::vector<std::string>& cells, const std::vector<std::size_t>& widths,
                  bool heading);

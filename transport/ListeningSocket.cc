@@ -25,7 +25,7 @@ Error Failure(std::string reason) {
   return Error::because("quarvel.listener", 1, std::move(reason));
 }
 
-/// Precondition: `errno` says why.
+/// Precondition: `errno` is set.
 Error SystemFailure(const std::filesystem::path& path, const char* what) {
   const int code = errno;
   return Failure(
@@ -35,14 +35,14 @@ Error SystemFailure(const std::filesystem::path& path, const char* what) {
 Outcome MakeDirectory(const std::filesystem::path& directory) {
   std::error_code error;
   std::filesystem::create_directories(directory.parent_path(), error);
-  // A parent that could not be made shows here as well, with the reason that matters.
+  // A parent that could not be made fails here too, with the error that the log needs.
   if (::mkdir(directory.c_str(), kDirectoryMode) != 0 && errno != EEXIST) {
     return SystemFailure(directory, "cannot make the directory");
   }
   return Success();
 }
 
-/// Makes way at `path`: nothing stands there, or a socket file that nobody listens at.
+/// Succeeds when `path` is free, or held a stale socket file, which is removed.
 Outcome RemoveStaleSocket(const std::filesystem::path& path, const sockaddr_un& address) {
   struct stat status {};
   if (::lstat(path.c_str(), &status) != 0) {
@@ -51,8 +51,8 @@ Outcome RemoveStaleSocket(const std::filesystem::path& path, const sockaddr_un& 
   if (!S_ISSOCK(status.st_mode)) {
     return Failure(fmt::format("{}: there is a file that is no socket", path.native()));
   }
-  // A datagram socket asks whether anybody is there without becoming a client: a stream socket in
-  // use refuses it for its type, one that nobody has open refuses the connection.
+  // Probed with a datagram socket, which never becomes a client: a stream socket in use refuses it
+  // for its type, a closed one refuses the connection.
   const UniqueDescriptor probe(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
   if (!probe) return SystemFailure(path, "cannot be probed");
   const int refused =
@@ -93,7 +93,7 @@ Result<ListeningSocket> ListeningSocket::listeningAt(const std::filesystem::path
 
   const std::filesystem::path directory = std::filesystem::absolute(path).parent_path();
   if (auto made = MakeDirectory(directory); !made) return std::move(made.error());
-  // Held from the probe until the socket listens, so that two services cannot both find it stale.
+  // Locked from the probe until the socket listens, so that two services cannot both find it stale.
   const UniqueDescriptor lock(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (!lock || ::flock(lock.get(), LOCK_EX) != 0) {
     return SystemFailure(directory, "cannot be locked");
@@ -103,7 +103,8 @@ Result<ListeningSocket> ListeningSocket::listeningAt(const std::filesystem::path
   ListeningSocket socket;
   socket.descriptor_ =
       UniqueDescriptor(::socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0));
-  // The mode is set before the file is there, and once more in case the umask takes from it.
+  // The mode is set before the file exists, so that it is never too open, and once more since the
+  // umask may have removed bits.
   if (!socket.descriptor_ || ::fchmod(socket.descriptor(), kSocketMode) != 0 ||
       ::bind(socket.descriptor(), reinterpret_cast<const sockaddr*>(&address), sizeof address) !=
           0) {

@@ -7,26 +7,25 @@
 
 namespace quarvel {
 
-/// What has arrived of one client and is not decoded yet, in one piece. Grows as bytes arrive, to
-/// no more than twice what it holds, and gives the memory back when what made it grow has been
-/// taken. Bytes are moved only to make room, so bytes that trickle in are moved a constant number
-/// of times. Not synchronised.
+/// Bytes of one client that have arrived and are not decoded yet, contiguous. The block grows to at
+/// most twice the bytes held and shrinks again after a large message. Bytes are moved only to make
+/// room, so a message that trickles in is moved a constant number of times.
+/// Owner: the connection. Thread: the I/O thread; not synchronised.
 class ReadBuffer {
  public:
-  /// No smaller block is ever taken; what a read of a busy client brings.
+  /// The smallest block, 32 KiB: one read of a busy client.
   static constexpr std::size_t kSmallest = std::size_t{32} * 1024;
 
   [[nodiscard]] std::string_view bytes() const { return {block_.get() + begin_, end_ - begin_}; }
   [[nodiscard]] bool empty() const { return begin_ == end_; }
 
-  /// Where the next bytes are to be written: room for an eighth of `kSmallest` at least. Moves the
-  /// bytes.
+  /// Free space for the next read, an eighth of `kSmallest` at least. Invalidates `bytes`.
   [[nodiscard]] std::span<char> room();
   /// The first `count` bytes of the room have been written.
   void arrived(std::size_t count) { end_ += count; }
-  /// The first `count` bytes are done with.
+  /// Removes the first `count` bytes. Precondition: so many are held.
   void consume(std::size_t count);
-  /// Gives all memory back; precondition: empty. For a client that has nothing to say for now.
+  /// Frees the block, for an idle client. Precondition: empty.
   void release();
 
  private:

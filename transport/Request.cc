@@ -14,7 +14,7 @@ constexpr const char* kErrorDomain = "quarvel.connection";
 constexpr std::int64_t kUnknownMethod = 1;
 constexpr std::int64_t kBadArguments = 2;
 
-/// A method name that came from a stranger, fit to be shown: plain ASCII of a bounded length.
+/// A client's method name for a reply and the log: plain ASCII, 80 characters at most.
 std::string Printable(std::string_view text) {
   constexpr std::size_t kShown = 80;
   std::string shown(text.substr(0, kShown));
@@ -61,7 +61,7 @@ std::optional<Request> Request::from(PayloadValue frame, std::string_view& fault
 }
 
 Error UnknownMethodError(const ExportedInterface* interface, std::string_view method) {
-  // Who calls in error calls often: this is not to be dearer than a call.
+  // A faulty client repeats its call, so this must not cost more than a good call.
   std::string known;
   known.reserve(1024);
   if (interface != nullptr) {

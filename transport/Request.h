@@ -10,18 +10,20 @@
 
 namespace quarvel {
 
-/// One MessagePack-RPC call as it stands in the read buffer, which must outlive it: a request
-/// `[0, message id, method, params]` or a notification `[2, method, params]`.
+/// One MessagePack-RPC call: a request `[0, message id, method, params]` or a notification
+/// `[2, method, params]`. Refers to the read buffer, which must outlive it.
 struct Request {
   std::optional<std::uint32_t> messageID;  // none for a notification
   std::string_view method;                 // not checked: any octets
   PayloadValue params;                     // a list
 
-  /// None when the value is neither; `fault` then says in a literal what is wrong.
+  /// None when `frame` is neither: the connection is then ended. `fault` is a literal that names
+  /// the error, for the log.
   [[nodiscard]] static std::optional<Request> from(PayloadValue frame, std::string_view& fault);
 };
 
-// What a well-formed call is answered with when it cannot be made: domain "quarvel.connection".
+// Answers to a well-formed call that cannot be made: domain "quarvel.connection", with a reason
+// that tells the allowed values.
 [[nodiscard]] Error UnknownMethodError(const ExportedInterface* interface, std::string_view method);
 [[nodiscard]] Error BadArgumentsError(std::string reason);
 

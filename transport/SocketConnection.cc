@@ -18,13 +18,9 @@ using std::chrono::steady_clock;
 
 namespace {
 
-/// One client's calls are taken in for so long before the others have their turn, looked at every
-/// few calls. Those for which the server queue has work stop earlier, at the desk.
-constexpr std::chrono::microseconds kLongestTurn{200};
-constexpr unsigned kCallsPerLook = 16;
-
-/// The store commits far more often than this.
-constexpr std::chrono::milliseconds kSlowBehind{50};
+FlowInstant Now() {
+  return steady_clock::now();
+}
 
 std::int32_t PeerProcessIdentifier(int socket) {
   ucred peer{};
@@ -33,7 +29,31 @@ std::int32_t PeerProcessIdentifier(int socket) {
   return peer.pid;
 }
 
+/// The begin or the end of a connection, while blocks that it caused are unfinished.
+class ConnectionChange final : public CallTracker {
+ public:
+  explicit ConnectionChange(std::shared_ptr<ConnectionContext> context)
+      : context_(std::move(context)) {
+    context_->churn.changeBegun();
+  }
+  [[nodiscard]] std::size_t bytes() const override { return 0; }
+
+ protected:
+  void blockRan(std::chrono::nanoseconds /*time*/) override {}
+  void callExecuted() override {}
+  void callCompleted() override {
+    if (context_->churn.changeEnded()) context_->acceptAgain();
+  }
+
+ private:
+  const std::shared_ptr<ConnectionContext> context_;
+};
+
 }  // namespace
+
+CallRef ConnectionContext::trackConnectionChange() {
+  return CallRef(std::make_shared<ConnectionChange>(shared_from_this()));
+}
 
 SocketConnection::SocketConnection(std::shared_ptr<ConnectionContext> context, std::uint64_t number)
     : context_(std::move(context)),
@@ -42,7 +62,7 @@ SocketConnection::SocketConnection(std::shared_ptr<ConnectionContext> context, s
       scanner_(context_->limits.messageBytes, context_->limits.depth),
       frameTimer_(context_->io),
       stallTimer_(context_->io),
-      behindTimer_(context_->io) {}
+      slowCallsTimer_(context_->io) {}
 
 std::shared_ptr<SocketConnection> SocketConnection::create(
     std::shared_ptr<ConnectionContext> context, UniqueDescriptor socket, std::uint64_t number) {
@@ -51,12 +71,12 @@ std::shared_ptr<SocketConnection> SocketConnection::create(
   connection->socket_.assign(socket.get(), error);
   if (error) return nullptr;
   connection->processIdentifier_ = PeerProcessIdentifier(socket.release());
-  // Calls may outlive the connection and even the listener, so what they hold on to is the context.
-  connection->desk_ = std::make_shared<ReplyQueue>(
+  // A call may outlive the connection and even the listener, so its channel holds the context.
+  connection->channel_ = std::make_shared<CallChannel>(
       connection->context_->limits,
       [shared = connection->context_, weak = std::weak_ptr(connection)] {
         asio::post(shared->io, [weak] {
-          if (const auto self = weak.lock()) self->attend();
+          if (const auto self = weak.lock()) self->onRepliesOrRoom();
         });
       });
   return connection;
@@ -96,27 +116,25 @@ void SocketConnection::resume() {
   });
 }
 
-/// Takes what has been read as far as the limits allow, then waits for more. Whatever made it stop
-/// short calls it again.
 void SocketConnection::proceed() {
   if (!open_ || !resumed_ || reading_) return;
   bool isLeft = false;
   {
-    // Most calls are brief and find their queues at rest: they are carried out here.
-    InlineRunner help;
+    // Most calls are brief and find their queues idle: their blocks run here.
+    InlineRunner runner;
     isLeft = decode();
-    while (help.runOne()) {
+    while (runner.runOne()) {
       if (open_) flush();
     }
   }
   if (!open_) return;
   if (mustWait()) {
-    unwatchFrame();  // it is not the client that is slow
+    unwatchFrame();  // the service is slow, not the client
     return;
   }
   if (isLeft) {
-    // What was carried out here has made room again. After the others' turn, so that nobody waits
-    // for one who sends without end.
+    // The blocks that ran here made room again. Posted, so that the other clients are served before
+    // one that sends without end.
     asio::post(context_->io, [self = shared_from_this()] { self->proceed(); });
     return;
   }
@@ -138,25 +156,24 @@ void SocketConnection::proceed() {
                      });
 }
 
-/// Whether calls are left for which there is no room.
 bool SocketConnection::decode() {
-  const auto end = steady_clock::now() + kLongestTurn;
-  for (unsigned calls = 1; open_ && !buffer_.empty() && !mustWait(); ++calls) {
+  ReadTurn turn(Now());
+  while (open_ && !buffer_.empty() && !mustWait()) {
     const std::string_view bytes = buffer_.bytes();
     switch (scanner_.scan(bytes)) {
       case MessagePackScanner::Progress::incomplete:
         return false;
       case MessagePackScanner::Progress::fault:
-        breach(scanner_.fault());
+        endForProtocolError(scanner_.fault());
         return false;
       case MessagePackScanner::Progress::complete:
-        carryOut(bytes.substr(0, scanner_.length()));
+        execute(bytes.substr(0, scanner_.length()));
         buffer_.consume(scanner_.length());
         scanner_.reset();
         frameIsPartial_ = false;
         break;
     }
-    if (calls % kCallsPerLook == 0 && !lastWords_ && steady_clock::now() >= end) break;
+    if (!draining_ && turn.isOverAfterCall(Now)) break;
   }
   return open_ && !buffer_.empty();
 }
@@ -170,7 +187,6 @@ void SocketConnection::receive() {
   proceed();
 }
 
-/// One read: how many bytes there were; none when the client has gone.
 std::optional<std::size_t> SocketConnection::readAvailable() {
   const std::span<char> room = buffer_.room();
   const ssize_t count =
@@ -181,49 +197,47 @@ std::optional<std::size_t> SocketConnection::readAvailable() {
   return static_cast<std::size_t>(count);
 }
 
-/// Whether the client has to wait: for its calls to be worked off, or until it reads its replies.
 bool SocketConnection::mustWait() {
-  if (lastWords_) return false;
-  const std::size_t limit = context_->limits.replyBytes;
-  if (desk_->repliesHeld() >= limit) {
+  if (draining_) return false;
+  if (channel_->replies.holdsMaximum()) {
     flush();
-    if (desk_->repliesHeld() >= limit) {
+    if (channel_->replies.holdsMaximum()) {
       watchStall();
       return true;
     }
   }
-  if (!desk_->mustWaitForRoom()) return false;
-  // Also when it is full of others yet: those are behind once they have been carried out.
-  watchThoseBehind();
+  if (!channel_->flow.mustWait(Now)) return false;
+  // Also while the calls are still executing: they are unstored after that.
+  watchSlowCalls();
   return true;
 }
 
-void SocketConnection::carryOut(std::string_view frame) {
+void SocketConnection::execute(std::string_view frame) {
   std::string_view fault;
   if (const auto request = Request::from(PayloadValue(frame.data()), fault)) {
     dispatch(*request, frame.size());
   } else {
-    breach(fault);
+    endForProtocolError(fault);
   }
 }
 
 void SocketConnection::dispatch(const Request& request, std::size_t frameBytes) {
   ZQ_FUNCTION("-[SocketConnection dispatch:frameBytes:]");
-  const auto call = std::make_shared<Call>(desk_, request.messageID, frameBytes);
+  const auto call = std::make_shared<Call>(channel_, request.messageID, frameBytes);
   const ExportedMethod* method =
       interface_ != nullptr && object_ ? interface_->find(request.method) : nullptr;
   std::optional<Error> error;
   if (method == nullptr) {
     error = UnknownMethodError(interface_, request.method);
   } else if (request.params.count() != method->argumentCount) {
-    // Not left to the operation: the list may be as long as a message, and is not to be copied.
+    // Checked before the arguments are copied: the list may be as long as a message.
     error = BadArgumentsError(WrongArgumentCount(*method, request.params.count()));
   } else {
     arguments_.clear();
     for (const PayloadValue argument : request.params.items()) arguments_.push_back(argument);
-    desk_->begin(frameBytes);
-    const CallRef hold(call);
-    const CallScope scope(CallScope::Of::call, hold);
+    channel_->flow.callBegun(frameBytes);
+    const CallRef reference(call);
+    const CallScope scope(CallScope::Of::call, reference);
     if (auto wrong = method->invoke(*method, *object_, arguments_, call)) {
       error = BadArgumentsError(std::move(*wrong));
     }
@@ -233,31 +247,29 @@ void SocketConnection::dispatch(const Request& request, std::size_t frameBytes) 
   call->error(*error);
 }
 
-/// What the desk wakes the I/O thread for.
-void SocketConnection::attend() {
+void SocketConnection::onRepliesOrRoom() {
   if (!open_) return;
   flush();
   watchStall();
   proceed();
 }
 
-/// Writes the replies that lie at the desk, all of them with one write where the socket takes them.
 void SocketConnection::flush() {
   while (!writing_) {
     if (sent_ == sending_.size()) {
       sent_ = 0;
-      if (!desk_->takeReplies(sending_)) return;
+      if (!channel_->replies.take(sending_)) return;
     }
     const ssize_t count = ::send(socket_.native_handle(), sending_.data() + sent_,
                                  sending_.size() - sent_, MSG_NOSIGNAL | MSG_DONTWAIT);
     if (count >= 0) {
       sent_ += static_cast<std::size_t>(count);
-      desk_->repliesWritten(static_cast<std::size_t>(count));
+      channel_->replies.written(static_cast<std::size_t>(count));
     } else if (errno != EAGAIN && errno != EINTR && errno != ENOBUFS && errno != ENOMEM) {
-      // The client hears no more. The socket is still read: what it sent before is to be carried
-      // out. Unless it has closed its end itself, it is to notice.
+      // No reply reaches the client any more. The socket is still read: calls that were sent before
+      // are executed. A client that did not close its end itself shall notice.
       const bool hasClosed = errno == EPIPE;
-      desk_->refuseReplies();
+      channel_->replies.refuse();
       sending_.clear();
       sent_ = 0;
       if (!hasClosed) ::shutdown(socket_.native_handle(), SHUT_RD);
@@ -274,7 +286,7 @@ void SocketConnection::waitUntilWritable() {
                        self->writing_ = false;
                        if (error || !self->open_) return;
                        self->unwatchStall();
-                       self->attend();
+                       self->onRepliesOrRoom();
                      });
 }
 
@@ -285,9 +297,9 @@ void SocketConnection::watchFrame() {
   if (!frameTimerRuns_) awaitFrameDeadline();
 }
 
-/// The timer is left running from one partial frame to the next, so that a busy client, whose every
-/// read ends inside a frame, does not set it each time.
 void SocketConnection::awaitFrameDeadline() {
+  // The timer runs on from one partial frame to the next: a busy client, whose every read ends
+  // inside a frame, does not set it each time.
   frameTimerRuns_ = true;
   frameTimer_.expires_at(frameDeadline_);
   frameTimer_.async_wait([self = shared_from_this()](asio::error_code error) {
@@ -297,7 +309,7 @@ void SocketConnection::awaitFrameDeadline() {
     if (steady_clock::now() < self->frameDeadline_) {
       self->awaitFrameDeadline();
     } else {
-      self->giveUp("a message was begun and not completed in time");
+      self->endForTimeout("a message was begun and not completed in time");
     }
   });
 }
@@ -308,12 +320,12 @@ void SocketConnection::unwatchFrame() {
 }
 
 void SocketConnection::watchStall() {
-  if (stallTimerRuns_ || !writing_ || desk_->repliesHeld() < context_->limits.replyBytes) return;
+  if (stallTimerRuns_ || !writing_ || !channel_->replies.holdsMaximum()) return;
   stallTimerRuns_ = true;
   stallTimer_.expires_after(context_->limits.stall);
   stallTimer_.async_wait([self = shared_from_this()](asio::error_code error) {
     if (error || !self->stallTimerRuns_ || self->stallTimer_.expiry() > steady_clock::now()) return;
-    self->giveUp("it does not read its replies");
+    self->endForTimeout("it does not read its replies");
   });
 }
 
@@ -321,27 +333,27 @@ void SocketConnection::unwatchStall() {
   if (std::exchange(stallTimerRuns_, false)) stallTimer_.cancel();
 }
 
-/// Calls that wait for something slow do not hold back those that come after them for long.
-void SocketConnection::watchThoseBehind() {
-  if (std::exchange(behindTimerRuns_, true)) return;
-  behindTimer_.expires_after(kSlowBehind);
-  behindTimer_.async_wait([self = shared_from_this(), done = desk_->callsDone()](asio::error_code) {
-    self->behindTimerRuns_ = false;
-    if (!self->open_ || !self->desk_->isWaiting()) return;
-    if (self->desk_->callsDone() == done) self->desk_->excuseThoseBehind();
-    self->proceed();
-  });
+void SocketConnection::watchSlowCalls() {
+  if (std::exchange(slowCallsTimerRuns_, true)) return;
+  slowCallsTimer_.expires_after(flow::kExemptAfter);
+  slowCallsTimer_.async_wait(
+      [self = shared_from_this(), completed = channel_->flow.completedCalls()](asio::error_code) {
+        self->slowCallsTimerRuns_ = false;
+        if (!self->open_ || !self->channel_->flow.isWaiting()) return;
+        self->channel_->flow.exemptSlowCalls(completed);
+        self->proceed();
+      });
 }
 
-void SocketConnection::breach(std::string_view fault) {
-  ZQ_FUNCTION("-[SocketConnection breach:]");
+void SocketConnection::endForProtocolError(std::string_view fault) {
+  ZQ_FUNCTION("-[SocketConnection endForProtocolError:]");
   ZQ_LOG(nullptr, error, "client {} broke the protocol: {}", processIdentifier_, fault);
   end(true);
 }
 
-void SocketConnection::giveUp(std::string_view why) {
-  ZQ_FUNCTION("-[SocketConnection giveUp:]");
-  ZQ_LOG(nullptr, error, "client {} is disconnected: {}", processIdentifier_, why);
+void SocketConnection::endForTimeout(std::string_view reason) {
+  ZQ_FUNCTION("-[SocketConnection endForTimeout:]");
+  ZQ_LOG(nullptr, error, "client {} is disconnected: {}", processIdentifier_, reason);
   end(false);
 }
 
@@ -351,13 +363,13 @@ void SocketConnection::refuse() {
   end(false);
 }
 
-void SocketConnection::endInOrder() {
+void SocketConnection::drainAndEnd() {
   if (open_ && resumed_) {
-    // The client can send no more, so this comes to an end; what it has sent can still be read.
+    // Stops the client from sending, so that the loop ends; bytes that have arrived stay readable.
     ::shutdown(socket_.native_handle(), SHUT_RD);
-    lastWords_ = true;
+    draining_ = true;
     do {
-      decode();
+      (void)decode();
     } while (open_ && readAvailable().value_or(0) > 0);
   }
   end(false);
@@ -365,20 +377,20 @@ void SocketConnection::endInOrder() {
 
 void SocketConnection::end(bool interrupted) {
   if (!open_) return;
-  flush();  // a client that has only stopped sending gets the replies that are there
+  flush();  // a client that has only shut down its sending side still gets its replies
   open_ = false;
-  desk_->refuseReplies();
+  channel_->replies.refuse();
   unwatchFrame();
   unwatchStall();
-  behindTimer_.cancel();
+  slowCallsTimer_.cancel();
   asio::error_code ignored;
   socket_.close(ignored);
 
   const auto interruptionHandler = std::exchange(interruptionHandler_, nullptr);
   const auto invalidationHandler = std::exchange(invalidationHandler_, nullptr);
   {
-    const CallRef passage = context_->passages.begin(context_);
-    const CallScope scope(CallScope::Of::call, passage);
+    const CallRef change = context_->trackConnectionChange();
+    const CallScope scope(CallScope::Of::call, change);
     if (interrupted && interruptionHandler) interruptionHandler();
     if (invalidationHandler) invalidationHandler();
     object_.reset();

@@ -14,39 +14,51 @@
 
 #include "base/MessagePack.h"
 #include "platform/ClientConnection.h"
+#include "queues/CallTracker.h"
+#include "quotas/FlowControl.h"
 #include "system/Configuration.h"
-#include "transport/ConnectionChurnLimit.h"
+#include "transport/Call.h"
+#include "transport/ListeningSocket.h"
 #include "transport/ReadBuffer.h"
-#include "transport/ReplyQueue.h"
-#include "transport/UniqueDescriptor.h"
 
 namespace quarvel {
 
 class SocketConnection;
 struct Request;
 
-/// What the connections of one listener share. Lives as long as any of them.
-struct ConnectionContext {
+/// The event loop, limits and counts that the connections of one listener share.
+/// Owner: the listener, its connections and their calls; lives as long as the last of them.
+struct ConnectionContext : std::enable_shared_from_this<ConnectionContext> {
   explicit ConnectionContext(const Configuration::Limits& connectionLimits)
       : limits(connectionLimits) {}
 
+  /// I/O thread. Counts the begin or the end of a connection until all blocks that are queued under
+  /// the returned reference have run.
+  [[nodiscard]] CallRef trackConnectionChange();
+
   asio::io_context io{1};  // run by the I/O thread alone
   const Configuration::Limits limits;
-  ConnectionChurnLimit passages;
-  /// Told, on the I/O thread, of each connection that has ended. Constant once the listener serves.
+  ChurnLimit churn;
+
+  // Constant once the listener serves.
+
+  /// Any thread: `churn` allows clients to be accepted again.
+  std::function<void()> acceptAgain;
+  /// I/O thread: a connection has ended.
   std::function<void(const std::shared_ptr<SocketConnection>&)> connectionEnded;
 };
 
-/// One client on a stream socket, speaking MessagePack-RPC. All of it belongs to the I/O thread,
-/// except where it says otherwise; calls and their replies meet it at the `ReplyQueue`.
+/// One client on a stream socket, speaking MessagePack-RPC: decodes its calls, makes them on the
+/// exported object, writes their replies, and ends a client that breaks a limit.
 ///
-/// Shared by its listener until it has ended, by whoever was handed it, and by the waits it has
-/// begun. A wait for the socket or a timer is begun at most once at a time.
+/// Owner: the listener until the connection has ended, the delegate if it keeps a reference, and
+/// the pending waits. At most one wait is pending for reading, for writing and for each timer.
+/// Thread: the I/O thread, except where another is named; calls report through `CallChannel`.
 class SocketConnection final : public ClientConnection,
                                public std::enable_shared_from_this<SocketConnection> {
  public:
-  /// Null when the kernel has no room for a further socket to be watched. `number` tells
-  /// connections of one process apart in log lines.
+  /// `number` tells connections of one process apart in log lines. Null when the kernel has no room
+  /// to watch a further socket.
   [[nodiscard]] static std::shared_ptr<SocketConnection> create(
       std::shared_ptr<ConnectionContext> context, UniqueDescriptor socket, std::uint64_t number);
 
@@ -60,47 +72,68 @@ class SocketConnection final : public ClientConnection,
   void resume() override;
   [[nodiscard]] std::string description() const override;
 
-  /// Closes a connection that nobody wants, without telling anybody but the client.
+  /// Closes a connection that the delegate did not accept. Calls no handler.
   void refuse();
-  /// Ends the connection as if its client had gone this moment: what it has sent is still carried
-  /// out, then the invalidation handler is called.
-  void endInOrder();
+  /// Ends the connection as if its client had gone now: executes every call that has arrived,
+  /// beyond any limit, then calls the invalidation handler.
+  void drainAndEnd();
 
  private:
   SocketConnection(std::shared_ptr<ConnectionContext> context, std::uint64_t number);
 
   // Reading.
+
+  /// Makes the calls that have been read, as far as the limits allow, then waits for more bytes. A
+  /// limit that stopped it calls it again when there is room.
   void proceed();
-  bool decode();
+  /// Makes calls until the limits, the turn or an incomplete call stop it. Whether bytes are left
+  /// that may be a complete call.
+  [[nodiscard]] bool decode();
+  /// The socket is readable.
   void receive();
+  /// Reads once. The number of bytes read; none when the client has gone.
   [[nodiscard]] std::optional<std::size_t> readAvailable();
+  /// Whether the client waits until calls complete or until it reads its replies. A wake through
+  /// the channel, the socket or a timer then calls `proceed`.
   [[nodiscard]] bool mustWait();
-  void carryOut(std::string_view frame);
+  /// One complete MessagePack value: a call, or a protocol error.
+  void execute(std::string_view frame);
+  /// Makes a call on the exported object, or answers with the reason why it cannot be made.
   void dispatch(const Request& request, std::size_t frameBytes);
 
   // Writing.
-  void attend();
+
+  /// Woken through the channel: replies are queued, or the limits allow calls again.
+  void onRepliesOrRoom();
+  /// Writes all queued replies, with one write where the socket takes them.
   void flush();
   void waitUntilWritable();
 
-  // Clocks.
+  // Time-outs: `limits.frame` for a partial message while the client could send the rest,
+  // `limits.stall` while it reads no reply and the most replies are held.
+
   void watchFrame();
   void awaitFrameDeadline();
   void unwatchFrame();
   void watchStall();
   void unwatchStall();
-  void watchThoseBehind();
+  /// Exempts calls that wait for a slow backend from the limit on unstored calls, after a time.
+  void watchSlowCalls();
 
   // Ends.
-  void breach(std::string_view fault);
-  void giveUp(std::string_view why);
+
+  /// Bytes that are no call: logs `fault`, calls both handlers.
+  void endForProtocolError(std::string_view fault);
+  /// Logs `reason`, calls the invalidation handler alone.
+  void endForTimeout(std::string_view reason);
+  /// Closes the socket, calls the handlers and releases the exported object. Once.
   void end(bool interrupted);
 
   // Constant after construction.
   const std::shared_ptr<ConnectionContext> context_;
   const std::uint64_t number_;
   std::int32_t processIdentifier_ = 0;
-  std::shared_ptr<ReplyQueue> desk_;
+  std::shared_ptr<CallChannel> channel_;
 
   // Constant from `resume` to the end.
   const ExportedInterface* interface_ = nullptr;
@@ -112,12 +145,12 @@ class SocketConnection final : public ClientConnection,
   asio::posix::stream_descriptor socket_;
   bool open_ = true;
   bool resumed_ = false;
-  bool lastWords_ = false;  // the service ends: what has arrived is taken in, whatever the limits
+  bool draining_ = false;  // the service ends: no limit applies to calls that have arrived
 
   bool reading_ = false;  // waits until the socket is readable
   ReadBuffer buffer_;
   MessagePackScanner scanner_;
-  std::vector<PayloadValue> arguments_;  // of the call being made; kept for its memory
+  std::vector<PayloadValue> arguments_;  // of the current call; a member to reuse its memory
 
   bool writing_ = false;  // waits until the socket is writable
   std::string sending_;
@@ -129,8 +162,8 @@ class SocketConnection final : public ClientConnection,
   std::chrono::steady_clock::time_point frameDeadline_;  // of the partial frame
   asio::steady_timer stallTimer_;
   bool stallTimerRuns_ = false;
-  asio::steady_timer behindTimer_;
-  bool behindTimerRuns_ = false;
+  asio::steady_timer slowCallsTimer_;
+  bool slowCallsTimerRuns_ = false;
 };
 
 }  // namespace quarvel

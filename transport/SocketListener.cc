@@ -2,7 +2,6 @@
 
 #include <sys/socket.h>
 
-#include <algorithm>
 #include <asio/executor_work_guard.hpp>
 #include <asio/io_context.hpp>
 #include <asio/posix/stream_descriptor.hpp>
@@ -21,44 +20,21 @@
 
 #include "base/Format.h"
 #include "platform/Log.h"
+#include "quotas/FlowControl.h"
 #include "transport/SocketConnection.h"
 
 namespace quarvel {
 
 namespace {
 
-/// Descriptors run out for the whole process or system, so there may be some again although none of
-/// our connections has ended.
-constexpr std::chrono::seconds kRetryAccepting{1};
-
-/// So many clients are welcomed before those who are there get their turn.
-constexpr int kAcceptedPerTurn = 4;
-
-/// Whoever comes brings the server queue work, a look at its process, lines of the log and a row:
-/// some hundred microseconds in all. So many may come at once, and in the long run so often, that
-/// those who come and go as fast as they can leave the processor to others.
-class Pace {
- public:
-  [[nodiscard]] bool allowsOne() const { return next_ <= std::chrono::steady_clock::now(); }
-  void oneCame() {
-    next_ = std::max(next_, std::chrono::steady_clock::now() - kInterval * kAtOnce) + kInterval;
-  }
-  /// When a turn's worth may come again.
-  [[nodiscard]] std::chrono::steady_clock::time_point nextTurn() const {
-    return next_ + kInterval * kAcceptedPerTurn;
-  }
-
- private:
-  static constexpr int kAtOnce = 512;
-  static constexpr std::chrono::microseconds kInterval{250};
-
-  std::chrono::steady_clock::time_point next_;
-};
+FlowInstant Now() {
+  return std::chrono::steady_clock::now();
+}
 
 }  // namespace
 
-/// The listener's side of the event loop: accepts, counts, ends. All of it belongs to the I/O
-/// thread, except what `SocketListener` calls on any.
+/// The listener's side of the event loop: accepts clients, counts connections, ends the service.
+/// Owner: the `SocketListener`. Thread: the I/O thread, except for `requestEnd`.
 class SocketListener::Loop {
  public:
   Loop(ListeningSocket socket, Options options)
@@ -71,11 +47,11 @@ class SocketListener::Loop {
         pulseTimer_(context_->io),
         signals_(context_->io) {
     for (const int signal : options_.endSignals) signals_.add(signal);
-    // May come when this object has gone, but then nothing runs the loop any more.
-    context_->passages.wake = [this, &io = context_->io] { acceptSoon(io); };
+    // A call may complete after this object has gone; the posted block then never runs.
+    context_->acceptAgain = [this, &io = context_->io] { acceptSoon(io); };
     context_->connectionEnded = [this](const std::shared_ptr<SocketConnection>& connection) {
       connections_.erase(connection);
-      if (heldBack_ && !ended_) acceptSoon(context_->io);
+      if (paused_ && !ended_) acceptSoon(context_->io);
     };
   }
 
@@ -103,72 +79,71 @@ class SocketListener::Loop {
 
  private:
   void acceptSoon(asio::io_context& io) {
-    asio::post(io, [this] { acceptWaiting(); });
+    asio::post(io, [this] { acceptPending(); });
   }
 
-  void acceptWaiting() {
+  void acceptPending() {
     if (accepting_ || ended_) return;
-    switch (accept(kAcceptedPerTurn)) {
-      case Accepted::all:
+    switch (accept(flow::kAcceptsPerTurn)) {
+      case AcceptResult::noneLeft:
         accepting_ = true;
         socket_.async_wait(asio::posix::stream_descriptor::wait_read,
                            [this](asio::error_code error) {
                              accepting_ = false;
-                             if (!error) acceptWaiting();
+                             if (!error) acceptPending();
                            });
         break;
-      case Accepted::turn:
+      case AcceptResult::turnOver:
         acceptSoon(context_->io);
         break;
-      case Accepted::paced:
-        acceptAt(pace_.nextTurn());
+      case AcceptResult::rateLimited:
+        acceptAt(rateLimit_.nextTurn());
         break;
-      case Accepted::heldBack:
+      case AcceptResult::paused:
         break;
     }
   }
 
-  /// What became of the clients who wait: all are accepted, as many as were to be, as many as may
-  /// be for now, or no more may be until somebody calls `acceptSoon`.
-  enum class Accepted { all, turn, paced, heldBack };
+  /// Why `accept` returned. `paused`: until an event or a timer calls `acceptPending`.
+  enum class AcceptResult { noneLeft, turnOver, rateLimited, paused };
 
-  Accepted accept(int most) {
+  AcceptResult accept(int most) {
     for (int accepted = 0;;) {
-      if (accepted == most) return Accepted::turn;
-      if (!ended_ && context_->passages.areTooMany()) return Accepted::heldBack;
-      if (!ended_ && !pace_.allowsOne()) return Accepted::paced;
+      if (accepted == most) return AcceptResult::turnOver;
+      if (!ended_ && context_->churn.mustWait()) return AcceptResult::paused;
+      if (!ended_ && !rateLimit_.allowsOne(Now())) return AcceptResult::rateLimited;
       if (connections_.size() >= options_.limits.connections) {
-        holdBack(fmt::format("there are {} connections already", connections_.size()));
-        return Accepted::heldBack;
+        pauseAccepting(fmt::format("there are {} connections already", connections_.size()));
+        return AcceptResult::paused;
       }
       UniqueDescriptor client(
           ::accept4(socket_.native_handle(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
       if (client) {
         ++accepted;
-        pace_.oneCame();
-        welcome(std::move(client));
+        rateLimit_.accepted(Now());
+        addConnection(std::move(client));
       } else if (errno == EAGAIN) {
-        heldBack_ = false;
-        return Accepted::all;
+        paused_ = false;
+        return AcceptResult::noneLeft;
       } else if (errno != EINTR && errno != ECONNABORTED && errno != EPROTO) {
-        holdBack(std::generic_category().message(errno));
-        acceptAt(std::chrono::steady_clock::now() + kRetryAccepting);
-        return Accepted::heldBack;
+        pauseAccepting(std::generic_category().message(errno));
+        acceptAt(Now() + flow::kAcceptRetry);
+        return AcceptResult::paused;
       }
     }
   }
 
-  /// Accepts no more until a connection ends; said once, however long it lasts.
-  void holdBack(const std::string& reason) {
-    ZQ_FUNCTION("-[SocketListener holdBack:]");
-    if (std::exchange(heldBack_, true)) return;
+  /// No client is accepted until a connection ends. Logged once for the whole pause.
+  void pauseAccepting(const std::string& reason) {
+    ZQ_FUNCTION("-[SocketListener pauseAccepting:]");
+    if (std::exchange(paused_, true)) return;
     ZQ_LOG(nullptr, error, "no further client is accepted until one has gone: {}", reason);
   }
 
   void acceptAt(std::chrono::steady_clock::time_point time) {
     acceptTimer_.expires_at(time);
     acceptTimer_.async_wait([this](asio::error_code error) {
-      if (!error) acceptWaiting();
+      if (!error) acceptPending();
     });
   }
 
@@ -181,16 +156,16 @@ class SocketListener::Loop {
     });
   }
 
-  void welcome(UniqueDescriptor client) {
-    ZQ_FUNCTION("-[SocketListener welcome:]");
+  void addConnection(UniqueDescriptor client) {
+    ZQ_FUNCTION("-[SocketListener addConnection:]");
     const auto connection = SocketConnection::create(context_, std::move(client), ++lastNumber_);
     if (connection == nullptr) {
       ZQ_LOG(nullptr, error, "a client is turned away: the kernel cannot watch its socket");
       return;
     }
     connections_.insert(connection);
-    const CallRef passage = context_->passages.begin(context_);
-    const CallScope scope(CallScope::Of::call, passage);
+    const CallRef change = context_->trackConnectionChange();
+    const CallScope scope(CallScope::Of::call, change);
     if (delegate_ == nullptr || !delegate_->shouldAcceptNewConnection(*listener_, connection)) {
       connection->refuse();
     }
@@ -199,17 +174,18 @@ class SocketListener::Loop {
   void end() {
     if (std::exchange(ended_, true)) return;
     if (options_.atEndBegun) options_.atEndBegun();
-    // Who came before the end is heard; at an inherited socket they wait for the next service.
+    // Clients that connected before the end are served; at an inherited socket they wait for the
+    // next service instead.
     if (listeningSocket_.removeFile()) (void)accept(std::numeric_limits<int>::max());
     asio::error_code ignored;
     socket_.close(ignored);
     acceptTimer_.cancel();
     pulseTimer_.cancel();
     signals_.cancel(ignored);
-    // Each takes itself out of the set.
+    // A copy: each connection removes itself from the set.
     const std::vector<std::shared_ptr<SocketConnection>> connections(connections_.begin(),
                                                                      connections_.end());
-    for (const auto& connection : connections) connection->endInOrder();
+    for (const auto& connection : connections) connection->drainAndEnd();
     busy_.reset();
   }
 
@@ -228,9 +204,9 @@ class SocketListener::Loop {
   asio::signal_set signals_;
   std::unordered_set<std::shared_ptr<SocketConnection>> connections_;
   std::uint64_t lastNumber_ = 0;
-  Pace pace_;
-  bool accepting_ = false;  // waits for a client
-  bool heldBack_ = false;   // clients wait, but there is no room
+  AcceptRateLimit rateLimit_;
+  bool accepting_ = false;  // waits until a client connects
+  bool paused_ = false;     // clients wait, but the service has no room for them
   bool ended_ = false;
 };
 

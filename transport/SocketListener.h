@@ -12,33 +12,38 @@
 
 namespace quarvel {
 
-/// A listener on a Unix stream socket. The thread that calls `resume` becomes the I/O thread, which
-/// serves every connection.
+/// A listener on a Unix stream socket.
+/// Owner: the process's composition root (or a test); must outlive `resume`.
+/// Thread: the thread that calls `resume` becomes the I/O thread, which serves every connection.
 class SocketListener final : public ServiceListener {
  public:
   struct Options {
     Configuration::Limits limits;
-    /// Signals that end the service in order; seen from construction on.
+    /// Signals that end the service as `requestEnd` does; caught from construction on.
     std::vector<int> endSignals;
-    /// Called on the I/O thread, each when it is set: once clients are served; every
-    /// `pulseInterval` from then on, unless that is zero; when the end begins.
+    // Called on the I/O thread; optional.
+
+    /// Once clients are served.
     std::function<void()> atStart;
+    /// Every `pulseInterval` from then on; zero: never.
     std::function<void()> pulse;
     std::chrono::microseconds pulseInterval{0};
+    /// When the end begins.
     std::function<void()> atEndBegun;
-    /// What is to be done when every connection has ended, in this order, on the I/O thread.
+    /// In this order, when every connection has ended.
     std::vector<std::function<void()>> atEnd;
   };
 
-  /// Errors: domain "quarvel.listener", when the kernel has no room for an event loop.
+  /// Errors: domain "quarvel.listener", when the kernel has no descriptor for an event loop.
   [[nodiscard]] static Result<std::unique_ptr<SocketListener>> create(ListeningSocket socket,
                                                                       Options options);
   ~SocketListener() override;
 
   void setDelegate(std::shared_ptr<ServiceListenerDelegate> delegate) override;
-  /// Returns when the service has been told to end, every connection has ended and `atEnd` is done.
+  /// Blocks until the service was told to end, every connection has ended and `atEnd` is done.
   void resume() override;
-  /// Tells the service to end, as an end signal does. Any thread; returns at once.
+  /// Tells the service to end: accepts no more clients, executes the calls that have arrived, ends
+  /// every connection. Any thread; returns at once.
   void requestEnd();
 
  private:

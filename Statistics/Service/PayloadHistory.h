@@ -14,8 +14,8 @@
 
 namespace quarvel {
 
-/// What names a message within its session: its codes, and how many with their names came before
-/// it and with it.
+/// Identifies a message within its session: its codes, and its number (from 1) among the messages
+/// with the same names.
 struct MessageIdentity {
   std::uint64_t number;
   std::uint32_t category;
@@ -25,19 +25,25 @@ struct MessageIdentity {
   [[nodiscard]] std::string text() const;
 };
 
-/// Everything one run of a session carried, in order, under a lock of its own: messages with their
-/// enriched payloads, whose blocks it shares, orientation entries, and in front the user
-/// information once a summary was made. A message costs 32 bytes beside its payload's block.
+/// The history of one run of a session, in order: messages with their enriched payloads,
+/// orientation entries and, in front, the user information once a summary was made.
+///
+/// Shared by the session and by blocks that still condense it after a stop. Every operation may be
+/// called from any thread; one lock guards the entries. A message costs 32 bytes beside the block
+/// of its payload, which is shared.
 class PayloadHistory {
  public:
+  /// Adds a message with its enriched payload.
   void append(const MessageIdentity& identity, Payload payload) {
     const MutexLock lock(mutex_);
     entries().emplace_back(SentMessage{identity, std::move(payload)});
   }
+  /// Adds an orientation entry.
   void append(Dictionary dictionary) {
     const MutexLock lock(mutex_);
     entries().emplace_back(std::make_unique<const Dictionary>(std::move(dictionary)));
   }
+  /// Adds the user information before all other entries.
   void insertAtFront(Dictionary dictionary) {
     const MutexLock lock(mutex_);
     entries().emplace_front(std::make_unique<const Dictionary>(std::move(dictionary)));
@@ -46,8 +52,8 @@ class PayloadHistory {
     const MutexLock lock(mutex_);
     return !entries_;
   }
-  /// Calls `visitMessage(identity, payload)` or `visitDictionary(dictionary)` with each entry in
-  /// order, under the lock: short work only.
+  /// Calls `visitMessage(identity, payload)` or `visitDictionary(dictionary)` for each entry in
+  /// order, with the lock held: visitors append to no history.
   template <class VisitMessage, class VisitDictionary>
   void forEach(VisitMessage&& visitMessage, VisitDictionary&& visitDictionary) const {
     const MutexLock lock(mutex_);
@@ -75,7 +81,7 @@ class PayloadHistory {
   }
 
   mutable Mutex mutex_;
-  /// Made with the first entry: an empty one costs half a kilobyte, and there may be many sessions.
+  /// Absent without entries: an empty deque costs half a kilobyte, and there may be many sessions.
   std::optional<std::deque<Entry>> entries_ QUARVEL_GUARDED_BY(mutex_);
 };
 

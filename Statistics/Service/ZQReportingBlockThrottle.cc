@@ -41,7 +41,7 @@ constexpr unsigned kCompletionPauses = 10;
 constexpr unsigned kCompletionSeconds = 5;
 constexpr std::chrono::duration<double> kLongestTimer = std::chrono::hours(24 * 365);
 
-/// The sessions' scope: the throttle sends what they would.
+/// The scope of the sessions, whose messages the throttle sends.
 LogHandle Scope() {
   static const LogHandle scope = ZQLogRegister(FourCharacterCode("zqrr"), "zqrr", kSubsystem,
                                                "reporting_session_verbose", 1, 31);
@@ -54,7 +54,7 @@ microseconds TimerSpan(double seconds) {
       std::min(std::chrono::duration<double>(seconds), kLongestTimer));
 }
 
-/// A key, or an entry in a list of keys, as text; none for what cannot be a key.
+/// A key, or an entry in a list of keys, as text; none when it cannot be a key.
 std::optional<std::string> KeyText(PayloadValue key) {
   if (const auto text = key.string()) return std::string(*text);
   if (const auto number = key.integer()) return fmt::to_string(*number);
@@ -157,7 +157,7 @@ void ZQReportingBlockThrottleTimerWrapper::setBlock(Block block) {
     const MutexLock lock(mutex_);
     block_.swap(newest);
   }
-  // The old one goes here, outside the lock: what it owns is not ours.
+  // The old block is destroyed outside the lock: it owns foreign objects.
 }
 
 std::shared_ptr<RunLoopTimer> ZQReportingBlockThrottleTimerWrapper::timer() const {
@@ -233,8 +233,8 @@ void ZQReportingBlockThrottle::addMessageBlock(Block block, ReporterID reporterI
   const double seconds = determineSleepTime(message);
   std::shared_ptr<Wrapper> duplicate;
   {
-    // Looking and storing under one lock: of two callers with equal messages, one finds the
-    // other's.
+    // Lookup and insertion under one lock: of two callers with equal messages, the second finds the
+    // first one's.
     const MutexLock lock(timersMutex_);
     if (const auto pending = timersInFlight_.find(key); pending != timersInFlight_.end()) {
       duplicate = pending->second;
@@ -256,7 +256,7 @@ std::shared_ptr<ZQReportingBlockThrottle::Wrapper> ZQReportingBlockThrottle::mak
     const std::string& key, Block block, double seconds) {
   auto wrapper = std::make_shared<Wrapper>(std::move(block));
   // The wrapper owns the timer, so the timer must not own the wrapper. It fires on the worker,
-  // which holds the throttle.
+  // which owns the throttle.
   wrapper->setTimer(CreateRunLoopTimer(TimerSpan(seconds),
                                        [this, pending = std::weak_ptr<Wrapper>(wrapper), key] {
                                          if (const auto due = pending.lock()) fire(*due, key);

@@ -16,22 +16,23 @@
 
 namespace quarvel {
 
-/// One message that waits in a throttle: the work, which a duplicate replaces, and the timer that
-/// will run it. Every operation may be called from any thread.
+/// One message that waits in a throttle: its block, which a duplicate replaces, and the timer that
+/// will run it. Owned by the throttle's map of pending messages. Every operation may be called from
+/// any thread.
 class ZQReportingBlockThrottleTimerWrapper {
  public:
   explicit ZQReportingBlockThrottleTimerWrapper(Block block);
 
-  /// Shared, since a reader may still hold what a duplicate has replaced by now.
+  /// Shared, since a reader may still hold a block that a duplicate has replaced.
   [[nodiscard]] std::shared_ptr<Block> block() const;
-  /// Destroys the old block, unless somebody holds it, on the calling thread.
+  /// Destroys the old block on the calling thread, unless a reader still holds it.
   void setBlock(Block block);
 
   /// Null until it is set.
   [[nodiscard]] std::shared_ptr<RunLoopTimer> timer() const;
   void setTimer(std::shared_ptr<RunLoopTimer> timer);
 
-  /// Has the timer fire that long from now; at once when `seconds` is not positive.
+  /// Moves the timer to `seconds` from now; it fires at once when `seconds` is not positive.
   void sleepFor(double seconds);
 
  private:
@@ -40,14 +41,16 @@ class ZQReportingBlockThrottleTimerWrapper {
   std::shared_ptr<RunLoopTimer> timer_ QUARVEL_GUARDED_BY(mutex_);
 };
 
-/// Delays messages for a moment, so that of a burst of equal ones only the last is sent. Messages
-/// are equal when they have the same key (`buildMessageKey`); each has its own delay
-/// (`determineSleepTime`), which every further equal one begins anew.
+/// Coalesces bursts: delays each message, and sends only the last one of several equal messages.
+/// Messages are equal when they have the same key (`buildMessageKey`). Each message has a delay
+/// (`determineSleepTime`), which a later equal message restarts with its own.
 ///
-/// The blocks run one at a time on the throttle's worker thread, which takes up new messages when
-/// it has none on its run loop: a message that comes while others wait for their delay is looked at
-/// after the last of those has run. An idle worker looks every tenth of a second. It holds the
-/// throttle, which so lives until `setShouldKeepRunning(false)`.
+/// A library of its own, for programs that link it: the service creates no throttle itself.
+///
+/// Blocks run one at a time on the throttle's worker thread. The worker takes new messages when its
+/// run loop is empty: a message that arrives while others wait for their delay is scheduled after
+/// the last of them has run. An idle worker looks every 100 ms. The worker owns the throttle, which
+/// therefore lives until `setShouldKeepRunning(false)`.
 class ZQReportingBlockThrottle : public std::enable_shared_from_this<ZQReportingBlockThrottle> {
   struct Private {};
 
@@ -58,39 +61,38 @@ class ZQReportingBlockThrottle : public std::enable_shared_from_this<ZQReporting
 
   explicit ZQReportingBlockThrottle(Private);
 
-  /// A new throttle, its worker started.
+  /// A new throttle with its worker running.
   [[nodiscard]] static std::shared_ptr<ZQReportingBlockThrottle> init();
 
-  /// Has `block`, which sends `message`, run once the message's delay is over, unless an equal
-  /// message comes before that: then the later block runs in its place, and this one is destroyed
-  /// by the later caller. From any thread; returns at once. When a message meets the firing of an
-  /// equal one, one of the two blocks runs.
+  /// Runs `block`, which sends `message`, after the message's delay. When an equal message arrives
+  /// earlier, its block replaces this one, which the later caller destroys. When it arrives while
+  /// this one fires, one of the two blocks runs. From any thread; returns at once.
   void addMessageBlock(Block block, ReporterID reporterID, const Payload& message,
                        std::uint32_t category, std::uint32_t type);
 
-  /// Waits until no message is pending, for 5 seconds at most; what is pending then stays. Looks
-  /// every half second. From any thread but the worker, which it would wait for in vain.
+  /// Blocks until no message is pending, for 5 seconds at most, and looks every 500 ms. Messages
+  /// that are pending then stay. From any thread but the worker, for which it would wait in vain.
   void waitForCompletion();
 
-  /// What makes messages equal: reporter, category, type, and the payload without the values that
-  /// always differ or that it says are not to be compared ("_comparison_field_blacklist", a list of
-  /// keys). An excluded key still counts as present. The order of keys plays no part. From any
-  /// thread.
+  /// The key that equal messages share: reporter, category, type, and the payload without excluded
+  /// values. Excluded are values that always differ, and keys that the payload lists under
+  /// "_comparison_field_blacklist"; such a key still counts as present. The order of keys does not
+  /// matter. From any thread.
   [[nodiscard]] static std::string buildMessageKey(const Payload& payload, ReporterID reporterID,
                                                    std::uint32_t category, std::uint32_t type);
 
-  /// The delay in seconds that the payload asks for ("_throttle_seconds", below 5, in single
-  /// precision; may be negative) or 0.5. From any thread.
+  /// The delay in seconds: "_throttle_seconds" of the payload (below 5, in single precision, may be
+  /// negative) or else 0.5. From any thread.
   [[nodiscard]] static double determineSleepTime(const Payload& payload);
 
-  /// Whether the worker goes on. Once false, it ends at its next look; what is pending then stays.
+  /// Whether the worker goes on. Once false, it ends at its next look; pending messages stay.
   [[nodiscard]] bool shouldKeepRunning() const { return shouldKeepRunning_; }
   void setShouldKeepRunning(bool shouldKeepRunning) { shouldKeepRunning_ = shouldKeepRunning; }
 
-  /// Every pending message by its key, as it stands now.
+  /// A copy of the pending messages by key. From any thread, like the accessors below.
   [[nodiscard]] TimersInFlight timersInFlight() const;
   void setTimersInFlight(TimersInFlight timersInFlight);
-  /// The keys of the messages that the worker has not taken up yet, in the order they came.
+  /// Keys of messages that the worker has not scheduled yet, in order of arrival.
   [[nodiscard]] TimerKeys unscheduledTimerKeys() const;
   void setUnscheduledTimerKeys(TimerKeys keys);
   [[nodiscard]] std::shared_ptr<WorkerThread> queueThread() const;
@@ -107,7 +109,7 @@ class ZQReportingBlockThrottle : public std::enable_shared_from_this<ZQReporting
 
   std::atomic<bool> shouldKeepRunning_ = true;
 
-  // Taken before `timersMutex_` where both are held. The platform's timers may be asked under both.
+  // Locked before `timersMutex_` where both are held. Timers may be used with both held.
   mutable Mutex unscheduledMutex_;
   TimerKeys unscheduledTimerKeys_ QUARVEL_GUARDED_BY(unscheduledMutex_);
 

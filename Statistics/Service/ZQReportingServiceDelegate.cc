@@ -30,7 +30,7 @@ constexpr std::uint32_t kTraceSendMessage = 0x21042824;
 
 constexpr int kKilledStatus = 2;
 
-/// To so many sessions a message is routed in no time; a list may name a hundred thousand.
+/// A message to this many sessions is routed in microseconds; a list may name a hundred thousand.
 constexpr std::size_t kFewTargets = 8;
 
 constexpr const char* kDefaultsNotification = "tarnwick.quarvel.reporting";
@@ -48,8 +48,8 @@ List ReporterIDList(const std::vector<ReporterID>& reporterIDs) {
   return {reporterIDs.begin(), reporterIDs.end()};
 }
 
-/// As a log line prints the list of their descriptions. Written straight away: a client may have a
-/// hundred thousand, and every broadcast prints all of them.
+/// The list of the sessions' descriptions for a log line. Composed without intermediate values: a
+/// client may have a hundred thousand sessions, and every broadcast prints them all.
 template <class Sessions, class Projection>
 std::string SessionDescriptions(const Sessions& sessions, Projection reporterID) {
   std::string text = "[";
@@ -70,7 +70,7 @@ std::string SessionDescriptions(const ZQReportingServerInstance::SessionMap& ses
   return SessionDescriptions(sessions, &ZQReportingServerInstance::SessionMap::value_type::first);
 }
 
-/// Reports how long a client was connected. `instance` is null when it has gone already.
+/// Reports how long a client was connected. `instance` is null when it is already destroyed.
 void ReportClientUptime(const ZQReportingServerInstance* instance, std::int32_t pid) {
   ZQ_FUNCTION("-[ZQReportingServiceDelegate listener:shouldAcceptNewConnection:]");
   const Date now = CurrentDate();
@@ -88,7 +88,7 @@ void ReportClientUptime(const ZQReportingServerInstance* instance, std::int32_t 
     uptime = seconds.count();
     wholeSeconds = static_cast<int>(std::min(seconds.count(), double{INT32_MAX}));
     if (*startDate > now) {
-      // Says "past" of a date in the future, on purpose.
+      // The text says "past" for a date in the future; this is deliberate.
       ZQ_LOG(Scope(), standard, "clientStartDate is in the past. clientpid={} clientprocessname={}",
              pid, displayName);
     }
@@ -179,14 +179,14 @@ bool ZQReportingServiceDelegate::shouldAcceptNewConnection(
     connection->setExportedInterface(ZQReportingServiceProtocolInterface());
     connection->setExportedObject(ZQReportingServerInstance::initWithPID(pid, shared_from_this()));
   }
-  // The connection and the client list own the instance; nothing else here may keep it alive.
+  // Only the connection and the client list own the instance, so the handlers hold it weakly.
   const std::weak_ptr<ZQReportingServerInstance> weakInstance =
       std::static_pointer_cast<ZQReportingServerInstance>(connection->exportedObject());
 
   ServerQueue().async([self = shared_from_this(), weakInstance, pid] {
     AssertOnServerQueue();
     const auto instance = weakInstance.lock();
-    if (instance == nullptr) return;  // its connection has ended already
+    if (instance == nullptr) return;  // the connection has already ended
     self->clients_.push_back(instance);
     instance->setClientStartDate(CurrentDate());
     instance->setClientProcessName(ProcessNameForPID(pid));
@@ -295,7 +295,7 @@ void ZQReportingServerInstance::setServiceType(std::uint16_t serviceType,
     if (reporterID == 0) return reply(true);
     if (const auto session = self->findReportingSessionForID(reporterID, false)) {
       session->setServiceType(serviceType);
-      // Two blanks, here and below, on purpose.
+      // The two blanks here and below are deliberate.
       ZQ_LOG(Scope(), standard, "service type {} set for reporter  {}", serviceType, reporterID);
     }
     reply(true);
@@ -305,17 +305,17 @@ void ZQReportingServerInstance::setServiceType(std::uint16_t serviceType,
 void ZQReportingServerInstance::getServiceNameForReporterID(ReporterID reporterID,
                                                             ServiceTypeReply reply) {
   ZQ_FUNCTION("-[ZQReportingServerInstance getServiceNameForReporterID:reply:]");
-  ZQ_LOG(Scope(), debug, "fetching seviceType");  // misspelt on purpose
+  ZQ_LOG(Scope(), debug, "fetching seviceType");  // misspelt deliberately
   ServerQueue().async([self = shared_from_this(), reporterID, reply = std::move(reply)] {
     AssertOnServerQueue();
-    // Identifier 0 is answered and then looked up all the same, which answers again.
+    // Identifier 0 is answered here and then looked up, which answers a second time.
     if (reporterID == 0) reply(kServiceTypeUnknown);
     const auto session = self->findReportingSessionForID(reporterID, true);
     const std::uint16_t serviceType =
         session == nullptr ? kServiceTypeUnknown : session->serviceType();
     reply(serviceType);
     ZQ_LOG(Scope(), standard, "returnning service type {} for reporter  {}", serviceType,
-           reporterID);  // misspelt on purpose
+           reporterID);  // misspelt deliberately
   });
 }
 
@@ -486,7 +486,7 @@ void ZQReportingServerInstance::broadcast(ZQReportingServiceDelegateProtocol& de
                                           std::uint32_t category, std::uint16_t type) {
   ZQ_FUNCTION(
       "-[ZQReportingServerInstance sendMessage:withCategory:andType:forReportingIDs:reply:]");
-  std::vector<ZQReportingSession*> active;  // of the clients' maps, which this queue guards
+  std::vector<ZQReportingSession*> active;  // owned by the clients' maps, which this queue guards
   for (const auto& client : delegate.getAllClients()) {
     const auto& sessions = client->clientReportingSessionMap();
     ZQ_LOG(Scope(), standard, "sessions for client {} : {}", client->processIdentifier(),
@@ -504,8 +504,7 @@ void ZQReportingServerInstance::broadcast(ZQReportingServiceDelegateProtocol& de
     return;
   }
   for (ZQReportingSession* const session : active) {
-    // The session first and the sinks after it: the other way round than for messages by
-    // identifier.
+    // The session before the sinks; a message by identifier has the opposite order.
     session->sendMessage(payload, category, type, nullptr);
     ZQReportingVistrelBridge::handleEvent(payload, category, type, session->userInfo());
     ZQReportingOhmrikUtility::handleEvent(payload, category, type, session->userInfo());

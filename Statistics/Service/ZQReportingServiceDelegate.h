@@ -23,7 +23,8 @@ namespace quarvel {
 
 class ZQReportingServerInstance;
 
-/// What a server instance may ask of the whole service. Called on the `ServerQueue`.
+/// The operations of the whole service that a server instance may use. Called on the `ServerQueue`.
+/// Implemented by the delegate, which an instance holds weakly.
 class ZQReportingServiceDelegateProtocol {
  public:
   using Clients = std::vector<std::shared_ptr<ZQReportingServerInstance>>;
@@ -33,26 +34,28 @@ class ZQReportingServiceDelegateProtocol {
   /// The preferences as last read; absent until the first notification of a change.
   [[nodiscard]] virtual const std::optional<Dictionary>& getDefaults()
       QUARVEL_REQUIRES(serverQueueRole) = 0;
-  /// The live list itself, in order of acceptance.
+  /// The live list, in order of acceptance.
   [[nodiscard]] virtual const Clients& getAllClients() QUARVEL_REQUIRES(serverQueueRole) = 0;
+  /// The reporting switch of the preferences.
   [[nodiscard]] virtual bool isReportingEnabled() = 0;
-  /// The session of the first client that has one of this identifier; none for 0 and while
+  /// The session with this identifier of the first client that has one; none for 0 and while
   /// reporting is switched off.
   [[nodiscard]] virtual std::shared_ptr<ZQReportingSession> findReportingSessionForID(
       ReporterID reporterID) QUARVEL_REQUIRES(serverQueueRole) = 0;
-  /// What the drivers count now, and how far the counters rose since (`ZQReportingDriverUtility`).
+  /// Driver counters now, and their rise since (`ZQReportingDriverUtility`).
   [[nodiscard]] virtual DriverSnapShot getSnapShot() QUARVEL_REQUIRES(serverQueueRole) = 0;
   [[nodiscard]] virtual std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
       const std::optional<DriverSnapShot>& snapShot) QUARVEL_REQUIRES(serverQueueRole) = 0;
-  /// Takes a client off the list; one that is not there is ignored.
+  /// Removes a client from the list, if it is there.
   virtual void removeClient(const ZQReportingServerInstance& client)
       QUARVEL_REQUIRES(serverQueueRole) = 0;
 };
 
-/// One client: the exported object of its connection, and the owner of the sessions it made.
+/// One client: the exported object of its connection, and the owner of its sessions.
 ///
-/// Owned by its connection and by the delegate's client list. The protocol's operations come on the
-/// connection's thread and only queue their work on the `ServerQueue`.
+/// Owned by its connection and by the delegate's client list, and by its blocks on the
+/// `ServerQueue`. The protocol's operations run on the connection's thread and only queue their
+/// work on the `ServerQueue`.
 class ZQReportingServerInstance final
     : public ZQReportingServiceProtocol,
       public std::enable_shared_from_this<ZQReportingServerInstance> {
@@ -65,6 +68,7 @@ class ZQReportingServerInstance final
                             std::weak_ptr<ZQReportingServiceDelegateProtocol> delegate);
   ~ZQReportingServerInstance() override;
 
+  /// A new instance for the client process `pid`.
   [[nodiscard]] static std::shared_ptr<ZQReportingServerInstance> initWithPID(
       std::int32_t pid, std::weak_ptr<ZQReportingServiceDelegateProtocol> delegate);
 
@@ -83,30 +87,35 @@ class ZQReportingServerInstance final
   void getAllReporters(ListReply reply) override;
   void killService(BoolReply reply) override;
 
-  /// A session of this client, or with `acrossAllClients` of the first client that has it.
+  /// A session of this client or, with `acrossAllClients`, of the first other client that has it.
   [[nodiscard]] std::shared_ptr<ZQReportingSession> findReportingSessionForID(ReporterID reporterID,
                                                                               bool acrossAllClients)
       QUARVEL_REQUIRES(serverQueueRole);
 
-  /// The connection has ended: stops the client's started sessions and takes it off the client
-  /// list, on the `ServerQueue`; a second call does nothing. From any thread.
+  /// Called when the connection has ended: stops the client's started sessions and removes it from
+  /// the client list, on the `ServerQueue`. A second call does nothing. From any thread.
   void handleConnectionError();
 
+  /// The client's process. From any thread.
   [[nodiscard]] std::int32_t processIdentifier() const { return processIdentifier_; }
-  /// When the client was registered; absent before. From any thread, as the next three.
+  /// The time of registration, absent before. From any thread, like the next three.
   [[nodiscard]] std::optional<Date> clientStartDate() const;
   void setClientStartDate(Date date);
   [[nodiscard]] std::optional<std::string> clientProcessName() const;
   void setClientProcessName(std::optional<std::string> name);
+  /// This client's sessions by identifier.
   [[nodiscard]] const SessionMap& clientReportingSessionMap() const
       QUARVEL_REQUIRES(serverQueueRole) {
     return clientReportingSessionMap_;
   }
 
  private:
+  /// Sends `session` the rise of the driver counters since its start as a message, if there is any.
   void reportDriverStatistics(ZQReportingSession& session) QUARVEL_REQUIRES(serverQueueRole);
+  /// Routes a message to the named sessions; counts a message without a session as dropped.
   void routeByIDs(const std::optional<Payload>& payload, std::uint32_t category, std::uint16_t type,
                   const std::vector<ReporterID>& reportingIDs) QUARVEL_REQUIRES(serverQueueRole);
+  /// Routes a message to every started session, or sends it as a single message without one.
   void broadcast(ZQReportingServiceDelegateProtocol& delegate,
                  const std::optional<Payload>& payload, std::uint32_t category, std::uint16_t type)
       QUARVEL_REQUIRES(serverQueueRole);
@@ -115,6 +124,8 @@ class ZQReportingServerInstance final
   const CountedAs counted_{Gauge::clients};
   const std::weak_ptr<ZQReportingServiceDelegateProtocol> delegate_;
 
+  // The delegate sets these on the `ServerQueue`; the invalidation handler reads them on a platform
+  // thread.
   mutable Mutex clientMutex_;
   std::optional<Date> clientStartDate_ QUARVEL_GUARDED_BY(clientMutex_);
   std::optional<std::string> clientProcessName_ QUARVEL_GUARDED_BY(clientMutex_);
@@ -122,8 +133,11 @@ class ZQReportingServerInstance final
   SessionMap clientReportingSessionMap_ QUARVEL_GUARDED_BY(serverQueueRole);
 };
 
-/// The one object of the whole process: accepts every connection, keeps the list of clients and the
-/// reporting switch, and answers the server instances' questions about each other.
+/// Accepts every connection and keeps the list of clients, the preferences and the reporting
+/// switch, through which the server instances find each other.
+///
+/// Owned by the listener and by its own queued blocks. Connections come on a platform thread; all
+/// other work runs on the `ServerQueue`.
 class ZQReportingServiceDelegate final
     : public ServiceListenerDelegate,
       public ZQReportingServiceDelegateProtocol,
@@ -133,11 +147,11 @@ class ZQReportingServiceDelegate final
  public:
   explicit ZQReportingServiceDelegate(Private);
 
-  /// Makes the `ServerQueue` too, and listens for changes of the preferences. Reads none yet:
-  /// reporting is on until they are said to have changed.
+  /// Creates the `ServerQueue` too, and registers for changes of the preferences. Reads none yet:
+  /// reporting is on until the first notification.
   [[nodiscard]] static std::shared_ptr<ZQReportingServiceDelegate> create();
 
-  /// Never refuses. Thread: the platform's, for connections.
+  /// Accepts every connection. Called on a platform thread.
   bool shouldAcceptNewConnection(ServiceListener& listener,
                                  const std::shared_ptr<ClientConnection>& connection) override;
 
@@ -165,7 +179,9 @@ class ZQReportingServiceDelegate final
   [[nodiscard]] static Dictionary ZQReportingDefaults();
 
  private:
+  /// Registers for changes of the preferences. A failure is logged and leaves the service without.
   void listenForDefaultsNotification();
+  /// Reads the preferences and merges them into every session. Ignores a foreign `token`.
   void readDefaults(NotificationToken token) QUARVEL_REQUIRES(serverQueueRole);
 
   /// Covers the export of a server instance and the search across clients.
@@ -177,7 +193,7 @@ class ZQReportingServiceDelegate final
   std::optional<ZQReportingDriverUtility> driverUtility_;  // present and constant after `create`
 };
 
-/// The short name of a client's process; none when it cannot be told. From any thread.
+/// The short name of a client's process, if it is known. From any thread.
 [[nodiscard]] std::optional<std::string> ProcessNameForPID(std::int32_t pid);
 
 }  // namespace quarvel

@@ -12,21 +12,22 @@
 
 namespace quarvel {
 
-/// The whole interface that audio clients call, in the order in which it is exported. Each
-/// operation is called on the connection's thread and returns at once; the work and the reply
-/// follow on the `ServerQueue`, in the order of the calls of all clients.
+/// The interface that audio clients call, in the order in which it is exported. Each operation is
+/// called on the connection's thread and returns at once. The work and the reply follow on the
+/// `ServerQueue`, in the order of the calls of all clients.
 ///
-/// Unknown identifiers are no errors: they get neutral replies. The one error a client can receive
-/// is that reporting is switched off (`sendMessage`).
+/// An unknown identifier is not an error and gets a neutral reply. The only error that a client can
+/// receive says that reporting is switched off (`sendMessage`).
 class ZQReportingServiceProtocol : public ExportedObject {
  public:
-  /// Makes a session; one already there under this client's `reporterID` is dropped, not stopped.
-  /// Replies true.
+  /// Creates a session. One that this client already has under `reporterID` is dropped, not
+  /// stopped. Replies true.
   virtual void createReportingSession(ReporterID reporterID, BoolReply reply) = 0;
-  /// For one of the caller's own sessions. Replies true, found or not.
+  /// Sets the service type of one of the caller's own sessions. Replies true, found or not.
   virtual void setServiceType(std::uint16_t serviceType, ReporterID reportingSession,
                               BoolReply reply) = 0;
-  /// Replies the numeric service type, 65535 when the session is unknown; for identifier 0 twice.
+  /// Replies the numeric service type of any client's session, 65535 when it is unknown; twice for
+  /// identifier 0.
   virtual void getServiceNameForReporterID(ReporterID reporterID, ServiceTypeReply reply) = 0;
   /// Merges `configuration` into the user information of one of the caller's own sessions; an
   /// absent one changes nothing. Replies true, found or not.
@@ -35,8 +36,8 @@ class ZQReportingServiceProtocol : public ExportedObject {
   /// Starts any client's session. The reply, true, comes when the session stops; none ever comes
   /// for a session that is unknown or started already.
   virtual void startReportingSessionForID(ReporterID reporterID, BoolReply reply) = 0;
-  /// Routes a message to the sessions named (any client's), or with an absent list to every started
-  /// session, or alone when there is none. Replies with no error, or with domain
+  /// Routes a message to the named sessions, any client's; with an absent list to every started
+  /// session, or as a single message when there is none. Replies with no error, or with domain
   /// "tarnwick.audio.reporting", code 1, while reporting is switched off.
   virtual void sendMessage(std::optional<Payload> payload, std::uint32_t category,
                            std::uint16_t type, std::optional<std::vector<ReporterID>> reportingIDs,

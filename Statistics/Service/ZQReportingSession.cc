@@ -43,7 +43,7 @@ LogHandle Scope() {
   return scope;
 }
 
-/// Blanks in the payload's own keys become underscores.
+/// Replaces blanks in the payload's own keys with underscores.
 Payload EnrichPayload(const Payload& payload) {
   return payload.replacingInKeys(' ', '_');
 }
@@ -65,7 +65,7 @@ Dictionary OrientationEntry(std::string_view mode, std::string_view orientation,
           {fmt::format("{}_orientation_time", mode), seconds}};
 }
 
-/// The texts that each key of a history had, joined, in the order in which the keys first came.
+/// Joins the texts of each key of a history, in the order in which the keys first occurred.
 class SummaryText {
  public:
   void add(std::string key, std::string text) {
@@ -88,7 +88,7 @@ class SummaryText {
   }
 
  private:
-  std::deque<std::pair<std::string, std::string>> texts_;  // they stay where the index finds them
+  std::deque<std::pair<std::string, std::string>> texts_;  // the index points to its elements
   std::unordered_map<std::string_view, std::string*> index_;
 };
 
@@ -111,7 +111,8 @@ Payload SummaryOf(const PayloadHistory& history, std::uint16_t serviceType) {
   return texts.payload();
 }
 
-/// A client's text as part of a file name: it can name no directory and leaves room for the rest.
+/// A client's text as part of a file name: without directory separators, and short enough that the
+/// whole name stays below the 255 bytes of common file systems.
 std::string FileNamePart(std::string text) {
   constexpr std::size_t kLongest = 128;
   text.resize(Utf8Prefix(text, kLongest).size());
@@ -120,7 +121,7 @@ std::string FileNamePart(std::string text) {
   return text;
 }
 
-/// What the agent set-up waits for. Shared with the agent's completion, which may come after the
+/// The agent set-up waits on this. Shared with the agent's completion, which may come after the
 /// wait has ended.
 struct BackendSearch {
   const std::shared_ptr<Condition> condition = CreateCondition();
@@ -204,7 +205,7 @@ void ZQReportingSession::setAggregatedPayloadData(std::shared_ptr<PayloadHistory
     const MutexLock lock(historyMutex_);
     aggregatedPayloadData_.swap(history);
   }
-  // The old one goes here, outside the lock: it may be large.
+  // The old history, perhaps large, is destroyed outside the lock.
 }
 
 void ZQReportingSession::setServiceType(std::uint16_t serviceType) {
@@ -289,8 +290,8 @@ void ZQReportingSession::stop() {
   ZQ_LOG(Scope(), debug, "ending session {}", reporterID_);
   if (shouldReportOrientation() && orientationCallbackID_) unregisterOrientationHandlers();
   if (!started_) return;
-  // Said a second time on purpose: the first line tells of every call, this one of those that end
-  // something.
+  // The repetition is deliberate: the first line reports every call, this one a call that ends a
+  // run.
   ZQ_LOG(Scope(), debug, "ending session {}", reporterID_);
   EmitKernelTrace(kTraceStopping);
   sendSummary();
@@ -301,9 +302,9 @@ void ZQReportingSession::stop() {
   transactionCompleteBlock_(true);
 }
 
-/// As one would expect, `createSummaryEventForSession` and `sendMessage`; but where no file shows
-/// when it is done, a history is condensed on the session's queue: a long one takes a second, and
-/// every client waits for this one.
+/// An internal build condenses the history here, on the `ServerQueue`, since its file is written
+/// there. Any other build condenses it on the session's queue: a long history takes a second, in
+/// which the `ServerQueue` would keep every client waiting.
 void ZQReportingSession::sendSummary() {
   ZQ_FUNCTION("-[ZQReportingSession stop]");
   const auto history = aggregatedPayloadData();
@@ -480,7 +481,7 @@ void ZQReportingSession::deliver(const Payload& enriched, std::uint32_t category
     ZQ_LOG(Scope(), error, "{}", "No valid RelmReportingSession");
     return;
   }
-  // A refusal is silent on purpose: the message stands in the session's history all the same.
+  // A refusal is deliberately silent; the message is in the session's history.
   if (relmReportingSession_->agentSendMessage(AgentCategory(category), type, enriched)) {
     ZQ_LOG(Scope(), debug, "RelmReportingAgent {} : message {} : category {} : type {}",
            relmReportingSession_->description(), Described(original), category, type);

@@ -26,13 +26,13 @@
 
 namespace quarvel {
 
-/// One client's reporting session: takes the messages sent to it, hands them to the telemetry agent
-/// inside an agent session of its own while it is started, or one by one while it is not, and
-/// reports its end to the client.
+/// One client's reporting session. While it is started, its messages go to the telemetry agent
+/// inside an agent session; before and after, each goes as a single message. A stop sends a summary
+/// and answers the client's start call.
 ///
-/// Owned by the session map of its server instance. Every operation is called on the `ServerQueue`
-/// and returns at once; all work with the agent runs on the session's own serial queue, in order.
-/// Dropping a session neither stops it nor loses what is queued: its blocks keep it alive.
+/// Owned by the session map of its server instance and by its queued blocks. Every operation is
+/// called on the `ServerQueue` and returns at once; all work with the agent runs on the session's
+/// own serial queue, in order. Dropping a session neither stops it nor loses queued messages.
 class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSession> {
   struct Private {};
 
@@ -45,7 +45,7 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
   ZQReportingSession(const ZQReportingSession&) = delete;
   ZQReportingSession& operator=(const ZQReportingSession&) = delete;
 
-  /// A new session. `processIdentifiers`: the clients that own it. From any thread.
+  /// A new session, owned by the client processes `processIdentifiers`. From any thread.
   [[nodiscard]] static std::shared_ptr<ZQReportingSession> initWithID(
       ReporterID reporterID, std::vector<std::int32_t> processIdentifiers);
 
@@ -56,19 +56,19 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
   void setConfiguration(const std::optional<Dictionary>& configuration);
   void updateDefaults(const std::optional<Dictionary>& defaults);
 
-  /// Begins an agent session, for whose backends the session queue waits up to 9 seconds. Already
-  /// started: changes nothing.
+  /// Begins an agent session, for whose backends the session queue waits up to 9 seconds. Does
+  /// nothing when it is already started.
   void start() QUARVEL_REQUIRES(serverQueueRole);
   /// Sends the summary, flushes and ends the agent session and answers the start call
-  /// (`transactionCompleteBlock`).
+  /// (`transactionCompleteBlock`). Does nothing when it is not started.
   void stop() QUARVEL_REQUIRES(serverQueueRole);
 
-  /// The message's identifier, "category_type_n"; counts the message.
+  /// Counts a message and returns its identifier, "category_type_n".
   [[nodiscard]] std::string messageIdForCategory(std::uint32_t category, std::uint16_t type)
       QUARVEL_REQUIRES(serverQueueRole);
 
   /// Records the message and delivers it on the session queue. `reply` is called at once, without
-  /// an error: the outcome of the delivery never reaches the caller, whatever `sync` says. An
+  /// an error; `sync` has no effect, so the outcome of the delivery never reaches the caller. An
   /// absent payload counts as an empty one.
   void sendMessage(const std::optional<Payload>& payload, std::uint32_t category,
                    std::uint16_t type, bool sync, const SendReply& reply)
@@ -77,25 +77,28 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
                    std::uint16_t type, const SendReply& reply) QUARVEL_REQUIRES(serverQueueRole);
 
   /// Hands one message that belongs to no session to the agent, on the background queue: at once,
-  /// or for alarms 0 to 59 seconds later. `userInfo` has no effect. `reply` is called there. From
-  /// any thread.
+  /// or for alarms after 0 to 59 seconds, so that the alarms of many devices spread over a minute.
+  /// `userInfo` has no effect. `reply` is called on that queue. From any thread.
   static void sendSingleMessage(const std::optional<Payload>& payload, std::uint32_t category,
                                 std::uint16_t type, std::uint16_t serviceType,
                                 const std::optional<Dictionary>& userInfo, SendReply reply);
 
-  /// Condenses the history into one dictionary of texts, each key's values joined by ",". Leaves
-  /// the user information at the front of the history, and on an internal build the whole history
-  /// as a JSON file in the diagnostics directory. None when nothing was sent.
+  /// Condenses the history into one dictionary of texts, each key's values joined by ",". Inserts
+  /// the user information at the front of the history and, on an internal build, writes the history
+  /// as a JSON file in the diagnostics directory. None when the history is empty.
   [[nodiscard]] std::optional<Payload> createSummaryEventForSession()
       QUARVEL_REQUIRES(serverQueueRole);
-  /// Whether changes of the orientation go into the history: on internal builds, for some service
-  /// types, not on every class of device.
+  /// Whether orientation changes go into the history: on internal builds, for two service types,
+  /// and not on one class of device.
   [[nodiscard]] bool shouldReportOrientation() const;
+
+  // Without a queue in their declaration: from any thread.
 
   [[nodiscard]] ReporterID reporterID() const { return reporterID_; }
   [[nodiscard]] const std::vector<std::int32_t>& processIdentifiers() const {
     return processIdentifiers_;
   }
+  /// Whether a start has not been followed by a stop.
   [[nodiscard]] bool started() const QUARVEL_REQUIRES(serverQueueRole) { return started_; }
   /// Never true: nothing sets it.
   [[nodiscard]] bool relmReportingSessionStarted() const { return relmReportingSessionStarted_; }
@@ -104,10 +107,9 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
     return serviceName_;
   }
   [[nodiscard]] const SharedDictionary& userInfo() const { return *userInfo_; }
-  /// The history of this run; none after a stop. From any thread.
+  /// The history of this run; null after a stop. From any thread.
   [[nodiscard]] std::shared_ptr<PayloadHistory> aggregatedPayloadData() const;
-  /// What the drivers had counted at the start. Kept for whoever started the session; not read
-  /// here.
+  /// Driver counters at the start. Kept for the server instance; the session does not read them.
   [[nodiscard]] const std::optional<DriverSnapShot>& driverSnapShot() const
       QUARVEL_REQUIRES(serverQueueRole) {
     return driverSnapShot_;
@@ -115,7 +117,7 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
   void setDriverSnapShot(std::optional<DriverSnapShot> snapShot) QUARVEL_REQUIRES(serverQueueRole) {
     driverSnapShot_ = std::move(snapShot);
   }
-  /// The client's start reply, to be answered at the stop.
+  /// The client's start reply, which the stop answers.
   [[nodiscard]] const BoolReply& transactionCompleteBlock() const
       QUARVEL_REQUIRES(serverQueueRole) {
     return transactionCompleteBlock_;
@@ -123,24 +125,36 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
   void setTransactionCompleteBlock(BoolReply block) QUARVEL_REQUIRES(serverQueueRole) {
     transactionCompleteBlock_ = std::move(block);
   }
-  /// For log lines: "<ZQReportingSession 7>".
+  /// Appends "<ZQReportingSession 7>", for log lines.
   static void appendDescription(std::string& text, ReporterID reporterID);
 
  private:
-  /// The pieces of a category's and a type's names.
+  /// The pieces of a category's and a type's names: component, kind, type.
   using MessageName = std::array<std::string_view, 3>;
 
+  /// Counts a message and returns its identity.
   [[nodiscard]] MessageIdentity nextIdentity(std::uint32_t category, std::uint16_t type)
       QUARVEL_REQUIRES(serverQueueRole);
+  // On the session's queue.
+
+  /// Creates the agent session and waits for its backends; drops it when none is found in time.
   void setUpAgent(const SharedDictionary& userInfo, const std::string& serviceName,
                   bool backendFound);
+  /// Hands a message to the agent. `wasStarted`: the session's state at the sending, which chooses
+  /// between the agent session and a single message.
   void deliver(const Payload& enriched, std::uint32_t category, std::uint16_t type,
                const Payload& original, bool wasStarted);
-  void acceptMessage() const;
-  void sendSummary() QUARVEL_REQUIRES(serverQueueRole);
+  /// Flushes and releases the agent session.
   void endAgent();
+
+  // On the `ServerQueue`.
+
+  void acceptMessage() const;
+  /// Sends the summary of a run that has a history.
+  void sendSummary() QUARVEL_REQUIRES(serverQueueRole);
   void registerOrientationHandlers() QUARVEL_REQUIRES(serverQueueRole);
   void unregisterOrientationHandlers() QUARVEL_REQUIRES(serverQueueRole);
+  /// Writes `history` as a JSON file into the diagnostics directory. Failures are logged.
   void writeSummaryLogFile(const PayloadHistory& history) const;
   void setAggregatedPayloadData(std::shared_ptr<PayloadHistory> history);
 
@@ -151,21 +165,21 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
   std::optional<CountedAs> countedAsStarted_ QUARVEL_GUARDED_BY(serverQueueRole);
   bool started_ QUARVEL_GUARDED_BY(serverQueueRole) = false;
   std::string serviceName_ QUARVEL_GUARDED_BY(serverQueueRole) = "unknown";
-  /// Counts run on across a stop and a new start. A session has messages of few names, and there
-  /// are few hundred in all.
+  /// Continues across a stop and a new start. A vector, since a session's messages have few names.
   std::vector<std::pair<MessageName, std::uint64_t>> messageCounts_
       QUARVEL_GUARDED_BY(serverQueueRole);
   std::optional<DriverSnapShot> driverSnapShot_ QUARVEL_GUARDED_BY(serverQueueRole);
   std::optional<std::string> orientationCallbackID_ QUARVEL_GUARDED_BY(serverQueueRole);
   BoolReply transactionCompleteBlock_ QUARVEL_GUARDED_BY(serverQueueRole);
 
-  // Written on one queue and read on the other.
+  // Written on one queue and read on the other: atomic instead of guarded.
   std::atomic<std::uint16_t> serviceType_ = kServiceTypeUnknown;
   std::atomic<bool> relmReportingSessionStarted_ = false;
 
-  /// Shared with the agent set-up on purpose: what is merged before it runs, it sees.
+  /// Shared with the agent set-up deliberately: it sees merges that precede its run.
   const std::shared_ptr<SharedDictionary> userInfo_ = std::make_shared<SharedDictionary>();
 
+  // The `ServerQueue` replaces it; orientation handlers read it on a platform thread.
   mutable Mutex historyMutex_;
   std::shared_ptr<PayloadHistory> aggregatedPayloadData_ QUARVEL_GUARDED_BY(historyMutex_);
 

@@ -1,6 +1,6 @@
-// A consumer of the stream: prints each row once, a JSON line each. A stream drops repeats only
-// within its window; a device that was cut off for longer, at the worst moment, sends a batch again
-// after it. The rows' names tell.
+// A consumer of the stream: prints each row once, one JSON line for each. The stream drops repeats
+// only within its duplicate window. A device that was offline for longer may send a batch again, so
+// the consumer drops repeats by the rows' names.
 //
 // usage: nats-consumer URL STREAM [--until-empty]
 
@@ -16,12 +16,12 @@ namespace {
 
 constexpr int kBatch = 500;
 constexpr long kPatienceMilliseconds = 2000;
-constexpr std::size_t kRemembered = 1'000'000;  // rows; some hundred megabytes
+constexpr std::size_t kRemembered = 1'000'000;  // row names, some hundred megabytes
 
 /// The names of the latest rows.
 class Names {
  public:
-  /// Whether it is a new one.
+  /// Adds a name; false if it is known.
   bool add(const std::string& name) {
     if (!known_.insert(name).second) return false;
     order_.push_back(name);
@@ -61,7 +61,8 @@ natsStatus Consume(natsSubscription* subscription, bool untilEmpty) {
     if (status != NATS_OK) return status;
     for (int i = 0; i < messages.Count; ++i) {
       Print(messages.Msgs[i], names);
-      natsMsg_Ack(messages.Msgs[i], nullptr);  // only now: what was not printed comes again
+      natsMsg_Ack(messages.Msgs[i],
+                  nullptr);  // only now: an unacknowledged message is delivered again
     }
     natsMsgList_Destroy(&messages);
     std::fflush(stdout);
@@ -84,8 +85,8 @@ int main(int argumentCount, char** arguments) {
   options.Stream = arguments[2];
   natsStatus status = natsConnection_ConnectTo(&connection, arguments[1]);
   if (status == NATS_OK) status = natsConnection_JetStream(&js, connection, nullptr);
-  // Without a durable name it begins with the stream's first message; with one it goes on where it
-  // left off.
+  // Without a durable name the consumer begins with the stream's first message; with one it would
+  // continue after the last acknowledged message.
   if (status == NATS_OK) {
     status = js_PullSubscribe(&subscription, js, "quarvel.>", nullptr, nullptr, &options, nullptr);
   }

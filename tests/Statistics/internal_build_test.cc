@@ -1,9 +1,9 @@
 #include <gmock/gmock.h>
 
-#include "tests/Statistics/Service/SessionOwner.h"
+#include "tests/Statistics/Service/CoreFixtures.h"
 
-// What internal builds do besides. A program of its own, since a process asks only once whether it
-// belongs to one.
+// Additional work of internal builds. A program of its own, since a process reads only once whether
+// it belongs to one.
 
 namespace quarvel {
 namespace {
@@ -12,7 +12,7 @@ using testing::ElementsAre;
 using testing::IsEmpty;
 
 struct InternalBuild : testing::Test {
-  // Says yes to whoever asks first; what later simulations say is not asked for any more.
+  // The first answer counts for the process; later simulations are not asked.
   static void SetUpTestSuite() {
     Simulation simulation(1);
     simulation.internalBuild = true;
@@ -22,7 +22,7 @@ struct InternalBuild : testing::Test {
   }
 };
 
-TEST_F(InternalBuild, AFileThatCannotBeWrittenCostsTheSummaryNothing) {
+TEST_F(InternalBuild, FileErrorsAreLoggedAndDoNotAffectTheSummary) {
   SessionOwner owner(1);
   owner.files.directoryError = Error::because("files", 13, "no");
   owner.files.writeError = Error::because("files", 2, "nowhere");
@@ -39,11 +39,11 @@ TEST_F(InternalBuild, AFileThatCannotBeWrittenCostsTheSummaryNothing) {
                   function + "jsonOutput writeToURL: files 2: nowhere"));
 }
 
-TEST_F(InternalBuild, OrientationIsFollowedForSomeServiceTypesAndDevices) {
+TEST_F(InternalBuild, OrientationIsTrackedForTwoServiceTypesExceptOnDeviceClass6) {
   struct Case {
     std::uint16_t serviceType;
     std::optional<std::int64_t> deviceClass;
-    bool followed;
+    bool tracked;
   };
   const Case kCases[] = {{7, 1, true},  {2, 1, true},  {7, std::nullopt, true}, {7, 6, false},
                          {2, 6, false}, {8, 1, false}, {65535, 1, false}};
@@ -52,7 +52,7 @@ TEST_F(InternalBuild, OrientationIsFollowedForSomeServiceTypesAndDevices) {
     SessionOwner owner(1, each.serviceType);
     owner.deviceClass = each.deviceClass;
     owner.start();
-    const std::size_t expected = each.followed ? 1 : 0;
+    const std::size_t expected = each.tracked ? 1 : 0;
     EXPECT_EQ(owner.orientation.device.count("ZQReportingService 7"), expected);
     EXPECT_EQ(owner.orientation.ui.count("ZQReportingService 7"), expected);
     owner.stop();
@@ -61,7 +61,7 @@ TEST_F(InternalBuild, OrientationIsFollowedForSomeServiceTypesAndDevices) {
   }
 }
 
-TEST_F(InternalBuild, OrientationChangesAreInTheSummaryToTheMillisecond) {
+TEST_F(InternalBuild, TheSummaryHasOrientationChangesToTheMillisecond) {
   for (const auto seed : Seeds()) {
     SessionOwner owner(seed, kServiceTypeTelephony);
     owner.start();
@@ -70,6 +70,7 @@ TEST_F(InternalBuild, OrientationChangesAreInTheSummaryToTheMillisecond) {
     owner.runFor(1s);
     SimulatedOrientation::turn(owner.orientation.ui, Orientation::portrait);
     owner.runFor(1s);
+    owner.scheduler.setWallClock(owner.scheduler.wallClock() - 10s);  // before the start
     SimulatedOrientation::turn(owner.orientation.device, Orientation::portrait);
     owner.runFor(0s);
     owner.stop();
@@ -77,7 +78,7 @@ TEST_F(InternalBuild, OrientationChangesAreInTheSummaryToTheMillisecond) {
     EXPECT_EQ(owner.delivered().at(0).payload.root().toDictionary(),
               (Dictionary{{"ZQ_Session_Summary_Event", "2"},
                           {"device_orientation", "landscapeLeft,portrait"},
-                          {"device_orientation_time", "1.235,3.235"},
+                          {"device_orientation_time", "1.235,6.765"},
                           {"ui_orientation", "portrait"},
                           {"ui_orientation_time", "2.235"}}));
   }

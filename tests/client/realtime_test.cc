@@ -77,7 +77,8 @@ TEST_F(RealtimeReporterTest, LossesAreCountedAndReportedAndTheRestIsWhole) {
   reporter_.recordBytes = 16;
   RealtimeReporter& reporter = report();
   EXPECT_FALSE(reporter.record(kPlayback, kSetup).set("twelve bytes", 128).send());
-  EXPECT_FALSE(reporter.record(kPlayback, kSetup).set("k", std::string(70'000, 'x')).send());
+  EXPECT_FALSE(
+      reporter.record(kPlayback, kSetup).set("k", std::string(70'000, 'x')).set("n", 1).send());
   EXPECT_TRUE(reporter.record(kPlayback, kSetup).set("k", "\xff").send());
   EXPECT_TRUE(reporter.record(kPlayback, kSetup).set("elevenbytes", 1).send()) << "16 bytes";
   static_cast<void>(reporter.record(kPlayback, kSetup).set("abandoned", 1));

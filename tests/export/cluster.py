@@ -1,4 +1,4 @@
-"""A NATS cluster of three nodes on the loopback, each of which can be killed."""
+"""A NATS cluster of three nodes on the loopback, each of which a test can kill."""
 
 import contextlib
 import json
@@ -7,21 +7,13 @@ import pathlib
 import socket
 import ssl
 import subprocess
+import sys
 import tempfile
-import time
+
+sys.path.insert(0, str(pathlib.Path(__file__).parents[1] / "integration"))
+from harness import PATIENCE, eventually
 
 DEPLOY = pathlib.Path(__file__).parents[2] / "fleet/nats"
-PATIENCE = 60
-
-
-def until(condition):
-    deadline = time.monotonic() + PATIENCE
-    while time.monotonic() < deadline:
-        result = condition()
-        if result:
-            return result
-        time.sleep(0.1)
-    raise AssertionError("the cluster never came to it")
 
 
 def free_ports(count):
@@ -67,7 +59,7 @@ class Cluster:
 
     def kill(self, node):
         self.nodes[node].kill()
-        self.nodes[node].wait()
+        self.nodes[node].wait(PATIENCE)
 
     def close(self):
         for node in range(3):
@@ -75,7 +67,7 @@ class Cluster:
         self._directory.cleanup()
 
     def rows(self, consumer):
-        """What the consumer prints, once it gets through to the stream's end."""
+        """The rows that the consumer prints up to the stream's end."""
         def read():
             for url in self.urls:
                 ran = subprocess.run([consumer, url, "QUARVEL", "--until-empty"], capture_output=True, text=True,
@@ -83,23 +75,24 @@ class Cluster:
                 if ran.returncode == 0:
                     return [json.loads(line) for line in ran.stdout.splitlines()]
             return None
-        return until(read)
+        return eventually(read, "the consumer reads the stream", 0.1)
 
     def create_stream(self):
-        """As soon as the three have found one another."""
+        """Creates the stream as soon as the cluster has a leader."""
         wanted = {"name": "QUARVEL", "subjects": ["quarvel.>"], "num_replicas": 3, "storage": "file",
                   "retention": "limits", "discard": "old"}
-        until(lambda: "config" in self.ask("$JS.API.STREAM.CREATE.QUARVEL", json.dumps(wanted)))
+        eventually(lambda: "config" in self.ask("$JS.API.STREAM.CREATE.QUARVEL", json.dumps(wanted)),
+                   "the stream", 0.1)
 
     def state(self):
-        """Of the stream: how many "messages" and "bytes" it holds."""
-        return until(lambda: self.ask("$JS.API.STREAM.INFO.QUARVEL").get("state"))
+        """The stream's state, with its counts of "messages" and "bytes"."""
+        return eventually(lambda: self.ask("$JS.API.STREAM.INFO.QUARVEL").get("state"), "the stream's state", 0.1)
 
     def ask(self, subject, body=""):
-        """A request's answer, or an empty one while nobody answers."""
+        """The answer to a request; an empty one if no server answers."""
         with contextlib.suppress(OSError), socket.create_connection(("127.0.0.1", self.clients[0]), 5) as peer:
             while peer.recv(1) != b"\n":
-                pass  # what the server says of itself comes first, in the clear
+                pass  # the server's INFO line comes first, before TLS
             with self.secured(peer) as talking:
                 reader = talking.makefile("rb")
                 talking.sendall('CONNECT {{"verbose":false}}\r\nSUB _INBOX.q 1\r\nPUB {} _INBOX.q {}\r\n{}\r\n'
@@ -111,7 +104,7 @@ class Cluster:
 
 
 class SecuredCluster(Cluster):
-    """As node.conf has it, with certificates of its own."""
+    """A cluster with the configuration of node.conf, and certificates of its own."""
 
     scheme = "tls"
 
@@ -130,7 +123,7 @@ class SecuredCluster(Cluster):
                          "-days", "2", "-extfile", "extensions", "-out", f"{name}.pem")
 
     def openssl(self, *arguments):
-        subprocess.run(["openssl", *arguments], cwd=self.directory, check=True, capture_output=True)
+        subprocess.run(["openssl", *arguments], cwd=self.directory, check=True, capture_output=True, timeout=PATIENCE)
 
     def arguments(self, node):
         return ["-c", self.directory / f"{node}.conf", "-a", "127.0.0.1", "-p", str(self.clients[node]), "-m", "0",

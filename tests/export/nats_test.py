@@ -1,4 +1,4 @@
-"""The service and a real NATS cluster of three nodes, any of which may be killed at any moment."""
+"""The service with a NATS cluster of three nodes, while nodes and the service are killed."""
 
 import collections
 import contextlib
@@ -8,11 +8,9 @@ import pathlib
 import random
 import signal
 import sqlite3
-import sys
 import time
 import unittest
 
-sys.path.insert(0, str(pathlib.Path(__file__).parents[1] / "integration"))
 from cluster import Cluster, SecuredCluster
 from harness import ServiceTest, eventually
 
@@ -43,7 +41,7 @@ class Nats(ServiceTest):
         return self.service(CONFIGURATION.format(urls=json.dumps(self.cluster.urls), window=window))
 
     def names(self, service):
-        """Of every row that the store holds."""
+        """The names of every row that the store holds."""
         store = service.rows("SELECT value FROM meta WHERE key = 'store_id'")[0][0]
         return [f"{store}-{table}-{row[0]}"
                 for table in ("agent_session", "message", "analytics_event", "power_event")
@@ -60,7 +58,7 @@ class Nats(ServiceTest):
                          " FROM backend_cursor WHERE table_name = ?)", table)[0][0]
             for table in ("agent_session", "message", "analytics_event", "power_event")), "all is exported")
 
-    def test_every_row_arrives_once_whatever_is_killed(self):
+    def test_every_row_arrives_once_while_nodes_and_the_service_are_killed(self):
         rows = 100_000 if NIGHTLY else 20_000
         dice = random.Random(7)
         service = self.started()
@@ -83,7 +81,7 @@ class Nats(ServiceTest):
                 service.start()
         self.await_export(service)
         names = self.names(service)
-        self.assertGreaterEqual(len(names), rows - 4 * 1024)  # what a kill may take: the last moment's
+        self.assertGreaterEqual(len(names), rows - 4 * 1024)  # a kill may lose the rows of the last moment
         arrived = self.cluster.rows(os.environ["QUARVEL_CONSUMER"])
         self.assertEqual(sorted(row["name"] for row in arrived), sorted(names))
         self.assertEqual(self.cluster.state()["messages"], len(names), "the stream itself has dropped the repeats")
@@ -101,7 +99,7 @@ class Nats(ServiceTest):
         self.await_export(service)
         before = self.cluster.state()["messages"]
         for wait, repeats in ((2, 100), (0, 100)):
-            # As a crash between the acknowledgement and the cursor's commit leaves it.
+            # The state after a crash between the acknowledgement and the cursor's commit.
             service.end(signal.SIGKILL)
             with contextlib.closing(sqlite3.connect(service.directory / "state/telemetry.db")) as store, store:
                 store.execute("UPDATE backend_cursor SET exported_through = exported_through - 100"
@@ -113,12 +111,12 @@ class Nats(ServiceTest):
         names = collections.Counter(row["name"] for row in self.cluster.rows(os.environ["QUARVEL_CONSUMER"]))
         self.assertEqual(sorted(names.elements()), sorted(self.names(service)))
 
-    def test_what_the_stream_cannot_take_is_set_aside_and_the_reason_told(self):
+    def test_rows_too_large_for_the_stream_are_refused_with_a_reason(self):
         service = self.service(CONFIGURATION.format(urls=json.dumps(self.cluster.urls), window=60).replace(
             "create_stream = true", "create_stream = false"))
         client = self.client(service)
         client.start_session(1)
-        eventually(lambda: "no stream QUARVEL" in service.log(), "the missing stream is told of")
+        eventually(lambda: "no stream QUARVEL" in service.log(), "a log line about the missing stream")
         service.end()
         configuration = service.directory / "etc/quarvel.toml"
         configuration.write_text(configuration.read_text().replace("create_stream = false", "create_stream = true"))

@@ -6,15 +6,15 @@
 #include <cstdio>
 #include <cstdlib>
 
-/// Standard error as it was when the process began: a fuzzer closes it to the service's log.
+/// A copy of standard error, which run.py has libFuzzer close because the service logs there.
 inline const int kComplaints = ::dup(STDERR_FILENO);
 
-/// What a fuzz target asserts, in every build.
-inline void Require(bool holds, const char* what) {
+/// An assertion of a fuzz target, in every build: prints the requirement and aborts.
+inline void Require(bool holds, const char* requirement) {
   if (holds) return;
-  ::dprintf(kComplaints, "required: %s\n", what);
+  ::dprintf(kComplaints, "required: %s\n", requirement);
   std::abort();
 }
 
-/// What libFuzzer and the replay call with each input.
+/// Runs one input; called by libFuzzer and by replay.cc.
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size);

@@ -1,5 +1,5 @@
-// The outer ends of the platform under fuzzing: an agent and sinks that take everything and check
-// it, a device without properties, preferences or drivers, and a process that does not end.
+// Fakes of the platform's outer ends for connection_fuzz.cc: an agent and sinks that accept and check
+// every payload, a device without properties, preferences or drivers, and a process that must not end.
 
 #include <rapidjson/reader.h>
 #include <unistd.h>
@@ -27,13 +27,13 @@ namespace quarvel {
 
 namespace {
 
-void Look(const Payload& payload) {
+void Check(const Payload& payload) {
   const std::string json = JsonText(payload);
   rapidjson::StringStream stream(json.c_str());
-  rapidjson::BaseReaderHandler<> nobody;
+  rapidjson::BaseReaderHandler<> handler;
   Require(
-      !rapidjson::Reader().Parse<rapidjson::kParseValidateEncodingFlag>(stream, nobody).IsError(),
-      "what reaches the agent is JSON");
+      !rapidjson::Reader().Parse<rapidjson::kParseValidateEncodingFlag>(stream, handler).IsError(),
+      "every payload is JSON");
 }
 
 class Session final : public RelmReportingSession {
@@ -44,7 +44,7 @@ class Session final : public RelmReportingSession {
   }
   Outcome agentSendMessage(std::uint16_t, std::uint16_t, const Payload& payload) override {
     Require(flushes_ == 0, "nothing comes after the flush");
-    Look(payload);
+    Check(payload);
     return Success();
   }
   void flushMessages(FlushCompletion completion) override {
@@ -66,14 +66,14 @@ RelmReportingToken RelmReporting::newSecureHierarchyToken(
 
 std::shared_ptr<RelmReportingSession> RelmReporting::createAgentSession(
     const Dictionary& sessionInfo, const Dictionary& userInfo, const std::vector<std::string>&) {
-  Look(Payload(sessionInfo));
-  Look(Payload(userInfo));
+  Check(Payload(sessionInfo));
+  Check(Payload(userInfo));
   return std::make_shared<Session>();
 }
 
 Outcome RelmReporting::sendOneMessage(const Dictionary&, const Dictionary&, std::uint16_t,
                                       std::uint16_t, const Payload& payload) {
-  Look(payload);
+  Check(payload);
   return Success();
 }
 
@@ -82,16 +82,16 @@ void CountDroppedMessage(MessageDrop) {}
 void AddToGauge(Gauge gauge, int difference) {
   static std::array<std::atomic<int>, 3> gauges{};
   const int now = gauges[static_cast<std::size_t>(gauge)] += difference;
-  Require(now >= 0, "nothing ends more often than it begins");
+  Require(now >= 0, "no gauge falls below zero");
 }
 
 void VistrelSendEventLazy(std::string_view, const std::function<Payload()>& payload) {
-  Look(payload());
+  Check(payload());
 }
 
 void OhmrikLogRegisteredEvent(std::int32_t, std::string_view, const Payload& record,
                               std::nullptr_t) {
-  Look(record);
+  Check(record);
 }
 
 std::optional<bool> DevicePropertyBoolean(std::string_view) {

@@ -1,8 +1,7 @@
-// A whole connection: the core behind a real listener, queues and sockets. One client sends
-// whatever bytes come, as it pleases, and goes; beside it a polite one is served as if it were
-// alone.
+// A whole connection: the core behind a real listener, queues and sockets. One client sends the
+// input and disconnects; a polite client beside it must be served as if it were alone.
 //
-// An input's first byte says how the client behaves, the rest is its stream.
+// An input's first byte selects the client's behaviour, the rest is its stream.
 
 #include <unistd.h>
 
@@ -31,7 +30,7 @@ namespace {
 using quarvel::MessagePackScanner;
 using quarvel::PayloadValue;
 
-/// Nothing should take a thousandth of it.
+/// A thousand times as long as any step should take.
 constexpr std::chrono::seconds kPatience(30);
 
 std::filesystem::path ServePath() {
@@ -43,7 +42,7 @@ std::filesystem::path ServePath() {
   return directory.path() / "socket";
 }
 
-/// The service, begun once and never ended.
+/// Starts the service at the first call, for the life of the process; returns its socket's path.
 const std::filesystem::path& Service() {
   static const std::filesystem::path path = [] {
     std::filesystem::path at = ServePath();
@@ -79,10 +78,10 @@ class Client {
   Client(const Client&) = delete;
   Client& operator=(const Client&) = delete;
 
-  /// False when the service has hung up.
+  /// False when the service has closed the connection.
   bool send(std::string_view bytes) {
     while (!bytes.empty()) {
-      // The fuzzer interrupts its own thread now and then.
+      // libFuzzer's timer signal may interrupt the call.
       const ssize_t count =
           TEMP_FAILURE_RETRY(::send(socket_, bytes.data(), bytes.size(), MSG_NOSIGNAL));
       Require(count > 0 || (errno != EAGAIN && errno != EWOULDBLOCK), "the service reads on");
@@ -93,7 +92,7 @@ class Client {
   }
   void stopSending() { ::shutdown(socket_, SHUT_WR); }
 
-  /// What has come, after one more read; false at the end of the stream.
+  /// Reads once; false at the end of the stream.
   bool receive() {
     char bytes[4096];
     const ssize_t count = TEMP_FAILURE_RETRY(::recv(socket_, bytes, sizeof bytes, 0));
@@ -102,7 +101,7 @@ class Client {
     received_.append(bytes, static_cast<std::size_t>(count));
     return true;
   }
-  /// Takes the next response off, if it has come whole.
+  /// Removes and checks the next response; false while it is incomplete.
   bool response() {
     MessagePackScanner scanner(std::size_t{1} << 24, MessagePackScanner::kDeepest);
     const auto progress = scanner.scan(received_);
@@ -116,7 +115,7 @@ class Client {
     const PayloadValue error = *++item;
     const PayloadValue result = *++item;
     Require(error.isNil() || (error.find("domain") && error.find("code") && result.isNil()),
-            "an error says what it is");
+            "an error has a domain and a code");
     received_.erase(0, scanner.length());
     return true;
   }
@@ -126,8 +125,7 @@ class Client {
   std::string received_;
 };
 
-/// Makes sure that the service serves a polite client, and soon has nobody's sessions but that
-/// one's.
+/// Requires that the service answers a polite client, and soon has no session but that client's.
 void ServePolitely() {
   static quarvel::Client& polite =
       *new quarvel::Client(std::move(quarvel::Client::connect(Service().string()).value()));
@@ -135,12 +133,13 @@ void ServePolitely() {
   auto sync = polite.sync(kPatience);
   const auto deadline = std::chrono::steady_clock::now() + kPatience;
   for (;;) {
-    // Anew each time, since others may have started it and sent to it.
+    // Created anew each time, since an input may have used the same ID.
     Require(sync.createReportingSession(kReporterID).ok(), "the polite client is served");
     const auto reporters = sync.getAllReporters();
     Require(reporters.ok(), "the polite client is answered");
     if (reporters.value() == std::vector{kReporterID}) return;
-    Require(std::chrono::steady_clock::now() < deadline, "the sessions of those who went go");
+    Require(std::chrono::steady_clock::now() < deadline,
+            "the sessions of disconnected clients end");
     std::this_thread::yield();
   }
 }
@@ -149,7 +148,7 @@ void ServePolitely() {
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   std::string_view stream(reinterpret_cast<const char*>(data), size);
-  // That call ends the process, as it should.
+  // This call rightly ends the process.
   if (stream.empty() || stream.find("killService") != std::string_view::npos) return 0;
   const unsigned behaviour = static_cast<unsigned char>(stream.front());
   stream.remove_prefix(1);

@@ -1,7 +1,7 @@
-// The frame decoder, as a connection uses it: calls are found in a stream that comes in one piece
-// or in any pieces, with the same result, and the scanner agrees with another reader of the format.
+// The frame decoder, as a connection uses it: a stream decodes to the same calls in one piece and
+// in many, and the scanner agrees with an independent reader of the format.
 //
-// An input is the stream; its own bytes say where it is torn.
+// An input is the stream; its own bytes select where the stream is split.
 
 #include <algorithm>
 #include <cstring>
@@ -26,7 +26,7 @@ using Progress = MessagePackScanner::Progress;
 constexpr std::size_t kLargest = 4096;
 constexpr unsigned kDeepest = 32;
 
-/// One MessagePack value, read straight from the format's description.
+/// Reads one MessagePack value, written from the format's description.
 class Reader {
  public:
   enum class Finding { whole, cut, wrong };
@@ -41,8 +41,8 @@ class Reader {
     if (code <= 0x9f) return items(code & 0x0f, depth);
     if (code <= 0xbf) return rest(code & 0x1f);
     if (code == 0xc1) return Finding::wrong;
-    // Of the codes from 0xc0: how many octets say a length, what follows besides, and what the
-    // length counts when it is no octets.
+    // For each code from 0xc0: the octets of the length, the octets that follow besides, and the
+    // items for each unit of length, or 0 if the length counts octets.
     constexpr struct {
       std::uint8_t octets, more, items;
     } kForms[] = {{0, 0, 0}, {0, 0, 0}, {0, 0, 0}, {0, 0, 0},  {1, 0, 0}, {2, 0, 0}, {4, 0, 0},
@@ -112,7 +112,7 @@ void Decode(ReadBuffer& buffer, MessagePackScanner& scanner, Decoded& decoded) {
   }
 }
 
-/// `torn`: in pieces of a few bytes, else as large as the buffer has room for.
+/// `torn`: in pieces of a few bytes, else in pieces as large as the buffer's room.
 Decoded DecodeStream(std::string_view stream, bool torn) {
   ReadBuffer buffer;
   MessagePackScanner scanner(kLargest, kDeepest);
@@ -137,11 +137,11 @@ void CompareWithReader(std::string_view stream) {
   const Progress progress = scanner.scan(stream);
   const Reader::Finding finding = reader.skip();
   if (progress == Progress::complete) {
-    Require(finding == Reader::Finding::whole, "what is complete is whole");
+    Require(finding == Reader::Finding::whole, "a complete value is whole");
     Require(scanner.length() == reader.position(), "both see the same end");
     Require(scanner.length() <= kLargest, "no value is larger than allowed");
   } else if (progress == Progress::incomplete) {
-    Require(finding == Reader::Finding::cut, "what is incomplete is cut");
+    Require(finding == Reader::Finding::cut, "an incomplete value is cut");
   } else {
     Require(finding != Reader::Finding::whole || reader.position() > kLargest,
             "a whole value of an allowed size is no fault");

@@ -1,5 +1,5 @@
-// Whatever bytes come: what is taken for a payload can be walked, rewritten and written as JSON, in
-// both forms; RapidJSON reads in it what the bytes say, and a tree of it comes back as the same.
+// Payloads of any bytes: an accepted payload can be walked, rewritten and written as JSON in both
+// forms. RapidJSON must read the payload's values from the JSON, and its tree must write the same.
 
 #include <rapidjson/document.h>
 
@@ -134,18 +134,20 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   CheckKeys(payload.value(), payload.value().replacingInKeys(' ', '_'));
 
   const std::string json = JsonText(payload.value());
-  Require(Says(Read(json), payload.value().root()), "the JSON says what the payload does");
+  Require(Says(Read(json), payload.value().root()), "the JSON equals the payload");
   quarvel::PrettyJsonWriter pretty;
   pretty.value(payload.value().root());
   const auto text = pretty.finish();
   Require(text.ok() && Says(Read(text.value()), payload.value().root()),
-          "the pretty JSON says the same");
+          "the pretty JSON equals the payload");
 
   const quarvel::Dictionary tree = payload.value().root().toDictionary();
-  Require(JsonText(tree) == json && JsonText(Payload(tree)) == json, "the tree says the same too");
+  Require(JsonText(tree) == json && JsonText(Payload(tree)) == json,
+          "the JSON of the tree is the same");
   const auto back = quarvel::ValueFromJson(json);
   Require(back.ok(), "the JSON can be read back");
   const std::string once = JsonText(back.value());
-  Require(JsonText(quarvel::ValueFromJson(once).value()) == once, "and stays as it is");
+  Require(JsonText(quarvel::ValueFromJson(once).value()) == once,
+          "a second round trip changes nothing");
   return 0;
 }

@@ -1,5 +1,5 @@
-// Runs a fuzz target over files, once each: the seeds and what was once found, in every build.
-// Arguments: files and directories; one that is missing or a directory without files is an error.
+// Runs a fuzz target over files, once each: the seeds and the regressions, in every build.
+// Arguments: files and directories; a missing one, or an empty directory, is an error.
 
 #include <algorithm>
 #include <cstdio>

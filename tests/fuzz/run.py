@@ -17,10 +17,10 @@ def main():
         fuzzed = subprocess.run(
             [target, f"-max_total_time={SECONDS}", f"-dict={dictionary}", "-max_len=8192",
              "-timeout=60", "-rss_limit_mb=1024", "-detect_leaks=0", "-print_final_stats=1",
-             # The service writes its log there; what the fuzzer and the sanitizers say comes through.
+             # Closes standard error for the service's log; libFuzzer and the sanitizers have a copy.
              "-close_fd_mask=2",
              f"-artifact_prefix={pathlib.Path(target).parent}/", grown, *corpora],
-            stderr=subprocess.PIPE, text=True, errors="replace", check=False)
+            stderr=subprocess.PIPE, text=True, errors="replace", check=False, timeout=SECONDS + 600)
     if fuzzed.returncode != 0:
         sys.stderr.write(fuzzed.stderr[-20000:])
         return 1

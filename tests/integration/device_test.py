@@ -1,4 +1,4 @@
-"""What feeds and steers the installed service: driver counters, orientation, preferences, properties."""
+"""The installed service with driver counters, orientation, preferences and device properties."""
 
 import json
 import os
@@ -7,13 +7,13 @@ import re
 import subprocess
 import unittest
 
-from harness import CallError, ServiceTest, eventually
+from harness import PATIENCE, CallError, ServiceTest, eventually
 
 HISTORY = "diagnostics/private/var/mobile/Library/Logs/Faultkeep/DiagnosticLogs/Audio/Reporting"
 
 
 class Drivers(ServiceTest):
-    def test_a_session_reports_how_far_counters_rose(self):
+    def test_a_session_reports_the_rise_of_counters(self):
         service = self.prepared()
         tree = service.directory / "tallix"
 
@@ -48,7 +48,7 @@ class Drivers(ServiceTest):
         client.stop_session(1)
         rows = service.wait_for_rows(2, "message WHERE category = 9")
         self.assertEqual(json.loads(rows[1]["payload"]), {"Haptics_Stats_taps": 1},
-                         "a channel that vanished takes its own group along, and no other")
+                         "a missing channel fails its own group and no other")
         self.assertIn("TallixCreateSamples error", service.log())
 
     def test_the_documented_example_finds_its_counter(self):
@@ -60,11 +60,19 @@ class Drivers(ServiceTest):
         client.stop_session(1)
         self.assertIn("subscribed to group group Speaker-(null)", service.log())
         self.assertNotIn("couldn't find any channels for driver group Speaker", service.log())
-        self.assertNotIn("SpuriousInterrupts", service.log(), "a counter that cannot be read is told of")
+        self.assertNotIn("SpuriousInterrupts", service.log(), "a counter that cannot be read is logged")
 
 
 class Preferences(ServiceTest):
-    def test_reporting_is_switched_off_and_on(self):
+    def verbose_scopes(self, service, client):
+        """The scopes of the verbose lines of two broadcasts, complete once the second one's line is there."""
+        before = len(service.log())
+        client.message({}, None)
+        client.message({}, None)
+        eventually(lambda: service.log()[before:].count("active reporting sessions") == 2, "the second broadcast")
+        return set(re.findall(r" debug tarnwick\.quarvel\[(\w+)\]", service.log()[before:]))
+
+    def test_reporting_and_verbose_lines_are_switched_off_and_on(self):
         service = self.service()
         client = self.client(service)
         client.start_session(1)
@@ -79,45 +87,27 @@ class Preferences(ServiceTest):
             return False
 
         service.prefer(disable_reporting=True, device_name="bench 7")
-        self.assertFalse(refused(), "nothing is read before the notification")
+        self.assertFalse(refused(), "preferences are read only at a notification")
         service.notify()
         eventually(refused, "reporting is off")
         service.write_preferences("disable_reporting = fal")
         service.notify()
         eventually(lambda: "tarnwick.quarvel.toml" in service.log(), "a line that names the file")
-        self.assertTrue(refused(), "a slip of the pen changes nothing")
+        self.assertTrue(refused(), "a faulty file changes nothing")
+        service.prefer(disable_reporting=False, device_name="bench 7", reporting_session_verbose=True,
+                       reporting_server_verbose=True)
+        service.notify()
+        eventually(lambda: not refused(), "reporting is on")
+        eventually(lambda: self.verbose_scopes(service, client) == {"zqrr", "zqrs"}, "verbose lines")
         service.prefer(disable_reporting=False, device_name="bench 7", reporting_session_verbose=True)
         service.notify()
-        eventually(lambda: not refused() and " debug tarnwick.quarvel[zqrr] " in service.log(),
-                   "reporting is on, and the session's verbose lines")
+        eventually(lambda: self.verbose_scopes(service, client) == {"zqrr"}, "verbose lines of sessions alone")
         client.stop_session(1)
         client.send("startReportingSessionForID:reply:", 1)
         client.stop_session(1)
         eventually(lambda: service.count("agent_session") == 2, "two runs")
         self.assertEqual(["device_name" in json.loads(row[0]) for row in service.rows(
             "SELECT user_info FROM agent_session ORDER BY id")], [False, True])
-
-    def test_verbose_lines_are_switched_on_before_the_start_and_off_after_it(self):
-        service = self.prepared()
-        service.prefer(reporting_server_verbose=True, reporting_session_verbose=True)
-        service.start()
-        self.addCleanup(service.finish)
-        client = self.client(service)
-        client.start_session(1)
-
-        def verbose_scopes():
-            """Of what two broadcasts write; once the second one's line is there, so is all of the first."""
-            before = len(service.log())
-            client.message({}, None)
-            client.message({}, None)
-            eventually(lambda: service.log()[before:].count("active reporting sessions") == 2, "the second broadcast")
-            return set(re.findall(r" debug tarnwick\.quarvel\[(\w+)\]", service.log()[before:]))
-
-        self.assertEqual(verbose_scopes(), {"zqrr", "zqrs"})
-        service.prefer(reporting_session_verbose=True)
-        self.assertEqual(verbose_scopes(), {"zqrr", "zqrs"}, "nobody has been told yet")
-        service.notify()
-        eventually(lambda: verbose_scopes() == {"zqrr"}, "one of them is switched off")
 
     def test_unwanted_events_are_not_recorded(self):
         service = self.service('[analytics]\nwanted = ["tarnwick.quarvel.HAL_*"]\n')
@@ -194,7 +184,7 @@ class Sensor(ServiceTest):
         self.assertEqual(len(self.errors()), number, self.errors())
 
     def fail_once(self, number, words):
-        """However often a session tracks in vain. One that is gone at once may not even have been noticed."""
+        """Expects one line, although four sessions fail to track."""
         self.track()
         self.await_error(number, words)
         self.tracker.stop_session(1)
@@ -202,7 +192,7 @@ class Sensor(ServiceTest):
             self.track()
             self.tracker.stop_session(1)
 
-    def test_it_is_claimed_while_a_session_tracks_it_and_followed_through_a_restart(self):
+    def test_it_is_claimed_while_a_session_tracks_it_and_after_a_restart(self):
         self.bus.begin()
         self.bus.begin_proxy(accelerometer_orientation="normal")
         self.await_claimants(0)
@@ -213,7 +203,7 @@ class Sensor(ServiceTest):
                                   ("normal", "portrait")):
             self.turn(word, orientation)
         self.bus.begin_proxy(accelerometer_orientation="left-up")
-        # Claimed again, and what changed meanwhile is told.
+        # The new proxy is claimed, and its different orientation is reported.
         eventually(lambda: self.watched.log().count('orientation="landscapeRight"') == 2, "the change")
         self.turn("normal", "portrait")
         self.tracker.stop_session(1)
@@ -223,9 +213,9 @@ class Sensor(ServiceTest):
                                                         "unknown,portrait,landscapeRight,portrait")
         self.assertEqual(self.errors(), [])
 
-    def test_no_bus_no_proxy_and_no_accelerometer_are_one_line_each(self):
+    def test_a_missing_bus_proxy_or_accelerometer_is_one_line(self):
         self.fail_once(1, "the system bus")
-        # With bus and proxy there, the next session succeeds, and all is said anew when they go.
+        # After a success the same failures are logged once more.
         self.bus.begin()
         self.bus.begin_proxy()
         self.track()
@@ -248,7 +238,7 @@ class Sensor(ServiceTest):
 
 
 class SystemBus:
-    """A private system bus, and a sensor proxy on it; both end with the test."""
+    """A private system bus and a sensor proxy on it, which end with the test."""
 
     PROXY = "net.hadess.SensorProxy", "/net/hadess/SensorProxy", "org.freedesktop.DBus.Mock"
 
@@ -290,11 +280,11 @@ class SystemBus:
     def _ended(process):
         if process:
             process.terminate()
-            process.wait()
+            process.wait(PATIENCE)
 
     def _gdbus(self, *arguments):
         return subprocess.run(["gdbus", *arguments], env=os.environ | self.environment, check=True,
-                              capture_output=True, text=True).stdout
+                              capture_output=True, text=True, timeout=PATIENCE).stdout
 
     def _call(self, method, *arguments):
         name, path, mock = self.PROXY

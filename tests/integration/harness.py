@@ -1,4 +1,4 @@
-"""Starts the installed service in directories of its own, and speaks to it as any client may."""
+"""Starts the installed service in directories of its own, and calls it as any client may."""
 
 import contextlib
 import json
@@ -8,7 +8,6 @@ import re
 import signal
 import socket
 import sqlite3
-import struct
 import subprocess
 import tempfile
 import time
@@ -16,15 +15,15 @@ import unittest
 
 import msgpack
 
-PREFIX = pathlib.Path(os.environ["QUARVEL_PREFIX"])
+PREFIX = pathlib.Path(os.environ.get("QUARVEL_PREFIX", "/usr"))
 LAUNCH = pathlib.Path(__file__).resolve().parent.parent / "launch"
 QUARVELD = (LAUNCH, PREFIX / "sbin/quarveld")
-# How long something may take that normally takes no time: machines that test are slow at times.
+# Seconds that an immediate event may take on a slow, busy machine.
 PATIENCE = float(os.environ.get("QUARVEL_TEST_PATIENCE", "60"))
 
 
-def eventually(condition, what):
-    """Waits for a condition that another process brings about."""
+def eventually(condition, what, pause=0.01):
+    """Waits for a condition that another process brings about; returns the condition's value."""
     deadline = time.monotonic() + PATIENCE
     while True:
         result = condition()
@@ -32,7 +31,7 @@ def eventually(condition, what):
             return result
         if time.monotonic() > deadline:
             raise AssertionError(f"never came about: {what}")
-        time.sleep(0.01)
+        time.sleep(pause)
 
 
 class Service:
@@ -80,13 +79,13 @@ class Service:
         return self.process.wait(PATIENCE)
 
     def finish(self):
-        """Ends it and looks whether a sanitizer or valgrind has spoken."""
+        """Ends the service; fails if a sanitizer or valgrind found something."""
         try:
             self.end()
         finally:
             if self.process.poll() is None:
                 self.process.kill()
-                self.process.wait()
+                self.process.wait(PATIENCE)
         if re.search(r"Sanitizer|runtime error:|^==\d+==", self.log(), re.MULTILINE):
             raise AssertionError(self.log())
 
@@ -116,12 +115,12 @@ class Service:
         )
 
     def prefer(self, **values):
-        """Writes the service's preferences; they take effect when it is notified."""
+        """Writes the service's preferences, which take effect with the next `notify`."""
         self.write_preferences("".join(f"{key} = {json.dumps(value)}\n"
                                        for key, value in values.items()))
 
     def write_preferences(self, text):
-        """Put in place whole: a file that is written where it lies is empty for a moment."""
+        """Replaces the file at once: a file that is written in place is empty for a moment."""
         path = self.directory / "etc/preferences/tarnwick.quarvel.toml"
         path.with_suffix(".new").write_text(text)
         path.with_suffix(".new").replace(path)
@@ -133,9 +132,9 @@ class Service:
 class Client:
     """One connection. `call` waits for the reply; `send` does not."""
 
-    def __init__(self, service):
+    def __init__(self, service, patience=PATIENCE):
         self._socket = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
-        self._socket.settimeout(PATIENCE)
+        self._socket.settimeout(patience)
         try:
             self._socket.connect(str(service.socket))
         except OSError:
@@ -157,7 +156,7 @@ class Client:
         return self._next
 
     def receive(self):
-        """Reads until one more reply is there; returns its id, or None at the end of the stream."""
+        """Reads one more reply and returns its id, or None at the end of the stream."""
         while True:
             for kind, identifier, error, result in self._unpacker:
                 assert kind == 1 and identifier not in self.replies
@@ -188,7 +187,7 @@ class Client:
         if configuration is not None:
             self.call("setConfiguration:forReporterID:reply:", configuration, reporter)
         started = self.send("startReportingSessionForID:reply:", reporter)
-        self.call("reporterID:valid:", reporter)  # so the start has been carried out
+        self.call("reporterID:valid:", reporter)  # answered after the start was done
         return started
 
     def message(self, payload, reporters, category=3, kind=1):
@@ -215,7 +214,7 @@ class CallError(Exception):
 
 class ServiceTest(unittest.TestCase):
     def prepared(self, configuration="", **options):
-        """A service that is not started yet; its directory goes with the test."""
+        """A service that is not started yet; its directory is removed after the test."""
         service = Service(configuration, **options)
         self.addCleanup(service.tidy)
         return service
@@ -226,7 +225,7 @@ class ServiceTest(unittest.TestCase):
         self.addCleanup(service.finish)
         return service
 
-    def client(self, service):
-        client = Client(service)
+    def client(self, service, **options):
+        client = Client(service, **options)
         self.addCleanup(client.close)
         return client

@@ -1,13 +1,12 @@
-"""Clients that mean no good, each in a process of its own, and a polite one that suffers or does not."""
+"""Hostile clients, each in a process of its own, and a polite client beside them."""
 
 import contextlib
 import multiprocessing
 import os
 import pathlib
 import socket
-import statistics
+import struct
 import time
-import typing
 
 import msgpack
 from harness import PATIENCE, Client
@@ -17,7 +16,7 @@ _fork = multiprocessing.get_context("fork")
 
 
 class Hostile:
-    """Runs `act(service)` again and again in another process, while it is let."""
+    """Runs `act(service)` again and again in another process, from `attack` to `rest`."""
 
     def __init__(self, service, act):
         self._go = _fork.Event()
@@ -26,13 +25,13 @@ class Hostile:
         self._process.start()
 
     def _live(self, service, act):
-        os.nice(19)  # what the machine gives to whom is not the service's to say
+        os.nice(19)  # the attack itself must not take the processor from the polite client
         while True:
             self._resting.set()
             self._go.wait()
             self._resting.clear()
             while self._go.is_set():
-                with contextlib.suppress(OSError):  # turned away, hung up on, held back
+                with contextlib.suppress(OSError):  # refused, disconnected, not read
                     act(service)
 
     def attack(self):
@@ -44,7 +43,7 @@ class Hostile:
 
     def end(self):
         self._process.kill()
-        self._process.join()
+        self._process.join(PATIENCE)
 
 
 class PoliteClient:
@@ -68,37 +67,18 @@ class PoliteClient:
         self._client.message({"n": self.sent, "route": "Speaker"}, [self._reporter])
         self.sent += 1
 
-    def measure(self, seconds):
-        """Returns messages a second and the time that 99 of 100 messages stay below."""
+    def times(self, seconds):
+        """Seconds that each answer took."""
         times = []
-        begun = due = time.perf_counter()
-        while due < begun + seconds:
+        due = time.perf_counter()
+        end = due + seconds
+        while due < end:
             time.sleep(max(0, due - time.perf_counter()))
             asked = time.perf_counter()
             self.send()
             times.append(time.perf_counter() - asked)
             due += self.PAUSE
-        elapsed = time.perf_counter() - begun
-        return len(times) / elapsed, statistics.quantiles(times, n=100)[98]
-
-
-class Comparison(typing.NamedTuple):
-    """Of a polite client beside a hostile one: medians of rounds that take turns."""
-    throughput: float  # of what it is alone
-    latency: float  # that 99 of 100 messages stay below, of what it is alone
-    share: float  # the same of what a client of another service has, which shares the cores with the attack alone
-    seconds: float  # the latency beside the hostile client
-
-
-def compare(polite, elsewhere, hostile, rounds, seconds):
-    compared = []
-    for _ in range(rounds):
-        alone = polite.measure(seconds)
-        hostile.attack()
-        beside, other = polite.measure(seconds), elsewhere.measure(seconds)
-        hostile.rest()
-        compared.append((beside[0] / alone[0], beside[1] / alone[1], beside[1] / other[1], beside[1]))
-    return Comparison(*map(statistics.median, zip(*compared)))
+        return times
 
 
 def resident(process, peak=False):
@@ -122,8 +102,10 @@ def threads(process):
 def raw(service):
     """A connected socket without a client around it."""
     connected = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
+    # A socket with a time-out of Python's own does not wait while the backlog is full.
+    connected.setsockopt(socket.SOL_SOCKET, socket.SO_SNDTIMEO, struct.pack("ll", int(PATIENCE), 0))
     try:
-        connected.connect(str(service.socket))  # waits while too many others do
+        connected.connect(str(service.socket))
     except OSError:
         connected.close()
         raise
@@ -150,11 +132,11 @@ def ask(connected, method, *arguments):
             return result
 
 
-# What hostile clients do. Each does it once, or for as long as a blink.
+# The attacks. Each runs once, or for a fraction of a second.
 
 
 def send_bombs(service):
-    """Lengths, depths and maps that promise more than they hold."""
+    """Lengths, depths and maps that announce more than follows."""
     head = b"\x94\x00\x01\xd9\x37" + SEND.encode() + b"\x94"
     for bomb in (b"\xdd\xff\xff\xff\xff", b"\x94\x00\x01\xdb\x7f\xff\xff\xff", b"\x94\x00\x01\xa1x" + b"\x91" * 4096,
                  head + b"\xdf\xff\xff\xff\xff", head + b"\x81\xa1k" * 1000, head + b"\xde\xff\xff" + b"\xc0" * 65536,
@@ -204,7 +186,7 @@ def never_read(service, question=request(1, "x" * 60)):
 
 
 def meddle(service):
-    """With the sessions of others, with none, and with the ends of the range."""
+    """Calls for the sessions of other clients, for no session, and for the least and largest IDs."""
     with contextlib.closing(Client(service)) as attacker:
         for reporter in (1, 0, -1, 2**63 - 1, -2**63):
             for call in (("startReportingSessionForID:reply:", reporter),
@@ -224,10 +206,13 @@ def come_and_go(service):
 
 
 def broadcast(service):
-    """To a thousand sessions of its own, of which every line of the log tells."""
+    """Broadcasts to a thousand sessions of the client, each of which the log lines name."""
     with contextlib.closing(Client(service)) as attacker:
         attacker.write(b"".join(notification("createReportingSession:reply:", n) for n in range(10_000, 11_000)))
         attacker.call("reporterID:valid:", 1)
         for _ in range(10):
             attacker.write(notification(SEND, {"n": 1}, 3, 1, None) * 50)
             attacker.call("reporterID:valid:", 1)
+
+
+ATTACKS = (send_bombs, send_tiny_keys, trickle, write_at_full_speed, never_read, meddle, come_and_go, broadcast)

@@ -1,7 +1,6 @@
-"""Whatever a client does, a polite one beside it is served, memory stays bounded and the service stays up.
+"""A hostile client delays no other client by a second, memory stays bounded, and limits hold.
 
-The exact figures are printed. Here they are held to what a slow, busy machine can show; with
-QUARVEL_NIGHTLY to what is promised."""
+bench/hostile_bench.py measures how much a hostile client costs the others."""
 
 import contextlib
 import os
@@ -12,8 +11,7 @@ import unittest
 import hostile
 from harness import ServiceTest, eventually
 
-NIGHTLY = bool(os.environ.get("QUARVEL_NIGHTLY"))
-ROUNDS, SECONDS = (9, 2) if NIGHTLY else (3, 0.5)
+SECONDS = 20 if os.environ.get("QUARVEL_NIGHTLY") else 1.5
 MOST_MEMORY = 256  # MiB
 SHORT_LIMITS = "[limits]\nframe_seconds = 1\nstall_seconds = 1\n"
 
@@ -23,28 +21,22 @@ def figure(name, text):
 
 
 class Beside(ServiceTest):
-    """A polite client beside a hostile one that does the same thing all the time."""
+    """A polite client beside a hostile client that repeats its attack all the time."""
 
     def beside(self, act):
         service = self.service(SHORT_LIMITS)
         polite = hostile.PoliteClient(service, 1)
         self.addCleanup(polite.close)
-        elsewhere = hostile.PoliteClient(self.service(), 1)
-        self.addCleanup(elsewhere.close)
         attacker = hostile.Hostile(service, act)
         self.addCleanup(attacker.end)
-        for attempt in range(3):
-            found = hostile.compare(polite, elsewhere, attacker, ROUNDS, SECONDS)
-            memory = hostile.resident(service.process, peak=True)
-            figure(act.__name__, f"throughput {found.throughput:.2f}, p99 {found.seconds * 1000:.1f} ms, "
-                                 f"{found.latency:.1f} times that alone and {found.share:.1f} times another "
-                                 f"service's, {memory:.0f} MB")
-            # Within a time slice of the machine nobody can tell who took the time.
-            served = (found.throughput >= 0.8 and (found.share <= 2 or found.seconds <= 0.005)) if NIGHTLY else (
-                found.throughput >= 0.2 and (found.share <= 3 or found.seconds <= 1))
-            if served:
+        attacker.attack()
+        for _ in range(3):  # a busy machine may hold up one answer
+            slowest = max(polite.times(SECONDS))
+            if slowest < 1:
                 break
-        self.assertTrue(served)
+        memory = hostile.resident(service.process, peak=True)
+        figure(act.__name__, f"slowest answer {slowest * 1000:.1f} ms, {memory:.0f} MB")
+        self.assertLess(slowest, 1)
         self.assertLess(memory, MOST_MEMORY)
         attacker.end()
         polite.stop()
@@ -52,34 +44,16 @@ class Beside(ServiceTest):
         service.end()
         rows = service.rows("SELECT id, json_extract(payload, '$.n') AS n FROM message WHERE session_id = 1 "
                             "AND category = 3 AND payload LIKE '%Speaker%' ORDER BY id")
-        # The store keeps the youngest rows of all clients; nothing else may be missing.
+        # Retention may remove the oldest rows of all clients; no other row may be missing.
         oldest = service.rows("SELECT min(id) FROM message")[0][0]
         first = 0 if oldest == 1 else polite.sent - len(rows)
         self.assertEqual([row["n"] for row in rows], list(range(first, polite.sent)))
 
-    def test_bombs(self):
-        self.beside(hostile.send_bombs)
-
-    def test_tiny_keys(self):
-        self.beside(hostile.send_tiny_keys)
-
-    def test_one_byte_at_a_time(self):
-        self.beside(hostile.trickle)
-
-    def test_full_speed(self):
-        self.beside(hostile.write_at_full_speed)
-
-    def test_never_reads(self):
-        self.beside(hostile.never_read)
-
-    def test_ids_of_others(self):
-        self.beside(hostile.meddle)
-
-    def test_coming_and_going(self):
-        self.beside(hostile.come_and_go)
-
-    def test_broadcasts(self):
-        self.beside(hostile.broadcast)
+    def test_every_attack(self):
+        for act in hostile.ATTACKS:
+            with self.subTest(act.__name__):
+                self.beside(act)
+                self.doCleanups()
 
 
 class Numbers(ServiceTest):
@@ -94,11 +68,8 @@ class Numbers(ServiceTest):
         self.addCleanup(lambda: [each.close() for each in connected])
         return connected
 
-    def descriptors(self, service):
-        return len(os.listdir(f"/proc/{service.process.pid}/fd"))
-
     def idles(self, service):
-        """Whether it uses next to no processor while nobody asks for anything."""
+        """Whether the service uses less than a fifth of a core while no client calls."""
         before = hostile.processor_seconds(service.process)
         time.sleep(1)
         return hostile.processor_seconds(service.process) - before < 0.2
@@ -109,7 +80,7 @@ class Numbers(ServiceTest):
         polite.start_session(1)
         began = time.monotonic()
         connected = self.connect(service, self.most)
-        eventually(lambda: self.descriptors(service) > self.most, "all are accepted")
+        eventually(lambda: len(os.listdir(f"/proc/{service.process.pid}/fd")) > self.most, "all are accepted")
         figure("connections", f"{self.most} in {time.monotonic() - began:.1f} s, "
                               f"{hostile.resident(service.process):.0f} MB")
         polite.message({"beside": self.most}, [1])
@@ -134,7 +105,7 @@ class Numbers(ServiceTest):
                 self.assertNotIn(asked, waiting.replies)
                 for each in connected:
                     each.close()
-                self.assertEqual(waiting.wait(asked), [1], "who waited is served")
+                self.assertEqual(waiting.wait(asked), [1], "the waiting client is served")
                 self.assertEqual(service.log().count("no further client is accepted"), 1)
 
     def test_a_hundred_thousand_sessions(self):
@@ -176,7 +147,7 @@ class Deadlines(ServiceTest):
         slow.recv(1)
         frame_seconds = time.monotonic() - began
         eventually(lambda: polite.call("getAllReporters:") == [] and
-                   "does not read its replies" in service.log(), "the deaf one is cut off")
+                   "does not read its replies" in service.log(), "the client that does not read is disconnected")
         stall_seconds = time.monotonic() - began
         figure("deadlines", f"a frame {frame_seconds:.1f} s, unread replies {stall_seconds:.1f} s")
         self.assertGreater(frame_seconds, 9.5)

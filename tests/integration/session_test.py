@@ -66,7 +66,7 @@ class Sessions(ServiceTest):
                          [(28, "Fennor_Haptics",
                            {"EngineOnDuration": 2.5, "ApplicationName": "Unknown", "TimestampEnd": 8})])
 
-    def test_calls_that_arrive_together_are_all_answered_however_few_may_wait(self):
+    def test_calls_that_arrive_together_are_all_answered_with_a_short_queue(self):
         service = self.service("[limits]\nqueued_calls = 4\nframe_seconds = 2\n")
         client = self.client(service)
         client.start_session(1)
@@ -77,7 +77,7 @@ class Sessions(ServiceTest):
         for identifier in together:
             self.assertIsNone(client.wait(identifier))
 
-    def test_a_thousand_sessions_wait_for_backends_and_nobody_else_does(self):
+    def test_a_thousand_sessions_wait_for_backends_beside_a_served_client(self):
         service = self.service(NO_BACKENDS)
         waiting = self.client(service)
         other = self.client(service)
@@ -96,7 +96,7 @@ class Sessions(ServiceTest):
             self.assertEqual(other.call("reporterID:valid:", 2000)["reporterID"], 2000)
             calls += 1
         self.assertGreater(calls, 20, "in nine seconds, calls that take far less than half a second each")
-        for reporter in to_start:  # on a slow machine the first gives up before they are all started
+        for reporter in to_start:  # on a slow machine the first wait ends before all are started
             start(reporter)
         eventually(lambda: failed() == 1000, "all sessions gave up, side by side and not one by one")
 
@@ -119,7 +119,7 @@ class Idle(ServiceTest):
                 time.sleep(2)
                 return switches() == before
             except FileNotFoundError:
-                return False  # a thread has just left
+                return False  # a thread has just ended
 
         eventually(stays_asleep, "two seconds without a wake-up")
 
@@ -136,7 +136,7 @@ class Ends(ServiceTest):
         client.message({"in": "session"}, [6])
         self.assertEqual(service.end(), 0)
         self.assertEqual(service.count("message WHERE service_name = 'alarms'"), 50,
-                         "what waited for its delay is sent before the end")
+                         "delayed messages are sent before the end")
         self.assertEqual(service.count("message WHERE session_id = 6"), 2, "and the session's summary")
         self.assertEqual(service.count("agent_session WHERE flushed_at IS NOT NULL"), 1)
         self.assertFalse(service.socket.exists())
@@ -153,9 +153,9 @@ class Ends(ServiceTest):
         self.assertIn("DESTROYING SERVICE", service.log())
         rows = service.count("message")
         service.start()
-        self.assertEqual(service.count("message"), rows, "what was committed stays")
+        self.assertEqual(service.count("message"), rows, "committed rows stay")
 
-    def test_what_cannot_start_says_why(self):
+    def test_a_failed_start_has_one_error_line(self):
         def refuse(service, *words):
             ended = subprocess.run(QUARVELD, env=service.environment,
                                    capture_output=True, text=True, timeout=PATIENCE)

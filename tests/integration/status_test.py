@@ -1,20 +1,23 @@
-"""What the installed service tells of itself, and what becomes of what it was sent."""
+"""The installed service's status and counters, and its behaviour on a full disk."""
 
 import contextlib
 import json
 import os
 import shutil
 import subprocess
+import threading
 import time
 import unittest
 
-from harness import ServiceTest, eventually
+from harness import PATIENCE, ServiceTest, eventually
 
 CAN_MOUNT = shutil.which("unshare") and subprocess.run(
     ["unshare", "-m", "mount", "-t", "tmpfs", "tmpfs", "/mnt"], capture_output=True, check=False).returncode == 0
-# Runs the service with a file system of its own for its store, which others see through /proc.
+# Runs the service with a small file system for its store, which the test reaches through /proc.
+FLOOD = 5000  # messages: more than the store's queue, one connection's calls and its socket hold together
+SEND = "sendMessage:withCategory:andType:forReportingIDs:reply:"
 ON_SMALL_DISK = ["unshare", "-m", "sh", "-c",
-                 'mount -t tmpfs -o size=2m tmpfs "$STATE_DIRECTORY" && exec "$0" "$@"']
+                 'mount -t tmpfs -o size=8m tmpfs "$STATE_DIRECTORY" && exec "$0" "$@"']
 
 
 class Status(ServiceTest):
@@ -22,8 +25,8 @@ class Status(ServiceTest):
         return json.loads(service.ctl("status", "--json").stdout)
 
     def settled(self, service, accepted):
-        """The status once so many rows have come and none waits; the counters always add up. The
-        client that looks whether the service is up leaves one row, its uptime."""
+        """The status once so many rows are accepted and none waits; the counters always add up. One row more
+        is the uptime of the client that checked the service's start."""
         def nothing_waits():
             status = self.status(service)
             counters = status["counters"]
@@ -40,7 +43,7 @@ class Status(ServiceTest):
         client.start_session(2, 11)
         for number in range(20):
             client.message({"n": number}, [1, 2, 3, 0])
-        # Each message once for each ID, and an analytics event for each session that there is.
+        # Each message counts once for each ID, and has an analytics event for each existing session.
         status = self.settled(service, 20 * (4 + 2))
         self.assertTrue(status["healthy"], status)
         self.assertEqual((status["clients"], status["sessions"], status["started_sessions"]), (1, 2, 2))
@@ -51,11 +54,11 @@ class Status(ServiceTest):
         client.close()
         service.end()
         service.start()
-        # And a summary of each session, one of which is a test; the uptimes of two more clients.
+        # The summaries of both sessions, of which one is a test, and the uptimes of two more clients.
         again = self.settled(service, 20 * (4 + 2) + 2 + 2)
         self.assertEqual(again["counters"]["dropped"]["test"], 21)
 
-    def test_people_get_a_verdict_and_an_exit_status(self):
+    def test_the_tool_prints_a_verdict_and_has_an_exit_status(self):
         service = self.service()
         told = service.ctl("status")
         self.assertEqual((told.returncode, told.stderr), (0, ""))
@@ -66,7 +69,7 @@ class Status(ServiceTest):
         self.assertEqual((told.returncode, told.stdout), (1, ""))
         self.assertIn("The service does not answer", told.stderr)
 
-    def test_nothing_is_written_unasked_and_the_files_are_nobody_elses(self):
+    def test_the_status_is_written_on_demand_and_files_are_not_public(self):
         service = self.service()
         self.client(service).message({"n": 1}, None)
         self.assertFalse((service.directory / "run/status.json").exists())
@@ -78,26 +81,40 @@ class Status(ServiceTest):
     @unittest.skipUnless(CAN_MOUNT, "needs a file system of its own")
     def test_a_full_disk_holds_rows_and_senders_and_shows_in_the_status(self):
         service = self.service(wrapper=ON_SMALL_DISK)
-        state = f"/proc/{service.process.pid}/root/{service.directory}/state"
-        with open(f"{state}/ballast", "wb") as ballast, contextlib.suppress(OSError):
+        flood, other = self.client(service), self.client(service, patience=PATIENCE / 12)
+        for reporter, client in ((1, flood), (2, other)):
+            client.start_session(reporter)
+        service_state = f"/proc/{service.process.pid}/root/{service.directory}/state"
+        eventually(lambda: self.status(service)["store_queue"]["rows"] == 0, "both agent sessions are stored")
+        with open(f"{service_state}/ballast", "wb") as ballast, contextlib.suppress(OSError):
             for _ in range(4096):
                 os.write(ballast.fileno(), bytes(4096))
-        client = self.client(service)
-        for number in range(400):
-            client.send("sendMessage:withCategory:andType:forReportingIDs:reply:",
-                        {"n": number, "text": "x" * 3000}, 3, 1, None)
+        sender = threading.Thread(daemon=True, target=lambda: [
+            flood.send(SEND, {"n": number, "text": "x" * 100}, 3, 1, [1]) for number in range(FLOOD)])
+        sender.start()
         status = eventually(lambda: (lambda s: s if s["store"]["error"] else None)(self.status(service)),
-                            "the status tells of the full disk")
+                            "the full disk in the status")
         self.assertFalse(status["healthy"])
         self.assertIn("full", status["problems"][0])
-        # What was moved out of the log may make room for a few rows once more.
+        # A checkpoint may make room for a few rows.
         eventually(lambda: (lambda told: (told.returncode, told.stdout.splitlines()[0]))(
-            service.ctl("status")) == (1, "not healthy"), "the tool tells of it too")
-        time.sleep(1)  # it tries again and again
+            service.ctl("status")) == (1, "not healthy"), "the tool's verdict")
+
+        def is_full():
+            before = self.status(service)["store_queue"]["rows"]
+            time.sleep(0.3)
+            return before == self.status(service)["store_queue"]["rows"] and sender.is_alive()
+        eventually(is_full, "the store's queue takes no more of the flood")
+        # The I/O thread must not wait for the store: it serves the other clients too.
+        for number in range(20):
+            other.message({"n": number}, [2])
+        self.assertTrue(is_full())
+        time.sleep(1)  # the writer retries several times
         self.assertEqual(service.log().count("fails:"), 1)
-        os.unlink(f"{state}/ballast")
-        status = self.settled(service, 400)
-        self.assertEqual(status["counters"]["stored"], 401)
+        os.unlink(f"{service_state}/ballast")
+        sender.join(PATIENCE)
+        status = self.settled(service, 2 * (FLOOD + 20))
+        self.assertEqual(status["counters"]["stored"], 2 * (FLOOD + 20) + 1)
         self.assertTrue(status["healthy"])
 
 

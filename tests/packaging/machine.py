@@ -1,5 +1,5 @@
-"""A machine to install packages on: this one's files under an overlay that is thrown away, in
-namespaces of its own, with systemd as its first process."""
+"""A machine to install packages on: this machine's files under a temporary overlay, in namespaces of its own,
+with systemd as its first process."""
 
 import json
 import os
@@ -10,11 +10,10 @@ import textwrap
 import time
 import unittest
 
-# How long something may take that normally takes no time: machines that test are slow at times.
-PATIENCE = float(os.environ.get("QUARVEL_TEST_PATIENCE", "60"))
+from harness import PATIENCE
 
-# Runs in the namespaces, before there is a first process. /proc/sys and /sys are the real machine's,
-# so they are for reading only.
+# Runs in the namespaces before systemd starts. /proc/sys and /sys are the real machine's, and therefore
+# read-only.
 BOOT = r"""
 set -e
 root=$1/root
@@ -38,7 +37,7 @@ mount -t devpts -o newinstance,ptmxmode=0666 devpts "$root/dev/pts"
 mount -t mqueue mqueue "$root/dev/mqueue"
 ln -s pts/ptmx "$root/dev/ptmx"
 ln -s /proc/self/fd "$root/dev/fd"
-# Nothing is started but sockets; packages may start what they bring.
+# Only sockets are started; packages may start their own units.
 rm -rf "$root"/etc/systemd/system/* "$root"/lib/systemd/system/*.wants "$root/usr/sbin/policy-rc.d"
 wants=$root/etc/systemd/system/sockets.target.wants
 mkdir "$wants"
@@ -49,7 +48,7 @@ export container=quarvel
 # The loopback interface is brought up: SIOCSIFFLAGS, IFF_UP.
 /usr/bin/python3 -c 'import fcntl, socket, struct
 fcntl.ioctl(socket.socket(), 0x8914, struct.pack("16sh", b"lo", 1))'
-# Whoever is in a chroot may make no user namespaces, which sandboxes want.
+# A process in a chroot may make no user namespaces, which sandboxes need.
 mkdir "$root/old"
 cd "$root"
 pivot_root . old
@@ -83,7 +82,7 @@ class Machine:
 
     @staticmethod
     def available():
-        """Skips the test where there can be none."""
+        """Skips the test if no machine can be started."""
         if os.geteuid() != 0:
             raise unittest.SkipTest("starting a systemd of one's own needs root")
         if not pathlib.Path("/lib/systemd/systemd").exists():
@@ -128,8 +127,8 @@ class Machine:
 
     def close(self):
         self._process.kill()
-        self._process.wait()
-        for _ in range(100):  # the last processes of the machine are just going
+        self._process.wait(PATIENCE)
+        for _ in range(100):  # the last processes of the machine are ending
             try:
                 for directory, _, _ in os.walk(self._cgroup, topdown=False):
                     os.rmdir(directory)
@@ -146,7 +145,7 @@ class Machine:
             capture_output=True, text=True, timeout=PATIENCE, **options)
 
     def must(self, *command, **options):
-        """Runs a command that has to succeed; returns what it printed."""
+        """Runs a command that must succeed; returns its output."""
         done = self.run(*command, **options)
         if done.returncode != 0:
             raise AssertionError(f"{command}: {done.returncode}\n{done.stdout}{done.stderr}")

@@ -1,5 +1,5 @@
-"""The packages on a machine of their own, under the real systemd: installed, started by a client,
-locked up, reloaded, killed, stopped, removed."""
+"""The packages on a machine of their own under systemd: installed, started by a client, sandboxed, reloaded,
+killed, stopped, removed."""
 
 import json
 import os
@@ -8,7 +8,8 @@ import re
 import time
 import unittest
 
-from machine import PATIENCE, Machine
+from harness import PATIENCE, eventually
+from machine import Machine
 
 PACKAGES = sorted((pathlib.Path(os.environ["QUARVEL_BUILD"]) / "packages").glob("*.deb"))
 UNIT = "quarvel.service"
@@ -33,7 +34,7 @@ CONFIGURATION = """
     file = "/proc/stat"
     pattern = '^ctxt ([0-9]+)'
     """
-# A sensor proxy, which may have its name on the bus.
+# A sensor proxy, whose name the bus policy allows.
 SENSOR = """
     [Service]
     Type=dbus
@@ -67,7 +68,7 @@ class InstalledMachine(unittest.TestCase):
         cls.machine = Machine()
         cls.addClassCleanup(cls.machine.close)
         cls.machine.must("apt-get", "install", "--yes", *PACKAGES)
-        # Some user who plays and records sound, and one who does not.
+        # A user of the group audio, and one of no group.
         cls.machine.must("useradd", "--groups", "audio", "player")
         cls.machine.must("useradd", "stranger")
 
@@ -81,10 +82,10 @@ class InstalledMachine(unittest.TestCase):
         return done.stdout
 
     def eventually(self, condition, what):
-        deadline = time.monotonic() + PATIENCE
-        while not condition():
-            self.assertLess(time.monotonic(), deadline, f"never came about: {what}\n{self.log()}")
-            time.sleep(0.05)
+        try:
+            eventually(condition, what, 0.05)
+        except AssertionError as failure:
+            raise AssertionError(f"{failure}\n{self.log()}") from None
 
     def state(self):
         return self.machine.property(UNIT, "ActiveState")
@@ -109,7 +110,7 @@ class OnDemand(InstalledMachine):
 
     def test_a_client_starts_it_and_starts_it_again_after_a_kill(self):
         self.assertEqual(self.machine.property("quarvel.socket", "ActiveState"), "active")
-        self.assertEqual(self.state(), "inactive", "nobody has come yet")
+        self.assertEqual(self.state(), "inactive", "no client has connected")
         self.assertEqual(self.machine.must("stat", "-c", "%U %G %a", "/run/quarvel/reporting.sock"),
                          "quarvel audio 660\n")
         refused = self.ctl("reporters", user="stranger")
@@ -123,7 +124,7 @@ class OnDemand(InstalledMachine):
         self.call("reporters")
         self.eventually(lambda: self.state() == "active", "it is up")
         self.assertEqual(self.machine.must("stat", "-c", "%U %G %a", "/run/quarvel/reporting.sock"),
-                         "quarvel audio 660\n", "and its socket is still for the same people")
+                         "quarvel audio 660\n", "the socket keeps owner, group and mode")
 
         for _ in range(10):  # more than systemd lets a service start by default
             self.call("kill")
@@ -146,16 +147,16 @@ class OnDemand(InstalledMachine):
 
         self.machine.must("systemctl", "stop", UNIT)
         self.machine.must("quarvelctl", "defaults", "write", "disable_reporting", "true")
-        self.eventually(refused, "what was set while nothing ran holds from the start")
+        self.eventually(refused, "preferences set while it was stopped hold from the start")
         self.machine.must("quarvelctl", "defaults", "delete", "disable_reporting", "--notify")
 
-    def test_a_service_that_hangs_is_replaced(self):
+    def test_a_service_that_hangs_is_restarted(self):
         self.machine.write(f"/run/systemd/system/{UNIT}.d/soon.conf", "[Service]\nWatchdogSec=3\n")
         self.machine.must("systemctl", "daemon-reload")
         self.machine.must("systemctl", "restart", UNIT)
         first = self.machine.property(UNIT, "MainPID")
         time.sleep(5)
-        self.assertEqual(self.machine.property(UNIT, "MainPID"), first, "it has said that it is alive")
+        self.assertEqual(self.machine.property(UNIT, "MainPID"), first, "its pings arrive")
         self.machine.must("systemctl", "kill", "--kill-whom=main", "--signal=STOP", UNIT)
         self.eventually(lambda: self.machine.property(UNIT, "MainPID") not in (first, "0"), "another one")
         self.call("reporters")
@@ -164,7 +165,7 @@ class OnDemand(InstalledMachine):
 
 
 class Sandbox(InstalledMachine):
-    def test_everything_works_locked_up(self):
+    def test_everything_works_in_the_sandbox(self):
         machine = self.machine
         machine.write("/etc/dbus-1/system.d/sensor.conf", BUS_POLICY)
         machine.write("/run/systemd/system/sensor.service", SENSOR)
@@ -220,12 +221,12 @@ class Sandbox(InstalledMachine):
         [accepted] = [line for line in machine.journal(UNIT) if "newConnection:" in line["MESSAGE"]]
         self.assertEqual((accepted["QUARVEL_SCOPE"], accepted["CODE_FILE"], accepted["PRIORITY"]),
                          ("tarnwick.quarvel[zqrs]", "ZQReportingServiceDelegate.cc", "5"))
-        # The engines may have come up later than the service.
+        # The engines may have started later than the service.
         errors = [line["MESSAGE"] for line in machine.journal(UNIT)
                   if line["PRIORITY"] < "4" and "takes no rows" not in line["MESSAGE"]]
         self.assertEqual(errors, [])
 
-    def test_who_is_in_its_group_reads_the_store_also_when_it_is_stopped(self):
+    def test_its_group_may_read_the_store_while_it_runs_and_after(self):
         self.machine.must("useradd", "--groups", "quarvel", "reader")
         self.call("run", "/usr/share/doc/quarvel/examples/haptics.jsonl")
         for _ in range(2):
@@ -243,7 +244,7 @@ class Removal(InstalledMachine):
         self.assertNotEqual(self.machine.run("pidof", "quarveld").returncode, 0)
         self.machine.must("test", "-e", "/var/lib/quarvel/telemetry.db", "-a", "-e", "/etc/quarvel/quarvel.toml")
         self.machine.must("apt-get", "install", "--yes", "--reinstall", *PACKAGES)
-        self.assertIn("333", self.machine.must("quarvelctl", "sessions"), "what it had is there again")
+        self.assertIn("333", self.machine.must("quarvelctl", "sessions"), "the store is kept")
         self.call("reporters")
         self.machine.must("dpkg", "--purge", "quarvel")
         left = self.machine.run("sh", "-c", "ls -d /var/lib/quarvel /etc/quarvel /run/quarvel/reporting.sock "

@@ -1,5 +1,4 @@
-"""What a service manager asks of the installed service: its socket is passed in, it says when it is
-ready, alive and stopping, and the units do what they say."""
+"""The installed service under a service manager: socket activation, notifications, watchdog, sandbox."""
 
 import re
 import signal
@@ -14,7 +13,7 @@ UNITS = PREFIX / "lib/systemd/system"
 
 class Manager(ServiceTest):
     def watched(self, service, **variables):
-        """Has the service speak to a service manager; returns what that one hears from."""
+        """Returns the socket that receives the service's notifications."""
         path = service.directory / "notify.sock"
         heard = socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM)
         self.addCleanup(heard.close)
@@ -23,7 +22,7 @@ class Manager(ServiceTest):
         service.environment.update(NOTIFY_SOCKET=str(path), **variables)
         return heard
 
-    def test_it_says_when_it_is_ready_and_when_it_stops_and_nothing_else(self):
+    def test_it_notifies_ready_and_stopping_and_nothing_else(self):
         service = self.prepared()
         heard = self.watched(service)
         service.start()
@@ -51,7 +50,7 @@ class Manager(ServiceTest):
         self.assertEqual(said, [b"READY=1"] + [b"WATCHDOG=1"] * 4)
         service.process.send_signal(signal.SIGSTOP)
         heard.settimeout(1)
-        with self.assertRaises(TimeoutError):  # what was on its way comes, and then no more
+        with self.assertRaises(TimeoutError):  # after pings already sent, none follows
             for _ in range(20):
                 heard.recv(100)
         heard.settimeout(PATIENCE)
@@ -66,26 +65,26 @@ class Manager(ServiceTest):
             if name in service.environment:
                 arguments.append(f"--setenv={name}={service.environment[name]}")
         with open(service.log_path, "wb") as log:
-            # As it is here instead of where it will be installed.
+            # The program of the unit, below the test's prefix.
             program = re.search("^ExecStart=/usr/(.*)$", (UNITS / "quarvel.service").read_text(), re.MULTILINE)[1]
             service.process = subprocess.Popen([*arguments, PREFIX / program], stderr=log)
         self.addCleanup(service.finish)
         eventually(service.socket.exists, "the socket")
-        self.assertNotIn("quarveld", service.log(), "nobody has come yet")
+        self.assertNotIn("quarveld", service.log(), "no client has connected")
         client = self.client(service)
         client.start_session(5)
         client.message({"first": True}, [5])
         self.assertTrue((service.directory / "run/notify").is_dir(), "notifications can be posted")
         self.assertEqual(service.end(), 0)
         self.assertEqual(service.count("message WHERE session_id = 5"), 2, "and the summary")
-        self.assertTrue(service.socket.exists(), "it belongs to whoever passed it in")
+        self.assertTrue(service.socket.exists(), "it belongs to the service manager")
 
 
 class Units(unittest.TestCase):
-    # From "systemd-analyze security": 10 is nothing between the service and the machine.
+    # Of "systemd-analyze security"; 10 is a service without any sandbox.
     MOST_EXPOSURE = 1.5
 
-    def test_the_service_is_locked_up(self):
+    def test_the_service_is_sandboxed(self):
         done = subprocess.run(["systemd-analyze", "security", "--offline=yes", "--no-pager",
                                f"--threshold={round(self.MOST_EXPOSURE * 10)}", UNITS / "quarvel.service"],
                               capture_output=True, text=True, timeout=PATIENCE)

@@ -1,4 +1,4 @@
-"""The packages: what Debian's own checks say of them, and what somebody has who installed them."""
+"""The packages: Debian's own checks, and programs that use the installed library."""
 
 import os
 import pathlib
@@ -10,7 +10,7 @@ import unittest
 SOURCE = pathlib.Path(os.environ["QUARVEL_SOURCE"])
 BUILD = pathlib.Path(os.environ["QUARVEL_BUILD"])
 PACKAGES = sorted((BUILD / "packages").glob("*.deb"))
-PATIENCE = 600
+PATIENCE = 600  # seconds
 
 
 def run(*command, **options):
@@ -38,9 +38,15 @@ class Packages(unittest.TestCase):
         self.assertEqual(names, ["libquarvel-dev", "".join(soname), "quarvel-tools", "quarvel"])
         self.assertIn(f"{soname[0]} {soname[1]} {''.join(soname)} ", run("dpkg-deb", "--info", PACKAGES[1], "shlibs"))
 
+    def test_the_probe_is_in_the_service(self):
+        with tempfile.TemporaryDirectory() as directory:
+            run("dpkg-deb", "-x", PACKAGES[-1], directory)
+            notes = run("readelf", "-n", pathlib.Path(directory) / "usr/sbin/quarveld")
+        self.assertRegex(notes, r"Provider: quarvel\s+Name: event\s+.*\s+Arguments: 4@\S+( 8@\S+){4}")
+
 
 class Installed(unittest.TestCase):
-    """Without a machine of its own: unpacked, and used from there."""
+    """The packages unpacked into a directory, and used from there."""
 
     @classmethod
     def setUpClass(cls):

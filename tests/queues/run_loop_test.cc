@@ -1,7 +1,6 @@
 #include "platform/RunLoop.h"
 
 #include <gmock/gmock.h>
-#include <pthread.h>
 #include <sys/resource.h>
 
 #include <atomic>
@@ -168,22 +167,6 @@ TEST(RunLoop, TimersThatOutliveItsThreadNeverFire) {
   kept->invalidate();
 }
 
-TEST(WorkerThread, ShowsItsNameAndDestroysItsBody) {
-  std::string shown;
-  Gate destroyed;
-  static_cast<void>(CreateWorkerThread("unstarted", [] { ADD_FAILURE(); }));
-  CreateWorkerThread("tarnwick.test.worker", [&shown, token = std::shared_ptr<void>(
-                                                          nullptr, [&destroyed](void*) {
-                                                            destroyed.arrive();
-                                                          })] {
-    char name[16] = "";
-    pthread_getname_np(pthread_self(), name, sizeof(name));
-    shown = name;
-  })->start();
-  destroyed.wait();
-  EXPECT_EQ(shown, "test.worker");
-}
-
 // The class of the server queue runs one block at a time.
 TEST(SleepThread, DelaysItsOwnQueueAlone) {
   WorkQueues queues;
@@ -194,7 +177,7 @@ TEST(SleepThread, DelaysItsOwnQueueAlone) {
   bool ranMeanwhile = false;
   sleepers->async([&] {
     asleep.arrive();
-    SleepThread(1s);
+    SleepThread(500ms);
     isAwake = true;
   });
   asleep.wait();

@@ -7,6 +7,7 @@
 #include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <iterator>
 #include <memory>
 #include <string>
@@ -127,16 +128,11 @@ TEST_F(SerialQueueTest, BusyQueueLeavesOthersTheirTurn) {
   const auto other = serverQueue();
   std::atomic<bool> otherRan{false};
   Gate stopped;
-  struct Again {
-    WorkQueue& queue;
-    std::atomic<bool>& stop;
-    Gate& stopped;
-    void operator()() {
-      if (stop) return stopped.arrive();
-      queue.async(Again{queue, stop, stopped});
-    }
+  const std::function<void()> again = [&] {
+    if (otherRan) return stopped.arrive();
+    busy->async(again);
   };
-  busy->async(Again{*busy, otherRan, stopped});
+  busy->async(again);
   other->async([&otherRan] { otherRan = true; });
   stopped.wait();
 }
@@ -305,9 +301,9 @@ class RecordingTracker final : public CallTracker {
   std::atomic<int> carriedOutTimes{0};
 
  private:
-  void ran(std::chrono::nanoseconds /*time*/) override { EXPECT_EQ(carriedOutTimes, 0); }
-  void carriedOut() override { ++carriedOutTimes; }
-  void completed() override {
+  void blockRan(std::chrono::nanoseconds /*time*/) override { EXPECT_EQ(carriedOutTimes, 0); }
+  void callExecuted() override { ++carriedOutTimes; }
+  void callCompleted() override {
     EXPECT_EQ(carriedOutTimes, 1);
     ++completions_;
   }

@@ -1,4 +1,4 @@
-#include "tests/simulated/SimulatedLog.h"
+#include "platform/Log.h"
 
 #include <map>
 
@@ -6,26 +6,10 @@
 
 namespace quarvel {
 
-namespace {
-
-const char* LevelName(LogLevel level) {
-  switch (level) {
-    case LogLevel::error:
-      return "error";
-    case LogLevel::standard:
-      return "default";
-    case LogLevel::info:
-      return "info";
-    case LogLevel::debug:
-      return "debug";
-  }
-  return "";
-}
-
-}  // namespace
-
 std::string LogLine::text() const {
-  return fmt::format("{} {} {}: {}", LevelName(level), scope, function, message);
+  constexpr const char* kLevels[] = {"error", "default", "info", "debug"};
+  return fmt::format("{} {} {}: {}", kLevels[static_cast<std::size_t>(level)], scope, function,
+                     message);
 }
 
 std::vector<std::string> SimulatedLog::texts(std::string_view prefix) const {

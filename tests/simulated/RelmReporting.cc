@@ -1,4 +1,4 @@
-#include "tests/simulated/SimulatedAgent.h"
+#include "platform/RelmReporting.h"
 
 #include <fmt/format.h>
 
@@ -42,15 +42,14 @@ class SimulatedAgentSession final : public RelmReportingSession {
     AwaitRoom();
     Simulation::current().note(
         fmt::format("agent {} message {:#x} {:#x}", number_, category, type));
-    offer({category, type, payload, Simulation::current().elapsed()});
+    record_.offered.push_back({category, type, payload, Simulation::current().elapsed()});
     if (Agent().sendError) return *Agent().sendError;
-    record_.messages.push_back({category, type, payload, Simulation::current().elapsed()});
+    record_.messages.push_back(record_.offered.back());
     return Success();
   }
 
   void flushMessages(FlushCompletion completion) override {
     Simulation& simulation = Simulation::current();
-    if (simulation.tells(Lie::flushLost)) return;
     simulation.note(fmt::format("agent {} flush", number_));
     record_.flushes.push_back(simulation.elapsed());
     simulation.spawn("agent", [completion = std::move(completion), error = Agent().flushError] {
@@ -63,16 +62,6 @@ class SimulatedAgentSession final : public RelmReportingSession {
   }
 
  private:
-  void offer(const SimulatedAgent::Message& message) {
-    Simulation& simulation = Simulation::current();
-    if (simulation.tells(Lie::messageLost)) return;
-    record_.offered.push_back(message);
-    if (simulation.tells(Lie::messageTwice)) record_.offered.push_back(message);
-    if (record_.offered.size() > 1 && simulation.tells(Lie::messagesSwapped)) {
-      std::swap(record_.offered.back(), record_.offered.front());
-    }
-  }
-
   SimulatedAgent::Session& record_;
   const std::size_t number_;
 };
@@ -101,7 +90,6 @@ Outcome RelmReporting::sendOneMessage(const Dictionary& sessionInfo, const Dicti
   Simulation::current().note(fmt::format("agent single {:#x} {:#x}", category, type));
   SimulatedAgent::SingleMessage message{
       sessionInfo, userInfo, {category, type, payload, Simulation::current().elapsed()}};
-  if (Simulation::current().tells(Lie::singleMessageLost)) return Success();
   if (Agent().singleMessageError) {
     Agent().refusedSingleMessages.push_back(std::move(message));
     return *Agent().singleMessageError;

@@ -1,8 +1,9 @@
+#include "platform/RunLoop.h"
+
 #include <algorithm>
 #include <optional>
 #include <vector>
 
-#include "platform/RunLoop.h"
 #include "tests/simulated/Simulation.h"
 
 namespace quarvel {
@@ -29,7 +30,7 @@ class SimulatedTimer final : public RunLoopTimer {
   friend class SimulatedRunLoop;
 
   Scheduler::Duration fireDate_;
-  std::optional<Block> block_;  // none: not valid any more
+  std::optional<Block> block_;  // none: no longer valid
   SimulatedRunLoop* loop_ = nullptr;
 };
 
@@ -68,13 +69,13 @@ class SimulatedRunLoop final : public RunLoop {
     std::erase_if(timers_, [&timer](const auto& held) { return held.get() == &timer; });
   }
 
-  /// Has `run` look again.
+  /// Makes `run` look at its timers again.
   void changed() {
     if (waiter_ != nullptr) TheScheduler().wake(*waiter_);
   }
 
  private:
-  /// Of timers with the same date, one by the seed.
+  /// The seed chooses among timers with the same date.
   [[nodiscard]] std::shared_ptr<SimulatedTimer> earliest() const {
     const auto first = std::ranges::min(timers_, {}, &dateOf)->fireDate_;
     std::vector<std::shared_ptr<SimulatedTimer>> candidates;
@@ -102,7 +103,7 @@ class SimulatedRunLoop final : public RunLoop {
   Scheduler::Thread* waiter_ = nullptr;
 };
 
-// What another thread does around the change may come before or after it.
+// Another thread may run before or after the change.
 void SimulatedTimer::fireAfter(std::chrono::microseconds delay) {
   TheScheduler().mayYield();
   fireDate_ = TheScheduler().elapsed() + std::max(delay, Scheduler::Duration::zero());

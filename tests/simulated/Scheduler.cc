@@ -13,7 +13,7 @@ namespace {
 
 constexpr Date kBeginning{std::chrono::seconds{1'769'866'000}};
 constexpr std::size_t kMostChoices = 1'000'000;
-// Real time. Nothing waits this long unless a thread blocks where the simulation cannot see it.
+// Real time. Reached only when a thread blocks outside the simulated platform.
 constexpr std::chrono::seconds kHung{60};
 
 }  // namespace
@@ -65,18 +65,6 @@ Scheduler::Thread* Scheduler::current() const {
   return currentThread;
 }
 
-void Scheduler::run() {
-  runFromTest(std::nullopt);
-}
-
-void Scheduler::runFor(Duration duration) {
-  runFromTest(elapsed_ + duration);
-}
-
-void Scheduler::runUntil(Duration elapsed) {
-  runFromTest(elapsed);
-}
-
 void Scheduler::runFromTest(std::optional<Duration> until) {
   if (stopped_) return;
   until_ = until;
@@ -85,12 +73,12 @@ void Scheduler::runFromTest(std::optional<Duration> until) {
     handOver(first);
     awaitTurn(*test_);
   }
-  if (endless_) ADD_FAILURE() << "no end after " << choices_.size() << " choices";
+  if (endless_) ADD_FAILURE() << "no end after " << choices_ << " choices";
   if (stopped_) return;
   if (until) {
     elapsed_ = std::max(elapsed_, *until);
-  } else if (const std::string inVain = waiting(); !inVain.empty()) {
-    ADD_FAILURE() << "nothing is left to run, yet somebody waits: " << inVain;
+  } else if (const std::string stuck = waiting(); !stuck.empty()) {
+    ADD_FAILURE() << "deadlock: nothing is left to run, but threads wait: " << stuck;
   }
 }
 
@@ -197,7 +185,7 @@ void Scheduler::wakeOverdue() {
   }
 }
 
-// Moves the clock to the next deadline; false when there is none (within this run).
+// Moves the clock to the next deadline; false when this run has none.
 bool Scheduler::advanceTime() {
   std::optional<Duration> earliest;
   if (!timers_.empty()) earliest = timers_.begin()->first;
@@ -211,10 +199,10 @@ bool Scheduler::advanceTime() {
   return true;
 }
 
-// Chooses who goes on. A block that begins is given to `idle`, or else to a thread of the pool; the
-// test goes on when nothing is left.
+// Chooses the next thread. A block that begins is given to `idle`, or else to a thread of the pool.
+// The test goes on when nothing is left.
 Scheduler::Thread& Scheduler::next(Thread* idle) {
-  endless_ = choices_.size() >= kMostChoices;
+  endless_ = choices_++ >= kMostChoices;
   stopped_ = stopped_ || endless_;
   do {
     if (stopped_) return *test_;
@@ -225,7 +213,6 @@ Scheduler::Thread& Scheduler::next(Thread* idle) {
   const auto chosen = ready_.begin() + static_cast<std::ptrdiff_t>(choose(ready_.size()));
   Ready ready = std::move(*chosen);
   ready_.erase(chosen);
-  choices_.push_back(ready.name);
   if (ready.thread != nullptr) return *ready.thread;
 
   if (idle == nullptr) {

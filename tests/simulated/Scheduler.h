@@ -18,46 +18,44 @@
 
 namespace quarvel {
 
-/// Thrown in a simulated thread whose life is over: the process exited, or the simulation ends.
+/// Thrown in a simulated thread that must end: the process exited, or the simulation ends.
 struct ThreadEnded {};
 
-/// Runs simulated threads one at a time in virtual time. Each lives on a thread of its own from a
-/// pool, and exactly one of them, or the test, holds the baton; whoever has to wait hands it to
-/// another that is ready, chosen by the seed. Time moves only when nobody is ready, and then
-/// straight to the next deadline.
+/// Runs simulated threads one at a time in virtual time. Each has a real thread from a pool, and
+/// exactly one of them, or the test, holds the baton. A thread that has to wait hands the baton to
+/// another one that is ready; the seed chooses it. Time moves only when no thread is ready, and
+/// then straight to the next deadline.
 ///
-/// Ownership: everything but the baton itself belongs to whoever holds the baton.
+/// Owned by the `Simulation`. Everything but the baton itself is guarded by the baton.
 class Scheduler {
  public:
   using Duration = std::chrono::microseconds;
 
-  /// A queue of blocks. Outlives its handle for as long as it has blocks to run.
+  /// Queue of blocks. Outlives its handle while it has blocks to run.
   struct Queue {
     Queue(std::string label, bool isSerial) : name(std::move(label)), serial(isSerial) {}
     std::string name;
-    std::size_t number = 0;  // in the order of their making
+    std::size_t number = 0;  // in the order of creation
     bool serial;
     bool busy = false;         // serial: a block is ready or running
     std::deque<Block> blocks;  // serial: those behind it
   };
 
   explicit Scheduler(std::uint64_t seed);
-  /// Ends every simulated thread where it waits, and destroys the blocks that have not run.
+  /// Ends every simulated thread where it waits, and destroys blocks that have not run.
   ~Scheduler();
   Scheduler(const Scheduler&) = delete;
   Scheduler& operator=(const Scheduler&) = delete;
 
   // For the test, outside simulated threads.
 
-  /// Runs until nothing is ready and nobody waits for a time. Somebody who waits for a signal then
-  /// waits for ever: that is a failure, and so is a simulation without an end.
-  void run();
-  /// Runs for that long and leaves the clock there, however early nothing was left to do. Waiting
+  /// Runs until no thread is ready and none waits for a time. A thread that still waits for a
+  /// signal then is a deadlock, which fails the test; so does a simulation without an end.
+  void run() { runFromTest(std::nullopt); }
+  /// Runs for that long and leaves the clock there, even when there is nothing left to do. Waiting
   /// for a signal at its end is no failure.
-  void runFor(Duration duration);
-  void runUntil(Duration elapsed);
-  /// What ran, in order: the name of the thread or queue at every choice. For comparing runs.
-  [[nodiscard]] const std::vector<std::string>& choices() const { return choices_; }
+  void runFor(Duration duration) { runFromTest(elapsed_ + duration); }
+  void runUntil(Duration elapsed) { runFromTest(elapsed); }
 
   // From anywhere.
 
@@ -65,32 +63,33 @@ class Scheduler {
   [[nodiscard]] Duration elapsed() const { return elapsed_; }
   [[nodiscard]] Date wallClock() const { return Date{} + elapsed_ + wallOffset_; }
   void setWallClock(Date date) { wallOffset_ = date - Date{} - elapsed_; }
-  /// A number below `bound`, by the seed.
+  /// A number below `bound`, from the seed.
   [[nodiscard]] std::uint64_t choose(std::uint64_t bound) { return random_() % bound; }
 
   /// Starts a simulated thread.
   void spawn(std::string name, Block body);
   [[nodiscard]] std::shared_ptr<Queue> makeQueue(std::string name, bool serial);
   void enqueue(const std::shared_ptr<Queue>& queue, Block block);
-  /// Runs `action` once nobody is ready and the time has come. It must not wait.
+  /// Runs `action` once the time has come and no thread is ready. It must not wait.
   void after(Duration delay, Block action);
   [[nodiscard]] bool isCurrent(const Queue& queue) const;
   /// The number of the queue whose block is running; 0 when none is.
   [[nodiscard]] std::size_t currentQueue() const;
-  /// A point where another thread may go on instead of this one. Never while a `Mutex` is held.
+  /// Lets another thread go on instead of this one, if the seed says so. Never while a `Mutex` is
+  /// held.
   void mayYield();
-  /// No simulated thread runs any more: the process has exited or the simulation is ending.
+  /// Whether the process has exited or the simulation is ending: no simulated thread runs any more.
   [[nodiscard]] bool stopped() const { return stopped_; }
   /// Stops everything, as the end of the process does.
   void stop() { stopped_ = true; }
 
-  // For what simulated threads wait on.
+  // For the objects on which simulated threads wait.
 
   class Thread;
   /// The running simulated thread; null in the test.
   [[nodiscard]] Thread* current() const;
-  /// Gives the baton up until `wake`, or until the wall clock reads `deadline`; false for the
-  /// latter. `reason` says what for, to whom it waits in vain. In a simulated thread only.
+  /// Gives up the baton until `wake`, or until the wall clock reads `deadline`; false for the
+  /// latter. A deadlock's failure prints `reason`. In a simulated thread only.
   bool park(const char* reason, std::optional<Date> deadline = std::nullopt);
   /// Makes a parked thread ready; does nothing to one that is not parked.
   void wake(Thread& thread);
@@ -98,7 +97,7 @@ class Scheduler {
   void sleep(Duration duration);
 
  private:
-  // What can run next: a thread that goes on, or a block that begins (on a queue or its own).
+  // A thread that can go on, or a block that can begin (on a queue or by itself).
   struct Ready {
     Thread* thread = nullptr;
     std::string name;
@@ -129,7 +128,7 @@ class Scheduler {
   std::vector<Thread*> idle_;
   std::unique_ptr<Thread> test_;
   std::vector<std::weak_ptr<Queue>> queues_;
-  std::vector<std::string> choices_;
+  std::size_t choices_ = 0;
 
   Mutex baton_;
   std::atomic<std::uint64_t> handOvers_{0};

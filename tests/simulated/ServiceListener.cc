@@ -1,4 +1,4 @@
-#include "tests/simulated/SimulatedListener.h"
+#include "platform/ServiceListener.h"
 
 #include <fmt/format.h>
 
@@ -16,10 +16,7 @@ class RecordingReply final : public ReplySink {
   explicit RecordingReply(std::shared_ptr<RecordedCall> call) : call_(std::move(call)) {}
 
   void result(Value value) override {
-    Simulation& simulation = Simulation::current();
-    if (simulation.tells(Lie::replyLost)) return;
-    simulation.note(fmt::format("reply {} {}", call_->method, JsonText(value)));
-    if (simulation.tells(Lie::replyTwice)) call_->results.push_back(value);
+    Simulation::current().note(fmt::format("reply {} {}", call_->method, JsonText(value)));
     call_->results.push_back(std::move(value));
   }
   void error(const Error& error) override { call_->results.emplace_back(error.description()); }
@@ -44,7 +41,6 @@ class SimulatedConnection final : public ClientConnection,
   }
   void setExportedObject(std::shared_ptr<ExportedObject> object) override {
     object_ = std::move(object);
-    *observedObject = object_;
   }
   [[nodiscard]] std::shared_ptr<ExportedObject> exportedObject() const override { return object_; }
   void setInterruptionHandler(std::function<void()> handler) override {
@@ -53,22 +49,13 @@ class SimulatedConnection final : public ClientConnection,
   void setInvalidationHandler(std::function<void()> handler) override {
     invalidationHandler_ = std::move(handler);
   }
-  void resume() override {
-    served_ = true;
-    for (Block& block : std::exchange(early_, {})) perform(std::move(block));
-  }
+  void resume() override {}
   [[nodiscard]] std::string description() const override {
     return fmt::format("<ClientConnection {}>", processIdentifier_);
   }
 
-  // On the connection's thread, once it serves.
-  void perform(Block block) {
-    if (served_) {
-      Simulation::current().scheduler.enqueue(queue_, std::move(block));
-    } else {
-      early_.push_back(std::move(block));
-    }
-  }
+  // On the connection's thread. Its first block is the question to the delegate, so calls follow.
+  void perform(Block block) { Simulation::current().scheduler.enqueue(queue_, std::move(block)); }
 
   void receive(const std::shared_ptr<RecordedCall>& call, const std::string& arguments) {
     if (object_ == nullptr) return;
@@ -89,7 +76,6 @@ class SimulatedConnection final : public ClientConnection,
     if (invalidationHandler) note(Arrival::Kind::end);
     if (interrupted && interruptionHandler) interruptionHandler();
     if (invalidationHandler) invalidationHandler();
-    if (Simulation::current().tells(Lie::connectionKept)) return;
     object_.reset();
     Simulation::current().listener.drop(*this);
   }
@@ -97,9 +83,6 @@ class SimulatedConnection final : public ClientConnection,
   void note(Arrival::Kind kind, std::shared_ptr<const RecordedCall> call = nullptr) const {
     Simulation::current().arrivals.push_back({kind, client_, std::move(call)});
   }
-
-  const std::shared_ptr<std::weak_ptr<ExportedObject>> observedObject =
-      std::make_shared<std::weak_ptr<ExportedObject>>();
 
  private:
   const std::int32_t processIdentifier_;
@@ -109,12 +92,10 @@ class SimulatedConnection final : public ClientConnection,
   std::shared_ptr<ExportedObject> object_;
   std::function<void()> interruptionHandler_;
   std::function<void()> invalidationHandler_;
-  bool served_ = false;
-  std::vector<Block> early_;
 };
 
 SimulatedClient::SimulatedClient(const std::shared_ptr<SimulatedConnection>& connection)
-    : connection_(connection), exportedObject_(connection->observedObject) {}
+    : connection_(connection) {}
 
 SimulatedClient::Call SimulatedClient::call(std::string method, const List& arguments) {
   auto call = std::make_shared<RecordedCall>();
@@ -145,9 +126,7 @@ std::weak_ptr<ClientConnection> SimulatedClient::connection() const {
 SimulatedClient SimulatedListener::connect(std::int32_t processIdentifier) {
   const auto connection = connections_.emplace_back(
       std::make_shared<SimulatedConnection>(processIdentifier, clients_++));
-  Scheduler& scheduler = Simulation::current().scheduler;
-  if (queue_ == nullptr) queue_ = scheduler.makeQueue("listener", true);
-  scheduler.enqueue(queue_, [this, connection] {
+  connection->perform([this, connection] {
     connection->note(Arrival::Kind::connection);
     if (!resumed_ || !delegate_->shouldAcceptNewConnection(*this, connection)) drop(*connection);
   });

@@ -12,6 +12,16 @@ namespace {
 Simulation* currentSimulation = nullptr;
 }
 
+Seeds::Seeds() {
+  constexpr std::uint64_t kNightlyFactor = 25;
+  if (const char* one = std::getenv("QUARVEL_SEED")) {
+    first_ = last_ = std::strtoull(one, nullptr, 10);
+  } else if (const char* count = std::getenv("QUARVEL_SEEDS")) {
+    const std::uint64_t times = std::getenv("QUARVEL_NIGHTLY") == nullptr ? 1 : kNightlyFactor;
+    last_ = std::strtoull(count, nullptr, 10) * times;
+  }
+}
+
 std::vector<std::string> Journal::lines(std::initializer_list<std::string_view> prefixes) const {
   std::vector<std::string> matching;
   std::ranges::copy_if(lines_, std::back_inserter(matching), [&](const std::string& line) {
@@ -21,7 +31,7 @@ std::vector<std::string> Journal::lines(std::initializer_list<std::string_view> 
 }
 
 Simulation::Simulation(std::uint64_t seed)
-    : random(seed),
+    : random{std::mt19937(seed)},
       scheduler(seed),
       seedTrace_(__FILE__, __LINE__, fmt::format("QUARVEL_SEED={}", seed)) {
   currentSimulation = this;
@@ -29,9 +39,9 @@ Simulation::Simulation(std::uint64_t seed)
 
 Simulation::~Simulation() {
   scheduler.stop();
-  // Whatever these hold may still use the rest of the platform as it goes.
+  // Released first: their destructors may still use the rest of the platform.
   listener.release();
-  notifications.release();
+  notifications = {};
   orientation = {};
 }
 

@@ -4,35 +4,72 @@
 
 #include <chrono>
 #include <cstdint>
+#include <initializer_list>
+#include <iterator>
 #include <map>
 #include <optional>
+#include <ostream>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "base/Error.h"
+#include "base/Json.h"
 #include "platform/WorkQueue.h"
-#include "tests/simulated/Printers.h"
+#include "tests/simulated/Recorders.h"
 #include "tests/simulated/Scheduler.h"
-#include "tests/simulated/Seeds.h"
-#include "tests/simulated/SimulatedAgent.h"
-#include "tests/simulated/SimulatedListener.h"
-#include "tests/simulated/SimulatedLog.h"
-#include "tests/simulated/SimulatedSettings.h"
-#include "tests/simulated/SimulatedSinks.h"
-#include "tests/simulated/SimulatedSystem.h"
-#include "tests/simulated/SimulatedTallix.h"
 
 namespace quarvel {
 
 using namespace std::chrono_literals;  // NOLINT(google-build-using-namespace): durations in tests
 
-/// Everything that reached the platform, of whatever kind, a line each in the order it came. For
-/// asserting an order across kinds; each kind's own recorder has the details.
+// Texts of the project's values in GoogleTest's failures.
+inline void PrintTo(const Value& value, std::ostream* out) {
+  *out << JsonText(value);
+}
+inline void PrintTo(const Dictionary& dictionary, std::ostream* out) {
+  *out << JsonText(dictionary);
+}
+inline void PrintTo(const Payload& payload, std::ostream* out) {
+  *out << JsonText(payload);
+}
+inline void PrintTo(const Error& error, std::ostream* out) {
+  *out << error.description();
+}
+
+/// The seeds for which a test repeats its body, for a range-for. Ends once the test has failed: the
+/// first failing seed is enough.
+class Seeds {
+ public:
+  /// `QUARVEL_SEED` alone when it is set, to replay a failure; else `QUARVEL_SEEDS` seeds (25 times
+  /// as many when `QUARVEL_NIGHTLY` is set), 20 by default.
+  Seeds();
+
+  struct Iterator {
+    std::uint64_t seed;
+    std::uint64_t last;
+    std::uint64_t operator*() const { return seed; }
+    void operator++() { ++seed; }
+    bool operator!=(std::default_sentinel_t) const {
+      return seed <= last && !testing::Test::HasFailure();
+    }
+  };
+  [[nodiscard]] Iterator begin() const { return {first_, last_}; }
+  [[nodiscard]] std::default_sentinel_t end() const { return {}; }
+  [[nodiscard]] std::uint64_t size() const { return last_ - first_ + 1; }
+
+ private:
+  std::uint64_t first_ = 1;
+  std::uint64_t last_ = 20;
+};
+
+/// Every event that reached the platform, a line each in order of arrival, for asserting an order
+/// across kinds. The recorder of each kind has the details.
 class Journal {
  public:
   /// The lines that begin with one of `prefixes`.
-  [[nodiscard]] std::vector<std::string> lines(std::initializer_list<std::string_view> prefixes = {
-                                                   ""}) const;
+  [[nodiscard]] std::vector<std::string> lines(
+      std::initializer_list<std::string_view> prefixes) const;
   void clear() { lines_.clear(); }
   void note(std::string line) { lines_.push_back(std::move(line)); }
 
@@ -40,28 +77,12 @@ class Journal {
   std::vector<std::string> lines_;
 };
 
-/// What the simulated platform can be told to get wrong, once, so that a test can show that its
-/// checks would notice.
-enum class Lie : std::uint8_t {
-  none,
-  messageLost,
-  messageTwice,
-  messagesSwapped,
-  singleMessageLost,
-  flushLost,
-  replyLost,
-  replyTwice,
-  historyCut,
-  eventLost,
-  connectionKept,
-};
-
-/// The simulated platform, one a test: stands behind every header of `platform/` from its
-/// construction to its destruction. What is declared after it in a test is destroyed before it, so
-/// a thread that may still wait at the end must share what it uses: it unwinds at the destruction.
+/// The simulated platform: implements every header of `platform/` from its construction to its
+/// destruction. A test owns one. Objects that the test declares after it are destroyed before it,
+/// so a thread that may still wait at the end must share its objects: it unwinds at destruction.
 ///
-/// The test arranges (switches, connections, threads), runs, and asserts on what was recorded;
-/// nothing happens between two runs. Every failure names the seed.
+/// The test arranges (switches, connections, threads), runs, and asserts on the recorders; nothing
+/// happens between two runs. Every failure names the seed.
 class Simulation {
  public:
   struct CreatedQueue {
@@ -80,13 +101,6 @@ class Simulation {
   void runFor(Scheduler::Duration duration) { scheduler.runFor(duration); }
   void spawn(std::string name, Block body) { scheduler.spawn(std::move(name), std::move(body)); }
   [[nodiscard]] Scheduler::Duration elapsed() const { return scheduler.elapsed(); }
-
-  /// For recorders: whether to tell `what`, which is told once.
-  [[nodiscard]] bool tells(Lie what) {
-    if (lie != what) return false;
-    lie = Lie::none;
-    return true;
-  }
   /// For recorders: notes a line unless the process is over.
   void note(std::string line) {
     if (!scheduler.stopped()) journal.note(std::move(line));
@@ -94,9 +108,8 @@ class Simulation {
 
   /// Switch: waits in a `Condition` may end without a signal, at a moment chosen by the seed.
   bool spuriousWakeUps = false;
-  /// Switch: what the platform gets wrong.
-  Lie lie = Lie::none;
   std::vector<CreatedQueue> queues;
+  std::size_t briefBlocks = 0;  // on all queues
   // Device properties.
   bool internalBuild = false;
   std::optional<std::int64_t> deviceClass;
@@ -125,3 +138,14 @@ class Simulation {
 };
 
 }  // namespace quarvel
+
+/// A test whose body is a member function of a simulation, made anew for each seed.
+#define SEEDED_TEST(suite, name, Simulated)                      \
+  struct suite##_##name final : Simulated {                      \
+    using Simulated::Simulated;                                  \
+    void body();                                                 \
+  };                                                             \
+  TEST(suite, name) {                                            \
+    for (const auto seed : Seeds()) suite##_##name(seed).body(); \
+  }                                                              \
+  void suite##_##name::body()

@@ -1,6 +1,5 @@
-#include "tests/simulated/SimulatedTallix.h"
-
 #include "platform/Tallix.h"
+
 #include "tests/simulated/Simulation.h"
 
 namespace quarvel {

@@ -36,25 +36,36 @@ Dictionary WithoutBlanksInKeys(const Dictionary& payload) {
   return result;
 }
 
+/// The application in the name of a history file: at most 128 bytes of whole characters.
+std::string FileNamePart(std::string name) {
+  if (name.size() > 128) {
+    std::size_t end = 128;
+    while ((static_cast<unsigned char>(name[end]) & 0xc0) == 0x80) --end;
+    name.resize(end);
+  }
+  std::ranges::replace(name, '/', '_');
+  return name;
+}
+
 Model::Message AgentMessage(std::uint32_t category, std::uint16_t type, Dictionary payload) {
   return {static_cast<std::uint16_t>(category % 0x1'0000), type, std::move(payload)};
 }
 
 }  // namespace
 
-void Model::arrived(const Arrival& arrival) {
+void Model::execute(const Arrival& arrival) {
   if (arrival.kind == Arrival::Kind::notification) return readPreferences();
   if (arrival.kind == Arrival::Kind::connection) {
     clients_.push_back({arrival.client, {}});
     return;
   }
   const auto client = std::ranges::find(clients_, arrival.client, &Client::number);
-  if (arrival.kind == Arrival::Kind::call) return carryOut(*client, *arrival.call);
+  if (arrival.kind == Arrival::Kind::call) return execute(*client, *arrival.call);
   for (const auto& [reporterID, session] : client->sessions) {
     if (session->started) stop(*session);
   }
   clients_.erase(client);
-  ++ended;
+  ++endedClients;
 }
 
 void Model::readPreferences() {
@@ -66,7 +77,7 @@ void Model::readPreferences() {
   defaults.set("disable_reporting", disabled == nullptr ? Value(0) : *disabled);
   reporting_ = disabled == nullptr || *disabled != Value(true);
   for (Client& client : clients_) {
-    for (const auto& [reporterID, session] : client.sessions) session->userInfo.merge(defaults);
+    for (const auto& [reporterID, session] : client.sessions) merge(*session, defaults);
   }
 }
 
@@ -84,7 +95,7 @@ Model::Session* Model::any(Client& client, std::int64_t reporterID) {
   return nullptr;
 }
 
-void Model::carryOut(Client& client, const RecordedCall& call) {
+void Model::execute(Client& client, const RecordedCall& call) {
   std::vector<Value>& answer = answers[&call];
   const std::string operation = call.method.substr(0, call.method.find(':'));
   const auto number = [&](std::size_t i) { return *call.arguments.at(i).integer(); };
@@ -103,7 +114,7 @@ void Model::carryOut(Client& client, const RecordedCall& call) {
     answer.emplace_back(session == nullptr ? 65535 : session->serviceType);
   } else if (operation == "setConfiguration") {
     Session* session = own(client, number(1));
-    if (session != nullptr) session->userInfo.merge(*call.arguments.at(0).dictionary());
+    if (session != nullptr) merge(*session, *call.arguments.at(0).dictionary());
     answer.emplace_back(true);
   } else if (operation == "startReportingSessionForID") {
     if (number(0) == 0) {
@@ -136,9 +147,14 @@ void Model::carryOut(Client& client, const RecordedCall& call) {
   }
 }
 
+void Model::merge(Session& session, const Dictionary& entries) {
+  session.userInfo.merge(entries);
+  for (Run& run : session.runs) run.userInfos.push_back(session.userInfo);
+}
+
 void Model::setServiceType(Session& session, std::uint16_t serviceType) {
   if ((serviceType == kTest) != (session.serviceType == kTest) && !session.runs.empty()) {
-    session.unsettled = true;
+    session.ambiguous = true;
   }
   session.serviceType = serviceType;
   for (SingleMessage& single : singleMessages) {
@@ -151,9 +167,9 @@ void Model::start(Session& session, const RecordedCall& call) {
   session.history.clear();
   session.runs.push_back({session.serviceType != kTest,
                           ServiceName(session.serviceType) + "_session",
-                          session.userInfo,
+                          {session.userInfo},
                           {}});
-  // The start before this one is answered once more.
+  // The previous start is answered once more.
   for (const RecordedCall* start : session.starts) answers[start].emplace_back(true);
   session.starts = {&call};
 }
@@ -168,10 +184,12 @@ void Model::stop(Session& session) {
     }
     run.messages.push_back({0xffff, 0xffff, summary});
     const Value* application = session.userInfo.find("HostApplicationDisplayID");
-    histories.push_back({fmt::format("-quarvel-{}-{}.json",
-                                     application == nullptr ? "unknown" : *application->string(),
-                                     ServiceName(session.serviceType)),
-                         session.userInfo, session.history});
+    histories.push_back(
+        {fmt::format("-quarvel-{}-{}.json",
+                     application == nullptr ? "unknown" : FileNamePart(*application->string()),
+                     ServiceName(session.serviceType)),
+         session.userInfo, session.history});
+    ++session.counts[MessageName(0xffff'ffff, '_', 0xffff)];
   }
   run.stopped = true;
   session.started = false;
@@ -194,7 +212,7 @@ void Model::send(Client& client, const RecordedCall& call) {
       if (session != nullptr) {
         targets.push_back(session);
       } else {
-        ++toNobody;
+        ++unroutable;
       }
     }
   } else {

@@ -3,20 +3,19 @@
 #include <cstdint>
 #include <deque>
 #include <map>
-#include <optional>
 #include <set>
 #include <string>
 #include <utility>
 #include <vector>
 
 #include "base/Value.h"
-#include "tests/simulated/SimulatedListener.h"
+#include "tests/simulated/Recorders.h"
 
 namespace quarvel {
 
-/// What the service owes its clients, the agent, the sinks and the diagnostics directory on an
-/// internal build, worked out from the order in which things came to it and from nothing else: one
-/// pass, no queues, no time, none of the service's code.
+/// The output that the service owes its clients, the agent, the sinks and the diagnostics
+/// directory. Computed in one pass from the order of arrivals alone: no queues, no time, none of
+/// the service's code. A `World` owns it and reads its results after the simulation.
 class Model {
  public:
   struct Message {
@@ -24,11 +23,11 @@ class Model {
     std::uint16_t type;
     Dictionary payload;
   };
-  /// A session from a start to the stop.
+  /// A session from a start to its stop.
   struct Run {
-    bool reported;  // not a test
+    bool reported;  // false for the service type "test"
     std::string serviceName;
-    Dictionary userInfo;  // at the start; more may come before the agent is asked
+    std::vector<Dictionary> userInfos;  // at the start and after each later merge
     std::vector<Message> messages;
     bool stopped = false;
   };
@@ -39,15 +38,15 @@ class Model {
     bool started = false;
     std::vector<const RecordedCall*> starts;  // answered at the stop: none or one
     std::vector<Run> runs;
-    std::map<std::string, int> counts;
+    std::map<std::string, int> counts;                        // message name to number
     std::vector<std::pair<std::string, Dictionary>> history;  // of this run
-    /// It became a test, or stopped being one, with messages perhaps still on their way: whether
-    /// those were reported depends on who was faster.
-    bool unsettled = false;
+    /// The service type became or ceased to be "test" after a start. Thread timing then decides
+    /// which of the queued messages are reported.
+    bool ambiguous = false;
   };
   struct SingleMessage {
     Message message;
-    /// Those of the session from the sending on: the one of the delivery counts.
+    /// Names that the session has had since the sending; the name at the delivery counts.
     std::set<std::string> serviceNames;
     const Session* session;  // null for a broadcast
   };
@@ -57,19 +56,19 @@ class Model {
     std::vector<std::pair<std::string, Dictionary>> messages;
   };
 
-  void arrived(const Arrival& arrival);
-  /// What the preferences hold when the next notification is carried out.
+  void execute(const Arrival& arrival);
+  /// Contents of the preferences, one for each notification to come.
   std::deque<Dictionary> preferences;
 
-  // What is owed, each in order where the service has one.
+  // Expected output, each in order where the service has an order.
   std::map<const RecordedCall*, std::vector<Value>> answers;  // an error as its text
-  std::deque<Session> sessions;                               // in the order of their creation
+  std::deque<Session> sessions;                               // in order of creation
   std::vector<SingleMessage> singleMessages;
   std::vector<std::pair<std::string, Dictionary>> events;
   std::vector<Dictionary> powerRecords;
   std::vector<History> histories;
-  std::size_t ended = 0;
-  std::size_t toNobody = 0;  // messages for sessions that do not exist
+  std::size_t endedClients = 0;
+  std::size_t unroutable = 0;  // messages for sessions that do not exist
 
  private:
   struct Client {
@@ -77,11 +76,12 @@ class Model {
     std::map<std::int64_t, Session*> sessions;
   };
 
-  void carryOut(Client& client, const RecordedCall& call);
+  void execute(Client& client, const RecordedCall& call);
   void send(Client& client, const RecordedCall& call);
   void readPreferences();
   [[nodiscard]] static Session* own(Client& client, std::int64_t reporterID);
   [[nodiscard]] Session* any(Client& client, std::int64_t reporterID);
+  static void merge(Session& session, const Dictionary& entries);
   void setServiceType(Session& session, std::uint16_t serviceType);
   void start(Session& session, const RecordedCall& call);
   void stop(Session& session);
@@ -90,7 +90,7 @@ class Model {
   void offerToSinks(const Session& session, const Dictionary& payload, std::uint32_t category,
                     std::uint16_t type);
 
-  std::vector<Client> clients_;  // in the order of their acceptance
+  std::vector<Client> clients_;  // in order of acceptance
   bool reporting_ = true;
 };
 

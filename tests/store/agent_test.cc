@@ -6,10 +6,10 @@
 #include <limits>
 #include <thread>
 
-#include "queues/WorkQueues.h"
 #include "store/EventSinks.h"
 #include "store/database/SecureRandom.h"
 #include "store/database/StoreError.h"
+#include "tests/FolderPlatform.h"
 #include "tests/store/FileCalls.h"
 #include "tests/store/StoreFixture.h"
 

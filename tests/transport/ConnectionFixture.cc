@@ -4,10 +4,12 @@
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <sys/socket.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <array>
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
 #include <utility>
 
@@ -30,10 +32,8 @@ namespace {
 
 class TestService final : public ExportedObject {
  public:
-  explicit TestService(std::shared_ptr<Ledger> ledger) : ledger_(std::move(ledger)) {}
-
   void echo(std::int64_t number, Reply<std::int64_t> reply) {
-    ledger_->arrived(number);
+    Journal::shared().addCall(number);
     reply(number);
   }
   void twice(std::int64_t number, Reply<std::int64_t> reply) {
@@ -43,10 +43,17 @@ class TestService final : public ExportedObject {
   void never(Reply<bool>) {}
   void refuse(ErrorReply reply) { reply(Error{"test", 9, {{"why", "because"}}}); }
   void keep(std::int64_t number, Reply<std::int64_t> reply) {
-    ledger_->keep(number, std::move(reply));
+    Journal::shared().keepCall(number, std::move(reply), CallRef::current());
+  }
+  void later(std::int64_t number, Reply<std::int64_t> reply) {
+    Journal::shared().keepCall(number, std::move(reply), CallRef());
+  }
+  void answerUnstored(std::int64_t number, Reply<std::int64_t> reply) {
+    reply(number);
+    Journal::shared().keepCall(number, {}, CallRef::indirect(CallRef::current().tracker()));
   }
   void make(std::int64_t number, std::uint32_t size, Reply<std::string> reply) {
-    ledger_->arrived(number);
+    Journal::shared().addCall(number);
     reply(std::string(size, 'x'));
   }
   void describe(std::optional<Payload> payload, std::uint16_t code,
@@ -54,9 +61,6 @@ class TestService final : public ExportedObject {
     reply(fmt::format("{} {} {}", payload ? JsonText(*payload) : "none", code,
                       list ? std::to_string(list->size()) : "none"));
   }
-
- private:
-  const std::shared_ptr<Ledger> ledger_;
 };
 
 constexpr std::array kTestMethods{
@@ -65,6 +69,8 @@ constexpr std::array kTestMethods{
     Exported<&TestService::never>("never:"),
     Exported<&TestService::refuse>("refuse:"),
     Exported<&TestService::keep>("keep:reply:"),
+    Exported<&TestService::later>("later:reply:"),
+    Exported<&TestService::answerUnstored>("answerUnstored:reply:"),
     Exported<&TestService::make>("make:size:reply:"),
     Exported<&TestService::describe>("describe:code:list:reply:"),
 };
@@ -72,16 +78,16 @@ constexpr ExportedInterface kTestInterface{"TestProtocol", kTestMethods};
 
 class TestDelegate final : public ServiceListenerDelegate {
  public:
-  explicit TestDelegate(Served& served) : served_(served) {}
+  explicit TestDelegate(Service& service) : service_(service) {}
 
   bool shouldAcceptNewConnection(ServiceListener&,
                                  const std::shared_ptr<ClientConnection>& connection) override {
-    const auto object = std::make_shared<TestService>(served_.ledger);
-    served_.connections.push_back(connection);
-    served_.objects.push_back(object);
+    const auto object = std::make_shared<TestService>();
+    service_.connections.push_back(connection);
+    service_.objects.push_back(object);
     connection->setExportedInterface(kTestInterface);
     connection->setExportedObject(object);
-    // Holding the object, as a careless delegate might, must not keep anything alive.
+    // Handlers that hold the object, as a careless delegate's might, must not keep it alive.
     connection->setInterruptionHandler([object] { Journal::shared().add("interrupted"); });
     connection->setInvalidationHandler([object] { Journal::shared().add("invalidated"); });
     connection->resume();
@@ -89,18 +95,23 @@ class TestDelegate final : public ServiceListenerDelegate {
   }
 
  private:
-  Served& served_;
+  Service& service_;
 };
 
 }  // namespace
 
-std::shared_ptr<ServiceListenerDelegate> DelegateFor(Served& served) {
-  return std::make_shared<TestDelegate>(served);
-}
-
 Journal& Journal::shared() {
   static Journal journal;
   return journal;
+}
+
+void Journal::clear() {
+  std::deque<KeptCall> kept;  // destroyed without the lock
+  MutexLock lock(mutex_);
+  entries_.clear();
+  calls_.clear();
+  kept.swap(kept_);
+  mostKept_ = 0;
 }
 
 void Journal::add(std::string entry) {
@@ -109,72 +120,58 @@ void Journal::add(std::string entry) {
   changed_.notifyAll();
 }
 
-void Journal::clear() {
-  MutexLock lock(mutex_);
-  entries_.clear();
-}
-
 std::vector<std::string> Journal::entries() {
   MutexLock lock(mutex_);
   return entries_;
 }
 
-std::size_t Journal::count(std::string_view part) {
-  MutexLock lock(mutex_);
-  return countLocked(part);
-}
-
-std::size_t Journal::countLocked(std::string_view part) {
-  return static_cast<std::size_t>(std::ranges::count_if(entries_, [part](const std::string& entry) {
-    return entry.find(part) != std::string::npos;
-  }));
-}
-
 bool Journal::waitFor(std::string_view part) {
   const auto deadline = std::chrono::steady_clock::now() + kPatience;
   MutexLock lock(mutex_);
-  while (countLocked(part) == 0) {
+  while (std::ranges::none_of(entries_, [part](const std::string& entry) {
+    return entry.find(part) != std::string::npos;
+  })) {
     if (!changed_.waitUntil(mutex_, deadline)) return false;
   }
   return true;
 }
 
-void Ledger::arrived(std::int64_t number) {
+void Journal::addCall(std::int64_t number) {
   MutexLock lock(mutex_);
-  numbers_.push_back(number);
+  calls_.push_back(number);
   changed_.notifyAll();
 }
 
-void Ledger::keep(std::int64_t number, Reply<std::int64_t> reply) {
+void Journal::keepCall(std::int64_t number, Reply<std::int64_t> reply, CallRef reference) {
   MutexLock lock(mutex_);
-  numbers_.push_back(number);
-  kept_.push_back({number, std::move(reply), CallRef::current()});
-  largestKept_ = std::max(largestKept_, kept_.size());
+  calls_.push_back(number);
+  kept_.push_back({number, std::move(reply), std::move(reference)});
+  mostKept_ = std::max(mostKept_, kept_.size());
   changed_.notifyAll();
 }
 
-std::optional<Ledger::Kept> Ledger::takeKept() {
+std::optional<Journal::KeptCall> Journal::takeKeptCall() {
   MutexLock lock(mutex_);
   if (kept_.empty()) return std::nullopt;
-  std::optional<Kept> first = std::move(kept_.front());
+  std::optional<KeptCall> first = std::move(kept_.front());
   kept_.pop_front();
   return first;
 }
 
-std::vector<std::int64_t> Ledger::numbers() {
+std::vector<std::int64_t> Journal::calls() {
   MutexLock lock(mutex_);
-  return numbers_;
+  return calls_;
 }
 
-std::size_t Ledger::largestKept() {
+std::size_t Journal::mostKeptCalls() {
   MutexLock lock(mutex_);
-  return largestKept_;
+  return mostKept_;
 }
 
-bool Ledger::waitForArrivals(std::size_t count) {
+bool Journal::waitForCalls(std::size_t count) {
   const auto deadline = std::chrono::steady_clock::now() + kPatience;
   MutexLock lock(mutex_);
-  while (numbers_.size() < count) {
+  while (calls_.size() < count) {
     if (!changed_.waitUntil(mutex_, deadline)) return false;
   }
   return true;
@@ -250,28 +247,43 @@ std::string CallBytes(std::optional<std::uint32_t> messageID, std::string_view m
   return bytes;
 }
 
-Service::Service(const Configuration::Limits& limits, bool begun) {
-  Journal::shared().clear();
+Service::Service(const Configuration::Limits& limits, bool begun, void (*run)(const Work&))
+    : run_(run) {
+  journal.clear();
+  ::close(BoundSocket(socketPath(), SOCK_STREAM));
+  run_([&] {
+    if (auto listener = makeListener(limits)) {
+      listener_ = std::move(listener.value());
+    } else {
+      failure = std::move(listener.error());
+    }
+  });
+  if (begun && !failure) begin();
+}
+
+Result<std::unique_ptr<SocketListener>> Service::makeListener(const Configuration::Limits& limits) {
   SocketListener::Options options;
   options.limits = limits;
-  options.atEnd.emplace_back([] { Journal::shared().add("ended"); });
+  options.atEnd.emplace_back([this] { journal.add("ended"); });
   auto socket = ListeningSocket::listeningAt(socketPath());
-  EXPECT_TRUE(socket) << socket.error().description();
+  if (!socket) return std::move(socket.error());
   auto listener = SocketListener::create(std::move(socket.value()), std::move(options));
-  EXPECT_TRUE(listener);
-  listener_ = std::move(listener.value());
-  listener_->setDelegate(DelegateFor(*this));
-  if (begun) begin();
+  if (listener) listener.value()->setDelegate(std::make_shared<TestDelegate>(*this));
+  return listener;
 }
 
 void Service::begin() {
-  thread_ = std::thread([this] { listener_->resume(); });
+  serving_ = std::async(std::launch::async, [this] { run_([this] { listener_->resume(); }); });
 }
 
 void Service::end() {
-  if (!thread_.joinable()) return;
+  if (!serving_.valid()) return;
   requestEnd();
-  thread_.join();
+  if (serving_.wait_for(kPatience) != std::future_status::ready) {
+    ADD_FAILURE() << "the service does not end";
+    std::abort();
+  }
+  serving_.get();
 }
 
 }  // namespace quarvel

@@ -4,11 +4,12 @@
 #include <cstdint>
 #include <deque>
 #include <filesystem>
+#include <functional>
+#include <future>
 #include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
-#include <thread>
 #include <vector>
 
 #include "base/Mutex.h"
@@ -20,54 +21,42 @@
 
 namespace quarvel {
 
-/// No test passes because of it; it only ends those that fail.
+/// The time-out of every wait. Reached only by a test that fails.
 inline constexpr std::chrono::seconds kPatience{60};
 
-/// What happened, in order: error lines of the log and what the handlers were told.
+/// Records events of one service, in order: error lines of the log, handlers that were called and
+/// calls that arrived. One for the program, since the log is one; any thread.
 class Journal {
  public:
-  /// The one that this program's log is written to.
+  struct KeptCall {
+    std::int64_t number;
+    Reply<std::int64_t> reply;
+    CallRef reference;
+  };
+
   static Journal& shared();
 
-  void add(std::string entry);
   void clear();
+  void add(std::string entry);
   std::vector<std::string> entries();
-  std::size_t count(std::string_view part);
   /// Waits until an entry contains `part`.
   bool waitFor(std::string_view part);
 
- private:
-  std::size_t countLocked(std::string_view part) QUARVEL_REQUIRES(mutex_);
+  void addCall(std::int64_t number);
+  /// As `addCall`; a call with a reference is in flight until it is taken and dropped.
+  void keepCall(std::int64_t number, Reply<std::int64_t> reply, CallRef reference);
+  std::optional<KeptCall> takeKeptCall();
+  std::vector<std::int64_t> calls();
+  std::size_t mostKeptCalls();
+  bool waitForCalls(std::size_t count);
 
+ private:
   Mutex mutex_;
   ConditionVariable changed_;
   std::vector<std::string> entries_ QUARVEL_GUARDED_BY(mutex_);
-};
-
-/// What the exported objects of one service have been asked, and the calls they are still working
-/// on.
-class Ledger {
- public:
-  struct Kept {
-    std::int64_t number;
-    Reply<std::int64_t> reply;
-    CallRef work;
-  };
-
-  void arrived(std::int64_t number);
-  /// As `arrived`; the call stays under way until taken and dropped.
-  void keep(std::int64_t number, Reply<std::int64_t> reply);
-  std::optional<Kept> takeKept();
-  std::vector<std::int64_t> numbers();
-  std::size_t largestKept();
-  bool waitForArrivals(std::size_t count);
-
- private:
-  Mutex mutex_;
-  ConditionVariable changed_;
-  std::vector<std::int64_t> numbers_ QUARVEL_GUARDED_BY(mutex_);
-  std::deque<Kept> kept_ QUARVEL_GUARDED_BY(mutex_);
-  std::size_t largestKept_ QUARVEL_GUARDED_BY(mutex_) = 0;
+  std::vector<std::int64_t> calls_ QUARVEL_GUARDED_BY(mutex_);
+  std::deque<KeptCall> kept_ QUARVEL_GUARDED_BY(mutex_);
+  std::size_t mostKept_ QUARVEL_GUARDED_BY(mutex_) = 0;
 };
 
 /// A client's end: writes bytes, reads responses.
@@ -75,14 +64,14 @@ class Client {
  public:
   explicit Client(const std::filesystem::path& service);
 
-  /// Sends all of it, waiting for the service to take it. False when the service has hung up.
+  /// Sends all bytes, waiting until the service reads them. False when the service has hung up.
   bool send(std::string_view bytes);
   bool call(std::uint32_t messageID, std::string_view method, List arguments);
   /// The next response as JSON text; "end" when the service has hung up.
   std::string response();
   /// The next response, "end", or nothing when neither came in time.
   std::string responseWithin(std::chrono::milliseconds time);
-  /// Calls echo with this number and says whether the answer, and nothing else, came back.
+  /// Calls echo with this number; true when its answer, and nothing else, came back.
   static constexpr std::int64_t kServedNumber = -1000;
   bool isServed();
   void stopSending();
@@ -98,34 +87,40 @@ class Client {
 std::string CallBytes(std::optional<std::uint32_t> messageID, std::string_view method,
                       const List& arguments);
 
-/// Whom a listener has served, and with what.
-struct Served {
-  const std::shared_ptr<Ledger> ledger = std::make_shared<Ledger>();
-  /// Of each connection, in order of acceptance; to be read when its end has been heard of.
-  std::vector<std::weak_ptr<ClientConnection>> connections;
-  std::vector<std::weak_ptr<ExportedObject>> objects;
-};
-/// A delegate that exports operations that answer at once, later, at length or not at all.
-std::shared_ptr<ServiceListenerDelegate> DelegateFor(Served& served);
-
-/// A listener that serves on a thread of its own from `begin` to `end`.
-class Service : public Served {
+/// A listener on a thread of its own, from `begin` to `end`. Its delegate exports operations that
+/// answer at once, later, at length or not at all. It finds the socket file of a killed service.
+class Service {
  public:
-  /// Begun, unless clients shall connect and nobody look at them yet.
-  explicit Service(const Configuration::Limits& limits = {}, bool begun = true);
+  using Work = std::function<void()>;
+  static void Run(const Work& work) { work(); }
+
+  /// With `begun` false, clients can connect but are not accepted yet. `run` runs the start and the
+  /// I/O thread.
+  explicit Service(const Configuration::Limits& limits = {}, bool begun = true,
+                   void (*run)(const Work&) = Run);
   ~Service() { end(); }
 
   Client connect() { return Client(socketPath()); }
   [[nodiscard]] std::filesystem::path socketPath() const { return directory_.path() / "socket"; }
   void begin();
-  /// Returns when the listener has.
+  /// Returns when the listener has; aborts when it does not.
   void end();
   void requestEnd() { listener_->requestEnd(); }
 
+  Journal& journal = Journal::shared();
+  // The accepted connections and their objects; to be read once an invalidation handler has run.
+  std::vector<std::weak_ptr<ClientConnection>> connections;
+  std::vector<std::weak_ptr<ExportedObject>> objects;
+  /// Why the service could not start; none when it could.
+  std::optional<Error> failure;
+
  private:
+  Result<std::unique_ptr<SocketListener>> makeListener(const Configuration::Limits& limits);
+
+  void (*const run_)(const Work&);
   TemporaryDirectory directory_;
   std::unique_ptr<SocketListener> listener_;
-  std::thread thread_;
+  std::future<void> serving_;
 };
 
 }  // namespace quarvel

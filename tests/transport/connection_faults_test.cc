@@ -1,17 +1,17 @@
+#include <fmt/format.h>
 #include <gtest/gtest.h>
-#include <unistd.h>
 
 #include <cerrno>
 #include <cstdio>
-#include <future>
+#include <map>
 #include <set>
+#include <thread>
 
-#include "tests/UnixSocket.h"
 #include "tests/transport/ConnectionFixture.h"
 #include "tests/transport/SocketCalls.h"
 
-// Every call that listening and serving make of the system fails, once and for ever: the service
-// says why it cannot begin, or goes on, and serves a polite client as soon as the fault is over.
+// Every system call of the listener and its connections fails, once or for ever: the service
+// reports why it cannot start, or it goes on and serves a good client as soon as the fault is over.
 
 namespace quarvel {
 namespace {
@@ -24,8 +24,7 @@ struct Site {
   std::size_t from = 0;  // the first call that may fail
 };
 
-// Each with the errors that its manual page has for a call that is right, and EIO for those where
-// anything else would be a surprise.
+// With the errors that the manual page lists for a correct call; EIO where it lists none.
 const std::vector<Site> kSites = {
     {"socket", {EMFILE, ENFILE, ENOMEM}},
     {"bind", {ENOSPC, EACCES, EIO}},
@@ -37,13 +36,13 @@ const std::vector<Site> kSites = {
     {"shutdown", {ENOTCONN}},
     {"getsockopt", {EIO}},
     {"epoll_create1", {EMFILE, ENFILE, ENOMEM}},
-    // Asio watches its own two descriptors without looking whether it could.
+    // Asio ignores the result of watching its own two descriptors.
     {"epoll_ctl", {ENOSPC, ENOMEM}, 2},
     {"epoll_wait", {EINTR}},
     {"eventfd", {EMFILE, ENFILE, ENOMEM}},
     {"timerfd_create", {EMFILE, ENFILE, ENOMEM}},
-    {"timerfd_settime", {}},  // a right call does not fail
-    {"write", {}},            // to a new event counter; a right call does not fail
+    {"timerfd_settime", {}},  // a correct call does not fail
+    {"write", {}},            // to a new event counter; a correct call does not fail
     {"mkdir", {ENOSPC, EIO}},
     {"open", {EMFILE, ENFILE, EIO}},
     {"flock", {EINTR, EIO}},
@@ -53,12 +52,12 @@ const std::vector<Site> kSites = {
     {"unlink", {EIO}},
 };
 
-/// Whether nothing would ever be done if a call failed with it for ever.
+/// Whether the error means "try again", so that a caller may retry for ever.
 bool IsPassing(int error) {
   return error == EINTR || error == EAGAIN || error == ECONNABORTED || error == EPROTO;
 }
 
-/// What clients do while something may fail; any of them may be turned away.
+/// Three clients while system calls fail; any of them may be refused.
 void BeClients(const std::filesystem::path& path) {
   Client first(path);
   Client second(path);
@@ -73,85 +72,58 @@ void BeClients(const std::filesystem::path& path) {
   (void)first.responseWithin(std::chrono::milliseconds(100));
 }
 
-/// A listener from its beginning to its end, with one fault. Says what went wrong, if anything did.
+/// One life of a service, from start to end, with at most one fault.
 class Life {
  public:
-  explicit Life(std::optional<SocketCalls::Fault> fault) {
-    SocketCalls& calls = SocketCalls::instance();
-    calls.begin(fault);
-    // A socket file that a killed service has left.
-    const std::filesystem::path path = directory_.path() / "socket";
-    ::close(BoundSocket(path, SOCK_STREAM));
-    if (!listen(path)) return;
-    auto served = std::async(std::launch::async, [this] {
+  explicit Life(const std::optional<SocketCalls::Fault>& fault) {
+    SocketCalls::instance().begin(fault);
+    Configuration::Limits limits;
+    limits.frame = std::chrono::milliseconds(10);
+    Service service(limits, true, [](const Service::Work& work) {
       const SocketCalls::Watched watched;
-      listener_->resume();
+      work();
     });
-    const Client bystander(path);
-    BeClients(path);
-    countsWhileFailing_ = calls.counts();
+    if (service.failure) {
+      refused_ = true;
+      if (service.failure->userInfo.find("reason") == nullptr) finding_ = "no reason is given";
+      return;
+    }
+    const Client bystander = service.connect();
+    BeClients(service.socketPath());
+    countsWhileFailing_ = SocketCalls::instance().counts();
     if (fault && fault->forever) {
-      expectRest();
-      calls.lift();
+      expectNoBusyLoop();
+      SocketCalls::instance().lift();
     }
-    // What fails once may fail for the first of them.
-    if (!Client(path).isServed() && !Client(path).isServed()) {
-      finding_ = "a polite client is not served";
-    }
-    listener_->requestEnd();
-    if (served.wait_for(kPatience) != std::future_status::ready) {
-      std::fprintf(stderr, "%s %zu fails with %d: the service does not end\n",
-                   fault ? fault->function.c_str() : "", fault ? fault->at : 0,
-                   fault ? fault->error : 0);
-      std::abort();
+    // A single fault may hit the first one.
+    if (!service.connect().isServed() && !service.connect().isServed()) {
+      finding_ = "a good client is not served";
     }
   }
 
+  /// The rule that was broken; empty when none was.
   [[nodiscard]] const std::string& finding() const { return finding_; }
   [[nodiscard]] bool refused() const { return refused_; }
-  /// How many calls of a function something may fail for ever before.
+  /// Calls of `function` before the fault was lifted: only these can fail for ever.
   [[nodiscard]] std::size_t callsWhileFailing(const std::string& function) const {
     return countsWhileFailing_.contains(function) ? countsWhileFailing_.at(function) : 0;
   }
 
  private:
-  bool listen(const std::filesystem::path& path) {
-    const SocketCalls::Watched watched;
-    auto socket = ListeningSocket::listeningAt(path);
-    if (!socket) return refuse(socket.error());
-    SocketListener::Options options;
-    options.limits.frame = std::chrono::milliseconds(10);
-    auto listener = SocketListener::create(std::move(socket.value()), std::move(options));
-    if (!listener) return refuse(listener.error());
-    listener_ = std::move(listener.value());
-    listener_->setDelegate(DelegateFor(served_));
-    return true;
-  }
-
-  bool refuse(const Error& error) {
-    refused_ = true;
-    if (error.userInfo.find("reason") == nullptr)
-      finding_ = "the service does not begin and does not say why";
-    return false;
-  }
-
-  /// Whatever fails for ever, the service does not try again and again.
-  void expectRest() {
-    std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    const auto made = [] {
+  /// A call that fails for ever is not repeated without pause.
+  void expectNoBusyLoop() {
+    const auto callsMade = [] {
+      std::this_thread::sleep_for(std::chrono::milliseconds(20));
       std::size_t sum = 0;
       for (const auto& [function, count] : SocketCalls::instance().counts()) sum += count;
       return sum;
     };
-    const std::size_t before = made();
-    std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    if (made() > before + 100) finding_ = fmt::format("{} calls in 20 ms", made() - before);
+    const std::size_t before = callsMade();
+    const std::size_t after = callsMade();
+    if (after > before + 100) finding_ = fmt::format("{} calls in 20 ms", after - before);
   }
 
-  TemporaryDirectory directory_;
-  Served served_;
   std::map<std::string, std::size_t> countsWhileFailing_;
-  std::unique_ptr<SocketListener> listener_;
   std::string finding_;
   bool refused_ = false;
 };
@@ -179,11 +151,12 @@ TEST(ConnectionFaults, EveryCallMayFail) {
             continue;
           }
           bool reached = false;
-          // Which calls are made in the end is a matter of who is faster.
+          // The calls at the end depend on which thread is faster.
           for (int attempt = 0; attempt < 5 && !reached; ++attempt) {
+            SCOPED_TRACE(fmt::format("{} {} fails with {}{}", site.function, at, error,
+                                     forever ? " for ever" : ""));
             const Life life(SocketCalls::Fault{site.function, at, error, forever});
-            EXPECT_EQ(life.finding(), "") << site.function << " " << at << " fails with " << error
-                                          << (forever ? " for ever" : "");
+            EXPECT_EQ(life.finding(), "");
             reached = SocketCalls::instance().failed() > 0;
             refusals += life.refused() ? 1U : 0U;
           }

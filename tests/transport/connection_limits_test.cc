@@ -1,4 +1,4 @@
-// Clients that are too fast, too slow or too many: bounded, held back, and never at others' cost.
+// Clients that are too fast, too slow or too many: bounded, without cost to other clients.
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -9,7 +9,6 @@
 #include <thread>
 
 #include "tests/transport/ConnectionFixture.h"
-#include "transport/ReplyQueue.h"
 
 namespace quarvel {
 namespace {
@@ -31,17 +30,17 @@ TEST(ConnectionLimits, AClientThatIsTooFastWaitsAndLosesNothing) {
       bytes += CallBytes(static_cast<std::uint32_t>(100 + i), "keep:reply:", {i});
     }
     ASSERT_TRUE(client.send(bytes));
-    ASSERT_TRUE(service.ledger->waitForArrivals(8));
+    ASSERT_TRUE(service.journal.waitForCalls(8));
     EXPECT_TRUE(service.connect().isServed()) << "only the fast client waits";
 
-    // Worked off on another thread; each reply is given before its work is done.
+    // Each reply is given before the call completes.
     std::thread worker([&] {
       for (std::size_t done = 0; done < kCalls;) {
-        if (auto kept = service.ledger->takeKept()) {
+        if (auto kept = service.journal.takeKeptCall()) {
           kept->reply(kept->number);
           ++done;
-        } else {
-          service.ledger->waitForArrivals(done + 2);  // the other client's call counts too
+        } else if (!service.journal.waitForCalls(done + 2)) {  // the other client's call counts too
+          break;
         }
       }
     });
@@ -49,90 +48,47 @@ TEST(ConnectionLimits, AClientThatIsTooFastWaitsAndLosesNothing) {
       ASSERT_THAT(client.response(), HasSubstr(",null," + std::to_string(i) + "]"));
     }
     worker.join();
-    std::vector<std::int64_t> arrived = service.ledger->numbers();
+    std::vector<std::int64_t> arrived = service.journal.calls();
     EXPECT_EQ(arrived.at(8), Client::kServedNumber)
-        << "more than eight calls were taken in before one was done";
+        << "more than eight calls were taken in before one completed";
     arrived.erase(arrived.begin() + 8);
     std::vector<std::int64_t> sent(kCalls);
     std::iota(sent.begin(), sent.end(), 0);
     EXPECT_EQ(arrived, sent);
-    EXPECT_LE(service.ledger->largestKept(), 9U);
+    EXPECT_LE(service.journal.mostKeptCalls(), 9U);
   }
 }
 
-/// Takes calls in until the desk has no room for more.
-std::size_t Fill(ReplyQueue& desk) {
-  std::size_t calls = 0;
-  for (; !desk.mustWaitForRoom(); ++calls) desk.begin(1);
-  return calls;
-}
-
-void CarryOut(ReplyQueue& desk, std::size_t calls, std::chrono::nanoseconds each) {
-  for (; calls > 0; --calls) {
-    desk.ran(each);
-    desk.carriedOut();
-  }
-}
-
-void Finish(ReplyQueue& desk, std::size_t calls) {
-  for (; calls > 0; --calls) desk.done(1);
-}
-
-TEST(ConnectionLimits, AsManyCallsAreAheadOfOthersAsTakeAMoment) {
-  const Configuration::Limits limits;
-  int woken = 0;
-  ReplyQueue desk(limits, [&woken] { ++woken; });
-  const auto turnAfter = [&](std::size_t calls, std::chrono::nanoseconds each) {
-    CarryOut(desk, calls, each);
-    Finish(desk, calls);
-    return Fill(desk);
-  };
-  EXPECT_EQ(Fill(desk), limits.firstTurn);
-  std::size_t turn = limits.firstTurn;
-  for (int i = 0; i < 20; ++i) turn = turnAfter(turn, 1us);
-  EXPECT_GT(turn, 90U) << "light calls are many";
-  // One heavy call among them is enough, though none of its like has used up a turn.
-  CarryOut(desk, 1, 10ms);
-  Finish(desk, 1);
-  turn = turnAfter(turn - 1, 50us);
-  EXPECT_EQ(turn, 1U);
-  for (int i = 0; i < 200; ++i) turn = turnAfter(turn, 1us);
-  EXPECT_GT(turn, 90U) << "and it is forgotten";
-  EXPECT_GT(woken, 200);
-}
-
-TEST(ConnectionLimits, FewerAreAnsweredAndNotDoneWhereThatTakesLong) {
-  Configuration::Limits limits;
-  ReplyQueue desk(limits, [] {});
-  const auto answer = [&] {
-    std::size_t calls = 0;
-    for (; !desk.mustWaitForRoom(); ++calls) {
-      desk.begin(1);
-      CarryOut(desk, 1, 1us);
-    }
-    return calls;
-  };
-  const std::size_t most = answer();
-  EXPECT_GT(most, 16U);
-  std::this_thread::sleep_for(5ms);
-  Finish(desk, most);
-  EXPECT_EQ(answer(), most / 2);
-  // What waits for something slow is excused, and says nothing of the rest.
-  std::this_thread::sleep_for(5ms);
-  desk.excuseThoseBehind();
-  EXPECT_EQ(answer(), most / 2);
-}
-
-TEST(ConnectionLimits, WhoComesAndGoesAsFastAsHeCanIsPaced) {
+TEST(ConnectionLimits, UnstoredCallsHoldBackLaterOnesUntilTheyAreStoredOrSlow) {
   Service service;
+  const auto callTwoHundredTimes = [](Client& client) {
+    for (int i = 0; i < 200; ++i) ASSERT_TRUE(client.call(1, "answerUnstored:reply:", {i}));
+  };
+  Client slow = service.connect();
   const auto began = std::chrono::steady_clock::now();
-  for (int i = 0; i < 1012; ++i) service.connect().hangUp();
-  EXPECT_TRUE(service.connect().isServed());
-  // 500 more than may come at once, at 4,000 a second.
-  EXPECT_GT(std::chrono::steady_clock::now() - began, 120ms);
+  callTwoHundredTimes(slow);
+  EXPECT_TRUE(service.journal.waitForCalls(200)) << "none of them completes";
+  EXPECT_GE(std::chrono::steady_clock::now() - began, 50ms) << "more than 128 were unstored";
+
+  Client other = service.connect();
+  callTwoHundredTimes(other);
+  ASSERT_TRUE(service.journal.waitForCalls(200 + 128));
+  while (service.journal.takeKeptCall()) continue;
+  EXPECT_TRUE(service.journal.waitForCalls(400)) << "completed calls make room";
 }
 
-TEST(ConnectionLimits, AClientThatReadsLateIsHeldBackAndGetsEveryReply) {
+TEST(ConnectionLimits, ClientsThatReconnectWithoutPauseAreRateLimited) {
+  Service service({}, false);
+  for (int i = 0; i < 1512; ++i) service.connect().hangUp();
+  Client last = service.connect();
+  const auto began = std::chrono::steady_clock::now();
+  service.begin();
+  EXPECT_TRUE(last.isServed());
+  // 1000 more than the burst, at 4,000 a second.
+  EXPECT_GE(std::chrono::steady_clock::now() - began, 249ms);
+}
+
+TEST(ConnectionLimits, AClientThatReadsLateIsHeldBackAndGetsEveryReplyInOrder) {
   constexpr std::size_t kCalls = 300;
   Configuration::Limits limits;
   limits.replyBytes = 64 * 1024;
@@ -141,37 +97,38 @@ TEST(ConnectionLimits, AClientThatReadsLateIsHeldBackAndGetsEveryReply) {
   std::string bytes;
   for (std::size_t i = 0; i < kCalls; ++i) {
     bytes += CallBytes(static_cast<std::uint32_t>(i), "make:size:reply:", {i, 16 * 1024});
+    bytes += CallBytes(std::nullopt, "make:size:reply:", {i, 1});  // answered with nothing
   }
   ASSERT_TRUE(client.send(bytes));
   Client bystander = service.connect();
   ASSERT_TRUE(bystander.isServed());
-  // What the kernel takes and `replyBytes` hold is far from all.
+  // The kernel's buffer and `replyBytes` hold far fewer replies.
   ASSERT_TRUE(bystander.isServed());
-  EXPECT_LT(service.ledger->numbers().size(), kCalls / 2);
+  EXPECT_LT(service.journal.calls().size(), kCalls);
   for (std::size_t i = 0; i < kCalls; ++i) {
     ASSERT_EQ(client.response().substr(0, 12 + std::to_string(i).size()),
               "[1," + std::to_string(i) + ",null,\"xx");
   }
-  EXPECT_TRUE(Journal::shared().entries().empty());
+  EXPECT_TRUE(service.journal.waitForCalls(2 * kCalls + 2));
+  EXPECT_TRUE(service.journal.entries().empty());
 }
 
 TEST(ConnectionLimits, RepliesThatComeLaterCountToo) {
   Configuration::Limits limits;
   limits.replyBytes = 1024;
   limits.stall = 1ms;
-  limits.queuedCalls = limits.firstTurn = 10'000;
   Service service(limits);
   Client bystander = service.connect();
   Client client = service.connect();
   constexpr std::size_t kCalls = 2000;  // their replies are more than a socket takes unread
-  for (std::size_t i = 0; i < kCalls; ++i) ASSERT_TRUE(client.call(1, "keep:reply:", {1 << 30}));
-  ASSERT_TRUE(service.ledger->waitForArrivals(kCalls));
-  // One by one, so that writing has come to a halt well before too much is held.
-  while (auto kept = service.ledger->takeKept()) {
+  for (std::size_t i = 0; i < kCalls; ++i) ASSERT_TRUE(client.call(1, "later:reply:", {1 << 30}));
+  ASSERT_TRUE(service.journal.waitForCalls(kCalls));
+  // One by one, so that the socket is full well before `replyBytes` are held.
+  while (auto kept = service.journal.takeKeptCall()) {
     kept->reply(kept->number);
     ASSERT_TRUE(bystander.isServed());
   }
-  EXPECT_TRUE(Journal::shared().waitFor("does not read its replies"));
+  EXPECT_TRUE(service.journal.waitFor("does not read its replies"));
 }
 
 TEST(ConnectionLimits, AMessageThatTheServiceHoldsBackHasNoDeadline) {
@@ -183,12 +140,12 @@ TEST(ConnectionLimits, AMessageThatTheServiceHoldsBackHasNoDeadline) {
   Client other = service.connect();
   const std::string keep = CallBytes(1, "keep:reply:", {1});
   ASSERT_TRUE(client.send(keep + keep + CallBytes(2, "echo:reply:", {2}).substr(0, 5)));
-  ASSERT_TRUE(service.ledger->waitForArrivals(1));
-  // The other's message times out meanwhile.
+  ASSERT_TRUE(service.journal.waitForCalls(1));
+  // Meanwhile the other client's message times out.
   ASSERT_TRUE(other.send(keep.substr(0, 5)));
   EXPECT_EQ(other.response(), "end");
-  EXPECT_TRUE(Journal::shared().waitFor("is disconnected: a message was begun"));
-  service.ledger->takeKept()->reply(1);
+  EXPECT_TRUE(service.journal.waitFor("is disconnected: a message was begun"));
+  service.journal.takeKeptCall()->reply(1);
   EXPECT_EQ(client.response(), "[1,1,null,1]");
 }
 

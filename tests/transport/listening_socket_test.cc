@@ -1,4 +1,4 @@
-// Where clients find the service: its socket file, or the socket it was started with.
+// The socket file that clients connect to, and a socket that was passed in.
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -28,7 +28,7 @@ class ListeningSocketTest : public ::testing::Test {
   const std::filesystem::path path_ = directory_.path() / "socket";
 };
 
-TEST_F(ListeningSocketTest, MakesItsDirectoryAndRemovesItsFile) {
+TEST_F(ListeningSocketTest, MakesItsDirectoryAndRemovesItsOwnFile) {
   const auto path = directory_.path() / "run" / "quarvel" / "reporting.sock";
   const auto modeOf = [](const std::filesystem::path& file) {
     return static_cast<mode_t>(std::filesystem::status(file).permissions());
@@ -42,14 +42,22 @@ TEST_F(ListeningSocketTest, MakesItsDirectoryAndRemovesItsFile) {
     EXPECT_EQ(modeOf(path.parent_path()), 0750U);
   }
   EXPECT_FALSE(std::filesystem::exists(path));
+
+  auto socket = ListeningSocket::listeningAt(path);
+  ASSERT_TRUE(socket);
+  std::filesystem::remove(path);
+  const auto successor = ListeningSocket::listeningAt(path);
+  ASSERT_TRUE(successor);
+  socket.value().removeFile();
+  EXPECT_TRUE(std::filesystem::exists(path)) << "the file of a successor";
 }
 
-TEST_F(ListeningSocketTest, ReplacesOnlyWhatNobodyListensAt) {
+TEST_F(ListeningSocketTest, ReplacesOnlyAStaleFile) {
   const struct {
     const char* name;
     int type;
     int backlog;  // -1: does not listen
-    bool closed;  // and so replaced
+    bool stale;   // closed before, so replaced
   } cases[] = {
       {"dead", SOCK_STREAM, 5, true},
       {"dead before it listened", SOCK_STREAM, -1, true},
@@ -66,9 +74,9 @@ TEST_F(ListeningSocketTest, ReplacesOnlyWhatNobodyListensAt) {
     if (row.backlog >= 0) {
       ASSERT_EQ(::listen(there.get(), row.backlog), 0);
     }
-    if (row.closed) there = UniqueDescriptor();
+    if (row.stale) there = UniqueDescriptor();
     const auto socket = ListeningSocket::listeningAt(path_);
-    EXPECT_EQ(socket.ok(), row.closed);
+    EXPECT_EQ(socket.ok(), row.stale);
     if (!socket) {
       EXPECT_THAT(socket.error().description(), HasSubstr("another service is listening there"));
     }
@@ -76,7 +84,7 @@ TEST_F(ListeningSocketTest, ReplacesOnlyWhatNobodyListensAt) {
   }
 }
 
-TEST_F(ListeningSocketTest, RefusesWhatItCannotListenAtAndLeavesItAlone) {
+TEST_F(ListeningSocketTest, RefusesAPathThatIsNoSocketOrTooLongAndASocketThatDoesNotListen) {
   directory_.write("socket", "precious");
   const auto socket = ListeningSocket::listeningAt(path_);
   ASSERT_FALSE(socket);
@@ -107,16 +115,6 @@ TEST_F(ListeningSocketTest, OfServicesThatStartAtOnceExactlyOneSucceeds) {
     for (std::thread& service : services) service.join();
     ASSERT_EQ(std::ranges::count_if(sockets, [](const auto& each) { return each.has_value(); }), 1);
   }
-}
-
-TEST_F(ListeningSocketTest, LeavesTheFileOfASuccessorAlone) {
-  auto socket = ListeningSocket::listeningAt(path_);
-  ASSERT_TRUE(socket);
-  std::filesystem::remove(path_);
-  const auto successor = ListeningSocket::listeningAt(path_);
-  ASSERT_TRUE(successor);
-  socket.value().removeFile();
-  EXPECT_TRUE(std::filesystem::exists(path_));
 }
 
 }  // namespace

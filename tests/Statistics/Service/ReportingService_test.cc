@@ -1,10 +1,10 @@
 #include <fmt/format.h>
 #include <gmock/gmock.h>
 
-#include "tests/Statistics/Service/RunningService.h"
+#include "tests/Statistics/Service/CoreFixtures.h"
 
-// What the service says on its way, in what order, and what only happens in special places. What
-// becomes of the messages is for the simulation.
+// Log lines and their order, and cases that need a special set-up. The simulation checks the fate
+// of messages.
 
 namespace quarvel {
 namespace {
@@ -20,109 +20,84 @@ const Value kYes(true);
 const std::string kDelegate = "-[ZQReportingServiceDelegate ";
 const std::string kInstance = "-[ZQReportingServerInstance ";
 
-// What one call leaves in the journal. The lines of the operation itself stand there without
-// "log " and without its function's name.
-Lines JournalOf(RunningService& service, Client& client, const std::string& method,
-                const List& arguments) {
-  service.journal.clear();
-  client.call(method, arguments);
-  service.run();
-  Lines lines = service.journal.lines({"log", "trace", "reply", "exit"});
-  const std::string own = " zqrs " + kInstance + method + "]: ";
-  for (std::string& line : lines) {
-    if (const auto at = line.find(own); at != std::string::npos) {
-      line = line.substr(4, at - 4) + ": " + line.substr(at + own.size());
-    } else if (line.starts_with("reply " + method)) {
-      line = "reply" + line.substr(6 + method.size());
-    }
-  }
-  return lines;
-}
-
-TEST(ServerInstance, EveryOperationInOrder) {
-  struct Case {
-    const char* method;
-    List arguments;
-    Lines journal;
-  };
-  const std::string notFound = "log error zqrs " + kDelegate +
-                               "findReportingSessionForID:]: failed to find reporting session 99";
-  const Case kCases[] = {
-      {"createReportingSession:reply:",
-       {8},
-       {"debug: creating session for reporter 8", "trace 0x21042814",
-        "log info zqrr -[ZQReportingSession initWithID:processIdentifiers:]: created reporting "
-        "session for ID: 8",
-        "trace 0x21042828", "default: session created for reporter 8", "reply true"}},
-      {"setServiceType:reportingSession:reply:",
-       {2, 7},
-       {"debug: setting service type 2 for reporter 7",
-        "log info zqrr -[ZQReportingSession setServiceType:]: setting service type telephony",
-        "default: service type 2 set for reporter  7", "reply true"}},
-      {"setServiceType:reportingSession:reply:",
-       {2, 99},
-       {"debug: setting service type 2 for reporter 99", "reply true"}},
-      {"getServiceNameForReporterID:reply:",
-       {7},
-       {"debug: fetching seviceType", "reply 2",
-        "default: returnning service type 2 for reporter  7"}},
-      {"getServiceNameForReporterID:reply:",
-       {99},
-       {"debug: fetching seviceType", notFound, "reply 65535",
-        "default: returnning service type 65535 for reporter  99"}},
-      {"getServiceNameForReporterID:reply:",
-       {0},
-       {"debug: fetching seviceType", "reply 65535", "reply 65535",
-        "default: returnning service type 65535 for reporter  0"}},
-      {"setConfiguration:forReporterID:reply:",
-       {Dictionary{{"a", 1}}, 7},
-       {"debug: setting configuration", "reply true"}},
-      {"setConfiguration:forReporterID:reply:",
-       {Value(), 7},
-       {"debug: setting configuration", "reply true"}},
-      {"startReportingSessionForID:reply:",
-       {99},
-       {"debug: starting session for reporter 99", "trace 0x21042818", notFound}},
-      {"startReportingSessionForID:reply:",
-       {0},
-       {"debug: starting session for reporter 0", "trace 0x21042818", "reply true"}},
-      {"stopReportingSessionForID:reply:",
-       {7},
-       {"debug: stopping session for reporter 7", "trace 0x2104281c",
-        "default: nothing interesting to fetch from the drivers", "default: stopping 7",
-        "reply true"}},
-      {"stopReportingSessionForID:reply:",
-       {0},
-       {"debug: stopping session for reporter 0", "trace 0x2104281c", "reply true"}},
-      {"reporterID:valid:",
-       {7},
-       {"debug: validating reporter 7", "default: validating reporter 7",
-        "reply {\"reporterID\":7,\"serviceType\":2}"}},
-      {"getAllReporters:", {}, {"reply [7,8]"}},
-      {"destroyReportingSession:reply:",
-       {0},
-       {"debug: destroying session for reporter 0", "trace 0x21042820", "reply true"}},
-      {"destroyReportingSession:reply:",
-       {8},
-       {"debug: destroying session for reporter 8", "trace 0x21042820", "trace 0x21042834",
-        "log info zqrr -[ZQReportingSession dealloc]: deallocing this session 8",
-        "default: destroying 8", "reply true"}},
-      {"killService:", {}, {"default: DESTROYING SERVICE", "exit 2"}},
-  };
+TEST(ServerInstance, OperationsLogTraceAndReplyInOrder) {
+  // Each call, then its journal. "+" stands for the operation's own log lines.
+  const std::vector<std::pair<std::string, List>> kCalls = {
+      {"createReportingSession:reply:", {8}},
+      {"setServiceType:reportingSession:reply:", {2, 7}},
+      {"getServiceNameForReporterID:reply:", {7}},
+      {"getServiceNameForReporterID:reply:", {0}},
+      {"setConfiguration:forReporterID:reply:", {Value(), 7}},
+      {"startReportingSessionForID:reply:", {99}},
+      {"stopReportingSessionForID:reply:", {7}},
+      {"reporterID:valid:", {7}},
+      {"destroyReportingSession:reply:", {8}},
+      {"killService:", {}}};
+  const std::string kJournal = R"(
++debug: creating session for reporter 8
+trace 0x21042814
+log info zqrr -[ZQReportingSession initWithID:processIdentifiers:]: created reporting session for ID: 8
+trace 0x21042828
++default: session created for reporter 8
+reply true
++debug: setting service type 2 for reporter 7
+log info zqrr -[ZQReportingSession setServiceType:]: setting service type telephony
++default: service type 2 set for reporter  7
+reply true
++debug: fetching seviceType
+reply 2
++default: returnning service type 2 for reporter  7
++debug: fetching seviceType
+reply 65535
+reply 65535
++default: returnning service type 65535 for reporter  0
++debug: setting configuration
+reply true
++debug: starting session for reporter 99
+trace 0x21042818
+log error zqrs -[ZQReportingServiceDelegate findReportingSessionForID:]: failed to find reporting session 99
++debug: stopping session for reporter 7
+trace 0x2104281c
++default: nothing interesting to fetch from the drivers
++default: stopping 7
+reply true
++debug: validating reporter 7
++default: validating reporter 7
+reply {"reporterID":7,"serviceType":2}
++debug: destroying session for reporter 8
+trace 0x21042820
+trace 0x21042834
+log info zqrr -[ZQReportingSession dealloc]: deallocing this session 8
++default: destroying 8
+reply true
++default: DESTROYING SERVICE
+exit 2)";
   for (const auto seed : Seeds()) {
     RunningService service(seed);
     Client client = service.connect(42);
     client.create(7);
     service.run();
     service.log.verbose = {"zqrs"};
-    for (const Case& each : kCases) {
-      EXPECT_EQ(JournalOf(service, client, each.method, each.arguments), each.journal)
-          << each.method << " " << JsonText(Value(each.arguments));
+    std::string journal;
+    for (const auto& [method, arguments] : kCalls) {
+      service.journal.clear();
+      client.call(method, arguments);
+      service.run();
+      for (std::string line : service.journal.lines({"log", "trace", "reply", "exit"})) {
+        const std::string own = " zqrs " + kInstance + method + "]";
+        if (const auto at = line.find(own); at != std::string::npos) {
+          line.erase(at, own.size()).replace(0, 4, "+");
+        } else if (line.starts_with("reply " + method)) {
+          line.erase(5, method.size() + 1);
+        }
+        journal += '\n' + line;
+      }
     }
+    EXPECT_EQ(journal, kJournal);
   }
 }
 
-SEEDED_TEST(ServerInstance, EntryLinesAreWrittenBeforeTheServerQueueGetsToTheCall, RunningService) {
+SEEDED_TEST(ServerInstance, EntryLinesDoNotWaitForTheServerQueue, RunningService) {
   Client client = connect(42);
   log.verbose = {"zqrs"};
   bool entered = false;
@@ -135,7 +110,7 @@ SEEDED_TEST(ServerInstance, EntryLinesAreWrittenBeforeTheServerQueueGetsToTheCal
   EXPECT_TRUE(entered);
 }
 
-TEST(ServerInstance, AStopReportsWhatTheDriversCountedSinceTheStart) {
+TEST(Drivers, AStopReportsTheRiseOfTheCountersSinceTheStart) {
   const std::optional<std::string> none;
   for (const auto seed : Seeds()) {
     RunningService service(seed, [&](Simulation& simulation) {
@@ -149,11 +124,8 @@ TEST(ServerInstance, AStopReportsWhatTheDriversCountedSinceTheStart) {
     client.createStarted(7);
     service.run();
     auto& channels = service.tallix.channels;
-    channels[0].value = 11;
-    channels[1].value = 9;
-    channels[2].value = 17;
-    channels[3].value = 13;
-    channels[4].value = 99;
+    const std::int64_t values[] = {11, 9, 17, 13, 99};
+    for (std::size_t i = 0; i < channels.size(); ++i) channels[i].value = values[i];
     client.stop(7);
     service.run();
     const auto& messages = service.agent.sessions.at(0).messages;
@@ -166,7 +138,7 @@ TEST(ServerInstance, AStopReportsWhatTheDriversCountedSinceTheStart) {
                 Contains("default zqrs " + kInstance +
                          "stopReportingSessionForID:reply:]: fetching driver logs "
                          "{\"VorrenMXDrv_a\":1,\"MCA_c\":7,\"Haptics_Stats_\":3}"));
-    // The snapshot went with the first stop; without one the counters themselves are reported.
+    // The first stop dropped the snapshot; without one the counters themselves are reported.
     client.stop(7);
     service.run();
     ASSERT_EQ(service.agent.singleMessages.size(), 1U);
@@ -176,14 +148,42 @@ TEST(ServerInstance, AStopReportsWhatTheDriversCountedSinceTheStart) {
   }
 }
 
-// The journal is of the `ServerQueue` alone, which no other queue's work interleaves with while the
-// sessions are started.
-SEEDED_TEST(Routing, TheSinksComeBeforeANamedSessionAndAfterOneThatABroadcastReaches,
-            RunningService) {
+TEST(Drivers, FailuresAreLoggedAndLeaveCountersOut) {
+  const std::optional<std::string> none;
+  Simulation simulation(1);
+  simulation.tallix.channels = {{"Speaker", none, "b", 10}, {"Haptics", "Stats", "d", 0, false}};
+  simulation.tallix.channelsError = Error{"tallix", 5, {}};
+  const ZQReportingDriverUtility drivers;
+  simulation.tallix.samplesError = Error{"tallix", 3, {}};
+  const DriverSnapShot snapShot = drivers.getSnapShot();
+  EXPECT_THAT(snapShot, IsEmpty());
+  EXPECT_EQ(drivers.getDriverStatisticsRelativeToSnapShot(snapShot), std::nullopt);
+  simulation.tallix.samplesError.reset();
+  EXPECT_EQ(drivers.getDriverStatisticsRelativeToSnapShot(snapShot),
+            (Dictionary{{"Speaker_b", 10}}));
+  Lines lines;
+  for (const LogLine& line : simulation.log.lines) lines.push_back(line.message);
+  EXPECT_THAT(lines,
+              ElementsAre("creating tallixing driver utility",
+                          "error 5 getting channels for driver VorrenMXDrv-(null)",
+                          "error 5 getting channels for driver Speaker-(null)",
+                          "subscribed to group group Speaker-(null)",
+                          "error 5 getting channels for driver (null)-MCA",
+                          "error 5 getting channels for driver Haptics-Stats",
+                          "couldn't find any channels for driver group Haptics-Stats",
+                          "subscribed to group group Haptics-Stats",
+                          "sampling driver Speaker-(null)", "TallixCreateSamples error 3",
+                          "getting latest samples", "done getting latest samples",
+                          "TallixCreateSamples error 3", "getting latest samples",
+                          "done getting latest samples", "TallixCreateSamplesDelta error 6"));
+}
+
+// Only the `ServerQueue` writes these journal lines while the sessions are started.
+SEEDED_TEST(Routing, SinksPrecedeANamedSessionAndFollowABroadcastOne, RunningService) {
   const auto routed = [this] { return journal.lines({"vistrel", "ohmrik", "trace"}); };
   const std::string routing = "trace 0x21042824";
   const std::string event = "vistrel tarnwick.quarvel.Playback.Start";
-  const std::string power = "ohmrik Fennor_Haptics";
+  const std::string power = "ohmrik 28 Fennor_Haptics";
   const std::string sent = "trace 0x21042838";
   const Dictionary payload = {{"EngineOnTime", 3}, {"zqreporting_timestamp", 9.5}};
   Client first = connect(41);
@@ -211,7 +211,20 @@ SEEDED_TEST(Routing, TheSinksComeBeforeANamedSessionAndAfterOneThatABroadcastRea
                                  "\"<ZQReportingSession 6>\"]"));
 }
 
-SEEDED_TEST(Routing, AnAgentWithoutRoomHoldsNobodyUp, RunningService) {
+TEST(Routing, OnlyAMessageToAtMostEightSessionsIsABriefBlock) {
+  RunningService service(1);
+  Client client = service.connect(41);
+  const std::pair<std::optional<List>, std::size_t> kCases[] = {
+      {List(8, Value(1)), 1}, {List(9, Value(1)), 0}, {std::nullopt, 0}};
+  for (const auto& [reporterIDs, briefBlocks] : kCases) {
+    service.briefBlocks = 0;
+    client.send({}, 3, 1, reporterIDs);
+    service.run();
+    EXPECT_EQ(service.briefBlocks, briefBlocks);
+  }
+}
+
+SEEDED_TEST(Routing, AFullAgentDelaysNoReply, RunningService) {
   Client client = connect(41);
   client.createStarted(7);
   run();
@@ -226,14 +239,7 @@ SEEDED_TEST(Routing, AnAgentWithoutRoomHoldsNobodyUp, RunningService) {
   run();
 }
 
-SEEDED_TEST(Preferences, AreNotReadForAForeignNotification, RunningService) {
-  log.lines.clear();
-  notifications.deliverForeign("tarnwick.quarvel.reporting");
-  run();
-  EXPECT_THAT(log.texts(), IsEmpty());
-}
-
-TEST(Preferences, TheServiceRunsOnWithoutNotifications) {
+TEST(Preferences, AForeignNotificationAndAFailedRegistrationChangeNothing) {
   RunningService service(
       1, [](Simulation& simulation) { simulation.notifications.registrationStatus = 5; });
   EXPECT_EQ(service.log.texts("default").at(0),
@@ -241,9 +247,15 @@ TEST(Preferences, TheServiceRunsOnWithoutNotifications) {
   const auto created = service.connect(42).create(7);
   service.run();
   EXPECT_THAT(created->results, ElementsAre(kYes));
+
+  RunningService listening(1);
+  listening.log.lines.clear();
+  listening.notifications.deliverForeign("tarnwick.quarvel.reporting");
+  listening.run();
+  EXPECT_THAT(listening.log.texts(), IsEmpty());
 }
 
-TEST(ClientUptime, IsReportedWhenAClientEndsWhichItDoesOnce) {
+TEST(ClientUptime, IsReportedOnceWhenAClientEnds) {
   struct Case {
     std::int32_t pid;
     bool interrupted;
@@ -255,7 +267,7 @@ TEST(ClientUptime, IsReportedWhenAClientEndsWhichItDoesOnce) {
       {42,
        true,
        0s,
-       12.75,  // the fraction is cut in the line only
+       12.75,  // only the line truncates the fraction
        {"InterruptionHandler: connection exited",
         "InvalidationHandler: connection exited process=player uptime_sec=12"}},
       {42,
@@ -296,15 +308,15 @@ TEST(ClientUptime, IsReportedWhenAClientEndsWhichItDoesOnce) {
       const auto& events = service.vistrel.events;
       ASSERT_EQ(events.size(), each.seconds ? 1U : 0U);
       if (each.seconds) {
-        EXPECT_EQ(events[0].name, "tarnwick.quarvel.zqreportingclientuptime");
-        EXPECT_EQ(events[0].payload.root().toDictionary(),
+        EXPECT_EQ(events[0].first, "tarnwick.quarvel.zqreportingclientuptime");
+        EXPECT_EQ(events[0].second.root().toDictionary(),
                   (Dictionary{{"processName", "player"}, {"seconds", *each.seconds}}));
       }
     }
   }
 }
 
-SEEDED_TEST(ClientUptime, OfAClientThatLeftBeforeItWasRegistered, RunningService) {
+SEEDED_TEST(ClientUptime, IsUnknownForAClientThatEndsBeforeItsRegistration, RunningService) {
   processes[42] = "player";
   ServerQueue().async([&] { scheduler.sleep(1s); });
   Client client(listener.connect(42));

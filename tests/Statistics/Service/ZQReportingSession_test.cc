@@ -2,7 +2,7 @@
 
 #include <gmock/gmock.h>
 
-#include "tests/Statistics/Service/SessionOwner.h"
+#include "tests/Statistics/Service/CoreFixtures.h"
 
 namespace quarvel {
 namespace {
@@ -21,13 +21,13 @@ const char* const kSendSingle =
     "+[ZQReportingSession sendSingleMessage:category:type:serviceType:userInfo:reply:]";
 const char* const kWait = "ZQReportingUtilityWait";
 
-SEEDED_TEST(Session, StartSetsUpAnAgentSessionWithWhatIsConfiguredByThen, SessionOwner) {
+SEEDED_TEST(Session, TheAgentSessionHasTheUserInformationAtItsSetUp, SessionOwner) {
   setServiceType(kServiceTypeTelephony);
   session->setConfiguration(Dictionary{{"app", "Phone"}, {"version", 1}});
   session->setConfiguration(Dictionary{{"version", 2}});
   session->updateDefaults(std::nullopt);
   start();
-  // The user information is shared with the set-up, which has not begun; the service name is not.
+  // The set-up, which has not begun, shares the user information but not the service name.
   session->updateDefaults(Dictionary{{"ClientName", "renamed"}});
   holdServerQueue();
   session->setServiceType(kServiceTypeAlarms);
@@ -103,7 +103,7 @@ TEST(Session, StartsAndStopsRepeat) {
     owner.holdServerQueue();
     EXPECT_EQ(owner.session->messageIdForCategory(kCategorySummary, kTypeSummary),
               "Undefined_Unknown_3")
-        << "the summaries have counted";
+        << "each summary counts as a message";
 
     Lines expected;
     for (const Lines& lines :
@@ -115,7 +115,7 @@ TEST(Session, StartsAndStopsRepeat) {
   }
 }
 
-SEEDED_TEST(Session, LogsAFailedFlushAndKeepsQuietAboutAFailedSend, SessionOwner) {
+SEEDED_TEST(Session, AFailedFlushIsLoggedAndAFailedSendIsNot, SessionOwner) {
   agent.sendError = Error::because("agent", 3, "full");
   agent.flushError = Error::because("agent", 4, "gone");
   log.verbose = {"zqrr"};
@@ -160,7 +160,7 @@ SEEDED_TEST(Delivery, VerboseLinesFollowAMessage, SessionOwner) {
           Line("debug", kSendSingle, "message {\"a_key\":1} : category 268435459 : type 1")));
 }
 
-SEEDED_TEST(SingleMessage, OnlyAlarmsAreSpreadOverAMinute, Simulation) {
+SEEDED_TEST(SingleMessage, OnlyAlarmsAreDelayedUpTo59Seconds, Simulation) {
   random.largest = true;
   for (const std::uint16_t serviceType : {kServiceTypeStandalone, kServiceTypeAlarms}) {
     ZQReportingSession::sendSingleMessage(Payload(), 1, 1, serviceType, std::nullopt, nullptr);
@@ -171,7 +171,7 @@ SEEDED_TEST(SingleMessage, OnlyAlarmsAreSpreadOverAMinute, Simulation) {
   EXPECT_EQ(agent.singleMessages[1].message.at, 59s);
 }
 
-SEEDED_TEST(SingleMessage, IsAnsweredWithTheAgentsError, Simulation) {
+SEEDED_TEST(SingleMessage, TheReplyHasTheAgentsError, Simulation) {
   agent.singleMessageError = Error::because("agent", 3, "full");
   std::optional<Error> replied;
   ZQReportingSession::sendSingleMessage(
@@ -183,7 +183,7 @@ SEEDED_TEST(SingleMessage, IsAnsweredWithTheAgentsError, Simulation) {
                                             "sendOneMessageWithSessionInfo agent 3: full")));
 }
 
-TEST(Summary, JoinsEveryKeysTextsAndLeavesTheUserInformationInFront) {
+TEST(Summary, JoinsTheTextsOfEachKeyAndInsertsTheUserInformation) {
   SessionOwner owner(1, kServiceTypeLongFormAudio);
   owner.session->setConfiguration(Dictionary{{"app", "Music"}, {"n", 1.5}});
   owner.holdServerQueue();

@@ -1,11 +1,9 @@
-// A collector that takes OTLP/HTTP logs in JSON, strictly: what the published definitions do not
-// know, or would turn into something else, is an error. Prints a JSON line for each request: what
-// was decoded and how it was answered. Listens on a free port of the loopback, which it prints
-// first.
+// A strict collector for OTLP/HTTP logs in JSON: a field that the published definitions do not know or
+// would change is an error. Listens on a free port of the loopback and prints the port, then a JSON
+// line with the decoded request and the answer for each request.
 //
-// POST /answers takes a JSON list that is answered with, one each, before all is well again:
-// {"status", "headers", "body"}, "reset" or "hang". POST /poison takes a text; a request that has it
-// is answered with 400.
+// POST /answers takes a JSON list with the answers of the next requests: {"status", "headers", "body"},
+// "reset" or "hang". POST /poison takes a text; each request that holds the text is answered with 400.
 'use strict';
 const http = require('http');
 const zlib = require('zlib');
@@ -15,17 +13,17 @@ const Request = root.opentelemetry.proto.collector.logs.v1.ExportLogsServiceRequ
 let answers = [];
 let poison = null;
 
-// What was sent must be found again in what was decoded: a misspelt or misplaced field is dropped in
-// silence otherwise.
+// Every sent field must be in the decoded request: the decoder drops a misspelt or misplaced field
+// silently.
 function compare(sent, decoded, place) {
   if (sent === null || typeof sent !== 'object') {
-    // Doubles that JSON has no number for are texts in the protocol's JSON.
+    // NaN and the infinities are texts in the protocol's JSON.
     if (String(sent) !== String(decoded)) throw Error(`${place}: sent ${sent}, decoded ${decoded}`);
     return;
   }
   for (const key of Object.keys(sent)) {
     const known = decoded !== null && decoded !== undefined && key in decoded;
-    if (!known && Array.isArray(sent[key]) && sent[key].length === 0) continue; // as an absent one
+    if (!known && Array.isArray(sent[key]) && sent[key].length === 0) continue; // equals an absent list
     if (!known) throw Error(`unknown ${place}.${key}`);
     compare(sent[key], decoded[key], `${place}.${key}`);
   }

@@ -1,15 +1,19 @@
 #pragma once
 
 #include <functional>
+#include <memory>
 #include <optional>
+#include <string>
 #include <utility>
+#include <vector>
 
 #include "Statistics/Service/ZQReportingServiceDelegate.h"
+#include "Statistics/Service/ZQReportingSession.h"
 #include "tests/simulated/Simulation.h"
 
 namespace quarvel {
 
-/// A client of the service, with the protocol's operations by name.
+/// A client of the service, with an operation of the protocol each.
 class Client : public SimulatedClient {
  public:
   explicit Client(SimulatedClient client) : SimulatedClient(std::move(client)) {}
@@ -33,7 +37,6 @@ class Client : public SimulatedClient {
   Call destroy(ReporterID id) { return call("destroyReportingSession:reply:", {id}); }
   Call valid(ReporterID id) { return call("reporterID:valid:", {id}); }
   Call reporters() { return call("getAllReporters:", {}); }
-  Call kill() { return call("killService:", {}); }
 
   void createStarted(ReporterID id) {
     create(id);
@@ -43,7 +46,7 @@ class Client : public SimulatedClient {
 
 /// The whole service on the simulated platform, as its process entry sets it up.
 struct RunningService : Simulation {
-  /// `prepare` arranges what the service finds when it begins.
+  /// `prepare` arranges the platform before the service starts.
   explicit RunningService(
       std::uint64_t seed, const std::function<void(Simulation&)>& prepare = [](Simulation&) {})
       : Simulation(seed) {
@@ -52,19 +55,48 @@ struct RunningService : Simulation {
     ProcessServiceListener().resume();
   }
 
-  /// Connects a client and runs until it is registered, so that clients are in the order of their
-  /// connecting.
+  /// Connects a client and runs until it is registered, so that clients are registered in this
+  /// order.
   [[nodiscard]] Client connect(std::int32_t pid) {
     Client client(listener.connect(pid));
     run();
     return client;
   }
-  /// Gives the service's preferences domain these entries, and says so.
-  void changePreferences(Dictionary entries) {
-    preferences["tarnwick.quarvel"] = std::move(entries);
-    notifications.post("tarnwick.quarvel.reporting");
-    run();
+};
+
+/// A session that the test owns. The test runs only while the simulation does not, in place of the
+/// `ServerQueue`.
+struct SessionOwner : Simulation {
+  explicit SessionOwner(std::uint64_t seed, std::uint16_t serviceType = 0) : Simulation(seed) {
+    setServiceType(serviceType);
   }
+  static void holdServerQueue() QUARVEL_ASSERT_CAPABILITY(serverQueueRole) {}
+
+  void setServiceType(std::uint16_t serviceType) {
+    holdServerQueue();
+    session->setServiceType(serviceType);
+    log.lines.clear();
+    journal.clear();
+  }
+  void start() {
+    holdServerQueue();
+    session->start();
+  }
+  void stop() {
+    holdServerQueue();
+    session->stop();
+  }
+  void send(const Dictionary& payload = {{"a", 1}}, std::uint32_t category = 3) {
+    holdServerQueue();
+    session->sendMessage(Payload(payload), category, 1, nullptr);
+  }
+  [[nodiscard]] std::vector<std::string> errors() const { return log.texts("error"); }
+  /// Messages that reached the agent inside its one session.
+  [[nodiscard]] const std::vector<SimulatedAgent::Message>& delivered() const {
+    return agent.sessions.at(0).messages;
+  }
+
+  std::shared_ptr<ZQReportingSession> session = ZQReportingSession::initWithID(7, {42});
 };
 
 }  // namespace quarvel

@@ -1,0 +1,15 @@
+#include "platform/Clock.h"
+
+#include "tests/simulated/Simulation.h"
+
+namespace quarvel {
+
+Date CurrentDate() {
+  return Simulation::current().scheduler.wallClock();
+}
+
+std::string LocalDateText(Date date, const char*) {
+  return DateText(date);
+}
+
+}  // namespace quarvel

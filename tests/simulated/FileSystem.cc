@@ -1,0 +1,22 @@
+#include "platform/FileSystem.h"
+
+#include "tests/simulated/Simulation.h"
+
+namespace quarvel {
+
+std::string DiagnosticsPath(std::string_view path) {
+  return std::string(path);
+}
+
+Outcome CreateDirectory(std::string_view, std::uint32_t) {
+  const SimulatedFiles& files = Simulation::current().files;
+  return files.directoryError ? Outcome(*files.directoryError) : Success();
+}
+
+Outcome WriteFileAtomically(std::string_view path, std::string_view content) {
+  SimulatedFiles& files = Simulation::current().files;
+  files.writes.emplace_back(path, content);
+  return files.writeError ? Outcome(*files.writeError) : Success();
+}
+
+}  // namespace quarvel
