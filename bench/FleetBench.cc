@@ -60,7 +60,7 @@ class Device {
     }
   }
 
-  void start(const Configuration::Nats& nats) {
+  void start(const NatsSettings& nats) {
     std::vector<Exporters::Backend> backends;
     backends.push_back(
         {{"nats", 1'000'000}, std::make_unique<NatsEngine>(nats, ExportDevice{name_, "bench"})});
@@ -111,7 +111,7 @@ int Run(int argumentCount, char** arguments) {
   }
   const int count = std::atoi(arguments[2]);
   const int rows = std::atoi(arguments[3]);
-  Configuration::Nats nats;
+  NatsSettings nats;
   nats.urls.assign(arguments + 4, arguments + argumentCount);
   nats.acknowledge = std::chrono::seconds(60);
   const long residentBefore = ResidentKibibytes();

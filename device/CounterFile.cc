@@ -5,17 +5,16 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <charconv>
 #include <utility>
 
-#include "device/Trimmed.h"
-
 namespace quarvel {
 
-// The C library's matcher and not std::regex, which recurses once a character and so overflows the
-// stack on a report of this size.
+// The C library's matcher: std::regex recurses once for each character and overflows the stack on a
+// report of this size.
 struct CounterPattern::Compiled {
   regex_t expression{};
   bool valid = false;
@@ -60,8 +59,14 @@ std::string_view CounterPattern::find(std::string_view content) const {
                         static_cast<std::size_t>(matches[1].rm_eo - matches[1].rm_so));
 }
 
+std::string_view TrimBlanks(std::string_view text) {
+  static constexpr std::string_view kBlanks = " \t\r\n";
+  text.remove_prefix(std::min(text.find_first_not_of(kBlanks), text.size()));
+  return text.substr(0, text.find_last_not_of(kBlanks) + 1);
+}
+
 std::optional<TallixErrorCode> CounterFromText(std::string_view text, std::int64_t& value) {
-  text = Trimmed(text);
+  text = TrimBlanks(text);
   const auto [end, status] = std::from_chars(text.data(), text.data() + text.size(), value);
   if (end == text.data() || end != text.data() + text.size()) return TallixErrorCode::noInteger;
   if (status == std::errc::result_out_of_range) return TallixErrorCode::integerOutOfRange;
@@ -86,7 +91,7 @@ void CounterFile::close() {
 
 int CounterFile::open() {
   close();
-  // Without O_NONBLOCK a named pipe in a counter's place would hold up the service.
+  // Without O_NONBLOCK a named pipe in place of a counter would block the service.
   descriptor_ = ::open(path_.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK);
   return descriptor_ < 0 ? errno : 0;
 }
@@ -106,7 +111,7 @@ int CounterFile::readOnce(std::string& buffer, std::string_view& content) const 
   const std::size_t limit = extent_ == Extent::lines ? kReportBytes : kIntegerBytes;
   if (buffer.size() < limit) buffer.resize(limit);
   std::size_t length = 0;
-  // The kernel's reports come a page at a time, however large the buffer is.
+  // The kernel returns its reports one page at a time, for a buffer of any size.
   while (length < limit) {
     const ssize_t count =
         pread(descriptor_, buffer.data() + length, limit - length, static_cast<off_t>(length));

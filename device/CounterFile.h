@@ -13,14 +13,15 @@
 namespace quarvel {
 
 /// A POSIX extended regular expression whose first group finds an integer in a text. "^" and "$"
-/// match at every line, "." matches no line's end. Immutable; from any thread.
+/// match at every line, "." matches no line end. Immutable; any thread. Copies share the compiled
+/// expression.
 class CounterPattern {
  public:
-  /// None, with a `fault` that says what is wrong, when `text` is no such expression.
+  /// Returns none, with the reason in `fault`, when `text` is no such expression.
   [[nodiscard]] static std::optional<CounterPattern> compile(const std::string& text,
                                                              std::string& fault);
 
-  /// What the group matched; empty when nothing did. Points into `content`.
+  /// The text that the group matched, or an empty one. Points into `content`.
   [[nodiscard]] std::string_view find(std::string_view content) const;
 
  private:
@@ -30,17 +31,21 @@ class CounterPattern {
   std::shared_ptr<const Compiled> compiled_;
 };
 
+/// `text` without the blanks and line ends around it.
+[[nodiscard]] std::string_view TrimBlanks(std::string_view text);
+
 /// Reads decimal text, blanks around it allowed, as a signed 64-bit integer. Returns noInteger or
 /// integerOutOfRange when that is not possible.
 [[nodiscard]] std::optional<TallixErrorCode> CounterFromText(std::string_view text,
                                                              std::int64_t& value);
 
-/// A file that counters are read from, kept open. It follows its path: when another file took its
-/// place, or its device went and came back, it is opened again. One thread at a time.
+/// An open file with counters. Follows its path: it is opened again when another file took its
+/// place, or when its device went and came back. Owned by a `TallixSubscription`, which lets one
+/// thread in at a time.
 class CounterFile {
  public:
   enum class Extent {
-    oneInteger,  // a few bytes, read at once
+    oneInteger,  // up to kIntegerBytes, by one read
     lines,       // a report of many lines, up to kReportBytes
   };
   static constexpr std::size_t kIntegerBytes = 64;
@@ -52,14 +57,16 @@ class CounterFile {
   ~CounterFile();
 
   [[nodiscard]] const std::filesystem::path& path() const { return path_; }
-  /// Returns 0 or the system's error number.
+  /// Opens the file; never waits, not even for a named pipe. Returns 0 or the system's error
+  /// number.
   [[nodiscard]] int open();
-  /// What the file holds now, placed in `buffer`; a report that is longer than the limit is cut
-  /// off. Returns 0 or the system's error number.
+  /// Reads the present content into `buffer`; `content` points into it. A report that is longer
+  /// than the limit is cut off. Returns 0 or the system's error number.
   [[nodiscard]] int read(std::string& buffer, std::string_view& content);
 
  private:
   void close();
+  /// Whether the open file has no name any more.
   [[nodiscard]] bool wasReplaced() const;
   [[nodiscard]] int readOnce(std::string& buffer, std::string_view& content) const;
 

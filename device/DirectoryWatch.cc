@@ -17,7 +17,7 @@ namespace quarvel {
 
 namespace {
 
-// A shell's `touch` closes a file it opened for writing; touching by path alone changes attributes.
+// A shell's `touch` closes a file that was open for writing; utime(2) by path changes attributes.
 constexpr std::uint32_t kChanges = IN_CLOSE_WRITE | IN_MOVED_TO | IN_ATTRIB | IN_ONLYDIR;
 
 }  // namespace
@@ -30,7 +30,7 @@ void DirectoryWatch::end() {
   const MutexLock lock(mutex_);
   if (descriptor_ < 0) return;
   ending_ = true;
-  // Giving up a watch is news too: it wakes the thread.
+  // Removing a watch is an event too, which wakes the thread.
   inotify_rm_watch(descriptor_, inotify_add_watch(descriptor_, "/", IN_DELETE_SELF));
   while (running_) ended_.wait(mutex_);
   ::close(std::exchange(descriptor_, -1));
@@ -68,7 +68,7 @@ void DirectoryWatch::report(int identifier, std::string_view file) {
   for (const auto& handler : handlers) (*handler)(file);
 }
 
-bool DirectoryWatch::forget(int identifier) {
+bool DirectoryWatch::dropDirectory(int identifier) {
   ZQ_FUNCTION("DirectoryWatch");
   const MutexLock lock(mutex_);
   if (ending_) return true;
@@ -105,10 +105,10 @@ void DirectoryWatch::reportUntilEnd(int descriptor) {
       const char* name = events.data() + at + sizeof event;
       at += sizeof event + event.len;
       if ((event.mask & IN_IGNORED) != 0) {
-        if (forget(event.wd)) return;
+        if (dropDirectory(event.wd)) return;
       } else if ((event.mask & IN_Q_OVERFLOW) != 0) {
         report(event.wd, {});
-      } else if (event.len > 0) {  // without a name it is about the directory itself
+      } else if (event.len > 0) {  // without a name the event concerns the directory itself
         report(event.wd, name);
       }
     }

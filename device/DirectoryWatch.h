@@ -10,13 +10,13 @@
 
 namespace quarvel {
 
-/// Tells when files directly in certain directories are written, touched or replaced. One thread
-/// for all directories, blocked until the kernel has news, started with the first of them. From any
-/// thread.
+/// Reports files that are written, touched or replaced directly in certain directories. One thread
+/// for all directories; it starts with the first one and blocks until the kernel has news. Handlers
+/// run on that thread. Outlives its users' registrations; operations from any thread.
 class DirectoryWatch {
  public:
-  /// Is given the file's name without its directory, or an empty name when so much has happened
-  /// that news was lost and any file may have changed. One change may be reported more than once.
+  /// Receives the file's name without its directory. An empty name: the kernel dropped events, and
+  /// any file may have changed. One change may be reported more than once.
   using Handler = std::function<void(std::string_view file)>;
 
   DirectoryWatch() = default;
@@ -25,8 +25,8 @@ class DirectoryWatch {
   /// As `end`.
   ~DirectoryWatch();
 
-  /// Makes `directory` if it is missing and calls `handler` on the watch's thread from now on. It
-  /// may take the locks of its owner but not wait. Returns 0 or the system's error number.
+  /// Makes `directory` if it is missing and calls `handler` for its files from now on. The handler
+  /// may take its owner's locks but must not wait. Returns 0 or the system's error number.
   [[nodiscard]] int add(const std::filesystem::path& directory, Handler handler);
 
   /// Ends the thread: when this returns, no handler is running or will be called. Not from a
@@ -44,8 +44,8 @@ class DirectoryWatch {
   void run(int descriptor);
   void reportUntilEnd(int descriptor);
   void report(int identifier, std::string_view file);
-  /// A directory was removed. Returns whether the watch itself is to end.
-  [[nodiscard]] bool forget(int identifier);
+  /// Drops a directory that was removed. Returns whether the thread is to end.
+  [[nodiscard]] bool dropDirectory(int identifier);
 
   Mutex mutex_;
   int descriptor_ QUARVEL_GUARDED_BY(mutex_) = -1;

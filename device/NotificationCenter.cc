@@ -9,7 +9,7 @@ int NotificationCenter::add(std::string_view name, NotificationToken& token, Wor
   token = 0;
   const MutexLock lock(mutex_);
   if (!watching_) {
-    const int status = watch_.add(directory_, [this](std::string_view file) { posted(file); });
+    const int status = watch_.add(directory_, [this](std::string_view file) { post(file); });
     if (status != 0) return status;
     watching_ = true;
   }
@@ -18,15 +18,15 @@ int NotificationCenter::add(std::string_view name, NotificationToken& token, Wor
   return 0;
 }
 
-void NotificationCenter::posted(std::string_view name) {
-  std::vector<std::shared_ptr<Registration>> called;
+void NotificationCenter::post(std::string_view name) {
+  std::vector<std::shared_ptr<Registration>> found;
   {
     const MutexLock lock(mutex_);
     for (const auto& registration : registrations_) {
-      if (name.empty() || registration->name == name) called.push_back(registration);
+      if (name.empty() || registration->name == name) found.push_back(registration);
     }
   }
-  for (const auto& registration : called) {
+  for (const auto& registration : found) {
     if (registration->waiting.exchange(true)) continue;
     registration->queue.async([registration] {
       registration->waiting = false;

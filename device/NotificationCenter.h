@@ -15,10 +15,11 @@
 namespace quarvel {
 
 /// Named notifications as files: touching, writing or replacing the file N in the directory posts
-/// N. From any thread. Must not be destroyed before `watch`.
+/// N. One for each process, as long as the process; `watch` must be destroyed first. Any thread;
+/// handlers run on the queue of their registration.
 class NotificationCenter {
  public:
-  /// Nothing is touched or started before the first registration.
+  /// Makes no directory and no watch before the first registration.
   NotificationCenter(std::filesystem::path directory, DirectoryWatch& watch)
       : directory_(std::move(directory)), watch_(watch) {}
 
@@ -27,6 +28,7 @@ class NotificationCenter {
                         NotificationHandler handler);
 
  private:
+  /// One handler. Shared with its queued calls; lives as long as the process.
   struct Registration {
     Registration(NotificationToken ownToken, std::string_view ownName, WorkQueue& ownQueue,
                  NotificationHandler ownHandler)
@@ -36,10 +38,11 @@ class NotificationCenter {
     const std::string name;
     WorkQueue& queue;
     const NotificationHandler handler;
-    std::atomic<bool> waiting = false;  // on the queue and not yet begun
+    std::atomic<bool> waiting = false;  // a call is queued and has not begun
   };
 
-  void posted(std::string_view name);
+  /// Queues a call for each registration of `name`; an empty name stands for all.
+  void post(std::string_view name);
 
   const std::filesystem::path directory_;
   DirectoryWatch& watch_;

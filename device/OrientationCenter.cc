@@ -9,7 +9,7 @@ void OrientationCenter::add(OrientationKind kind, std::string_view callbackID,
   const MutexLock lock(mutex_);
   Registered& all = registered(kind);
   if (all.handlers.empty() && source_) {
-    if (const auto orientation = source_->begin(kind)) all.last = *orientation;
+    if (const auto orientation = source_->start(kind)) all.last = *orientation;
   }
   all.handlers.insert_or_assign(std::string(callbackID),
                                 std::make_shared<const OrientationHandler>(std::move(handler)));
@@ -22,18 +22,18 @@ void OrientationCenter::remove(OrientationKind kind, std::string_view callbackID
   if (found == all.handlers.end()) return;
   const SharedHandler removed = found->second;
   all.handlers.erase(found);
-  if (all.handlers.empty() && source_) source_->end(kind);
+  if (all.handlers.empty() && source_) source_->stop(kind);
   while (all.running == removed && all.runningOn != std::this_thread::get_id()) {
     finished_.wait(mutex_);
   }
 }
 
-void OrientationCenter::known(OrientationKind kind, Orientation orientation) {
+void OrientationCenter::setInitial(OrientationKind kind, Orientation orientation) {
   const MutexLock lock(mutex_);
   registered(kind).last = orientation;
 }
 
-void OrientationCenter::changed(OrientationKind kind, Orientation orientation) {
+void OrientationCenter::reportChange(OrientationKind kind, Orientation orientation) {
   std::map<std::string, SharedHandler, std::less<>> handlers;
   {
     const MutexLock lock(mutex_);

@@ -15,25 +15,27 @@
 
 namespace quarvel {
 
+/// How the device is held, or how its user interface is turned.
 enum class OrientationKind : std::size_t { device, ui };
 inline constexpr std::size_t kOrientationKinds = 2;
 
-/// What a center learns orientations from. Reports through `OrientationCenter::known` and
-/// `changed`, for each kind on one thread at a time.
+/// A source of orientations. Owned by its `OrientationCenter`, to which it reports through
+/// `setInitial` and `reportChange`, for each kind on one thread at a time.
 class OrientationSource {
  public:
   virtual ~OrientationSource() = default;
-  /// From now on somebody is interested. Returns the orientation where it is known at once. Called
-  /// with the center's lock held: must return soon and not call the center.
-  virtual std::optional<Orientation> begin(OrientationKind kind) = 0;
-  /// Nobody is interested any more. Under the same rules.
-  virtual void end(OrientationKind kind) = 0;
+  /// Begins to report, for the first handler. Returns the orientation if it is known at once.
+  /// Called with the center's lock held: must return soon and must not call the center.
+  virtual std::optional<Orientation> start(OrientationKind kind) = 0;
+  /// Ends reporting, after the last handler; later reports call no handler. Same rules.
+  virtual void stop(OrientationKind kind) = 0;
 };
 
-/// The registered handlers of a process. From any thread.
+/// The registered handlers and the last orientation of each kind. One for each process, as long as
+/// the process. Any thread; handlers run on the thread of the source.
 class OrientationCenter {
  public:
-  /// Before anything else; without a source no handler is ever called.
+  /// Must be called before any other operation. Without a source no handler is ever called.
   void setSource(std::unique_ptr<OrientationSource> source) { source_ = std::move(source); }
 
   // As the functions of platform/Orientation.h.
@@ -41,17 +43,17 @@ class OrientationCenter {
   void remove(OrientationKind kind, std::string_view callbackID);
 
   // For the source.
-  /// This is how things stand: the starting point for changes.
-  void known(OrientationKind kind, Orientation orientation);
-  /// Calls the handlers, unless the orientation is what it was already.
-  void changed(OrientationKind kind, Orientation orientation);
+  /// Sets the orientation that changes start from; calls no handler.
+  void setInitial(OrientationKind kind, Orientation orientation);
+  /// Calls the handlers if the orientation differs from the last one.
+  void reportChange(OrientationKind kind, Orientation orientation);
 
  private:
   using SharedHandler = std::shared_ptr<const OrientationHandler>;
   struct Registered {
     std::map<std::string, SharedHandler, std::less<>> handlers;
     Orientation last = Orientation::unknown;
-    SharedHandler running;
+    SharedHandler running;  // null between calls
     std::thread::id runningOn;
   };
 
@@ -62,7 +64,8 @@ class OrientationCenter {
   Mutex mutex_;
   ConditionVariable finished_;  // a handler has returned
   std::array<Registered, kOrientationKinds> registered_ QUARVEL_GUARDED_BY(mutex_);
-  std::unique_ptr<OrientationSource> source_;  // constant after setSource; last, so it ends first
+  std::unique_ptr<OrientationSource>
+      source_;  // constant after setSource; declared last, ends first
 };
 
 }  // namespace quarvel

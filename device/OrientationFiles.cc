@@ -6,7 +6,7 @@
 #include <utility>
 
 #include "base/Files.h"
-#include "device/Trimmed.h"
+#include "device/CounterFile.h"
 #include "platform/Log.h"
 
 namespace quarvel {
@@ -23,7 +23,7 @@ std::string_view fileName(OrientationKind kind) {
 }  // namespace
 
 std::optional<Orientation> OrientationFromText(std::string_view text) {
-  text = Trimmed(text);
+  text = TrimBlanks(text);
   for (std::int32_t number = 0; number <= static_cast<std::int32_t>(Orientation::faceDown);
        ++number) {
     const auto orientation = static_cast<Orientation>(number);
@@ -38,10 +38,11 @@ OrientationFiles::OrientationFiles(OrientationCenter& center, std::filesystem::p
                                    DirectoryWatch& watch)
     : center_(center), directory_(std::move(directory)), watch_(watch) {}
 
-std::optional<Orientation> OrientationFiles::begin(OrientationKind kind) {
+std::optional<Orientation> OrientationFiles::start(OrientationKind kind) {
   ZQ_FUNCTION("OrientationFiles");
   if (!watching_) {
-    const int status = watch_.add(directory_, [this](std::string_view file) { written(file); });
+    const int status =
+        watch_.add(directory_, [this](std::string_view file) { reportWritten(file); });
     if (status != 0) {
       ZQ_LOG(nullptr, error, "no orientation, {} cannot be watched: {}", directory_.native(),
              std::generic_category().message(status));
@@ -52,8 +53,8 @@ std::optional<Orientation> OrientationFiles::begin(OrientationKind kind) {
   return read(kind).value_or(Orientation::unknown);
 }
 
-// The watch stays: it costs nothing while nothing is written.
-void OrientationFiles::end(OrientationKind) {}
+// The watch stays: it costs nothing while no file is written.
+void OrientationFiles::stop(OrientationKind) {}
 
 std::optional<Orientation> OrientationFiles::read(OrientationKind kind) const {
   ZQ_FUNCTION("OrientationFiles");
@@ -68,10 +69,10 @@ std::optional<Orientation> OrientationFiles::read(OrientationKind kind) const {
   return orientation;
 }
 
-void OrientationFiles::written(std::string_view file) {
+void OrientationFiles::reportWritten(std::string_view file) {
   for (const OrientationKind kind : {OrientationKind::device, OrientationKind::ui}) {
     if (!file.empty() && file != fileName(kind)) continue;
-    if (const auto orientation = read(kind)) center_.changed(kind, *orientation);
+    if (const auto orientation = read(kind)) center_.reportChange(kind, *orientation);
   }
 }
 

@@ -10,29 +10,33 @@
 
 namespace quarvel {
 
-/// Orientations from the files device-orientation and ui-orientation of a directory. A file holds
-/// an orientation's name or number. A missing file means an unknown orientation at the start and no
-/// change later; a file that holds something else is logged and changes nothing.
-/// `watch` must be destroyed first.
+/// Reads orientations from the files device-orientation and ui-orientation of a directory. A file
+/// holds an orientation's name or number. A missing file means an unknown orientation at the start
+/// and no change later. Any other content is logged and changes nothing.
+///
+/// Owned by the center. Reads on the thread of `watch`, which must be destroyed first, and on the
+/// thread that registers the first handler.
 class OrientationFiles final : public OrientationSource {
  public:
   OrientationFiles(OrientationCenter& center, std::filesystem::path directory,
                    DirectoryWatch& watch);
 
-  std::optional<Orientation> begin(OrientationKind kind) override;
-  void end(OrientationKind kind) override;
+  std::optional<Orientation> start(OrientationKind kind) override;
+  void stop(OrientationKind kind) override;
 
  private:
   [[nodiscard]] std::optional<Orientation> read(OrientationKind kind) const;
-  void written(std::string_view file);
+  /// Reports the orientation in a file that was written; an empty name stands for both files.
+  void reportWritten(std::string_view file);
 
   OrientationCenter& center_;
   const std::filesystem::path directory_;
   DirectoryWatch& watch_;
-  bool watching_ = false;  // touched under the center's lock only
+  bool watching_ = false;  // guarded by the center's lock
 };
 
-/// "portrait" or "1", blanks around it allowed. None for anything else.
+/// The orientation with this name ("portrait") or number ("1"), blanks around it allowed; else
+/// none.
 [[nodiscard]] std::optional<Orientation> OrientationFromText(std::string_view text);
 
 }  // namespace quarvel

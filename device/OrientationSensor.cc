@@ -25,7 +25,7 @@ constexpr const char* kProxyName = "net.hadess.SensorProxy";
 constexpr const char* kProxyPath = "/net/hadess/SensorProxy";
 constexpr const char* kProxyInterface = "net.hadess.SensorProxy";
 constexpr const char* kPropertiesInterface = "org.freedesktop.DBus.Properties";
-// Of the proxy's name alone: other names come and go without waking us.
+// For the proxy's name alone: other names come and go without a wake-up.
 constexpr const char* kOwnerChanges =
     "type='signal',sender='org.freedesktop.DBus',path='/org/freedesktop/DBus',"
     "interface='org.freedesktop.DBus',member='NameOwnerChanged',arg0='net.hadess.SensorProxy'";
@@ -39,8 +39,8 @@ struct ProxyProperties {
   std::optional<bool> hasAccelerometer;
 };
 
-/// Reads properties (a{sv}) at the message's present place. Returns a negative error number when
-/// the message is not of that form.
+/// Reads properties (a{sv}) at the message's read position. Returns a negative error number for a
+/// message of another form.
 int readProperties(sd_bus_message* message, ProxyProperties& properties) {
   int status = sd_bus_message_enter_container(message, SD_BUS_TYPE_ARRAY, "{sv}");
   while (status >= 0 &&
@@ -73,19 +73,19 @@ timespec timeUntil(std::uint64_t monotonicMicroseconds) {
   return {static_cast<time_t>(left / 1'000'000), static_cast<long>(left % 1'000'000 * 1'000)};
 }
 
-/// Writes a complaint once, until things went well again.
-class Complaint {
+/// Logs the first of a run of faults. For the sensor's thread.
+class FaultLog {
  public:
-  void make(std::string_view what, std::string_view why) {
+  void report(std::string_view subject, std::string_view reason) {
     ZQ_FUNCTION("OrientationSensor");
-    if (!std::exchange(made_, true)) {
-      ZQ_LOG(nullptr, error, "no device orientation, {}: {}", what, why);
+    if (!std::exchange(reported_, true)) {
+      ZQ_LOG(nullptr, error, "no device orientation, {}: {}", subject, reason);
     }
   }
-  void settle() { made_ = false; }
+  void clear() { reported_ = false; }
 
  private:
-  bool made_ = false;
+  bool reported_ = false;
 };
 
 }  // namespace
@@ -93,17 +93,16 @@ class Complaint {
 Orientation OrientationFromSensor(std::string_view word) {
   if (word == "normal") return Orientation::portrait;
   if (word == "bottom-up") return Orientation::portraitUpsideDown;
-  // The proxy says which edge is up, we say where the top points.
+  // The proxy names the edge that is up, the service the direction of the top.
   if (word == "right-up") return Orientation::landscapeLeft;
   if (word == "left-up") return Orientation::landscapeRight;
   return Orientation::unknown;
 }
 
-/// One connection to the bus. Used by the sensor's thread only; it returns from every call at once.
+/// One connection to the bus, for the sensor's thread only. No call blocks.
 class OrientationSensor::Connection {
  public:
-  Connection(OrientationCenter& center, Complaint& complaint)
-      : center_(center), complaint_(complaint) {}
+  Connection(OrientationCenter& center, FaultLog& faults) : center_(center), faults_(faults) {}
   Connection(const Connection&) = delete;
   Connection& operator=(const Connection&) = delete;
   ~Connection() { sd_bus_close_unref(bus_); }
@@ -121,10 +120,10 @@ class OrientationSensor::Connection {
                                      nullptr, this);
   }
 
-  /// Claims the accelerometer and asks how things stand, to begin with.
+  /// Claims the accelerometer and asks for the initial orientation.
   void claim() {
-    startingPoint_ = true;
-    claimAgain();
+    isInitial_ = true;
+    requestClaim();
   }
   void release() {
     if (!std::exchange(claimed_, false)) return;
@@ -132,7 +131,7 @@ class OrientationSensor::Connection {
                              "ReleaseAccelerometer", nullptr, nullptr, nullptr);
   }
 
-  /// Does what can be done now. Returns a negative error number when the bus is lost.
+  /// Processes all pending messages. Returns a negative error number when the bus is lost.
   [[nodiscard]] int process() {
     int status = 0;
     do {
@@ -140,26 +139,26 @@ class OrientationSensor::Connection {
     } while (status > 0);
     return status;
   }
-  /// What to wait for, until there is something to process.
-  [[nodiscard]] pollfd news() const {
+  /// The descriptor and events that announce the next message.
+  [[nodiscard]] pollfd pollDescriptor() const {
     return {sd_bus_get_fd(bus_), static_cast<short>(sd_bus_get_events(bus_)), 0};
   }
-  /// How long to wait for it at most; none while no answer is due.
-  [[nodiscard]] std::optional<timespec> patience() const {
+  /// Time until a reply is overdue; none while none is expected.
+  [[nodiscard]] std::optional<timespec> replyTimeout() const {
     std::uint64_t deadline = UINT64_MAX;
     if (sd_bus_get_timeout(bus_, &deadline) < 0 || deadline == UINT64_MAX) return std::nullopt;
     return timeUntil(deadline);
   }
 
  private:
-  /// A member function as the bus library calls it.
+  /// Adapts a member function to the bus library's callback.
   template <void (Connection::*Function)(sd_bus_message*)>
   static int call(sd_bus_message* message, void* connection, sd_bus_error*) {
     (static_cast<Connection*>(connection)->*Function)(message);
     return 0;
   }
 
-  void claimAgain() {
+  void requestClaim() {
     claimed_ = true;
     sd_bus_call_method_async(bus_, nullptr, kProxyName, kProxyPath, kProxyInterface,
                              "ClaimAccelerometer", &call<&Connection::claimAnswered>, this,
@@ -168,7 +167,7 @@ class OrientationSensor::Connection {
 
   void claimAnswered(sd_bus_message* answer) {
     if (const sd_bus_error* error = sd_bus_message_get_error(answer)) {
-      complaint_.make("the accelerometer cannot be claimed", error->message);
+      faults_.report("the accelerometer cannot be claimed", error->message);
       return;
     }
     sd_bus_call_method_async(bus_, nullptr, kProxyName, kProxyPath, kPropertiesInterface, "GetAll",
@@ -179,16 +178,16 @@ class OrientationSensor::Connection {
     ProxyProperties properties;
     if (sd_bus_message_get_error(answer) != nullptr || readProperties(answer, properties) < 0 ||
         !properties.hasAccelerometer.value_or(false)) {
-      complaint_.make("the sensor proxy", "it has no accelerometer");
+      faults_.report("the sensor proxy", "it has no accelerometer");
       return;
     }
-    complaint_.settle();
+    faults_.clear();
     if (!properties.orientation) return;
     const Orientation orientation = OrientationFromSensor(*properties.orientation);
-    if (std::exchange(startingPoint_, false)) {
-      center_.known(OrientationKind::device, orientation);
+    if (std::exchange(isInitial_, false)) {
+      center_.setInitial(OrientationKind::device, orientation);
     } else {
-      center_.changed(OrientationKind::device, orientation);
+      center_.reportChange(OrientationKind::device, orientation);
     }
   }
 
@@ -200,8 +199,8 @@ class OrientationSensor::Connection {
         !properties.orientation) {
       return;
     }
-    startingPoint_ = false;
-    center_.changed(OrientationKind::device, OrientationFromSensor(*properties.orientation));
+    isInitial_ = false;
+    center_.reportChange(OrientationKind::device, OrientationFromSensor(*properties.orientation));
   }
 
   void ownerChanged(sd_bus_message* signal) {
@@ -209,14 +208,14 @@ class OrientationSensor::Connection {
     const char* oldOwner = nullptr;
     const char* newOwner = nullptr;
     if (sd_bus_message_read(signal, "sss", &name, &oldOwner, &newOwner) < 0) return;
-    if (claimed_ && std::string_view(name) == kProxyName && *newOwner != '\0') claimAgain();
+    if (claimed_ && std::string_view(name) == kProxyName && *newOwner != '\0') requestClaim();
   }
 
   OrientationCenter& center_;
-  Complaint& complaint_;
+  FaultLog& faults_;
   sd_bus* bus_ = nullptr;
   bool claimed_ = false;
-  bool startingPoint_ = false;  // the next answer is how things stand, not a change
+  bool isInitial_ = false;  // the next reply is the initial orientation, not a change
 };
 
 OrientationSensor::~OrientationSensor() {
@@ -228,16 +227,16 @@ OrientationSensor::~OrientationSensor() {
   ::close(wakeDescriptor_);
 }
 
-std::optional<Orientation> OrientationSensor::begin(OrientationKind kind) {
-  if (kind == OrientationKind::device) want(true);
+std::optional<Orientation> OrientationSensor::start(OrientationKind kind) {
+  if (kind == OrientationKind::device) setWanted(true);
   return std::nullopt;
 }
 
-void OrientationSensor::end(OrientationKind kind) {
-  if (kind == OrientationKind::device) want(false);
+void OrientationSensor::stop(OrientationKind kind) {
+  if (kind == OrientationKind::device) setWanted(false);
 }
 
-void OrientationSensor::want(bool wanted) {
+void OrientationSensor::setWanted(bool wanted) {
   ZQ_FUNCTION("OrientationSensor");
   const MutexLock lock(mutex_);
   wanted_ = wanted;
@@ -258,12 +257,12 @@ void OrientationSensor::want(bool wanted) {
 
 void OrientationSensor::wait(const Connection* connection) const {
   std::array<pollfd, 2> descriptors{pollfd{wakeDescriptor_, POLLIN, 0}, pollfd{-1, 0, 0}};
-  std::optional<timespec> patience;
+  std::optional<timespec> timeout;
   if (connection != nullptr) {
-    descriptors[1] = connection->news();
-    patience = connection->patience();
+    descriptors[1] = connection->pollDescriptor();
+    timeout = connection->replyTimeout();
   }
-  ppoll(descriptors.data(), descriptors.size(), patience ? &*patience : nullptr, nullptr);
+  ppoll(descriptors.data(), descriptors.size(), timeout ? &*timeout : nullptr, nullptr);
   eventfd_t wakes = 0;
   eventfd_read(wakeDescriptor_, &wakes);
 }
@@ -276,7 +275,7 @@ void OrientationSensor::run() {
 }
 
 void OrientationSensor::followUntilEnd() {
-  Complaint complaint;
+  FaultLog faults;
   std::unique_ptr<Connection> connection;
   unsigned attempted = 0;
   for (;;) {
@@ -290,9 +289,9 @@ void OrientationSensor::followUntilEnd() {
     }
     if (wanted && attempts != std::exchange(attempted, attempts)) {
       if (!connection) {
-        connection = std::make_unique<Connection>(center_, complaint);
+        connection = std::make_unique<Connection>(center_, faults);
         if (const int status = connection->open(); status < 0) {
-          complaint.make("the system bus", statusText(status));
+          faults.report("the system bus", statusText(status));
           connection.reset();
         }
       }
@@ -302,7 +301,7 @@ void OrientationSensor::followUntilEnd() {
     }
     if (connection) {
       if (const int status = connection->process(); status < 0) {
-        complaint.make("the system bus was lost", statusText(status));
+        faults.report("the system bus was lost", statusText(status));
         connection.reset();
       }
     }

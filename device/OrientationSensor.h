@@ -8,11 +8,13 @@
 
 namespace quarvel {
 
-/// The device's orientation from the sensor proxy on the system bus. One thread, blocked until the
-/// bus has news, started with the first registration. The accelerometer is claimed only while
-/// somebody is registered, since it costs battery, and again when the proxy was restarted.
-/// Without bus, proxy or accelerometer there is one log line and no orientation; the next first
-/// registration tries again.
+/// Reads the device's orientation from the sensor proxy on the system bus. Claims the
+/// accelerometer, which costs battery, only while a handler is registered, and again after a
+/// restart of the proxy. Without bus, proxy or accelerometer there is one log line and no
+/// orientation; the next first registration tries again.
+///
+/// Owned by the center. One thread, started with the first registration, blocked until the bus has
+/// news.
 class OrientationSensor final : public OrientationSource {
  public:
   explicit OrientationSensor(OrientationCenter& center) : center_(center) {}
@@ -20,15 +22,16 @@ class OrientationSensor final : public OrientationSource {
   OrientationSensor& operator=(const OrientationSensor&) = delete;
   ~OrientationSensor() override;
 
-  std::optional<Orientation> begin(OrientationKind kind) override;
-  void end(OrientationKind kind) override;
+  std::optional<Orientation> start(OrientationKind kind) override;
+  void stop(OrientationKind kind) override;
 
  private:
   class Connection;
 
-  void want(bool wanted);
+  void setWanted(bool wanted);
   void run();
   void followUntilEnd();
+  /// Waits for the bus, when there is a `connection`, or for `wakeDescriptor_`.
   void wait(const Connection* connection) const;
 
   OrientationCenter& center_;
@@ -41,8 +44,8 @@ class OrientationSensor final : public OrientationSource {
   int wakeDescriptor_ = -1;                          // constant once the thread runs
 };
 
-/// The proxy's word for an orientation: "normal", "bottom-up", "left-up", "right-up"; unknown for
-/// any other.
+/// The orientation of the proxy's words "normal", "bottom-up", "left-up" and "right-up"; unknown
+/// for any other word.
 [[nodiscard]] Orientation OrientationFromSensor(std::string_view word);
 
 }  // namespace quarvel

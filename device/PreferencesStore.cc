@@ -63,13 +63,13 @@ PreferencesDomain PreferencesStore::open(std::string_view name) {
   Result<Dictionary> read = readDomain(directory_ / fmt::format("{}.toml", name));
   Domain& domain = domains_[std::string(name)];
   if (read) {
-    domain.lastFault.clear();
-    domain.lastUnderstood = std::move(read.value());
-  } else if (std::string fault = read.error().description(); fault != domain.lastFault) {
+    domain.lastError.clear();
+    domain.lastValid = std::move(read.value());
+  } else if (std::string fault = read.error().description(); fault != domain.lastError) {
     ZQ_LOG(nullptr, error, "{}; the preferences stay as they were", fault);
-    domain.lastFault = std::move(fault);
+    domain.lastError = std::move(fault);
   }
-  return PreferencesDomain(domain.lastUnderstood);
+  return PreferencesDomain(domain.lastValid);
 }
 
 }  // namespace quarvel

@@ -13,21 +13,22 @@
 namespace quarvel {
 
 /// Preferences domains as TOML files, `<directory>/<domain>.toml`: flat keys to strings, numbers
-/// and booleans. From any thread.
+/// and booleans. One for each process, as long as the process. Any thread; a read waits for another
+/// one to end.
 class PreferencesStore {
  public:
+  /// Larger files are an error: settings made by people are far below.
   static constexpr std::size_t kMaximumBytes = 65'536;
 
   explicit PreferencesStore(std::filesystem::path directory) : directory_(std::move(directory)) {}
 
-  /// As `OpenPreferencesDomain`. The same fault is logged once, until the file was right
-  /// again.
+  /// As `OpenPreferencesDomain`. The same error is logged once, until the file is right again.
   [[nodiscard]] PreferencesDomain open(std::string_view name);
 
  private:
   struct Domain {
-    Dictionary lastUnderstood;
-    std::string lastFault;  // as it was logged; empty while all is well
+    Dictionary lastValid;
+    std::string lastError;  // as it was logged; empty while the file is right
   };
 
   const std::filesystem::path directory_;
@@ -36,8 +37,7 @@ class PreferencesStore {
 };
 
 /// Reads the text of a preferences file. Errors: domain "quarvel.preferences", code 1; the reason
-/// is
-/// "<file>:<line>: " and what is wrong and allowed.
+/// names file and line and the allowed kinds.
 [[nodiscard]] Result<Dictionary> PreferencesFromText(std::string_view text,
                                                      const std::filesystem::path& file);
 

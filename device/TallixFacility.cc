@@ -20,7 +20,7 @@ bool matches(std::optional<std::string_view> wanted, std::string_view name) {
   return !wanted || *wanted == name;
 }
 
-/// Looks through the tree for what a lookup asks for.
+/// Collects the channels of one lookup. Lives as long as the lookup, on its thread.
 class TreeSearch {
  public:
   using Position = std::tuple<std::string, std::string, std::string>;
@@ -59,7 +59,7 @@ class TreeSearch {
     for (fs::directory_iterator entry(directory, failure), end; !failure && entry != end;
          entry.increment(failure)) {
       const std::string name = entry->path().filename();
-      // A name becomes part of a message, so it has to be text.
+      // A name becomes part of a message, which must be UTF-8.
       if (!name.starts_with('.') && IsUtf8(name)) visit(*entry, name);
     }
     if (failure && !error) {
@@ -92,6 +92,15 @@ class TreeSearch {
 };
 
 }  // namespace
+
+std::string DriverChannel::description() const {
+  return fmt::format("{}/{}{}{} ({})", group, subgroup, subgroup.empty() ? "" : "/", name,
+                     file.native());
+}
+
+Error TallixError(TallixErrorCode code, std::string reason) {
+  return Error::because(kTallixErrorDomain, static_cast<std::int64_t>(code), std::move(reason));
+}
 
 TallixFacility::TallixFacility(const Configuration::Tallix& configuration)
     : root_(configuration.root) {

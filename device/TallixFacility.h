@@ -2,23 +2,45 @@
 
 #include <filesystem>
 #include <optional>
+#include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 #include "base/Error.h"
-#include "device/TallixChannels.h"
+#include "device/CounterFile.h"
 #include "platform/Tallix.h"
 #include "system/Configuration.h"
 
 namespace quarvel {
 
-/// Finds channels: a tree of files ROOT/<group>/<channel> and ROOT/<group>/<subgroup>/<channel>,
-/// one integer each, and the single channels of the configuration. A single one takes the place of
-/// one in the tree that has the same group, subgroup and name. Symbolic links are followed, hidden
-/// files are not looked at. Immutable; from any thread.
+/// The place of one channel's integer. A value type.
+struct DriverChannel {
+  std::string group, subgroup, name;  // an absent subgroup or name is empty
+  std::filesystem::path file;
+  std::optional<CounterPattern> pattern;  // absent: the file holds the integer alone
+
+  /// For messages: "group/subgroup/name (file)".
+  [[nodiscard]] std::string description() const;
+};
+
+/// Immutable; shared by references from any thread.
+class TallixChannelSet {
+ public:
+  explicit TallixChannelSet(std::vector<DriverChannel> list) : channels(std::move(list)) {}
+  const std::vector<DriverChannel> channels;
+};
+
+[[nodiscard]] Error TallixError(TallixErrorCode code, std::string reason);
+
+/// Finds channels in two places: a tree of files ROOT/<group>/<channel> and
+/// ROOT/<group>/<subgroup>/<channel>, one integer each, and the single channels of the
+/// configuration. A single channel replaces the one in the tree with the same group, subgroup and
+/// name. Symbolic links are followed, hidden files ignored. One for each process. Immutable; any
+/// thread.
 class TallixFacility {
  public:
-  /// A single channel whose pattern is wrong is logged and left out.
+  /// A single channel with a wrong pattern is logged and left out.
   explicit TallixFacility(const Configuration::Tallix& configuration);
 
   /// As `TallixCopyChannelsInGroup`.

@@ -13,7 +13,7 @@ namespace quarvel {
 VerbosePreferences::VerbosePreferences()
     : queue_(CreateSerialQueue("tarnwick.quarvel.log.preferences", QualityOfService::background)) {
   ZQ_FUNCTION("FollowVerbosePreferences");
-  // First the notification: a change while the scopes are read is then read again.
+  // The notification comes first, so that a change while the scopes are read causes another read.
   NotificationToken token = 0;
   const std::int32_t status = RegisterForNotification("tarnwick.quarvel.reporting", token, *queue_,
                                                       [this](NotificationToken) { readAgain(); });

@@ -9,10 +9,10 @@
 
 namespace quarvel {
 
-/// Has the log's verbose switches follow the preferences: each scope's key is read from its domain
-/// when the scope is registered (at once for the registered ones), and again whenever the
-/// notification "tarnwick.quarvel.reporting" is posted. Owned by the service, one at a time, and
-/// outlives the blocks of its queue.
+/// Makes log scopes follow the preferences. Reads each scope's verbose key from its domain when the
+/// scope is registered (at once for the registered ones), and again whenever the notification
+/// "tarnwick.quarvel.reporting" is posted. Owned by the service, one at a time, and outlives the
+/// blocks of its queue, on which later reads run.
 class VerbosePreferences {
  public:
   VerbosePreferences();

@@ -11,15 +11,15 @@ namespace quarvel {
 
 namespace {
 
-/// Takes nothing, for a reason that may be mended while the rows wait in the store.
+/// Takes nothing. The reason may be mended while the rows wait in the store.
 class MissingEngine final : public ExportEngine {
  public:
   explicit MissingEngine(std::string reason) : reason_(std::move(reason)) {}
 
   [[nodiscard]] Delivery deliver(const ExportBatch& /*batch*/) override {
-    return {.rest = Delivery::Rest::again, .reason = reason_};
+    return {.remainder = Delivery::Remainder::again, .reason = reason_};
   }
-  void rest() override {}
+  void disconnect() override {}
   void stop() override {}
   void resume() override {}
 
@@ -27,7 +27,8 @@ class MissingEngine final : public ExportEngine {
   const std::string reason_;
 };
 
-/// Where it was installed to, as seen from the service; before that, beside it.
+/// The installed module, relative to the service's program; before installation, beside the
+/// program.
 std::filesystem::path ModulePath(const std::string& backend) {
   std::error_code error;
   const auto service = std::filesystem::read_symlink("/proc/self/exe", error).parent_path();
@@ -39,7 +40,7 @@ std::filesystem::path ModulePath(const std::string& backend) {
 }  // namespace
 
 std::unique_ptr<ExportEngine> LoadEngine(const std::string& backend,
-                                         const Configuration::Agent& agent,
+                                         const BackendSettings& settings,
                                          const ExportDevice& device) {
   // Never closed: its threads may be running until the process is gone.
   void* const module = ::dlopen(ModulePath(backend).c_str(), RTLD_NOW | RTLD_LOCAL);
@@ -48,7 +49,7 @@ std::unique_ptr<ExportEngine> LoadEngine(const std::string& backend,
     return std::make_unique<MissingEngine>(
         fmt::format("the part of the service for it cannot be loaded: {}", ::dlerror()));
   }
-  return std::unique_ptr<ExportEngine>(reinterpret_cast<MakeEngine>(entry)(agent, device));
+  return std::unique_ptr<ExportEngine>(reinterpret_cast<MakeEngine>(entry)(settings, device));
 }
 
 }  // namespace quarvel

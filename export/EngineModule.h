@@ -9,16 +9,17 @@
 
 namespace quarvel {
 
-/// What an engine's module exports, under `kEngineModuleEntry`.
-using MakeEngine = ExportEngine* (*)(const Configuration::Agent& agent, const ExportDevice& device);
+/// The function that an engine's module exports under `kEngineModuleEntry`. `settings` are of the
+/// engine's own type: its own reader made them.
+using MakeEngine = ExportEngine* (*)(const BackendSettings& settings, const ExportDevice& device);
 inline constexpr const char* kEngineModuleEntry = "QuarvelMakeEngine";
 
-/// Makes the engine of a backend. Its code is in a module of its own (`export-<backend>.so`),
-/// loaded now: what an engine stands on is larger than all the rest of the service, and slower to
-/// load, and most devices have none or one. When the module cannot be loaded the engine is one that
-/// takes nothing and says why.
+/// Makes the engine of a backend from its module, `export-<backend>.so`, which is loaded now and
+/// never closed. An engine's libraries are larger than all the rest of the service, and most
+/// devices need one engine or none. When the module cannot be loaded, the result is an engine that
+/// takes nothing and gives the reason. Blocks while the module is loaded.
 [[nodiscard]] std::unique_ptr<ExportEngine> LoadEngine(const std::string& backend,
-                                                       const Configuration::Agent& agent,
+                                                       const BackendSettings& settings,
                                                        const ExportDevice& device);
 
 }  // namespace quarvel

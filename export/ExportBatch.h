@@ -14,24 +14,25 @@ namespace quarvel {
 /// A column of a table, exported under its name in the store.
 using ExportColumn = StoreColumn;
 
-/// A value of a row: nothing, or by the column's kind an integer (also a boolean's, and a time's in
-/// microseconds since the epoch), a real, or a text (also JSON).
+/// A value of a row: absent, or by the column's kind an integer (a boolean is 0 or 1, a time is in
+/// microseconds since the epoch), a real, or a text (also of a JSON column).
 using ExportValue = std::variant<std::monostate, std::int64_t, double, std::string>;
 
-/// One row, its values in the order of `ExportColumns`.
+/// One row, with its values in the order of `ExportColumns`.
 struct ExportRow {
   std::int64_t id = 0;
-  std::size_t bytes = 0;  // of its texts
+  std::size_t bytes = 0;  // of its values; a number counts 8
   std::vector<ExportValue> values;
 };
 
-/// Rows of one table, in the order of their ids.
+/// Rows of one table in the order of their ids. Made by `ExportSource::read`, handed to the engine
+/// on the same thread, and gone when the delivery has been recorded.
 struct ExportBatch {
   StoreTable table{};
   std::string storeID;
   std::vector<ExportRow> rows;
 
-  /// What a row is called everywhere and for ever: "<store_id>-<table>-<id>".
+  /// The stable name of a row, by which engines drop repeats: "<store_id>-<table>-<id>".
   [[nodiscard]] std::string nameOf(const ExportRow& row) const;
 };
 
@@ -40,7 +41,8 @@ struct ExportBatch {
   return InsertedColumns(Describe(table));
 }
 
-/// Appends a row as one JSON object: its id and its columns under their names.
+/// Appends a row as one JSON object: its id, then its columns under their names, absent ones as
+/// null.
 void AppendRowJson(std::string& out, StoreTable table, const ExportRow& row);
 
 }  // namespace quarvel

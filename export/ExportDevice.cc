@@ -11,12 +11,12 @@ namespace quarvel {
 
 namespace {
 
-// Random; makes the derived identifier the service's own.
+// A random constant: the identifier derived with it is the service's own.
 constexpr sd_id128_t kApplication{.bytes = {0x7b, 0x0c, 0x5e, 0x42, 0x91, 0xd3, 0x4f, 0x1a, 0xa6,
                                             0x08, 0x2e, 0xc7, 0x13, 0x5d, 0xf0, 0x69}};
 
-/// With what no subject or label may hold replaced.
-std::string Cleaned(std::string name) {
+/// Replaces the characters that subjects and labels may not hold.
+std::string CleanName(std::string name) {
   for (char& character : name) {
     const auto octet = static_cast<unsigned char>(character);
     if (octet > 127 || (std::isalnum(octet) == 0 && character != '_')) character = '-';
@@ -26,8 +26,7 @@ std::string Cleaned(std::string name) {
 
 std::string HostName() {
   std::array<char, 256> name{};
-  if (::gethostname(name.data(), name.size() - 1) != 0) return {};
-  return Cleaned(name.data());
+  return ::gethostname(name.data(), name.size() - 1) == 0 ? name.data() : "";
 }
 
 std::string MachineName() {
@@ -39,10 +38,14 @@ std::string MachineName() {
 
 }  // namespace
 
-ExportDevice DescribeDevice(const std::string& configured) {
-  std::string name = configured.empty() ? HostName() : configured;
+std::string DeviceName(const std::string& configured, const std::string& hostName) {
+  std::string name = configured.empty() ? CleanName(hostName) : configured;
   if (name.empty() || name == "localhost") name = MachineName();
-  return {std::move(name), QUARVEL_VERSION};
+  return name;
+}
+
+ExportDevice DescribeDevice(const std::string& configured) {
+  return {DeviceName(configured, HostName()), QUARVEL_VERSION};
 }
 
 }  // namespace quarvel

@@ -10,39 +10,40 @@
 
 namespace quarvel {
 
-/// What became of a batch.
+/// The outcome of one batch.
 struct Delivery {
-  enum class Rest : std::uint8_t {
-    none,     // there is no rest: the whole batch was taken
-    again,    // the engine may take the rest another time
-    refused,  // the engine will never take the next `refused` rows, as they stand or together
-    stopped,  // `stop` was called; what became of the rest is not known
+  enum class Remainder : std::uint8_t {
+    none,     // the whole batch was taken
+    again,    // the engine may take the remaining rows at another time
+    refused,  // the engine will never take the next `refused` rows, alone or together
+    stopped,  // `stop` was called; the remaining rows may or may not have arrived
   };
 
-  std::size_t taken = 0;  // so many rows from the first on are safe with the engine
-  Rest rest = Rest::none;
+  std::size_t taken = 0;  // rows that are safe with the engine, counted from the first
+  Remainder remainder = Remainder::none;
   std::size_t refused = 0;
-  std::string reason{};  // why there is a rest, a sentence without its full stop
-  /// How long the engine asks to be left alone before it is sent the rest.
+  std::string reason{};  // of the remainder; a sentence without its full stop
+  /// Time that the engine asks for before the remaining rows are sent.
   std::optional<std::chrono::seconds> after{};
-  /// Of the rows that were taken so many were not kept, the engine does not say which; `reason`
-  /// says why.
+  /// Number of taken rows that the engine dropped without naming them, for `reason`.
   std::size_t droppedByEngine = 0;
 };
 
-/// An engine that takes rows: the part of an exporter that differs from engine to engine. Used by
-/// its exporter's thread alone, but for `stop` and `resume`.
+/// The part of an exporter that differs from engine to engine: it hands rows to one remote system.
+/// Owned by its `ExportThread` and used on that thread alone, but for `stop` and `resume`; lives
+/// until the thread has ended.
 class ExportEngine {
  public:
   virtual ~ExportEngine() = default;
 
-  /// Hands rows over and returns once the engine has them safe or is known not to take them, after
-  /// some seconds at most. The batch is not empty.
+  /// Sends rows and waits, for some seconds at most, until the engine has them safe or refuses
+  /// them. The batch is not empty.
   [[nodiscard]] virtual Delivery deliver(const ExportBatch& batch) = 0;
-  /// There will be nothing to deliver for a while: gives up what costs the device anything.
-  virtual void rest() = 0;
+  /// Releases the connection and anything else that costs the device power while there is nothing
+  /// to send. The next `deliver` connects again.
+  virtual void disconnect() = 0;
 
-  /// Any thread. From now on until `resume` a delivery, also one under way, ends at once.
+  /// Any thread. Between `stop` and `resume` a delivery ends at once, also one in flight.
   virtual void stop() = 0;
   virtual void resume() = 0;
 };

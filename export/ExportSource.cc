@@ -21,7 +21,7 @@ std::string SelectRows(StoreTable table) {
                      StoreTableName(table));
 }
 
-/// Ids come without gaps, but for rows that were erased: both ends tell how many there are.
+/// Ids have no gaps except erased rows, so both ends tell the number of rows without a scan.
 std::string CountRows(StoreTable table) {
   return fmt::format(
       "SELECT max(0, (SELECT max(id) FROM {0}) - max(?1, (SELECT min(id) FROM {0})"
@@ -73,7 +73,7 @@ Outcome ExportSource::open() {
   isOpen_ = false;
   for (const StoreTable table : kAllStoreTables) statements_[table] = {};
   connection_ = {};
-  // Batches are read once and in order: a large cache would hold what nobody asks for again.
+  // 128 KiB: each page is read once and in order, so a larger cache would never be hit.
   if (!connection_.open(path_) ||
       !connection_.execute("PRAGMA query_only = 1; PRAGMA cache_size = -128")) {
     return failed();

@@ -16,9 +16,10 @@
 
 namespace quarvel {
 
-/// The store as one exporter sees it: rows after a cursor, and the store's writer, which moves the
-/// cursor. Has a connection of its own that only reads, and never for longer than one batch takes.
-/// For the exporter's thread, but for `stop` and `resume`.
+/// The store as one exporter sees it: the rows after its cursor, and the store's writer, which
+/// moves the cursor. Reads through a connection of its own, one batch at a time, so that no read
+/// holds up a checkpoint. Owned by its `ExportThread` and used on that thread, but for `stop`,
+/// `resume` and `isStopped`.
 class ExportSource {
  public:
   /// `store` must outlive this.
@@ -26,11 +27,11 @@ class ExportSource {
 
   struct Position {
     std::string storeID;
-    StoreIDs exportedThrough;
-    std::optional<Date> acknowledgedAt;
+    StoreIDs exportedThrough;            // the cursors
+    std::optional<Date> acknowledgedAt;  // the last time by the ledger
   };
-  /// Opens the store's file, again when another one has taken its place, and tells how far the
-  /// backend is.
+  /// Reads the backend's cursors, and opens the store's file first when it is not open or was
+  /// replaced.
   [[nodiscard]] Result<Position> position();
   /// Whether the file that was opened is still the store.
   [[nodiscard]] bool isCurrent() { return isOpen_ && !connection_.hasMoved(); }
@@ -39,27 +40,29 @@ class ExportSource {
     std::int64_t after = 0;    // ids above this,
     std::int64_t through = 0;  // and up to this
     std::size_t rows = 0;
-    std::size_t bytes = 0;  // may be passed by one row
+    std::size_t bytes = 0;  // exceeded by one row at most
   };
+  /// Reads rows that `position` found; none when they have been removed.
   [[nodiscard]] Result<ExportBatch> read(StoreTable table, const Bounds& bounds);
-  /// How many rows lie after the cursors. Any thread but with its own source.
+  /// Number of rows after the cursors.
   [[nodiscard]] Result<std::int64_t> backlog(const StoreIDs& exportedThrough);
 
-  /// Has the store's writer keep this, and waits until it has. Errors: the store is closed, or
-  /// `stop` was called meanwhile, and it is not known what became of it.
+  /// Hands a record to the store's writer and waits until it is stored. Errors: the store is
+  /// closed, or `stop` was called meanwhile and the record may or may not be stored.
   [[nodiscard]] Outcome record(ExportRecord record);
 
-  // Any thread. From now on until `resume`, `record` does not wait.
+  // Any thread. Between `stop` and `resume`, `record` does not wait.
   void stop();
   void resume();
   [[nodiscard]] bool isStopped() const;
 
  private:
-  /// Shared with the writer, who may answer when nobody waits any more.
+  /// Shared with the store's writer, which may reply after `record` has stopped waiting.
   struct Pending {
     Mutex mutex;
     ConditionVariable changed;
-    std::uint64_t answered QUARVEL_GUARDED_BY(mutex) = 0;  // the last record
+    std::uint64_t answered QUARVEL_GUARDED_BY(mutex) =
+        0;  // number of the last record that was stored or refused
     std::optional<Error> error QUARVEL_GUARDED_BY(mutex);
     bool stopped QUARVEL_GUARDED_BY(mutex) = false;
   };
@@ -77,7 +80,7 @@ class ExportSource {
   PerStoreTable<Statements> statements_;
   bool isOpen_ = false;
   std::string storeID_;
-  std::uint64_t records_ = 0;
+  std::uint64_t records_ = 0;  // handed to the writer
   const std::shared_ptr<Pending> pending_ = std::make_shared<Pending>();
 };
 

@@ -71,7 +71,7 @@ bool ExportThread::awaitEnd(std::chrono::steady_clock::time_point deadline) {
     }
     if (!ended_) return false;
   }
-  if (thread_.joinable()) thread_.join();  // which has nothing more to do
+  if (thread_.joinable()) thread_.join();  // its function has returned or is about to
   return true;
 }
 
@@ -116,7 +116,7 @@ bool ExportThread::awaitWork(const Exporter::Next& next) {
 
 void ExportThread::park() {
   mutex_.unlock();
-  engine_->rest();
+  engine_->disconnect();
   mutex_.lock();
   parked_ = true;
   changed_.notifyAll();

@@ -14,29 +14,30 @@
 
 namespace quarvel {
 
-/// An exporter on a thread of its own, so that an engine that is down delays nobody else. Sleeps
-/// while there is nothing to send. All operations from any thread.
+/// An exporter on a thread of its own, so that an engine that is down delays no other. Sleeps while
+/// there is nothing to send. Owned by `Exporters` and lives as long. All operations from any
+/// thread.
 class ExportThread {
  public:
   /// `store` must outlive this. Nothing runs before `start`.
   ExportThread(Exporter::Options options, std::unique_ptr<ExportEngine> engine,
                TelemetryStore& store);
-  /// Waits for the thread as long as it takes.
+  /// Stops, and waits for the thread without a time limit.
   ~ExportThread();
   ExportThread(const ExportThread&) = delete;
   ExportThread& operator=(const ExportThread&) = delete;
 
   void start();
-  /// The store is safe this far now. Brief.
+  /// Tells how far the store is durable now. Takes the lock only; called by the store's writer.
   void extend(const DurableExtent& extent) QUARVEL_EXCLUDES(mutex_);
 
-  /// Nothing is sent from now on until `release`: a batch under way is abandoned, and when this
-  /// returns no row is in the thread's hands. May be called several times, each with its `release`.
+  /// Sends nothing until `release`. Abandons a batch in flight; when this returns, the thread holds
+  /// no row. May be called several times, each with its `release`.
   void hold() QUARVEL_EXCLUDES(mutex_);
   void release() QUARVEL_EXCLUDES(mutex_);
 
-  /// Abandons a batch under way and ends. `awaitEnd`, which is for one thread, returns false when
-  /// it took longer.
+  /// Abandons a batch in flight and ends the thread. `awaitEnd`, for one caller only, waits for the
+  /// end and returns false after `deadline`.
   void stop() QUARVEL_EXCLUDES(mutex_);
   [[nodiscard]] bool awaitEnd(std::chrono::steady_clock::time_point deadline)
       QUARVEL_EXCLUDES(mutex_);
@@ -45,9 +46,11 @@ class ExportThread {
 
  private:
   void run() QUARVEL_EXCLUDES(mutex_);
-  /// Returns once there is something to do; false at the end.
+  /// Waits until the next step is due; false when the thread is to end.
   [[nodiscard]] bool awaitWork(const Exporter::Next& next) QUARVEL_REQUIRES(mutex_);
+  /// Waits while held, without a connection.
   void park() QUARVEL_REQUIRES(mutex_);
+  /// Interrupts the engine and the source.
   void stopWork() QUARVEL_REQUIRES(mutex_);
 
   const std::string backend_;
@@ -58,13 +61,13 @@ class ExportThread {
   mutable Mutex mutex_;
   ConditionVariable changed_;
   DurableExtent extent_ QUARVEL_GUARDED_BY(mutex_);
-  bool extended_ QUARVEL_GUARDED_BY(mutex_) = false;  // since the exporter last looked
+  bool extended_ QUARVEL_GUARDED_BY(mutex_) = false;  // since the last step
   int holds_ QUARVEL_GUARDED_BY(mutex_) = 0;
   bool parked_ QUARVEL_GUARDED_BY(mutex_) = true;
   bool stopping_ QUARVEL_GUARDED_BY(mutex_) = false;
   bool ended_ QUARVEL_GUARDED_BY(mutex_) = true;
   std::uint64_t wakeUps_ QUARVEL_GUARDED_BY(mutex_) = 0;
-  std::thread thread_;  // set by `start`
+  std::thread thread_;  // constant after `start`
 };
 
 }  // namespace quarvel

@@ -15,9 +15,9 @@ namespace {
 
 using std::chrono::milliseconds;
 
-/// A backlog is drained in this many batches a second, so that none takes the whole share at once.
+/// A backlog is drained in this many batches a second, so that draining is smooth.
 constexpr std::uint32_t kBatchesPerSecond = 4;
-constexpr std::size_t kReasonBytes = 500;  // of the ledger's lines
+constexpr std::size_t kReasonBytes = 500;  // of a ledger line's reason
 
 Date SystemDate() {
   return std::chrono::floor<std::chrono::microseconds>(std::chrono::system_clock::now());
@@ -29,7 +29,7 @@ std::function<double()> Generator() {
   };
 }
 
-std::string Shortened(const std::string& text) {
+std::string Shorten(const std::string& text) {
   if (text.size() <= kReasonBytes) return text;
   return std::string(Utf8Prefix(text, kReasonBytes)) + "…";
 }
@@ -47,7 +47,7 @@ ExportRecord::Line LineOf(const ExportBatch& batch, std::size_t first, std::size
 std::string OutcomeOf(const Delivery& delivery) {
   if (delivery.droppedByEngine == 0) return "acknowledged";
   return fmt::format("partly refused: {} of {}: {}", delivery.droppedByEngine, delivery.taken,
-                     Shortened(delivery.reason));
+                     Shorten(delivery.reason));
 }
 
 }  // namespace
@@ -68,8 +68,8 @@ Exporter::Next Exporter::step(const DurableExtent& extent) {
   const Instant now = options_.monotonicClock();
   if (now < notBefore_) return {notBefore_, false};
   if (storeID_.empty() || !source_.isCurrent()) {
-    if (const Outcome located = locate(); !located) {
-      return backOff(located.error().description(), std::nullopt);
+    if (const Outcome found = findPosition(); !found) {
+      return backOff(found.error().description(), std::nullopt);
     }
   }
   if (storeID_ != extent.storeID || !hasRows(extent)) return idle();
@@ -82,7 +82,7 @@ Exporter::Next Exporter::step(const DurableExtent& extent) {
   return exportBatch(extent);
 }
 
-Outcome Exporter::locate() {
+Outcome Exporter::findPosition() {
   storeID_.clear();
   auto position = source_.position();
   if (!position) return position.error();
@@ -102,12 +102,12 @@ bool Exporter::hasRows(const DurableExtent& extent) const {
 
 Exporter::Next Exporter::idle() {
   const Instant now = options_.monotonicClock();
-  if (!std::exchange(idle_, true)) restAt_ = now + kRestAfter;
-  if (restAt_ && now >= *restAt_) {
-    engine_.rest();
-    restAt_.reset();
+  if (!std::exchange(idle_, true)) disconnectAt_ = now + kDisconnectAfter;
+  if (disconnectAt_ && now >= *disconnectAt_) {
+    engine_.disconnect();
+    disconnectAt_.reset();
   }
-  return {restAt_, true};
+  return {disconnectAt_, true};
 }
 
 Exporter::Next Exporter::exportBatch(const DurableExtent& extent) {
@@ -125,34 +125,34 @@ Exporter::Next Exporter::exportBatch(const DurableExtent& extent) {
     idle_ = false;
     notBefore_ = options_.monotonicClock() + milliseconds(batch.value().rows.size() * 1000 /
                                                           std::max(options_.rowsPerSecond, 1U));
-    return concluded(batch.value(), engine_.deliver(batch.value()));
+    return conclude(batch.value(), engine_.deliver(batch.value()));
   }
   return idle();
 }
 
-Exporter::Next Exporter::concluded(const ExportBatch& batch, const Delivery& delivery) {
+Exporter::Next Exporter::conclude(const ExportBatch& batch, const Delivery& delivery) {
   if (delivery.taken > 0) refusalsInARow_ = 0;
   const std::size_t aside = setAside(delivery);
   if (delivery.taken + aside > 0) {
     if (const Outcome recorded = record(batch, delivery, aside); !recorded) {
-      storeID_.clear();  // where the cursor stands now has to be read again
+      storeID_.clear();  // the cursor has to be read again
       if (source_.isStopped()) return {notBefore_, false};
       return backOff(recorded.error().description(), std::nullopt);
     }
   }
-  switch (delivery.rest) {
-    case Delivery::Rest::none:
-      getsOn();
+  switch (delivery.remainder) {
+    case Delivery::Remainder::none:
+      noteSuccess();
       break;
-    case Delivery::Rest::again:
+    case Delivery::Remainder::again:
       if (delivery.taken > 0) backOff_ = kFirstBackOff;
       return backOff(delivery.reason, delivery.after);
-    case Delivery::Rest::refused:
+    case Delivery::Remainder::refused:
       if (refusalsInARow_ >= kRefusalsInARow) {
         return backOff(delivery.reason, delivery.after);
       }
       break;
-    case Delivery::Rest::stopped:
+    case Delivery::Remainder::stopped:
       break;
   }
   return {notBefore_, false};
@@ -160,7 +160,7 @@ Exporter::Next Exporter::concluded(const ExportBatch& batch, const Delivery& del
 
 std::size_t Exporter::setAside(const Delivery& delivery) {
   ZQ_FUNCTION("Exporter::setAside");
-  if (delivery.rest != Delivery::Rest::refused) return 0;
+  if (delivery.remainder != Delivery::Remainder::refused) return 0;
   if (delivery.refused > 1 && refusalsInARow_ < kRefusalsInARow) {
     batchRows_ = delivery.refused / 2;
     return 0;
@@ -179,7 +179,7 @@ Outcome Exporter::record(const ExportBatch& batch, const Delivery& delivery, std
   }
   if (setAside > 0) {
     record.lines.push_back(
-        LineOf(batch, delivery.taken, end, "refused: " + Shortened(delivery.reason)));
+        LineOf(batch, delivery.taken, end, "refused: " + Shorten(delivery.reason)));
   }
   const std::int64_t lastID = record.lastID;
   Outcome recorded = source_.record(std::move(record));
@@ -195,7 +195,8 @@ Outcome Exporter::record(const ExportBatch& batch, const Delivery& delivery, std
 
 Exporter::Next Exporter::backOff(std::string reason, std::optional<std::chrono::seconds> askedFor) {
   ZQ_FUNCTION("Exporter::backOff");
-  // A fleet that lost its engine at one moment does not come back to it at one moment.
+  // Jitter between half and the whole: a fleet that lost its engine at one moment must not return
+  // to it at one moment.
   milliseconds delay(static_cast<std::int64_t>(static_cast<double>(backOff_.count()) *
                                                (1 + options_.random()) / 2));
   backOff_ = std::min<milliseconds>(backOff_ * 2, kLongestBackOff);
@@ -212,8 +213,8 @@ Exporter::Next Exporter::backOff(std::string reason, std::optional<std::chrono::
   return {notBefore_, false};
 }
 
-void Exporter::getsOn() {
-  ZQ_FUNCTION("Exporter::getsOn");
+void Exporter::noteSuccess() {
+  ZQ_FUNCTION("Exporter::noteSuccess");
   backOff_ = kFirstBackOff;
   batchRows_ = std::min(batchRows_ * 2, kBatchRows);
   const MutexLock lock(mutex_);

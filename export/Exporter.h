@@ -17,75 +17,79 @@
 
 namespace quarvel {
 
-/// What one backend has to tell of itself.
+/// The state of one backend, for the status file.
 struct ExportStatus {
   std::string backend;
   StoreIDs exportedThrough;
   std::uint64_t exportedRows = 0;  // since the service started
-  std::uint64_t refusedRows = 0;   // set aside since then
-  std::uint64_t wakeUps = 0;       // of its thread since then
+  std::uint64_t refusedRows = 0;   // likewise; set aside
+  std::uint64_t wakeUps = 0;       // likewise; of its thread
   std::optional<Date> acknowledgedAt;
-  std::optional<std::string> error;  // why it does not get on now
-  std::optional<Date> nextAttempt;   // while it backs off
+  std::optional<std::string> error;  // the reason of the present back-off
+  std::optional<Date> nextAttempt;   // during back-off
 };
 
-/// Carries a store's rows to one engine: a batch at a time, the next only once the engine has
-/// acknowledged one and the store's writer has moved the cursor. So whatever happens at any point
-/// repeats one batch at most, under the same names. Never gives up: it backs off from 1 second to 5
-/// minutes. What the engine will never take is set aside, with a line in the ledger, after halving
-/// the batch down to the row that it does not like.
+/// Carries a store's rows to one engine. Sends one batch at a time; the next one follows only after
+/// the engine has acknowledged it and the store's writer has moved the cursor. A crash or an outage
+/// at any point therefore repeats one batch at most, under the same names.
 ///
-/// Has no thread: `step` is called when there is something to do. Only `status` may be called from
-/// another thread.
+/// Retries for ever, with a back-off that doubles from 1 second to 5 minutes. A batch that the
+/// engine refuses is halved until the row that it objects to is found; that row is set aside, with
+/// a line in the ledger.
+///
+/// Owned by `ExportThread`, which calls `step` on its thread whenever a step is due. Only `status`
+/// may be called from another thread.
 class Exporter {
  public:
   using Instant = std::chrono::steady_clock::time_point;
 
   static constexpr std::chrono::seconds kFirstBackOff{1};
   static constexpr std::chrono::minutes kLongestBackOff{5};
-  /// What an engine may ask for at most.
+  /// Longest time that is granted to an engine that asks for one (Retry-After).
   static constexpr std::chrono::hours kLongestAskedFor{1};
-  /// How long an engine with nothing to do keeps its connection.
-  static constexpr std::chrono::seconds kRestAfter{30};
+  /// Time without rows after which the engine disconnects.
+  static constexpr std::chrono::seconds kDisconnectAfter{30};
   static constexpr std::size_t kBatchRows = 1000;
   static constexpr std::size_t kBatchBytes = 512 * 1024;
-  /// So many rows refused one by one, and none taken, and the rest of a batch is not tried singly.
+  /// After so many refusals in a row the engine is taken to refuse everything: batches are set
+  /// aside whole, with back-off in between.
   static constexpr int kRefusalsInARow = 8;
 
   struct Options {
     std::string backend;
     std::uint32_t rowsPerSecond = 2000;
-    std::chrono::seconds gather{0};  // how long rows are collected before a batch is sent
-    // For tests; empty: the system's clocks, and a generator.
+    std::chrono::seconds gather{0};  // rows are collected for this long before a batch is sent
+    // For tests; empty: the system's clocks and random numbers.
     std::function<Date()> clock{};
     std::function<Instant()> monotonicClock{};
-    std::function<double()> random{};  // from 0 to 1, spreads a fleet's attempts
+    std::function<double()> random{};  // from 0 to 1; the jitter of the back-off
   };
 
   /// `source` and `engine` must outlive this.
   Exporter(Options options, ExportSource& source, ExportEngine& engine);
 
   struct Next {
-    std::optional<Instant> at;  // call `step` again then
-    bool uponRows = false;      // and as soon as there are more rows
+    std::optional<Instant> at;  // call `step` again at this time
+    bool uponRows = false;      // and as soon as the store's extent has grown
   };
-  /// Does what is due. `extent` is how far the store is safe: no row beyond is sent.
+  /// Sends one batch if one is due. `extent` is the durable part of the store: no row after it is
+  /// sent, because a power cut could still take it.
   [[nodiscard]] Next step(const DurableExtent& extent);
 
   [[nodiscard]] ExportStatus status() const QUARVEL_EXCLUDES(mutex_);
 
  private:
-  [[nodiscard]] Outcome locate();
+  [[nodiscard]] Outcome findPosition();
   [[nodiscard]] bool hasRows(const DurableExtent& extent) const;
   Next idle();
   Next exportBatch(const DurableExtent& extent);
-  Next concluded(const ExportBatch& batch, const Delivery& delivery);
-  /// How many of the rows that were refused are now set aside; with none, fewer are tried at once.
+  Next conclude(const ExportBatch& batch, const Delivery& delivery);
+  /// Returns the number of refused rows to set aside now; 0 when smaller batches are tried first.
   [[nodiscard]] std::size_t setAside(const Delivery& delivery);
   [[nodiscard]] Outcome record(const ExportBatch& batch, const Delivery& delivery,
                                std::size_t setAside);
   Next backOff(std::string reason, std::optional<std::chrono::seconds> askedFor);
-  void getsOn();
+  void noteSuccess();
 
   const Options options_;
   ExportSource& source_;
@@ -93,13 +97,13 @@ class Exporter {
 
   std::string storeID_;
   StoreIDs exportedThrough_;
-  std::size_t batchRows_ = kBatchRows;  // halved by refusals, doubled by success
+  std::size_t batchRows_ = kBatchRows;  // halved by a refusal, doubled by success
   int refusalsInARow_ = 0;
   std::chrono::milliseconds backOff_ = kFirstBackOff;
-  Instant notBefore_{};  // back-off, and the share of a backlog's draining
+  Instant notBefore_{};  // back-off, and the rate limit of draining
   bool gathering_ = false;
   bool idle_ = true;
-  std::optional<Instant> restAt_;
+  std::optional<Instant> disconnectAt_;
 
   mutable Mutex mutex_;
   ExportStatus status_ QUARVEL_GUARDED_BY(mutex_);

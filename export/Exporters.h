@@ -11,25 +11,28 @@
 
 namespace quarvel {
 
-/// The exporters of one store, a thread each. All operations from any thread.
+/// The exporters of one store, each with a thread. Owned by the service; must end before the store.
+/// All operations from any thread.
 class Exporters {
  public:
+  /// One exporter to start: its options, and its engine, which the exporter then owns.
   struct Backend {
     Exporter::Options options;
     std::unique_ptr<ExportEngine> engine;
   };
-  /// `store` must outlive this. They begin at once when `exports`.
+  /// `store` must outlive this. The exporters begin at once, but send nothing unless `exports`.
   Exporters(TelemetryStore& store, std::vector<Backend> backends, bool exports);
-  /// Waits for the threads as long as they take.
+  /// Waits for the threads without a time limit.
   ~Exporters();
   Exporters(const Exporters&) = delete;
   Exporters& operator=(const Exporters&) = delete;
 
-  /// Whether anything may leave the device. Once this has returned from taking that back, nothing
-  /// is under way any more.
+  /// Sets whether rows may leave the device (consent). When this returns after a withdrawal, no row
+  /// is in flight.
   void setExports(bool exports) QUARVEL_EXCLUDES(mutex_);
 
-  /// While one lives, nothing is sent and no row is in anybody's hands.
+  /// While one lives, nothing is sent and no exporter holds a row. The constructor waits for
+  /// deliveries in flight to be abandoned.
   class Hold {
    public:
     explicit Hold(Exporters& exporters);
@@ -41,7 +44,7 @@ class Exporters {
     Exporters& exporters_;
   };
 
-  /// Abandons what is under way; waits for the threads until `deadline`.
+  /// Abandons batches in flight and ends the threads; waits for them until `deadline`.
   void stop(std::chrono::steady_clock::time_point deadline);
 
   [[nodiscard]] const std::vector<std::unique_ptr<ExportThread>>& threads() const {
@@ -54,7 +57,7 @@ class Exporters {
 
   TelemetryStore& store_;
   std::vector<std::unique_ptr<ExportThread>> threads_;  // constant after construction
-  Mutex mutex_;                                         // held while threads come to a halt
+  Mutex mutex_;  // held while the threads are held or released
   bool exports_ QUARVEL_GUARDED_BY(mutex_) = true;
 };
 

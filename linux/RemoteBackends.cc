@@ -1,5 +1,6 @@
 #include "linux/RemoteBackends.h"
 
+#include <array>
 #include <chrono>
 #include <memory>
 #include <string>
@@ -8,6 +9,8 @@
 #include <vector>
 
 #include "export/EngineModule.h"
+#include "export/nats/NatsSettings.h"
+#include "export/otlp/OtlpSettings.h"
 #include "platform/Log.h"
 #include "platform/Notifications.h"
 
@@ -18,13 +21,18 @@ namespace {
 /// Long enough for an engine to notice; a batch that is in flight is repeated at the next start.
 constexpr std::chrono::milliseconds kEndMayTake{500};
 
+// A new engine is one line here and one folder in export/.
+constexpr std::array kBackendKinds{
+    BackendKind{"nats", ReadNatsSettings},
+    BackendKind{"otlp", ReadOtlpSettings},
+};
+
 std::vector<Exporters::Backend> MakeBackends(const Configuration::Agent& agent) {
   std::vector<Exporters::Backend> backends;
   for (const std::string& name : agent.remoteBackends()) {
-    Exporters::Backend backend{{name, agent.drainRowsPerSecond},
-                               LoadEngine(name, agent, DescribeDevice(agent.device))};
-    backend.options.gather = name == "nats" ? agent.nats.gather : agent.otlp.gather;
-    backends.push_back(std::move(backend));
+    const BackendSettings& settings = *agent.settings.at(name);
+    backends.push_back({{name, agent.drainRowsPerSecond, settings.gather},
+                        LoadEngine(name, settings, DescribeDevice(agent.device))});
   }
   return backends;
 }
@@ -69,6 +77,10 @@ RemoteBackends::RemoteBackends(const Configuration& configuration,
   processExit.add([this] { exporters_.stop(std::chrono::steady_clock::now() + kEndMayTake); });
 }
 
+std::span<const BackendKind> RemoteBackends::kinds() {
+  return kBackendKinds;
+}
+
 void RemoteBackends::followConsent() {
   ZQ_FUNCTION("ProcessExporters");
   NotificationToken token = 0;
@@ -85,7 +97,7 @@ void RemoteBackends::followConsent() {
 void RemoteBackends::readConsentAgain() {
   ZQ_FUNCTION("ProcessExporters");
   std::vector<std::string> warnings;  // logged at the start
-  const auto configuration = Configuration::read(configurationFile_, warnings);
+  const auto configuration = Configuration::read(configurationFile_, kinds(), warnings);
   if (!configuration) {
     ZQ_LOG(nullptr, error, "{} Whether rows may leave the device stays as it was.",
            configuration.error().description());

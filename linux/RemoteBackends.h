@@ -2,6 +2,7 @@
 
 #include <filesystem>
 #include <memory>
+#include <span>
 
 #include "export/Exporters.h"
 #include "platform/WorkQueue.h"
@@ -22,6 +23,9 @@ class RemoteBackends {
                  TelemetryStore& store, Status& status, ProcessExit& processExit);
   RemoteBackends(const RemoteBackends&) = delete;
   RemoteBackends& operator=(const RemoteBackends&) = delete;
+
+  /// The engines that the service knows, for its configuration. Constant.
+  [[nodiscard]] static std::span<const BackendKind> kinds();
 
   [[nodiscard]] Exporters& exporters() { return exporters_; }
 

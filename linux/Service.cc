@@ -90,7 +90,8 @@ std::filesystem::path Service::configurationFile() const {
 Configuration Service::readConfiguration() {
   ZQ_FUNCTION("ConfigurationRead");
   std::vector<std::string> warnings;
-  Result<Configuration> configuration = Configuration::read(configurationFile(), warnings);
+  Result<Configuration> configuration =
+      Configuration::read(configurationFile(), RemoteBackends::kinds(), warnings);
   if (!configuration) {
     const std::string* const reason = configuration.error().userInfo.find("reason")->string();
     ZQ_LOG(nullptr, error, "{}", *reason);

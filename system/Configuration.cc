@@ -1,46 +1,27 @@
 #include "system/Configuration.h"
 
 #include <fmt/format.h>
-#include <toml++/toml.h>
+#include <fmt/ranges.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <optional>
 #include <utility>
 
 #include "base/Files.h"
-#include "platform/Log.h"
-#include "system/ConfigurationSection.h"
 
 namespace quarvel {
 namespace {
 
-using configuration::Findings;
-using configuration::kAnyPositive;
-using configuration::Section;
+using Section = ConfigurationSection;
 
+constexpr std::string_view kStore = "store";  // the backend that is not remote
 constexpr std::int64_t kMebibyte = 1024 * 1024;
 constexpr std::int64_t kGibibyte = 1024 * kMebibyte;
 constexpr std::int64_t kDaySeconds = 24 * 60 * 60;
 
-void readDevice(Findings& findings, const toml::table* table, Configuration& out) {
-  if (table == nullptr) return;
-  for (const auto& [key, node] : *table) {
-    std::string name(key.str());
-    if (const auto* boolean = node.as_boolean()) {
-      out.device.insert_or_assign(std::move(name), boolean->get());
-    } else if (const auto* integer = node.as_integer()) {
-      out.device.insert_or_assign(std::move(name), integer->get());
-    } else if (const auto* text = node.as_string()) {
-      out.device.insert_or_assign(std::move(name), text->get());
-    } else {
-      findings.wrongValue("device." + name, node, "a boolean, an integer or a string");
-    }
-  }
-}
-
-void readLog(Findings& findings, const toml::table* table, Configuration& out) {
-  Section log(findings, table, "log");
+void readLog(Section log, Configuration& out) {
   log.read<LogLevel>("level",
                      {{"error", LogLevel::error},
                       {"default", LogLevel::standard},
@@ -49,11 +30,10 @@ void readLog(Findings& findings, const toml::table* table, Configuration& out) {
                      out.logLevel);
 }
 
-void readStore(Findings& findings, const toml::table* table, Configuration::Store& out) {
-  Section store(findings, table, "store");
+void readStore(Section store, Configuration::Store& out) {
   store.read("path", out.path);
   store.read("sync_ms", 0, 60'000, out.sync);
-  store.read("max_bytes", kMebibyte, kAnyPositive, out.maximumBytes);
+  store.read("max_bytes", kMebibyte, Section::kAnyPositive, out.maximumBytes);
   store.read("max_age_days", 1, 36'500, out.maximumAge);
 }
 
@@ -63,95 +43,33 @@ bool isDeviceName(std::string_view name) {
   return name.size() <= 64 && name.find_first_not_of(kAllowed) == std::string_view::npos;
 }
 
-/// Whether `url` is `<scheme>://` and more, without blanks, a query or a fragment.
-bool isUrl(std::string_view url, std::initializer_list<std::string_view> schemes) {
-  for (const std::string_view scheme : schemes) {
-    if (!url.starts_with(scheme) || !url.substr(scheme.size()).starts_with("://")) continue;
-    const std::string_view rest = url.substr(scheme.size() + 3);
-    return !rest.empty() && rest.front() != '/' && rest.find_first_of(" \t\r\n?#") == url.npos;
-  }
-  return false;
-}
-
-bool isHeader(std::string_view name, std::string_view value) {
-  return !name.empty() && name.find_first_of(" \t\r\n:") == name.npos &&
-         value.find_first_of("\r\n") == value.npos;
-}
-
-void readTls(Section& section, Configuration::Tls& out) {
-  section.read("tls_ca", out.authority);
-  section.read("tls_certificate", out.certificate);
-  section.read("tls_key", out.key);
-  section.require("tls_key", !out.key.empty() || out.certificate.empty());
-  section.require("tls_certificate", !out.certificate.empty() || out.key.empty());
-}
-
-void readNats(Findings& findings, const toml::table* table, Configuration::Nats& out) {
-  Section nats(findings, table, "agent.nats");
-  nats.read(
-      "urls", "a list of addresses, each \"nats://…\" or \"tls://…\", none twice",
-      [](std::string_view url) {
-        return isUrl(url, {"nats", "tls"});
-      },
-      out.urls);
-  nats.require("urls", !out.urls.empty());
-  nats.read(
-      "stream", "a name without blanks, \".\", \"*\", \">\", \"/\" and \"\\\"",
-      [](std::string_view name) { return name.find_first_of(" \t\r\n.*>/\\") == name.npos; },
-      out.stream);
-  nats.read("create_stream", out.createStream);
-  nats.require("stream", !out.stream.empty() || !out.createStream);
-  nats.read("replicas", 1, 5, out.replicas);
-  nats.read("duplicate_window_seconds", 1, 30 * kDaySeconds, out.duplicateWindow);
-  nats.read("credentials", out.credentials);
-  readTls(nats, out.tls);
-  nats.read("acknowledge_seconds", 1, 600, out.acknowledge);
-  nats.read("gather_seconds", 0, kDaySeconds, out.gather);
-}
-
-void readOtlp(Findings& findings, const toml::table* table, Configuration::Otlp& out) {
-  Section otlp(findings, table, "agent.otlp");
-  otlp.read(
-      "endpoint", "an address, \"http://…\" or \"https://…\"",
-      [](std::string_view url) {
-        return isUrl(url, {"http", "https"});
-      },
-      out.endpoint);
-  otlp.read("headers", "a string without line breaks, for a header's name", isHeader, out.headers);
-  otlp.read("gzip", out.gzip);
-  readTls(otlp, out.tls);
-  otlp.read("connect_seconds", 1, 600, out.connect);
-  otlp.read("timeout_seconds", 1, 600, out.timeout);
-  otlp.read("gather_seconds", 0, kDaySeconds, out.gather);
-}
-
-void readAgent(Findings& findings, const toml::table* table, Configuration::Agent& out) {
-  Section agent(findings, table, "agent");
+void readAgent(Section agent, std::span<const BackendKind> backends, Configuration::Agent& out) {
+  std::vector<std::string_view> names{kStore};
+  for (const BackendKind& backend : backends) names.push_back(backend.name);
   agent.read(
-      "backends", R"(a list of "store", "nats", "otlp", each at most once)",
-      [](std::string_view name) { return name == "store" || name == "nats" || name == "otlp"; },
+      "backends", fmt::format("a list of \"{}\", each at most once", fmt::join(names, "\", \"")),
+      [&names](std::string_view name) { return std::ranges::find(names, name) != names.end(); },
       out.backends);
   agent.read("export", out.exports);
   agent.read("drain_rows_per_second", 1, 1'000'000, out.drainRowsPerSecond);
   agent.read("device", "a name of letters, digits, \"-\" and \"_\", 64 at most", isDeviceName,
              out.device);
-  readNats(findings, agent.table("nats"), out.nats);
-  readOtlp(findings, agent.table("otlp"), out.otlp);
+  for (const BackendKind& backend : backends) {
+    Section section = agent.section(backend.name);
+    out.settings.insert_or_assign(std::string(backend.name), backend.readSettings(section));
+  }
 }
 
-void readAnalytics(Findings& findings, const toml::table* table, Configuration& out) {
-  Section analytics(findings, table, "analytics");
+void readAnalytics(Section analytics, Configuration& out) {
   analytics.read(
       "wanted", "a list of patterns of event names, none empty and none twice",
       [](std::string_view pattern) { return !pattern.empty(); }, out.analyticsWanted);
 }
 
-void readTallix(Findings& findings, const toml::table* table, Configuration::Tallix& out) {
-  Section tallix(findings, table, "tallix");
+void readTallix(Section tallix, Configuration::Tallix& out) {
   tallix.read("root", out.root);
-  for (const toml::table* channelTable : tallix.tables("channel")) {
+  for (Section& section : tallix.sections("channel")) {
     Configuration::TallixChannel channel;
-    Section section(findings, channelTable, "tallix.channel");
     section.read("group", channel.group);
     section.read("subgroup", channel.subgroup);
     section.read("name", channel.name);
@@ -164,16 +82,14 @@ void readTallix(Findings& findings, const toml::table* table, Configuration::Tal
   }
 }
 
-void readOrientation(Findings& findings, const toml::table* table, Configuration& out) {
+void readOrientation(Section orientation, Configuration& out) {
   using Source = Configuration::OrientationSource;
-  Section orientation(findings, table, "orientation");
   orientation.read<Source>("source",
                            {{"none", Source::none}, {"files", Source::files}, {"iio", Source::iio}},
                            out.orientation);
 }
 
-void readLimits(Findings& findings, const toml::table* table, Configuration::Limits& out) {
-  Section limits(findings, table, "limits");
+void readLimits(Section limits, Configuration::Limits& out) {
   limits.read("message_bytes", 1024, kGibibyte, out.messageBytes);
   limits.read("reply_bytes", 1024, kGibibyte, out.replyBytes);
   limits.read("frame_seconds", 1, kDaySeconds, out.frame);
@@ -184,46 +100,39 @@ void readLimits(Findings& findings, const toml::table* table, Configuration::Lim
   limits.read("connections", 1, 1'000'000, out.connections);
 }
 
-Configuration readRoot(Findings& findings, const toml::table& table) {
-  Configuration out;
-  Section root(findings, &table, "");
-  readDevice(findings, root.table("device"), out);
-  readLog(findings, root.table("log"), out);
-  readStore(findings, root.table("store"), out.store);
-  readAgent(findings, root.table("agent"), out.agent);
-  readAnalytics(findings, root.table("analytics"), out);
-  readTallix(findings, root.table("tallix"), out.tallix);
-  readOrientation(findings, root.table("orientation"), out);
-  readLimits(findings, root.table("limits"), out.limits);
-  return out;
+void readRoot(Section& root, std::span<const BackendKind> backends, Configuration& out) {
+  root.section("device").readAll(out.device);
+  readLog(root.section("log"), out);
+  readStore(root.section("store"), out.store);
+  readAgent(root.section("agent"), backends, out.agent);
+  readAnalytics(root.section("analytics"), out);
+  readTallix(root.section("tallix"), out.tallix);
+  readOrientation(root.section("orientation"), out);
+  readLimits(root.section("limits"), out.limits);
 }
 
 }  // namespace
 
 std::vector<std::string> Configuration::Agent::remoteBackends() const {
   std::vector<std::string> remote = backends;
-  std::erase(remote, "store");
+  std::erase(remote, kStore);
   return remote;
 }
 
 Result<Configuration> Configuration::read(const std::filesystem::path& file,
+                                          std::span<const BackendKind> backends,
                                           std::vector<std::string>& warnings) {
-  const Result<std::string> content = ReadWholeFile(file);
-  if (!content) {
-    const std::int64_t status = content.error().code;
-    if (status == ENOENT || status == ENOTDIR) return Configuration{};
-    return Error::because(
-        "quarvel.configuration", 1,
-        fmt::format("{}: {}.", file.native(), std::strerror(static_cast<int>(status))));
+  const Result<std::string> text = ReadWholeFile(file);
+  const int status = text ? 0 : static_cast<int>(text.error().code);
+  if (status != 0 && status != ENOENT && status != ENOTDIR) {
+    return Error::because("quarvel.configuration", 1,
+                          fmt::format("{}: {}.", file.native(), std::strerror(status)));
   }
-  Findings findings(file, warnings);
   Configuration configuration;
-  try {
-    configuration = readRoot(findings, toml::parse(content.value(), file.native()));
-  } catch (const toml::parse_error& fault) {
-    findings.syntaxFault(fault);
-  }
-  if (findings.error()) return *findings.error();
+  auto error = ReadConfigurationText(
+      status == 0 ? text.value() : std::string(), file,
+      [&](Section& root) { readRoot(root, backends, configuration); }, warnings);
+  if (error) return *std::move(error);
   return configuration;
 }
 

@@ -5,100 +5,105 @@
 #include <cstdint>
 #include <filesystem>
 #include <map>
+#include <memory>
+#include <span>
 #include <string>
 #include <string_view>
-#include <variant>
 #include <vector>
 
 #include "base/Error.h"
 #include "platform/Log.h"
+#include "system/ConfigurationSection.h"
 
 namespace quarvel {
 
-/// The platform configuration, quarvel.toml. Every key is optional.
+/// Settings of one remote backend, a backend that is fed from the store. Each engine derives its
+/// own struct from this, and the rest of the service uses no other part of it. Constant once read;
+/// shared by the configuration and the engine.
+struct BackendSettings {
+  virtual ~BackendSettings() = default;
+
+  std::chrono::seconds gather{0};  // how long rows are collected before a batch is sent
+};
+
+/// A remote backend that [agent] may name, and the reader of its section [agent.<name>].
+struct BackendKind {
+  std::string_view name;
+  /// Reads and checks the section, which may be absent. Never null.
+  std::shared_ptr<const BackendSettings> (*readSettings)(ConfigurationSection& section);
+};
+
+/// The platform configuration, quarvel.toml, with a default for every key. A value type. The
+/// process's own (`process`) is read once and constant, so that any thread may use it.
 struct Configuration {
   /// [device]: the device properties.
-  std::map<std::string, std::variant<bool, std::int64_t, std::string>, std::less<>> device;
+  std::map<std::string, ConfigurationSection::Scalar, std::less<>> device;
 
+  /// [log]: the least urgent level that is written.
   LogLevel logLevel = LogLevel::standard;
 
+  /// [store]
   struct Store {
     std::filesystem::path path;  // empty: telemetry.db in the state directory
-    std::chrono::milliseconds sync{1000};
-    std::uint64_t maximumBytes = 268'435'456;
-    std::chrono::days maximumAge{14};
+    std::chrono::milliseconds sync{
+        1000};  // a row is on the medium at most this long after queueing
+    std::uint64_t maximumBytes = 268'435'456;  // the oldest rows are removed above it
+    std::chrono::days maximumAge{14};          // likewise
   } store;
 
-  /// Files in PEM; empty: the system's authorities, and no certificate of one's own.
-  struct Tls {
-    std::filesystem::path authority, certificate, key;
-  };
-  /// The backend "nats".
-  struct Nats {
-    std::vector<std::string> urls{"nats://localhost:4222"};
-    std::string stream = "QUARVEL";  // empty: whichever has the subject, and nobody checks
-    bool createStream = false;       // with the next two
-    int replicas = 3;
-    std::chrono::seconds duplicateWindow{120};
-    std::filesystem::path credentials;  // empty: none
-    Tls tls;
-    std::chrono::seconds acknowledge{10};  // how long acknowledgements may take
-    std::chrono::seconds gather{0};        // how long rows are collected before they are sent
-  };
-  /// The backend "otlp".
-  struct Otlp {
-    std::string endpoint = "http://localhost:4318";
-    std::map<std::string, std::string> headers;
-    bool gzip = true;
-    Tls tls;
-    std::chrono::seconds connect{5};
-    std::chrono::seconds timeout{10};  // of a whole request
-    std::chrono::seconds gather{0};
-  };
+  /// [agent]
   struct Agent {
     std::vector<std::string> backends{"store"};
-    bool exports = true;
-    std::uint32_t drainRowsPerSecond = 2000;
-    std::string device;  // empty: the host's name
-    Nats nats;
-    Otlp otlp;
+    bool exports = true;                      // consent to rows leaving the device
+    std::uint32_t drainRowsPerSecond = 2000;  // rate limit of draining a backlog
+    std::string device;                       // empty: the host's name
+    /// By the name of each remote backend that the service knows, also of the ones not in
+    /// `backends`.
+    std::map<std::string, std::shared_ptr<const BackendSettings>, std::less<>> settings;
 
-    /// Those of `backends` that are fed from the store.
+    /// The names in `backends` that are fed from the store.
     [[nodiscard]] std::vector<std::string> remoteBackends() const;
   } agent;
 
+  /// [analytics]: glob patterns of the event names that are recorded.
   std::vector<std::string> analyticsWanted{"*"};
 
+  /// [[tallix.channel]]: one driver counter in a file of its own or in a report.
   struct TallixChannel {
     std::string group, subgroup, name;
     std::filesystem::path file;
     std::string pattern;  // empty: the file holds the integer alone
   };
+  /// [tallix]
   struct Tallix {
     std::filesystem::path root;  // empty: no tree
     std::vector<TallixChannel> channels;
   } tallix;
 
+  /// [orientation]
   enum class OrientationSource { none, files, iio };
   OrientationSource orientation = OrientationSource::none;
 
+  /// [limits]
   struct Limits {
-    std::size_t messageBytes = 1'048'576;
-    std::size_t replyBytes = 1'048'576;
-    std::chrono::milliseconds frame{10'000};
-    std::chrono::milliseconds stall{30'000};
-    unsigned depth = 32;
-    std::size_t queuedCalls = 256;
-    std::size_t queuedBytes = 4'194'304;
-    std::size_t connections = 4096;
+    std::size_t messageBytes = 1'048'576;     // of one message
+    std::size_t replyBytes = 1'048'576;       // held for a client that does not read
+    std::chrono::milliseconds frame{10'000};  // to complete a frame that was begun
+    std::chrono::milliseconds stall{30'000};  // without progress of a client's reading
+    unsigned depth = 32;                      // of nested lists and dictionaries
+    std::size_t queuedCalls = 256;            // of one client
+    std::size_t queuedBytes = 4'194'304;      // likewise
+    std::size_t connections = 4096;           // of all clients
   } limits;
 
   /// The file's name in the configuration directory.
   static constexpr const char* kFileName = "quarvel.toml";
 
-  /// Reads one file; a missing file yields the defaults. `warnings` receives a sentence for each
-  /// unknown key. Errors: domain "quarvel.configuration".
+  /// Reads one file; a missing file yields the defaults. `backends` are the remote backends that
+  /// [agent] may name. `warnings` receives a sentence for each unknown key. Errors: domain
+  /// "quarvel.configuration".
   [[nodiscard]] static Result<Configuration> read(const std::filesystem::path& file,
+                                                  std::span<const BackendKind> backends,
                                                   std::vector<std::string>& warnings);
 };
 

@@ -37,13 +37,14 @@ std::string TextOf(natsStatus status) {
 
 }  // namespace
 
-/// What the stream has answered about the rows of one batch. Any thread.
-class NatsEngine::Answers {
+/// The stream's acknowledgements of the rows of one batch. Lives as long as the process, because
+/// the library may call it after the connection is closed. Any thread.
+class NatsEngine::Acknowledgements {
  public:
   struct Result {
-    std::size_t taken = 0;  // from the first on
+    std::size_t taken = 0;  // rows, counted from the first
     bool all = false;
-    bool refused = false;  // the row behind them
+    bool refused = false;  // the row after them
     bool stopped = false;
     std::string reason;
   };
@@ -59,26 +60,25 @@ class NatsEngine::Answers {
     closed_ = false;
     reason_.clear();
   }
-  /// About a row by its place in the batch: it will not be published, and why.
+  /// Marks a row, by its index in the batch, as one that cannot be published.
   void refuse(std::size_t index, std::string reason) {
     const MutexLock lock(mutex_);
-    settle(index, State::refused, std::move(reason));
+    setState(index, State::refused, std::move(reason));
   }
-  void answered(const char* name, const jsPubAckErr* error) {
+  void acknowledge(const char* name, const jsPubAckErr* error) {
     const MutexLock lock(mutex_);
-    const std::string_view answered(name);
-    if (!answered.starts_with(prefix_)) return;
+    if (!std::string_view(name).starts_with(prefix_)) return;
     const std::int64_t id = std::strtoll(name + prefix_.size(), nullptr, 10);
     const auto found = std::ranges::lower_bound(ids_, id);
     if (found == ids_.end() || *found != id) return;
     const auto index = static_cast<std::size_t>(found - ids_.begin());
     if (error == nullptr) {
-      settle(index, State::taken, {});
+      setState(index, State::taken, {});
       return;
     }
     const bool never = error->ErrCode == JSStreamMessageExceedsMaximumErr;
-    settle(index, never ? State::refused : State::failed,
-           error->ErrText != nullptr ? error->ErrText : natsStatus_GetText(error->Err));
+    setState(index, never ? State::refused : State::failed,
+             error->ErrText != nullptr ? error->ErrText : natsStatus_GetText(error->Err));
   }
   void connectionClosed() {
     const MutexLock lock(mutex_);
@@ -91,9 +91,9 @@ class NatsEngine::Answers {
     changed_.notifyAll();
   }
 
-  /// Waits until every row that was published has been answered, or nothing more is to be expected.
-  Result await(std::chrono::seconds patience) {
-    const auto deadline = std::chrono::steady_clock::now() + patience;
+  /// Waits until every row has its acknowledgement, or no more can come.
+  Result await(std::chrono::seconds limit) {
+    const auto deadline = std::chrono::steady_clock::now() + limit;
     const MutexLock lock(mutex_);
     bool inTime = true;
     while (inTime && waiting_ > 0 && !closed_ && !stopped_) {
@@ -111,7 +111,7 @@ class NatsEngine::Answers {
       result.reason = "the connection was lost";
     } else {
       result.reason =
-          fmt::format("{} rows were not acknowledged within {} s", waiting_, patience.count());
+          fmt::format("{} rows were not acknowledged within {} s", waiting_, limit.count());
     }
     return result;
   }
@@ -119,7 +119,7 @@ class NatsEngine::Answers {
  private:
   enum class State : std::uint8_t { waiting, taken, refused, failed };
 
-  void settle(std::size_t index, State state, std::string reason) QUARVEL_REQUIRES(mutex_) {
+  void setState(std::size_t index, State state, std::string reason) QUARVEL_REQUIRES(mutex_) {
     if (states_[index] == State::waiting) --waiting_;
     states_[index] = state;
     if (reason_.empty()) reason_ = std::move(reason);
@@ -137,24 +137,25 @@ class NatsEngine::Answers {
   std::string reason_ QUARVEL_GUARDED_BY(mutex_);  // the first one
 
  public:
-  /// One that lives as long as the process.
-  static Answers& make() {
+  /// Never destroyed.
+  static Acknowledgements& make() {
     static Mutex mutex;
-    static auto& all = *new std::deque<Answers>;
+    static auto& all = *new std::deque<Acknowledgements>;
     const MutexLock lock(mutex);
     return all.emplace_back();
   }
 };
 
-/// A connection and its JetStream context. With the first failure it is of no more use.
+/// A connection and its JetStream context, for the exporter's thread. Replaced after the first
+/// failure.
 class NatsEngine::Connection {
  public:
-  Connection(const Configuration::Nats& configuration, Answers& answers)
-      : configuration_(configuration), answers_(answers) {}
+  Connection(const NatsSettings& settings, Acknowledgements& acknowledgements)
+      : settings_(settings), acknowledgements_(acknowledgements) {}
   Connection(const Connection&) = delete;
   Connection& operator=(const Connection&) = delete;
   ~Connection() {
-    if (published_) {  // before that the library has no list, and does not look
+    if (published_) {  // before that the library has no list and does not check
       natsMsgList pending{};
       if (js_PublishAsyncGetPendingList(&pending, js_.get()) == NATS_OK) {
         natsMsgList_Destroy(&pending);
@@ -164,7 +165,7 @@ class NatsEngine::Connection {
     if (connection_) natsConnection_Close(connection_.get());
   }
 
-  /// None when that went well, else why not.
+  /// Returns the reason when it fails.
   std::optional<std::string> open(const std::string& name) {
     natsOptions* made = nullptr;
     natsStatus status = natsOptions_Create(&made);
@@ -175,26 +176,26 @@ class NatsEngine::Connection {
     status = natsConnection_Connect(&connected, made);
     connection_.reset(connected);
     if (status != NATS_OK) {
-      return fmt::format("{} cannot be reached: {}", fmt::join(configuration_.urls, ", "),
+      return fmt::format("{} cannot be reached: {}", fmt::join(settings_.urls, ", "),
                          TextOf(status));
     }
     jsOptions jetStream;
     jsOptions_Init(&jetStream);
     jetStream.Wait = milliseconds();
     jetStream.PublishAsync.AckHandler = [](jsCtx*, natsMsg* message, jsPubAck*, jsPubAckErr* error,
-                                           void* answers) {
+                                           void* acknowledgements) {
       const char* row = nullptr;
       if (natsMsgHeader_Get(message, "Nats-Msg-Id", &row) == NATS_OK) {
-        static_cast<Answers*>(answers)->answered(row, error);
+        static_cast<Acknowledgements*>(acknowledgements)->acknowledge(row, error);
       }
       natsMsg_Destroy(message);
     };
-    jetStream.PublishAsync.AckHandlerClosure = &answers_;
+    jetStream.PublishAsync.AckHandlerClosure = &acknowledgements_;
     jsCtx* js = nullptr;
     status = natsConnection_JetStream(&js, connected, &jetStream);
     js_.reset(js);
     if (status != NATS_OK) return TextOf(status);
-    return configuration_.stream.empty() ? std::nullopt : prepareStream();
+    return settings_.stream.empty() ? std::nullopt : prepareStream();
   }
 
   natsStatus publish(const std::string& subject, const std::string& name, const std::string& body) {
@@ -204,7 +205,7 @@ class NatsEngine::Connection {
     jsPubOptions options;
     jsPubOptions_Init(&options);
     options.MsgId = name.c_str();
-    if (!configuration_.stream.empty()) options.ExpectStream = configuration_.stream.c_str();
+    if (!settings_.stream.empty()) options.ExpectStream = settings_.stream.c_str();
     if (status == NATS_OK) status = js_PublishMsgAsync(js_.get(), &message, &options);
     published_ = published_ || status == NATS_OK;
     natsMsg_Destroy(message);
@@ -212,14 +213,12 @@ class NatsEngine::Connection {
   }
 
  private:
-  [[nodiscard]] std::int64_t milliseconds() const {
-    return configuration_.acknowledge.count() * 1000;
-  }
+  [[nodiscard]] std::int64_t milliseconds() const { return settings_.acknowledge.count() * 1000; }
 
   natsStatus configure(natsOptions* options, const std::string& name) {
     std::vector<const char*> urls;
-    for (const std::string& url : configuration_.urls) urls.push_back(url.c_str());
-    const auto& [authority, certificate, key] = configuration_.tls;
+    for (const std::string& url : settings_.urls) urls.push_back(url.c_str());
+    const auto& [authority, certificate, key] = settings_.tls;
     natsStatus status = NATS_OK;
     const auto also = [&status](natsStatus next) {
       if (status == NATS_OK) status = next;
@@ -227,13 +226,15 @@ class NatsEngine::Connection {
     also(natsOptions_SetServers(options, urls.data(), static_cast<int>(urls.size())));
     also(natsOptions_SetName(options, name.c_str()));
     also(natsOptions_SetTimeout(options, kConnectMilliseconds));
-    // The exporter backs off by itself, and a library that tried meanwhile would cost wake-ups.
+    // The exporter has its own back-off; reconnecting by the library would cost wake-ups.
     also(natsOptions_SetAllowReconnect(options, false));
     also(natsOptions_SetPingInterval(options, kPingMilliseconds));
     also(natsOptions_SetClosedCB(
         options,
-        [](natsConnection*, void* answers) { static_cast<Answers*>(answers)->connectionClosed(); },
-        &answers_));
+        [](natsConnection*, void* acknowledgements) {
+          static_cast<Acknowledgements*>(acknowledgements)->connectionClosed();
+        },
+        &acknowledgements_));
     if (!authority.empty()) {
       also(natsOptions_LoadCATrustedCertificates(options, authority.c_str()));
       also(natsOptions_SetSecure(options, true));
@@ -241,22 +242,22 @@ class NatsEngine::Connection {
     if (!certificate.empty()) {
       also(natsOptions_LoadCertificatesChain(options, certificate.c_str(), key.c_str()));
     }
-    if (!configuration_.credentials.empty()) {
-      also(natsOptions_SetUserCredentialsFromFiles(options, configuration_.credentials.c_str(),
-                                                   nullptr));
+    if (!settings_.credentials.empty()) {
+      also(
+          natsOptions_SetUserCredentialsFromFiles(options, settings_.credentials.c_str(), nullptr));
     }
     return status;
   }
 
   std::optional<std::string> prepareStream() {
-    const char* const name = configuration_.stream.c_str();
+    const char* const name = settings_.stream.c_str();
     jsStreamInfo* found = nullptr;
     jsErrCode code{};
     natsStatus status = js_GetStreamInfo(&found, js_.get(), name, nullptr, &code);
     Owned<jsStreamInfo, jsStreamInfo_Destroy> info(found);
     if (status == NATS_OK) return std::nullopt;
     if (status != NATS_NOT_FOUND) return fmt::format("its stream {}: {}", name, TextOf(status));
-    if (!configuration_.createStream) {
+    if (!settings_.createStream) {
       return fmt::format("it has no stream {}: make it, or set create_stream in [agent.nats]",
                          name);
     }
@@ -266,36 +267,36 @@ class NatsEngine::Connection {
     stream.Name = name;
     stream.Subjects = subjects;
     stream.SubjectsLen = 1;
-    stream.Replicas = configuration_.replicas;
-    stream.Duplicates = std::chrono::nanoseconds(configuration_.duplicateWindow).count();
+    stream.Replicas = settings_.replicas;
+    stream.Duplicates = std::chrono::nanoseconds(settings_.duplicateWindow).count();
     status = js_AddStream(&found, js_.get(), &stream, nullptr, &code);
     info.reset(found);
     if (status == NATS_OK) return std::nullopt;
     return fmt::format("its stream {} cannot be made: {}", name, TextOf(status));
   }
 
-  const Configuration::Nats& configuration_;
-  Answers& answers_;
+  const NatsSettings& settings_;
+  Acknowledgements& acknowledgements_;
   Owned<natsConnection, natsConnection_Destroy> connection_;
   Owned<jsCtx, jsCtx_Destroy> js_;
   bool published_ = false;
 };
 
-NatsEngine::NatsEngine(Configuration::Nats configuration, const ExportDevice& device)
-    : configuration_(std::move(configuration)),
+NatsEngine::NatsEngine(NatsSettings settings, const ExportDevice& device)
+    : settings_(std::move(settings)),
       name_(fmt::format("quarveld {} {}", device.version, device.name)),
       subject_(fmt::format("quarvel.{}.", device.name)),
-      answers_(Answers::make()) {}
+      acknowledgements_(Acknowledgements::make()) {}
 
 NatsEngine::~NatsEngine() = default;
 
 Delivery NatsEngine::deliver(const ExportBatch& batch) {
-  answers_.expect(batch);
+  acknowledgements_.expect(batch);
   if (!connection_) {
-    connection_ = std::make_unique<Connection>(configuration_, answers_);
+    connection_ = std::make_unique<Connection>(settings_, acknowledgements_);
     if (auto reason = connection_->open(name_)) {
       connection_.reset();
-      return {.rest = Delivery::Rest::again, .reason = std::move(*reason)};
+      return {.remainder = Delivery::Remainder::again, .reason = std::move(*reason)};
     }
   }
   const std::string subject = subject_ + StoreTableName(batch.table);
@@ -306,37 +307,37 @@ Delivery NatsEngine::deliver(const ExportBatch& batch) {
     AppendRowJson(body, batch.table, batch.rows[i]);
     const natsStatus status = connection_->publish(subject, batch.nameOf(batch.rows[i]), body);
     if (status == NATS_MAX_PAYLOAD) {
-      answers_.refuse(i, fmt::format("{} bytes are more than it allows", body.size()));
+      acknowledgements_.refuse(i, fmt::format("{} bytes are more than it allows", body.size()));
     } else if (status != NATS_OK) {
       failure = TextOf(status);
-      answers_.connectionClosed();
+      acknowledgements_.connectionClosed();
     }
   }
-  Answers::Result result = answers_.await(configuration_.acknowledge);
+  Acknowledgements::Result result = acknowledgements_.await(settings_.acknowledge);
   if (result.all) return {.taken = result.taken};
-  if (result.stopped) return {.taken = result.taken, .rest = Delivery::Rest::stopped};
+  if (result.stopped) return {.taken = result.taken, .remainder = Delivery::Remainder::stopped};
   if (result.refused) {
     return {.taken = result.taken,
-            .rest = Delivery::Rest::refused,
+            .remainder = Delivery::Remainder::refused,
             .refused = 1,
             .reason = std::move(result.reason)};
   }
   connection_.reset();
   return {.taken = result.taken,
-          .rest = Delivery::Rest::again,
+          .remainder = Delivery::Remainder::again,
           .reason = failure.empty() ? std::move(result.reason) : std::move(failure)};
 }
 
-void NatsEngine::rest() {
+void NatsEngine::disconnect() {
   connection_.reset();
 }
 
 void NatsEngine::stop() {
-  answers_.setStopped(true);
+  acknowledgements_.setStopped(true);
 }
 
 void NatsEngine::resume() {
-  answers_.setStopped(false);
+  acknowledgements_.setStopped(false);
 }
 
 }  // namespace quarvel

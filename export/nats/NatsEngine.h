@@ -6,34 +6,36 @@
 
 #include "export/ExportDevice.h"
 #include "export/ExportEngine.h"
-#include "system/Configuration.h"
+#include "export/nats/NatsSettings.h"
 
 namespace quarvel {
 
-/// A NATS JetStream stream: a message a row, subject `quarvel.<device>.<table>`, body the row as
-/// JSON, its name as the `Nats-Msg-Id` by which the stream drops repeats.
+/// Publishes rows to a NATS JetStream stream: one message for each row, subject
+/// `quarvel.<device>.<table>`, body the row as JSON. The row's name is the `Nats-Msg-Id` by which
+/// the stream drops repeats.
 ///
-/// A row counts as taken when its own acknowledgement has come. Rows are published without waiting
-/// for one another; when something does not get on, the connection is given up with all that waits
-/// in it, and what was not acknowledged goes out again, under the same names, on a new one.
+/// A row is taken once its own acknowledgement has come; rows are published without waiting for one
+/// another. After any failure the connection is closed with all rows in flight, and the rows
+/// without an acknowledgement are sent again, under the same names, on a new connection. Owned and
+/// used as `ExportEngine` says.
 class NatsEngine final : public ExportEngine {
  public:
-  NatsEngine(Configuration::Nats configuration, const ExportDevice& device);
+  NatsEngine(NatsSettings settings, const ExportDevice& device);
   ~NatsEngine() override;
 
   [[nodiscard]] Delivery deliver(const ExportBatch& batch) override;
-  void rest() override;
+  void disconnect() override;
   void stop() override;
   void resume() override;
 
  private:
-  class Answers;
+  class Acknowledgements;
   class Connection;
 
-  const Configuration::Nats configuration_;
-  const std::string name_;     // of the connection
-  const std::string subject_;  // and the table's name
-  Answers& answers_;           // the library may call them after everything else
+  const NatsSettings settings_;
+  const std::string name_;              // of the connection
+  const std::string subject_;           // of every message, up to the table's name
+  Acknowledgements& acknowledgements_;  // outlives this: the library may still call it
   std::unique_ptr<Connection> connection_;
 };
 

@@ -2,6 +2,6 @@
 #include "export/nats/NatsEngine.h"
 
 extern "C" __attribute__((visibility("default"))) quarvel::ExportEngine* QuarvelMakeEngine(
-    const quarvel::Configuration::Agent& agent, const quarvel::ExportDevice& device) {
-  return new quarvel::NatsEngine(agent.nats, device);
+    const quarvel::BackendSettings& settings, const quarvel::ExportDevice& device) {
+  return new quarvel::NatsEngine(static_cast<const quarvel::NatsSettings&>(settings), device);
 }

@@ -11,7 +11,7 @@ namespace quarvel {
 
 namespace {
 
-constexpr int kPollMilliseconds = 1000;  // the library wakes by itself when there is something
+constexpr int kPollMilliseconds = 1000;  // a bound; the library wakes up for news by itself
 
 // The library's handles are all pointers to void.
 struct EasyCleanUp {
@@ -30,9 +30,9 @@ T* OrAbort(T* made) {
   return made;
 }
 
-std::size_t Keep(char* data, std::size_t, std::size_t length, void* body) {
+std::size_t AppendBody(char* data, std::size_t, std::size_t length, void* body) {
   std::string& kept = *static_cast<std::string*>(body);
-  if (kept.size() + length > HttpPoster::kMaximumAnswer) return 0;
+  if (kept.size() + length > HttpPoster::kMaximumBody) return 0;
   kept.append(data, length);
   return length;
 }
@@ -58,7 +58,7 @@ struct HttpPoster::Connection {
     set(CURLOPT_QUICK_EXIT, 1L);
     set(CURLOPT_CONNECTTIMEOUT, static_cast<long>(options.connect.count()));
     set(CURLOPT_TIMEOUT, static_cast<long>(options.timeout.count()));
-    set(CURLOPT_WRITEFUNCTION, Keep);
+    set(CURLOPT_WRITEFUNCTION, AppendBody);
     set(CURLOPT_ERRORBUFFER, reason.data());
     setPath(CURLOPT_CAINFO, options.tls.authority);
     setPath(CURLOPT_SSLCERT, options.tls.certificate);
@@ -98,20 +98,20 @@ bool HttpPoster::isStopped() const {
   return stopped_;
 }
 
-HttpPoster::Answer HttpPoster::post(std::string_view body) {
+HttpPoster::Response HttpPoster::post(std::string_view body) {
   Connection& used = connection();
-  Answer answer;
-  used.set(CURLOPT_WRITEDATA, &answer.body);
+  Response response;
+  used.set(CURLOPT_WRITEDATA, &response.body);
   used.set(CURLOPT_POSTFIELDS, body.data());
   used.set(CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(body.size()));
   used.reason[0] = '\0';
 
   curl_multi_add_handle(used.multi.get(), used.easy.get());
   int running = 1;
-  while (running > 0 && !answer.stopped) {
+  while (running > 0 && !response.stopped) {
     if (curl_multi_perform(used.multi.get(), &running) != CURLM_OK) break;
     if (running > 0) curl_multi_poll(used.multi.get(), nullptr, 0, kPollMilliseconds, nullptr);
-    answer.stopped = isStopped();
+    response.stopped = isStopped();
   }
   CURLcode result = CURLE_ABORTED_BY_CALLBACK;
   int waiting = 0;
@@ -120,20 +120,20 @@ HttpPoster::Answer HttpPoster::post(std::string_view body) {
   }
   if (result == CURLE_OK) {
     curl_off_t seconds = 0;
-    curl_easy_getinfo(used.easy.get(), CURLINFO_RESPONSE_CODE, &answer.status);
+    curl_easy_getinfo(used.easy.get(), CURLINFO_RESPONSE_CODE, &response.status);
     curl_easy_getinfo(used.easy.get(), CURLINFO_RETRY_AFTER, &seconds);
-    if (seconds > 0) answer.retryAfter = std::chrono::seconds(seconds);
-    answer.stopped = false;
+    if (seconds > 0) response.retryAfter = std::chrono::seconds(seconds);
+    response.stopped = false;
   } else if (result == CURLE_WRITE_ERROR) {
-    answer.failure = "the answer is longer than allowed";
+    response.failure = "the answer is longer than allowed";
   } else {
-    answer.failure = used.reason[0] != '\0' ? used.reason.data() : curl_easy_strerror(result);
+    response.failure = used.reason[0] != '\0' ? used.reason.data() : curl_easy_strerror(result);
   }
   curl_multi_remove_handle(used.multi.get(), used.easy.get());
-  return answer;
+  return response;
 }
 
-void HttpPoster::rest() {
+void HttpPoster::disconnect() {
   const MutexLock lock(mutex_);
   connection_.reset();
 }

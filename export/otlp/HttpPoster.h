@@ -8,22 +8,22 @@
 #include <string_view>
 
 #include "base/Mutex.h"
-#include "system/Configuration.h"
+#include "export/ExportSettings.h"
 
 namespace quarvel {
 
-/// Posts bodies to one address, on one connection that is kept until `rest`. Follows no redirect
-/// and asks no proxy: what leaves the device goes where the configuration says, or nowhere. For one
-/// thread, but for `stop` and `resume`.
+/// Posts bodies to one address, on one connection that is kept until `disconnect`. Follows no
+/// redirect and asks no proxy, so that rows reach the configured address or none. Owned by its
+/// engine and used on the exporter's thread, but for `stop` and `resume`.
 class HttpPoster {
  public:
-  /// An answer's body beyond this is not read, and the answer counts for none.
-  static constexpr std::size_t kMaximumAnswer = 64 * 1024;
+  /// A response with a longer body is not read to its end and counts as none.
+  static constexpr std::size_t kMaximumBody = 64 * 1024;
 
   struct Options {
     std::string url;
     std::map<std::string, std::string> headers;
-    Configuration::Tls tls;
+    TlsSettings tls;
     std::chrono::seconds connect{5};
     std::chrono::seconds timeout{10};  // of a whole request
   };
@@ -32,17 +32,19 @@ class HttpPoster {
   HttpPoster(const HttpPoster&) = delete;
   HttpPoster& operator=(const HttpPoster&) = delete;
 
-  struct Answer {
-    long status = 0;      // 0: there was none
-    std::string failure;  // why
-    bool stopped = false;
-    std::string body;
-    std::optional<std::chrono::seconds> retryAfter;
+  struct Response {
+    long status = 0;        // 0: there was no response
+    std::string failure{};  // the reason why there was none
+    bool stopped = false;   // by `stop`
+    std::string body{};
+    std::optional<std::chrono::seconds> retryAfter{};
   };
-  [[nodiscard]] Answer post(std::string_view body) QUARVEL_EXCLUDES(mutex_);
-  void rest() QUARVEL_EXCLUDES(mutex_);
+  /// Blocks until the response is complete, `timeout` is over or `stop` is called.
+  [[nodiscard]] Response post(std::string_view body) QUARVEL_EXCLUDES(mutex_);
+  /// Closes the connection; the next `post` opens another one.
+  void disconnect() QUARVEL_EXCLUDES(mutex_);
 
-  // Any thread. From now on until `resume` a request, also one under way, ends at once.
+  // Any thread. Between `stop` and `resume` a request ends at once, also one in flight.
   void stop() QUARVEL_EXCLUDES(mutex_);
   void resume() QUARVEL_EXCLUDES(mutex_);
 

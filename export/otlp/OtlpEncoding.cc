@@ -39,7 +39,7 @@ void AppendDictionary(std::string& out, const Dictionary& dictionary) {
   for (const auto& [key, value] : dictionary) {
     if (!std::exchange(first, false)) out += ',';
     out += R"({"key":)";
-    AppendJson(out, Value(*key.string()));  // as every key of what was JSON
+    AppendJson(out, Value(*key.string()));  // JSON has only text keys
     out += R"(,"value":)";
     AppendAnyValue(out, value);
     out += '}';
@@ -151,7 +151,7 @@ void AppendRecord(std::string& out, const ExportBatch& batch, const ExportRow& r
   out += '}';
 }
 
-const Value* Found(const Value* value, const char* key) {
+const Value* FindKey(const Value* value, const char* key) {
   return value == nullptr || value->dictionary() == nullptr ? nullptr
                                                             : value->dictionary()->find(key);
 }
@@ -185,14 +185,14 @@ Result<OtlpPartialSuccess> ReadOtlpResponse(std::string_view body) {
     return Error::because("quarvel.otlp", 1, "The answer is not one of OTLP's in JSON.");
   }
   OtlpPartialSuccess partial;
-  const Value* const said = Found(&response.value(), "partialSuccess");
-  const Value* const rejected = Found(said, "rejectedLogRecords");
+  const Value* const said = FindKey(&response.value(), "partialSuccess");
+  const Value* const rejected = FindKey(said, "rejectedLogRecords");
   if (rejected != nullptr && rejected->string() != nullptr) {
     partial.rejected = std::strtoull(rejected->string()->c_str(), nullptr, 10);
   } else if (rejected != nullptr && rejected->integer() != nullptr && *rejected->integer() > 0) {
     partial.rejected = static_cast<std::size_t>(*rejected->integer());
   }
-  const Value* const message = Found(said, "errorMessage");
+  const Value* const message = FindKey(said, "errorMessage");
   if (message != nullptr && message->string() != nullptr) partial.message = *message->string();
   return partial;
 }

@@ -15,24 +15,23 @@ namespace quarvel {
 namespace {
 
 constexpr std::string_view kPath = "/v1/logs";
-constexpr std::size_t kQuotedBytes = 200;  // of what an engine says of itself
+constexpr std::size_t kQuotedBytes = 200;  // of a response's body, in the ledger and the log
 
 std::string AddressOf(std::string endpoint) {
   while (endpoint.ends_with('/')) endpoint.pop_back();
   return endpoint.ends_with(kPath) ? endpoint : endpoint.append(kPath);
 }
 
-HttpPoster::Options OptionsOf(const Configuration::Otlp& configuration,
-                              const ExportDevice& device) {
-  HttpPoster::Options options{AddressOf(configuration.endpoint), configuration.headers,
-                              configuration.tls, configuration.connect, configuration.timeout};
+HttpPoster::Options OptionsOf(const OtlpSettings& settings, const ExportDevice& device) {
+  HttpPoster::Options options{AddressOf(settings.endpoint), settings.headers, settings.tls,
+                              settings.connect, settings.timeout};
   options.headers["Content-Type"] = "application/json";
   options.headers["User-Agent"] = "quarveld/" + device.version;
-  if (configuration.gzip) options.headers["Content-Encoding"] = "gzip";
+  if (settings.gzip) options.headers["Content-Encoding"] = "gzip";
   return options;
 }
 
-std::string Gzipped(const std::string& text) {
+std::string Gzip(const std::string& text) {
   constexpr int kGzipWindow = 15 + 16;
   constexpr int kMemory = 8;
   z_stream stream{};
@@ -51,8 +50,8 @@ std::string Gzipped(const std::string& text) {
   return out;
 }
 
-/// One line of what the engine says, for the ledger and the log.
-std::string Quoted(const std::string& body) {
+/// The begin of a response's body as one line of ASCII, for the ledger and the log.
+std::string QuoteBody(const std::string& body) {
   if (body.empty()) return {};
   std::string quoted = body.substr(0, kQuotedBytes);
   for (char& character : quoted) {
@@ -63,43 +62,47 @@ std::string Quoted(const std::string& body) {
   return fmt::format(" and says \"{}\"", quoted);
 }
 
-bool IsAboutTheBatch(long status) {
-  constexpr std::array kNotAboutTheBatch{401L, 403L, 404L, 405L, 407L, 408L,
-                                         415L, 429L, 502L, 503L, 504L};
-  return status >= 400 && std::ranges::find(kNotAboutTheBatch, status) == kNotAboutTheBatch.end();
+/// Whether the collector refuses the rows themselves, so that sending them again is of no use.
+bool RefusesBatch(long status) {
+  constexpr std::array kRetryLater{401L, 403L, 404L, 405L, 407L, 408L,
+                                   415L, 429L, 502L, 503L, 504L};
+  return status >= 400 && std::ranges::find(kRetryLater, status) == kRetryLater.end();
 }
 
-Delivery Taken(const HttpPoster::Answer& answer, std::size_t rows) {
-  const auto said = ReadOtlpResponse(answer.body);
-  if (!said) {  // whoever answers for a network that is not reached, say
-    return {.rest = Delivery::Rest::again,
-            .reason = fmt::format("{} is answered, but not by OTLP", answer.status)};
+Delivery AcceptedDelivery(const HttpPoster::Response& response, std::size_t rows) {
+  const auto partial = ReadOtlpResponse(response.body);
+  if (!partial) {  // for example the log-in page of a public network
+    return {.remainder = Delivery::Remainder::again,
+            .reason = fmt::format("{} is answered, but not by OTLP", response.status)};
   }
   return {.taken = rows,
-          .reason = said.value().message,
-          .droppedByEngine = std::min(said.value().rejected, rows)};
+          .reason = partial.value().message,
+          .droppedByEngine = std::min(partial.value().rejected, rows)};
 }
 
 }  // namespace
 
-OtlpEngine::OtlpEngine(const Configuration::Otlp& configuration, ExportDevice device)
-    : device_(std::move(device)),
-      gzip_(configuration.gzip),
-      poster_(OptionsOf(configuration, device_)) {}
+OtlpEngine::OtlpEngine(const OtlpSettings& settings, ExportDevice device)
+    : device_(std::move(device)), gzip_(settings.gzip), poster_(OptionsOf(settings, device_)) {}
 
 Delivery OtlpEngine::deliver(const ExportBatch& batch) {
   const std::string request = OtlpRequest(batch, device_);
-  const HttpPoster::Answer answer = poster_.post(gzip_ ? Gzipped(request) : request);
-  if (answer.stopped) return {.rest = Delivery::Rest::stopped};
-  if (answer.status == 0) return {.rest = Delivery::Rest::again, .reason = answer.failure};
-  if (answer.status / 100 == 2) return Taken(answer, batch.rows.size());
-  Delivery delivery{.reason = fmt::format("it answers {}{}", answer.status, Quoted(answer.body))};
-  if (IsAboutTheBatch(answer.status)) {
-    delivery.rest = Delivery::Rest::refused;
-    delivery.refused = batch.rows.size();
+  return DeliveryFromResponse(poster_.post(gzip_ ? Gzip(request) : request), batch.rows.size());
+}
+
+Delivery DeliveryFromResponse(const HttpPoster::Response& response, std::size_t rows) {
+  if (response.stopped) return {.remainder = Delivery::Remainder::stopped};
+  if (response.status == 0)
+    return {.remainder = Delivery::Remainder::again, .reason = response.failure};
+  if (response.status / 100 == 2) return AcceptedDelivery(response, rows);
+  Delivery delivery{.reason =
+                        fmt::format("it answers {}{}", response.status, QuoteBody(response.body))};
+  if (RefusesBatch(response.status)) {
+    delivery.remainder = Delivery::Remainder::refused;
+    delivery.refused = rows;
   } else {
-    delivery.rest = Delivery::Rest::again;
-    delivery.after = answer.retryAfter;
+    delivery.remainder = Delivery::Remainder::again;
+    delivery.after = response.retryAfter;
   }
   return delivery;
 }

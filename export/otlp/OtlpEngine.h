@@ -5,21 +5,19 @@
 #include "export/ExportDevice.h"
 #include "export/ExportEngine.h"
 #include "export/otlp/HttpPoster.h"
-#include "system/Configuration.h"
+#include "export/otlp/OtlpSettings.h"
 
 namespace quarvel {
 
-/// Any collector that takes logs by OTLP/HTTP, in the protocol's JSON form.
+/// Sends rows to any collector that takes logs by OTLP/HTTP, in the protocol's JSON form.
 ///
-/// An answer that the protocol calls retryable (429, 502, 503, 504) has the batch wait. So do those
-/// that speak of the connection and not of the batch (a redirect, 401, 403, 404, ...): no row is
-/// given up because a token has run out. Any other refusal is about the batch, and for ever.
+/// Owned and used as `ExportEngine` says. Memory: one request, compressed when configured.
 class OtlpEngine final : public ExportEngine {
  public:
-  OtlpEngine(const Configuration::Otlp& configuration, ExportDevice device);
+  OtlpEngine(const OtlpSettings& settings, ExportDevice device);
 
   [[nodiscard]] Delivery deliver(const ExportBatch& batch) override;
-  void rest() override { poster_.rest(); }
+  void disconnect() override { poster_.disconnect(); }
   void stop() override { poster_.stop(); }
   void resume() override { poster_.resume(); }
 
@@ -28,5 +26,13 @@ class OtlpEngine final : public ExportEngine {
   const bool gzip_;
   HttpPoster poster_;
 };
+
+/// The outcome of a batch of `rows` rows by the collector's response. Pure.
+///
+/// The protocol calls 429, 502, 503 and 504 retryable: the rows wait. They also wait after a status
+/// that concerns the connection and not the rows (a redirect, 401, 403, 404, ...), since no row may
+/// be given up because a token has run out. Any other status of 400 and above refuses the rows for
+/// ever.
+[[nodiscard]] Delivery DeliveryFromResponse(const HttpPoster::Response& response, std::size_t rows);
 
 }  // namespace quarvel

@@ -11,7 +11,7 @@
 
 namespace quarvel {
 
-/// What other threads hand to a test, in their order.
+/// Items that other threads hand to a test, in order.
 template <class T>
 class Collected {
  public:
@@ -20,7 +20,7 @@ class Collected {
     items_.push_back(std::move(item));
     added_.notifyAll();
   }
-  /// The next one, waiting for it; none when it did not come within a time that means never.
+  /// Waits for the next item; none after 30 seconds, which is far longer than any item takes.
   std::optional<T> next() {
     const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
     const MutexLock lock(mutex_);
@@ -31,7 +31,7 @@ class Collected {
     items_.pop_front();
     return item;
   }
-  /// All that are there.
+  /// All items so far.
   std::vector<T> take() {
     const MutexLock lock(mutex_);
     const std::deque<T> taken = std::exchange(items_, {});

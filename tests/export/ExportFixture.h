@@ -13,14 +13,14 @@
 
 namespace quarvel::testing {
 
-/// An engine that keeps the names of what it takes, and answers as it is told.
+/// Records the names of the rows that it takes, and answers each batch with `answer`.
 class RecordingEngine : public ExportEngine {
  public:
   using Answer = std::function<Delivery(const ExportBatch&)>;
 
   static Delivery takeAll(const ExportBatch& batch) { return {.taken = batch.rows.size()}; }
   static Delivery down(const ExportBatch&) {
-    return {.rest = Delivery::Rest::again, .reason = "nobody answers"};
+    return {.remainder = Delivery::Remainder::again, .reason = "no answer"};
   }
 
   Delivery deliver(const ExportBatch& batch) override {
@@ -29,17 +29,17 @@ class RecordingEngine : public ExportEngine {
     for (std::size_t i = 0; i < delivery.taken; ++i) taken.push_back(batch.nameOf(batch.rows[i]));
     return delivery;
   }
-  void rest() override { ++rests; }
+  void disconnect() override { ++disconnects; }
   void stop() override {}
   void resume() override {}
 
   Answer answer = takeAll;
   std::vector<std::string> taken;
   int deliveries = 0;
-  int rests = 0;
+  int disconnects = 0;
 };
 
-/// A store with a remote backend, and an exporter in virtual time.
+/// A store with one remote backend, and an exporter in virtual time.
 class ExportFixture : public StoreFixture {
  protected:
   using Instant = Exporter::Instant;
@@ -55,7 +55,7 @@ class ExportFixture : public StoreFixture {
     store_ = open(options);
     source_.emplace(*store_, path_, "engine");
     exporter_.emplace(Exporter::Options{"engine", rowsPerSecond, gather, [this] { return date(); },
-                                        [this] { return now_; }, [] { return 1.0; }},
+                                        [this] { return now_; }, [this] { return jitter_; }},
                       *source_, engine_);
     next_ = {now_, false};
     Await([this] { return !extent().storeID.empty(); });
@@ -71,7 +71,7 @@ class ExportFixture : public StoreFixture {
     store_->followDurableExtent({});
     return extent;
   }
-  /// Lets the exporter do what is due until then; returns how often it woke up.
+  /// Runs the exporter's steps that are due within `duration`; returns the number of wake-ups.
   int runFor(Duration duration) {
     const Instant end = now_ + duration;
     int wakeUps = 0;
@@ -107,6 +107,7 @@ class ExportFixture : public StoreFixture {
   std::optional<ExportSource> source_;
   std::optional<Exporter> exporter_;
   Instant now_{std::chrono::hours(1)};
+  double jitter_ = 1;
 
  private:
   void advance(Duration duration) {

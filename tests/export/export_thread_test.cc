@@ -2,6 +2,7 @@
 
 #include <gmock/gmock.h>
 
+#include "export/Exporters.h"
 #include "tests/device/Collected.h"
 #include "tests/store/StoreFixture.h"
 
@@ -10,11 +11,14 @@ namespace {
 
 using namespace std::chrono_literals;
 
-/// Tells what it takes, unless it hangs: then it does so until it is stopped.
+constexpr std::int64_t kDisconnected = 0;
+
+/// Reports the ids of the rows that it takes. While `hangs`, a delivery waits until it is stopped.
 class HangingEngine : public ExportEngine {
  public:
   struct Seen {
-    Collected<std::int64_t> taken, hung;
+    Collected<std::int64_t> taken;  // and `kDisconnected`
+    Collected<std::int64_t> hung;
     std::atomic<bool> hangs = false;
   };
   explicit HangingEngine(Seen& seen) : seen_(seen) {}
@@ -23,11 +27,11 @@ class HangingEngine : public ExportEngine {
     const MutexLock lock(mutex_);
     if (seen_.hangs && !stopped_) seen_.hung.add(batch.rows.front().id);
     while (seen_.hangs && !stopped_) changed_.wait(mutex_);
-    if (stopped_) return {.rest = Delivery::Rest::stopped};
+    if (stopped_) return {.remainder = Delivery::Remainder::stopped};
     for (const ExportRow& row : batch.rows) seen_.taken.add(row.id);
     return {.taken = batch.rows.size()};
   }
-  void rest() override {}
+  void disconnect() override { seen_.taken.add(kDisconnected); }
   void stop() override { setStopped(true); }
   void resume() override { setStopped(false); }
 
@@ -46,69 +50,65 @@ class HangingEngine : public ExportEngine {
 
 class ExportThreadTest : public StoreFixture {
  protected:
-  ~ExportThreadTest() override { store_->followDurableExtent({}); }
-
-  ExportThread& exporter(const std::string& backend, HangingEngine::Seen& seen) {
-    store_->followDurableExtent({});  // the store's thread reads the list
-    threads_.push_back(std::make_unique<ExportThread>(
-        Exporter::Options{backend, 1'000'000}, std::make_unique<HangingEngine>(seen), *store_));
-    threads_.back()->start();
-    store_->followDurableExtent([this](const DurableExtent& extent) {
-      for (const auto& thread : threads_) thread->extend(extent);
-    });
-    return *threads_.back();
+  void start(std::initializer_list<std::pair<const char*, HangingEngine::Seen*>> engines,
+             bool exports = true) {
+    std::vector<Exporters::Backend> backends;
+    for (const auto& [name, seen] : engines) {
+      backends.push_back({{name, 1'000'000}, std::make_unique<HangingEngine>(*seen)});
+    }
+    exporters_.emplace(*store_, std::move(backends), exports);
   }
   void addMessage() { ASSERT_TRUE(send(*store_, Payload())); }
 
   std::unique_ptr<TelemetryStore> store_ = open({.sync = 0ms, .remoteBackends = {"dead", "alive"}});
-  std::vector<std::unique_ptr<ExportThread>> threads_;
+  HangingEngine::Seen dead_;
+  HangingEngine::Seen alive_;
+  std::optional<Exporters> exporters_;
 };
 
 TEST_F(ExportThreadTest, ADeadEngineDelaysNeitherAnotherNorTheEnd) {
-  HangingEngine::Seen dead;
-  HangingEngine::Seen alive;
-  dead.hangs = true;
-  ExportThread& hanging = exporter("dead", dead);
-  exporter("alive", alive);
+  dead_.hangs = true;
+  start({{"dead", &dead_}, {"alive", &alive_}});
   for (std::int64_t id = 1; id <= 3; ++id) {
     addMessage();
-    EXPECT_EQ(alive.taken.next(), id);
+    EXPECT_EQ(alive_.taken.next(), id);
   }
-  EXPECT_EQ(dead.hung.next(), 1);
+  EXPECT_EQ(dead_.hung.next(), 1);
+  // Each row wakes it up when it is stored, and again when the cursor is.
+  EXPECT_LE(exporters_->threads().back()->status().wakeUps, 10U) << "it polls";
+  ExportThread& hanging = *exporters_->threads().front();
   hanging.stop();
   EXPECT_TRUE(hanging.awaitEnd(std::chrono::steady_clock::now() + 30s));
   EXPECT_EQ(value("SELECT count(*) FROM backend_cursor WHERE backend = 'dead'"), "0");
 }
 
-TEST_F(ExportThreadTest, HeldItHasNoRowInItsHandsAndReleasedItGoesOn) {
-  HangingEngine::Seen seen;
-  seen.hangs = true;
-  ExportThread& thread = exporter("alive", seen);
+TEST_F(ExportThreadTest, HeldItHoldsNoRowAndReleasedItGoesOn) {
+  alive_.hangs = true;
+  start({{"alive", &alive_}});
+  ExportThread& thread = *exporters_->threads().front();
   addMessage();
-  EXPECT_EQ(seen.hung.next(), 1);
+  EXPECT_EQ(alive_.hung.next(), 1);
   thread.hold();
   thread.hold();
-  seen.hangs = false;
+  alive_.hangs = false;
   addMessage();
   thread.release();
-  EXPECT_EQ(seen.taken.size(), 0U);
+  EXPECT_EQ(alive_.taken.next(), kDisconnected);
+  EXPECT_EQ(alive_.taken.size(), 0U);
   thread.release();
-  EXPECT_EQ(seen.taken.next(), 1);
-  EXPECT_EQ(seen.taken.next(), 2);
+  EXPECT_EQ(alive_.taken.next(), 1);
+  EXPECT_EQ(alive_.taken.next(), 2);
 }
 
-TEST_F(ExportThreadTest, SleepsWhileNothingComes) {
-  HangingEngine::Seen seen;
-  ExportThread& thread = exporter("alive", seen);
+// Rows left when the service was started with `export = false`.
+TEST_F(ExportThreadTest, WithoutConsentAtTheStartNoRowLeaves) {
   addMessage();
-  EXPECT_EQ(seen.taken.next(), 1);
-  std::uint64_t before = 0;
-  do {
-    before = thread.status().wakeUps;
-    std::this_thread::sleep_for(200ms);
-  } while (thread.status().wakeUps != before);
-  std::this_thread::sleep_for(1s);
-  EXPECT_EQ(thread.status().wakeUps, before);
+  awaitStored(*store_);
+  start({{"alive", &alive_}}, /*exports=*/false);
+  EXPECT_EQ(alive_.taken.next(), kDisconnected) << "it must be held before its first row";
+  EXPECT_EQ(alive_.taken.size(), 0U);
+  exporters_->setExports(true);
+  EXPECT_EQ(alive_.taken.next(), 1);
 }
 
 }  // namespace

@@ -2,6 +2,8 @@
 
 #include <gmock/gmock.h>
 
+#include "export/ExportDevice.h"
+#include "export/otlp/OtlpEngine.h"
 #include "tests/LogRecorder.h"
 #include "tests/export/ExportFixture.h"
 
@@ -17,7 +19,7 @@ using ::testing::IsEmpty;
 using ::testing::Le;
 using ::testing::Optional;
 using namespace std::chrono_literals;
-using Rest = Delivery::Rest;
+using Remainder = Delivery::Remainder;
 
 class ExporterTest : public ExportFixture {};
 
@@ -66,17 +68,7 @@ TEST_F(ExporterTest, CarriesEveryTableOutOnceInOrderAndSaysSo) {
   EXPECT_EQ(engine_.taken, names(2501, 2501));
 }
 
-TEST_F(ExporterTest, RestsWhenThereIsNothingToSend) {
-  begin();
-  addMessages(1);
-  runFor(29s);
-  EXPECT_EQ(engine_.rests, 0) << "the connection is kept for what may follow";
-  runFor(2s);
-  EXPECT_EQ(engine_.rests, 1);
-  EXPECT_EQ(runFor(1000h), 0);
-}
-
-TEST_F(ExporterTest, GathersRowsForAsLongAsItIsTold) {
+TEST_F(ExporterTest, GathersRowsAndDisconnectsWhenThereAreNoMore) {
   begin({}, 1'000'000, 60s);
   addMessages(1);
   runFor(59s);
@@ -85,6 +77,11 @@ TEST_F(ExporterTest, GathersRowsForAsLongAsItIsTold) {
   runFor(2s);
   EXPECT_EQ(engine_.deliveries, 1);
   EXPECT_EQ(engine_.taken, names(1, 2));
+  runFor(28s);
+  EXPECT_EQ(engine_.disconnects, 0) << "the connection is kept for rows that may follow";
+  runFor(2s);
+  EXPECT_EQ(engine_.disconnects, 1);
+  EXPECT_EQ(runFor(1000h), 0);
 }
 
 TEST_F(ExporterTest, DrainsABacklogAtItsShare) {
@@ -107,8 +104,8 @@ TEST_F(ExporterTest, AnEngineDownForEightHoursCostsFewWakeUpsAndNoRow) {
   }
   // 1 + 2 + 4 ... + 256 seconds, then one every five minutes.
   EXPECT_THAT(wakeUps, AllOf(Ge(100), Le(110)));
-  EXPECT_THAT(LogRecorder::takeErrors(), ElementsAre(HasSubstr("nobody answers")));
-  EXPECT_THAT(exporter_->status().error, Optional(std::string("nobody answers")));
+  EXPECT_THAT(LogRecorder::takeErrors(), ElementsAre(HasSubstr("no answer")));
+  EXPECT_THAT(exporter_->status().error, Optional(std::string("no answer")));
   EXPECT_THAT(exporter_->status().nextAttempt, Optional(Ge(date())));
   EXPECT_THAT(source_->backlog(exporter_->status().exportedThrough).value(), 9600);
 
@@ -132,43 +129,45 @@ TEST_F(ExporterTest, GoesOnBehindRowsThatRetentionHasTaken) {
   EXPECT_EQ(engine_.taken, names(first, 2000));
 }
 
-TEST_F(ExporterTest, BacksOffAsLongAsTheEngineAsksButNoLongerThanAnHour) {
-  for (const auto& [asked, kept] : {std::pair{90s, 90s}, {1s, 1s}, {86'400s, 3600s}}) {
+TEST_F(ExporterTest, BackOffFollowsTheJitterAndTheEnginesWish) {
+  const struct {
+    const char* name;
+    double jitter;
+    std::optional<std::chrono::seconds> asked;
+    std::chrono::seconds took;  // by the engine, and no part of the back-off
+    std::chrono::milliseconds expected;
+  } cases[] = {
+      {"most jitter", 1, {}, 0s, 1s},
+      {"least jitter", 0, {}, 0s, 500ms},
+      {"a slow engine", 1, {}, 10s, 1s},
+      {"the engine asks for more", 1, 90s, 0s, 90s},
+      {"the engine asks for less", 1, 0s, 0s, 1s},
+      {"the engine asks for more than an hour", 1, 86'400s, 0s, 3600s},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
     begin();
-    engine_.answer = [asked = asked](const ExportBatch&) {
-      return Delivery{.rest = Rest::again, .reason = "busy", .after = asked};
+    jitter_ = c.jitter;
+    engine_.answer = [&](const ExportBatch&) {
+      now_ += c.took;
+      return Delivery{.remainder = Remainder::again, .reason = "busy", .after = c.asked};
     };
     addMessages(1);
-    runFor(1ms);
+    runFor(0s);
     engine_.answer = RecordingEngine::takeAll;
     const int before = engine_.deliveries;
-    runFor(kept - 2ms);
-    EXPECT_EQ(engine_.deliveries, before) << asked.count();
-    runFor(2ms);
-    EXPECT_EQ(engine_.deliveries, before + 1) << asked.count();
+    runFor(c.expected - 1ms);
+    EXPECT_EQ(engine_.deliveries, before);
+    runFor(1ms);
+    EXPECT_EQ(engine_.deliveries, before + 1);
   }
 }
 
-TEST_F(ExporterTest, BacksOffAfterAnEngineThatTookItsTimeNotMeanwhile) {
-  begin();
-  addMessages(1);
-  engine_.answer = [this](const ExportBatch& batch) {
-    now_ += 10s;
-    return RecordingEngine::down(batch);
-  };
-  runFor(0s);
-  engine_.answer = RecordingEngine::takeAll;
-  runFor(999ms);
-  EXPECT_EQ(engine_.deliveries, 1);
-  runFor(1ms);
-  EXPECT_EQ(engine_.deliveries, 2);
-}
-
-TEST_F(ExporterTest, WhatIsTakenOfABatchIsNotSentAgain) {
+TEST_F(ExporterTest, TakenRowsOfABatchAreNotSentAgain) {
   begin();
   addMessages(10);
   engine_.answer = [](const ExportBatch&) {
-    return Delivery{.taken = 4, .rest = Rest::again, .reason = "full"};
+    return Delivery{.taken = 4, .remainder = Remainder::again, .reason = "full"};
   };
   runFor(1ms);
   engine_.answer = RecordingEngine::takeAll;
@@ -185,13 +184,14 @@ TEST_F(ExporterTest, WhatIsTakenOfABatchIsNotSentAgain) {
   EXPECT_EQ(exporter_->status().refusedRows, 2U);
 }
 
-TEST_F(ExporterTest, APoisonousRowIsSetAsideAlone) {
+TEST_F(ExporterTest, ARefusedRowIsSetAsideAlone) {
   begin();
   addMessages(1000);
   engine_.answer = [](const ExportBatch& batch) {
     for (const ExportRow& row : batch.rows) {
       if (row.id == 778) {
-        return Delivery{.rest = Rest::refused, .refused = batch.rows.size(), .reason = "bad row"};
+        return Delivery{
+            .remainder = Remainder::refused, .refused = batch.rows.size(), .reason = "bad row"};
       }
     }
     return RecordingEngine::takeAll(batch);
@@ -210,19 +210,19 @@ TEST_F(ExporterTest, AnEngineThatRefusesEverythingIsNotAskedRowByRow) {
   begin();
   addMessages(3000);
   engine_.answer = [](const ExportBatch& batch) {
-    return Delivery{.rest = Rest::refused, .refused = batch.rows.size(), .reason = "nonsense"};
+    return Delivery{
+        .remainder = Remainder::refused, .refused = batch.rows.size(), .reason = "nonsense"};
   };
   runFor(1s);
   const int firstSecond = engine_.deliveries;
   EXPECT_LE(firstSecond, 25);
   runFor(1h);
-  EXPECT_LE(engine_.deliveries, firstSecond + 20) << "it has time to come to its senses";
+  EXPECT_LE(engine_.deliveries, firstSecond + 20) << "attempts must back off";
   engine_.answer = RecordingEngine::takeAll;
   runFor(10min);
   EXPECT_EQ(value("SELECT sum(rows) FROM export_log"), "3000");
 }
 
-// What was acknowledged and could not be recorded is repeated, under the same names.
 TEST_F(ExporterTest, ACrashRepeatsOneBatchAtMost) {
   begin();
   addMessages(3000);
@@ -258,7 +258,7 @@ TEST_F(ExporterTest, AStoreThatTakesThePlaceOfAnotherIsExportedFromItsBeginning)
   EXPECT_EQ(engine_.taken, names(1, 3));
 }
 
-TEST_F(ExporterTest, WhatAPowerCutMayStillTakeIsNotSent) {
+TEST_F(ExporterTest, RowsThatAPowerCutMayTakeAreNotSent) {
   begin();
   addMessages(10);
   DurableExtent safe = extent();
@@ -267,6 +267,30 @@ TEST_F(ExporterTest, WhatAPowerCutMayStillTakeIsNotSent) {
   now_ += 1s;
   (void)exporter_->step(safe);
   EXPECT_EQ(engine_.taken, names(1, 4));
+}
+
+TEST(OtlpDeliveryTest, OnlyAStatusAboutTheRowsRefusesThem) {
+  for (const long status :
+       {0L, 301L, 401L, 403L, 404L, 405L, 407L, 408L, 415L, 429L, 502L, 503L, 504L}) {
+    const Delivery delivery = DeliveryFromResponse({.status = status, .retryAfter = 7s}, 3);
+    EXPECT_EQ(delivery.remainder, Remainder::again) << status;
+    EXPECT_EQ(delivery.taken + delivery.refused, 0U) << status;
+    EXPECT_EQ(delivery.after.has_value(), status != 0) << status;
+  }
+  for (const long status : {400L, 413L, 422L, 500L, 501L}) {
+    const Delivery delivery = DeliveryFromResponse({.status = status}, 3);
+    EXPECT_EQ(delivery.remainder, Remainder::refused) << status;
+    EXPECT_EQ(delivery.refused, 3U) << status;
+  }
+  EXPECT_EQ(DeliveryFromResponse({.status = 200, .body = "<html>"}, 3).remainder, Remainder::again);
+}
+
+TEST(ExportDeviceTest, NameFitsIntoASubjectAndALabel) {
+  EXPECT_EQ(DeviceName("car-7", "other"), "car-7");
+  EXPECT_EQ(DeviceName("", "Kitchen_2.local lan*\xc3\xa9>"), "Kitchen_2-local-lan----");
+  for (const char* useless : {"", "localhost"}) {
+    EXPECT_THAT(DeviceName("", useless), ::testing::MatchesRegex("unnamed|[0-9a-f]+"));
+  }
 }
 
 }  // namespace
