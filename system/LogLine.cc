@@ -4,6 +4,8 @@
 #include <cstdlib>
 #include <ctime>
 
+#include "base/Mutex.h"
+
 namespace quarvel {
 namespace {
 
@@ -34,8 +36,13 @@ const LocalSecond& localSecond(std::time_t second) {
   thread_local LocalSecond local;
   if (local.second == second) return local;
   std::tm time{};
-  tzset();  // the device may have travelled
-  localtime_r(&second, &time);
+  {
+    // The C library locks by itself, but a thread sanitizer cannot see that.
+    static Mutex& zone = *new Mutex;
+    const MutexLock lock(zone);
+    tzset();  // the device may have travelled
+    localtime_r(&second, &time);
+  }
   local.second = second;
   std::strftime(local.text, sizeof local.text, "%Y-%m-%dT%H:%M:%S", &time);
   const long minutes = std::abs(time.tm_gmtoff) / 60;
