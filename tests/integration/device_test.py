@@ -5,7 +5,6 @@ import os
 import pathlib
 import re
 import subprocess
-import unittest
 
 from harness import PATIENCE, CallError, ServiceTest, eventually
 
@@ -27,13 +26,9 @@ class Drivers(ServiceTest):
         set_counter("Haptics/Stats/taps", 3)
         set_counter("Unrelated/other", 1)
         (service.directory / "etc/quarvel.toml").write_text(
-            f'[tallix]\nroot = "{tree}"\n'
-            f'[[tallix.channel]]\ngroup = "VorrenMXDrv"\nname = "interrupts"\n'
+            f'[tallix]\nroot = "{tree}"\n[[tallix.channel]]\ngroup = "VorrenMXDrv"\nname = "interrupts"\n'
             f'file = "{service.directory}/irq"\npattern = "9: +([0-9]+).*audio"\n')
-        service.start()
-        self.addCleanup(service.finish)
-        client = self.client(service)
-        client.start_session(1)
+        client = self.client(service.start(), session=1)
         set_counter("Speaker/underruns", 12)
         set_counter("Board/MCA/clips", 9)
         set_counter("Unrelated/other", 99)
@@ -55,8 +50,7 @@ class Drivers(ServiceTest):
         document = (pathlib.Path(__file__).parents[2] / "docs/sources.md").read_text()
         [example] = [block for block in re.findall("```toml\n(.*?)```", document, re.DOTALL) if "/proc/interrupts" in block]
         service = self.service(example)
-        client = self.client(service)
-        client.start_session(1)
+        client = self.client(service, session=1)
         client.stop_session(1)
         self.assertIn("subscribed to group group Speaker-(null)", service.log())
         self.assertNotIn("couldn't find any channels for driver group Speaker", service.log())
@@ -74,8 +68,7 @@ class Preferences(ServiceTest):
 
     def test_reporting_and_verbose_lines_are_switched_off_and_on(self):
         service = self.service()
-        client = self.client(service)
-        client.start_session(1)
+        client = self.client(service, session=1)
         service.wait_for_rows(1, "agent_session")
 
         def refused():
@@ -90,9 +83,9 @@ class Preferences(ServiceTest):
         self.assertFalse(refused(), "preferences are read only at a notification")
         service.notify()
         eventually(refused, "reporting is off")
-        service.write_preferences("disable_reporting = fal")
+        service.prefer("disable_reporting = fal")
         service.notify()
-        eventually(lambda: "tarnwick.quarvel.toml" in service.log(), "a line that names the file")
+        service.await_log("tarnwick.quarvel.toml")
         self.assertTrue(refused(), "a faulty file changes nothing")
         service.prefer(disable_reporting=False, device_name="bench 7", reporting_session_verbose=True,
                        reporting_server_verbose=True)
@@ -111,8 +104,7 @@ class Preferences(ServiceTest):
 
     def test_unwanted_events_are_not_recorded(self):
         service = self.service('[analytics]\nwanted = ["tarnwick.quarvel.HAL_*"]\n')
-        client = self.client(service)
-        client.start_session(1)
+        client = self.client(service, session=1)
         for category in (3, 0x20000003, 0x10000003):
             client.message({}, [1], category)
         service.wait_for_rows(3, "message WHERE session_id = 1")
@@ -126,15 +118,12 @@ class InternalBuild(ServiceTest):
     def test_the_history_is_written_with_its_orientations(self):
         service = self.prepared('[device]\nInternalBuild = true\n[orientation]\nsource = "files"\n')
         service.prefer(reporting_session_verbose=True)
-        service.start()
-        self.addCleanup(service.finish)
-        client = self.client(service)
+        client = self.client(service.start())
         client.start_session(1, 7, {"HostApplicationDisplayID": "../../Music"})
         client.message({"volume level": 0.5}, [1], 11, 3)
         for mode in ("device", "ui"):
             (service.directory / f"run/{mode}-orientation").write_text("landscapeLeft\n")
-            eventually(lambda: f'callback mode={mode} orientation="landscapeLeft" app="../../Music"'
-                       in service.log(), f"the {mode} handler is called")
+            service.await_log(f'callback mode={mode} orientation="landscapeLeft" app="../../Music"')
         client.stop_session(1)
         row = service.wait_for_rows(1, "message WHERE category = 65535")[0]
         summary = json.loads(row["payload"])
@@ -159,9 +148,7 @@ class Sensor(ServiceTest):
         self.watched.prefer(reporting_session_verbose=True)
         self.bus = SystemBus(self, self.watched.directory)
         self.watched.environment |= self.bus.environment
-        self.watched.start()
-        self.addCleanup(self.watched.finish)
-        self.tracker = self.client(self.watched)
+        self.tracker = self.client(self.watched.start())
 
     def track(self):
         self.tracker.start_session(1, 7)
@@ -173,7 +160,7 @@ class Sensor(ServiceTest):
         told = f'orientation="{orientation}"'
         before = self.watched.log().count(told)
         self.bus.turn(word)
-        eventually(lambda: self.watched.log().count(told) > before, orientation)
+        self.watched.await_log(told, before + 1)
 
     def errors(self):
         return [line for line in self.watched.log().splitlines() if " error " in line]
@@ -204,7 +191,7 @@ class Sensor(ServiceTest):
             self.turn(word, orientation)
         self.bus.begin_proxy(accelerometer_orientation="left-up")
         # The new proxy is claimed, and its different orientation is reported.
-        eventually(lambda: self.watched.log().count('orientation="landscapeRight"') == 2, "the change")
+        self.watched.await_log('orientation="landscapeRight"', 2)
         self.turn("normal", "portrait")
         self.tracker.stop_session(1)
         self.await_claimants(0)
@@ -295,7 +282,3 @@ class SystemBus:
 
     def claimants(self):
         return self._call("GetInternalProperty", "AccelerometerOwners").count(":")
-
-
-if __name__ == "__main__":
-    unittest.main(verbosity=2)

@@ -1,16 +1,16 @@
 """A machine to install packages on: this machine's files under a temporary overlay, in namespaces of its own,
 with systemd as its first process."""
 
+import contextlib
 import json
 import os
 import pathlib
 import subprocess
 import tempfile
 import textwrap
-import time
 import unittest
 
-from harness import PATIENCE
+from harness import PATIENCE, eventually
 
 # Runs in the namespaces before systemd starts. /proc/sys and /sys are the real machine's, and therefore
 # read-only.
@@ -64,31 +64,36 @@ class Machine:
         self._cgroup = self._make_cgroup()
         self._boot = base / "boot"
         self._boot.write_text(BOOT)
-        self._first = None
         enter = f'echo $$ > {self._cgroup}/cgroup.procs && exec "$@"'
         with open(base / "log", "wb") as log:
             self._process = subprocess.Popen(
-                ["sh", "-c", enter, "sh",
-                 "unshare", "--mount", "--pid", "--fork", "--uts", "--ipc", "--net", "--cgroup",
-                 "--kill-child=KILL", "bash", self._boot, base / "root"],
+                ["sh", "-c", enter, "sh", "unshare", "--mount", "--pid", "--fork", "--uts", "--ipc", "--net",
+                 "--cgroup", "--kill-child=KILL", "bash", self._boot, base / "root"],
                 stdin=subprocess.DEVNULL, stdout=log, stderr=log)
         try:
-            self._first = self._wait_for_first_process()
-            self._wait_until_up()
-        except TimeoutError as problem:
+            self._first = eventually(self._first_process, "there is a first process", 0.05)
+            eventually(lambda: self.run("systemctl", "is-active", "basic.target").stdout == "active\n",
+                       "systemd is up", 0.05)
+        except AssertionError as problem:
             log = (base / "log").read_text(errors="replace").strip()
             self.close()
             raise unittest.SkipTest(f"no systemd can be started here: {problem} {log}") from None
 
+    def _first_process(self):
+        if self._process.poll() is not None:
+            raise AssertionError("it has ended.")
+        children = pathlib.Path(f"/proc/{self._process.pid}/task/{self._process.pid}/children").read_text().split()
+        return next((int(child) for child in children
+                     if pathlib.Path(f"/proc/{child}/comm").read_text() == "systemd\n"), None)
+
     @staticmethod
     def available():
         """Skips the test if no machine can be started."""
-        if os.geteuid() != 0:
-            raise unittest.SkipTest("starting a systemd of one's own needs root")
-        if not pathlib.Path("/lib/systemd/systemd").exists():
-            raise unittest.SkipTest("there is no systemd to start")
-        if Machine._cgroup_mount() is None:
-            raise unittest.SkipTest("there is no cgroup2 file system for a systemd of one's own")
+        for reason, missing in (("a root user", os.geteuid() != 0),
+                                ("systemd", not pathlib.Path("/lib/systemd/systemd").exists()),
+                                ("a cgroup2 file system", Machine._cgroup_mount() is None)):
+            if missing:
+                raise unittest.SkipTest(f"starting a systemd of one's own needs {reason}")
 
     @staticmethod
     def _cgroup_mount():
@@ -128,20 +133,19 @@ class Machine:
     def close(self):
         self._process.kill()
         self._process.wait(PATIENCE)
-        for _ in range(100):  # the last processes of the machine are ending
-            try:
+
+        def removed():
+            with contextlib.suppress(OSError):  # the last processes of the machine are ending
                 for directory, _, _ in os.walk(self._cgroup, topdown=False):
                     os.rmdir(directory)
-                break
-            except OSError:
-                time.sleep(0.05)
+            return not self._cgroup.exists()
+        eventually(removed, "the machine's processes have ended", 0.05)
         self._directory.cleanup()
 
     def run(self, *command, **options):
         """Runs a command on the machine, as root."""
         return subprocess.run(
-            ["nsenter", "-t", str(self._first), "-m", "-p", "-u", "-i", "-n", "-C", "-r", "-w",
-             *map(str, command)],
+            ["nsenter", "-t", str(self._first), *"-m -p -u -i -n -C -r -w".split(), *map(str, command)],
             capture_output=True, text=True, timeout=PATIENCE, **options)
 
     def must(self, *command, **options):
