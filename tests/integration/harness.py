@@ -42,7 +42,7 @@ class Service:
         self._directory = tempfile.TemporaryDirectory(prefix="quarvel-test-")
         self.directory = pathlib.Path(self._directory.name)
         for name in ("run", "state", "etc/preferences", "diagnostics"):
-            (self.directory / name).mkdir(parents=True, exist_ok=True)
+            (self.directory / name).mkdir(parents=True)
         (self.directory / "etc/quarvel.toml").write_text(configuration)
         self.environment = dict(os.environ, **{variable: str(self.directory / name) for variable, name in (
             ("RUNTIME_DIRECTORY", "run"), ("STATE_DIRECTORY", "state"), ("CONFIGURATION_DIRECTORY", "etc"),
@@ -143,15 +143,10 @@ class Client:
         except OSError:
             self._socket.close()
             raise
+        self.close, self.write = self._socket.close, self._socket.sendall
         self._unpacker = msgpack.Unpacker(raw=False, timestamp=3)
         self._next = 0
         self.replies = {}
-
-    def close(self):
-        self._socket.close()
-
-    def write(self, data):
-        self._socket.sendall(data)
 
     def send(self, method, *arguments):
         self._next += 1

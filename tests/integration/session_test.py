@@ -6,9 +6,7 @@ import pathlib
 import subprocess
 import time
 
-import msgpack
-
-from harness import PATIENCE, QUARVELD, SEND, ServiceTest, eventually
+from harness import PATIENCE, QUARVELD, ServiceTest, eventually
 
 
 class Sessions(ServiceTest):
@@ -30,17 +28,17 @@ class Sessions(ServiceTest):
         self.assertEqual(json.loads(session["user_info"]), {
             "ClientName": "tarnwick.quarvel", "ServiceName": "telephony_session",
             "HostApplicationDisplayID": "org.example.phone"})
-        messages = service.rows("SELECT * FROM message WHERE agent_session = ? ORDER BY id", session["id"])
-        self.assertEqual(len(messages), 301, "and the summary")
-        for number, message in enumerate(messages[:-1]):
+        *messages, last = service.rows("SELECT * FROM message WHERE agent_session = ? ORDER BY id", session["id"])
+        self.assertEqual(len(messages), 300)
+        for number, message in enumerate(messages):
             self.assertEqual(json.loads(message["payload"]), {"call_number": number, "route": "Receiver"})
-            self.assertEqual((message["category"], message["type"], message["session_id"]), (7, 1, 77))
-            self.assertEqual(message["client_name"], "tarnwick.quarvel")
-        summary = json.loads(messages[-1]["payload"])
-        self.assertEqual((messages[-1]["category"], messages[-1]["type"]), (0xFFFF, 0xFFFF))
+            self.assertEqual((message["category"], message["type"], message["session_id"], message["client_name"]),
+                             (7, 1, 77, "tarnwick.quarvel"))
+        summary = json.loads(last["payload"])
+        self.assertEqual((last["category"], last["type"]), (0xFFFF, 0xFFFF))
         self.assertEqual(summary["ZQ_Session_Summary_Event"], "2")
         self.assertEqual(json.loads(summary["Routing_RouteChange_Start_300"])["call_number"], 299)
-        self.assertEqual(service.count("analytics_event WHERE name = 'tarnwick.quarvel.Routing_RouteChange.Start'"), 300)
+        self.assertEqual(service.count("analytics_event WHERE name LIKE '%.Routing_RouteChange.Start'"), 300)
         client.close()
         uptime = service.wait_for_rows(
             1, "analytics_event WHERE name LIKE '%uptime' AND payload LIKE '%python%'")[0]
@@ -60,15 +58,6 @@ class Sessions(ServiceTest):
         self.assertEqual([(row["domain"], row["name"], json.loads(row["payload"])) for row in power],
                          [(28, "Fennor_Haptics",
                            {"EngineOnDuration": 2.5, "ApplicationName": "Unknown", "TimestampEnd": 8})])
-
-    def test_calls_that_arrive_together_are_all_answered_with_a_short_queue(self):
-        service = self.service("[limits]\nqueued_calls = 4\nframe_seconds = 2\n")
-        client = self.client(service, session=1)
-        together = range(1000, 1064)
-        client.write(b"".join(msgpack.packb([0, identifier, SEND, [{"number": identifier}, 3, 1, [1]]])
-                              for identifier in together))
-        for identifier in together:
-            self.assertIsNone(client.wait(identifier))
 
     def test_a_thousand_sessions_wait_for_backends_beside_a_served_client(self):
         service = self.service("[agent]\nbackends = []\n")

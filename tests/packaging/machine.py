@@ -5,6 +5,7 @@ import contextlib
 import json
 import os
 import pathlib
+import re
 import subprocess
 import tempfile
 import textwrap
@@ -58,6 +59,8 @@ exec /lib/systemd/systemd --unit=basic.target
 
 class Machine:
     def __init__(self):
+        if os.geteuid() != 0 or not pathlib.Path("/lib/systemd/systemd").exists() or not self._cgroup_mount():
+            raise unittest.SkipTest("a systemd of one's own needs root, systemd and a cgroup2 file system")
         self._directory = tempfile.TemporaryDirectory(prefix="quarvel-machine-")
         base = pathlib.Path(self._directory.name)
         (base / "root").mkdir()
@@ -87,27 +90,15 @@ class Machine:
                      if pathlib.Path(f"/proc/{child}/comm").read_text() == "systemd\n"), None)
 
     @staticmethod
-    def available():
-        """Skips the test if no machine can be started."""
-        for reason, missing in (("a root user", os.geteuid() != 0),
-                                ("systemd", not pathlib.Path("/lib/systemd/systemd").exists()),
-                                ("a cgroup2 file system", Machine._cgroup_mount() is None)):
-            if missing:
-                raise unittest.SkipTest(f"starting a systemd of one's own needs {reason}")
-
-    @staticmethod
     def _cgroup_mount():
-        for line in pathlib.Path("/proc/self/mounts").read_text().splitlines():
-            _, place, kind, *_ = line.split()
-            if kind == "cgroup2" and os.access(place, os.W_OK):
-                return pathlib.Path(place)
-        return None
+        mounts = (line.split() for line in pathlib.Path("/proc/self/mounts").read_text().splitlines())
+        return next((pathlib.Path(place) for _, place, kind, *_ in mounts
+                     if kind == "cgroup2" and os.access(place, os.W_OK)), None)
 
     @staticmethod
     def _make_cgroup():
-        own = [line[3:] for line in pathlib.Path("/proc/self/cgroup").read_text().splitlines()
-               if line.startswith("0::")][0]
-        cgroup = Machine._cgroup_mount() / own.lstrip("/") / f"quarvel-test-{os.getpid()}"
+        [own] = re.findall("(?m)^0::/(.*)$", pathlib.Path("/proc/self/cgroup").read_text())
+        cgroup = Machine._cgroup_mount() / own / f"quarvel-test-{os.getpid()}"
         cgroup.mkdir()
         return cgroup
 

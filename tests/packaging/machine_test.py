@@ -63,7 +63,6 @@ BUS_POLICY = """
 class InstalledMachine(unittest.TestCase):
     @classmethod
     def setUpClass(cls):
-        Machine.available()
         cls.machine = Machine()
         cls.addClassCleanup(cls.machine.close)
         cls.machine.must("apt-get", "install", "--yes", *PACKAGES)
@@ -186,7 +185,7 @@ class Sandbox(InstalledMachine):
         self.assertIn("landscapeRight", summary["device_orientation"], "the sensor on the system bus")
         uptimes = [event["payload"]["processName"] for event in self.rows("events") if "uptime" in event["name"]]
         self.assertEqual(set(uptimes), {"quarvelctl"}, "names of clients' processes")
-        [history] = machine.must("find", HISTORIES, "-name", "*.json").split()
+        [history] = machine.must("find", HISTORIES, "-name", "*.json", "-newer", script).split()
         self.assertEqual(machine.must("stat", "-c", "%U", history), "quarvel\n", "session histories")
 
         def exported():
