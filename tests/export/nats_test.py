@@ -3,7 +3,6 @@
 import collections
 import json
 import os
-import pathlib
 import random
 import signal
 import time

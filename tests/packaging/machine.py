@@ -57,6 +57,7 @@ umount -l /old
 exec /lib/systemd/systemd --unit=basic.target
 """
 
+
 class Machine:
     def __init__(self):
         if os.geteuid() != 0 or not pathlib.Path("/lib/systemd/systemd").exists() or not self._cgroup_mount():
@@ -101,25 +102,6 @@ class Machine:
         cgroup = Machine._cgroup_mount() / own / f"quarvel-test-{os.getpid()}"
         cgroup.mkdir()
         return cgroup
-
-    def _wait_for_first_process(self):
-        children = pathlib.Path(f"/proc/{self._process.pid}/task/{self._process.pid}/children")
-        deadline = time.monotonic() + PATIENCE
-        while time.monotonic() < deadline and self._process.poll() is None:
-            for child in children.read_text().split():
-                with open(f"/proc/{child}/comm", encoding="utf-8") as comm:
-                    if comm.read() == "systemd\n":
-                        return int(child)
-            time.sleep(0.05)
-        raise TimeoutError("there was no first process.")
-
-    def _wait_until_up(self):
-        deadline = time.monotonic() + PATIENCE
-        while time.monotonic() < deadline and self._process.poll() is None:
-            if self.run("systemctl", "is-active", "basic.target").stdout == "active\n":
-                return
-            time.sleep(0.05)
-        raise TimeoutError("it did not come up.")
 
     def close(self):
         self._process.kill()
