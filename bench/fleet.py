@@ -10,7 +10,7 @@ import subprocess
 import sys
 import tempfile
 
-sys.path.insert(0, str(pathlib.Path(__file__).parents[1] / "tests/export"))
+sys.path[:0] = [str(pathlib.Path(__file__).parents[1] / "tests" / name) for name in ("export", "integration")]
 from cluster import Cluster
 
 MEMORY = pathlib.Path("/dev/shm")  # in memory, so that the medium does not limit the result

@@ -29,18 +29,19 @@ def measure(polite, seconds):
 def compare(act, rounds, seconds):
     """Returns whether the polite client was served well enough: medians of rounds that take turns."""
     services = Service(SHORT_LIMITS).start(), Service().start()
-    polite, elsewhere = (hostile.PoliteClient(service, 1) for service in services)
-    attacker = hostile.Hostile(services[0], act)
+    polite, elsewhere = map(hostile.PoliteClient, services)
+    attacker = None
     try:
         compared = []
         for _ in range(rounds):
             alone = measure(polite, seconds)
-            attacker.attack()
+            attacker = hostile.Hostile(services[0], act)
             beside, other = measure(polite, seconds), measure(elsewhere, seconds)
-            attacker.rest()
+            attacker.end()
             compared.append((beside[0] / alone[0], beside[1] / alone[1], beside[1] / other[1], beside[1]))
     finally:
-        attacker.end()
+        if attacker:
+            attacker.end()
         for service in services:
             service.finish()
             service.tidy()

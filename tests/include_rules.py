@@ -59,35 +59,22 @@ RULES = {
 INCLUDE = re.compile(r'^\s*#\s*include\s*(?:"([^"]+)"|<([^>]+)>)')
 
 
-def fault(path, quoted, angled):
-    """Why the file at `path` may not include this, or None."""
-    rule = max((known for known in RULES if path.startswith(known)), key=len, default=None)
-    if rule is None:
-        return "is in no folder that the rules know"
-    name = quoted or angled
-    if not any(re.fullmatch(pattern, name) for pattern in RULES[rule][0 if quoted else 1]):
-        return f"includes {name}, which is not for {rule}"
-    return None
-
-
 def faults(root):
-    for pattern in ("*.h", "*.hpp", "*.cc", "*.c"):
-        for file in sorted(root.rglob(pattern)):
-            path = file.relative_to(root).as_posix()
-            if path.startswith(("build/", "demo/", ".")):
-                continue
-            for number, line in enumerate(file.read_text().splitlines(), 1):
-                found = INCLUDE.match(line)
-                reason = found and fault(path, found[1], found[2])
-                if reason:
-                    yield f"{path}:{number}: {reason}"
-
-
-def main():
-    found = list(faults(pathlib.Path(sys.argv[1])))
-    print("\n".join(found))
-    return 1 if found else 0
+    for file in sorted(file for kind in ("h", "hpp", "cc", "c") for file in root.rglob(f"*.{kind}")):
+        path = file.relative_to(root).as_posix()
+        if path.startswith(("build/", "demo/", ".")):
+            continue
+        rule = max((known for known in RULES if path.startswith(known)), key=len, default=None)
+        if rule is None:
+            yield f"{path}: is in no folder that the rules know"
+            continue
+        for number, line in enumerate(file.read_text().splitlines(), 1):
+            found = INCLUDE.match(line)
+            name = found and (found[1] or found[2])
+            if found and not any(re.fullmatch(pattern, name) for pattern in RULES[rule][0 if found[1] else 1]):
+                yield f"{path}:{number}: includes {name}, which is not for {rule}"
 
 
 if __name__ == "__main__":
-    sys.exit(main())
+    found = list(faults(pathlib.Path(sys.argv[1])))
+    sys.exit("\n".join(found) if found else 0)

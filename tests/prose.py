@@ -2,6 +2,7 @@
 
 Usage: prose.py ROOT [PATH ...]; with paths, lists every counted word below them."""
 
+import contextlib
 import pathlib
 import re
 import sys
@@ -119,23 +120,17 @@ def blocks(path, text):
 def files(root, wanted):
     for path in sorted(root.rglob("*")):
         name = path.relative_to(root)
-        if any(f"{name}/".startswith(skipped) or f"/{skipped}" in f"/{name}" for skipped in SKIPPED):
-            continue
-        if wanted and not any(f"{name}".startswith(prefix) for prefix in wanted):
-            continue
-        if path.is_file() and not path.is_symlink() and path.stat().st_size < 500_000:
-            yield name
+        skipped = any(f"{name}/".startswith(folder) or f"/{folder}" in f"/{name}" for folder in SKIPPED)
+        if not skipped and f"{name}".startswith(wanted) and path.is_file() and not path.is_symlink():
+            with contextlib.suppress(UnicodeDecodeError):
+                yield name, path.read_text()
 
 
 def main():
-    root, wanted = pathlib.Path(sys.argv[1]), sys.argv[2:]
+    root, wanted = pathlib.Path(sys.argv[1]), tuple(sys.argv[2:])
     words = counted = 0
     long, found_in = [], []
-    for name in files(root, wanted):
-        try:
-            text = (root / name).read_text()
-        except UnicodeDecodeError:
-            continue
+    for name, text in files(root, wanted or ""):
         for line, block in blocks(name, text):
             for sentence in sentences(block):
                 length = len(re.findall(r"\w[\w'’-]*", sentence))
@@ -149,8 +144,7 @@ def main():
     rate = 1000 * counted / max(words, 1)
     if wanted or rate > ALLOWED_PER_1000_WORDS:
         print("\n".join(found_in))
-    if long:
-        print("\n".join(long))
+    print("".join(f"{line}\n" for line in long), end="")
     print(f"{counted} counted words in {words}: {rate:.2f} per 1,000 (at most {ALLOWED_PER_1000_WORDS}); "
           f"{len(long)} sentences over {LONGEST_SENTENCE} words (none)")
     return 1 if long or rate > ALLOWED_PER_1000_WORDS else 0

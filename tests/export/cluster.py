@@ -7,10 +7,8 @@ import pathlib
 import socket
 import ssl
 import subprocess
-import sys
 import tempfile
 
-sys.path.insert(0, str(pathlib.Path(__file__).parents[1] / "integration"))
 from harness import PATIENCE, eventually
 
 DEPLOY = pathlib.Path(__file__).parents[2] / "fleet/nats"
@@ -25,7 +23,6 @@ def free_ports(count):
 
 
 class Cluster:
-    configuration = DEPLOY / "trial.conf"
     scheme = "nats"
 
     def __init__(self):
@@ -52,7 +49,7 @@ class Cluster:
         pass
 
     def arguments(self, _node):
-        return ["-c", self.configuration]
+        return ["-c", DEPLOY / "trial.conf"]
 
     def secured(self, peer):
         return peer

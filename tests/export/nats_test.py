@@ -1,35 +1,33 @@
 """The service with a NATS cluster of three nodes, while nodes and the service are killed."""
 
 import collections
-import contextlib
 import json
 import os
-import pathlib
 import random
 import signal
-import sqlite3
 import time
-import unittest
 
 from cluster import Cluster, SecuredCluster
 from harness import ServiceTest, eventually
 
 NIGHTLY = bool(os.environ.get("QUARVEL_NIGHTLY"))
-CONFIGURATION = """
-[store]
-sync_ms = 20
-[analytics]
-wanted = []
-[agent]
-backends = ["nats"]
-device = "car-7"
-drain_rows_per_second = 20000
-[agent.nats]
-urls = {urls}
-create_stream = true
-duplicate_window_seconds = {window}
-acknowledge_seconds = 5
-"""
+TABLES = "agent_session", "message", "analytics_event", "power_event"
+
+
+def configuration(cluster, device="car-7", window=600, create="true"):
+    return f"""
+        store.sync_ms = 20
+        analytics.wanted = []
+        [agent]
+        backends = ["nats"]
+        device = "{device}"
+        drain_rows_per_second = 20000
+        [agent.nats]
+        urls = {json.dumps(cluster.urls)}
+        create_stream = {create}
+        duplicate_window_seconds = {window}
+        acknowledge_seconds = 5
+        """
 
 
 class Nats(ServiceTest):
@@ -37,14 +35,9 @@ class Nats(ServiceTest):
         self.cluster = Cluster()
         self.addCleanup(self.cluster.close)
 
-    def started(self, window=600):
-        return self.service(CONFIGURATION.format(urls=json.dumps(self.cluster.urls), window=window))
-
     def names(self, service):
         """The names of every row that the store holds."""
-        store = service.rows("SELECT value FROM meta WHERE key = 'store_id'")[0][0]
-        return [f"{store}-{table}-{row[0]}"
-                for table in ("agent_session", "message", "analytics_event", "power_event")
+        return [f"{service.store_id()}-{table}-{row[0]}" for table in TABLES
                 for row in service.rows(f"SELECT id FROM {table} ORDER BY id")]
 
     def await_export(self, service):
@@ -56,17 +49,16 @@ class Nats(ServiceTest):
         eventually(lambda: all(
             service.rows(f"SELECT (SELECT ifnull(max(id), 0) FROM {table}) <= (SELECT ifnull(max(exported_through), 0)"
                          " FROM backend_cursor WHERE table_name = ?)", table)[0][0]
-            for table in ("agent_session", "message", "analytics_event", "power_event")), "all is exported")
+            for table in TABLES), "all is exported")
 
     def test_every_row_arrives_once_while_nodes_and_the_service_are_killed(self):
         rows = 100_000 if NIGHTLY else 20_000
         dice = random.Random(7)
-        service = self.started()
+        service = self.service(configuration(self.cluster))
         killed = []
         sent = 0
         for turn in range(8):
-            client = self.client(service)
-            client.start_session(turn + 1)
+            client = self.client(service, session=turn + 1)
             for _ in range(rows // 8):
                 sent += 1
                 client.message({"n": sent, "route": "speaker", "text": "x" * 150}, [turn + 1])
@@ -91,9 +83,8 @@ class Nats(ServiceTest):
                          stored)
 
     def test_a_repeat_after_the_streams_window_is_dropped_by_the_consumer(self):
-        service = self.started(window=1)
-        client = self.client(service)
-        client.start_session(1)
+        service = self.service(configuration(self.cluster, window=1))
+        client = self.client(service, session=1)
         for number in range(300):
             client.message({"n": number}, [1])
         self.await_export(service)
@@ -101,9 +92,8 @@ class Nats(ServiceTest):
         for wait, repeats in ((2, 100), (0, 100)):
             # The state after a crash between the acknowledgement and the cursor's commit.
             service.end(signal.SIGKILL)
-            with contextlib.closing(sqlite3.connect(service.directory / "state/telemetry.db")) as store, store:
-                store.execute("UPDATE backend_cursor SET exported_through = exported_through - 100"
-                              " WHERE table_name = 'message'")
+            service.rows("UPDATE backend_cursor SET exported_through = exported_through - 100 WHERE table_name = "
+                         "'message'", mode="rw")
             time.sleep(wait)
             service.start()
             self.await_export(service)
@@ -112,17 +102,12 @@ class Nats(ServiceTest):
         self.assertEqual(sorted(names.elements()), sorted(self.names(service)))
 
     def test_rows_too_large_for_the_stream_are_refused_with_a_reason(self):
-        service = self.service(CONFIGURATION.format(urls=json.dumps(self.cluster.urls), window=60).replace(
-            "create_stream = true", "create_stream = false"))
-        client = self.client(service)
-        client.start_session(1)
-        eventually(lambda: "no stream QUARVEL" in service.log(), "a log line about the missing stream")
+        service = self.service(configuration(self.cluster, create="false"))
+        self.client(service, session=1)
+        service.await_log("no stream QUARVEL")
         service.end()
-        configuration = service.directory / "etc/quarvel.toml"
-        configuration.write_text(configuration.read_text().replace("create_stream = false", "create_stream = true"))
-        service.start()
-        client = self.client(service)
-        client.start_session(2)
+        service.reconfigure("create_stream = false", "create_stream = true")
+        client = self.client(service.start(), session=2)
         client.message({"n": 1}, [2])
         client.message({"text": "\x01" * 400_000}, [2])  # six bytes each in JSON
         client.message({"n": 2}, [2])
@@ -140,21 +125,14 @@ class SecuredNats(ServiceTest):
         cluster = SecuredCluster()
         self.addCleanup(cluster.close)
         cluster.create_stream()
-        configuration = CONFIGURATION.replace("create_stream = true", "create_stream = false").format(
-            urls=json.dumps(cluster.urls), window=60)
         files = "".join(f'{key} = "{cluster.directory}/{file}"\n' for key, file in
                         (("tls_ca", "ca.pem"), ("tls_certificate", "car-7.pem"), ("tls_key", "car-7.key")))
         for device, allowed in (("car-7", True), ("car-8", False)):
-            service = self.service(configuration.replace("car-7", device) + files)
-            client = self.client(service)
-            client.start_session(1)
+            service = self.service(configuration(cluster, device, create="false") + files)
+            self.client(service, session=1)
             if allowed:
-                eventually(lambda service=service: service.count("export_log WHERE outcome = 'acknowledged'"), "a row")
+                service.wait_for_rows(1, "export_log WHERE outcome = 'acknowledged'")
             else:
-                eventually(lambda service=service: "takes no rows" in service.log(), "the refusal")
+                service.await_log("takes no rows")
                 self.assertEqual(service.count("export_log"), 0)
         self.assertEqual(cluster.state()["messages"], 1)
-
-
-if __name__ == "__main__":
-    unittest.main(verbosity=2)

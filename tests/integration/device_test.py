@@ -1,11 +1,11 @@
 """The installed service with driver counters, orientation, preferences and device properties."""
 
+import contextlib
 import json
 import os
 import pathlib
 import re
 import subprocess
-import unittest
 
 from harness import PATIENCE, CallError, ServiceTest, eventually
 
@@ -17,34 +17,26 @@ class Drivers(ServiceTest):
         service = self.prepared()
         tree = service.directory / "tallix"
 
-        def set_counter(channel, value):
-            (tree / channel).parent.mkdir(parents=True, exist_ok=True)
-            (tree / channel).write_text(f"{value}\n")
+        def count(**counters):
+            (service.directory / "irq").write_text(f"           CPU0 CPU1\n 9:  {counters.pop('irq')} 2  audio\n")
+            for channel, value in counters.items():
+                path = tree / channel.replace("_", "/")
+                path.parent.mkdir(parents=True, exist_ok=True)
+                path.write_text(f"{value}\n")
 
-        (service.directory / "irq").write_text("           CPU0 CPU1\n 9:  100 2  audio\n")
-        set_counter("Speaker/underruns", 5)
-        set_counter("Board/MCA/clips", 10)
-        set_counter("Haptics/Stats/taps", 3)
-        set_counter("Unrelated/other", 1)
+        count(irq=100, Speaker_underruns=5, Board_MCA_clips=10, Haptics_Stats_taps=3, Unrelated_other=1)
         (service.directory / "etc/quarvel.toml").write_text(
-            f'[tallix]\nroot = "{tree}"\n'
-            f'[[tallix.channel]]\ngroup = "VorrenMXDrv"\nname = "interrupts"\n'
+            f'[tallix]\nroot = "{tree}"\n[[tallix.channel]]\ngroup = "VorrenMXDrv"\nname = "interrupts"\n'
             f'file = "{service.directory}/irq"\npattern = "9: +([0-9]+).*audio"\n')
-        service.start()
-        self.addCleanup(service.finish)
-        client = self.client(service)
-        client.start_session(1)
-        set_counter("Speaker/underruns", 12)
-        set_counter("Board/MCA/clips", 9)
-        set_counter("Unrelated/other", 99)
-        (service.directory / "irq").write_text("           CPU0 CPU1\n 9:  142 2  audio\n")
+        client = self.client(service.start(), session=1)
+        count(irq=142, Speaker_underruns=12, Board_MCA_clips=9, Unrelated_other=99)
         client.stop_session(1)
         rows = service.wait_for_rows(1, "message WHERE category = 9")
         self.assertEqual(json.loads(rows[0]["payload"]),
                          {"VorrenMXDrv_interrupts": 42, "Speaker_underruns": 7})
         client.start_session(1)
         (tree / "Speaker/underruns").unlink()
-        set_counter("Haptics/Stats/taps", 4)
+        count(irq=142, Haptics_Stats_taps=4)
         client.stop_session(1)
         rows = service.wait_for_rows(2, "message WHERE category = 9")
         self.assertEqual(json.loads(rows[1]["payload"]), {"Haptics_Stats_taps": 1},
@@ -53,10 +45,9 @@ class Drivers(ServiceTest):
 
     def test_the_documented_example_finds_its_counter(self):
         document = (pathlib.Path(__file__).parents[2] / "docs/sources.md").read_text()
-        [example] = [block for block in re.findall("```toml\n(.*?)```", document, re.DOTALL) if "/proc/interrupts" in block]
+        [example] = re.findall("```toml\n([^`]*/proc/interrupts[^`]*)```", document)
         service = self.service(example)
-        client = self.client(service)
-        client.start_session(1)
+        client = self.client(service, session=1)
         client.stop_session(1)
         self.assertIn("subscribed to group group Speaker-(null)", service.log())
         self.assertNotIn("couldn't find any channels for driver group Speaker", service.log())
@@ -74,8 +65,7 @@ class Preferences(ServiceTest):
 
     def test_reporting_and_verbose_lines_are_switched_off_and_on(self):
         service = self.service()
-        client = self.client(service)
-        client.start_session(1)
+        client = self.client(service, session=1)
         service.wait_for_rows(1, "agent_session")
 
         def refused():
@@ -90,9 +80,9 @@ class Preferences(ServiceTest):
         self.assertFalse(refused(), "preferences are read only at a notification")
         service.notify()
         eventually(refused, "reporting is off")
-        service.write_preferences("disable_reporting = fal")
+        service.prefer("disable_reporting = fal")
         service.notify()
-        eventually(lambda: "tarnwick.quarvel.toml" in service.log(), "a line that names the file")
+        service.await_log("tarnwick.quarvel.toml")
         self.assertTrue(refused(), "a faulty file changes nothing")
         service.prefer(disable_reporting=False, device_name="bench 7", reporting_session_verbose=True,
                        reporting_server_verbose=True)
@@ -111,8 +101,7 @@ class Preferences(ServiceTest):
 
     def test_unwanted_events_are_not_recorded(self):
         service = self.service('[analytics]\nwanted = ["tarnwick.quarvel.HAL_*"]\n')
-        client = self.client(service)
-        client.start_session(1)
+        client = self.client(service, session=1)
         for category in (3, 0x20000003, 0x10000003):
             client.message({}, [1], category)
         service.wait_for_rows(3, "message WHERE session_id = 1")
@@ -126,15 +115,12 @@ class InternalBuild(ServiceTest):
     def test_the_history_is_written_with_its_orientations(self):
         service = self.prepared('[device]\nInternalBuild = true\n[orientation]\nsource = "files"\n')
         service.prefer(reporting_session_verbose=True)
-        service.start()
-        self.addCleanup(service.finish)
-        client = self.client(service)
+        client = self.client(service.start())
         client.start_session(1, 7, {"HostApplicationDisplayID": "../../Music"})
         client.message({"volume level": 0.5}, [1], 11, 3)
         for mode in ("device", "ui"):
             (service.directory / f"run/{mode}-orientation").write_text("landscapeLeft\n")
-            eventually(lambda: f'callback mode={mode} orientation="landscapeLeft" app="../../Music"'
-                       in service.log(), f"the {mode} handler is called")
+            service.await_log(f'callback mode={mode} orientation="landscapeLeft" app="../../Music"')
         client.stop_session(1)
         row = service.wait_for_rows(1, "message WHERE category = 65535")[0]
         summary = json.loads(row["payload"])
@@ -159,12 +145,7 @@ class Sensor(ServiceTest):
         self.watched.prefer(reporting_session_verbose=True)
         self.bus = SystemBus(self, self.watched.directory)
         self.watched.environment |= self.bus.environment
-        self.watched.start()
-        self.addCleanup(self.watched.finish)
-        self.tracker = self.client(self.watched)
-
-    def track(self):
-        self.tracker.start_session(1, 7)
+        self.tracker = self.client(self.watched.start())
 
     def await_claimants(self, count):
         eventually(lambda: self.bus.claimants() == count, f"{count} claimants")
@@ -173,66 +154,62 @@ class Sensor(ServiceTest):
         told = f'orientation="{orientation}"'
         before = self.watched.log().count(told)
         self.bus.turn(word)
-        eventually(lambda: self.watched.log().count(told) > before, orientation)
-
-    def errors(self):
-        return [line for line in self.watched.log().splitlines() if " error " in line]
+        self.watched.await_log(told, before + 1)
 
     def await_error(self, number, words):
-        eventually(lambda: len(self.errors()) >= number, words)
-        self.assertIn(words, self.errors()[-1])
-        self.assertEqual(len(self.errors()), number, self.errors())
+        self.watched.await_log(" error ", number)
+        errors = [line for line in self.watched.log().splitlines() if " error " in line]
+        self.assertIn(words, errors[-1])
+        self.assertEqual(len(errors), number, errors)
 
     def fail_once(self, number, words):
         """Expects one line, although four sessions fail to track."""
-        self.track()
-        self.await_error(number, words)
-        self.tracker.stop_session(1)
-        for _ in range(3):
-            self.track()
+        for _ in range(4):
+            self.tracker.start_session(1, 7)
+            self.await_error(number, words)
             self.tracker.stop_session(1)
+
+    def succeed(self):
+        self.tracker.start_session(1, 7)
+        self.await_claimants(1)
 
     def test_it_is_claimed_while_a_session_tracks_it_and_after_a_restart(self):
         self.bus.begin()
         self.bus.begin_proxy(accelerometer_orientation="normal")
         self.await_claimants(0)
-        self.track()
-        self.await_claimants(1)
+        self.succeed()
         for word, orientation in (("left-up", "landscapeRight"), ("right-up", "landscapeLeft"),
                                   ("bottom-up", "portraitUpsideDown"), ("undefined", "unknown"),
                                   ("normal", "portrait")):
             self.turn(word, orientation)
         self.bus.begin_proxy(accelerometer_orientation="left-up")
         # The new proxy is claimed, and its different orientation is reported.
-        eventually(lambda: self.watched.log().count('orientation="landscapeRight"') == 2, "the change")
+        self.watched.await_log('orientation="landscapeRight"', 2)
         self.turn("normal", "portrait")
         self.tracker.stop_session(1)
         self.await_claimants(0)
         summary = json.loads(self.watched.wait_for_rows(1, "message WHERE category = 65535")[0]["payload"])
         self.assertEqual(summary["device_orientation"], "landscapeRight,landscapeLeft,portraitUpsideDown,"
                                                         "unknown,portrait,landscapeRight,portrait")
-        self.assertEqual(self.errors(), [])
+        self.assertNotIn(" error ", self.watched.log())
 
     def test_a_missing_bus_proxy_or_accelerometer_is_one_line(self):
         self.fail_once(1, "the system bus")
         # After a success the same failures are logged once more.
         self.bus.begin()
         self.bus.begin_proxy()
-        self.track()
-        self.await_claimants(1)
+        self.succeed()
         self.turn("left-up", "landscapeRight")
         self.bus.end_proxy()
         self.tracker.stop_session(1)
         self.fail_once(2, "cannot be claimed")
         self.bus.begin_proxy()
-        self.track()
-        self.await_claimants(1)
+        self.succeed()
         self.tracker.stop_session(1)
         self.bus.begin_proxy(has_accelerometer=False)
         self.fail_once(3, "no accelerometer")
         self.bus.begin_proxy()
-        self.track()
-        self.await_claimants(1)
+        self.succeed()
         self.bus.end()
         self.await_error(4, "the system bus was lost")
 
@@ -246,9 +223,7 @@ class SystemBus:
         self._directory = directory
         self._address = f"unix:path={directory}/system.sock"
         self.environment = {"DBUS_SYSTEM_BUS_ADDRESS": self._address}
-        self._bus = self._proxy = None
-        test.addCleanup(self.end)
-        test.addCleanup(self.end_proxy)
+        self._bus, self._proxy = (test.enterContext(contextlib.ExitStack()) for _ in range(2))
 
     def begin(self):
         (self._directory / "bus.conf").write_text(
@@ -257,30 +232,26 @@ class SystemBus:
             f"<busconfig><type>session</type><listen>{self._address}</listen><auth>EXTERNAL</auth>"
             '<policy context="default"><allow own="*"/><allow send_destination="*"/>'
             '<allow receive_sender="*"/><allow user="*"/></policy></busconfig>')
-        self._bus = self._beside("dbus-daemon", f"--config-file={self._directory}/bus.conf", "--nofork", "--nopidfile")
+        self._run_beside(self._bus, "dbus-daemon", f"--config-file={self._directory}/bus.conf", "--nofork")
         eventually((self._directory / "system.sock").exists, "the bus")
-
-    def end(self):
-        self._bus = self._ended(self._bus)
 
     def begin_proxy(self, **parameters):
         self.end_proxy()
-        self._proxy = self._beside(
-            "/usr/bin/python3", "-m", "dbusmock", "--system", "--template", "iio-sensors-proxy",
+        self._run_beside(
+            self._proxy, "/usr/bin/python3", "-m", "dbusmock", "--system", "--template", "iio-sensors-proxy",
             "-p", json.dumps({"has_accelerometer": True} | parameters), "-l", f"{self._directory}/proxy.log")
         self._gdbus("wait", "--system", "--timeout", "60", self.PROXY[0])
 
+    def end(self):
+        self._bus.close()
+
     def end_proxy(self):
-        self._proxy = self._ended(self._proxy)
+        self._proxy.close()
 
-    def _beside(self, *command):
-        return subprocess.Popen(command, env=os.environ | self.environment, stderr=subprocess.DEVNULL)
-
-    @staticmethod
-    def _ended(process):
-        if process:
-            process.terminate()
-            process.wait(PATIENCE)
+    def _run_beside(self, stack, *command):
+        process = stack.enter_context(
+            subprocess.Popen(command, env=os.environ | self.environment, stderr=subprocess.DEVNULL))
+        stack.callback(process.terminate)
 
     def _gdbus(self, *arguments):
         return subprocess.run(["gdbus", *arguments], env=os.environ | self.environment, check=True,
@@ -295,7 +266,3 @@ class SystemBus:
 
     def claimants(self):
         return self._call("GetInternalProperty", "AccelerometerOwners").count(":")
-
-
-if __name__ == "__main__":
-    unittest.main(verbosity=2)

@@ -18,6 +18,7 @@ import msgpack
 PREFIX = pathlib.Path(os.environ.get("QUARVEL_PREFIX", "/usr"))
 LAUNCH = pathlib.Path(__file__).resolve().parent.parent / "launch"
 QUARVELD = (LAUNCH, PREFIX / "sbin/quarveld")
+SEND = "sendMessage:withCategory:andType:forReportingIDs:reply:"
 # Seconds that an immediate event may take on a slow, busy machine.
 PATIENCE = float(os.environ.get("QUARVEL_TEST_PATIENCE", "60"))
 
@@ -41,27 +42,20 @@ class Service:
         self._directory = tempfile.TemporaryDirectory(prefix="quarvel-test-")
         self.directory = pathlib.Path(self._directory.name)
         for name in ("run", "state", "etc/preferences", "diagnostics"):
-            (self.directory / name).mkdir(parents=True, exist_ok=True)
+            (self.directory / name).mkdir(parents=True)
         (self.directory / "etc/quarvel.toml").write_text(configuration)
-        self.environment = dict(
-            os.environ,
-            RUNTIME_DIRECTORY=str(self.directory / "run"),
-            STATE_DIRECTORY=str(self.directory / "state"),
-            CONFIGURATION_DIRECTORY=str(self.directory / "etc"),
-            QUARVEL_DIAGNOSTICS_PREFIX=str(self.directory / "diagnostics"),
-        )
+        self.environment = dict(os.environ, **{variable: str(self.directory / name) for variable, name in (
+            ("RUNTIME_DIRECTORY", "run"), ("STATE_DIRECTORY", "state"), ("CONFIGURATION_DIRECTORY", "etc"),
+            ("QUARVEL_DIAGNOSTICS_PREFIX", "diagnostics"))})
         for inherited in ("QUARVEL_SOCKET", "LISTEN_FDS", "LISTEN_PID", "JOURNAL_STREAM"):
             self.environment.pop(inherited, None)
         self.socket = self.directory / "run/reporting.sock"
         self.log_path = self.directory / "log"
-        self._wrapper = list(wrapper)
-        self.process = None
+        self.process, self._wrapper = None, wrapper
 
     def start(self):
         with open(self.log_path, "ab") as log:
-            self.process = subprocess.Popen(
-                [*self._wrapper, *QUARVELD], env=self.environment, stderr=log
-            )
+            self.process = subprocess.Popen([*self._wrapper, *QUARVELD], env=self.environment, stderr=log)
 
         def up():
             if self.process.poll() is not None:
@@ -81,9 +75,10 @@ class Service:
     def finish(self):
         """Ends the service; fails if a sanitizer or valgrind found something."""
         try:
-            self.end()
+            if self.process:
+                self.end()
         finally:
-            if self.process.poll() is None:
+            if self.process and self.process.poll() is None:
                 self.process.kill()
                 self.process.wait(PATIENCE)
         if re.search(r"Sanitizer|runtime error:|^==\d+==", self.log(), re.MULTILINE):
@@ -95,9 +90,12 @@ class Service:
     def log(self):
         return self.log_path.read_text(errors="replace") if self.log_path.exists() else ""
 
-    def rows(self, query, *arguments):
+    def await_log(self, text, count=1):
+        eventually(lambda: self.log().count(text) >= count, f"{count} of {text!r} in the log")
+
+    def rows(self, query, *arguments, mode="ro"):
         path = self.directory / "state/telemetry.db"
-        with contextlib.closing(sqlite3.connect(f"file:{path}?mode=ro", uri=True)) as database:
+        with contextlib.closing(sqlite3.connect(f"file:{path}?mode={mode}", uri=True)) as database, database:
             database.row_factory = sqlite3.Row
             return database.execute(query, arguments).fetchall()
 
@@ -108,19 +106,24 @@ class Service:
         eventually(lambda: self.count(query, *arguments) >= count, f"{count} rows of {query}")
         return self.rows(f"SELECT * FROM {query}", *arguments)
 
-    def ctl(self, *arguments, **options):
-        return subprocess.run(
-            [LAUNCH, PREFIX / "bin/quarvelctl", *map(str, arguments)],
-            env=self.environment, capture_output=True, text=True, timeout=PATIENCE, **options
-        )
+    def store_id(self):
+        return self.rows("SELECT value FROM meta WHERE key = 'store_id'")[0][0]
 
-    def prefer(self, **values):
-        """Writes the service's preferences, which take effect with the next `notify`."""
-        self.write_preferences("".join(f"{key} = {json.dumps(value)}\n"
-                                       for key, value in values.items()))
+    def ctl(self, *arguments):
+        return subprocess.run([LAUNCH, PREFIX / "bin/quarvelctl", *map(str, arguments)],
+                              env=self.environment, capture_output=True, text=True, timeout=PATIENCE)
 
-    def write_preferences(self, text):
-        """Replaces the file at once: a file that is written in place is empty for a moment."""
+    def status(self):
+        return json.loads(self.ctl("status", "--json").stdout)
+
+    def reconfigure(self, old, new):
+        path = self.directory / "etc/quarvel.toml"
+        path.write_text(path.read_text().replace(old, new))
+
+    def prefer(self, text=None, **values):
+        """Writes preferences, which take effect with the next `notify`. Replaces the file at once: a file that
+        is written in place is empty for a moment."""
+        text = text or "".join(f"{key} = {json.dumps(value)}\n" for key, value in values.items())
         path = self.directory / "etc/preferences/tarnwick.quarvel.toml"
         path.with_suffix(".new").write_text(text)
         path.with_suffix(".new").replace(path)
@@ -140,15 +143,10 @@ class Client:
         except OSError:
             self._socket.close()
             raise
+        self.close, self.write = self._socket.close, self._socket.sendall
         self._unpacker = msgpack.Unpacker(raw=False, timestamp=3)
         self._next = 0
         self.replies = {}
-
-    def close(self):
-        self._socket.close()
-
-    def write(self, data):
-        self._socket.sendall(data)
 
     def send(self, method, *arguments):
         self._next += 1
@@ -191,18 +189,10 @@ class Client:
         return started
 
     def message(self, payload, reporters, category=3, kind=1):
-        return self.call(
-            "sendMessage:withCategory:andType:forReportingIDs:reply:", payload, category, kind, reporters
-        )
+        return self.call(SEND, payload, category, kind, reporters)
 
     def stop_session(self, reporter):
         return self.call("stopReportingSessionForID:reply:", reporter)
-
-    def until_end(self):
-        """Reads to the end of the stream; a reset is an end too."""
-        with contextlib.suppress(ConnectionResetError):
-            while self.receive() is not None:
-                pass
 
 
 class CallError(Exception):
@@ -214,18 +204,19 @@ class CallError(Exception):
 
 class ServiceTest(unittest.TestCase):
     def prepared(self, configuration="", **options):
-        """A service that is not started yet; its directory is removed after the test."""
+        """A service that is not started yet; it ends with the test."""
         service = Service(configuration, **options)
         self.addCleanup(service.tidy)
-        return service
-
-    def service(self, configuration="", **options):
-        service = self.prepared(configuration, **options)
-        service.start()
         self.addCleanup(service.finish)
         return service
 
-    def client(self, service, **options):
+    def service(self, configuration="", **options):
+        return self.prepared(configuration, **options).start()
+
+    def client(self, service, session=None, **options):
+        """A client, in which `session` has started."""
         client = Client(service, **options)
         self.addCleanup(client.close)
+        if session is not None:
+            client.start_session(session)
         return client

@@ -3,69 +3,41 @@
 import contextlib
 import multiprocessing
 import os
-import pathlib
 import socket
 import struct
 import time
 
 import msgpack
-from harness import PATIENCE, Client
-
-SEND = "sendMessage:withCategory:andType:forReportingIDs:reply:"
-_fork = multiprocessing.get_context("fork")
+from harness import PATIENCE, SEND, Client
 
 
 class Hostile:
-    """Runs `act(service)` again and again in another process, from `attack` to `rest`."""
+    """Runs `act(service)` again and again in another process, until `end`."""
 
     def __init__(self, service, act):
-        self._go = _fork.Event()
-        self._resting = _fork.Event()
-        self._process = _fork.Process(target=self._live, args=(service, act), daemon=True)
+        self._process = multiprocessing.get_context("fork").Process(
+            target=self._live, args=(service, act), daemon=True)
         self._process.start()
 
-    def _live(self, service, act):
+    @staticmethod
+    def _live(service, act):
         os.nice(19)  # the attack itself must not take the processor from the polite client
         while True:
-            self._resting.set()
-            self._go.wait()
-            self._resting.clear()
-            while self._go.is_set():
-                with contextlib.suppress(OSError):  # refused, disconnected, not read
-                    act(service)
-
-    def attack(self):
-        self._go.set()
-
-    def rest(self):
-        self._go.clear()
-        assert self._resting.wait(PATIENCE)
+            with contextlib.suppress(OSError):  # refused, disconnected, not read
+                act(service)
 
     def end(self):
         self._process.kill()
         self._process.join(PATIENCE)
 
 
-class PoliteClient:
-    """Sends a message every two milliseconds and waits for each answer."""
+class PoliteClient(Client):
+    """Sends a message every two milliseconds to session 1 and waits for each answer."""
 
-    PAUSE = 0.002
-
-    def __init__(self, service, reporter):
-        self._client = Client(service)
-        self._reporter = reporter
-        self._client.start_session(reporter)
+    def __init__(self, service):
+        super().__init__(service)
+        self.start_session(1)
         self.sent = 0
-
-    def close(self):
-        self._client.close()
-
-    def stop(self):
-        self._client.stop_session(self._reporter)
-
-    def send(self):
-        self._client.message({"n": self.sent, "route": "Speaker"}, [self._reporter])
-        self.sent += 1
 
     def times(self, seconds):
         """Seconds that each answer took."""
@@ -75,28 +47,11 @@ class PoliteClient:
         while due < end:
             time.sleep(max(0, due - time.perf_counter()))
             asked = time.perf_counter()
-            self.send()
+            self.message({"n": self.sent, "route": "Speaker"}, [1])
             times.append(time.perf_counter() - asked)
-            due += self.PAUSE
+            self.sent += 1
+            due += 0.002
         return times
-
-
-def resident(process, peak=False):
-    """Memory in MiB."""
-    key = "VmHWM:" if peak else "VmRSS:"
-    for line in pathlib.Path(f"/proc/{process.pid}/status").read_text().splitlines():
-        if line.startswith(key):
-            return int(line.split()[1]) / 1024
-    raise AssertionError(key)
-
-
-def processor_seconds(process):
-    fields = pathlib.Path(f"/proc/{process.pid}/stat").read_text().rpartition(") ")[2].split()
-    return (int(fields[11]) + int(fields[12])) / os.sysconf("SC_CLK_TCK")
-
-
-def threads(process):
-    return len(os.listdir(f"/proc/{process.pid}/task"))
 
 
 def raw(service):
@@ -119,17 +74,6 @@ def notification(method, *arguments):
 
 def request(number, method, *arguments):
     return msgpack.packb([0, number, method, list(arguments)])
-
-
-def ask(connected, method, *arguments):
-    """Calls on a raw socket and returns the result."""
-    connected.sendall(request(1, method, *arguments))
-    unpacker = msgpack.Unpacker(raw=False)
-    while True:
-        unpacker.feed(connected.recv(65536))
-        for _, _, error, result in unpacker:
-            assert error is None
-            return result
 
 
 # The attacks. Each runs once, or for a fraction of a second.

@@ -4,11 +4,12 @@ bench/hostile_bench.py measures how much a hostile client costs the others."""
 
 import contextlib
 import os
+import pathlib
 import resource
 import time
-import unittest
 
 import hostile
+import msgpack
 from harness import ServiceTest, eventually
 
 SECONDS = 20 if os.environ.get("QUARVEL_NIGHTLY") else 1.5
@@ -20,26 +21,34 @@ def figure(name, text):
     print(f"harness: hostile: {name}: {text}", flush=True)
 
 
+def resident(process, peak=False):
+    """Memory in MiB."""
+    key = "VmHWM:" if peak else "VmRSS:"
+    for line in pathlib.Path(f"/proc/{process.pid}/status").read_text().splitlines():
+        if line.startswith(key):
+            return int(line.split()[1]) / 1024
+    raise AssertionError(key)
+
+
 class Beside(ServiceTest):
     """A polite client beside a hostile client that repeats its attack all the time."""
 
     def beside(self, act):
         service = self.service(SHORT_LIMITS)
-        polite = hostile.PoliteClient(service, 1)
+        polite = hostile.PoliteClient(service)
         self.addCleanup(polite.close)
         attacker = hostile.Hostile(service, act)
         self.addCleanup(attacker.end)
-        attacker.attack()
         for _ in range(3):  # a busy machine may hold up one answer
             slowest = max(polite.times(SECONDS))
             if slowest < 1:
                 break
-        memory = hostile.resident(service.process, peak=True)
+        memory = resident(service.process, peak=True)
         figure(act.__name__, f"slowest answer {slowest * 1000:.1f} ms, {memory:.0f} MB")
         self.assertLess(slowest, 1)
         self.assertLess(memory, MOST_MEMORY)
         attacker.end()
-        polite.stop()
+        polite.stop_session(1)
         polite.close()
         service.end()
         rows = service.rows("SELECT id, json_extract(payload, '$.n') AS n FROM message WHERE session_id = 1 "
@@ -64,29 +73,33 @@ class Numbers(ServiceTest):
         self.most = min(10_000, hard - 200)
 
     def connect(self, service, count):
-        connected = [hostile.raw(service) for _ in range(count)]
-        self.addCleanup(lambda: [each.close() for each in connected])
-        return connected
+        """Returns an ExitStack of connections, and the last one."""
+        connected = self.enterContext(contextlib.ExitStack())
+        for _ in range(count):
+            last = connected.enter_context(hostile.raw(service))
+        return connected, last
 
     def idles(self, service):
         """Whether the service uses less than a fifth of a core while no client calls."""
-        before = hostile.processor_seconds(service.process)
+        def ticks():
+            fields = pathlib.Path(f"/proc/{service.process.pid}/stat").read_text().rpartition(") ")[2].split()
+            return int(fields[11]) + int(fields[12])
+        before = ticks()
         time.sleep(1)
-        return hostile.processor_seconds(service.process) - before < 0.2
+        return ticks() - before < 0.2 * os.sysconf("SC_CLK_TCK")
 
     def test_ten_thousand_connections(self):
         service = self.service(f"[limits]\nconnections = {self.most + 10}\n")
-        polite = self.client(service)
-        polite.start_session(1)
+        polite = self.client(service, session=1)
         began = time.monotonic()
-        connected = self.connect(service, self.most)
+        _, last = self.connect(service, self.most)
         eventually(lambda: len(os.listdir(f"/proc/{service.process.pid}/fd")) > self.most, "all are accepted")
-        figure("connections", f"{self.most} in {time.monotonic() - began:.1f} s, "
-                              f"{hostile.resident(service.process):.0f} MB")
+        figure("connections", f"{self.most} in {time.monotonic() - began:.1f} s, {resident(service.process):.0f} MB")
         polite.message({"beside": self.most}, [1])
-        self.assertEqual(hostile.ask(connected[-1], "getAllReporters:"), [1])
+        last.sendall(hostile.request(1, "getAllReporters:"))
+        self.assertEqual(last.recv(100), msgpack.packb([1, 1, None, [1]]))
         eventually(lambda: self.idles(service), "an idle service")
-        self.assertLess(hostile.resident(service.process), MOST_MEMORY)
+        self.assertLess(resident(service.process), MOST_MEMORY)
 
     def test_at_a_limit_clients_wait_and_the_service_does_not_spin(self):
         limits = {"of connections": ("[limits]\nconnections = 100\n", (), 300),
@@ -94,24 +107,21 @@ class Numbers(ServiceTest):
         for name, (configuration, wrapper, count) in limits.items():
             with self.subTest(name):
                 service = self.service(configuration, wrapper=wrapper)
-                polite = self.client(service)
-                polite.start_session(1)
-                connected = self.connect(service, count)
+                polite = self.client(service, session=1)
+                connected, _ = self.connect(service, count)
                 waiting = self.client(service)
                 asked = waiting.send("getAllReporters:")
-                eventually(lambda: "no further client is accepted" in service.log(), "the limit")
+                service.await_log("no further client is accepted")
                 polite.message({"at": name}, [1])
                 eventually(lambda: self.idles(service), "a service that waits")
                 self.assertNotIn(asked, waiting.replies)
-                for each in connected:
-                    each.close()
+                connected.close()
                 self.assertEqual(waiting.wait(asked), [1], "the waiting client is served")
                 self.assertEqual(service.log().count("no further client is accepted"), 1)
 
     def test_a_hundred_thousand_sessions(self):
         service = self.service()
-        polite = self.client(service)
-        polite.start_session(1)
+        polite = self.client(service, session=1)
         attacker = self.client(service)
         sessions, threads = 100_000, 0
         began = time.monotonic()
@@ -119,12 +129,12 @@ class Numbers(ServiceTest):
             attacker.write(b"".join(hostile.notification(call, reporter)
                                     for reporter in range(first, min(first + 1000, sessions + 1))
                                     for call in ("createReportingSession:reply:", "startReportingSessionForID:reply:")))
-            threads = max(threads, hostile.threads(service.process))
+            threads = max(threads, len(os.listdir(f"/proc/{service.process.pid}/task")))
             polite.message({"beside": first}, [1])
         self.assertEqual(len(attacker.call("getAllReporters:")), sessions)
         figure("sessions", f"{sessions} started in {time.monotonic() - began:.1f} s, "
-                           f"{hostile.resident(service.process):.0f} MB, {threads} threads at most")
-        self.assertLess(hostile.resident(service.process), 2 * MOST_MEMORY)
+                           f"{resident(service.process):.0f} MB, {threads} threads at most")
+        self.assertLess(resident(service.process), 2 * MOST_MEMORY)
         self.assertLess(threads, 4000)
         attacker.close()
         eventually(lambda: polite.call("getAllReporters:") == [1], "all of them are gone")
@@ -135,9 +145,7 @@ class Deadlines(ServiceTest):
         """An incomplete frame ends its connection after 10 s, unread replies after 30 s and at 1 MiB."""
         service = self.service()
         polite = self.client(service)
-        slow, deaf = hostile.raw(service), hostile.raw(service)
-        self.addCleanup(slow.close)
-        self.addCleanup(deaf.close)
+        slow, deaf = (self.enterContext(hostile.raw(service)) for _ in range(2))
         began = time.monotonic()
         slow.send(b"\x94")
         deaf.setblocking(False)
@@ -153,8 +161,4 @@ class Deadlines(ServiceTest):
         self.assertGreater(frame_seconds, 9.5)
         self.assertGreater(stall_seconds, 29.5)
         self.assertLess(frame_seconds, stall_seconds)
-        self.assertLess(hostile.resident(service.process, peak=True), 64)
-
-
-if __name__ == "__main__":
-    unittest.main(verbosity=2)
+        self.assertLess(resident(service.process, peak=True), 64)

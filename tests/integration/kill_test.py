@@ -1,17 +1,16 @@
 """Answered messages survive a kill or an end of the service at random moments under load."""
 
+import contextlib
 import os
 import random
 import signal
 import statistics
 import threading
 import time
-import unittest
 
-from harness import PATIENCE, Client, ServiceTest
+from harness import PATIENCE, SEND, Client, ServiceTest
 
 NIGHTLY = bool(os.environ.get("QUARVEL_NIGHTLY"))
-SEND = "sendMessage:withCategory:andType:forReportingIDs:reply:"
 # Seconds after which an answered message must be safe from a kill: 10 ms, and more for a busy machine.
 SAFE_AFTER = 0.010 + (0.040 if NIGHTLY else 1)
 RESTART = 1 if NIGHTLY else 5
@@ -31,21 +30,17 @@ class Writer(threading.Thread):
         self.start()
 
     def run(self):
-        numbers = {}
-        sent = 0
-        try:
+        waited_for, sent = set(), 0
+        with contextlib.closing(self._client), contextlib.suppress(OSError):
             while True:
                 while sent - len(self.answered) < self._ahead:
-                    numbers[self._client.send(SEND, {**self._base, "n": sent}, 3, 1, [self._reporter])] = sent
+                    waited_for.add(self._client.send(SEND, {**self._base, "n": sent}, 3, 1, [self._reporter]))
                     sent += 1
                 answer = self._client.receive()
                 if answer is None:
-                    break
-                if numbers.pop(answer, None) is not None:
+                    return
+                if answer in waited_for:
                     self.answered.append(time.monotonic())
-        except OSError:
-            pass
-        self._client.close()
 
 
 class Kills(ServiceTest):
@@ -105,7 +100,3 @@ class Kills(ServiceTest):
               f"{longest:.2f} s at most", flush=True)
         self.assertGreater(answered, 10 * ends)
         self.assertLess(longest, 5 if NIGHTLY else 20)
-
-
-if __name__ == "__main__":
-    unittest.main(verbosity=2)

@@ -1,16 +1,17 @@
 """A machine to install packages on: this machine's files under a temporary overlay, in namespaces of its own,
 with systemd as its first process."""
 
+import contextlib
 import json
 import os
 import pathlib
+import re
 import subprocess
 import tempfile
 import textwrap
-import time
 import unittest
 
-from harness import PATIENCE
+from harness import PATIENCE, eventually
 
 # Runs in the namespaces before systemd starts. /proc/sys and /sys are the real machine's, and therefore
 # read-only.
@@ -56,92 +57,68 @@ umount -l /old
 exec /lib/systemd/systemd --unit=basic.target
 """
 
+
 class Machine:
     def __init__(self):
+        if os.geteuid() != 0 or not pathlib.Path("/lib/systemd/systemd").exists() or not self._cgroup_mount():
+            raise unittest.SkipTest("a systemd of one's own needs root, systemd and a cgroup2 file system")
         self._directory = tempfile.TemporaryDirectory(prefix="quarvel-machine-")
         base = pathlib.Path(self._directory.name)
         (base / "root").mkdir()
         self._cgroup = self._make_cgroup()
         self._boot = base / "boot"
         self._boot.write_text(BOOT)
-        self._first = None
         enter = f'echo $$ > {self._cgroup}/cgroup.procs && exec "$@"'
         with open(base / "log", "wb") as log:
             self._process = subprocess.Popen(
-                ["sh", "-c", enter, "sh",
-                 "unshare", "--mount", "--pid", "--fork", "--uts", "--ipc", "--net", "--cgroup",
-                 "--kill-child=KILL", "bash", self._boot, base / "root"],
+                ["sh", "-c", enter, "sh", "unshare", "--mount", "--pid", "--fork", "--uts", "--ipc", "--net",
+                 "--cgroup", "--kill-child=KILL", "bash", self._boot, base / "root"],
                 stdin=subprocess.DEVNULL, stdout=log, stderr=log)
         try:
-            self._first = self._wait_for_first_process()
-            self._wait_until_up()
-        except TimeoutError as problem:
+            self._first = eventually(self._first_process, "there is a first process", 0.05)
+            eventually(lambda: self.run("systemctl", "is-active", "basic.target").stdout == "active\n",
+                       "systemd is up", 0.05)
+        except AssertionError as problem:
             log = (base / "log").read_text(errors="replace").strip()
             self.close()
             raise unittest.SkipTest(f"no systemd can be started here: {problem} {log}") from None
 
-    @staticmethod
-    def available():
-        """Skips the test if no machine can be started."""
-        if os.geteuid() != 0:
-            raise unittest.SkipTest("starting a systemd of one's own needs root")
-        if not pathlib.Path("/lib/systemd/systemd").exists():
-            raise unittest.SkipTest("there is no systemd to start")
-        if Machine._cgroup_mount() is None:
-            raise unittest.SkipTest("there is no cgroup2 file system for a systemd of one's own")
+    def _first_process(self):
+        if self._process.poll() is not None:
+            raise AssertionError("it has ended.")
+        children = pathlib.Path(f"/proc/{self._process.pid}/task/{self._process.pid}/children").read_text().split()
+        return next((int(child) for child in children
+                     if pathlib.Path(f"/proc/{child}/comm").read_text() == "systemd\n"), None)
 
     @staticmethod
     def _cgroup_mount():
-        for line in pathlib.Path("/proc/self/mounts").read_text().splitlines():
-            _, place, kind, *_ = line.split()
-            if kind == "cgroup2" and os.access(place, os.W_OK):
-                return pathlib.Path(place)
-        return None
+        mounts = (line.split() for line in pathlib.Path("/proc/self/mounts").read_text().splitlines())
+        return next((pathlib.Path(place) for _, place, kind, *_ in mounts
+                     if kind == "cgroup2" and os.access(place, os.W_OK)), None)
 
     @staticmethod
     def _make_cgroup():
-        own = [line[3:] for line in pathlib.Path("/proc/self/cgroup").read_text().splitlines()
-               if line.startswith("0::")][0]
-        cgroup = Machine._cgroup_mount() / own.lstrip("/") / f"quarvel-test-{os.getpid()}"
+        [own] = re.findall("(?m)^0::/(.*)$", pathlib.Path("/proc/self/cgroup").read_text())
+        cgroup = Machine._cgroup_mount() / own / f"quarvel-test-{os.getpid()}"
         cgroup.mkdir()
         return cgroup
-
-    def _wait_for_first_process(self):
-        children = pathlib.Path(f"/proc/{self._process.pid}/task/{self._process.pid}/children")
-        deadline = time.monotonic() + PATIENCE
-        while time.monotonic() < deadline and self._process.poll() is None:
-            for child in children.read_text().split():
-                with open(f"/proc/{child}/comm", encoding="utf-8") as comm:
-                    if comm.read() == "systemd\n":
-                        return int(child)
-            time.sleep(0.05)
-        raise TimeoutError("there was no first process.")
-
-    def _wait_until_up(self):
-        deadline = time.monotonic() + PATIENCE
-        while time.monotonic() < deadline and self._process.poll() is None:
-            if self.run("systemctl", "is-active", "basic.target").stdout == "active\n":
-                return
-            time.sleep(0.05)
-        raise TimeoutError("it did not come up.")
 
     def close(self):
         self._process.kill()
         self._process.wait(PATIENCE)
-        for _ in range(100):  # the last processes of the machine are ending
-            try:
+
+        def removed():
+            with contextlib.suppress(OSError):  # the last processes of the machine are ending
                 for directory, _, _ in os.walk(self._cgroup, topdown=False):
                     os.rmdir(directory)
-                break
-            except OSError:
-                time.sleep(0.05)
+            return not self._cgroup.exists()
+        eventually(removed, "the machine's processes have ended", 0.05)
         self._directory.cleanup()
 
     def run(self, *command, **options):
         """Runs a command on the machine, as root."""
         return subprocess.run(
-            ["nsenter", "-t", str(self._first), "-m", "-p", "-u", "-i", "-n", "-C", "-r", "-w",
-             *map(str, command)],
+            ["nsenter", "-t", str(self._first), *"-m -p -u -i -n -C -r -w".split(), *map(str, command)],
             capture_output=True, text=True, timeout=PATIENCE, **options)
 
     def must(self, *command, **options):
