@@ -38,31 +38,20 @@ class Examples(ServiceTest):
         # The last one is the session's summary.
         return ended.stdout, session["service_name"], [json.loads(row["payload"]) for row in rows[:-1]]
 
-    def test_c_on_an_event_loop(self):
-        output, service_name, payloads = self.run_example(LAUNCH, self.built / "client-c")
-        self.assertIn("has stopped", output)
-        self.assertIn("longformaudio", service_name)
-        self.assertEqual(payloads, [{"number": number, "route": "Speaker", "rates": [44100, 48000]}
-                                    for number in range(1, 6)])
-
-    def test_cc(self):
-        output, service_name, payloads = self.run_example(LAUNCH, self.built / "client-cc")
-        self.assertEqual(output, "started: true\nstopped: true\n")
-        self.assertIn("telephony", service_name)
-        self.assertEqual(payloads, [{"number": number, "route": "Receiver"} for number in (1, 2, 3)]
-                         + [{"volume": 0.5}])
-
-    def test_realtime(self):
-        output, service_name, payloads = self.run_example(LAUNCH, self.built / "realtime")
-        self.assertEqual(output, "200 records sent\n")
-        self.assertIn("audiodeviceusage", service_name)
-        self.assertEqual([payload["callback"] for payload in payloads], list(range(200)))
-
-    def test_python(self):
-        output, service_name, payloads = self.run_example(sys.executable, SOURCES / "client.py")
-        self.assertIn("destroy: True", output)
-        self.assertIn("longformaudio", service_name)
-        self.assertEqual([payload["route"] for payload in payloads], ["Speaker"])
+    def test_each(self):
+        c = [{"number": number, "route": "Speaker", "rates": [44100, 48000]} for number in range(1, 6)]
+        cc = [{"number": number, "route": "Receiver"} for number in (1, 2, 3)] + [{"volume": 0.5}]
+        for command, said, service, key, reported in (
+                ([LAUNCH, self.built / "client-c"], "has stopped", "longformaudio", None, c),
+                ([LAUNCH, self.built / "client-cc"], "started: true\nstopped: true\n", "telephony", None, cc),
+                ([LAUNCH, self.built / "realtime"], "200 records sent\n", "audiodeviceusage", "callback",
+                 list(range(200))),
+                ([sys.executable, SOURCES / "client.py"], "destroy: True", "longformaudio", "route", ["Speaker"])):
+            with self.subTest(str(command[-1])):
+                output, service_name, payloads = self.run_example(*command)
+                self.assertIn(said, output)
+                self.assertIn(service, service_name)
+                self.assertEqual([payload[key] if key else payload for payload in payloads], reported)
 
 
 if __name__ == "__main__":
