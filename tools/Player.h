@@ -17,6 +17,7 @@ namespace quarvel {
 /// one command. The functions are for one thread; replies come on the client's thread.
 class Player {
  public:
+  /// Takes the connected client over.
   explicit Player(Client client);
   /// Closes the connection; the errors that this causes are not printed.
   ~Player();
@@ -34,9 +35,9 @@ class Player {
   struct Replies {
     Mutex mutex;
     ConditionVariable changed;
-    std::size_t outstanding QUARVEL_GUARDED_BY(mutex) = 0;  // without starts
-    std::multiset<std::int64_t> starts QUARVEL_GUARDED_BY(mutex);
-    std::optional<Value> last QUARVEL_GUARDED_BY(mutex);  // of those waited for
+    std::size_t outstanding QUARVEL_GUARDED_BY(mutex) = 0;         // without starts
+    std::multiset<std::int64_t> starts QUARVEL_GUARDED_BY(mutex);  // sessions, without a reply yet
+    std::optional<Value> last QUARVEL_GUARDED_BY(mutex);           // of those waited for
     bool closing QUARVEL_GUARDED_BY(mutex) = false;
   };
 
@@ -47,7 +48,7 @@ class Player {
 
   const std::shared_ptr<Replies> replies_ = std::make_shared<Replies>();
   std::set<std::int64_t> stopped_;  // sessions whose start is due to be answered
-  bool killed_ = false;
+  bool killed_ = false;             // the script has ended the service: the loss is no error
   Client client_;
 };
 

@@ -17,15 +17,15 @@ namespace quarvel::script {
 
 /// {"call": "<full keyword name>", "args": […], "wait": true or false}
 struct Call {
-  std::string operation;
-  List arguments;  // as written, for printing
-  List values;     // as sent: {"$date": "<RFC 3339>"} is a date, {"$bytes": "<base64>"} bytes
-  bool wait;       // for the reply, before the next line; by default not for a start
+  std::string operation;  // not checked: the service knows its operations
+  List arguments;         // as written, for printing
+  List values;  // as sent: {"$date": "<RFC 3339>"} is a date, {"$bytes": "<base64>"} bytes
+  bool wait;    // for the reply, before the next line; by default not for a start
 };
 
 /// {"sleep": seconds}
 struct Sleep {
-  std::chrono::duration<double> duration;
+  std::chrono::duration<double> duration;  // seconds, 0 or more
 };
 
 /// {"expect": value}: the expected last reply of the calls that were waited for, as it was printed:
@@ -45,7 +45,7 @@ struct Step {
 /// Reads one line of a script. Errors: domain "quarvel.script" or "quarvel.json", with a reason.
 [[nodiscard]] Result<Action> Parse(std::string_view line);
 
-/// Whether a line is empty or a comment.
+/// Whether a line is empty or a comment, and so no step.
 [[nodiscard]] bool IsSkipped(std::string_view line);
 
 }  // namespace quarvel::script

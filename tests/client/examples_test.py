@@ -7,7 +7,7 @@ import sys
 import tempfile
 import unittest
 
-from harness import LAUNCH, PATIENCE, PREFIX, ServiceTest, eventually
+from harness import LAUNCH, PATIENCE, PREFIX, ServiceTest
 
 SOURCES = pathlib.Path(sys.argv.pop(1))
 
@@ -18,11 +18,8 @@ class Examples(ServiceTest):
         directory = tempfile.TemporaryDirectory(prefix="quarvel-examples-")
         cls.addClassCleanup(directory.cleanup)
         cls.built = pathlib.Path(directory.name)
-        for command in (
-            ["cmake", "-S", SOURCES, "-B", cls.built, f"-DCMAKE_PREFIX_PATH={PREFIX}",
-             "-DCMAKE_COMPILE_WARNING_AS_ERROR=ON"],
-            ["cmake", "--build", cls.built],
-        ):
+        for command in (["cmake", "-S", SOURCES, "-B", cls.built, f"-DCMAKE_PREFIX_PATH={PREFIX}",
+                         "-DCMAKE_COMPILE_WARNING_AS_ERROR=ON"], ["cmake", "--build", cls.built]):
             built = subprocess.run(command, capture_output=True, text=True)
             assert built.returncode == 0, built.stdout + built.stderr
 
@@ -30,8 +27,7 @@ class Examples(ServiceTest):
         """Returns its output and the payloads of the session that it has reported."""
         service = self.service()
         ended = subprocess.run([*command, service.socket], capture_output=True, text=True, timeout=PATIENCE)
-        self.assertEqual(ended.returncode, 0, ended.stderr)
-        self.assertEqual(ended.stderr, "")
+        self.assertEqual((ended.returncode, ended.stderr), (0, ""))
         session = service.wait_for_rows(1, "agent_session WHERE flushed_at IS NOT NULL")[0]
         rows = service.rows("SELECT * FROM message WHERE agent_session = ? ORDER BY id", session["id"])
         self.assertEqual(len(rows), service.count("message"), "every message belongs to the session")
