@@ -84,7 +84,6 @@ class FakeService {
     char byte = 0;
     return !received_.empty() || ::recv(connection_, &byte, 1, MSG_PEEK | MSG_DONTWAIT) == 1;
   }
-
   void send(std::string_view bytes) {
     ::send(connection_, bytes.data(), bytes.size(), MSG_NOSIGNAL);  // waits until all is taken
   }

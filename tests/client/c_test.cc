@@ -126,8 +126,12 @@ TEST_F(CTest, SynchronousCallsHaveResultsAndErrors) {
   std::jthread service([this] {
     for (int i = 0; i < 5; ++i) service_.answer(true);
     service_.answer(3);
-    service_.receive();  // the start
+    const Value start = service_.call();
     service_.answer(Dictionary{{"reporterID", 0}, {"serviceType", 65535}});
+    const Value secondStart = service_.call();
+    service_.answer(Dictionary{{"reporterID", 7}, {"serviceType", 3}});
+    service_.reply(start, true);
+    service_.reply(secondStart, false);
     service_.answer(Dictionary{{"reporterID", 7}, {"serviceType", 3}});
     service_.answer(List{7, 8, 9});
     service_.answer(nullptr);
@@ -137,8 +141,10 @@ TEST_F(CTest, SynchronousCallsHaveResultsAndErrors) {
   });
   const PayloadHandle payload(quarvel_payload_new());
   constexpr std::nullptr_t n = nullptr;
+  const auto add = Notes<bool>::add;
   std::uint16_t type = 0;
-  bool known[] = {true, false};
+  bool known[] = {true, false, false};
+  std::vector<std::string> stopped;
   std::int64_t ids[2] = {};
   std::size_t count = 0;
   const quarvel_status done[] = {
@@ -148,14 +154,16 @@ TEST_F(CTest, SynchronousCallsHaveResultsAndErrors) {
       quarvel_sync_stop_reporting_session_for_id(c, 7, -1, n),
       quarvel_sync_destroy_reporting_session(c, 7, -1, n),
       quarvel_sync_get_service_name_for_reporter_id(c, 7, -1, &type, n),
-      quarvel_sync_start_reporting_session_for_id(c, 7, n, n, -1, &known[0], n),
-      quarvel_sync_reporter_id(c, 7, -1, &known[1], n, n),
+      quarvel_sync_start_reporting_session_for_id(c, 7, add, &stopped, -1, &known[0], n),
+      quarvel_sync_start_reporting_session_for_id(c, 7, add, &stopped, -1, &known[1], n),
+      quarvel_sync_reporter_id(c, 7, -1, &known[2], n, n),
       quarvel_sync_get_all_reporters(c, -1, ids, 2, &count, n),
       quarvel_sync_send_message(c, payload.get(), 1, 1, ids, 2, -1, n),
   };
   EXPECT_THAT(done, ::testing::Each(QUARVEL_OK));
   EXPECT_EQ(type, 3);
-  EXPECT_THAT(known, ElementsAre(false, true));
+  EXPECT_THAT(known, ElementsAre(false, true, true));
+  EXPECT_THAT(stopped, ElementsAre("true", "false"));
   EXPECT_THAT(ids, ElementsAre(7, 8));
   EXPECT_EQ(count, 3U);
   quarvel_error error;

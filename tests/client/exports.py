@@ -23,4 +23,4 @@ for symbol in symbols:
 for function in re.findall(r"\b(quarvel_\w+)\(", re.sub(r"/\*.*?\*/", "", text, flags=re.DOTALL)):
     if function not in symbols:
         wrong.append(f"declared but not exported: {function}")
-sys.exit("\n".join(wrong))
+sys.exit("\n".join(wrong) or 0)
