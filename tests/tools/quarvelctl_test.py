@@ -29,7 +29,7 @@ def enough(cases):
     return cases[::4] if "QUARVEL_VALGRIND" in os.environ else cases
 
 
-class ToolTest(unittest.TestCase):
+class ToolTest(harness.ServiceTest):
     def setUp(self):
         self.directory = tempfile.TemporaryDirectory(prefix="quarvelctl-")
         self.addCleanup(self.directory.cleanup)
@@ -58,9 +58,7 @@ class ToolTest(unittest.TestCase):
 
     def new_store(self):
         """The empty store that a service makes; a connection to it."""
-        service = harness.Service("[analytics]\nwanted = []\n")
-        self.addCleanup(service.tidy)
-        service.start()
+        service = self.service("[analytics]\nwanted = []\n")
         service.end()
         return sqlite3.connect(shutil.copy(service.directory / "state/telemetry.db", self.root), isolation_level=None)
 
@@ -68,11 +66,8 @@ class ToolTest(unittest.TestCase):
 class Service(ToolTest):
     def setUp(self):
         super().setUp()
-        self.service = harness.Service()
-        self.addCleanup(self.service.tidy)
-        self.service.start()
-        self.addCleanup(self.service.finish)
-        self.environment["QUARVEL_SOCKET"] = str(self.service.socket)
+        self.daemon = self.service()
+        self.environment["QUARVEL_SOCKET"] = str(self.daemon.socket)
 
     def run_script(self, *steps):
         """Status, replies, standard error."""
@@ -97,7 +92,7 @@ class Service(ToolTest):
         arguments = [payload, 3, 1, None]
         status, replies, _ = self.run_script({"call": SEND, "args": arguments})
         self.assertEqual((status, replies[0]["args"]), (0, arguments))
-        [row] = self.service.wait_for_rows(1, "message")
+        [row] = self.daemon.wait_for_rows(1, "message")
         self.assertEqual(json.loads(row["payload"]), payload | {"At": "2026-01-31T12:00:00.250000Z", "Raw": "AP8="})
 
     def test_an_expectation_that_fails_names_its_line(self):
@@ -110,9 +105,6 @@ class Service(ToolTest):
         status, replies, _ = self.run_script({"call": CREATE, "args": [7]}, {"call": START, "args": [7]}, {"call": KILL})
         self.assertEqual(status, 0)
         self.assertEqual({reply["error"]["domain"] for reply in replies[1:]}, {"quarvel.client"})
-        self.service.end()
-        self.service.start()
-        self.assertEqual(self.ctl("kill")[:2], (0, ["The service has ended."]))
 
     def test_nothing_is_played_of_a_file_with_a_fault(self):
         faults = [('{"call": 7}', "keyword name"), ('{"call": "x", "args": {}}', "a list"),
@@ -127,8 +119,7 @@ class Service(ToolTest):
                 self.fails(reason, "run", script)
 
     def test_reporters_and_validity(self):
-        client = harness.Client(self.service)
-        self.addCleanup(client.close)
+        client = self.client(self.daemon)
         for reporter, service_type in ((7, 2), (-8, 4242)):
             client.call(CREATE, reporter)
             client.call(SET_TYPE, service_type, reporter)
@@ -226,7 +217,6 @@ class Store(ToolTest):
 
     def test_a_client_s_uptime_is_told_only_when_it_can_be_no_other_s(self):
         event = "tarnwick.quarvel.zqreportingclientuptime"
-
         for name, process, seconds, at, told in (
                 (event, "left before the end", 9.0, 1, False), (event, "came after the start", 1.0, 2, False),
                 (event, "unknown", -1, 2, False), ("another", "another", 9.0, 2, False),
