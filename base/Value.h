@@ -173,7 +173,7 @@ class Dictionary {
   /// dictionaries are replaced, not merged.
   void merge(const Dictionary& other);
 
-  /// The number of entries, without those of nested dictionaries.
+  /// The number of entries; a nested dictionary is one.
   [[nodiscard]] std::size_t size() const { return entries_.size(); }
   [[nodiscard]] bool empty() const { return entries_.empty(); }
   /// For range-for over the entries, in their order. Valid until the dictionary changes.
