@@ -11,6 +11,7 @@ namespace quarvel {
 
 // Base64 with padding: RFC 4648, section 4.
 
+/// The digit of each number from 0 to 63.
 inline constexpr std::string_view kBase64Digits =
     "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
 
@@ -20,7 +21,7 @@ inline constexpr std::string_view kBase64Digits =
   text.reserve((octets.size() + 2) / 3 * 4);
   for (std::size_t i = 0; i < octets.size(); i += 3) {
     const std::size_t count = std::min<std::size_t>(3, octets.size() - i);
-    std::uint32_t group = 0;
+    std::uint32_t group = 0;  // 24 bits: three octets, four digits
     for (std::size_t j = 0; j < 3; ++j) {
       group = group << 8 | (j < count ? static_cast<unsigned char>(octets[i + j]) : 0U);
     }
@@ -31,12 +32,13 @@ inline constexpr std::string_view kBase64Digits =
   return text;
 }
 
-/// The octets of a text. None when its length is not a multiple of 4, or a character is no digit.
+/// The octets of a text. None when its length is not a multiple of 4, or a character is no digit;
+/// blanks and line ends are none.
 [[nodiscard]] inline std::optional<std::string> FromBase64(std::string_view text) {
   if (text.size() % 4 != 0) return std::nullopt;
   for (int padding = 0; padding < 2 && text.ends_with('='); ++padding) text.remove_suffix(1);
   std::string octets;
-  std::uint32_t bits = 0;
+  std::uint32_t bits = 0;  // read and not yet written; the lowest `count` matter
   int count = 0;
   for (const char digit : text) {
     const std::size_t value = kBase64Digits.find(digit);

@@ -9,7 +9,8 @@
 
 namespace quarvel {
 
-/// A point in time: microseconds since 1970-01-01T00:00:00Z.
+/// A point in time: microseconds since 1970-01-01T00:00:00Z, without leap seconds. May be before
+/// 1970.
 using Date = std::chrono::sys_time<std::chrono::microseconds>;
 
 /// The dates that have an RFC 3339 text: years 1 to 9999.
@@ -24,13 +25,14 @@ inline constexpr Date kLatestDate{std::chrono::microseconds{253'402'300'799'999'
 /// A value; the view is valid as long as it.
 class DateCharacters {
  public:
+  /// Clamps as `DateText` does.
   explicit DateCharacters(Date date);
   operator std::string_view() const {  // NOLINT(google-explicit-constructor): it is a text
     return {characters_.data(), characters_.size()};
   }
 
  private:
-  std::array<char, 27> characters_;
+  std::array<char, 27> characters_;  // not ended by a zero
 };
 
 /// Reads RFC 3339 text with "Z" or a numeric offset and up to nine digits of a second; digits finer

@@ -19,8 +19,8 @@ namespace quarvel {
 inline constexpr const char* kFileErrorDomain = "quarvel.files";
 
 /// Permissions of the service's own files and directories: the group may read.
-inline constexpr mode_t kPrivateFile = 0640;
-inline constexpr mode_t kPrivateDirectory = 0750;
+inline constexpr mode_t kPrivateFile = 0640;       // the owner writes
+inline constexpr mode_t kPrivateDirectory = 0750;  // the group may list
 
 /// Larger than any file that is read whole; keeps a wrong path (a device, say) from taking all
 /// memory.
@@ -53,7 +53,8 @@ inline constexpr std::size_t kLargestWholeFile = 16'777'216;
 /// Returns 0 or the system's error number.
 [[nodiscard]] int CreatePrivateDirectory(const std::filesystem::path& directory);
 
-/// Makes the names in a directory durable. Returns 0 or the system's error number.
+/// Makes the names in a directory durable: files that were created, renamed or removed in it stay
+/// so after a power cut. Returns 0 or the system's error number.
 int SyncDirectory(const std::filesystem::path& directory);
 
 }  // namespace quarvel

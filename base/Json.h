@@ -14,12 +14,14 @@ namespace quarvel {
 // microseconds, bytes as base64 text, non-finite numbers as "NaN", "Infinity" and "-Infinity".
 // Integer keys become their decimal text. Keys keep their order.
 
-/// Appends compact JSON. A `PayloadValue` must be part of a `Payload`.
+/// Appends compact JSON, and leaves the text before it as it is. A `PayloadValue` must be part of a
+/// `Payload`.
 void AppendJson(std::string& out, PayloadValue value);
 void AppendJson(std::string& out, const Value& value);
 void AppendJson(std::string& out, const Dictionary& dictionary);
 
-/// Compact JSON.
+/// Compact JSON: no blanks, no line ends. Strings must be UTF-8, which is not checked here. May be
+/// called from any thread.
 [[nodiscard]] std::string JsonText(const Payload& payload);
 [[nodiscard]] std::string JsonText(const Value& value);
 [[nodiscard]] std::string JsonText(const Dictionary& dictionary);
@@ -33,11 +35,14 @@ class PrettyJsonWriter {
   PrettyJsonWriter(const PrettyJsonWriter&) = delete;
   PrettyJsonWriter& operator=(const PrettyJsonWriter&) = delete;
 
+  // Containers are closed in the reverse order of their opening; that is not checked.
   void beginList();
   void endList();
   void beginDictionary();
   void endDictionary();
+  /// In a dictionary, before each value or `begin`.
   void key(std::string_view key);
+  // A whole value, with all that it holds; a `PayloadValue` as for `AppendJson`.
   void value(PayloadValue value);
   void value(const Dictionary& dictionary);
   /// The whole text, after the last `end`. Errors: domain "quarvel.json", when a string was not
@@ -45,7 +50,7 @@ class PrettyJsonWriter {
   [[nodiscard]] Result<std::string> finish();
 
  private:
-  struct Implementation;
+  struct Implementation;  // the JSON library's writer, which no header names
   std::unique_ptr<Implementation> implementation_;
 };
 

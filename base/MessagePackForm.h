@@ -13,16 +13,16 @@ struct MessagePackForm {
   /// In the order of `Value::Kind`, whose dates are extensions here.
   enum class Kind : std::uint8_t {
     nil,
-    boolean,
-    integer,
-    unsignedInteger,
-    real,
-    string,
+    boolean,          // the first byte is the value
+    integer,          // forms that can be negative
+    unsignedInteger,  // forms that cannot, though small numbers may have them
+    real,             // 4 or 8 bytes, IEEE 754
+    string,           // UTF-8 by the format's rule, not checked here
     bytes,
-    extension,
+    extension,  // a type of one byte, then its data; in payloads a timestamp
     list,
     dictionary,
-    unused
+    unused  // 0xc1, which the format forbids
   };
 
   Kind kind;
@@ -32,17 +32,20 @@ struct MessagePackForm {
 
   /// The form of values that begin with `code`.
   [[nodiscard]] static inline const MessagePackForm& of(unsigned char code);
+  /// The form of the value at an address, where at least one byte must be readable.
   [[nodiscard]] static const MessagePackForm& at(const char* value) {
     return of(static_cast<unsigned char>(*value));
   }
 
+  /// Whether the value holds other values, which follow its head.
   [[nodiscard]] bool isContainer() const { return kind == Kind::list || kind == Kind::dictionary; }
-  /// The number of bytes after the head; for containers, of items or entries.
+  /// The number of bytes after the head; for containers, of items or entries. Reads the
+  /// bytes of the length, which must be there.
   [[nodiscard]] std::uint64_t length(const char* value) const {
     return lengthBytes == 0 ? fixed : bigEndian(value + 1, lengthBytes);
   }
 
-  /// The big-endian number in `count` (1, 2, 4 or 8) bytes.
+  /// The big-endian number in `count` (1, 2, 4 or 8) bytes. The address needs no alignment.
   [[nodiscard]] static std::uint64_t bigEndian(const char* bytes, std::size_t count) {
     switch (count) {
       case 1:
@@ -57,6 +60,7 @@ struct MessagePackForm {
   }
 
  private:
+  /// With a fixed number of bytes: compilers make one load and one swap of the loop.
   template <class Unsigned>
   static Unsigned bigEndianOf(const char* bytes) {
     Unsigned number = 0;
@@ -83,7 +87,8 @@ struct MessagePackForm {
   return count;
 }
 
-/// The byte after a well-formed value. Needs no recursion, however deep the value is.
+/// The byte after a well-formed value: a `MessagePackScanner` has found it complete, or this
+/// process has written it. Needs no recursion, however deep the value is.
 [[nodiscard]] inline const char* AfterMessagePack(const char* value) {
   // `left`: values still to be skipped; containers add their items.
   for (std::uint64_t left = 1; left > 0; --left) {
@@ -104,78 +109,55 @@ struct MessagePackForm {
 
 namespace message_pack_detail {
 
+using Kind = MessagePackForm::Kind;
+
+/// The forms of the first bytes 0xc0 to 0xdf, in order. Fields: kind, `lengthBytes`, `headBytes`,
+/// `fixed`.
+inline constexpr std::array<MessagePackForm, 32> kFormsFrom0xc0{{
+    {Kind::nil, 0, 1, 0},              // 0xc0: nil
+    {Kind::unused, 0, 1, 0},           // 0xc1: never used
+    {Kind::boolean, 0, 1, 0},          // 0xc2: false
+    {Kind::boolean, 0, 1, 0},          // 0xc3: true
+    {Kind::bytes, 1, 2, 0},            // 0xc4: up to 2^8 - 1 bytes
+    {Kind::bytes, 2, 3, 0},            // 0xc5: up to 2^16 - 1
+    {Kind::bytes, 4, 5, 0},            // 0xc6: up to 2^32 - 1
+    {Kind::extension, 1, 3, 0},        // 0xc7: up to 2^8 - 1 bytes
+    {Kind::extension, 2, 4, 0},        // 0xc8: up to 2^16 - 1
+    {Kind::extension, 4, 6, 0},        // 0xc9: up to 2^32 - 1
+    {Kind::real, 0, 1, 4},             // 0xca: single precision
+    {Kind::real, 0, 1, 8},             // 0xcb: double precision
+    {Kind::unsignedInteger, 0, 1, 1},  // 0xcc: 8 bits
+    {Kind::unsignedInteger, 0, 1, 2},  // 0xcd: 16 bits
+    {Kind::unsignedInteger, 0, 1, 4},  // 0xce: 32 bits
+    {Kind::unsignedInteger, 0, 1, 8},  // 0xcf: 64 bits
+    {Kind::integer, 0, 1, 1},          // 0xd0: 8 bits
+    {Kind::integer, 0, 1, 2},          // 0xd1: 16 bits
+    {Kind::integer, 0, 1, 4},          // 0xd2: 32 bits
+    {Kind::integer, 0, 1, 8},          // 0xd3: 64 bits
+    {Kind::extension, 0, 2, 1},        // 0xd4: 1 byte
+    {Kind::extension, 0, 2, 2},        // 0xd5: 2 bytes
+    {Kind::extension, 0, 2, 4},        // 0xd6: 4 bytes: a timestamp in seconds
+    {Kind::extension, 0, 2, 8},        // 0xd7: 8 bytes: a timestamp up to the year 2514
+    {Kind::extension, 0, 2, 16},       // 0xd8: 16 bytes
+    {Kind::string, 1, 2, 0},           // 0xd9: up to 2^8 - 1 bytes
+    {Kind::string, 2, 3, 0},           // 0xda: up to 2^16 - 1
+    {Kind::string, 4, 5, 0},           // 0xdb: up to 2^32 - 1
+    {Kind::list, 2, 3, 0},             // 0xdc: up to 2^16 - 1 values
+    {Kind::list, 4, 5, 0},             // 0xdd: up to 2^32 - 1
+    {Kind::dictionary, 2, 3, 0},       // 0xde: up to 2^16 - 1 entries
+    {Kind::dictionary, 4, 5, 0},       // 0xdf: up to 2^32 - 1
+}};
+
+/// The form of a first byte from 0 to 255. Below 0xc0 and above 0xdf the byte holds the number or
+/// the length itself.
 constexpr MessagePackForm FormOf(unsigned code) {
-  using Kind = MessagePackForm::Kind;
+  const auto low = [code](unsigned mask) { return static_cast<std::uint8_t>(code & mask); };
   if (code <= 0x7f) return {Kind::unsignedInteger, 0, 1, 0};
-  if (code <= 0x8f) return {Kind::dictionary, 0, 1, static_cast<std::uint8_t>(code & 0x0f)};
-  if (code <= 0x9f) return {Kind::list, 0, 1, static_cast<std::uint8_t>(code & 0x0f)};
-  if (code <= 0xbf) return {Kind::string, 0, 1, static_cast<std::uint8_t>(code & 0x1f)};
-  if (code >= 0xe0) return {Kind::integer, 0, 1, 0};
-  switch (code) {
-    case 0xc0:
-      return {Kind::nil, 0, 1, 0};
-    case 0xc2:
-    case 0xc3:
-      return {Kind::boolean, 0, 1, 0};
-    case 0xc4:
-      return {Kind::bytes, 1, 2, 0};
-    case 0xc5:
-      return {Kind::bytes, 2, 3, 0};
-    case 0xc6:
-      return {Kind::bytes, 4, 5, 0};
-    case 0xc7:
-      return {Kind::extension, 1, 3, 0};
-    case 0xc8:
-      return {Kind::extension, 2, 4, 0};
-    case 0xc9:
-      return {Kind::extension, 4, 6, 0};
-    case 0xca:
-      return {Kind::real, 0, 1, 4};
-    case 0xcb:
-      return {Kind::real, 0, 1, 8};
-    case 0xcc:
-      return {Kind::unsignedInteger, 0, 1, 1};
-    case 0xcd:
-      return {Kind::unsignedInteger, 0, 1, 2};
-    case 0xce:
-      return {Kind::unsignedInteger, 0, 1, 4};
-    case 0xcf:
-      return {Kind::unsignedInteger, 0, 1, 8};
-    case 0xd0:
-      return {Kind::integer, 0, 1, 1};
-    case 0xd1:
-      return {Kind::integer, 0, 1, 2};
-    case 0xd2:
-      return {Kind::integer, 0, 1, 4};
-    case 0xd3:
-      return {Kind::integer, 0, 1, 8};
-    case 0xd4:
-      return {Kind::extension, 0, 2, 1};
-    case 0xd5:
-      return {Kind::extension, 0, 2, 2};
-    case 0xd6:
-      return {Kind::extension, 0, 2, 4};
-    case 0xd7:
-      return {Kind::extension, 0, 2, 8};
-    case 0xd8:
-      return {Kind::extension, 0, 2, 16};
-    case 0xd9:
-      return {Kind::string, 1, 2, 0};
-    case 0xda:
-      return {Kind::string, 2, 3, 0};
-    case 0xdb:
-      return {Kind::string, 4, 5, 0};
-    case 0xdc:
-      return {Kind::list, 2, 3, 0};
-    case 0xdd:
-      return {Kind::list, 4, 5, 0};
-    case 0xde:
-      return {Kind::dictionary, 2, 3, 0};
-    case 0xdf:
-      return {Kind::dictionary, 4, 5, 0};
-    default:
-      return {Kind::unused, 0, 1, 0};
-  }
+  if (code <= 0x8f) return {Kind::dictionary, 0, 1, low(0x0f)};
+  if (code <= 0x9f) return {Kind::list, 0, 1, low(0x0f)};
+  if (code <= 0xbf) return {Kind::string, 0, 1, low(0x1f)};
+  if (code <= 0xdf) return kFormsFrom0xc0[code - 0xc0];
+  return {Kind::integer, 0, 1, 0};
 }
 
 constexpr std::array<MessagePackForm, 256> Forms() {

@@ -22,6 +22,9 @@ class BasicMessagePackWriter {
   /// `out` must outlive the writer.
   explicit BasicMessagePackWriter(Sink& out) : out_(out) {}
 
+  // Each appends one value. An exception of the sink, such as a lack of memory, passes through, and
+  // leaves a value written in part.
+
   void nil() { head('\xc0'); }
   void boolean(bool value) { head(value ? '\xc3' : '\xc2'); }
   // A number takes 1, 2, 3, 5 or 9 bytes; a positive one is written unsigned in both functions.
@@ -29,32 +32,37 @@ class BasicMessagePackWriter {
   void unsignedInteger(std::uint64_t value);
   /// Always 9 bytes: a double stays a double.
   void real(double value);
-  /// `text` must be UTF-8, which is not checked. Texts and octets have at most 2^32 - 1 bytes.
+  /// `text` must be UTF-8 and have at most 2^32 - 1 bytes, which is not checked.
   void string(std::string_view text);
+  /// Octets without a meaning, at most 2^32 - 1.
   void bytes(std::string_view octets);
-  /// The timestamp extension, in the shortest of its three forms.
+  /// The timestamp extension, in the shortest of its three forms: 6, 10 or 15 bytes.
   void date(Date date);
-  /// The head of a list; `count` values follow.
+  /// The head of a list; the caller then writes `count` values, at most 2^32 - 1. Nothing checks
+  /// that it does.
   void list(std::size_t count);
-  /// The head of a dictionary; `count` times a key and a value follow.
+  /// The head of a dictionary; the caller then writes `count` times a key (`string`, `integer` or
+  /// `key`) and a value. Nothing checks that it does.
   void dictionary(std::size_t count);
-  /// A value that is MessagePack already.
+  /// A value that is MessagePack already, appended unchanged and unchecked.
   void encoded(std::string_view value) { out_.append(value.data(), value.size()); }
 
-  // Trees, with all that they hold.
+  // Trees, with all that they hold. Recursive: as deep as the tree.
   void key(const Key& key);
   void value(const Value& value);
   void value(const Dictionary& dictionary);
 
  private:
-  // The first byte of a value, and numbers behind it.
+  /// Appends the first byte of a value, or an extension's type.
   void head(char code) { out_.push_back(code); }
+  /// Appends a number of 1, 2, 4 or 8 bytes behind a head.
   template <class Unsigned>
   void bigEndian(Unsigned number);
 
   Sink& out_;
 };
 
+/// The writer of the service and of ordinary clients, which appends to a string.
 using MessagePackWriter = BasicMessagePackWriter<std::string>;
 extern template class BasicMessagePackWriter<std::string>;  // MessagePack.cc
 
@@ -152,23 +160,25 @@ void BasicMessagePackWriter<Sink>::bytes(std::string_view octets) {
 template <class Sink>
 void BasicMessagePackWriter<Sink>::date(Date date) {
   using namespace std::chrono;
+  // Rounded down, so that the part of a second is positive before 1970 too.
   const auto whole = floor<seconds>(date.time_since_epoch());
   const auto count = whole.count();
   const auto nanoseconds32 = static_cast<std::uint32_t>(
       duration_cast<nanoseconds>(date.time_since_epoch() - whole).count());
+  // The short forms have 32 or 34 bits for the seconds, and no sign.
   if (count >= 0 && count >> 34 == 0) {
     if (nanoseconds32 == 0 && count >> 32 == 0) {
-      head('\xd6');
+      head('\xd6');  // 4 bytes of data
       head('\xff');
       bigEndian(static_cast<std::uint32_t>(count));
     } else {
-      head('\xd7');
+      head('\xd7');  // 8
       head('\xff');
       bigEndian(std::uint64_t{nanoseconds32} << 34 | static_cast<std::uint64_t>(count));
     }
   } else {
     head('\xc7');
-    head('\x0c');
+    head('\x0c');  // 12
     head('\xff');
     bigEndian(nanoseconds32);
     bigEndian(static_cast<std::uint64_t>(count));

@@ -16,8 +16,10 @@ class QUARVEL_CAPABILITY("mutex") Mutex {
   Mutex(const Mutex&) = delete;
   Mutex& operator=(const Mutex&) = delete;
 
-  /// Waits while another thread holds the lock.
+  /// Waits while another thread holds the lock. A holder that locks again waits for ever. Prefer
+  /// `MutexLock`, which cannot forget to unlock.
   void lock() QUARVEL_ACQUIRE() { mutex_.lock(); }
+  /// On the thread that holds the lock.
   void unlock() QUARVEL_RELEASE() { mutex_.unlock(); }
 
  private:
@@ -33,7 +35,9 @@ class QUARVEL_CAPABILITY("mutex") RecursiveMutex {
   RecursiveMutex(const RecursiveMutex&) = delete;
   RecursiveMutex& operator=(const RecursiveMutex&) = delete;
 
+  /// Waits while another thread holds the lock; each `lock` needs its own `unlock`.
   void lock() QUARVEL_ACQUIRE() { mutex_.lock(); }
+  /// On the thread that holds the lock.
   void unlock() QUARVEL_RELEASE() { mutex_.unlock(); }
 
  private:
@@ -44,6 +48,7 @@ class QUARVEL_CAPABILITY("mutex") RecursiveMutex {
 template <class Lock>
 class QUARVEL_SCOPED_CAPABILITY BasicMutexLock {
  public:
+  /// Waits for the lock, which must outlive the scope.
   explicit BasicMutexLock(Lock& lock) QUARVEL_ACQUIRE(lock) : lock_(lock) { lock_.lock(); }
   ~BasicMutexLock() QUARVEL_RELEASE() { lock_.unlock(); }
   BasicMutexLock(const BasicMutexLock&) = delete;
@@ -61,14 +66,16 @@ using RecursiveMutexLock = BasicMutexLock<RecursiveMutex>;
 /// core of the service waits in `Condition`, which its platform can see.
 class ConditionVariable {
  public:
-  /// Releases `mutex` while it waits.
+  /// Releases `mutex` while it waits, and holds it again when it returns. May return without a
+  /// notification.
   void wait(Mutex& mutex) QUARVEL_REQUIRES(mutex) {
     std::unique_lock<std::mutex> lock(mutex.mutex_, std::adopt_lock);
     condition_.wait(lock);
     lock.release();
   }
 
-  /// The same until `deadline`; returns false when it has passed.
+  /// The same until `deadline`; returns false when it has passed. Choose a steady clock: changes of
+  /// the system's time move the deadlines of others.
   template <class Clock, class Duration>
   bool waitUntil(Mutex& mutex, const std::chrono::time_point<Clock, Duration>& deadline)
       QUARVEL_REQUIRES(mutex) {
@@ -78,6 +85,7 @@ class ConditionVariable {
     return woken;
   }
 
+  // Each wakes waiting threads, one or all; without any, nothing happens. The mutex may be held.
   void notifyOne() { condition_.notify_one(); }
   void notifyAll() { condition_.notify_all(); }
 

@@ -121,7 +121,7 @@ Dictionary PayloadValue::toDictionary() const {
 }
 
 // The block is its bytes with a count in front: one allocation a payload.
-struct Payload::Block {
+struct __attribute__((visibility("hidden"))) Payload::Block {
   std::atomic<std::uint32_t> references{1};
   std::uint32_t size = 0;
 

@@ -24,8 +24,8 @@ namespace quarvel {
 class PayloadValue {
  public:
   using Kind = Value::Kind;
-  class Items;
-  class Entries;
+  class Items;    // the range over a list
+  class Entries;  // the range over a dictionary
 
   /// The value whose first byte is at `wellFormed`.
   explicit PayloadValue(const char* wellFormed) : at_(wellFormed) {}
@@ -47,10 +47,11 @@ class PayloadValue {
   }
 
   // Each is none when the value is of another kind. The two integers accept every integer form
-  // whose number fits their type.
+  // whose number fits their type. Texts and bytes are views of the value's bytes, not copies.
   [[nodiscard]] inline std::optional<bool> boolean() const;
   [[nodiscard]] inline std::optional<std::int64_t> integer() const;
   [[nodiscard]] inline std::optional<std::uint64_t> unsignedInteger() const;
+  /// Single precision is widened to a double; an integer is no real.
   [[nodiscard]] inline std::optional<double> real() const;
   [[nodiscard]] std::optional<std::string_view> string() const {
     return octets(MessagePackForm::Kind::string);
@@ -58,6 +59,8 @@ class PayloadValue {
   [[nodiscard]] std::optional<std::string_view> bytes() const {
     return octets(MessagePackForm::Kind::bytes);
   }
+  /// None also for an extension that is no timestamp, and for a date without an RFC 3339 text.
+  /// Finer parts than a microsecond are cut off.
   [[nodiscard]] std::optional<Date> date() const;
 
   /// The number of a list's items or a dictionary's entries; 0 for other kinds.
@@ -69,7 +72,8 @@ class PayloadValue {
   [[nodiscard]] inline Items items() const;
   /// For range-for over a dictionary's entries in the order received; empty for other kinds.
   [[nodiscard]] inline Entries entries() const;
-  /// A dictionary's value under a key; none for other kinds.
+  /// A dictionary's value under a string key; none for other kinds. Walks the entries in order and
+  /// takes the first with this key.
   [[nodiscard]] std::optional<PayloadValue> find(std::string_view key) const;
 
   /// The value's first byte.
@@ -80,19 +84,21 @@ class PayloadValue {
   }
   /// The same value as a tree, which is a copy.
   [[nodiscard]] Value toValue() const;
+  /// A dictionary as a tree; empty for other kinds.
   [[nodiscard]] Dictionary toDictionary() const;
 
  private:
+  /// The bytes behind the head of a value of this kind; none for every other kind.
   [[nodiscard]] std::optional<std::string_view> octets(MessagePackForm::Kind kind) const {
     const MessagePackForm& form = MessagePackForm::at(at_);
     if (form.kind != kind) return std::nullopt;
     return std::string_view(at_ + form.headBytes, static_cast<std::size_t>(form.length(at_)));
   }
 
-  const char* at_;
+  const char* at_;  // the value's first byte; never null
 };
 
-/// One entry of a dictionary. `key` is a string or an integer inside a `Payload`.
+/// One entry of a dictionary, as two views. `key` is a string or an integer inside a `Payload`.
 struct PayloadEntry {
   PayloadValue key;
   PayloadValue value;
@@ -101,6 +107,7 @@ struct PayloadEntry {
 /// A list's values, for range-for. Valid as long as the bytes.
 class PayloadValue::Items {
  public:
+  /// Walks over each item once: `operator++` passes the whole item, however deep.
   class Iterator {
    public:
     Iterator(const char* at, std::size_t left) : at_(at), left_(left) {}
@@ -113,7 +120,7 @@ class PayloadValue::Items {
 
    private:
     const char* at_;
-    std::size_t left_;
+    std::size_t left_;  // items from `at_` on
   };
   Items(const char* first, std::size_t count) : first_(first), count_(count) {}
   [[nodiscard]] Iterator begin() const { return {first_, count_}; }
@@ -127,6 +134,7 @@ class PayloadValue::Items {
 /// A dictionary's entries, for range-for. Valid as long as the bytes.
 class PayloadValue::Entries {
  public:
+  /// Finds a value by walking over its key, so each key is walked over once.
   class Iterator {
    public:
     Iterator(const char* at, std::size_t left) : at_(at), left_(left) {
@@ -143,9 +151,9 @@ class PayloadValue::Entries {
     bool operator==(std::default_sentinel_t) const { return left_ == 0; }
 
    private:
-    const char* at_;
-    const char* value_ = nullptr;
-    std::size_t left_;
+    const char* at_;               // the key
+    const char* value_ = nullptr;  // its value; null in an empty dictionary
+    std::size_t left_;             // entries from `at_` on
   };
   Entries(const char* first, std::size_t count) : first_(first), count_(count) {}
   [[nodiscard]] Iterator begin() const { return {first_, count_}; }
@@ -217,11 +225,15 @@ class Payload {
   /// is a payload. Of equal keys the last one stays. Errors: domain "quarvel.payload", with a
   /// reason.
   [[nodiscard]] static Result<Payload> from(PayloadValue dictionary);
+  /// Encodes a tree. Its strings must be UTF-8 and its dates have an RFC 3339 text, which is not
+  /// checked: the service has built the tree.
   explicit Payload(const Dictionary& dictionary);
   /// The payload in the bytes that a `MessagePackWriter` wrote. Precondition, not checked: they are
   /// a dictionary that is a payload.
   [[nodiscard]] static Payload written(std::string_view encoded) { return Payload(encoded); }
 
+  // A copy shares the block and costs an atomic addition. A moved-from payload is the empty
+  // dictionary.
   Payload(const Payload& other) noexcept;
   Payload(Payload&& other) noexcept : block_(std::exchange(other.block_, nullptr)) {}
   Payload& operator=(Payload other) noexcept {
@@ -253,17 +265,21 @@ class Payload {
   /// changes.
   [[nodiscard]] Payload replacingInKeys(char from, char to) const;
 
-  /// The payload with `value` under `key`: in place of an old value, else at the end.
+  /// The payload with `value` under `key`: in place of an old value, else at the end. Copies the
+  /// bytes; this payload does not change. `value` must be one that a payload may hold.
   [[nodiscard]] Payload setting(std::string_view key, const Value& value) const;
 
-  /// Whether both are the same block, or hold the same bytes.
+  /// Whether both are the same block, or hold the same bytes. The same entries in another order are
+  /// other bytes.
   bool operator==(const Payload& other) const { return encoded() == other.encoded(); }
+  /// Whether both are copies of one payload, or both made as the empty dictionary.
   [[nodiscard]] bool sharesBlockWith(const Payload& other) const { return block_ == other.block_; }
 
  private:
   /// The shared bytes with their reference count; null stands for the empty dictionary.
   struct Block;
   explicit Payload(std::string_view encoded);
+  /// The first byte of the block, or of a constant empty dictionary.
   [[nodiscard]] const char* bytes() const;
 
   Block* block_;

@@ -12,11 +12,12 @@ namespace quarvel {
 /// be called from any thread; the secret is drawn at the first call and never changes.
 class SecretHash {
  public:
+  /// Differs from process to process: never store or send a hash.
   static std::uint64_t of(std::uint64_t number) {
     const auto& [first, second] = secret();
     return fold(number ^ first, second);
   }
-  /// Takes the text 16 octets at a time.
+  /// Takes the text 16 octets at a time; the last step overlaps the one before where it can.
   static std::uint64_t of(std::string_view text) {
     const auto& [first, second] = secret();
     const char* at = text.data();
@@ -41,8 +42,9 @@ class SecretHash {
 
  private:
   struct Secret {
-    std::uint64_t first, second;
+    std::uint64_t first, second;  // random, from the system
   };
+  /// Drawn once: the language makes other threads wait for the first.
   static const Secret& secret() {
     static const Secret drawn = [] {
       std::random_device device;

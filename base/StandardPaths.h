@@ -12,9 +12,9 @@ namespace quarvel {
 /// A value: read it once and keep it. Reading takes the environment, which nothing may change
 /// meanwhile.
 struct StandardPaths {
-  std::filesystem::path runtime;
-  std::filesystem::path state;
-  std::filesystem::path configuration;
+  std::filesystem::path runtime;        // sockets, status and notifications; gone after a reboot
+  std::filesystem::path state;          // the store
+  std::filesystem::path configuration;  // quarvel.toml and preferences/
   /// The listening socket: `$QUARVEL_SOCKET`, or reporting.sock in `runtime`.
   std::filesystem::path socket;
   /// Prefix of the diagnostics directory: `$QUARVEL_DIAGNOSTICS_PREFIX`, empty by default.
@@ -25,6 +25,7 @@ struct StandardPaths {
   [[nodiscard]] static StandardPaths fromEnvironment(bool root);
   [[nodiscard]] static StandardPaths fromEnvironment();
 
+  /// One of the three directories.
   enum class Kind : std::uint8_t { runtime, state, configuration };
 
   /// The directories where a service's files may be, in the order in which a client or tool looks:

@@ -7,7 +7,8 @@
 
 namespace quarvel {
 
-/// Whether a text is plain ASCII. Takes a few instructions for a short text, as most are.
+/// Whether a text is plain ASCII, the empty text too. Takes a few instructions for a short text, as
+/// most are.
 [[nodiscard]] inline bool IsAscii(std::string_view text) {
   constexpr std::uint64_t kHighBits = 0x8080808080808080U;
   const auto load = [&text]<class Unsigned>(Unsigned bytes, std::size_t offset) -> std::uint64_t {
@@ -32,8 +33,9 @@ namespace quarvel {
 /// surrogates, nothing above U+10FFFF.
 [[nodiscard]] inline bool IsUtf8(std::string_view text) {
   if (IsAscii(text)) return true;
-  const auto* at = reinterpret_cast<const unsigned char*>(text.data());
+  const auto* at = reinterpret_cast<const unsigned char*>(text.data());  // bytes above 127 positive
   const auto* const end = at + text.size();
+  // Whether a byte within the text is a continuation, of a narrower range after some lead bytes.
   const auto continues = [&](std::ptrdiff_t offset, unsigned low = 0x80, unsigned high = 0xbf) {
     return end - at > offset && at[offset] >= low && at[offset] <= high;
   };
@@ -53,13 +55,13 @@ namespace quarvel {
       if (!continues(1)) return false;
       at += 2;
     } else if (lead >= 0xe0 && lead <= 0xef) {
-      const unsigned low = lead == 0xe0 ? 0xa0 : 0x80;
-      const unsigned high = lead == 0xed ? 0x9f : 0xbf;
+      const unsigned low = lead == 0xe0 ? 0xa0 : 0x80;   // below: overlong
+      const unsigned high = lead == 0xed ? 0x9f : 0xbf;  // above: surrogates
       if (!continues(1, low, high) || !continues(2)) return false;
       at += 3;
     } else if (lead >= 0xf0 && lead <= 0xf4) {
-      const unsigned low = lead == 0xf0 ? 0x90 : 0x80;
-      const unsigned high = lead == 0xf4 ? 0x8f : 0xbf;
+      const unsigned low = lead == 0xf0 ? 0x90 : 0x80;   // below: overlong
+      const unsigned high = lead == 0xf4 ? 0x8f : 0xbf;  // above: U+10FFFF
       if (!continues(1, low, high) || !continues(2) || !continues(3)) return false;
       at += 4;
     } else {
@@ -70,6 +72,7 @@ namespace quarvel {
 }
 
 /// The longest beginning of UTF-8 text that has at most `bytes` bytes and ends between characters.
+/// A view of `text`. Characters that combine may be parted.
 [[nodiscard]] inline std::string_view Utf8Prefix(std::string_view text, std::size_t bytes) {
   if (text.size() <= bytes) return text;
   const auto isInside = [&text](std::size_t at) {

@@ -22,6 +22,7 @@ concept IntegerNumber = std::integral<T> && !std::same_as<T, bool>;
 
 class Value;
 class Dictionary;
+/// Values in order. A list may hold values of different kinds.
 using List = std::vector<Value>;
 
 /// Octets that are not text. A type of its own, since a string is UTF-8.
@@ -34,9 +35,11 @@ struct Bytes {
 /// unsigned, so that equal numbers are equal keys.
 class Key {
  public:
+  // Strings and integers convert to a key. A string is copied or moved in, and must be UTF-8.
   Key(std::string text) : key_(std::move(text)) {}         // NOLINT(google-explicit-constructor)
   Key(std::string_view text) : key_(std::string(text)) {}  // NOLINT(google-explicit-constructor)
   Key(const char* text) : key_(std::string(text)) {}       // NOLINT(google-explicit-constructor)
+  /// Equal numbers of different types are equal keys.
   template <IntegerNumber Integer>
   Key(Integer integer) {  // NOLINT(google-explicit-constructor)
     if (std::in_range<std::int64_t>(integer)) {
@@ -46,14 +49,18 @@ class Key {
     }
   }
 
-  // Each is null when the key is of another kind.
+  // Each is null when the key is of another kind, and valid as long as the key is.
   [[nodiscard]] const std::string* string() const { return std::get_if<std::string>(&key_); }
+  /// The number, when it fits 64 bits with a sign.
   [[nodiscard]] const std::int64_t* integer() const { return std::get_if<std::int64_t>(&key_); }
+  /// The number, when it is 2^63 or more.
   [[nodiscard]] const std::uint64_t* unsignedInteger() const {
     return std::get_if<std::uint64_t>(&key_);
   }
-  /// Keyed with a secret of the process, so that clients cannot write keys that collide.
+  /// Keyed with a secret of the process, so that clients cannot write keys that collide. Differs in
+  /// the next process: never stored or sent.
   [[nodiscard]] std::size_t hash() const;
+  /// A string never equals a number: "5" and 5 are two keys.
   bool operator==(const Key&) const = default;
 
  private:
@@ -68,14 +75,14 @@ class Value {
  public:
   /// The order is that of MessagePack's forms in `MessagePackForm`.
   enum class Kind : std::uint8_t {
-    nil,
-    boolean,
+    nil,      // present, without a value; JSON's null
+    boolean,  // never equal to a number
     integer,
-    unsignedInteger,
-    real,
-    string,
-    bytes,
-    date,
+    unsignedInteger,  // 2^63 and more: smaller numbers are `integer`
+    real,             // a double, also when it has no fraction
+    string,           // UTF-8
+    bytes,            // octets without a meaning here
+    date,             // microseconds in UTC
     list,
     dictionary
   };
@@ -107,7 +114,8 @@ class Value {
   [[nodiscard]] Kind kind() const { return static_cast<Kind>(value_.index()); }
   [[nodiscard]] bool isNil() const { return kind() == Kind::nil; }
 
-  // Each is null when the value is of another kind.
+  // Each is null when the value is of another kind. There is no conversion between kinds: the
+  // number 1 has no `real`. The pointers are valid until the value changes or ends.
   [[nodiscard]] const bool* boolean() const { return std::get_if<bool>(&value_); }
   [[nodiscard]] const std::int64_t* integer() const { return std::get_if<std::int64_t>(&value_); }
   [[nodiscard]] const std::uint64_t* unsignedInteger() const {
@@ -120,7 +128,8 @@ class Value {
   [[nodiscard]] const List* list() const { return std::get_if<List>(&value_); }
   [[nodiscard]] const Dictionary* dictionary() const;
 
-  /// Values of different kinds are different, also when their numbers are equal.
+  /// Values of different kinds are different, also when their numbers are equal. Compares whole
+  /// trees; a real that is not a number equals nothing, itself included.
   bool operator==(const Value& other) const;
 
  private:
@@ -149,6 +158,7 @@ class Value {
 /// equal when they hold equal entries, in any order. Not synchronised.
 class Dictionary {
  public:
+  /// A key and its value. The key of a stored entry never changes.
   using Entry = std::pair<Key, Value>;
 
   Dictionary() = default;
@@ -157,11 +167,13 @@ class Dictionary {
 
   /// Null when there is no such key. Valid until the dictionary changes.
   [[nodiscard]] const Value* find(const Key& key) const;
-  /// A new value replaces an old one in its place.
+  /// Takes both over. A new value replaces an old one in its place; a new key comes last.
   void set(Key key, Value value);
-  /// Sets every entry of `other`; nothing is removed.
+  /// Sets every entry of `other`, in its order; nothing is removed. Values are copied, and nested
+  /// dictionaries are replaced, not merged.
   void merge(const Dictionary& other);
 
+  /// The number of entries; a nested dictionary is one.
   [[nodiscard]] std::size_t size() const { return entries_.size(); }
   [[nodiscard]] bool empty() const { return entries_.empty(); }
   /// For range-for over the entries, in their order. Valid until the dictionary changes.
@@ -178,10 +190,11 @@ class Dictionary {
   /// time; below it a linear search is faster.
   static constexpr std::size_t kIndexedFrom = 16;
 
+  /// The entry's place in `entries_`, or `entries_.size()` when there is no such key.
   [[nodiscard]] std::size_t indexOf(const Key& key) const;
 
-  std::vector<Entry> entries_;
-  std::unordered_map<Key, std::size_t, KeyHash> index_;
+  std::vector<Entry> entries_;  // in the order in which their keys were first set
+  std::unordered_map<Key, std::size_t, KeyHash> index_;  // empty below `kIndexedFrom` entries
 };
 
 }  // namespace quarvel

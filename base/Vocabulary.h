@@ -10,7 +10,7 @@ namespace quarvel::vocabulary {
 
 /// The high half of a category: the part of the system that produced the message.
 enum class Component : std::uint32_t {
-  none = 0,
+  none = 0,  // the name is the kind's alone
   session = 0x0800'0000,
   dsp = 0x1000'0000,
   hal = 0x2000'0000,
@@ -35,11 +35,13 @@ enum class Kind : std::uint16_t {
 
 /// A message's category. Codes outside the two tables are allowed and keep their number.
 struct Category {
-  std::uint32_t code;
+  std::uint32_t code;  // component in the high 16 bits, kind in the low 16
 
+  /// Any number, as a client has sent it.
   constexpr explicit Category(std::uint32_t number) : code(number) {}
   constexpr Category(Kind kind)  // NOLINT(google-explicit-constructor): a kind alone is a category
       : code(static_cast<std::uint32_t>(kind)) {}
+  /// The kind of a component.
   constexpr Category(Component component, Kind kind)
       : code(static_cast<std::uint32_t>(component) | static_cast<std::uint32_t>(kind)) {}
   constexpr bool operator==(const Category&) const = default;
@@ -48,11 +50,11 @@ struct Category {
 /// A message's type. Every 16-bit code is allowed.
 enum class MessageType : std::uint16_t {
   generic = 0,
-  start = 1,
-  stop = 2,
+  start = 1,  // the subject has begun
+  stop = 2,   // the subject has ended
   setup = 3,
   error = 4,
-  issueDetector = 5,
+  issueDetector = 5,  // found by a detector of faults
   unknown = 65535,
 };
 
@@ -69,8 +71,8 @@ enum class ServiceType : std::uint16_t {
   nonLongFormAudio = 8,
   audioDeviceUsage = 9,
   alerts = 10,
-  test = 11,
-  unknown = 65535,
+  test = 11,        // messages of such a session are counted and go to no backend
+  unknown = 65535,  // also the type of a session that the service does not know
 };
 
 /// The composed name: "HAL_Playback", "Playback" without a component, "_Generic" with an unknown
@@ -87,9 +89,11 @@ struct CategoryName {
   std::string_view component;
   std::string_view kind;
 };
+/// Allocates nothing: both views are of constant texts.
 [[nodiscard]] CategoryName PiecesOf(Category category);
 
-/// The names of codes that may be wider than 16 bits: such a code is outside the table.
+/// The names of codes that may be wider than 16 bits: such a code is outside the table. They are
+/// "Undefined" for a type and the empty text for a service type. Valid for ever.
 [[nodiscard]] std::string_view TypeName(std::uint32_t code);
 [[nodiscard]] std::string_view ServiceTypeName(std::uint32_t code);
 

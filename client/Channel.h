@@ -50,10 +50,14 @@ class __attribute__((visibility("hidden"))) Client::Channel
   /// Connects and starts the driver. Errors: `Code::unreachable`, also when the process can have no
   /// further descriptor or thread.
   [[nodiscard]] static Result<std::shared_ptr<Channel>> open(Options options);
+  /// For `open`, which then begins. `path` is the socket's.
   Channel(Options options, std::string path);
+  /// The connection is closed: `close` was called, or `begin` has failed.
   ~Channel();
 
+  /// The result of sending a call.
   struct Sent {
+    /// `none`: sent or gathered. Else the error that the reply gets, if there is one.
     Code code = Code::none;
     /// The number under which the reply is pending; none for a notification or a refused call.
     std::optional<std::uint32_t> call;
@@ -75,9 +79,11 @@ class __attribute__((visibility("hidden"))) Client::Channel
   /// Has the driver run `work` at `time`, and again at each time that a run returns.
   void schedule(Time time, std::weak_ptr<Periodic> work) QUARVEL_EXCLUDES(mutex_);
 
+  /// False from the loss of the connection until it is made again.
   [[nodiscard]] bool connected() const QUARVEL_EXCLUDES(mutex_);
   /// Whether the connection is lost and will be made again.
   [[nodiscard]] bool reconnecting() const QUARVEL_EXCLUDES(mutex_);
+  /// Readable when `dispatch` has work; -1 when the connection has its own thread.
   [[nodiscard]] int descriptor() const { return ownThread() ? -1 : poller_.descriptor(); }
   /// Whether this thread is the driver, that is, whether the caller is a reply.
   [[nodiscard]] bool onDriver() const { return driver_.load() == std::this_thread::get_id(); }
@@ -107,6 +113,7 @@ class __attribute__((visibility("hidden"))) Client::Channel
 
   /// `down`: will be made again; `lost`: will not.
   enum class Link : std::uint8_t { up, down, lost };
+  /// `failed`: the connection is broken, which the driver notices when it reads.
   enum class Written : std::uint8_t { all, some, failed };
 
   /// A call that the service has not answered yet.
@@ -142,6 +149,7 @@ class __attribute__((visibility("hidden"))) Client::Channel
   /// start's `reply` may be kept with its session.
   [[nodiscard]] Code checkCall(const SessionCall& session, AnyReply& reply)
       QUARVEL_REQUIRES(mutex_);
+  /// A number that no pending call has; numbers come again after 2^32 calls.
   [[nodiscard]] std::uint32_t nextNumber() QUARVEL_REQUIRES(mutex_);
   /// Has the driver deliver an error.
   void refuse(AnyReply&& reply, Code code) QUARVEL_REQUIRES(mutex_);
@@ -154,12 +162,14 @@ class __attribute__((visibility("hidden"))) Client::Channel
   /// Writes the gathered calls unless a batch, another writer or the driver will; then waits while
   /// too many bytes have gathered, where that is allowed.
   void sendIfDue() QUARVEL_REQUIRES(mutex_);
+  /// Whether bytes of calls are gathered or partly written.
   [[nodiscard]] bool hasOutput() const QUARVEL_REQUIRES(mutex_);
   /// Writes gathered calls, other threads' calls too, for at most `kRounds` rounds. Releases the
   /// mutex during each system call.
   void write(bool mayWait) QUARVEL_REQUIRES(mutex_);
   /// Writes `sending_`; `some`: the socket is full and `mayWait` is false.
   [[nodiscard]] Written writeSending(int socket, bool mayWait);
+  /// Has the driver wake when the socket takes bytes again.
   void watchOutput(bool wanted) QUARVEL_REQUIRES(mutex_);
 
   /// Whether the driver must write: batches do not hold the bytes back.
@@ -171,6 +181,7 @@ class __attribute__((visibility("hidden"))) Client::Channel
   void run() QUARVEL_EXCLUDES(mutex_);
   /// Waits for events until `deadline` and handles them: input, timers, refusals, output.
   void step(std::optional<Time> deadline) QUARVEL_EXCLUDES(mutex_);
+  /// Whether `close` was called.
   [[nodiscard]] bool closing() const QUARVEL_EXCLUDES(mutex_);
   /// Sends the gathered calls, ends the connection and answers every pending call.
   void finish() QUARVEL_EXCLUDES(mutex_);
@@ -179,10 +190,15 @@ class __attribute__((visibility("hidden"))) Client::Channel
   /// In a child process: closes the copies of the descriptors and does nothing else.
   void abandon();
 
+  /// Reads for at most `kRounds` rounds and delivers the replies; handles a loss.
   void receiveReplies() QUARVEL_EXCLUDES(mutex_);
+  // Both return the reason when the connection is lost; `more`: bytes may be left in the socket.
   [[nodiscard]] std::optional<std::string> receive(bool& more) QUARVEL_EXCLUDES(mutex_);
   [[nodiscard]] std::optional<std::string> deliverReplies() QUARVEL_EXCLUDES(mutex_);
+  /// False when the bytes are no response. A response without a pending call is ignored: its caller
+  /// has stopped waiting.
   [[nodiscard]] bool deliverReply(PayloadValue response) QUARVEL_EXCLUDES(mutex_);
+  /// Delivers the errors of `refused_`.
   void deliverRefusals() QUARVEL_EXCLUDES(mutex_);
 
   // Loss and reconnection, on the driver.
@@ -190,14 +206,19 @@ class __attribute__((visibility("hidden"))) Client::Channel
   /// Closes the socket, refuses or keeps the pending replies, plans the first attempt, and reports
   /// the change.
   void handleLoss(const std::string& reason, bool forGood) QUARVEL_EXCLUDES(mutex_);
+  /// Forgets the bytes not sent; returns the number of notifications among them.
   [[nodiscard]] std::size_t dropOutput() QUARVEL_REQUIRES(mutex_);
+  /// Refuses the pending calls, or keeps their replies; returns the number refused.
   [[nodiscard]] std::size_t refusePending() QUARVEL_REQUIRES(mutex_);
   /// The wait before the next attempt, with its jitter; doubles the one after it.
   [[nodiscard]] std::chrono::milliseconds nextDelay();
+  /// Makes one attempt; plans the next when it fails.
   void reconnect() QUARVEL_EXCLUDES(mutex_);
   /// Frames the calls that create the sessions anew; returns their number.
   [[nodiscard]] std::size_t restoreSessions() QUARVEL_REQUIRES(mutex_);
+  /// Runs the work that is due, without the mutex.
   void runScheduled() QUARVEL_EXCLUDES(mutex_);
+  /// Sets the poller's timer to the earliest work or attempt.
   void armTimer() QUARVEL_EXCLUDES(mutex_);
 
   // Constant after construction.
@@ -232,15 +253,15 @@ class __attribute__((visibility("hidden"))) Client::Channel
   std::size_t sent_ = 0;  // bytes of `sending_`
 
   // For the driver alone.
-  std::vector<char> received_;
+  std::vector<char> received_;  // input; [begin_, end_) are not delivered yet
   std::size_t begin_ = 0;
   std::size_t end_ = 0;
   MessagePackScanner scanner_{kReplyBytes, MessagePackScanner::kDeepest};
-  std::string lossReason_;
-  Time connectedAt_{};
-  std::optional<Time> reconnectAt_;
-  std::chrono::milliseconds delay_{};
-  std::minstd_rand random_;
+  std::string lossReason_;             // for the error of refused calls
+  Time connectedAt_{};                 // of the present connection
+  std::optional<Time> reconnectAt_;    // of the next attempt, while the link is down
+  std::chrono::milliseconds delay_{};  // of the next attempt, before its jitter
+  std::minstd_rand random_;            // of the jitter
 };
 
 template <class Request, class T>

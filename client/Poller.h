@@ -15,9 +15,10 @@ class Poller {
  public:
   using Time = std::chrono::steady_clock::time_point;
 
+  /// The events that ended a wait.
   struct Events {
-    bool input = false;  // or the end
-    bool timer = false;
+    bool input = false;  // bytes to read, or the end of the connection
+    bool timer = false;  // the armed time has come
   };
 
   Poller();
@@ -27,10 +28,12 @@ class Poller {
 
   /// 0, or `errno` of the failure to create the descriptors.
   [[nodiscard]] int error() const { return error_; }
+  /// For the program's own loop; the poller keeps it.
   [[nodiscard]] int descriptor() const { return epoll_; }
 
   /// Watches a socket until it is closed or unwatched. Returns 0, or `errno` of the failure.
   [[nodiscard]] int watch(int socket) const;
+  /// Before the socket is closed, while a copy of its descriptor may live on.
   void unwatch(int socket) const;
   /// Whether room to write is an event too.
   void watchOutput(int socket, bool wanted) const;
@@ -48,9 +51,9 @@ class Poller {
 
  private:
   // Constant after construction until they are abandoned.
-  int epoll_ = -1;
-  int wake_ = -1;
-  int timer_ = -1;
+  int epoll_ = -1;  // watches the other two, and the socket
+  int wake_ = -1;   // an event counter
+  int timer_ = -1;  // of the monotonic clock
   int error_ = 0;
 
   std::optional<Time> armed_;  // used by the driver alone

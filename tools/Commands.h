@@ -12,6 +12,7 @@
 
 namespace quarvel::commands {
 
+/// Options of every command.
 struct Options {
   bool json = false;   // JSON Lines for programs instead of tables for people
   std::string socket;  // empty: where the service listens by default
@@ -20,13 +21,13 @@ struct Options {
 
 /// Selects rows of a table in the store.
 struct RowOptions {
-  std::optional<Date> since;
-  std::optional<std::int64_t> last;
-  bool follow = false;  // wait for further rows, without end
+  std::optional<Date> since;         // rows of that time or later; none: all
+  std::optional<std::int64_t> last;  // at most that many, the latest; at least 1
+  bool follow = false;               // wait for further rows, without end
 };
 
 struct MessageOptions : RowOptions {
-  std::optional<std::int64_t> session;
+  std::optional<std::int64_t> session;  // of one session; none: of all
 };
 
 struct EventOptions : RowOptions {
@@ -34,39 +35,44 @@ struct EventOptions : RowOptions {
 };
 
 struct ExportOptions {
-  std::int64_t last = 20;
-  bool wait = false;  // until every backlog is gone
+  std::int64_t last = 20;  // lines of the ledger
+  bool wait = false;       // until every backlog is gone
 };
 
 /// Exactly one of the three.
 struct EraseOptions {
-  std::optional<std::int64_t> session;
-  std::string before;  // RFC 3339, or a day
-  bool all = false;
+  std::optional<std::int64_t> session;  // the rows of one session
+  std::string before;                   // RFC 3339, or a day
+  bool all = false;                     // every row
 };
 
 struct DefaultsOptions {
-  std::string domain = "tarnwick.quarvel";
-  std::string key;  // of `DefaultsRead`: empty for all
+  std::string domain = "tarnwick.quarvel";  // the service's own
+  std::string key;                          // of `DefaultsRead`: empty for all
   std::string value;
   bool string = false;  // the value is a string, even when it looks like a number
   bool notify = false;  // have the service read the change
 };
 
+/// The notification on which the service reads its preferences again.
 inline constexpr const char* kReportingNotification = "tarnwick.quarvel.reporting";
 
 /// Plays a script; "-" is standard input, played line by line as it arrives. A file is read whole
 /// first, so that no line of a faulty file is played.
 [[nodiscard]] Outcome Run(const Options& options, const std::string& file);
 
+/// Prints the IDs of all reporting sessions that clients have.
 [[nodiscard]] Outcome Reporters(const Options& options);
-/// Fails when no client has such a session.
+/// Prints a session's service type. Fails when no client has such a session.
 [[nodiscard]] Outcome Valid(const Options& options, std::int64_t reporterID);
+/// Ends the service; waits until its connection is closed.
 [[nodiscard]] Outcome Kill(const Options& options);
 
 /// Sessions are not followed: a session's line changes until the session ends.
 [[nodiscard]] Outcome Sessions(const Options& options, const RowOptions& which);
+/// Lists messages in the order of storing.
 [[nodiscard]] Outcome Messages(const Options& options, const MessageOptions& which);
+/// Lists analytics or power events in the order of storing.
 [[nodiscard]] Outcome Events(const Options& options, const EventOptions& which);
 /// Summarises the latest run of this session. Fails when the store has none.
 [[nodiscard]] Outcome Summary(const Options& options, std::int64_t reporterID);

@@ -20,7 +20,9 @@ class PreferencesFile {
   /// either.
   [[nodiscard]] static Result<PreferencesFile> open(std::filesystem::path path);
 
+  /// The file, which need not exist.
   [[nodiscard]] const std::filesystem::path& path() const { return path_; }
+  /// The values as the service reads them, with the changes made here.
   [[nodiscard]] const Dictionary& entries() const { return entries_; }
 
   /// Both write the file at once: a reader sees the old file or the new one, never a part.
@@ -31,6 +33,7 @@ class PreferencesFile {
  private:
   PreferencesFile(std::filesystem::path path, std::string text, Dictionary entries);
 
+  /// Writes `text` when it parses to the entries with this one change; null: the key is removed.
   [[nodiscard]] Outcome replace(std::string text, const std::string& key, const Value* value);
 
   std::filesystem::path path_;

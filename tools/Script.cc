@@ -1,4 +1,4 @@
-#include "tools/Script.h"
+#include "tools/Player.h"
 
 #include <fmt/format.h>
 

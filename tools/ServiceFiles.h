@@ -44,9 +44,10 @@ class FileArrival {
   [[nodiscard]] bool wait(const char* name, std::chrono::milliseconds timeout) const;
 
  private:
+  /// Takes the events that have come so far.
   [[nodiscard]] bool hasArrived(const char* name) const;
 
-  const int descriptor_;
+  const int descriptor_;  // of inotify, or -1
   const bool watching_;
 };
 

@@ -17,8 +17,8 @@ namespace quarvel {
 
 /// One agent session.
 struct StoredSession {
-  std::int64_t id;
-  std::int64_t reporterID;
+  std::int64_t id;          // of the row; grows with each opening
+  std::int64_t reporterID;  // chosen by the client, and perhaps used again
   std::int64_t clientType;
   double clientVersion;
   bool batchEvent;
@@ -28,7 +28,7 @@ struct StoredSession {
   std::string userInfo;  // JSON
   Date openedAt;
   std::optional<Date> flushedAt;  // none: still open, or the service ended before
-  std::int64_t messages;
+  std::int64_t messages;          // rows of this session still in the store
 };
 
 /// One message.
@@ -131,9 +131,9 @@ class StoreReader {
   /// Before each query: a service may have begun to write a store that was opened as immutable.
   [[nodiscard]] Outcome reconnect();
 
-  std::string path_;
+  std::string path_;  // of the file
   SqliteConnection connection_;
-  bool isImmutable_ = false;
+  bool isImmutable_ = false;  // opened without locks, while no service wrote it
 };
 
 /// Waits for writes to a store. Owned by the command that follows rows; one thread.

@@ -15,10 +15,11 @@ namespace quarvel {
 class Table {
  public:
   struct Column {
-    std::string_view heading;
-    bool toTheRight = false;  // numbers
+    std::string_view heading;  // a constant
+    bool toTheRight = false;   // numbers
   };
 
+  /// Without a terminal nothing is cut.
   Table(std::vector<Column> columns, const Terminal& terminal);
 
   /// Takes one cell for each column.
@@ -34,9 +35,9 @@ class Table {
 
   const std::vector<Column> columns_;
   const Terminal terminal_;
-  std::vector<std::size_t> widths_;
-  std::vector<std::vector<std::string>> rows_;
-  bool begun_ = false;
+  std::vector<std::size_t> widths_;  // of the widest cells so far, in columns of a terminal
+  std::vector<std::vector<std::string>> rows_;  // added and not printed yet
+  bool begun_ = false;                          // the heading is printed
 };
 
 }  // namespace quarvel

@@ -12,6 +12,7 @@ struct Terminal {
   bool coloured = false;     // attached, and NO_COLOR is not set or empty
   std::size_t columns = 80;  // when attached
 
+  /// As it is now; a later change of the window's size is not seen.
   [[nodiscard]] static Terminal standardOutput();
 };
 

@@ -1,12 +1,9 @@
+#include <fmt/format.h>
 #include <gmock/gmock.h>
-#include <gtest/gtest.h>
 #include <sys/stat.h>
 
-#include <cerrno>
 #include <cmath>
-#include <filesystem>
 #include <fstream>
-#include <limits>
 
 #include "base/Files.h"
 #include "base/Json.h"
@@ -22,11 +19,11 @@ namespace fs = std::filesystem;
 using testing::HasSubstr;
 using Progress = MessagePackScanner::Progress;
 
-std::string Encoded(const Value& value) {
+struct Fault {
+  const char* name;
   std::string bytes;
-  MessagePackWriter(bytes).value(value);
-  return bytes;
-}
+  const char* reason;
+};
 
 List EveryForm() {
   List forms{nullptr, true, false, Value(1.5), Value(-0.0), Bytes{"\x00\xff"}, "text"};
@@ -35,7 +32,7 @@ List EveryForm() {
     forms.insert(forms.end(), {edge - 1, edge, -static_cast<std::int64_t>(edge - 1) - 1,
                                -static_cast<std::int64_t>(edge - 1)});
   }
-  forms.emplace_back(std::numeric_limits<std::uint64_t>::max());
+  forms.emplace_back(UINT64_MAX);
   for (const std::size_t length : {0U, 31U, 32U, 255U, 256U, 65'535U, 65'536U}) {
     forms.emplace_back(std::string(length, 's'));
     forms.emplace_back(Bytes{std::string(length, 'b')});
@@ -45,33 +42,29 @@ List EveryForm() {
   for (int i = 0; i < 70'000; ++i) large.set(i, i);
   forms.emplace_back(std::move(large));
   for (const std::int64_t microseconds :
-       {std::int64_t{0}, std::int64_t{1}, std::int64_t{-1}, std::int64_t{1'769'865'901'123'456},
-        std::int64_t{4'294'967'296'000'000}, std::int64_t{17'179'869'184'000'000}}) {
+       {0L, 1L, -1L, 1'769'865'901'123'456L, 4'294'967'296'000'000L, 17'179'869'184'000'000L}) {
     forms.emplace_back(Date(std::chrono::microseconds(microseconds)));
   }
-  forms.emplace_back(kEarliestDate);
-  forms.emplace_back(kLatestDate);
+  forms.insert(forms.end(), {kEarliestDate, kLatestDate});
   return forms;
 }
 
 TEST(MessagePack, EveryFormComesBackAsItWasWritten) {
   for (const Value& form : EveryForm()) {
-    const std::string bytes = Encoded(form);
+    std::string bytes;
+    MessagePackWriter(bytes).value(form);
     MessagePackScanner scanner(bytes.size(), 4);
     ASSERT_EQ(scanner.scan(bytes), Progress::complete) << scanner.fault();
     EXPECT_EQ(scanner.length(), bytes.size());
-    EXPECT_EQ(PayloadValue(bytes.data()).toValue(), form);
-    EXPECT_EQ(PayloadValue(bytes.data()).kind(), form.kind());
-    EXPECT_EQ(PayloadValue(bytes.data()).encoded().size(), bytes.size());
+    const PayloadValue read(bytes.data());
+    EXPECT_EQ(read.toValue(), form);
+    EXPECT_EQ(read.kind(), form.kind());
+    EXPECT_EQ(read.encoded().size(), bytes.size());
   }
 }
 
 TEST(MessagePackScanner, RefusesLiesBeforeTheirBytesArrive) {
-  const struct {
-    const char* name;
-    std::string bytes;
-    const char* reason;
-  } kRows[] = {
+  const Fault kRows[] = {
       {"list longer than a message", {"\xdd\xff\xff\xff\xff", 5}, "needs"},
       {"dictionary longer than a message", {"\xdf\x00\x00\x02\x01", 5}, "needs"},
       {"dictionary whose doubled count overflows", {"\xdf\xff\xff\xff\xff", 5}, "needs"},
@@ -92,11 +85,7 @@ TEST(MessagePackScanner, RefusesLiesBeforeTheirBytesArrive) {
 }
 
 TEST(Payload, RefusesWhatIsNoPayload) {
-  const struct {
-    const char* name;
-    std::string bytes;
-    const char* reason;
-  } kRows[] = {
+  const Fault kRows[] = {
       {"no dictionary", {"\x90", 1}, "not a dictionary"},
       {"list as a key", {"\x81\x90\x01", 3}, "neither a string nor an integer"},
       {"boolean as a nested key", {"\x81\xa1k\x81\xc3\x01", 6}, "neither a string nor an integer"},
@@ -112,15 +101,11 @@ TEST(Payload, RefusesWhatIsNoPayload) {
       {"overlong form", {"\x81\xa1k\xa2\xc0\xaf", 6}, "not UTF-8"},
       {"surrogate", {"\x81\xa1k\xa3\xed\xa0\x80", 7}, "not UTF-8"},
       {"above U+10FFFF", {"\x81\xa1k\xa4\xf4\x90\x80\x80", 8}, "not UTF-8"},
-      {"cut off after eight plain bytes",
-       {"\x81\xa1k\xaa"
-        "12345678\xe2\x82",
-        14},
-       "not UTF-8"},
+      {"cut off after eight plain bytes", {"\x81\xa1k\xaaplainly \xe2\x82", 14}, "not UTF-8"},
   };
   for (const auto& row : kRows) {
     MessagePackScanner scanner(1024, 4);
-    ASSERT_EQ(scanner.scan(row.bytes), MessagePackScanner::Progress::complete) << row.name;
+    ASSERT_EQ(scanner.scan(row.bytes), Progress::complete) << row.name;
     const Result<Payload> payload = Payload::from(PayloadValue(row.bytes.data()));
     ASSERT_FALSE(payload) << row.name;
     EXPECT_THAT(payload.error().description(), HasSubstr(row.reason)) << row.name;
@@ -135,37 +120,20 @@ TEST(Payload, OfEqualKeysTheLastCounts) {
   writer.dictionary(2 * kKeys);
   for (std::int64_t i = 0; i < 2 * kKeys; ++i) {
     const std::int64_t nth = i % kKeys / 3;
-    if (i % 3 == 0)
-      writer.string(std::string(static_cast<std::size_t>(nth % 40), 'k') + std::to_string(nth));
+    if (i % 3 == 0) writer.string(fmt::format("{:k>{}}", nth, nth % 40 + 1));
     if (i % 3 == 1) writer.integer(-1 - nth);
     if (i % 3 == 2) writer.unsignedInteger(static_cast<std::uint64_t>(-1 - nth));
     writer.integer(i);
   }
-  const struct {
-    std::string bytes;
-    std::string json;
-  } kRows[] = {
-      {"\x82\xa1"
-       "a\x01\xa1"
-       "a\x02",
-       R"({"a":2})"},
-      {"\x83\xa1"
-       "a\x01\xa1"
-       "b\x02\xa1"
-       "a\x03",
-       R"({"b":2,"a":3})"},
-      {"\x81\xa1"
-       "n\x91\x82\xa1"
-       "a\x01\xa1"
-       "a\x02",
-       R"({"n":[{"a":2}]})"},
+  const std::pair<std::string, std::string> rows[] = {
+      {"\x82\xa1k\x01\xa1k\x02", R"({"k":2})"},
+      {"\x83\xa1k\x01\xa1m\x02\xa1k\x03", R"({"m":2,"k":3})"},
+      {"\x81\xa1n\x91\x82\xa1k\x01\xa1k\x02", R"({"n":[{"k":2}]})"},
       {std::string("\x82\x05\x01\xcd\x00\x05\x02", 7), R"({"5":2})"},
-      {"\x82\x05\x01\xa1"
-       "5\x02",
-       R"({"5":1,"5":2})"},
+      {"\x82\x05\x01\xa1\x35\x02", R"({"5":1,"5":2})"},
   };
-  for (const auto& row : kRows) {
-    EXPECT_EQ(JsonText(Payload::from(PayloadValue(row.bytes.data())).value()), row.json);
+  for (const auto& [bytes, json] : rows) {
+    EXPECT_EQ(JsonText(Payload::from(PayloadValue(bytes.data())).value()), json);
   }
   const Payload unique = Payload::from(PayloadValue(many.data())).value();
   EXPECT_EQ(unique.count(), kKeys);
@@ -189,7 +157,7 @@ TEST(Json, IsReadBackAsWhatItWas) {
         1e9, 1e15, 1e16, -1e300, 5e-324, std::numeric_limits<double>::max(), 1.0 / 3}) {
     values.emplace_back(number);
   }
-  values.emplace_back(std::numeric_limits<std::int64_t>::min());
+  values.emplace_back(INT64_MIN);
   // Every character that needs an escape, at every place around the steps of eight.
   for (std::size_t length = 0; length <= 20; ++length) {
     for (std::size_t at = 0; at < length; ++at) {
@@ -207,14 +175,12 @@ TEST(Json, IsReadBackAsWhatItWas) {
   EXPECT_TRUE(std::signbit(*(*read.value().list())[1].real()));
 }
 
-TEST(Json, ComesBackAsATree) {
-  const std::string text =
-      R"({"a":[1,-2,18446744073709551615,2.5,true,null,{"b":"\u20ac"}],"c":{}})";
-  const Result<Value> tree = ValueFromJson(text);
-  ASSERT_TRUE(tree);
-  EXPECT_EQ(tree.value(), (Dictionary{{"a", List{1, -2, std::numeric_limits<std::uint64_t>::max(),
-                                                 2.5, true, nullptr, Dictionary{{"b", "\u20ac"}}}},
-                                      {"c", Dictionary{}}}));
+TEST(Json, IsReadAsATree) {
+  EXPECT_EQ(
+      ValueFromJson(R"({"a":[1,-2,18446744073709551615,2.5,true,null,{"b":"\u20ac"}],"c":{}})")
+          .value(),
+      (Dictionary{{"a", List{1, -2, UINT64_MAX, 2.5, true, nullptr, Dictionary{{"b", "€"}}}},
+                  {"c", Dictionary{}}}));
   for (const char* bad : {"", "{", "[1,]", "{\"a\":1} x", "\"\xff\"", "nul"}) {
     EXPECT_FALSE(ValueFromJson(bad)) << bad;
   }
@@ -262,13 +228,17 @@ TEST(Vocabulary, NamesAreFixed) {
 
 TEST(Dictionary, ALargeOneKeepsOrderAndReplacesInPlace) {
   Dictionary dictionary;
-  for (int round = 0; round < 2; ++round) {
-    for (int i = 0; i < 50; ++i) dictionary.set("key " + std::to_string(i), i + 100 * round);
-  }
+  for (int i = 0; i < 100; ++i) dictionary.set(fmt::format("key {}", i % 50), i + 50);
   EXPECT_EQ(dictionary.size(), 50);
   int expected = 100;
   for (const auto& [key, value] : dictionary) EXPECT_EQ(value, Value(expected++));
   EXPECT_EQ(dictionary.find("key 50"), nullptr);
+}
+
+/// The code of a failure; 0 for success.
+template <class T>
+std::int64_t CodeOf(const Result<T>& result) {
+  return result ? 0 : result.error().code;
 }
 
 TEST(FilesTest, DirectoriesAreMadeWithTheirPermissions) {
@@ -284,12 +254,9 @@ TEST(FilesTest, DirectoriesAreMadeWithTheirPermissions) {
   // One that exists stays as it is.
   ASSERT_TRUE(MakeDirectory((directory.path() / "a/b").native(), 0777).ok());
   EXPECT_EQ(fs::status(directory.path() / "a/b").permissions(), fs::perms::owner_all);
-
   const fs::path file = directory.write("file", "");
-  for (const fs::path& impossible : {file, file / "below"}) {
-    const Outcome outcome = MakeDirectory(impossible.native(), 0777);
-    ASSERT_FALSE(outcome.ok()) << impossible;
-    EXPECT_EQ(outcome.error().code, ENOTDIR);
+  for (const fs::path& path : {file, file / "below"}) {
+    EXPECT_EQ(CodeOf(MakeDirectory(path.native(), 0777)), ENOTDIR) << path;
   }
 }
 
@@ -320,22 +287,19 @@ TEST(FilesTest, AWholeFileIsReadUpToItsBoundAndNeverWaitedFor) {
   const std::pair<fs::path, int> failures[] = {
       {file, EFBIG}, {directory.path(), EISDIR}, {file / "below", ENOTDIR}, {"absent", ENOENT}};
   for (const auto& [path, status] : failures) {
-    const auto read = ReadWholeFile(path, text.size() - 1);
-    ASSERT_FALSE(read) << path;
-    EXPECT_EQ(read.error().code, status) << path;
+    EXPECT_EQ(CodeOf(ReadWholeFile(path, text.size() - 1)), status) << path;
   }
 }
 
 TEST(FilesTest, WritingThatFailsLeavesNothingBehind) {
   const TemporaryDirectory directory;
   const Outcome missing = ReplaceFile((directory.path() / "no/file").native(), "x");
-  ASSERT_FALSE(missing.ok());
-  EXPECT_EQ(missing.error().code, ENOENT);
-  EXPECT_NE(missing.error().description().find("no/file"), std::string::npos);
-
-  fs::create_directories(directory.path() / "taken/by-a-folder");
-  EXPECT_FALSE(ReplaceFile((directory.path() / "taken/by-a-folder").native(), "x").ok());
-  EXPECT_EQ(std::distance(fs::directory_iterator(directory.path() / "taken"), {}), 1);
+  ASSERT_EQ(CodeOf(missing), ENOENT);
+  EXPECT_THAT(missing.error().description(), HasSubstr("no/file"));
+  const fs::path taken = directory.path() / "taken";
+  fs::create_directories(taken / "by-a-folder");
+  EXPECT_FALSE(ReplaceFile((taken / "by-a-folder").native(), "x").ok());
+  EXPECT_EQ(std::distance(fs::directory_iterator(taken), {}), 1);
 }
 
 }  // namespace

@@ -4,16 +4,8 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <chrono>
-#include <filesystem>
 #include <future>
-#include <memory>
-#include <optional>
-#include <string>
-#include <string_view>
 #include <thread>
-#include <utility>
-#include <vector>
 
 #include <quarvel/client.hpp>
 
@@ -44,7 +36,6 @@ class FakeService {
     stopListening();
   }
   FakeService(const FakeService&) = delete;
-  FakeService& operator=(const FakeService&) = delete;
 
   [[nodiscard]] const std::filesystem::path& directory() const { return directory_.path(); }
   [[nodiscard]] std::string path() const { return directory() / "reporting.sock"; }
@@ -69,22 +60,23 @@ class FakeService {
 
   /// The next call, waited for; none when the client has closed.
   std::optional<std::string> receiveBytes() {
-    for (;;) {
-      if (!received_.empty() &&
-          scanner_.scan(received_) == MessagePackScanner::Progress::complete) {
-        std::string frame = received_.substr(0, scanner_.length());
-        received_.erase(0, scanner_.length());
-        scanner_.reset();
-        return frame;
-      }
+    while (scanner_.scan(received_) != MessagePackScanner::Progress::complete) {
       char bytes[65'536];
       const ssize_t count = ::recv(connection_, bytes, sizeof bytes, 0);
       EXPECT_FALSE(count < 0 && errno == EAGAIN) << "no call has come in time";
       if (count <= 0) return std::nullopt;
       received_.append(bytes, static_cast<std::size_t>(count));
     }
+    std::string frame = received_.substr(0, scanner_.length());
+    received_.erase(0, scanner_.length());
+    scanner_.reset();
+    return frame;
   }
-  bool receive() { return receiveBytes().has_value(); }
+  /// False when the client closes before it has sent so many calls.
+  bool receive(int calls = 1) {
+    while (calls > 0 && receiveBytes()) --calls;
+    return calls == 0;
+  }
   /// The next call; throws when there is none.
   Value call() { return PayloadValue(receiveBytes().value().data()).toValue(); }
   /// Whether the client has sent bytes that were not received yet.
@@ -92,13 +84,8 @@ class FakeService {
     char byte = 0;
     return !received_.empty() || ::recv(connection_, &byte, 1, MSG_PEEK | MSG_DONTWAIT) == 1;
   }
-
   void send(std::string_view bytes) {
-    while (!bytes.empty()) {
-      const ssize_t count = ::send(connection_, bytes.data(), bytes.size(), MSG_NOSIGNAL);
-      if (count <= 0) return;
-      bytes.remove_prefix(static_cast<std::size_t>(count));
-    }
+    ::send(connection_, bytes.data(), bytes.size(), MSG_NOSIGNAL);  // waits until all is taken
   }
   [[nodiscard]] static std::string response(const Value& call, const Value& error,
                                             const Value& result) {

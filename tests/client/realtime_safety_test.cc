@@ -16,13 +16,9 @@
 #include <array>
 #include <atomic>
 #include <csignal>
-#include <cstddef>
-#include <cstdlib>
-#include <cstring>
+#include <functional>
 #include <mutex>
-#include <string>
 #include <thread>
-#include <vector>
 
 #include "tests/TemporaryDirectory.h"
 #include "tests/UnixSocket.h"
@@ -35,18 +31,13 @@ namespace {
 
 thread_local bool watched = false;
 
-std::array<std::atomic<const char*>, 64> calls;  // the calls of a watched thread
+std::array<const char*, 64> calls;  // the calls of a watched thread
 std::atomic<std::size_t> callCount{0};
 
 void Note(const char* call) {
   if (!watched) return;
   const std::size_t index = callCount.fetch_add(1);
   if (index < calls.size()) calls[index] = call;
-}
-
-template <class Function>
-Function Next(const char* name) {
-  return reinterpret_cast<Function>(::dlsym(RTLD_NEXT, name));
 }
 
 }  // namespace
@@ -59,37 +50,26 @@ void* __libc_realloc(void* memory, std::size_t size);
 void* __libc_memalign(std::size_t alignment, std::size_t size);
 void __libc_free(void* memory);
 
-void* malloc(std::size_t size) {
-  Note("malloc");
-  return __libc_malloc(size);
-}
-void* calloc(std::size_t count, std::size_t size) {
-  Note("calloc");
-  return __libc_calloc(count, size);
-}
-void* realloc(void* memory, std::size_t size) {
-  Note("realloc");
-  return __libc_realloc(memory, size);
-}
-void* aligned_alloc(std::size_t alignment, std::size_t size) {
-  Note("aligned_alloc");
-  return __libc_memalign(alignment, size);
-}
-int posix_memalign(void** memory, std::size_t alignment, std::size_t size) {
-  Note("posix_memalign");
-  *memory = __libc_memalign(alignment, size);
-  return *memory == nullptr ? ENOMEM : 0;
-}
-void free(void* memory) {
-  Note("free");
-  __libc_free(memory);
-}
+// Stands for the C library's `name`.
+#define QUARVEL_NOTE(type, name, parameters, result) \
+  type name parameters {                             \
+    Note(#name);                                     \
+    return result;                                   \
+  }
+QUARVEL_NOTE(void*, malloc, (std::size_t size), __libc_malloc(size))
+QUARVEL_NOTE(void*, calloc, (std::size_t count, std::size_t size), __libc_calloc(count, size))
+QUARVEL_NOTE(void*, realloc, (void* memory, std::size_t size), __libc_realloc(memory, size))
+QUARVEL_NOTE(void*, aligned_alloc, (std::size_t alignment, std::size_t size),
+             __libc_memalign(alignment, size))
+QUARVEL_NOTE(int, posix_memalign, (void** memory, std::size_t alignment, std::size_t size),
+             (*memory = __libc_memalign(alignment, size)) == nullptr ? ENOMEM : 0)
+QUARVEL_NOTE(void, free, (void* memory), __libc_free(memory))
 
-#define QUARVEL_NOTE_LOCK(name, Lock)                     \
-  int name(Lock* lock) noexcept {                         \
-    static const auto next = Next<int (*)(Lock*)>(#name); \
-    Note(#name);                                          \
-    return next(lock);                                    \
+#define QUARVEL_NOTE_LOCK(name, Lock)                                                     \
+  int name(Lock* lock) noexcept {                                                         \
+    static const auto next = reinterpret_cast<int (*)(Lock*)>(::dlsym(RTLD_NEXT, #name)); \
+    Note(#name);                                                                          \
+    return next(lock);                                                                    \
   }
 QUARVEL_NOTE_LOCK(pthread_mutex_lock, pthread_mutex_t)
 QUARVEL_NOTE_LOCK(pthread_mutex_trylock, pthread_mutex_t)
@@ -138,82 +118,61 @@ void TrapSystemCalls() {
 }
 
 /// Runs `produce` on a watched thread. Returns its forbidden calls.
-template <class Produce>
-std::vector<std::string> Watch(Produce produce) {
+std::vector<std::string> Watch(const std::function<void()>& produce) {
   callCount = 0;
-  std::atomic<bool> completed = false;
-  struct Watched {
-    Produce& produce;
-    std::atomic<bool>& completed;
-  } context{produce, completed};
   pthread_t thread{};
-  const auto run = [](void* argument) -> void* {
-    auto& [body, done] = *static_cast<Watched*>(argument);
+  const auto run = [](void* produce) -> void* {
     // malloc prepares each thread at its first call; then an allocation is no system call as well.
     void* volatile first = ::malloc(1);
     ::free(first);
     TrapSystemCalls();
     watched = true;
-    body();
+    (*static_cast<const std::function<void()>*>(produce))();
     watched = false;
-    done = true;
     ::syscall(SYS_exit, 0);  // the ordinary end of a thread makes more system calls
     return nullptr;
   };
-  EXPECT_EQ(::pthread_create(&thread, nullptr, run, &context), 0);
+  EXPECT_EQ(::pthread_create(&thread, nullptr, run,
+                             const_cast<void*>(static_cast<const void*>(&produce))),
+            0);
   EXPECT_EQ(::pthread_join(thread, nullptr), 0);
-  EXPECT_TRUE(completed);
-  std::vector<std::string> called;
-  for (std::size_t i = 0; i < std::min(callCount.load(), calls.size()); ++i) {
-    called.emplace_back(calls[i]);
-  }
-  return called;
+  return {calls.begin(), calls.begin() + std::min(callCount.load(), calls.size())};
 }
 
-class RealtimeSafety : public ::testing::Test {
- protected:
-  RealtimeSafety() {
-    EXPECT_EQ(::listen(listener_, 1), 0);
-    client_.emplace(std::move(Client::connect(path_).value()));
-    // The service, which only reads.
-    reader_ = std::jthread([listener = listener_] {
-      const int connection = ::accept(listener, nullptr, nullptr);
-      std::vector<char> bytes(65'536);
-      while (::recv(connection, bytes.data(), bytes.size(), 0) > 0) continue;
-      ::close(connection);
-      ::close(listener);
-    });
-  }
-
-  static bool record(RealtimeReporter& reporter, int number) {
-    return reporter.record(vocabulary::Kind::playback, RealtimeReporter::MessageType::generic)
+// Records that fit, that are too large and that find the ring full, while the client's thread takes
+// them out.
+TEST(RealtimeSafety, TheProducerNeitherAllocatesNorLocksNorCallsTheSystem) {
+  constexpr int kRecords = 200'000;
+  const TemporaryDirectory directory;
+  const std::string path = directory.path() / "reporting.sock";
+  const int listener = BoundSocket(path, SOCK_STREAM);
+  ASSERT_EQ(::listen(listener, 1), 0);
+  // The service, which only reads.
+  const std::jthread service([listener] {
+    const int connection = ::accept(listener, nullptr, nullptr);
+    std::vector<char> bytes(65'536);
+    while (::recv(connection, bytes.data(), bytes.size(), 0) > 0) continue;
+    ::close(connection);
+    ::close(listener);
+  });
+  Client client = std::move(Client::connect(path).value());
+  RealtimeReporter::Options options;
+  options.interval = 1ms;
+  RealtimeReporter reporter(client, 7, options);
+  reporter.start();
+  const auto record = [&reporter](int number) {
+    reporter.record(vocabulary::Kind::playback, RealtimeReporter::MessageType::generic)
         .set("frames", number)
         .set("load", 0.5)
         .set("glitch", true)
         .set("route", "Speaker")
         .set("at", Date{})
         .send();
-  }
-
-  const TemporaryDirectory directory_;
-  const std::string path_ = directory_.path() / "reporting.sock";
-  const int listener_ = BoundSocket(path_, SOCK_STREAM);
-  std::jthread reader_;
-  std::optional<Client> client_;
-};
-
-// Records that fit, that are too large and that find the ring full, while the client's thread takes
-// them out.
-TEST_F(RealtimeSafety, TheProducerNeitherAllocatesNorLocksNorCallsTheSystem) {
-  constexpr int kRecords = 200'000;
-  RealtimeReporter::Options options;
-  options.interval = 1ms;
-  RealtimeReporter reporter(*client_, 7, options);
-  reporter.start();
+  };
   const std::string large(1'000, 'x');
   const auto called = Watch([&] {
     for (int i = 0; i < kRecords; ++i) {
-      record(reporter, i);
+      record(i);
       if (i % 64 == 0) {
         reporter.record(vocabulary::Kind::error, {}).set("text", std::string_view(large)).send();
       }
@@ -223,7 +182,7 @@ TEST_F(RealtimeSafety, TheProducerNeitherAllocatesNorLocksNorCallsTheSystem) {
   // The watch sees each forbidden call that is made beside a record.
   std::mutex mutex;
   const auto forbidden = Watch([&] {
-    record(reporter, 1);
+    record(1);
     void* volatile memory = ::calloc(1, 1);
     memory = ::realloc(memory, 2);
     ::free(memory);

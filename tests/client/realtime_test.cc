@@ -23,10 +23,8 @@ class RealtimeReporterTest : public DrivenClient {
     return *reporting_;
   }
   bool record(int number) { return reporting_->record(kPlayback, kSetup).set("n", number).send(); }
-  std::string message() {
-    const Value call = service_.call();
-    return JsonText(call.list()->back());
-  }
+  Value arguments() { return service_.call().list()->back(); }
+  std::string message() { return JsonText(arguments()); }
 
   RealtimeReporter::Options reporter_;
   std::vector<Loss> losses_;
@@ -37,7 +35,6 @@ TEST_F(RealtimeReporterTest, ARecordBecomesAMessageWithEveryKindOfValue) {
   reporter_.recordBytes = 1'024;
   for (const int entries : {0, 30}) {  // a dictionary's head of one byte, and of three
     RealtimeReporter& reporter = report();
-    const std::string text(40, 'x');
     const std::string longText(300, 'y');
     Dictionary expected;
     {
@@ -46,16 +43,14 @@ TEST_F(RealtimeReporterTest, ARecordBecomesAMessageWithEveryKindOfValue) {
         record.set(key, value);
         expected.set(key, value);
       };
-      set("yes", true);
-      set("no", false);
-      set("small", 127);
-      set("large", 128U);
-      set("negative", std::int64_t{-1});
-      set("least", std::numeric_limits<std::int64_t>::min());
-      set("most", std::numeric_limits<std::uint64_t>::max());
+      for (const bool boolean : {true, false}) set(boolean ? "yes" : "no", boolean);
+      for (const std::int64_t number : {127L, 128L, -1L, INT64_MIN}) {
+        set(std::to_string(number), number);
+      }
+      set("most", UINT64_MAX);
       set("real", 0.25);
       set("", "");
-      set(text, std::string_view(longText));
+      set(std::string(40, 'x'), std::string_view(longText));
       for (const int microseconds : {-1, 0, 1}) {
         set("date" + std::to_string(microseconds), Date{std::chrono::microseconds(microseconds)});
       }
@@ -63,10 +58,7 @@ TEST_F(RealtimeReporterTest, ARecordBecomesAMessageWithEveryKindOfValue) {
       EXPECT_TRUE(record.send());
     }
     reporter.stop();
-    const Value call = service_.call();
-    const List& arguments = *call.list()->back().list();
-    EXPECT_EQ(arguments[0], Value(expected));
-    EXPECT_EQ(JsonText(Value(List(arguments.begin() + 1, arguments.end()))), "[536870915,3,[7]]");
+    EXPECT_EQ(arguments(), Value(List{expected, 536870915, 3, List{7}}));
     reporting_.reset();
     disconnect();
   }
@@ -93,9 +85,9 @@ TEST_F(RealtimeReporterTest, LossesAreCountedAndReportedAndTheRestIsWhole) {
   }
   reporter.stop();
   EXPECT_THAT(losses_, ElementsAre(Loss{2, 2, 1, 0}));
-  EXPECT_EQ(message(), R"([{"elevenbytes":1},536870915,3,[7]])");
-  EXPECT_EQ(message(), R"([{"n":1},536870915,3,[7]])");
-  EXPECT_EQ(message(), R"([{"n":2},536870915,3,[7]])");
+  for (const std::string entry : {R"("elevenbytes":1)", R"("n":1)", R"("n":2)"}) {
+    EXPECT_EQ(message(), "[{" + entry + "},536870915,3,[7]]");
+  }
   EXPECT_EQ(message(), R"([{"RealtimeRecordsLost":5,"Full":2,"TooLarge":2,"Invalid":1},8,5,[7]])");
   EXPECT_TRUE(record(6)) << "there is room again";
   reporter.stop();
@@ -152,15 +144,13 @@ TEST_F(RealtimeReporterTest, AServiceThatIsSlowCostsRecordsOnlyWhenTheRingIsFull
   reporter_.records = 4'096;
   RealtimeReporter& reporter = report();
   const std::string text(200, 'x');
-  std::uint64_t taken = 0;
+  int taken = 0;
   while (reporter.record(kPlayback, kSetup).set("text", text).send()) {
     reporter.stop();
     ++taken;
   }
-  std::jthread service([&] {
-    for (std::uint64_t i = 0; i < taken; ++i) service_.receive();
-  });
-  driveUntil([&] { return reporter.statistics().sent == taken; });
+  std::jthread service([&] { service_.receive(taken); });
+  driveUntil([&] { return std::cmp_equal(reporter.statistics().sent, taken); });
   EXPECT_EQ(reporter.statistics().lost, (Loss{1, 0, 0, 0}));
 }
 
@@ -187,12 +177,11 @@ TEST_F(RealtimeReporterTest, EveryRecordArrivesOnceAndInItsOrderOrIsCounted) {
   std::uint64_t received = 0;
   std::int64_t last = -1;
   for (;;) {
-    const Value call = service_.call();
-    const List& arguments = *call.list()->back().list();
-    if (arguments.empty()) break;
-    const std::int64_t number = *arguments[0].dictionary()->find("n")->integer();
+    const List call = *arguments().list();
+    if (call.empty()) break;
+    const std::int64_t number = *call[0].dictionary()->find("n")->integer();
     ASSERT_GT(number, last);
-    ASSERT_EQ(*arguments[0].dictionary()->find("half")->integer(), number / 2);
+    ASSERT_EQ(*call[0].dictionary()->find("half")->integer(), number / 2);
     last = number;
     ++received;
   }

@@ -17,14 +17,10 @@ import unittest
 import harness
 
 QUARVELCTL = (pathlib.Path(__file__).resolve().parent.parent / "launch", sys.argv.pop(1))
-CREATE = "createReportingSession:reply:"
-SET_TYPE = "setServiceType:reportingSession:reply:"
-START = "startReportingSessionForID:reply:"
+CREATE, SET_TYPE = "createReportingSession:reply:", "setServiceType:reportingSession:reply:"
+START, STOP = "startReportingSessionForID:reply:", "stopReportingSessionForID:reply:"
 SEND = "sendMessage:withCategory:andType:forReportingIDs:reply:"
-STOP = "stopReportingSessionForID:reply:"
-VALID = "reporterID:valid:"
-REPORTERS = "getAllReporters:"
-KILL = "killService:"
+VALID, REPORTERS, KILL = "reporterID:valid:", "getAllReporters:", "killService:"
 NOON = 1_769_860_800_000_000  # 2026-01-31T12:00:00Z
 
 
@@ -33,16 +29,14 @@ def enough(cases):
     return cases[::4] if "QUARVEL_VALGRIND" in os.environ else cases
 
 
-class ToolTest(unittest.TestCase):
+class ToolTest(harness.ServiceTest):
     def setUp(self):
         self.directory = tempfile.TemporaryDirectory(prefix="quarvelctl-")
         self.addCleanup(self.directory.cleanup)
         self.root = pathlib.Path(self.directory.name)
         self.environment = {name: os.environ[name] for name in ("PATH", "QUARVEL_VALGRIND") if name in os.environ}
-        self.environment |= {"TZ": "UTC",
-                             "QUARVEL_SOCKET": str(self.root / "reporting.sock"),
-                             "STATE_DIRECTORY": str(self.root),
-                             "CONFIGURATION_DIRECTORY": str(self.root / "etc")}
+        self.environment |= {"TZ": "UTC", "QUARVEL_SOCKET": str(self.root / "reporting.sock"),
+                             "STATE_DIRECTORY": str(self.root), "CONFIGURATION_DIRECTORY": str(self.root / "etc")}
 
     def ctl(self, *arguments, stdin=""):
         """Status, standard output's lines, standard error."""
@@ -50,11 +44,21 @@ class ToolTest(unittest.TestCase):
                              capture_output=True, env=self.environment, timeout=60, check=False)
         return ran.returncode, ran.stdout.splitlines(), ran.stderr
 
+    def rows(self, *arguments):
+        """The objects that a command prints with --json, one a line."""
+        status, lines, error = self.ctl(*arguments, "--json")
+        self.assertEqual((status, error), (0, ""))
+        return [json.loads(line) for line in lines]
+
+    def fails(self, reason, *arguments):
+        """Runs a command that prints nothing and fails with this reason."""
+        status, lines, error = self.ctl(*arguments)
+        self.assertEqual((status, lines), (1, []), arguments)
+        self.assertIn(str(reason), error)
+
     def new_store(self):
         """The empty store that a service makes; a connection to it."""
-        service = harness.Service("[analytics]\nwanted = []\n")
-        self.addCleanup(service.tidy)
-        service.start()
+        service = self.service("[analytics]\nwanted = []\n")
         service.end()
         return sqlite3.connect(shutil.copy(service.directory / "state/telemetry.db", self.root), isolation_level=None)
 
@@ -62,11 +66,8 @@ class ToolTest(unittest.TestCase):
 class Service(ToolTest):
     def setUp(self):
         super().setUp()
-        self.service = harness.Service()
-        self.addCleanup(self.service.tidy)
-        self.service.start()
-        self.addCleanup(self.service.finish)
-        self.environment["QUARVEL_SOCKET"] = str(self.service.socket)
+        self.daemon = self.service()
+        self.environment["QUARVEL_SOCKET"] = str(self.daemon.socket)
 
     def run_script(self, *steps):
         """Status, replies, standard error."""
@@ -91,7 +92,7 @@ class Service(ToolTest):
         arguments = [payload, 3, 1, None]
         status, replies, _ = self.run_script({"call": SEND, "args": arguments})
         self.assertEqual((status, replies[0]["args"]), (0, arguments))
-        [row] = self.service.wait_for_rows(1, "message")
+        [row] = self.daemon.wait_for_rows(1, "message")
         self.assertEqual(json.loads(row["payload"]), payload | {"At": "2026-01-31T12:00:00.250000Z", "Raw": "AP8="})
 
     def test_an_expectation_that_fails_names_its_line(self):
@@ -104,28 +105,21 @@ class Service(ToolTest):
         status, replies, _ = self.run_script({"call": CREATE, "args": [7]}, {"call": START, "args": [7]}, {"call": KILL})
         self.assertEqual(status, 0)
         self.assertEqual({reply["error"]["domain"] for reply in replies[1:]}, {"quarvel.client"})
-        self.service.end()
-        self.service.start()
-        self.assertEqual(self.ctl("kill")[:2], (0, ["The service has ended."]))
 
     def test_nothing_is_played_of_a_file_with_a_fault(self):
-        faults = [("{\"call\": 7}", "keyword name"), ("{\"call\": \"x\", \"args\": {}}", "a list"),
-                  ("{\"call\": \"x\", \"wiat\": true}", "\"wiat\""), ("{\"sleep\": -1}", "seconds"),
-                  ("{\"call\": \"x\", \"args\": [{\"$date\": \"noon\"}]}", "$date"),
-                  ("{\"call\": \"x\", \"args\": [{\"$bytes\": \"?\"}]}", "$bytes"),
-                  ("[]", "A line is"), ("{", "script.jsonl:3: ")]
+        faults = [('{"call": 7}', "keyword name"), ('{"call": "x", "args": {}}', "a list"),
+                  ('{"call": "x", "wiat": true}', '"wiat"'), ('{"sleep": -1}', "seconds"),
+                  ('{"call": "x", "args": [{"$date": "noon"}]}', "$date"),
+                  ('{"call": "x", "args": [{"$bytes": "?"}]}', "$bytes"), ("[]", "A line is"), ("{", ":3: ")]
         for line, reason in faults:
             with self.subTest(line):
                 script = self.root / "script.jsonl"
                 script.write_text("# A comment, and a call that is right.\n{\"call\": \"x\"}\n" + line + "\n")
-                status, replies, error = self.ctl("run", script)
-                self.assertEqual((status, replies), (1, []))
-                self.assertIn("script.jsonl:3: ", error)
-                self.assertIn(reason, error)
+                self.fails("script.jsonl:3: ", "run", script)
+                self.fails(reason, "run", script)
 
     def test_reporters_and_validity(self):
-        client = harness.Client(self.service)
-        self.addCleanup(client.close)
+        client = self.client(self.daemon)
         for reporter, service_type in ((7, 2), (-8, 4242)):
             client.call(CREATE, reporter)
             client.call(SET_TYPE, service_type, reporter)
@@ -162,10 +156,9 @@ class Store(ToolTest):
         self.assertEqual([line.split() for line in lines[1:]], [
             ["7", "telephony", "01-31", "12:00:00.000", "1.500", "s", "2", "org.example.dialer"],
             ["8", "telephony", "01-31", "12:00:00.000", "not", "ended", "0", "org.example.dialer"]])
-        _, lines, _ = self.ctl("sessions", "--json")
-        self.assertEqual([json.loads(line)["flushedAt"] for line in lines],
-                         ["2026-01-31T12:00:01.500000Z", None])
-        self.assertEqual(json.loads(lines[1]), {
+        ended, open_still = self.rows("sessions")
+        self.assertEqual(ended["flushedAt"], "2026-01-31T12:00:01.500000Z")
+        self.assertEqual(open_still, {
             "id": 2, "session": 8, "clientType": 19, "clientVersion": 2.0, "batchEvent": True,
             "hierarchyToken": "", "client": "tarnwick.quarvel", "service": "telephony_session",
             "openedAt": "2026-01-31T12:00:00.000000Z", "flushedAt": None, "messages": 0,
@@ -177,8 +170,7 @@ class Store(ToolTest):
         self.assertRegex(lines[1], r"12:00:00\.001 +7 +telephony +Tallixing +Generic +\{\"Glitches\": 3\}$")
         self.assertRegex(lines[2], r"Undefined +Unknown ")
         self.assertRegex(self.ctl("messages", "--last", 1)[1][1], r" single .* Volume +Error ")
-        _, lines, _ = self.ctl("messages", "--session", -1, "--json")
-        self.assertEqual(json.loads(lines[0]), {
+        self.assertEqual(self.rows("messages", "--session", -1)[0], {
             "id": 3, "agentSession": None, "session": -1, "service": "telephony_session", "category": 11,
             "categoryName": "Volume", "type": 4, "typeName": "Error",
             "sentAt": "2026-01-31T12:00:00.001000Z", "payload": {"Volume": 0.5}})
@@ -194,10 +186,10 @@ class Store(ToolTest):
         _, lines, _ = self.ctl("events", "--last", 2)
         self.assertEqual([line.split()[2:] for line in lines],
                          [["PAYLOAD"], ["event1", '{"Number":', "1}"], ["event2", '{"Number":', "2}"]])
-        self.assertEqual(json.loads(self.ctl("events", "--last", 1, "--json")[1][0]), {
+        self.assertEqual(self.rows("events", "--last", 1)[0], {
             "id": 3, "name": "event2", "recordedAt": "2026-01-31T12:00:02.000000Z", "payload": {"Number": 2}})
         self.assertRegex(self.ctl("power")[1][1], r"12:00:00\.000 +12 +power +\{\"On\": true\}$")
-        self.assertEqual(json.loads(self.ctl("power", "--json")[1][0])["domain"], 12)
+        self.assertEqual(self.rows("power")[0]["domain"], 12)
 
     def test_a_summary_is_of_the_latest_run(self):
         self.store.execute("INSERT INTO agent_session SELECT 9, session_id, client_type, client_version,"
@@ -209,9 +201,8 @@ class Store(ToolTest):
         self.add_message(9, 7, 65535, 65535, {
             "device_orientation": "portrait,landscapeLeft", "device_orientation_time": "0.0,1.25",
             "ui_orientation": "portrait", "ui_orientation_time": "0.5"})
-        status, lines, _ = self.ctl("summary", 7, "--json")
-        summary = json.loads(lines[0])
-        self.assertEqual((status, summary["earlierRuns"], summary["seconds"], summary["flushed"]), (0, 1, 3.5, True))
+        [summary] = self.rows("summary", 7)
+        self.assertEqual((summary["earlierRuns"], summary["seconds"], summary["flushed"]), (1, 3.5, True))
         self.assertEqual([(row["categoryName"], row["typeName"], row["count"]) for row in summary["messages"]],
                          [("RouteChange", "Start", 2), ("Tallixing", "Generic", 1), ("Undefined", "Unknown", 1)])
         self.assertEqual(summary["driverStatistics"], {"Codec_Underruns": 4})
@@ -222,22 +213,17 @@ class Store(ToolTest):
                       "2 +RouteChange +Start", "Codec_Underruns +4", "1.25 s +device +landscapeLeft"):
             self.assertRegex(text, shown)
         self.assertRegex("\n".join(self.ctl("summary", 8)[1]), "Duration +not ended\nFlushed +no")
-        self.assertIn("no run of a session 99", self.ctl("summary", 99)[2])
+        self.fails("no run of a session 99", "summary", 99)
 
     def test_a_client_s_uptime_is_told_only_when_it_can_be_no_other_s(self):
         event = "tarnwick.quarvel.zqreportingclientuptime"
-
-        def uptime():
-            return json.loads(self.ctl("summary", 7, "--json")[1][0]).get("clientUptime")
-        self.add_event(event, {"processName": "left before the end", "seconds": 9.0}, 1)
-        self.add_event(event, {"processName": "came after the start", "seconds": 1.0}, 2)
-        self.add_event(event, {"processName": "unknown", "seconds": -1}, 2)
-        self.add_event("another", {"processName": "another", "seconds": 9.0}, 2)
-        self.assertIsNone(uptime())
-        self.add_event(event, {"processName": "dialer", "seconds": 2.5}, 2)
-        self.assertEqual(uptime(), {"processName": "dialer", "seconds": 2.5})
-        self.add_event(event, {"processName": "player", "seconds": 60.0}, 3)
-        self.assertIsNone(uptime())
+        for name, process, seconds, at, told in (
+                (event, "left before the end", 9.0, 1, False), (event, "came after the start", 1.0, 2, False),
+                (event, "unknown", -1, 2, False), ("another", "another", 9.0, 2, False),
+                (event, "dialer", 2.5, 2, True), (event, "player", 60.0, 3, False)):
+            uptime = {"processName": process, "seconds": seconds}
+            self.add_event(name, uptime, at)
+            self.assertEqual(self.rows("summary", 7)[0].get("clientUptime"), uptime if told else None)
 
     def test_since_and_last_choose_rows(self):
         now = time.time_ns() // 1000
@@ -248,11 +234,10 @@ class Store(ToolTest):
                                       ("2026-01-31T13:00:00.001+01:00", [1, 2, 3, 4, 5]),
                                       ("2026-01-31T12:00:00.0011Z", [4, 5]))):
             with self.subTest(since):
-                _, lines, error = self.ctl("messages", "--json", "--since", since)
-                self.assertEqual([json.loads(line)["id"] for line in lines], numbers, error)
+                self.assertEqual([row["id"] for row in self.rows("messages", "--since", since)], numbers)
         self.assertEqual(len(self.ctl("sessions", "--since", "2026-01-31T12:00:00Z")[1]), 3)
         self.assertEqual(len(self.ctl("sessions", "--since", "1h")[1]), 1)
-        self.assertEqual([json.loads(line)["session"] for line in self.ctl("sessions", "--last", 1, "--json")[1]], [8])
+        self.assertEqual([row["session"] for row in self.rows("sessions", "--last", 1)], [8])
         self.add_event("now", {}, now / 1e6 - NOON / 1e6)
         self.assertEqual(len(self.ctl("events", "--since", "10m")[1]), 2)
         for wrong in enough(("", "5", "m", "1h1h", "10m2h", "-1h", "1.5h", "9999999999w", "yesterday", "2026-01-31")):
@@ -275,9 +260,8 @@ class Store(ToolTest):
         self.assertTrue(lines[0].startswith("\x1b[1mSENT"))
         self.assertEqual([len(line) for line in lines[1:] if "é" in line], [80])
         # An ideograph takes two columns, a combining accent none.
-        self.add_message(1, 7, 1, 1, {"Note": "音" * 100})
-        self.add_message(1, 7, 1, 1, {"Note": "e\u0301" * 100})
-        self.add_message(1, 7, 1, 1, {"Note": "\u202ebackwards\x7f\x9b31m"})
+        for note in ("音" * 100, "e\u0301" * 100, "\u202ebackwards\x7f\x9b31m"):
+            self.add_message(1, 7, 1, 1, {"Note": note})
         self.add_event("tarnwick.quarvel." + "A" * 100, {"Payload": "B" * 100}, 1)
         for columns in enough((40, 60, 81, 200)):
             for line in self.on_terminal(columns, "messages", NO_COLOR="1")[1:] + \
@@ -316,15 +300,13 @@ class Preferences(ToolTest):
                 self.assertEqual((status, error), (0, ""))
                 self.assertIn("quarvelctl notify", lines[0])
                 self.assertEqual(tomllib.loads(self.file.read_text()), {"a key": value})
-                self.assertEqual(json.loads(self.ctl("defaults", "read", "a key", "--json")[1][0]), value)
+                self.assertEqual(self.rows("defaults", "read", "a key"), [value])
         self.assertIn("UTF-8", self.ctl("defaults", "write", "a key", "\udcff")[2])
         self.ctl("defaults", "write", "a key", "7", "--string")
         self.assertEqual(self.ctl("defaults", "read", "--json")[1], ['{"a key":"7"}'])
         self.assertEqual(self.ctl("defaults", "delete", "a key")[0], 0)
         for command in ("read", "delete"):
-            status, _, error = self.ctl("defaults", command, "a key")
-            self.assertEqual(status, 1)
-            self.assertIn("is not set in " + str(self.file), error)
+            self.fails(f"is not set in {self.file}", "defaults", command, "a key")
         self.ctl("defaults", "write", "key", "text", "--domain", "org.example")
         self.assertEqual(self.file.with_name("org.example.toml").read_text().split(), ["key", "=", '"text"'])
         self.assertEqual(self.ctl("defaults", "--domain", "org.example", "read", "key")[1], ["text"])
@@ -347,17 +329,14 @@ class Preferences(ToolTest):
                 content = "first = 1\n" + line + "\n"
                 self.file.write_text(content)
                 for arguments in (["read"], ["write", "key", "1"], ["delete", "first"]):
-                    status, lines, error = self.ctl("defaults", *arguments)
-                    self.assertEqual((status, lines, self.file.read_text()), (1, [], content))
-                    self.assertIn(f"{self.file}:2: ", error)
+                    self.fails(f"{self.file}:2: ", "defaults", *arguments)
+                    self.assertEqual(self.file.read_text(), content)
         self.file.unlink()
         self.file.mkdir()
-        self.assertIn(f"{self.file} cannot be read", self.ctl("defaults", "write", "key", "1")[2])
+        self.fails(f"{self.file} cannot be read", "defaults", "write", "key", "1")
 
     def test_notifications(self):
-        status, _, error = self.ctl("notify")
-        self.assertEqual(status, 1)
-        self.assertIn("The service is not running", error)
+        self.fails("The service is not running", "notify")
         notify = self.root / "notify"
         notify.mkdir()
         self.assertEqual(self.ctl("notify", "org.example.note")[0], 0)
@@ -373,9 +352,7 @@ class Refusal(ToolTest):
     def test_what_is_not_there_says_what_to_do(self):
         for arguments, reason in ((["reporters"], "The service is not running"), (["sessions"], "--store"),
                                   (["run", "none.jsonl"], "none.jsonl cannot be read")):
-            status, lines, error = self.ctl(*arguments)
-            self.assertEqual((status, lines), (1, []))
-            self.assertIn(reason, error)
+            self.fails(reason, *arguments)
 
     def test_what_is_no_store_of_this_version_is_left_alone(self):
         for statement, reason in (("PRAGMA user_version = 2", "is of version 2"),
@@ -383,11 +360,9 @@ class Refusal(ToolTest):
             store = self.new_store()
             store.execute(statement)
             store.close()
-            status, _, error = self.ctl("messages")
-            self.assertEqual(status, 1)
-            self.assertIn(reason, error)
+            self.fails(reason, "messages")
         (self.root / "text.db").write_text("Not a database, but long enough to be taken for one. " * 20)
-        self.assertIn("cannot be read", self.ctl("messages", "--store", self.root / "text.db")[2])
+        self.fails("cannot be read", "messages", "--store", self.root / "text.db")
 
     def test_wrong_usage_is_told_from_failure(self):
         for arguments in enough((
