@@ -10,19 +10,17 @@
 namespace quarvel {
 
 namespace {
-
+thread_local Scheduler::Thread* currentThread = nullptr;
 constexpr Date kBeginning{std::chrono::seconds{1'769'866'000}};
 constexpr std::size_t kMostChoices = 1'000'000;
 // Real time. Reached only when a thread blocks outside the simulated platform.
 constexpr std::chrono::seconds kHung{60};
-
 }  // namespace
 
 class Scheduler::Thread {
  public:
   ConditionVariable turn;
   bool hasBaton = false;  // guarded by `baton_`
-
   Ready job;
   const char* parkedFor = nullptr;
   std::optional<Date> deadline;
@@ -30,10 +28,6 @@ class Scheduler::Thread {
   bool finished = false;
   std::thread thread;
 };
-
-namespace {
-thread_local Scheduler::Thread* currentThread = nullptr;
-}
 
 Scheduler::Scheduler(std::uint64_t seed)
     : seed_(seed),
@@ -62,7 +56,7 @@ Scheduler::~Scheduler() {
 }
 
 Scheduler::Thread* Scheduler::current() const {
-  return currentThread;
+  return currentThread == nullptr ? test_.get() : currentThread;
 }
 
 void Scheduler::runFromTest(std::optional<Duration> until) {
@@ -77,18 +71,12 @@ void Scheduler::runFromTest(std::optional<Duration> until) {
   if (stopped_) return;
   if (until) {
     elapsed_ = std::max(elapsed_, *until);
-  } else if (const std::string stuck = waiting(); !stuck.empty()) {
-    ADD_FAILURE() << "deadlock: nothing is left to run, but threads wait: " << stuck;
+    return;
   }
-}
-
-std::string Scheduler::waiting() const {
-  std::string all;
   for (const auto& thread : threads_) {
     if (thread->parkedFor == nullptr) continue;
-    all += fmt::format("{}{} for {}", all.empty() ? "" : ", ", thread->job.name, thread->parkedFor);
+    ADD_FAILURE() << "deadlock: " << thread->job.name << " waits for " << thread->parkedFor;
   }
-  return all;
 }
 
 void Scheduler::spawn(std::string name, Block body) {
@@ -116,12 +104,11 @@ void Scheduler::after(Duration delay, Block action) {
 }
 
 bool Scheduler::isCurrent(const Queue& queue) const {
-  return currentThread != nullptr && currentThread->job.queue.get() == &queue;
+  return current()->job.queue.get() == &queue;
 }
 
 std::size_t Scheduler::currentQueue() const {
-  const Queue* queue = currentThread == nullptr ? nullptr : currentThread->job.queue.get();
-  return queue == nullptr ? 0 : queue->number;
+  return current()->job.queue == nullptr ? 0 : current()->job.queue->number;
 }
 
 void Scheduler::mayYield() {
@@ -154,8 +141,8 @@ bool Scheduler::park(const char* reason, std::optional<Date> deadline) {
   return !self.timedOut;
 }
 
-bool Scheduler::isParked(const Thread& thread) {
-  return thread.parkedFor != nullptr;
+bool Scheduler::isParked(const Thread* thread) {
+  return thread->parkedFor != nullptr;
 }
 
 void Scheduler::wake(Thread& thread) {
@@ -164,13 +151,20 @@ void Scheduler::wake(Thread& thread) {
   ready_.push_back({&thread, thread.job.name, nullptr, {}});
 }
 
-void Scheduler::sleep(Duration duration) {
-  bool over = false;
-  after(duration, [this, &over, thread = currentThread] {
-    over = true;
-    wake(*thread);
+Scheduler::WakeUp Scheduler::wakeAfter(Duration delay) {
+  auto wakeUp = std::make_shared<bool>();
+  after(delay, [this, thread = currentThread, alive = std::weak_ptr(wakeUp)] {
+    if (!alive.expired()) wake(*thread);
   });
-  while (!over) park("its sleep to end");
+  return wakeUp;
+}
+
+void Scheduler::sleep(Duration duration) {
+  const Duration end = elapsed_ + duration;
+  const WakeUp wakeUp = wakeAfter(duration);
+  do {
+    park("its sleep to end");
+  } while (elapsed_ < end);
 }
 
 void Scheduler::wakeOverdue() {

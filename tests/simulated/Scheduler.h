@@ -48,7 +48,6 @@ class Scheduler {
   Scheduler& operator=(const Scheduler&) = delete;
 
   // For the test, outside simulated threads.
-
   /// Runs until no thread is ready and none waits for a time. A thread that still waits for a
   /// signal then is a deadlock, which fails the test; so does a simulation without an end.
   void run() { runFromTest(std::nullopt); }
@@ -58,7 +57,6 @@ class Scheduler {
   void runUntil(Duration elapsed) { runFromTest(elapsed); }
 
   // From anywhere.
-
   /// Virtual time since the simulation began.
   [[nodiscard]] Duration elapsed() const { return elapsed_; }
   [[nodiscard]] Date wallClock() const { return Date{} + elapsed_ + wallOffset_; }
@@ -84,16 +82,18 @@ class Scheduler {
   void stop() { stopped_ = true; }
 
   // For the objects on which simulated threads wait.
-
   class Thread;
-  /// The running simulated thread; null in the test.
+  /// The running simulated thread, or one that stands for the test.
   [[nodiscard]] Thread* current() const;
   /// Gives up the baton until `wake`, or until the wall clock reads `deadline`; false for the
   /// latter. A deadlock's failure prints `reason`. In a simulated thread only.
   bool park(const char* reason, std::optional<Date> deadline = std::nullopt);
   /// Makes a parked thread ready; does nothing to one that is not parked.
   void wake(Thread& thread);
-  [[nodiscard]] static bool isParked(const Thread& thread);
+  /// Wakes this thread after `delay`, unless the result is destroyed before.
+  using WakeUp = std::shared_ptr<void>;
+  [[nodiscard]] WakeUp wakeAfter(Duration delay);
+  [[nodiscard]] static bool isParked(const Thread* thread);
   void sleep(Duration duration);
 
  private:
@@ -113,7 +113,6 @@ class Scheduler {
   void handOver(Thread& to) QUARVEL_EXCLUDES(baton_);
   void awaitTurn(Thread& thread) QUARVEL_EXCLUDES(baton_);
   void runFromTest(std::optional<Duration> until);
-  [[nodiscard]] std::string waiting() const;
 
   const std::uint64_t seed_;  // constant after construction
   std::mt19937_64 random_;
@@ -129,7 +128,6 @@ class Scheduler {
   std::unique_ptr<Thread> test_;
   std::vector<std::weak_ptr<Queue>> queues_;
   std::size_t choices_ = 0;
-
   Mutex baton_;
   std::atomic<std::uint64_t> handOvers_{0};
 };

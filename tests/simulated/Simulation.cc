@@ -24,7 +24,7 @@ Seeds::Seeds() {
 
 std::vector<std::string> Journal::lines(std::initializer_list<std::string_view> prefixes) const {
   std::vector<std::string> matching;
-  std::ranges::copy_if(lines_, std::back_inserter(matching), [&](const std::string& line) {
+  std::ranges::copy_if(*this, std::back_inserter(matching), [&](const std::string& line) {
     return std::ranges::any_of(prefixes, [&](auto prefix) { return line.starts_with(prefix); });
   });
   return matching;

@@ -1,5 +1,8 @@
 #pragma once
 
+#include <fmt/format.h>
+
+#include <algorithm>
 #include <cstdint>
 #include <deque>
 #include <map>
@@ -8,10 +11,47 @@
 #include <utility>
 #include <vector>
 
-#include "base/Value.h"
+#include "base/Json.h"
+#include "base/Vocabulary.h"
 #include "tests/simulated/Recorders.h"
 
 namespace quarvel {
+
+inline constexpr std::uint16_t kTest = 11;
+
+inline std::string ServiceName(std::uint16_t type) {
+  return std::string(vocabulary::NameOf(vocabulary::ServiceType{type}));
+}
+
+inline std::string MessageName(std::uint32_t category, char separator, std::uint16_t type) {
+  return fmt::format("{}{}{}", vocabulary::NameOf(vocabulary::Category(category)), separator,
+                     vocabulary::NameOf(vocabulary::MessageType{type}));
+}
+
+inline Dictionary WithoutBlanksInKeys(const Dictionary& payload) {
+  Dictionary result;
+  for (const auto& [key, value] : payload) {
+    if (const std::string* text = key.string()) {
+      std::string underscored = *text;
+      std::ranges::replace(underscored, ' ', '_');
+      result.set(underscored, value);
+    } else {
+      result.set(key, value);
+    }
+  }
+  return result;
+}
+
+/// The application in the name of a history file: at most 128 bytes of whole characters.
+inline std::string FileNamePart(std::string name) {
+  if (name.size() > 128) {
+    std::size_t end = 128;
+    while ((static_cast<unsigned char>(name[end]) & 0xc0) == 0x80) --end;
+    name.resize(end);
+  }
+  std::ranges::replace(name, '/', '_');
+  return name;
+}
 
 /// The output that the service owes its clients, the agent, the sinks and the diagnostics
 /// directory. Computed in one pass from the order of arrivals alone: no queues, no time, none of
@@ -56,7 +96,20 @@ class Model {
     std::vector<std::pair<std::string, Dictionary>> messages;
   };
 
-  void execute(const Arrival& arrival);
+  void execute(const Arrival& arrival) {
+    if (arrival.kind == Arrival::Kind::notification) return readPreferences();
+    if (arrival.kind == Arrival::Kind::connection) {
+      clients_.push_back({arrival.client, {}});
+      return;
+    }
+    const auto client = std::ranges::find(clients_, arrival.client, &Client::number);
+    if (arrival.kind == Arrival::Kind::call) return execute(*client, *arrival.call);
+    for (const auto& [reporterID, session] : client->sessions) {
+      if (session->started) stop(*session);
+    }
+    clients_.erase(client);
+    ++endedClients;
+  }
   /// Contents of the preferences, one for each notification to come.
   std::deque<Dictionary> preferences;
 
@@ -71,24 +124,213 @@ class Model {
   std::size_t unroutable = 0;  // messages for sessions that do not exist
 
  private:
+  static Message agentMessage(std::uint32_t category, std::uint16_t type, Dictionary payload) {
+    return {static_cast<std::uint16_t>(category % 0x1'0000), type, std::move(payload)};
+  }
+
   struct Client {
     std::size_t number;
     std::map<std::int64_t, Session*> sessions;
   };
 
-  void execute(Client& client, const RecordedCall& call);
-  void send(Client& client, const RecordedCall& call);
-  void readPreferences();
-  [[nodiscard]] static Session* own(Client& client, std::int64_t reporterID);
-  [[nodiscard]] Session* any(Client& client, std::int64_t reporterID);
-  static void merge(Session& session, const Dictionary& entries);
-  void setServiceType(Session& session, std::uint16_t serviceType);
-  void start(Session& session, const RecordedCall& call);
-  void stop(Session& session);
-  void deliver(Session& session, const Dictionary& payload, std::uint32_t category,
-               std::uint16_t type);
+  void readPreferences() {
+    const Dictionary read = preferences.front();
+    preferences.pop_front();
+    Dictionary defaults;
+    if (const Value* name = read.find("device_name")) defaults.set("device_name", *name);
+    const Value* disabled = read.find("disable_reporting");
+    defaults.set("disable_reporting", disabled == nullptr ? Value(0) : *disabled);
+    reporting_ = disabled == nullptr || *disabled != Value(true);
+    for (Client& client : clients_) {
+      for (const auto& [reporterID, session] : client.sessions) merge(*session, defaults);
+    }
+  }
+
+  static Session* own(Client& client, std::int64_t reporterID) {
+    const auto found = client.sessions.find(reporterID);
+    return found == client.sessions.end() ? nullptr : found->second;
+  }
+
+  Session* any(Client& client, std::int64_t reporterID) {
+    if (Session* session = own(client, reporterID)) return session;
+    if (reporterID == 0 || !reporting_) return nullptr;
+    for (Client& other : clients_) {
+      if (Session* session = own(other, reporterID)) return session;
+    }
+    return nullptr;
+  }
+
+  void execute(Client& client, const RecordedCall& call) {
+    std::vector<Value>& answer = answers[&call];
+    const std::string operation = call.method.substr(0, call.method.find(':'));
+    const auto number = [&](std::size_t i) { return *call.arguments.at(i).integer(); };
+    if (operation == "createReportingSession") {
+      Session& session = sessions.emplace_back();
+      session.reporterID = number(0);
+      client.sessions[session.reporterID] = &session;
+      answer.emplace_back(true);
+    } else if (operation == "setServiceType") {
+      Session* session = number(1) == 0 ? nullptr : own(client, number(1));
+      if (session != nullptr) setServiceType(*session, static_cast<std::uint16_t>(number(0)));
+      answer.emplace_back(true);
+    } else if (operation == "getServiceNameForReporterID") {
+      if (number(0) == 0) answer.emplace_back(65535);
+      const Session* session = any(client, number(0));
+      answer.emplace_back(session == nullptr ? 65535 : session->serviceType);
+    } else if (operation == "setConfiguration") {
+      Session* session = own(client, number(1));
+      if (session != nullptr) merge(*session, *call.arguments.at(0).dictionary());
+      answer.emplace_back(true);
+    } else if (operation == "startReportingSessionForID") {
+      if (number(0) == 0) {
+        answer.emplace_back(true);
+      } else if (Session* session = any(client, number(0));
+                 session != nullptr && !session->started) {
+        start(*session, call);
+      }
+    } else if (operation == "sendMessage") {
+      send(client, call);
+    } else if (operation == "stopReportingSessionForID") {
+      if (Session* session = number(0) == 0 ? nullptr : own(client, number(0))) stop(*session);
+      answer.emplace_back(true);
+    } else if (operation == "destroyReportingSession") {
+      if (Session* session = number(0) == 0 ? nullptr : own(client, number(0))) {
+        stop(*session);
+        client.sessions.erase(number(0));
+      }
+      answer.emplace_back(true);
+    } else if (operation == "reporterID") {
+      const Session* session = any(client, number(0));
+      answer.emplace_back(
+          Dictionary{{"reporterID", session == nullptr ? Value(0) : Value(number(0))},
+                     {"serviceType", session == nullptr ? 65535 : session->serviceType}});
+    } else {
+      List all;
+      for (const Client& each : clients_) {
+        for (const auto& [reporterID, session] : each.sessions) all.emplace_back(reporterID);
+      }
+      answer.emplace_back(std::move(all));
+    }
+  }
+
+  static void merge(Session& session, const Dictionary& entries) {
+    session.userInfo.merge(entries);
+    for (Run& run : session.runs) run.userInfos.push_back(session.userInfo);
+  }
+
+  void setServiceType(Session& session, std::uint16_t serviceType) {
+    if ((serviceType == kTest) != (session.serviceType == kTest) && !session.runs.empty()) {
+      session.ambiguous = true;
+    }
+    session.serviceType = serviceType;
+    for (SingleMessage& single : singleMessages) {
+      if (single.session == &session) single.serviceNames.insert(ServiceName(serviceType));
+    }
+  }
+
+  void start(Session& session, const RecordedCall& call) {
+    session.started = true;
+    session.history.clear();
+    session.runs.push_back({session.serviceType != kTest,
+                            ServiceName(session.serviceType) + "_session",
+                            {session.userInfo},
+                            {}});
+    // The previous start is answered once more.
+    for (const RecordedCall* start : session.starts) answers[start].emplace_back(true);
+    session.starts = {&call};
+  }
+
+  void stop(Session& session) {
+    if (!session.started) return;
+    Run& run = session.runs.back();
+    if (!session.history.empty()) {
+      Dictionary summary = {{"ZQ_Session_Summary_Event", std::to_string(session.serviceType)}};
+      for (const auto& [messageID, payload] : session.history) {
+        summary.set(messageID, JsonText(payload));
+      }
+      run.messages.push_back({0xffff, 0xffff, summary});
+      const Value* application = session.userInfo.find("HostApplicationDisplayID");
+      histories.push_back(
+          {fmt::format("-quarvel-{}-{}.json",
+                       application == nullptr ? "unknown" : FileNamePart(*application->string()),
+                       ServiceName(session.serviceType)),
+           session.userInfo, session.history});
+      ++session.counts[MessageName(0xffff'ffff, '_', 0xffff)];
+    }
+    run.stopped = true;
+    session.started = false;
+    for (const RecordedCall* start : session.starts) answers[start].emplace_back(true);
+  }
+
+  void send(Client& client, const RecordedCall& call) {
+    const Dictionary payload =
+        call.arguments[0].isNil() ? Dictionary() : *call.arguments[0].dictionary();
+    const auto category = static_cast<std::uint32_t>(*call.arguments[1].integer());
+    const auto type = static_cast<std::uint16_t>(*call.arguments[2].integer());
+    if (!reporting_) {
+      answers[&call].emplace_back("tarnwick.audio.reporting 1");
+      return;
+    }
+    std::vector<Session*> targets;
+    if (const List* reporterIDs = call.arguments[3].list()) {
+      for (const Value& reporterID : *reporterIDs) {
+        Session* session =
+            *reporterID.integer() == 0 ? nullptr : any(client, *reporterID.integer());
+        if (session != nullptr) {
+          targets.push_back(session);
+        } else {
+          ++unroutable;
+        }
+      }
+    } else {
+      for (Client& each : clients_) {
+        for (const auto& [reporterID, session] : each.sessions) {
+          if (session->started) targets.push_back(session);
+        }
+      }
+      if (targets.empty()) {
+        singleMessages.push_back({agentMessage(category, type, WithoutBlanksInKeys(payload)),
+                                  {ServiceName(5)},
+                                  nullptr});
+      }
+    }
+    for (Session* session : targets) {
+      offerToSinks(*session, payload, category, type);
+      deliver(*session, payload, category, type);
+    }
+    answers[&call].emplace_back();
+  }
+
   void offerToSinks(const Session& session, const Dictionary& payload, std::uint32_t category,
-                    std::uint16_t type);
+                    std::uint16_t type) {
+    const Value* application = session.userInfo.find("HostApplicationDisplayID");
+    const Value named = application == nullptr ? Value("Unknown") : *application;
+    Dictionary event = payload;
+    event.set("HostApplicationDisplayID", named);
+    events.emplace_back("tarnwick.quarvel." + MessageName(category, '.', type), event);
+    if (const Value* engineOnTime = payload.find("EngineOnTime")) {
+      Dictionary& record = powerRecords.emplace_back(
+          Dictionary{{"EngineOnDuration", *engineOnTime}, {"ApplicationName", named}});
+      if (const Value* timestamp = payload.find("zqreporting_timestamp")) {
+        record.set("TimestampEnd", *timestamp);
+      }
+    }
+  }
+
+  void deliver(Session& session, const Dictionary& payload, std::uint32_t category,
+               std::uint16_t type) {
+    const std::string name = MessageName(category, '_', type);
+    const std::string messageID = fmt::format("{}_{}", name, ++session.counts[name]);
+    Dictionary enriched = WithoutBlanksInKeys(payload);
+    if (session.started) {
+      session.history.emplace_back(messageID, enriched);
+      session.runs.back().messages.push_back(agentMessage(category, type, std::move(enriched)));
+    } else {
+      singleMessages.push_back({agentMessage(category, type, std::move(enriched)),
+                                {ServiceName(session.serviceType)},
+                                &session});
+    }
+  }
 
   std::vector<Client> clients_;  // in order of acceptance
   bool reporting_ = true;
