@@ -47,6 +47,7 @@ struct SimulatedAgent {
     Dictionary info;
     Dictionary userInfo;
     Message message;
+    bool refused;
   };
   // Switches.
   bool answers = true;                  // off: a configuration is never answered
@@ -60,7 +61,6 @@ struct SimulatedAgent {
   std::vector<RelmReportingToken> tokens;
   std::deque<Session> sessions;  // references stay valid
   std::vector<SingleMessage> singleMessages;
-  std::vector<SingleMessage> refusedSingleMessages;
 };
 
 /// A registered log scope. Lives, as its handle does, as long as the process.

@@ -76,10 +76,9 @@ Outcome RelmReporting::sendOneMessage(const Dictionary& sessionInfo, const Dicti
                                       const Payload& payload) {
   AwaitRoom();
   Simulation::current().note(fmt::format("agent single {:#x} {:#x}", category, type));
-  SimulatedAgent::SingleMessage message{
-      sessionInfo, userInfo, {category, type, payload, Simulation::current().elapsed()}};
   const auto& error = Agent().singleMessageError;
-  (error ? Agent().refusedSingleMessages : Agent().singleMessages).push_back(std::move(message));
+  const SimulatedAgent::Message message{category, type, payload, Simulation::current().elapsed()};
+  Agent().singleMessages.push_back({sessionInfo, userInfo, message, error.has_value()});
   return error ? Outcome(*error) : Success();
 }
 

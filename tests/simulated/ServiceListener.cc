@@ -2,8 +2,6 @@
 
 #include <fmt/format.h>
 
-#include <utility>
-
 #include "base/MessagePack.h"
 #include "tests/simulated/Simulation.h"
 

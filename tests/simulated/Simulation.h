@@ -33,18 +33,13 @@ class Seeds {
   /// `QUARVEL_SEED` alone when it is set, to replay a failure; else `QUARVEL_SEEDS` seeds (25 times
   /// as many when `QUARVEL_NIGHTLY` is set), 20 by default.
   Seeds();
-
-  struct Iterator {
-    std::uint64_t seed;
-    std::uint64_t last;
-    std::uint64_t operator*() const { return seed; }
-    void operator++() { ++seed; }
-    bool operator!=(std::default_sentinel_t) const {
-      return seed <= last && !testing::Test::HasFailure();
-    }
-  };
-  [[nodiscard]] Iterator begin() const { return {first_, last_}; }
+  [[nodiscard]] Seeds begin() const { return *this; }
   [[nodiscard]] std::default_sentinel_t end() const { return {}; }
+  std::uint64_t operator*() const { return first_; }
+  void operator++() { ++first_; }
+  bool operator!=(std::default_sentinel_t) const {
+    return first_ <= last_ && !testing::Test::HasFailure();
+  }
   [[nodiscard]] std::uint64_t size() const { return last_ - first_ + 1; }
 
  private:

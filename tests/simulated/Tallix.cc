@@ -6,18 +6,15 @@ namespace quarvel {
 
 /// Indices of the published ones.
 class TallixChannelSet : public std::vector<std::size_t> {};
-
 class TallixSubscription {
  public:
   TallixChannels channels;
 };
-
 class TallixChannelSample {
  public:
   SimulatedTallix::Name name;
   std::int64_t value;
 };
-
 class TallixSampleSet : public std::vector<TallixChannelSample> {};
 
 static SimulatedTallix& Tallix() {

@@ -3,13 +3,6 @@
 #include <fmt/format.h>
 
 #include <algorithm>
-#include <cstdint>
-#include <deque>
-#include <map>
-#include <set>
-#include <string>
-#include <utility>
-#include <vector>
 
 #include "base/Json.h"
 #include "base/Vocabulary.h"
@@ -17,8 +10,7 @@
 
 namespace quarvel {
 
-inline constexpr std::uint16_t kTest = 11;
-
+inline constexpr std::uint16_t kTest = 11;  // service type
 inline std::string ServiceName(std::uint16_t type) {
   return std::string(vocabulary::NameOf(vocabulary::ServiceType{type}));
 }
@@ -26,20 +18,6 @@ inline std::string ServiceName(std::uint16_t type) {
 inline std::string MessageName(std::uint32_t category, char separator, std::uint16_t type) {
   return fmt::format("{}{}{}", vocabulary::NameOf(vocabulary::Category(category)), separator,
                      vocabulary::NameOf(vocabulary::MessageType{type}));
-}
-
-inline Dictionary WithoutBlanksInKeys(const Dictionary& payload) {
-  Dictionary result;
-  for (const auto& [key, value] : payload) {
-    if (const std::string* text = key.string()) {
-      std::string underscored = *text;
-      std::ranges::replace(underscored, ' ', '_');
-      result.set(underscored, value);
-    } else {
-      result.set(key, value);
-    }
-  }
-  return result;
 }
 
 /// The application in the name of a history file: at most 128 bytes of whole characters.
@@ -98,10 +76,7 @@ class Model {
 
   void execute(const Arrival& arrival) {
     if (arrival.kind == Arrival::Kind::notification) return readPreferences();
-    if (arrival.kind == Arrival::Kind::connection) {
-      clients_.push_back({arrival.client, {}});
-      return;
-    }
+    if (arrival.kind == Arrival::Kind::connection) return clients_.push_back({arrival.client, {}});
     const auto client = std::ranges::find(clients_, arrival.client, &Client::number);
     if (arrival.kind == Arrival::Kind::call) return execute(*client, *arrival.call);
     for (const auto& [reporterID, session] : client->sessions) {
@@ -124,10 +99,17 @@ class Model {
   std::size_t unroutable = 0;  // messages for sessions that do not exist
 
  private:
-  static Message agentMessage(std::uint32_t category, std::uint16_t type, Dictionary payload) {
-    return {static_cast<std::uint16_t>(category % 0x1'0000), type, std::move(payload)};
+  /// With blanks in the payload's own keys replaced.
+  static Message agentMessage(std::uint32_t category, std::uint16_t type,
+                              const Dictionary& payload) {
+    Message message = {static_cast<std::uint16_t>(category % 0x1'0000), type, {}};
+    for (const auto& [key, value] : payload) {
+      std::string text = key.string() == nullptr ? "" : *key.string();
+      std::ranges::replace(text, ' ', '_');
+      message.payload.set(key.string() == nullptr ? key : Key(text), value);
+    }
+    return message;
   }
-
   struct Client {
     std::size_t number;
     std::map<std::int64_t, Session*> sessions;
@@ -145,12 +127,10 @@ class Model {
       for (const auto& [reporterID, session] : client.sessions) merge(*session, defaults);
     }
   }
-
   static Session* own(Client& client, std::int64_t reporterID) {
     const auto found = client.sessions.find(reporterID);
     return found == client.sessions.end() ? nullptr : found->second;
   }
-
   Session* any(Client& client, std::int64_t reporterID) {
     if (Session* session = own(client, reporterID)) return session;
     if (reporterID == 0 || !reporting_) return nullptr;
@@ -159,65 +139,56 @@ class Model {
     }
     return nullptr;
   }
-
   void execute(Client& client, const RecordedCall& call) {
     std::vector<Value>& answer = answers[&call];
     const std::string operation = call.method.substr(0, call.method.find(':'));
-    const auto number = [&](std::size_t i) { return *call.arguments.at(i).integer(); };
-    if (operation == "createReportingSession") {
-      Session& session = sessions.emplace_back();
-      session.reporterID = number(0);
-      client.sessions[session.reporterID] = &session;
-      answer.emplace_back(true);
-    } else if (operation == "setServiceType") {
-      Session* session = number(1) == 0 ? nullptr : own(client, number(1));
-      if (session != nullptr) setServiceType(*session, static_cast<std::uint16_t>(number(0)));
-      answer.emplace_back(true);
-    } else if (operation == "getServiceNameForReporterID") {
-      if (number(0) == 0) answer.emplace_back(65535);
-      const Session* session = any(client, number(0));
-      answer.emplace_back(session == nullptr ? 65535 : session->serviceType);
-    } else if (operation == "setConfiguration") {
-      Session* session = own(client, number(1));
-      if (session != nullptr) merge(*session, *call.arguments.at(0).dictionary());
-      answer.emplace_back(true);
-    } else if (operation == "startReportingSessionForID") {
-      if (number(0) == 0) {
-        answer.emplace_back(true);
-      } else if (Session* session = any(client, number(0));
-                 session != nullptr && !session->started) {
-        start(*session, call);
-      }
-    } else if (operation == "sendMessage") {
-      send(client, call);
-    } else if (operation == "stopReportingSessionForID") {
-      if (Session* session = number(0) == 0 ? nullptr : own(client, number(0))) stop(*session);
-      answer.emplace_back(true);
-    } else if (operation == "destroyReportingSession") {
-      if (Session* session = number(0) == 0 ? nullptr : own(client, number(0))) {
-        stop(*session);
-        client.sessions.erase(number(0));
-      }
-      answer.emplace_back(true);
-    } else if (operation == "reporterID") {
-      const Session* session = any(client, number(0));
-      answer.emplace_back(
-          Dictionary{{"reporterID", session == nullptr ? Value(0) : Value(number(0))},
-                     {"serviceType", session == nullptr ? 65535 : session->serviceType}});
-    } else {
+    if (operation == "sendMessage") return send(client, call);
+    if (operation == "getAllReporters") {
       List all;
       for (const Client& each : clients_) {
         for (const auto& [reporterID, session] : each.sessions) all.emplace_back(reporterID);
       }
       answer.emplace_back(std::move(all));
+      return;
     }
+    const std::int64_t id = *call.arguments.back().integer();
+    Session* const mine = own(client, id);
+    Session* const anyones = any(client, id);
+    const std::uint16_t serviceType = anyones == nullptr ? 65535 : anyones->serviceType;
+    if (operation == "getServiceNameForReporterID") {
+      if (id == 0) answer.emplace_back(65535);
+      answer.emplace_back(serviceType);
+      return;
+    }
+    if (operation == "reporterID") {
+      answer.emplace_back(
+          Dictionary{{"reporterID", anyones == nullptr ? 0 : id}, {"serviceType", serviceType}});
+      return;
+    }
+    if (operation == "startReportingSessionForID" && id != 0) {
+      if (anyones != nullptr && !anyones->started) start(*anyones, call);
+      return;
+    }
+    if (operation == "createReportingSession") {
+      Session& session = sessions.emplace_back();
+      session.reporterID = id;
+      client.sessions[id] = &session;
+    } else if (operation == "setConfiguration") {
+      if (mine != nullptr) merge(*mine, *call.arguments.at(0).dictionary());
+    } else if (mine != nullptr && id != 0) {
+      if (operation == "setServiceType") {
+        setServiceType(*mine, static_cast<std::uint16_t>(*call.arguments.at(0).integer()));
+      } else {
+        stop(*mine);
+      }
+      if (operation == "destroyReportingSession") client.sessions.erase(id);
+    }
+    answer.emplace_back(true);
   }
-
   static void merge(Session& session, const Dictionary& entries) {
     session.userInfo.merge(entries);
     for (Run& run : session.runs) run.userInfos.push_back(session.userInfo);
   }
-
   void setServiceType(Session& session, std::uint16_t serviceType) {
     if ((serviceType == kTest) != (session.serviceType == kTest) && !session.runs.empty()) {
       session.ambiguous = true;
@@ -227,19 +198,15 @@ class Model {
       if (single.session == &session) single.serviceNames.insert(ServiceName(serviceType));
     }
   }
-
   void start(Session& session, const RecordedCall& call) {
     session.started = true;
     session.history.clear();
-    session.runs.push_back({session.serviceType != kTest,
-                            ServiceName(session.serviceType) + "_session",
-                            {session.userInfo},
-                            {}});
+    const std::string name = ServiceName(session.serviceType) + "_session";
+    session.runs.push_back({session.serviceType != kTest, name, {session.userInfo}, {}});
     // The previous start is answered once more.
     for (const RecordedCall* start : session.starts) answers[start].emplace_back(true);
     session.starts = {&call};
   }
-
   void stop(Session& session) {
     if (!session.started) return;
     Run& run = session.runs.back();
@@ -250,10 +217,10 @@ class Model {
       }
       run.messages.push_back({0xffff, 0xffff, summary});
       const Value* application = session.userInfo.find("HostApplicationDisplayID");
+      const std::string name =
+          application == nullptr ? "unknown" : FileNamePart(*application->string());
       histories.push_back(
-          {fmt::format("-quarvel-{}-{}.json",
-                       application == nullptr ? "unknown" : FileNamePart(*application->string()),
-                       ServiceName(session.serviceType)),
+          {fmt::format("-quarvel-{}-{}.json", name, ServiceName(session.serviceType)),
            session.userInfo, session.history});
       ++session.counts[MessageName(0xffff'ffff, '_', 0xffff)];
     }
@@ -261,7 +228,6 @@ class Model {
     session.started = false;
     for (const RecordedCall* start : session.starts) answers[start].emplace_back(true);
   }
-
   void send(Client& client, const RecordedCall& call) {
     const Dictionary payload =
         call.arguments[0].isNil() ? Dictionary() : *call.arguments[0].dictionary();
@@ -274,13 +240,9 @@ class Model {
     std::vector<Session*> targets;
     if (const List* reporterIDs = call.arguments[3].list()) {
       for (const Value& reporterID : *reporterIDs) {
-        Session* session =
-            *reporterID.integer() == 0 ? nullptr : any(client, *reporterID.integer());
-        if (session != nullptr) {
-          targets.push_back(session);
-        } else {
-          ++unroutable;
-        }
+        const std::int64_t id = *reporterID.integer();
+        Session* session = id == 0 ? nullptr : any(client, id);
+        session == nullptr ? void(++unroutable) : targets.push_back(session);
       }
     } else {
       for (Client& each : clients_) {
@@ -289,20 +251,17 @@ class Model {
         }
       }
       if (targets.empty()) {
-        singleMessages.push_back({agentMessage(category, type, WithoutBlanksInKeys(payload)),
-                                  {ServiceName(5)},
-                                  nullptr});
+        singleMessages.push_back(
+            {agentMessage(category, type, payload), {ServiceName(5)}, nullptr});
       }
     }
-    for (Session* session : targets) {
-      offerToSinks(*session, payload, category, type);
-      deliver(*session, payload, category, type);
-    }
+    for (Session* session : targets) deliver(*session, payload, category, type);
     answers[&call].emplace_back();
   }
 
-  void offerToSinks(const Session& session, const Dictionary& payload, std::uint32_t category,
-                    std::uint16_t type) {
+  /// Offers the message to both sinks, then delivers it.
+  void deliver(Session& session, const Dictionary& payload, std::uint32_t category,
+               std::uint16_t type) {
     const Value* application = session.userInfo.find("HostApplicationDisplayID");
     const Value named = application == nullptr ? Value("Unknown") : *application;
     Dictionary event = payload;
@@ -311,27 +270,19 @@ class Model {
     if (const Value* engineOnTime = payload.find("EngineOnTime")) {
       Dictionary& record = powerRecords.emplace_back(
           Dictionary{{"EngineOnDuration", *engineOnTime}, {"ApplicationName", named}});
-      if (const Value* timestamp = payload.find("zqreporting_timestamp")) {
-        record.set("TimestampEnd", *timestamp);
-      }
+      const Value* timestamp = payload.find("zqreporting_timestamp");
+      if (timestamp != nullptr) record.set("TimestampEnd", *timestamp);
     }
-  }
-
-  void deliver(Session& session, const Dictionary& payload, std::uint32_t category,
-               std::uint16_t type) {
     const std::string name = MessageName(category, '_', type);
     const std::string messageID = fmt::format("{}_{}", name, ++session.counts[name]);
-    Dictionary enriched = WithoutBlanksInKeys(payload);
+    const Message message = agentMessage(category, type, payload);
     if (session.started) {
-      session.history.emplace_back(messageID, enriched);
-      session.runs.back().messages.push_back(agentMessage(category, type, std::move(enriched)));
+      session.history.emplace_back(messageID, message.payload);
+      session.runs.back().messages.push_back(message);
     } else {
-      singleMessages.push_back({agentMessage(category, type, std::move(enriched)),
-                                {ServiceName(session.serviceType)},
-                                &session});
+      singleMessages.push_back({message, {ServiceName(session.serviceType)}, &session});
     }
   }
-
   std::vector<Client> clients_;  // in order of acceptance
   bool reporting_ = true;
 };
