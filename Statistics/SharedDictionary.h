@@ -13,7 +13,9 @@ namespace quarvel {
 /// lock for the length of a copy.
 class SharedDictionary {
  public:
+  /// An empty dictionary.
   SharedDictionary() = default;
+  /// Begins with the entries of `dictionary`.
   explicit SharedDictionary(Dictionary dictionary) : dictionary_(std::move(dictionary)) {}
 
   /// Adds the entries of `other`; a new value replaces an old one.
@@ -21,6 +23,7 @@ class SharedDictionary {
     const MutexLock lock(mutex_);
     dictionary_.merge(other);
   }
+  /// All entries as of now; later merges do not show in the copy.
   [[nodiscard]] Dictionary copy() const {
     const MutexLock lock(mutex_);
     return dictionary_;

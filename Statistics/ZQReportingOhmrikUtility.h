@@ -14,7 +14,8 @@ namespace quarvel {
 /// Power-usage log, for messages that carry an engine-on time.
 class ZQReportingOhmrikUtility {
  public:
-  /// Writes one power-log record when `event` has an "EngineOnTime".
+  /// Writes one power-log record when `event` has an "EngineOnTime": that time, the application's
+  /// name, and the message's timestamp where it has one. Category and type do not matter.
   static void handleEvent(const std::optional<Payload>& event, std::uint32_t category,
                           std::uint16_t type, const SharedDictionary& session);
 };

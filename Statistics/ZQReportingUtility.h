@@ -16,22 +16,32 @@ namespace quarvel {
 using ReporterID = std::int64_t;
 
 // Codes that the service itself uses or treats specially.
+
+/// Category of the driver statistics.
 inline constexpr std::uint32_t kCategoryTallixing =
     static_cast<std::uint32_t>(vocabulary::Kind::tallixing);
+/// Category of a session's summary; no client's component or kind.
 inline constexpr std::uint32_t kCategorySummary = 0xffff'ffff;
+/// Type of the driver statistics.
 inline constexpr std::uint16_t kTypeGeneric =
     static_cast<std::uint16_t>(vocabulary::MessageType::generic);
+/// Type of a session's summary.
 inline constexpr std::uint16_t kTypeSummary = 0xffff;
+/// Telephony and long-form audio are the two types whose orientation is tracked.
 inline constexpr std::uint16_t kServiceTypeTelephony =
     static_cast<std::uint16_t>(vocabulary::ServiceType::telephony);
+/// Single messages of this type are delayed at random.
 inline constexpr std::uint16_t kServiceTypeAlarms =
     static_cast<std::uint16_t>(vocabulary::ServiceType::alarms);
+/// Type of a broadcast that finds no started session.
 inline constexpr std::uint16_t kServiceTypeStandalone =
     static_cast<std::uint16_t>(vocabulary::ServiceType::standalone);
 inline constexpr std::uint16_t kServiceTypeLongFormAudio =
     static_cast<std::uint16_t>(vocabulary::ServiceType::longFormAudio);
+/// Messages sent while such a session is started are dropped: they never reach the agent.
 inline constexpr std::uint16_t kServiceTypeTest =
     static_cast<std::uint16_t>(vocabulary::ServiceType::test);
+/// Type of a session until its client sets one; also the reply for an unknown session.
 inline constexpr std::uint16_t kServiceTypeUnknown =
     static_cast<std::uint16_t>(vocabulary::ServiceType::unknown);
 

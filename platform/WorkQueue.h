@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cassert>
 #include <chrono>
 #include <memory>
 #include <string_view>
@@ -31,6 +32,7 @@ class QUARVEL_CAPABILITY("queue") WorkQueue {
  public:
   virtual ~WorkQueue() = default;
 
+  /// The name given at creation. From any thread; lives as long as the process.
   [[nodiscard]] virtual std::string_view label() const = 0;
   /// Queues `block`.
   virtual void async(Block block) = 0;
@@ -43,7 +45,7 @@ class QUARVEL_CAPABILITY("queue") WorkQueue {
   [[nodiscard]] virtual bool isCurrent() const = 0;
 
   /// Asserts that the calling block runs on the queue (debug builds).
-  void assertCurrent() const QUARVEL_ASSERT_CAPABILITY(this);
+  void assertCurrent() const QUARVEL_ASSERT_CAPABILITY(this) { assert(isCurrent()); }
 };
 
 /// A new serial queue. `label` is a string literal and names the queue in tools and logs. An idle

@@ -17,8 +17,8 @@ namespace quarvel {
 /// Identifies a message within its session: its codes, and its number (from 1) among the messages
 /// with the same names.
 struct MessageIdentity {
-  std::uint64_t number;
-  std::uint32_t category;
+  std::uint64_t number;    // continues over the session's runs
+  std::uint32_t category;  // as the client sent it
   std::uint16_t type;
 
   /// "category_type_n"
@@ -48,6 +48,7 @@ class PayloadHistory {
     const MutexLock lock(mutex_);
     entries().emplace_front(std::make_unique<const Dictionary>(std::move(dictionary)));
   }
+  /// Whether no entry was ever added: entries are not removed.
   [[nodiscard]] bool empty() const {
     const MutexLock lock(mutex_);
     return !entries_;
@@ -75,6 +76,7 @@ class PayloadHistory {
   using Entry = std::variant<SentMessage, std::unique_ptr<const Dictionary>>;
   static_assert(sizeof(Entry) <= 32);
 
+  /// Creates the deque on the first use.
   std::deque<Entry>& entries() QUARVEL_REQUIRES(mutex_) {
     if (!entries_) entries_.emplace();
     return *entries_;

@@ -21,6 +21,7 @@ namespace quarvel {
 /// any thread.
 class ZQReportingBlockThrottleTimerWrapper {
  public:
+  /// Begins with `block` and without a timer. `block` may be empty: nothing then runs.
   explicit ZQReportingBlockThrottleTimerWrapper(Block block);
 
   /// Shared, since a reader may still hold a block that a duplicate has replaced.
@@ -30,6 +31,7 @@ class ZQReportingBlockThrottleTimerWrapper {
 
   /// Null until it is set.
   [[nodiscard]] std::shared_ptr<RunLoopTimer> timer() const;
+  /// Shares `timer`, which `sleepFor` then moves, and releases the one before.
   void setTimer(std::shared_ptr<RunLoopTimer> timer);
 
   /// Moves the timer to `seconds` from now; it fires at once when `seconds` is not positive.
@@ -56,9 +58,12 @@ class ZQReportingBlockThrottle : public std::enable_shared_from_this<ZQReporting
 
  public:
   using Wrapper = ZQReportingBlockThrottleTimerWrapper;
+  /// Message key to pending message.
   using TimersInFlight = std::unordered_map<std::string, std::shared_ptr<Wrapper>>;
+  /// Message keys in order of arrival.
   using TimerKeys = std::vector<std::string>;
 
+  /// For `init` alone.
   explicit ZQReportingBlockThrottle(Private);
 
   /// A new throttle with its worker running.
@@ -91,19 +96,28 @@ class ZQReportingBlockThrottle : public std::enable_shared_from_this<ZQReporting
 
   /// A copy of the pending messages by key. From any thread, like the accessors below.
   [[nodiscard]] TimersInFlight timersInFlight() const;
+  /// Replaces all pending messages; a removed one never runs and its block is destroyed.
   void setTimersInFlight(TimersInFlight timersInFlight);
   /// Keys of messages that the worker has not scheduled yet, in order of arrival.
   [[nodiscard]] TimerKeys unscheduledTimerKeys() const;
+  /// Replaces the keys. A message that is not scheduled yet and has no key here never runs.
   void setUnscheduledTimerKeys(TimerKeys keys);
+  /// The worker's handle. Dropping it leaves the worker running.
   [[nodiscard]] std::shared_ptr<WorkerThread> queueThread() const;
   void setQueueThread(std::shared_ptr<WorkerThread> thread);
 
  private:
+  /// A pending message whose timer calls `fire` `seconds` from now.
   [[nodiscard]] std::shared_ptr<Wrapper> makeWrapper(const std::string& key, Block block,
                                                      double seconds);
+  /// Removes the pending message of `key` and its timer, then runs the block of `wrapper`. On the
+  /// worker; the block runs with no lock held.
   void fire(Wrapper& wrapper, const std::string& key);
+  /// The worker's body.
   void work();
+  /// Puts the timers of the unscheduled keys on the worker's run loop.
   void scheduleTimers();
+  // For log lines and waits; each takes its own lock.
   [[nodiscard]] std::size_t countInFlight() const;
   [[nodiscard]] std::size_t countUnscheduled() const;
 

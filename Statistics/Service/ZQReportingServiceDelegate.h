@@ -27,6 +27,7 @@ class ZQReportingServerInstance;
 /// Implemented by the delegate, which an instance holds weakly.
 class ZQReportingServiceDelegateProtocol {
  public:
+  /// The accepted clients; the list shares the ownership of each.
   using Clients = std::vector<std::shared_ptr<ZQReportingServerInstance>>;
 
   virtual ~ZQReportingServiceDelegateProtocol() = default;
@@ -36,13 +37,14 @@ class ZQReportingServiceDelegateProtocol {
       QUARVEL_REQUIRES(serverQueueRole) = 0;
   /// The live list, in order of acceptance.
   [[nodiscard]] virtual const Clients& getAllClients() QUARVEL_REQUIRES(serverQueueRole) = 0;
-  /// The reporting switch of the preferences.
+  /// The reporting switch of the preferences; on until they are read. From any thread.
   [[nodiscard]] virtual bool isReportingEnabled() = 0;
   /// The session with this identifier of the first client that has one; none for 0 and while
   /// reporting is switched off.
   [[nodiscard]] virtual std::shared_ptr<ZQReportingSession> findReportingSessionForID(
       ReporterID reporterID) QUARVEL_REQUIRES(serverQueueRole) = 0;
   /// Driver counters now, and their rise since (`ZQReportingDriverUtility`).
+  /// Each takes some microseconds a channel; a driver that fails is left out.
   [[nodiscard]] virtual DriverSnapShot getSnapShot() QUARVEL_REQUIRES(serverQueueRole) = 0;
   [[nodiscard]] virtual std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
       const std::optional<DriverSnapShot>& snapShot) QUARVEL_REQUIRES(serverQueueRole) = 0;
@@ -62,15 +64,22 @@ class ZQReportingServerInstance final
   struct Private {};
 
  public:
+  /// Sessions by identifier, in ascending order.
   using SessionMap = std::map<ReporterID, std::shared_ptr<ZQReportingSession>>;
 
+  /// For `initWithPID` alone.
   ZQReportingServerInstance(Private, std::int32_t pid,
                             std::weak_ptr<ZQReportingServiceDelegateProtocol> delegate);
+  /// Drops the sessions that it still has, without stopping them.
   ~ZQReportingServerInstance() override;
 
-  /// A new instance for the client process `pid`.
+  /// A new instance for the client process `pid`, which is in no list yet. `delegate` may end
+  /// first: operations then find no other client and no preferences. From any thread.
   [[nodiscard]] static std::shared_ptr<ZQReportingServerInstance> initWithPID(
       std::int32_t pid, std::weak_ptr<ZQReportingServiceDelegateProtocol> delegate);
+
+  // The operations of the protocol, whose header describes them. Each logs its entry on the
+  // connection's thread, queues one block and returns; the block keeps the instance alive.
 
   void createReportingSession(ReporterID reporterID, BoolReply reply) override;
   void setServiceType(std::uint16_t serviceType, ReporterID reportingSession,
@@ -101,6 +110,8 @@ class ZQReportingServerInstance final
   /// The time of registration, absent before. From any thread, like the next three.
   [[nodiscard]] std::optional<Date> clientStartDate() const;
   void setClientStartDate(Date date);
+  /// The process's short name; absent before the registration, or when the process has gone by
+  /// then.
   [[nodiscard]] std::optional<std::string> clientProcessName() const;
   void setClientProcessName(std::optional<std::string> name);
   /// This client's sessions by identifier.
@@ -122,6 +133,7 @@ class ZQReportingServerInstance final
 
   const std::int32_t processIdentifier_;
   const CountedAs counted_{Gauge::clients};
+  /// Weak, since the delegate's list owns the instance.
   const std::weak_ptr<ZQReportingServiceDelegateProtocol> delegate_;
 
   // The delegate sets these on the `ServerQueue`; the invalidation handler reads them on a platform
@@ -145,15 +157,19 @@ class ZQReportingServiceDelegate final
   struct Private {};
 
  public:
+  /// For `create` alone.
   explicit ZQReportingServiceDelegate(Private);
 
   /// Creates the `ServerQueue` too, and registers for changes of the preferences. Reads none yet:
   /// reporting is on until the first notification.
   [[nodiscard]] static std::shared_ptr<ZQReportingServiceDelegate> create();
 
-  /// Accepts every connection. Called on a platform thread.
+  /// Accepts every connection: exports a new server instance, resumes the connection and queues the
+  /// client's registration. Called on a platform thread. Returns true.
   bool shouldAcceptNewConnection(ServiceListener& listener,
                                  const std::shared_ptr<ClientConnection>& connection) override;
+
+  // `ZQReportingServiceDelegateProtocol`
 
   [[nodiscard]] const std::optional<Dictionary>& getDefaults() override
       QUARVEL_REQUIRES(serverQueueRole) {
@@ -176,6 +192,7 @@ class ZQReportingServiceDelegate final
       QUARVEL_REQUIRES(serverQueueRole);
 
   /// The preferences as they are now: "device_name" when there is one, and "disable_reporting".
+  /// Reads the preferences domain of the service.
   [[nodiscard]] static Dictionary ZQReportingDefaults();
 
  private:
@@ -193,7 +210,12 @@ class ZQReportingServiceDelegate final
   std::optional<ZQReportingDriverUtility> driverUtility_;  // present and constant after `create`
 };
 
-/// The short name of a client's process, if it is known. From any thread.
+/// The process entry: makes the delegate, gives it to the process's listener and serves clients
+/// until the service is told to end. On the main thread. Returns the exit status of the process.
+[[nodiscard]] int ServiceMain();
+
+/// The short name of a client's process, if it is known: the own one for the own process, and none
+/// for a process that has ended. From any thread.
 [[nodiscard]] std::optional<std::string> ProcessNameForPID(std::int32_t pid);
 
 }  // namespace quarvel

@@ -40,7 +40,9 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
   /// Called with the agent's error, or none.
   using SendReply = std::function<void(const std::optional<Error>& error)>;
 
+  /// For `initWithID` alone.
   ZQReportingSession(Private, ReporterID reporterID, std::vector<std::int32_t> processIdentifiers);
+  /// From any thread: the last reference may be a queued block's.
   ~ZQReportingSession();
   ZQReportingSession(const ZQReportingSession&) = delete;
   ZQReportingSession& operator=(const ZQReportingSession&) = delete;
@@ -54,6 +56,7 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
   /// Merges into the user information, in which keys are never removed; an absent dictionary
   /// changes nothing.
   void setConfiguration(const std::optional<Dictionary>& configuration);
+  /// The same with the preferences as they were read.
   void updateDefaults(const std::optional<Dictionary>& defaults);
 
   /// Begins an agent session, for whose backends the session queue waits up to 9 seconds. Does
@@ -94,6 +97,7 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
 
   // Without a queue in their declaration: from any thread.
 
+  /// The client's identifier; other clients may use the same one.
   [[nodiscard]] ReporterID reporterID() const { return reporterID_; }
   [[nodiscard]] const std::vector<std::int32_t>& processIdentifiers() const {
     return processIdentifiers_;
@@ -102,10 +106,13 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
   [[nodiscard]] bool started() const QUARVEL_REQUIRES(serverQueueRole) { return started_; }
   /// Never true: nothing sets it.
   [[nodiscard]] bool relmReportingSessionStarted() const { return relmReportingSessionStarted_; }
+  /// The code last set, any number; `kServiceTypeUnknown` before.
   [[nodiscard]] std::uint16_t serviceType() const { return serviceType_; }
+  /// The service type's name: "unknown" before one is set, empty for a code that has none.
   [[nodiscard]] const std::string& serviceName() const QUARVEL_REQUIRES(serverQueueRole) {
     return serviceName_;
   }
+  /// The live user information, valid while the session lives.
   [[nodiscard]] const SharedDictionary& userInfo() const { return *userInfo_; }
   /// The history of this run; null after a stop. From any thread.
   [[nodiscard]] std::shared_ptr<PayloadHistory> aggregatedPayloadData() const;
@@ -149,9 +156,12 @@ class ZQReportingSession : public std::enable_shared_from_this<ZQReportingSessio
 
   // On the `ServerQueue`.
 
+  /// Counts one message of this session, client's or summary, as accepted.
   void acceptMessage() const;
   /// Sends the summary of a run that has a history.
   void sendSummary() QUARVEL_REQUIRES(serverQueueRole);
+  /// Adds orientation changes to the history until `unregisterOrientationHandlers`, which waits for
+  /// a handler that is running.
   void registerOrientationHandlers() QUARVEL_REQUIRES(serverQueueRole);
   void unregisterOrientationHandlers() QUARVEL_REQUIRES(serverQueueRole);
   /// Writes `history` as a JSON file into the diagnostics directory. Failures are logged.

@@ -40,19 +40,15 @@ TEST_F(InternalBuild, FileErrorsAreLoggedAndDoNotAffectTheSummary) {
 }
 
 TEST_F(InternalBuild, OrientationIsTrackedForTwoServiceTypesExceptOnDeviceClass6) {
-  struct Case {
-    std::uint16_t serviceType;
-    std::optional<std::int64_t> deviceClass;
-    bool tracked;
-  };
-  const Case kCases[] = {{7, 1, true},  {2, 1, true},  {7, std::nullopt, true}, {7, 6, false},
-                         {2, 6, false}, {8, 1, false}, {65535, 1, false}};
-  for (const Case& each : kCases) {
-    SCOPED_TRACE(each.serviceType);
-    SessionOwner owner(1, each.serviceType);
-    owner.deviceClass = each.deviceClass;
+  const std::tuple<std::uint16_t, std::optional<std::int64_t>, bool> kCases[] = {
+      {7, 1, true},  {2, 1, true},  {7, std::nullopt, true}, {7, 6, false},
+      {2, 6, false}, {8, 1, false}, {65535, 1, false}};
+  for (const auto& [serviceType, deviceClass, tracked] : kCases) {
+    SCOPED_TRACE(serviceType);
+    SessionOwner owner(1, serviceType);
+    owner.deviceClass = deviceClass;
     owner.start();
-    const std::size_t expected = each.tracked ? 1 : 0;
+    const std::size_t expected = tracked ? 1 : 0;
     EXPECT_EQ(owner.orientation.device.count("ZQReportingService 7"), expected);
     EXPECT_EQ(owner.orientation.ui.count("ZQReportingService 7"), expected);
     owner.stop();

@@ -15,7 +15,7 @@
 
 #include <quarvel/client.hpp>
 
-#include "Statistics/Service/ServiceMain.h"
+#include "Statistics/Service/ZQReportingServiceDelegate.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Log.h"
 #include "tests/TemporaryDirectory.h"

@@ -9,12 +9,8 @@
 #include <random>
 #include <set>
 #include <string>
-#include <utility>
 #include <vector>
 
-#include "base/Error.h"
-#include "base/Payload.h"
-#include "base/Value.h"
 #include "platform/Counters.h"
 #include "platform/Log.h"
 #include "platform/Notifications.h"
@@ -44,15 +40,15 @@ struct SimulatedAgent {
     std::vector<Message> offered;                   // refused messages too
     std::optional<Scheduler::Duration> foundAfter;  // set when a configuration finds backends
     std::size_t queue = 0;                          // number of the queue that made the session
-    std::vector<Scheduler::Duration> flushes;
+    std::size_t flushes = 0;
     bool released = false;
   };
   struct SingleMessage {
     Dictionary info;
     Dictionary userInfo;
     Message message;
+    bool refused;
   };
-
   // Switches.
   bool answers = true;                  // off: a configuration is never answered
   Scheduler::Duration answersAfter{0};  // duration of a configuration
@@ -61,11 +57,10 @@ struct SimulatedAgent {
   std::optional<Error> flushError;
   std::optional<Error> singleMessageError;
   bool full = false;  // on: senders are held back until it is off and 100 ms have passed
-
+  // Records.
   std::vector<RelmReportingToken> tokens;
   std::deque<Session> sessions;  // references stay valid
   std::vector<SingleMessage> singleMessages;
-  std::vector<SingleMessage> refusedSingleMessages;
 };
 
 /// A registered log scope. Lives, as its handle does, as long as the process.
@@ -79,7 +74,6 @@ struct LogLine {
   std::string scope;  // "[default]" for the default log
   std::string function;
   std::string message;
-
   /// "default zqrs -[Class operation:]: message"; the journal has the same after "log ".
   [[nodiscard]] std::string text() const;
 };
@@ -88,13 +82,11 @@ struct SimulatedLog {
   /// Switch: names of the scopes whose verbose lines are written.
   std::set<std::string, std::less<>> verbose;
   std::vector<LogLine> lines;
-
   /// The texts of the lines that begin with `prefix`.
   [[nodiscard]] std::vector<std::string> texts(std::string_view prefix = "") const;
+  /// The messages alone, of all lines.
+  [[nodiscard]] std::vector<std::string> messages() const;
 };
-
-/// Preferences: domain to entries.
-using SimulatedPreferences = std::map<std::string, Dictionary, std::less<>>;
 
 /// Notification facility.
 struct SimulatedNotifications {
@@ -109,20 +101,8 @@ struct SimulatedNotifications {
   std::int32_t registrationStatus = 0;
   std::vector<std::shared_ptr<Registration>> registrations;
 
-  /// Posts to every registration of that name.
-  void post(std::string_view name);
-  /// Calls the handlers of a name with a token that is not theirs.
-  void deliverForeign(std::string_view name);
-};
-
-/// Analytics facility: events with their payloads.
-struct SimulatedVistrel {
-  std::vector<std::pair<std::string, Payload>> events;
-};
-
-/// Power log.
-struct SimulatedOhmrik {
-  std::vector<Payload> records;
+  /// Posts to every registration of that name. With an offset, handlers get a foreign token.
+  void post(std::string_view name, NotificationToken tokenOffset = 0);
 };
 
 /// Service counters. Messages are conserved: once none is in flight, accepted = handed to the agent
@@ -131,7 +111,6 @@ struct SimulatedCounters {
   std::uint64_t accepted = 0;
   std::array<std::uint64_t, 3> dropped{};
   std::array<std::int64_t, 3> gauges{};
-
   [[nodiscard]] std::uint64_t of(StoreDrop reason) const {
     return dropped[static_cast<std::size_t>(reason)];
   }
@@ -148,7 +127,6 @@ struct SimulatedOrientation {
   using Handlers = std::map<std::string, OrientationHandler, std::less<>>;
   Handlers device;
   Handlers ui;
-
   /// Calls `device` or `ui` on a simulated thread. Handlers must not wait there.
   static void turn(const Handlers& handlers, Orientation orientation);
 };
@@ -157,9 +135,7 @@ struct SimulatedOrientation {
 struct SimulatedFiles {
   /// Path and content of every write in order, failed writes too.
   std::vector<std::pair<std::string, std::string>> writes;
-
-  // Switches.
-  std::optional<Error> directoryError;
+  std::optional<Error> directoryError;  // switch, as the next
   std::optional<Error> writeError;
 };
 
@@ -173,12 +149,9 @@ struct SimulatedTallix {
     std::int64_t value = 0;
     bool published = true;  // else its group is known all the same
   };
-  /// Channels may change their values but not vanish.
-  std::vector<Channel> channels;
-
-  // Switches.
-  std::optional<Error> channelsError;  // the channels are returned all the same
-  std::optional<Error> samplesError;
+  std::vector<Channel> channels;       // may change their values but not vanish
+  std::optional<Error> channelsError;  // switch: the channels are returned all the same
+  std::optional<Error> samplesError;   // switch
 };
 
 class SimulatedConnection;
@@ -187,9 +160,8 @@ class SimulatedConnection;
 struct RecordedCall {
   std::string method;
   List arguments;
-  std::vector<Value> results;  // an error as its text
-  /// The reason why the call did not reach the exported object.
-  std::optional<std::string> fault;
+  std::vector<Value> results;        // an error as its text
+  std::optional<std::string> fault;  // the reason why it did not reach the exported object
 };
 
 /// An event that reached the service, recorded when its work is queued: the service executes
@@ -207,16 +179,12 @@ struct Arrival {
 class SimulatedClient {
  public:
   using Call = std::shared_ptr<const RecordedCall>;
-
   explicit SimulatedClient(const std::shared_ptr<SimulatedConnection>& connection);
-
   /// Sends `arguments`, as MessagePack, to the exported operation `method`.
   Call call(std::string method, const List& arguments);
   /// Breaks the protocol (interruption, then invalidation) or goes away (invalidation alone).
   void end(bool interrupted = false);
-
-  /// For asserting that it is released.
-  [[nodiscard]] std::weak_ptr<ClientConnection> connection() const;
+  [[nodiscard]] bool isReleased() const { return connection_.expired(); }
 
  private:
   std::weak_ptr<SimulatedConnection> connection_;
@@ -227,11 +195,11 @@ class SimulatedListener final : public ServiceListener {
  public:
   /// Connects a process. The delegate is asked on a platform thread, in the next run.
   SimulatedClient connect(std::int32_t processIdentifier);
-
-  void setDelegate(std::shared_ptr<ServiceListenerDelegate> delegate) override;
+  void setDelegate(std::shared_ptr<ServiceListenerDelegate> delegate) override {
+    delegate_ = std::move(delegate);
+  }
   /// Returns at once, since the test has the main thread.
-  void resume() override;
-
+  void resume() override { resumed_ = true; }
   /// Releases an ended connection.
   void drop(const SimulatedConnection& connection);
   /// For the end of the simulation: releases everything.

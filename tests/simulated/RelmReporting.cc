@@ -5,17 +5,14 @@
 #include "tests/simulated/Simulation.h"
 
 namespace quarvel {
-
 namespace {
-
-using namespace std::chrono_literals;
 
 SimulatedAgent& Agent() {
   return Simulation::current().agent;
 }
 
 void AwaitRoom() {
-  while (Agent().full) Simulation::current().scheduler.sleep(100ms);
+  while (Agent().full) TheScheduler().sleep(100ms);
 }
 
 class SimulatedAgentSession final : public RelmReportingSession {
@@ -26,17 +23,13 @@ class SimulatedAgentSession final : public RelmReportingSession {
     record_.released = true;
     Simulation::current().note(fmt::format("agent {} released", number_));
   }
-
   void startConfiguration(ConfigurationCompletion completion) override {
     if (!Agent().answers) return;
     if (Agent().backends) record_.foundAfter = Agent().answersAfter;
-    Simulation& simulation = Simulation::current();
-    simulation.scheduler.after(Agent().answersAfter, [&simulation, found = Agent().backends,
-                                                      completion = std::move(completion)] {
-      simulation.spawn("agent", [found, completion] { completion(found); });
+    TheScheduler().after(Agent().answersAfter, [found = Agent().backends, completion] {
+      TheScheduler().spawn("agent", [found, completion] { completion(found); });
     });
   }
-
   Outcome agentSendMessage(std::uint16_t category, std::uint16_t type,
                            const Payload& payload) override {
     AwaitRoom();
@@ -47,16 +40,11 @@ class SimulatedAgentSession final : public RelmReportingSession {
     record_.messages.push_back(record_.offered.back());
     return Success();
   }
-
   void flushMessages(FlushCompletion completion) override {
-    Simulation& simulation = Simulation::current();
-    simulation.note(fmt::format("agent {} flush", number_));
-    record_.flushes.push_back(simulation.elapsed());
-    simulation.spawn("agent", [completion = std::move(completion), error = Agent().flushError] {
-      completion(error);
-    });
+    Simulation::current().note(fmt::format("agent {} flush", number_));
+    ++record_.flushes;
+    TheScheduler().spawn("agent", [completion, error = Agent().flushError] { completion(error); });
   }
-
   [[nodiscard]] std::string description() const override {
     return fmt::format("<RelmReportingSession {}>", number_);
   }
@@ -78,7 +66,7 @@ std::shared_ptr<RelmReportingSession> RelmReporting::createAgentSession(
   SimulatedAgent::Session& record = Agent().sessions.emplace_back();
   record.info = sessionInfo;
   record.userInfo = userInfo;
-  record.queue = Simulation::current().scheduler.currentQueue();
+  record.queue = TheScheduler().currentQueue();
   Simulation::current().note(fmt::format("agent {} created", Agent().sessions.size()));
   return std::make_shared<SimulatedAgentSession>(record, Agent().sessions.size());
 }
@@ -88,14 +76,10 @@ Outcome RelmReporting::sendOneMessage(const Dictionary& sessionInfo, const Dicti
                                       const Payload& payload) {
   AwaitRoom();
   Simulation::current().note(fmt::format("agent single {:#x} {:#x}", category, type));
-  SimulatedAgent::SingleMessage message{
-      sessionInfo, userInfo, {category, type, payload, Simulation::current().elapsed()}};
-  if (Agent().singleMessageError) {
-    Agent().refusedSingleMessages.push_back(std::move(message));
-    return *Agent().singleMessageError;
-  }
-  Agent().singleMessages.push_back(std::move(message));
-  return Success();
+  const auto& error = Agent().singleMessageError;
+  const SimulatedAgent::Message message{category, type, payload, Simulation::current().elapsed()};
+  Agent().singleMessages.push_back({sessionInfo, userInfo, message, error.has_value()});
+  return error ? Outcome(*error) : Success();
 }
 
 }  // namespace quarvel

@@ -10,30 +10,11 @@
 namespace quarvel {
 
 namespace {
-
 constexpr Date kBeginning{std::chrono::seconds{1'769'866'000}};
 constexpr std::size_t kMostChoices = 1'000'000;
-// Real time. Reached only when a thread blocks outside the simulated platform.
-constexpr std::chrono::seconds kHung{60};
-
+// Real time for one run. Reached only when a thread blocks outside the simulated platform.
+constexpr std::chrono::seconds kHung{300};
 }  // namespace
-
-class Scheduler::Thread {
- public:
-  ConditionVariable turn;
-  bool hasBaton = false;  // guarded by `baton_`
-
-  Ready job;
-  const char* parkedFor = nullptr;
-  std::optional<Date> deadline;
-  bool timedOut = false;
-  bool finished = false;
-  std::thread thread;
-};
-
-namespace {
-thread_local Scheduler::Thread* currentThread = nullptr;
-}
 
 Scheduler::Scheduler(std::uint64_t seed)
     : seed_(seed),
@@ -61,10 +42,6 @@ Scheduler::~Scheduler() {
   }
 }
 
-Scheduler::Thread* Scheduler::current() const {
-  return currentThread;
-}
-
 void Scheduler::runFromTest(std::optional<Duration> until) {
   if (stopped_) return;
   until_ = until;
@@ -77,22 +54,12 @@ void Scheduler::runFromTest(std::optional<Duration> until) {
   if (stopped_) return;
   if (until) {
     elapsed_ = std::max(elapsed_, *until);
-  } else if (const std::string stuck = waiting(); !stuck.empty()) {
-    ADD_FAILURE() << "deadlock: nothing is left to run, but threads wait: " << stuck;
+    return;
   }
-}
-
-std::string Scheduler::waiting() const {
-  std::string all;
   for (const auto& thread : threads_) {
     if (thread->parkedFor == nullptr) continue;
-    all += fmt::format("{}{} for {}", all.empty() ? "" : ", ", thread->job.name, thread->parkedFor);
+    ADD_FAILURE() << "deadlock: " << thread->job.name << " waits for " << thread->parkedFor;
   }
-  return all;
-}
-
-void Scheduler::spawn(std::string name, Block body) {
-  ready_.push_back({nullptr, std::move(name), nullptr, std::move(body)});
 }
 
 std::shared_ptr<Scheduler::Queue> Scheduler::makeQueue(std::string name, bool serial) {
@@ -109,19 +76,6 @@ void Scheduler::enqueue(const std::shared_ptr<Queue>& queue, Block block) {
     queue->busy = true;
     ready_.push_back({nullptr, queue->name, queue, std::move(block)});
   }
-}
-
-void Scheduler::after(Duration delay, Block action) {
-  timers_.emplace(elapsed_ + delay, std::move(action));
-}
-
-bool Scheduler::isCurrent(const Queue& queue) const {
-  return currentThread != nullptr && currentThread->job.queue.get() == &queue;
-}
-
-std::size_t Scheduler::currentQueue() const {
-  const Queue* queue = currentThread == nullptr ? nullptr : currentThread->job.queue.get();
-  return queue == nullptr ? 0 : queue->number;
 }
 
 void Scheduler::mayYield() {
@@ -154,23 +108,26 @@ bool Scheduler::park(const char* reason, std::optional<Date> deadline) {
   return !self.timedOut;
 }
 
-bool Scheduler::isParked(const Thread& thread) {
-  return thread.parkedFor != nullptr;
-}
-
 void Scheduler::wake(Thread& thread) {
   if (thread.parkedFor == nullptr) return;
   thread.parkedFor = nullptr;
   ready_.push_back({&thread, thread.job.name, nullptr, {}});
 }
 
-void Scheduler::sleep(Duration duration) {
-  bool over = false;
-  after(duration, [this, &over, thread = currentThread] {
-    over = true;
-    wake(*thread);
+Scheduler::WakeUp Scheduler::wakeAfter(Duration delay) {
+  auto wakeUp = std::make_shared<bool>();
+  after(delay, [this, thread = currentThread, alive = std::weak_ptr(wakeUp)] {
+    if (!alive.expired()) wake(*thread);
   });
-  while (!over) park("its sleep to end");
+  return wakeUp;
+}
+
+void Scheduler::sleep(Duration duration) {
+  const Duration end = elapsed_ + duration;
+  const WakeUp wakeUp = wakeAfter(duration);
+  do {
+    park("its sleep to end");
+  } while (elapsed_ < end);
 }
 
 void Scheduler::wakeOverdue() {
@@ -264,7 +221,6 @@ void Scheduler::runJob(Thread& thread) {
 }
 
 void Scheduler::handOver(Thread& to) {
-  handOvers_.fetch_add(1, std::memory_order_relaxed);
   const MutexLock lock(baton_);
   to.hasBaton = true;
   to.turn.notifyOne();
@@ -273,11 +229,9 @@ void Scheduler::handOver(Thread& to) {
 void Scheduler::awaitTurn(Thread& thread) {
   const MutexLock lock(baton_);
   while (!thread.hasBaton) {
-    const std::uint64_t seen = handOvers_.load(std::memory_order_relaxed);
     if (&thread != test_.get()) {
       thread.turn.wait(baton_);
-    } else if (!thread.turn.waitUntil(baton_, std::chrono::steady_clock::now() + kHung) &&
-               seen == handOvers_.load(std::memory_order_relaxed)) {
+    } else if (!thread.turn.waitUntil(baton_, std::chrono::steady_clock::now() + kHung)) {
       std::fprintf(stderr, "QUARVEL_SEED=%llu: a thread blocks outside the simulated platform\n",
                    static_cast<unsigned long long>(seed_));
       std::abort();

@@ -1,14 +1,11 @@
 #pragma once
 
-#include <atomic>
 #include <chrono>
-#include <cstdint>
 #include <deque>
 #include <map>
 #include <memory>
 #include <optional>
 #include <random>
-#include <string>
 #include <thread>
 #include <vector>
 
@@ -41,6 +38,25 @@ class Scheduler {
     std::deque<Block> blocks;  // serial: those behind it
   };
 
+  /// A thread that can go on, or a block that can begin (on a queue or by itself).
+  struct Thread;
+  struct Ready {
+    Thread* thread = nullptr;
+    std::string name;
+    std::shared_ptr<Queue> queue;
+    Block block;
+  };
+  struct Thread {
+    ConditionVariable turn;
+    bool hasBaton = false;  // guarded by `baton_`
+    Ready job;
+    const char* parkedFor = nullptr;
+    std::optional<Date> deadline;
+    bool timedOut = false;
+    bool finished = false;
+    std::thread thread;
+  };
+
   explicit Scheduler(std::uint64_t seed);
   /// Ends every simulated thread where it waits, and destroys blocks that have not run.
   ~Scheduler();
@@ -48,7 +64,6 @@ class Scheduler {
   Scheduler& operator=(const Scheduler&) = delete;
 
   // For the test, outside simulated threads.
-
   /// Runs until no thread is ready and none waits for a time. A thread that still waits for a
   /// signal then is a deadlock, which fails the test; so does a simulation without an end.
   void run() { runFromTest(std::nullopt); }
@@ -58,7 +73,6 @@ class Scheduler {
   void runUntil(Duration elapsed) { runFromTest(elapsed); }
 
   // From anywhere.
-
   /// Virtual time since the simulation began.
   [[nodiscard]] Duration elapsed() const { return elapsed_; }
   [[nodiscard]] Date wallClock() const { return Date{} + elapsed_ + wallOffset_; }
@@ -67,14 +81,20 @@ class Scheduler {
   [[nodiscard]] std::uint64_t choose(std::uint64_t bound) { return random_() % bound; }
 
   /// Starts a simulated thread.
-  void spawn(std::string name, Block body);
+  void spawn(std::string name, Block body) {
+    ready_.push_back({nullptr, std::move(name), nullptr, std::move(body)});
+  }
   [[nodiscard]] std::shared_ptr<Queue> makeQueue(std::string name, bool serial);
   void enqueue(const std::shared_ptr<Queue>& queue, Block block);
   /// Runs `action` once the time has come and no thread is ready. It must not wait.
-  void after(Duration delay, Block action);
-  [[nodiscard]] bool isCurrent(const Queue& queue) const;
+  void after(Duration delay, Block action) { timers_.emplace(elapsed_ + delay, std::move(action)); }
+  [[nodiscard]] bool isCurrent(const Queue& queue) const {
+    return current()->job.queue.get() == &queue;
+  }
   /// The number of the queue whose block is running; 0 when none is.
-  [[nodiscard]] std::size_t currentQueue() const;
+  [[nodiscard]] std::size_t currentQueue() const {
+    return current()->job.queue == nullptr ? 0 : current()->job.queue->number;
+  }
   /// Lets another thread go on instead of this one, if the seed says so. Never while a `Mutex` is
   /// held.
   void mayYield();
@@ -84,27 +104,22 @@ class Scheduler {
   void stop() { stopped_ = true; }
 
   // For the objects on which simulated threads wait.
-
-  class Thread;
-  /// The running simulated thread; null in the test.
-  [[nodiscard]] Thread* current() const;
+  /// The running simulated thread, or one that stands for the test.
+  [[nodiscard]] Thread* current() const {
+    return currentThread == nullptr ? test_.get() : currentThread;
+  }
   /// Gives up the baton until `wake`, or until the wall clock reads `deadline`; false for the
   /// latter. A deadlock's failure prints `reason`. In a simulated thread only.
   bool park(const char* reason, std::optional<Date> deadline = std::nullopt);
   /// Makes a parked thread ready; does nothing to one that is not parked.
   void wake(Thread& thread);
-  [[nodiscard]] static bool isParked(const Thread& thread);
+  /// Wakes this thread after `delay`, unless the result is destroyed before.
+  using WakeUp = std::shared_ptr<void>;
+  [[nodiscard]] WakeUp wakeAfter(Duration delay);
+  [[nodiscard]] static bool isParked(const Thread* thread) { return thread->parkedFor != nullptr; }
   void sleep(Duration duration);
 
  private:
-  // A thread that can go on, or a block that can begin (on a queue or by itself).
-  struct Ready {
-    Thread* thread = nullptr;
-    std::string name;
-    std::shared_ptr<Queue> queue;
-    Block block;
-  };
-
   Thread& next(Thread* idle);
   bool advanceTime();
   void wakeOverdue();
@@ -113,7 +128,6 @@ class Scheduler {
   void handOver(Thread& to) QUARVEL_EXCLUDES(baton_);
   void awaitTurn(Thread& thread) QUARVEL_EXCLUDES(baton_);
   void runFromTest(std::optional<Duration> until);
-  [[nodiscard]] std::string waiting() const;
 
   const std::uint64_t seed_;  // constant after construction
   std::mt19937_64 random_;
@@ -129,9 +143,8 @@ class Scheduler {
   std::unique_ptr<Thread> test_;
   std::vector<std::weak_ptr<Queue>> queues_;
   std::size_t choices_ = 0;
-
+  static inline thread_local Thread* currentThread = nullptr;
   Mutex baton_;
-  std::atomic<std::uint64_t> handOvers_{0};
 };
 
 }  // namespace quarvel

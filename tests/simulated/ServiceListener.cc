@@ -2,19 +2,15 @@
 
 #include <fmt/format.h>
 
-#include <utility>
-
 #include "base/MessagePack.h"
 #include "tests/simulated/Simulation.h"
 
 namespace quarvel {
-
 namespace {
 
 class RecordingReply final : public ReplySink {
  public:
   explicit RecordingReply(std::shared_ptr<RecordedCall> call) : call_(std::move(call)) {}
-
   void result(Value value) override {
     Simulation::current().note(fmt::format("reply {} {}", call_->method, JsonText(value)));
     call_->results.push_back(std::move(value));
@@ -33,8 +29,7 @@ class SimulatedConnection final : public ClientConnection,
   SimulatedConnection(std::int32_t processIdentifier, std::size_t client)
       : processIdentifier_(processIdentifier),
         client_(client),
-        queue_(Simulation::current().scheduler.makeQueue("connection", true)) {}
-
+        queue_(TheScheduler().makeQueue("connection", true)) {}
   [[nodiscard]] std::int32_t processIdentifier() const override { return processIdentifier_; }
   void setExportedInterface(const ExportedInterface& exportedInterface) override {
     interface_ = &exportedInterface;
@@ -54,22 +49,22 @@ class SimulatedConnection final : public ClientConnection,
     return fmt::format("<ClientConnection {}>", processIdentifier_);
   }
 
-  // On the connection's thread. Its first block is the question to the delegate, so calls follow.
-  void perform(Block block) { Simulation::current().scheduler.enqueue(queue_, std::move(block)); }
-
-  void receive(const std::shared_ptr<RecordedCall>& call, const std::string& arguments) {
+  /// Runs `action` on the connection's thread: first the question to the delegate, then calls.
+  void perform(std::function<void(SimulatedConnection&)> action) {
+    TheScheduler().enqueue(queue_, [weak = weak_from_this(), action = std::move(action)] {
+      if (const auto serving = weak.lock()) action(*serving);
+    });
+  }
+  void receive(const std::shared_ptr<RecordedCall>& call) {
     if (object_ == nullptr) return;
     note(Arrival::Kind::call, call);
-    const ExportedMethod* method = interface_->find(call->method);
-    if (method == nullptr) {
-      call->fault = "unknown method " + call->method;
-      return;
-    }
+    std::string encoded;
+    MessagePackWriter(encoded).value(Value(call->arguments));
     std::vector<PayloadValue> values;
-    for (const PayloadValue value : PayloadValue(arguments.data()).items()) values.push_back(value);
-    call->fault = method->invoke(*method, *object_, values, std::make_shared<RecordingReply>(call));
+    for (const PayloadValue value : PayloadValue(encoded.data()).items()) values.push_back(value);
+    const ExportedMethod& method = *interface_->find(call->method);
+    call->fault = method.invoke(method, *object_, values, std::make_shared<RecordingReply>(call));
   }
-
   void end(bool interrupted) {
     const auto interruptionHandler = std::exchange(interruptionHandler_, nullptr);
     const auto invalidationHandler = std::exchange(invalidationHandler_, nullptr);
@@ -79,7 +74,6 @@ class SimulatedConnection final : public ClientConnection,
     object_.reset();
     Simulation::current().listener.drop(*this);
   }
-
   void note(Arrival::Kind kind, std::shared_ptr<const RecordedCall> call = nullptr) const {
     Simulation::current().arrivals.push_back({kind, client_, std::move(call)});
   }
@@ -98,60 +92,43 @@ SimulatedClient::SimulatedClient(const std::shared_ptr<SimulatedConnection>& con
     : connection_(connection) {}
 
 SimulatedClient::Call SimulatedClient::call(std::string method, const List& arguments) {
-  auto call = std::make_shared<RecordedCall>();
-  call->method = std::move(method);
-  call->arguments = arguments;
-  std::string encoded;
-  MessagePackWriter(encoded).value(Value(arguments));
+  const auto call =
+      std::make_shared<RecordedCall>(RecordedCall{std::move(method), arguments, {}, {}});
   if (const auto connection = connection_.lock()) {
-    connection->perform([weak = connection_, call, encoded = std::move(encoded)] {
-      if (const auto serving = weak.lock()) serving->receive(call, encoded);
-    });
+    connection->perform([call](auto& serving) { serving.receive(call); });
   }
   return call;
 }
 
 void SimulatedClient::end(bool interrupted) {
   if (const auto connection = connection_.lock()) {
-    connection->perform([weak = connection_, interrupted] {
-      if (const auto serving = weak.lock()) serving->end(interrupted);
-    });
+    connection->perform([interrupted](auto& serving) { serving.end(interrupted); });
   }
-}
-
-std::weak_ptr<ClientConnection> SimulatedClient::connection() const {
-  return connection_;
 }
 
 SimulatedClient SimulatedListener::connect(std::int32_t processIdentifier) {
   const auto connection = connections_.emplace_back(
       std::make_shared<SimulatedConnection>(processIdentifier, clients_++));
-  connection->perform([this, connection] {
-    connection->note(Arrival::Kind::connection);
-    if (!resumed_ || !delegate_->shouldAcceptNewConnection(*this, connection)) drop(*connection);
+  connection->perform([this](auto& fresh) {
+    fresh.note(Arrival::Kind::connection);
+    if (!resumed_ || !delegate_->shouldAcceptNewConnection(*this, fresh.shared_from_this())) {
+      drop(fresh);
+    }
   });
   return SimulatedClient(connection);
-}
-
-void SimulatedListener::setDelegate(std::shared_ptr<ServiceListenerDelegate> delegate) {
-  delegate_ = std::move(delegate);
-}
-
-void SimulatedListener::resume() {
-  resumed_ = true;
 }
 
 void SimulatedListener::drop(const SimulatedConnection& connection) {
   std::erase_if(connections_, [&](const auto& held) { return held.get() == &connection; });
 }
 
+ServiceListener& ProcessServiceListener() {
+  return Simulation::current().listener;
+}
+
 void SimulatedListener::release() {
   connections_.clear();
   delegate_.reset();
-}
-
-ServiceListener& ProcessServiceListener() {
-  return Simulation::current().listener;
 }
 
 }  // namespace quarvel

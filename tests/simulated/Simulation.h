@@ -2,18 +2,9 @@
 
 #include <gtest/gtest.h>
 
-#include <chrono>
-#include <cstdint>
 #include <initializer_list>
-#include <iterator>
-#include <map>
-#include <optional>
 #include <ostream>
-#include <string>
-#include <string_view>
-#include <vector>
 
-#include "base/Error.h"
 #include "base/Json.h"
 #include "platform/WorkQueue.h"
 #include "tests/simulated/Recorders.h"
@@ -24,14 +15,12 @@ namespace quarvel {
 using namespace std::chrono_literals;  // NOLINT(google-build-using-namespace): durations in tests
 
 // Texts of the project's values in GoogleTest's failures.
-inline void PrintTo(const Value& value, std::ostream* out) {
+template <class T>
+requires requires(const T& value) {
+  JsonText(value);
+}
+void PrintTo(const T& value, std::ostream* out) {
   *out << JsonText(value);
-}
-inline void PrintTo(const Dictionary& dictionary, std::ostream* out) {
-  *out << JsonText(dictionary);
-}
-inline void PrintTo(const Payload& payload, std::ostream* out) {
-  *out << JsonText(payload);
 }
 inline void PrintTo(const Error& error, std::ostream* out) {
   *out << error.description();
@@ -44,18 +33,13 @@ class Seeds {
   /// `QUARVEL_SEED` alone when it is set, to replay a failure; else `QUARVEL_SEEDS` seeds (25 times
   /// as many when `QUARVEL_NIGHTLY` is set), 20 by default.
   Seeds();
-
-  struct Iterator {
-    std::uint64_t seed;
-    std::uint64_t last;
-    std::uint64_t operator*() const { return seed; }
-    void operator++() { ++seed; }
-    bool operator!=(std::default_sentinel_t) const {
-      return seed <= last && !testing::Test::HasFailure();
-    }
-  };
-  [[nodiscard]] Iterator begin() const { return {first_, last_}; }
+  [[nodiscard]] Seeds begin() const { return *this; }
   [[nodiscard]] std::default_sentinel_t end() const { return {}; }
+  std::uint64_t operator*() const { return first_; }
+  void operator++() { ++first_; }
+  bool operator!=(std::default_sentinel_t) const {
+    return first_ <= last_ && !testing::Test::HasFailure();
+  }
   [[nodiscard]] std::uint64_t size() const { return last_ - first_ + 1; }
 
  private:
@@ -65,16 +49,9 @@ class Seeds {
 
 /// Every event that reached the platform, a line each in order of arrival, for asserting an order
 /// across kinds. The recorder of each kind has the details.
-class Journal {
- public:
+struct Journal : std::vector<std::string> {
   /// The lines that begin with one of `prefixes`.
-  [[nodiscard]] std::vector<std::string> lines(
-      std::initializer_list<std::string_view> prefixes) const;
-  void clear() { lines_.clear(); }
-  void note(std::string line) { lines_.push_back(std::move(line)); }
-
- private:
-  std::vector<std::string> lines_;
+  [[nodiscard]] std::vector<std::string> lines(std::initializer_list<std::string_view>) const;
 };
 
 /// The simulated platform: implements every header of `platform/` from its construction to its
@@ -85,46 +62,37 @@ class Journal {
 /// happens between two runs. Every failure names the seed.
 class Simulation {
  public:
-  struct CreatedQueue {
-    std::string label;
-    std::size_t number = 0;
-  };
-
   explicit Simulation(std::uint64_t seed);
   ~Simulation();
   Simulation(const Simulation&) = delete;
   Simulation& operator=(const Simulation&) = delete;
 
   [[nodiscard]] static Simulation& current();
-
   void run() { scheduler.run(); }
   void runFor(Scheduler::Duration duration) { scheduler.runFor(duration); }
   void spawn(std::string name, Block body) { scheduler.spawn(std::move(name), std::move(body)); }
   [[nodiscard]] Scheduler::Duration elapsed() const { return scheduler.elapsed(); }
   /// For recorders: notes a line unless the process is over.
   void note(std::string line) {
-    if (!scheduler.stopped()) journal.note(std::move(line));
+    if (!scheduler.stopped()) journal.push_back(std::move(line));
   }
 
   /// Switch: waits in a `Condition` may end without a signal, at a moment chosen by the seed.
   bool spuriousWakeUps = false;
-  std::vector<CreatedQueue> queues;
-  std::size_t briefBlocks = 0;  // on all queues
-  // Device properties.
-  bool internalBuild = false;
+  std::vector<std::pair<std::string, std::size_t>> queues;  // label and number of each serial one
+  std::size_t briefBlocks = 0;                              // on all queues
+  bool internalBuild = false;                               // device property, as the next
   std::optional<std::int64_t> deviceClass;
-
   Journal journal;
   SimulatedCounters counters;
   std::vector<Arrival> arrivals;
   SimulatedLog log;
   SimulatedRandom random;
-  /// The kernel's process table: command names.
-  std::map<std::int32_t, std::string> processes;
-  SimulatedVistrel vistrel;
-  SimulatedOhmrik ohmrik;
+  std::map<std::int32_t, std::string> processes;  // the process table: command names
+  std::vector<std::pair<std::string, Payload>> analyticsEvents;
+  std::vector<Payload> powerRecords;
   SimulatedAgent agent;
-  SimulatedPreferences preferences;
+  std::map<std::string, Dictionary, std::less<>> preferences;  // domain to entries
   SimulatedNotifications notifications;
   SimulatedTallix tallix;
   SimulatedOrientation orientation;
@@ -136,6 +104,10 @@ class Simulation {
  private:
   const testing::ScopedTrace seedTrace_;
 };
+
+[[nodiscard]] inline Scheduler& TheScheduler() {
+  return Simulation::current().scheduler;
+}
 
 }  // namespace quarvel
 

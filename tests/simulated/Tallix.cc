@@ -6,40 +6,32 @@ namespace quarvel {
 
 /// Indices of the published ones.
 class TallixChannelSet : public std::vector<std::size_t> {};
-
 class TallixSubscription {
  public:
   TallixChannels channels;
 };
-
 class TallixChannelSample {
  public:
   SimulatedTallix::Name name;
   std::int64_t value;
 };
-
 class TallixSampleSet : public std::vector<TallixChannelSample> {};
 
-namespace {
-
-SimulatedTallix& Tallix() {
+static SimulatedTallix& Tallix() {
   return Simulation::current().tallix;
 }
-
-bool Matches(const std::optional<std::string_view>& wanted, const SimulatedTallix::Name& name) {
-  return !wanted || (name && *wanted == *name);
-}
-
-}  // namespace
 
 TallixChannels TallixCopyChannelsInGroup(std::optional<std::string_view> group,
                                          std::optional<std::string_view> subgroup,
                                          std::optional<Error>& error) {
   if (Tallix().channelsError) error = Tallix().channelsError;
+  const auto matches = [](const auto& wanted, const auto& name) {
+    return !wanted || (name && *wanted == *name);
+  };
   std::shared_ptr<TallixChannelSet> found;
   for (std::size_t i = 0; i < Tallix().channels.size(); ++i) {
     const SimulatedTallix::Channel& channel = Tallix().channels[i];
-    if (!Matches(group, channel.group) || !Matches(subgroup, channel.subgroup)) continue;
+    if (!matches(group, channel.group) || !matches(subgroup, channel.subgroup)) continue;
     if (found == nullptr) found = std::make_shared<TallixChannelSet>();
     if (channel.published) found->push_back(i);
   }

@@ -5,17 +5,9 @@
 #include <fmt/format.h>
 
 #include <algorithm>
-#include <cstdint>
 #include <cstdio>
 #include <cstdlib>
-#include <functional>
-#include <map>
-#include <random>
-#include <set>
-#include <string>
-#include <vector>
 
-#include "base/Json.h"
 #include "tests/Statistics/Service/CoreFixtures.h"
 #include "tests/simulation/Model.h"
 
@@ -31,15 +23,12 @@ constexpr std::uint16_t kTypes[] = {1, 2, 99};
 // A name with a separator, and one with a character across its 128th byte.
 const std::string kApplications[] = {"player", "a/b", std::string(127, 'n') + "\u00e9 and more"};
 constexpr Date::duration kSteps[] = {1s, 1min, 24h, 24h * 3650};
+const bool kInternalBuild = std::getenv("QUARVEL_CUSTOMER_BUILD") == nullptr;
 constexpr const char* kSessionQueue = "tarnwick.quarvel.session.relmreporting";
 
 bool Same(const Model::Message& expected, const SimulatedAgent::Message& given) {
   return expected.category == given.category && expected.type == given.type &&
          expected.payload == given.payload.root().toDictionary();
-}
-
-std::string Described(const Model::Session& session, std::size_t run) {
-  return fmt::format("run {} of a session {}", run + 1, session.reporterID);
 }
 
 /// The whole service with random clients, agent faults, file faults and clock steps, all drawn from
@@ -58,8 +47,7 @@ class World {
 
   explicit World(std::uint64_t seed)
       : random_(~seed),
-        service_(seed,
-                 [](Simulation& simulation) { simulation.internalBuild = isInternalBuild(); }),
+        service_(seed, [](Simulation& simulation) { simulation.internalBuild = kInternalBuild; }),
         simulation_(service_) {
     simulation_.deviceClass = oneIn(2) ? 6 : 1;
     simulation_.spuriousWakeUps = oneIn(4);
@@ -82,24 +70,12 @@ class World {
   [[nodiscard]] const Counts& counts() const { return counts_; }
 
  private:
-  /// Whether this process simulates an internal build: yes, unless QUARVEL_CUSTOMER_BUILD is set.
-  [[nodiscard]] static bool isInternalBuild() {
-    return std::getenv("QUARVEL_CUSTOMER_BUILD") == nullptr;
-  }
-
   [[nodiscard]] std::uint64_t draw(std::uint64_t bound) { return random_() % bound; }
   [[nodiscard]] bool oneIn(std::uint64_t chances) { return draw(chances) == 0; }
   void expect(bool holds, const std::string& otherwise) {
     if (!holds) findings_.push_back(otherwise);
   }
-
-  [[nodiscard]] std::int64_t drawReporterID() {
-    return kReporterIDs[draw(std::size(kReporterIDs))];
-  }
-
-  [[nodiscard]] const std::string& drawApplication() {
-    return kApplications[draw(std::size(kApplications))];
-  }
+  [[nodiscard]] const auto& pick(const auto& from) { return from[draw(std::size(from))]; }
 
   [[nodiscard]] Dictionary drawPayload() {
     Dictionary payload = {{"n", ++messages_}};
@@ -111,7 +87,6 @@ class World {
     if (oneIn(8)) payload.set("HostApplicationDisplayID", "another");
     return payload;
   }
-
   void step() {
     if (clients_.empty() || (clients_.size() < 5 && oneIn(4))) {
       const auto pid = static_cast<std::int32_t>(100 + draw(3));
@@ -121,18 +96,17 @@ class World {
     for (std::uint64_t calls = 1 + draw(8); calls > 0; --calls)
       call(clients_[draw(clients_.size())]);
     if (oneIn(8)) {
-      const auto leaving = clients_.begin() + static_cast<std::ptrdiff_t>(draw(clients_.size()));
-      leaving->end(oneIn(2));
-      gone_.push_back(std::move(*leaving));
-      clients_.erase(leaving);
+      std::swap(clients_[draw(clients_.size())], clients_.back());
+      clients_.back().end(oneIn(2));
+      gone_.push_back(std::move(clients_.back()));
+      clients_.pop_back();
     }
     if (oneIn(3)) injectFault();
     // Often too short to finish the pending work.
     simulation_.runFor(oneIn(3) ? Scheduler::Duration(1s * draw(15)) : Scheduler::Duration(0));
   }
-
   void call(Client& client) {
-    const std::int64_t id = drawReporterID();
+    const std::int64_t id = pick(kReporterIDs);
     ++counts_.calls;
     const std::function<void()> calls[] = {
         [&] { client.create(id); },
@@ -140,9 +114,9 @@ class World {
         [&] { client.createStarted(id); },
         [&] { client.start(id); },
         [&] { client.start(id); },
-        [&] { client.setServiceType(kServiceTypes[draw(std::size(kServiceTypes))], id); },
+        [&] { client.setServiceType(pick(kServiceTypes), id); },
         [&] {
-          client.configure(oneIn(2) ? Dictionary{{"HostApplicationDisplayID", drawApplication()}}
+          client.configure(oneIn(2) ? Dictionary{{"HostApplicationDisplayID", pick(kApplications)}}
                                     : Dictionary{{"key", fmt::format("value {}", draw(3))}},
                            id);
         },
@@ -157,21 +131,19 @@ class World {
     const std::uint64_t drawn = draw(16);
     drawn < std::size(calls) ? calls[drawn]() : sendMessage(client);
   }
-
   void sendMessage(Client& client) {
     std::optional<List> reporterIDs;
     if (!oneIn(3)) {
       reporterIDs.emplace();
       for (std::uint64_t count = draw(4); count > 0; --count) {
-        reporterIDs->emplace_back(drawReporterID());
+        reporterIDs->emplace_back(pick(kReporterIDs));
       }
     }
-    const std::uint32_t category = kCategories[draw(std::size(kCategories))];
+    const std::uint32_t category = pick(kCategories);
     // The codes of a summary, whose number such a message continues.
-    const std::uint16_t type = category == 0xffff'ffff ? 0xffff : kTypes[draw(std::size(kTypes))];
+    const std::uint16_t type = category == 0xffff'ffff ? 0xffff : pick(kTypes);
     client.send(drawPayload(), category, type, std::move(reporterIDs));
   }
-
   void injectFault() {
     const Error error{"tarnwick.test", 28, {}};
     const auto perhaps = [&] { return oneIn(3) ? std::optional(error) : std::nullopt; };
@@ -192,33 +164,28 @@ class World {
           simulation_.files.directoryError = perhaps();
         },
         [&] {
-          const Date::duration step = kSteps[draw(std::size(kSteps))];
+          const Date::duration step = pick(kSteps);
           simulation_.scheduler.setWallClock(simulation_.scheduler.wallClock() +
                                              (oneIn(2) ? step : -step));
           clockSteps_ = true;
         },
         [&] { changePreferences(); },
     };
-    faults[draw(std::size(faults))]();
+    pick(faults)();
   }
 
   /// Makes one change at a time, so that the model knows the content at each notification.
   void changePreferences() {
-    if (simulation_.log
-            .texts("default zqrs -[ZQReportingServiceDelegate "
-                   "listenForDefaultsNotification]: re-reading")
-            .size() != notifications_) {
-      return;
-    }
+    constexpr const char* kRead =
+        "default zqrs -[ZQReportingServiceDelegate listenForDefaultsNotification]: re-reading";
+    if (simulation_.log.texts(kRead).size() != model_.preferences.size()) return;
     Dictionary preferences;
     if (oneIn(2)) preferences.set("device_name", fmt::format("device {}", draw(3)));
     if (oneIn(2)) preferences.set("disable_reporting", oneIn(2));
     model_.preferences.push_back(preferences);
     simulation_.preferences["tarnwick.quarvel"] = std::move(preferences);
     simulation_.notifications.post("tarnwick.quarvel.reporting");
-    ++notifications_;
   }
-
   void compare() {
     for (const Arrival& arrival : simulation_.arrivals) model_.execute(arrival);
     // The orientation facility keeps a session that is replaced while it is started.
@@ -230,7 +197,6 @@ class World {
     compareHistories();
     compareCounters();
   }
-
   void compareReplies() {
     for (const auto& [call, expected] : model_.answers) {
       const std::vector<Value>& given = call->results;
@@ -245,8 +211,8 @@ class World {
   /// The queue of an agent session identifies the reporting session that made it.
   void compareAgentSessions() {
     std::vector<std::size_t> queues;
-    for (const auto& queue : simulation_.queues) {
-      if (queue.label == kSessionQueue) queues.push_back(queue.number);
+    for (const auto& [label, number] : simulation_.queues) {
+      if (label == kSessionQueue) queues.push_back(number);
     }
     expect(
         queues.size() == model_.sessions.size(),
@@ -260,11 +226,17 @@ class World {
     }
     for (std::size_t i = 0; i < std::min(queues.size(), model_.sessions.size()); ++i) {
       const Model::Session& session = model_.sessions[i];
-      session.ambiguous ? compareAmbiguous(session, made[queues[i]])
-                        : compareRuns(session, made[queues[i]]);
+      if (!session.ambiguous) {
+        compareRuns(session, made[queues[i]]);
+        continue;
+      }
+      std::size_t dropped = 0;
+      for (const Model::Run& run : session.runs) dropped += run.messages.size();
+      for (const auto* given : made[queues[i]]) dropped -= given->offered.size();
+      counts_.dropped += dropped;
+      counts_.droppedAmbiguously += dropped;
     }
   }
-
   void compareRuns(const Model::Session& session,
                    const std::vector<const SimulatedAgent::Session*>& made) {
     auto next = made.begin();
@@ -275,12 +247,24 @@ class World {
         counts_.droppedForType += run.messages.size();
         continue;
       }
-      const std::string which = Described(session, i);
+      const std::string which = fmt::format("run {} of a session {}", i + 1, session.reporterID);
       if (next == made.end()) return expect(false, which + " got no agent session");
       const SimulatedAgent::Session& given = **next++;
-      compareAnnouncement(which, session, run, given);
+      const Value* token = given.info.find("HierarchyToken");
+      expect(given.info == Dictionary{{"ClientType", 19},
+                                      {"ClientVersion", 2.0},
+                                      {"SessionID", session.reporterID},
+                                      {"BatchEvent", true},
+                                      {"HierarchyToken", token == nullptr ? Value() : *token}},
+             which + " was announced as " + JsonText(given.info));
+      const bool known = std::ranges::any_of(run.userInfos, [&](const Dictionary& userInfo) {
+        Dictionary all = {{"ClientName", "tarnwick.quarvel"}, {"ServiceName", run.serviceName}};
+        all.merge(userInfo);
+        return given.userInfo == all;
+      });
+      expect(known, which + " has the user information " + JsonText(given.userInfo));
       // Kept when the backends were found within 9 s, which is uncertain while clocks step.
-      const bool kept = !given.offered.empty() || !given.flushes.empty();
+      const bool kept = !given.offered.empty() || given.flushes > 0;
       const bool certain = !clockSteps_ && given.foundAfter != 9s && !simulation_.spuriousWakeUps;
       const bool found = given.foundAfter && (!certain || *given.foundAfter < 9s);
       expect(found || !kept, which + " was reported without backends");
@@ -289,8 +273,8 @@ class World {
         continue;
       }
       const std::size_t flushes = found && run.stopped ? 1 : 0;
-      expect(given.flushes.size() == flushes, fmt::format("{} was flushed {} times instead of {}",
-                                                          which, given.flushes.size(), flushes));
+      expect(given.flushes == flushes,
+             fmt::format("{} was flushed {} times instead of {}", which, given.flushes, flushes));
       if (!found) {
         counts_.dropped += run.messages.size();
         continue;
@@ -302,62 +286,18 @@ class World {
     expect(next == made.end(), "an agent session belongs to no run");
   }
 
-  void compareAnnouncement(const std::string& which, const Model::Session& session,
-                           const Model::Run& run, const SimulatedAgent::Session& given) {
-    const Value* token = given.info.find("HierarchyToken");
-    expect(given.info == Dictionary{{"ClientType", 19},
-                                    {"ClientVersion", 2.0},
-                                    {"SessionID", session.reporterID},
-                                    {"BatchEvent", true},
-                                    {"HierarchyToken", token == nullptr ? Value() : *token}},
-           which + " was announced as " + JsonText(given.info));
-    const bool known = std::ranges::any_of(run.userInfos, [&](const Dictionary& userInfo) {
-      Dictionary expected = {{"ClientName", "tarnwick.quarvel"}, {"ServiceName", run.serviceName}};
-      expected.merge(userInfo);
-      return given.userInfo == expected;
-    });
-    expect(known, which + " has the user information " + JsonText(given.userInfo));
-  }
-
-  void compareAmbiguous(const Model::Session& session,
-                        const std::vector<const SimulatedAgent::Session*>& made) {
-    std::vector<const Model::Message*> sent;
-    for (const Model::Run& run : session.runs) {
-      for (const Model::Message& message : run.messages) sent.push_back(&message);
-    }
-    std::size_t dropped = sent.size();
-    auto next = sent.begin();
-    for (const SimulatedAgent::Session* given : made) {
-      expect(given->flushes.size() <= 1, "an agent session was flushed twice");
-      dropped -= given->offered.size();
-      for (const SimulatedAgent::Message& message : given->offered) {
-        next =
-            std::find_if(next, sent.end(), [&](const auto* each) { return Same(*each, message); });
-        if (next == sent.end()) return expect(false, "a message came out of order, or twice");
-        ++next;
-      }
-    }
-    counts_.dropped += dropped;
-    counts_.droppedAmbiguously += dropped;
-  }
-
   /// One message to several sessions becomes several single messages that differ in the service
   /// name alone: a name that one of these sessions has had since.
   void compareSingleMessages() {
     const auto number = [](const Dictionary& payload) { return *payload.find("n")->integer(); };
     std::multimap<std::int64_t, const SimulatedAgent::SingleMessage*> given;
-    for (const auto* each :
-         {&simulation_.agent.singleMessages, &simulation_.agent.refusedSingleMessages}) {
-      for (const auto& single : *each) {
-        given.emplace(number(single.message.payload.root().toDictionary()), &single);
-      }
+    for (const auto& single : simulation_.agent.singleMessages) {
+      given.emplace(number(single.message.payload.root().toDictionary()), &single);
+      ++(single.refused ? counts_.refused : counts_.handedOver);
     }
-    counts_.handedOver += simulation_.agent.singleMessages.size();
-    counts_.refused += simulation_.agent.refusedSingleMessages.size();
     std::map<std::int64_t, std::set<std::string>> names;
     for (const Model::SingleMessage& sent : model_.singleMessages) {
-      names[number(sent.message.payload)].insert(sent.serviceNames.begin(),
-                                                 sent.serviceNames.end());
+      names[number(sent.message.payload)].merge(std::set(sent.serviceNames));
     }
     const Dictionary info = {{"ClientType", 19}, {"ClientVersion", 2.0}, {"SessionID", -1}};
     for (const Model::SingleMessage& sent : model_.singleMessages) {
@@ -367,10 +307,10 @@ class World {
         continue;
       }
       const SimulatedAgent::SingleMessage& single = *found->second;
-      const bool named = std::ranges::any_of(names[found->first], [&](const std::string& name) {
-        return single.userInfo ==
-               Dictionary{{"ClientName", "tarnwick.quarvel"}, {"ServiceName", name}};
-      });
+      const Value* name = single.userInfo.find("ServiceName");
+      const bool named =
+          name != nullptr && names[found->first].contains(*name->string()) &&
+          single.userInfo == Dictionary{{"ClientName", "tarnwick.quarvel"}, {"ServiceName", *name}};
       expect(Same(sent.message, single.message) && named && single.info == info,
              "a single message is not as it was sent: " + JsonText(sent.message.payload) +
                  JsonText(single.info) + JsonText(single.userInfo));
@@ -378,11 +318,10 @@ class World {
     }
     expect(given.empty(), fmt::format("{} single messages too many", given.size()));
   }
-
   void compareSinks() {
     std::vector<std::pair<std::string, Dictionary>> given;
     std::size_t uptimes = 0;
-    for (const auto& [name, payload] : simulation_.vistrel.events) {
+    for (const auto& [name, payload] : simulation_.analyticsEvents) {
       if (name == "tarnwick.quarvel.zqreportingclientuptime") {
         ++uptimes;
       } else {
@@ -393,16 +332,13 @@ class World {
            fmt::format("{} analytics events, not the {} expected ones in order", given.size(),
                        model_.events.size()));
     expect(uptimes <= model_.endedClients, "a client's time was reported twice");
-    std::vector<Dictionary> records;
-    for (const auto& record : simulation_.ohmrik.records) {
-      records.push_back(record.root().toDictionary());
-    }
-    expect(records == model_.powerRecords, "the power log has other records");
+    expect(std::ranges::equal(simulation_.powerRecords, model_.powerRecords, {},
+                              [](const auto& record) { return record.root().toDictionary(); }),
+           "the power log has other records");
   }
-
   void compareHistories() {
     const auto& written = simulation_.files.writes;
-    if (!isInternalBuild()) return expect(written.empty(), "a history was written");
+    if (!kInternalBuild) return expect(written.empty(), "a history was written");
     expect(written.size() == model_.histories.size(),
            fmt::format("{} histories instead of {}", written.size(), model_.histories.size()));
     for (std::size_t i = 0; i < std::min(written.size(), model_.histories.size()); ++i) {
@@ -438,19 +374,17 @@ class World {
                forType <= counts_.droppedForType + counts_.droppedAmbiguously,
            "dropped messages are miscounted");
     for (const Client& client : gone_) {
-      expect(client.connection().expired(), "a connection is kept after its end");
+      expect(client.isReleased(), "a connection is kept after its end");
     }
     expect(counters.gauges == std::array<std::int64_t, 3>{},
            "released clients or sessions are still counted");
   }
-
   std::mt19937_64 random_;
   RunningService service_;
   Simulation& simulation_;
   std::vector<Client> clients_;
   std::vector<Client> gone_;
   Model model_;
-  std::size_t notifications_ = 0;
   std::int64_t messages_ = 0;
   bool clockSteps_ = false;
   Counts counts_;

@@ -1,11 +1,6 @@
 #pragma once
 
 #include <functional>
-#include <memory>
-#include <optional>
-#include <string>
-#include <utility>
-#include <vector>
 
 #include "Statistics/Service/ZQReportingServiceDelegate.h"
 #include "Statistics/Service/ZQReportingSession.h"
@@ -17,7 +12,6 @@ namespace quarvel {
 class Client : public SimulatedClient {
  public:
   explicit Client(SimulatedClient client) : SimulatedClient(std::move(client)) {}
-
   Call create(ReporterID id) { return call("createReportingSession:reply:", {id}); }
   Call setServiceType(std::uint16_t type, ReporterID id) {
     return call("setServiceType:reportingSession:reply:", {type, id});
@@ -37,7 +31,6 @@ class Client : public SimulatedClient {
   Call destroy(ReporterID id) { return call("destroyReportingSession:reply:", {id}); }
   Call valid(ReporterID id) { return call("reporterID:valid:", {id}); }
   Call reporters() { return call("getAllReporters:", {}); }
-
   void createStarted(ReporterID id) {
     create(id);
     start(id);
@@ -51,10 +44,8 @@ struct RunningService : Simulation {
       std::uint64_t seed, const std::function<void(Simulation&)>& prepare = [](Simulation&) {})
       : Simulation(seed) {
     prepare(*this);
-    ProcessServiceListener().setDelegate(ZQReportingServiceDelegate::create());
-    ProcessServiceListener().resume();
+    EXPECT_EQ(ServiceMain(), 0);
   }
-
   /// Connects a client and runs until it is registered, so that clients are registered in this
   /// order.
   [[nodiscard]] Client connect(std::int32_t pid) {
@@ -71,7 +62,6 @@ struct SessionOwner : Simulation {
     setServiceType(serviceType);
   }
   static void holdServerQueue() QUARVEL_ASSERT_CAPABILITY(serverQueueRole) {}
-
   void setServiceType(std::uint16_t serviceType) {
     holdServerQueue();
     session->setServiceType(serviceType);

@@ -13,12 +13,12 @@ using testing::Contains;
 using testing::ElementsAre;
 using testing::IsEmpty;
 using testing::StartsWith;
-using testing::UnorderedElementsAreArray;
-using Lines = std::vector<std::string>;
+using testing::UnorderedElementsAre;
 
 const Value kYes(true);
 const std::string kDelegate = "-[ZQReportingServiceDelegate ";
 const std::string kInstance = "-[ZQReportingServerInstance ";
+const char* const kListener = "listener:shouldAcceptNewConnection:]: ";
 
 TEST(ServerInstance, OperationsLogTraceAndReplyInOrder) {
   // Each call, then its journal. "+" stands for the operation's own log lines.
@@ -123,28 +123,24 @@ TEST(Drivers, AStopReportsTheRiseOfTheCountersSinceTheStart) {
     Client client = service.connect(42);
     client.createStarted(7);
     service.run();
-    auto& channels = service.tallix.channels;
-    const std::int64_t values[] = {11, 9, 17, 13, 99};
-    for (std::size_t i = 0; i < channels.size(); ++i) channels[i].value = values[i];
+    for (std::size_t i = 0; i < 5; ++i) {
+      service.tallix.channels[i].value = std::array{11, 9, 17, 13, 99}[i];
+    }
     client.stop(7);
     service.run();
     const auto& messages = service.agent.sessions.at(0).messages;
     ASSERT_EQ(messages.size(), 2U);  // and the summary
     EXPECT_EQ(messages[0].category, 9);
     EXPECT_EQ(messages[0].type, 0);
-    EXPECT_EQ(messages[0].payload.root().toDictionary(),
-              (Dictionary{{"VorrenMXDrv_a", 1}, {"MCA_c", 7}, {"Haptics_Stats_", 3}}));
-    EXPECT_THAT(service.log.texts("default zqrs"),
-                Contains("default zqrs " + kInstance +
-                         "stopReportingSessionForID:reply:]: fetching driver logs "
-                         "{\"VorrenMXDrv_a\":1,\"MCA_c\":7,\"Haptics_Stats_\":3}"));
+    const std::string rise = R"({"VorrenMXDrv_a":1,"MCA_c":7,"Haptics_Stats_":3})";
+    EXPECT_EQ(JsonText(messages[0].payload), rise);
+    EXPECT_THAT(service.log.messages(), Contains("fetching driver logs " + rise));
     // The first stop dropped the snapshot; without one the counters themselves are reported.
     client.stop(7);
     service.run();
     ASSERT_EQ(service.agent.singleMessages.size(), 1U);
-    EXPECT_EQ(service.agent.singleMessages[0].message.payload.root().toDictionary(),
-              (Dictionary{
-                  {"VorrenMXDrv_a", 11}, {"Speaker_b", 9}, {"MCA_c", 17}, {"Haptics_Stats_", 13}}));
+    EXPECT_EQ(JsonText(service.agent.singleMessages[0].message.payload),
+              R"({"VorrenMXDrv_a":11,"Speaker_b":9,"MCA_c":17,"Haptics_Stats_":13})");
   }
 }
 
@@ -161,9 +157,7 @@ TEST(Drivers, FailuresAreLoggedAndLeaveCountersOut) {
   simulation.tallix.samplesError.reset();
   EXPECT_EQ(drivers.getDriverStatisticsRelativeToSnapShot(snapShot),
             (Dictionary{{"Speaker_b", 10}}));
-  Lines lines;
-  for (const LogLine& line : simulation.log.lines) lines.push_back(line.message);
-  EXPECT_THAT(lines,
+  EXPECT_THAT(simulation.log.messages(),
               ElementsAre("creating tallixing driver utility",
                           "error 5 getting channels for driver VorrenMXDrv-(null)",
                           "error 5 getting channels for driver Speaker-(null)",
@@ -247,10 +241,9 @@ TEST(Preferences, AForeignNotificationAndAFailedRegistrationChangeNothing) {
   const auto created = service.connect(42).create(7);
   service.run();
   EXPECT_THAT(created->results, ElementsAre(kYes));
-
   RunningService listening(1);
   listening.log.lines.clear();
-  listening.notifications.deliverForeign("tarnwick.quarvel.reporting");
+  listening.notifications.post("tarnwick.quarvel.reporting", 1);
   listening.run();
   EXPECT_THAT(listening.log.texts(), IsEmpty());
 }
@@ -260,33 +253,23 @@ TEST(ClientUptime, IsReportedOnceWhenAClientEnds) {
     std::int32_t pid;
     bool interrupted;
     std::chrono::seconds clockStep;
-    std::optional<double> seconds;
-    Lines lines;
+    double seconds;  // 0: no event, since the process has no name
+    std::string line;
+    std::string nextLine;
   };
+  const std::string invalidated = "InvalidationHandler: connection exited process=";
+  // Only the line truncates the fraction of the seconds.
   const Case kCases[] = {
-      {42,
-       true,
-       0s,
-       12.75,  // only the line truncates the fraction
-       {"InterruptionHandler: connection exited",
-        "InvalidationHandler: connection exited process=player uptime_sec=12"}},
-      {42,
-       false,
-       -60s,
-       47.25,
-       {"clientStartDate is in the past. clientpid=42 clientprocessname=player",
-        "InvalidationHandler: connection exited process=player uptime_sec=47"}},
-      {-1,  // has no name
-       false,
-       0s,
-       std::nullopt,
-       {"InvalidationHandler: connection exited process=(null) uptime_sec=12",
-        "clientProcessName is nil. clientpid=-1"}},
+      {42, true, 0s, 12.75, invalidated + "player uptime_sec=12",
+       "InterruptionHandler: connection exited"},
+      {42, false, -60s, 47.25, invalidated + "player uptime_sec=47",
+       "clientStartDate is in the past. clientpid=42 clientprocessname=player"},
+      {-1, false, 0s, 0, invalidated + "(null) uptime_sec=12",
+       "clientProcessName is nil. clientpid=-1"},
   };
-  const std::string function = "listener:shouldAcceptNewConnection:]: ";
   for (const Case& each : kCases) {
     for (const auto seed : Seeds()) {
-      SCOPED_TRACE(each.lines.back());
+      SCOPED_TRACE(each.nextLine);
       RunningService service(seed);
       service.processes[42] = "player";
       Client client = service.connect(each.pid);
@@ -298,20 +281,19 @@ TEST(ClientUptime, IsReportedOnceWhenAClientEnds) {
       service.log.lines.clear();
       client.end(each.interrupted);
       service.run();
-      Lines expected = {
-          fmt::format("{}handleConnectionError]: removing {} from the server client list",
-                      kInstance, each.pid),
-          fmt::format("{}dealloc]: dealloc {} from the server client list", kInstance, each.pid)};
-      for (const std::string& line : each.lines) expected.push_back(kDelegate + function + line);
-      for (std::string& line : expected) line.insert(0, "default zqrs ");
-      EXPECT_THAT(service.log.texts(), UnorderedElementsAreArray(expected));
-      const auto& events = service.vistrel.events;
-      ASSERT_EQ(events.size(), each.seconds ? 1U : 0U);
-      if (each.seconds) {
-        EXPECT_EQ(events[0].first, "tarnwick.quarvel.zqreportingclientuptime");
-        EXPECT_EQ(events[0].second.root().toDictionary(),
-                  (Dictionary{{"processName", "player"}, {"seconds", *each.seconds}}));
-      }
+      const std::string pid = fmt::format("{} from the server client list", each.pid);
+      const std::string instance = "default zqrs " + kInstance;
+      const std::string delegate = "default zqrs " + kDelegate + kListener;
+      EXPECT_THAT(service.log.texts(),
+                  UnorderedElementsAre(delegate + each.line, delegate + each.nextLine,
+                                       instance + "handleConnectionError]: removing " + pid,
+                                       instance + "dealloc]: dealloc " + pid));
+      ASSERT_EQ(service.analyticsEvents.size(), each.seconds > 0 ? 1U : 0U);
+      if (each.seconds == 0) continue;
+      const auto& [name, payload] = service.analyticsEvents[0];
+      EXPECT_EQ(name, "tarnwick.quarvel.zqreportingclientuptime");
+      EXPECT_EQ(payload.root().toDictionary(),
+                (Dictionary{{"processName", "player"}, {"seconds", each.seconds}}));
     }
   }
 }
@@ -322,16 +304,14 @@ SEEDED_TEST(ClientUptime, IsUnknownForAClientThatEndsBeforeItsRegistration, Runn
   Client client(listener.connect(42));
   client.end();
   run();
-  const std::string function =
-      "default zqrs " + kDelegate + "listener:shouldAcceptNewConnection:]: ";
-  const auto lines = log.texts(function);
-  EXPECT_THAT(lines, ElementsAre(StartsWith(function + "newConnection: "),
-                                 function + "clientStartDate is nil. clientpid=42 "
-                                            "clientprocessname=unknown",
-                                 function + "InvalidationHandler: connection exited process=(null) "
-                                            "uptime_sec=-1",
-                                 function + "clientProcessName is nil. clientpid=42"));
-  EXPECT_THAT(vistrel.events, IsEmpty());
+  const std::string function = "default zqrs " + kDelegate + kListener;
+  EXPECT_THAT(
+      log.texts(function),
+      ElementsAre(StartsWith(function + "newConnection: "),
+                  function + "clientStartDate is nil. clientpid=42 clientprocessname=unknown",
+                  function + "InvalidationHandler: connection exited process=(null) uptime_sec=-1",
+                  function + "clientProcessName is nil. clientpid=42"));
+  EXPECT_THAT(analyticsEvents, IsEmpty());
 }
 
 }  // namespace

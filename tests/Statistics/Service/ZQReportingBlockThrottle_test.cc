@@ -3,8 +3,6 @@
 #include <gmock/gmock.h>
 
 #include <cmath>
-#include <cstdint>
-#include <map>
 
 #include "tests/simulated/Simulation.h"
 
@@ -30,16 +28,12 @@ Payload Delayed(Value seconds) {
 /// A throttle whose blocks record their times.
 struct Throttled : Simulation {
   using Simulation::Simulation;
-
   /// Adds a message whose block is called `name`; from a simulated thread or the test.
   void add(std::string name, const Payload& message = Payload()) {
     const auto token = std::make_shared<int>();
     blocks[name] = token;
-    throttle->addMessageBlock(
-        [this, name, token] {
-          ran.push_back({name, elapsed()});
-        },
-        7, message, 3, 1);
+    throttle->addMessageBlock([this, name, token] { ran.emplace_back(name, elapsed()); }, 7,
+                              message, 3, 1);
   }
   /// Adds it at `time`, from a thread of its own.
   void addAt(Scheduler::Duration time, const std::string& name,
@@ -61,8 +55,16 @@ struct Throttled : Simulation {
     return kPause + Scheduler::Duration(scheduler.choose(300'000));
   }
 
-  using Run = std::pair<std::string, Scheduler::Duration>;
+  /// Starts a thread that waits for completion; `completedAt` is then the time of its return.
+  void awaitCompletion() {
+    spawn("waiter", [this] {
+      throttle->waitForCompletion();
+      completedAt = elapsed();
+    });
+  }
 
+  using Run = std::pair<std::string, Scheduler::Duration>;
+  std::optional<Scheduler::Duration> completedAt;
   std::vector<Run> ran;
   std::map<std::string, std::weak_ptr<int>> blocks;
   std::shared_ptr<ZQReportingBlockThrottle> throttle = ZQReportingBlockThrottle::init();
@@ -99,12 +101,11 @@ TEST(MessageKey, HasSortedKeysAndTheTextsOfComparedValues) {
 }
 
 TEST(SleepTime, IsThePayloadsNumberBelowFiveSeconds) {
-  struct Row {
+  const struct {
     Value asked;
     double seconds;
     const char* rejected;
-  };
-  const Row rows[] = {
+  } kRows[] = {
       {4.9, 4.900000095367432, ""},  // single precision
       {-1, -1.0, ""},
       {true, 1.0, ""},
@@ -113,34 +114,30 @@ TEST(SleepTime, IsThePayloadsNumberBelowFiveSeconds) {
       {"2", 0.5, "non XoNumber value of throttle time. {time=2}"},
       {nullptr, 0.5, "non XoNumber value of throttle time. {time=(null)}"},
   };
-  for (const Row& row : rows) {
+  const std::string line = "info zqrr +[ZQReportingBlockThrottle determineSleepTime:]: Rejecting ";
+  for (const auto& [asked, seconds, rejected] : kRows) {
     Simulation simulation(1);
-    EXPECT_EQ(ZQReportingBlockThrottle::determineSleepTime(Delayed(row.asked)), row.seconds);
-    std::string line = "info zqrr +[ZQReportingBlockThrottle determineSleepTime:]: Rejecting ";
-    line += row.rejected;
+    EXPECT_EQ(ZQReportingBlockThrottle::determineSleepTime(Delayed(asked)), seconds);
     EXPECT_THAT(simulation.log.texts(),
-                ElementsAreArray(std::vector(*row.rejected == '\0' ? 0 : 1, line)));
+                ElementsAreArray(std::vector(*rejected == '\0' ? 0 : 1, line + rejected)));
   }
 }
 
 // A delay is exact unless it ends before the idle worker's next look.
 TEST(BlockThrottle, RunsAMessageAtTheEndOfItsDelay) {
-  struct Row {
-    Value asked;
-    Scheduler::Duration delay;
-  };
-  const Row rows[] = {{2, 2s}, {0.03, 30ms}, {std::nan(""), 0s}, {-1e300, 0s}, {6, 500ms}};
+  const std::pair<double, Scheduler::Duration> kRows[] = {
+      {2, 2s}, {0.03, 30ms}, {std::nan(""), 0s}, {-1e300, 0s}, {6, 500ms}};
   for (const auto seed : Seeds()) {
-    for (const Row& row : rows) {
+    for (const auto& [asked, delay] : kRows) {
       Throttled throttled(seed);
       const auto added = throttled.anyMoment();
       throttled.runUntil(added);
-      throttled.add("a", Delayed(row.asked));
-      if (row.delay > 0s) throttled.runUntil(added + row.delay - kInstant);
+      throttled.add("a", Delayed(asked));
+      if (delay > 0s) throttled.runUntil(added + delay - kInstant);
       EXPECT_THAT(throttled.ran, IsEmpty());
       EXPECT_THAT(throttled.throttle->timersInFlight(), SizeIs(1));
-      throttled.runUntil(added + std::max<Scheduler::Duration>(row.delay, kPause));
-      EXPECT_THAT(throttled.names(), ElementsAre("a")) << row.delay.count();
+      throttled.runUntil(added + std::max<Scheduler::Duration>(delay, kPause));
+      EXPECT_THAT(throttled.names(), ElementsAre("a")) << delay.count();
       EXPECT_FALSE(throttled.isAlive("a"));
       EXPECT_THAT(throttled.throttle->timersInFlight(), IsEmpty());
       throttled.runFor(20s);
@@ -162,7 +159,6 @@ SEEDED_TEST(BlockThrottle, ABurstRunsItsLastMessageOnceOneDelayLater, Throttled)
   EXPECT_THAT(throttle->timersInFlight(), SizeIs(1));
   runFor(kInstant);
   EXPECT_THAT(ran, ElementsAre(Throttled::Run("5", last + 500ms)));
-
   // After the burst an equal message is a new one.
   add("6");
   runFor(500ms);
@@ -198,29 +194,16 @@ SEEDED_TEST(BlockThrottle, ABlockMayAddItsMessageAgainAndMayBeEmpty, Throttled) 
   EXPECT_THAT(names(), ElementsAre("again"));
 }
 
-/// A thread that waits for completion from now on.
-struct Completion {
-  explicit Completion(Throttled& throttled) {
-    throttled.spawn("waiter", [this, &throttled] {
-      throttled.throttle->waitForCompletion();
-      over = throttled.elapsed();
-    });
-  }
-  std::optional<Scheduler::Duration> over;
-};
-
 TEST(WaitForCompletion, ReturnsAtItsFirstLookThatFindsNothingPending) {
-  struct Row {
-    std::optional<double> delay;  // none: nothing pending
-    Scheduler::Duration over;
-  };
+  // The delay of the pending message (0: none is pending), and the time of the return.
+  const std::pair<double, Scheduler::Duration> kRows[] = {{0, 0s}, {0.7, 1s}, {4.75, 5s}};
   for (const auto seed : Seeds()) {
-    for (const Row& row : {Row{std::nullopt, 0s}, Row{0.7, 1s}, Row{4.75, 5s}}) {
+    for (const auto& [delay, completedAt] : kRows) {
       Throttled throttled(seed);
-      if (row.delay) throttled.add("a", Delayed(*row.delay));
-      const Completion completion(throttled);
+      if (delay > 0) throttled.add("a", Delayed(delay));
+      throttled.awaitCompletion();
       throttled.runUntil(10s);
-      EXPECT_EQ(completion.over, row.over);
+      EXPECT_EQ(throttled.completedAt, completedAt);
       EXPECT_THAT(throttled.log.texts("default"), IsEmpty());
     }
   }
@@ -232,19 +215,16 @@ SEEDED_TEST(WaitForCompletion, TimesOutAfterFiveSecondsAndKeepsPendingMessages, 
   runUntil(50ms);
   add("unscheduled", Payload(Dictionary{{"a", 1}}));
   addAt(3s, "b", Delayed(4));
-  const Completion completion(*this);
+  awaitCompletion();
   runUntil(5050ms - kInstant);
-  EXPECT_EQ(completion.over, std::nullopt);
+  EXPECT_EQ(completedAt, std::nullopt);
   runUntil(7s - kInstant);
-  EXPECT_EQ(completion.over, 5050ms);
+  EXPECT_EQ(completedAt, 5050ms);
   EXPECT_THAT(ran, IsEmpty());
   runUntil(7150ms);
   EXPECT_THAT(names(), ElementsAre("b", "unscheduled"));
-
-  std::vector<std::string> said;
-  for (const LogLine& line : log.lines) said.push_back(line.message);
   EXPECT_THAT(
-      said,
+      log.messages(),
       ElementsAre("calling workingRunLoop run from inside thread block",
                   "waitForCompletion. timersInFlight=2 unscheduledTimerKeys=1",
                   "Waiting up to 5 seconds for blockThrottle queue to be empty.",
