@@ -25,20 +25,15 @@ constexpr auto kNever = 1h;
 /// A worker thread, until its body has ended.
 class Worker {
  public:
-  explicit Worker(Block body) {
-    auto thread =
-        CreateWorkerThread("tarnwick.test.worker", [this, body = std::move(body)]() mutable {
-          body();
-          ended_.arrive();
-        });
-    thread->start();
-    // The handle goes; the thread runs on.
+  explicit Worker(Block body) : body_(std::move(body)) {
+    CreateWorkerThread("tarnwick.test.worker", [this] { body_(), ended_.arrive(); })->start();
   }
   ~Worker() { ended_.wait(); }
   Worker(const Worker&) = delete;
   Worker& operator=(const Worker&) = delete;
 
  private:
+  Block body_;
   Gate ended_;
 };
 
@@ -49,45 +44,41 @@ std::shared_ptr<RunLoopTimer> AddTimer(std::chrono::microseconds interval, Block
 }
 
 TEST(RunLoop, FiresTimersInTheOrderOfTheirDatesAndReturnsWhenNoneIsLeft) {
-  std::vector<std::string> fired;
-  const auto early = CreateRunLoopTimer(-1s, [&] { fired.push_back("overdue"); });
-  {
-    const Worker worker([&] {
-      const auto begun = Clock::now();
-      const auto note = [&fired, begun](const char* name, std::chrono::milliseconds date) {
-        return [&fired, begun, name, date] {
-          fired.push_back(name);
-          EXPECT_GE(Clock::now() - begun, date);
-        };
+  const Worker worker([] {
+    std::vector<std::string> fired;
+    const auto early = CreateRunLoopTimer(-1s, [&] { fired.push_back("overdue"); });
+    const auto begun = Clock::now();
+    const auto note = [&fired, begun](const char* name, std::chrono::milliseconds date) {
+      return [&fired, begun, name, date] {
+        fired.push_back(name);
+        EXPECT_GE(Clock::now() - begun, date);
       };
-      AddTimer(150ms, note("150", 150ms));
-      const auto moved = AddTimer(25ms, note("25, moved to 200", 200ms));
-      AddTimer(50ms, note("50", 50ms));
-      moved->fireAfter(200ms);
-      AddTimer(100ms, [&] {
-        fired.push_back("100");
-        AddTimer(0ms, note("added by 100", 100ms));
-      });
-      RunLoop::current().addTimer(early);
-      RunLoop::current().addTimer(early);
-      RunLoop::current().run();
-      EXPECT_THAT(fired,
-                  ElementsAre("overdue", "50", "100", "added by 100", "150", "25, moved to 200"));
-      RunLoop::current().addTimer(early);  // no longer valid
-      early->fireAfter(0s);
-      RunLoop::current().run();
+    };
+    AddTimer(150ms, note("150", 150ms));
+    const auto moved = AddTimer(25ms, note("25, moved to 200", 200ms));
+    AddTimer(50ms, note("50", 50ms));
+    moved->fireAfter(200ms);
+    AddTimer(100ms, [&] {
+      fired.push_back("100");
+      AddTimer(0ms, note("added by 100", 100ms));
     });
-  }
-  EXPECT_EQ(fired.size(), 6U);
+    RunLoop& loop = RunLoop::current();
+    loop.addTimer(early);
+    loop.addTimer(early);
+    loop.run();
+    loop.addTimer(early);  // no longer valid
+    early->fireAfter(0s);
+    loop.run();
+    EXPECT_THAT(fired,
+                ElementsAre("overdue", "50", "100", "added by 100", "150", "25, moved to 200"));
+  });
 }
 
 // Each of these would take an hour if the waiting run loop did not notice.
 TEST(RunLoop, NoticesAnotherThreadsChangesToItsTimers) {
   std::vector<std::string> fired;
-  std::shared_ptr<RunLoopTimer> moved;
-  std::shared_ptr<RunLoopTimer> invalidated;
-  Gate first;
-  Gate second;
+  std::shared_ptr<RunLoopTimer> moved, invalidated;
+  Gate first, second;
   const auto token = std::make_shared<int>();
   {
     const Worker worker([&] {
@@ -123,30 +114,23 @@ TEST(RunLoop, FiresATimerOnceHoweverItIsMovedMeanwhile) {
       RunLoop::current().run();
     });
     added.wait();
-    const auto each = [&](auto change) {
-      return std::thread([&timers, change] {
-        for (const auto& timer : timers) change(*timer);
-      });
-    };
-    std::thread ahead = each([](RunLoopTimer& timer) { timer.fireAfter(0s); });
-    std::thread off = each([](RunLoopTimer& timer) { timer.invalidate(); });
-    ahead.join();
-    off.join();
+    std::thread other([&] {
+      for (const auto& timer : timers) timer->fireAfter(0s);
+    });
+    for (const auto& timer : timers) timer->invalidate();
+    other.join();
   }
   for (const auto& count : fired) ASSERT_LE(count, 1);
 }
 
 TEST(RunLoop, WaitsWithoutWakingUp) {
   const Worker worker([] {
-    const auto switches = [] {
-      rusage usage{};
-      getrusage(RUSAGE_THREAD, &usage);
-      return usage.ru_nvcsw;
-    };
     AddTimer(100ms, [] {});
-    const long before = switches();
+    rusage before{}, after{};
+    getrusage(RUSAGE_THREAD, &before);
     RunLoop::current().run();
-    EXPECT_LE(switches() - before, 3);
+    getrusage(RUSAGE_THREAD, &after);
+    EXPECT_LE(after.ru_nvcsw - before.ru_nvcsw, 3);
   });
 }
 
