@@ -22,16 +22,11 @@ TEST(RandomTest, IsUniformWhereTheBoundDoesNotDivideTheRange) {
   for (const int count : thirds) EXPECT_NEAR(count, kDraws / 3, 7 * std::sqrt(kDraws * 2 / 9.0));
 }
 
-TEST(ProcessTest, NamesProcessesByTheirShortCommandName) {
+TEST(ProcessTest, NamesProcessesByTheirShortCommandNameIfItIsText) {
   EXPECT_EQ(OwnProcessIdentifier(), getpid());
   EXPECT_EQ(OwnProcessName(), "service_test");
   EXPECT_EQ(ProcessCommandName(getpid()), "service_test");
-  EXPECT_EQ(ProcessCommandName(0), std::nullopt);
-  EXPECT_EQ(ProcessCommandName(-5), std::nullopt);
-  EXPECT_EQ(ProcessCommandName(0x7fffffff), std::nullopt);
-}
-
-TEST(ProcessTest, NameThatIsNoTextIsNone) {
+  for (const int none : {0, -5, 0x7fffffff}) EXPECT_EQ(ProcessCommandName(none), std::nullopt);
   std::thread([] {
     pthread_setname_np(pthread_self(), "caf\xc3\xa9 x\n");
     EXPECT_EQ(ProcessCommandName(gettid()), "caf\xc3\xa9 x\n");

@@ -40,21 +40,22 @@ class Journal {
     CallRef reference;
   };
 
-  void add(std::string entry) {
+  struct Record {
+    std::vector<std::string> handlers;
+    std::vector<std::int64_t> calls;
+    std::size_t mostKept = 0;
+  };
+
+  void add(std::string handler) {
     const MutexLock lock(mutex_);
-    entries_.push_back(std::move(entry));
+    record_.handlers.push_back(std::move(handler));
     changed_.notifyAll();
   }
-  void addCall(std::int64_t number) {
+  void addCall(std::int64_t number, std::optional<KeptCall> kept = std::nullopt) {
     const MutexLock lock(mutex_);
-    calls_.push_back(number);
-    changed_.notifyAll();
-  }
-  void keepCall(KeptCall call) {
-    const MutexLock lock(mutex_);
-    calls_.push_back(call.number);
-    kept_.push_back(std::move(call));
-    mostKept_ = std::max(mostKept_, kept_.size());
+    record_.calls.push_back(number);
+    if (kept) kept_.push_back(std::move(*kept));
+    record_.mostKept = std::max(record_.mostKept, kept_.size());
     changed_.notifyAll();
   }
   std::optional<KeptCall> takeKeptCall() {
@@ -64,26 +65,18 @@ class Journal {
     kept_.pop_front();
     return first;
   }
-  std::vector<std::string> takeEntries() {
+  Record record() {
     const MutexLock lock(mutex_);
-    return std::exchange(entries_, {});
-  }
-  std::vector<std::int64_t> calls() {
-    const MutexLock lock(mutex_);
-    return calls_;
-  }
-  std::size_t mostKeptCalls() {
-    const MutexLock lock(mutex_);
-    return mostKept_;
+    return record_;
   }
   bool waitForCalls(std::size_t count) { return wait(count, 0); }
-  bool waitForEntries(std::size_t count) { return wait(0, count); }
+  bool waitForHandlers(std::size_t count) { return wait(0, count); }
 
  private:
-  bool wait(std::size_t calls, std::size_t entries) {
+  bool wait(std::size_t calls, std::size_t handlers) {
     const auto deadline = std::chrono::steady_clock::now() + kPatience;
     const MutexLock lock(mutex_);
-    while (calls_.size() < calls || entries_.size() < entries) {
+    while (record_.calls.size() < calls || record_.handlers.size() < handlers) {
       if (!changed_.waitUntil(mutex_, deadline)) return false;
     }
     return true;
@@ -91,10 +84,8 @@ class Journal {
 
   Mutex mutex_;
   ConditionVariable changed_;
-  std::vector<std::string> entries_ QUARVEL_GUARDED_BY(mutex_);
-  std::vector<std::int64_t> calls_ QUARVEL_GUARDED_BY(mutex_);
+  Record record_ QUARVEL_GUARDED_BY(mutex_);
   std::deque<KeptCall> kept_ QUARVEL_GUARDED_BY(mutex_);
-  std::size_t mostKept_ QUARVEL_GUARDED_BY(mutex_) = 0;
 };
 
 /// Operations that answer at once, later, at length or not at all.
@@ -113,14 +104,14 @@ class TestObject final : public ExportedObject {
   void never(Reply<bool>) {}
   void refuse(ErrorReply reply) { reply(Error{"test", 9, {{"why", "because"}}}); }
   void keep(std::int64_t number, Reply<std::int64_t> reply) {
-    journal_.keepCall({number, std::move(reply), CallRef::current()});
+    journal_.addCall(number, {{number, std::move(reply), CallRef::current()}});
   }
   void later(std::int64_t number, Reply<std::int64_t> reply) {
-    journal_.keepCall({number, std::move(reply), CallRef()});
+    journal_.addCall(number, {{number, std::move(reply), CallRef()}});
   }
   void answerUnstored(std::int64_t number, Reply<std::int64_t> reply) {
     reply(number);
-    journal_.keepCall({number, {}, CallRef::indirect(CallRef::current().tracker())});
+    journal_.addCall(number, {{number, {}, CallRef::indirect(CallRef::current().tracker())}});
   }
   void make(std::int64_t number, std::uint32_t size, Reply<std::string> reply) {
     journal_.addCall(number);

@@ -25,6 +25,13 @@ const std::string echo =
     "\xab"
     "echo:reply:"s;
 
+/// From 0 up, below `count`.
+std::vector<std::int64_t> Numbers(std::size_t count) {
+  std::vector<std::int64_t> numbers(count);
+  std::iota(numbers.begin(), numbers.end(), 0);
+  return numbers;
+}
+
 TEST(Connection, AnswersCallsInEveryFormThatFits) {
   const struct {
     const char* name;
@@ -93,7 +100,7 @@ TEST(Connection, AnswersWrongCallsWithAReasonAndGoesOn) {
         << row.name;
   }
   EXPECT_TRUE(client.isServed());
-  EXPECT_THAT(service.journal.calls(), ElementsAre(Client::kServedNumber))
+  EXPECT_THAT(service.journal.record().calls, ElementsAre(Client::kServedNumber))
       << "a wrong call reached the object";
 }
 
@@ -101,10 +108,7 @@ TEST(Connection, EndsAClientThatBreaksTheProtocolAndNoOther) {
   Configuration::Limits limits;
   limits.messageBytes = 4096;
   limits.depth = 8;
-  const struct {
-    const char* name;
-    std::string bytes;
-  } cases[] = {
+  const std::pair<const char*, std::string> cases[] = {
       {"text", "GET / HTTP/1.1\r\n\r\n"},
       {"a byte that MessagePack never uses", "\xc1"},
       {"a list of nothing", "\x90"},
@@ -124,16 +128,17 @@ TEST(Connection, EndsAClientThatBreaksTheProtocolAndNoOther) {
   };
   Service service(limits);
   Client bystander = service.connect();
-  ASSERT_TRUE(bystander.isServed());
-  for (const auto& row : cases) {
-    SCOPED_TRACE(row.name);
+  std::vector<std::string> handlers;
+  for (const auto& [name, bytes] : cases) {
+    SCOPED_TRACE(name);
     Client client = service.connect();
     // The call before it, in the same write, is still executed and answered.
-    ASSERT_TRUE(client.send(CallBytes(1, "echo:reply:", {1}) + row.bytes));
+    ASSERT_TRUE(client.send(CallBytes(1, "echo:reply:", {1}) + bytes));
     EXPECT_EQ(client.response(), "[1,1,null,1]");
     EXPECT_EQ(client.response(), "end");
-    ASSERT_TRUE(service.journal.waitForEntries(2));
-    EXPECT_THAT(service.journal.takeEntries(), ElementsAre("interrupted", "invalidated"));
+    handlers.insert(handlers.end(), {"interrupted", "invalidated"});
+    ASSERT_TRUE(service.journal.waitForHandlers(handlers.size()));
+    EXPECT_EQ(service.journal.record().handlers, handlers);
     EXPECT_THAT(
         LogRecorder::takeErrors(),
         ElementsAre(StartsWith("client " + std::to_string(::getpid()) + " broke the protocol: ")));
@@ -184,12 +189,12 @@ TEST(Connection, ReleasesItsObjectWhenItsClientHasGone) {
   auto stillKnown = service.connections.front().lock();
   EXPECT_EQ(stillKnown->processIdentifier(), ::getpid());
   client.hangUp();
-  ASSERT_TRUE(service.journal.waitForEntries(1));
+  ASSERT_TRUE(service.journal.waitForHandlers(1));
   ASSERT_TRUE(other.isServed());  // by the same thread, so the end of the first is complete
   EXPECT_TRUE(service.objects.front().expired());
   stillKnown.reset();
   EXPECT_TRUE(service.connections.front().expired()) << "though its call is in flight";
-  EXPECT_THAT(service.journal.takeEntries(), ElementsAre("invalidated"));
+  EXPECT_THAT(service.journal.record().handlers, ElementsAre("invalidated"));
   EXPECT_THAT(LogRecorder::takeErrors(), IsEmpty()) << "closing is no protocol error";
   service.journal.takeKeptCall()->reply(1);  // discarded
 }
@@ -199,12 +204,10 @@ TEST(Connection, ExecutesCallsOfAClientThatDoesNotWaitForReplies) {
   Service service;
   {
     Client client = service.connect();
-    for (std::size_t i = 0; i < kCalls; ++i) {
-      ASSERT_TRUE(client.call(static_cast<std::uint32_t>(i), "make:size:reply:", {1, 500}));
-    }
+    for (std::uint32_t i = 0; i < kCalls; ++i) client.call(i, "make:size:reply:", {1, 500});
   }
   EXPECT_TRUE(service.journal.waitForCalls(kCalls));
-  EXPECT_TRUE(service.journal.waitForEntries(1));
+  EXPECT_TRUE(service.journal.waitForHandlers(1));
 
   Client halfOpen = service.connect();
   ASSERT_TRUE(halfOpen.call(1, "echo:reply:", {1}));
@@ -218,19 +221,16 @@ TEST(Connection, DrainsCallsAtTheEndOfTheService) {
   limits.queuedCalls = 4;
   Service service(limits);
   Client client = service.connect();
-  std::string bytes;
-  for (int i = 0; i < 100; ++i) bytes += CallBytes(std::nullopt, "keep:reply:", {i});
-  ASSERT_TRUE(client.send(bytes));
+  for (int i = 0; i < 100; ++i) client.send(CallBytes(std::nullopt, "keep:reply:", {i}));
   Client other = service.connect();
   ASSERT_TRUE(other.isServed());
 
   service.end();
-  std::vector<std::int64_t> sent(100);
-  std::iota(sent.begin(), sent.end(), 0);
-  std::vector<std::int64_t> arrived = service.journal.calls();
+  std::vector<std::int64_t> arrived = service.journal.record().calls;
   std::erase(arrived, Client::kServedNumber);
-  EXPECT_EQ(arrived, sent) << "a call that had been sent was not executed";
-  EXPECT_THAT(service.journal.takeEntries(), ElementsAre("invalidated", "invalidated", "ended"));
+  EXPECT_EQ(arrived, Numbers(100)) << "a call that had been sent was not executed";
+  EXPECT_THAT(service.journal.record().handlers,
+              ElementsAre("invalidated", "invalidated", "ended"));
   EXPECT_THAT(LogRecorder::takeErrors(), IsEmpty());
   EXPECT_EQ(client.response(), "end");
   EXPECT_FALSE(std::filesystem::exists(service.socketPath()));
@@ -259,11 +259,7 @@ TEST(ConnectionLimits, AClientThatIsTooFastWaitsAndLosesNothing) {
     constexpr std::size_t kCalls = 100;
     Service service(limits);
     Client client = service.connect();
-    std::string bytes;
-    for (std::size_t i = 0; i < kCalls; ++i) {
-      bytes += CallBytes(static_cast<std::uint32_t>(100 + i), "keep:reply:", {i});
-    }
-    ASSERT_TRUE(client.send(bytes));
+    for (std::uint32_t i = 0; i < kCalls; ++i) client.call(100 + i, "keep:reply:", {i});
     ASSERT_TRUE(service.journal.waitForCalls(8));
     EXPECT_TRUE(service.connect().isServed()) << "only the fast client waits";
 
@@ -282,14 +278,12 @@ TEST(ConnectionLimits, AClientThatIsTooFastWaitsAndLosesNothing) {
       ASSERT_THAT(client.response(), HasSubstr(",null," + std::to_string(i) + "]"));
     }
     worker.join();
-    std::vector<std::int64_t> arrived = service.journal.calls();
+    std::vector<std::int64_t> arrived = service.journal.record().calls;
     EXPECT_EQ(arrived.at(8), Client::kServedNumber)
         << "more than eight calls were taken in before one completed";
     arrived.erase(arrived.begin() + 8);
-    std::vector<std::int64_t> sent(kCalls);
-    std::iota(sent.begin(), sent.end(), 0);
-    EXPECT_EQ(arrived, sent);
-    EXPECT_LE(service.journal.mostKeptCalls(), 9U);
+    EXPECT_EQ(arrived, Numbers(kCalls));
+    EXPECT_LE(service.journal.record().mostKept, 9U);
   }
 }
 
@@ -329,8 +323,8 @@ TEST(ConnectionLimits, AClientThatReadsLateIsHeldBackAndGetsEveryReplyInOrder) {
   Service service(limits);
   Client client = service.connect();
   std::string bytes;
-  for (std::size_t i = 0; i < kCalls; ++i) {
-    bytes += CallBytes(static_cast<std::uint32_t>(i), "make:size:reply:", {i, 16 * 1024});
+  for (std::uint32_t i = 0; i < kCalls; ++i) {
+    bytes += CallBytes(i, "make:size:reply:", {i, 16 * 1024});
     bytes += CallBytes(std::nullopt, "make:size:reply:", {i, 1});  // answered with nothing
   }
   ASSERT_TRUE(client.send(bytes));
@@ -338,7 +332,7 @@ TEST(ConnectionLimits, AClientThatReadsLateIsHeldBackAndGetsEveryReplyInOrder) {
   ASSERT_TRUE(bystander.isServed());
   // The kernel's buffer and `replyBytes` hold far fewer replies.
   ASSERT_TRUE(bystander.isServed());
-  EXPECT_LT(service.journal.calls().size(), kCalls);
+  EXPECT_LT(service.journal.record().calls.size(), kCalls);
   for (std::size_t i = 0; i < kCalls; ++i) {
     ASSERT_EQ(client.response().substr(0, 12 + std::to_string(i).size()),
               "[1," + std::to_string(i) + ",null,\"xx");
