@@ -1,11 +1,14 @@
 #include "linux/Service.h"
 
 #include <gmock/gmock.h>
+#include <pthread.h>
 #include <sqlite3.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <array>
 #include <chrono>
+#include <cmath>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -18,6 +21,8 @@
 #include "Statistics/Service/ServiceMain.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Log.h"
+#include "platform/Process.h"
+#include "platform/Random.h"
 #include "tests/TemporaryDirectory.h"
 #include "tests/UnixSocket.h"
 
@@ -143,6 +148,28 @@ TEST(ServiceTest, LogsToStandardErrorWithoutAService) {
   const std::string text = ::testing::internal::GetCapturedStderr();
   EXPECT_THAT(text, HasSubstr("before: a line\n"));
   EXPECT_THAT(text, Not(HasSubstr("below")));
+}
+
+// Folding 2^32 numbers onto this bound without care makes the lowest third twice as likely.
+TEST(RandomTest, IsUniformWhereTheBoundDoesNotDivideTheRange) {
+  constexpr std::uint32_t kThird = std::uint32_t{1} << 30;
+  constexpr int kDraws = 200'000;
+  std::array<int, 3> thirds{};
+  for (int i = 0; i < kDraws; ++i) ++thirds.at(RandomBelow(3 * kThird) / kThird);
+  for (const int count : thirds) EXPECT_NEAR(count, kDraws / 3, 7 * std::sqrt(kDraws * 2 / 9.0));
+}
+
+TEST(ProcessTest, NamesProcessesByTheirShortCommandNameIfItIsText) {
+  EXPECT_EQ(OwnProcessIdentifier(), getpid());
+  EXPECT_EQ(OwnProcessName(), "service_test");
+  EXPECT_EQ(ProcessCommandName(getpid()), "service_test");
+  for (const int none : {0, -5, 0x7fffffff}) EXPECT_EQ(ProcessCommandName(none), std::nullopt);
+  std::thread([] {
+    pthread_setname_np(pthread_self(), "caf\xc3\xa9 x\n");
+    EXPECT_EQ(ProcessCommandName(gettid()), "caf\xc3\xa9 x\n");
+    pthread_setname_np(pthread_self(), "\xff\xfe");
+    EXPECT_EQ(ProcessCommandName(gettid()), std::nullopt);
+  }).join();
 }
 
 }  // namespace

@@ -1,8 +1,11 @@
-// Traffic on the wire: calls, replies, unknown calls, bytes that are no calls, and both ends.
+// Traffic on the wire: calls, replies, unknown calls, bytes that are no calls, and both ends;
+// limits of clients; the listening socket.
 
 #include <gmock/gmock.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
+#include <latch>
 #include <numeric>
 #include <string>
 #include <thread>
@@ -208,7 +211,6 @@ TEST(Connection, ExecutesCallsOfAClientThatDoesNotWaitForReplies) {
   }
   EXPECT_TRUE(service.journal.waitForCalls(kCalls));
   EXPECT_TRUE(service.journal.waitForHandlers(1));
-
   Client halfOpen = service.connect();
   ASSERT_TRUE(halfOpen.call(1, "echo:reply:", {1}));
   halfOpen.stopSending();
@@ -224,7 +226,6 @@ TEST(Connection, DrainsCallsAtTheEndOfTheService) {
   for (int i = 0; i < 100; ++i) client.send(CallBytes(std::nullopt, "keep:reply:", {i}));
   Client other = service.connect();
   ASSERT_TRUE(other.isServed());
-
   service.end();
   std::vector<std::int64_t> arrived = service.journal.record().calls;
   std::erase(arrived, Client::kServedNumber);
@@ -262,7 +263,6 @@ TEST(ConnectionLimits, AClientThatIsTooFastWaitsAndLosesNothing) {
     for (std::uint32_t i = 0; i < kCalls; ++i) client.call(100 + i, "keep:reply:", {i});
     ASSERT_TRUE(service.journal.waitForCalls(8));
     EXPECT_TRUE(service.connect().isServed()) << "only the fast client waits";
-
     // Each reply is given before the call completes.
     std::thread worker([&] {
       for (std::size_t done = 0; done < kCalls;) {
@@ -297,7 +297,6 @@ TEST(ConnectionLimits, UnstoredCallsHoldBackLaterOnesUntilTheyAreStoredOrSlow) {
   callTwoHundredTimes(slow);
   EXPECT_TRUE(service.journal.waitForCalls(200)) << "none of them completes";
   EXPECT_GE(std::chrono::steady_clock::now() - began, 50ms) << "more than 128 were unstored";
-
   Client other = service.connect();
   callTwoHundredTimes(other);
   ASSERT_TRUE(service.journal.waitForCalls(200 + 128));
@@ -375,6 +374,100 @@ TEST(ConnectionLimits, AMessageThatTheServiceHoldsBackHasNoDeadline) {
   EXPECT_THAT(LogRecorder::nextError(), HasSubstr("is disconnected: a message was begun"));
   service.journal.takeKeptCall()->reply(1);
   EXPECT_EQ(client.response(), "[1,1,null,1]");
+}
+
+// The socket file that clients connect to, and a socket that was passed in.
+
+class ListeningSocketTest : public ::testing::Test {
+ protected:
+  const TemporaryDirectory directory_;
+  const std::filesystem::path path_ = directory_.path() / "socket";
+};
+
+TEST_F(ListeningSocketTest, MakesItsDirectoryAndRemovesItsOwnFile) {
+  const auto path = directory_.path() / "run" / "quarvel" / "reporting.sock";
+  const auto modeOf = [](const std::filesystem::path& file) {
+    return static_cast<mode_t>(std::filesystem::status(file).permissions());
+  };
+  const mode_t umaskBefore = ::umask(0027);
+  {
+    auto socket = ListeningSocket::listeningAt(path);
+    ::umask(umaskBefore);
+    ASSERT_TRUE(socket) << socket.error().description();
+    EXPECT_EQ(modeOf(path), 0660U);
+    EXPECT_EQ(modeOf(path.parent_path()), 0750U);
+  }
+  EXPECT_FALSE(std::filesystem::exists(path));
+  auto socket = ListeningSocket::listeningAt(path);
+  ASSERT_TRUE(socket);
+  std::filesystem::remove(path);
+  const auto successor = ListeningSocket::listeningAt(path);
+  ASSERT_TRUE(successor);
+  socket.value().removeFile();
+  EXPECT_TRUE(std::filesystem::exists(path)) << "the file of a successor";
+}
+
+TEST_F(ListeningSocketTest, ReplacesOnlyAStaleFile) {
+  const struct {
+    const char* name;
+    int type;
+    int backlog;  // -1: does not listen
+    bool stale;   // closed before, so replaced
+  } cases[] = {
+      {"dead", SOCK_STREAM, 5, true},
+      {"dead before it listened", SOCK_STREAM, -1, true},
+      {"dead, of another type", SOCK_DGRAM, -1, true},
+      {"live", SOCK_STREAM, 5, false},
+      {"live, with its queue full", SOCK_STREAM, 0, false},
+      {"about to listen", SOCK_STREAM, -1, false},
+      {"live, of another type", SOCK_DGRAM, -1, false},
+  };
+  for (const auto& row : cases) {
+    SCOPED_TRACE(row.name);
+    std::filesystem::remove(path_);
+    UniqueDescriptor there(BoundSocket(path_, row.type));
+    if (row.backlog >= 0) {
+      ASSERT_EQ(::listen(there.get(), row.backlog), 0);
+    }
+    if (row.stale) there = UniqueDescriptor();
+    const auto socket = ListeningSocket::listeningAt(path_);
+    EXPECT_EQ(socket.ok(), row.stale);
+    if (!socket) {
+      EXPECT_THAT(socket.error().description(), HasSubstr("another service is listening there"));
+    }
+    EXPECT_TRUE(std::filesystem::exists(path_));
+  }
+}
+
+TEST_F(ListeningSocketTest, RefusesAPathThatIsNoSocketOrTooLongAndASocketThatDoesNotListen) {
+  directory_.write("socket", "precious");
+  const auto socket = ListeningSocket::listeningAt(path_);
+  ASSERT_FALSE(socket);
+  EXPECT_THAT(socket.error().description(), HasSubstr("no socket"));
+  EXPECT_EQ(std::filesystem::file_size(path_), 8U);
+  const auto tooLong = ListeningSocket::listeningAt(directory_.path() / std::string(108, 'l'));
+  ASSERT_FALSE(tooLong);
+  EXPECT_THAT(tooLong.error().description(), HasSubstr("1 to 107 bytes"));
+  EXPECT_FALSE(ListeningSocket::inherited(
+      UniqueDescriptor(BoundSocket(directory_.path() / "quiet", SOCK_STREAM))));
+}
+
+TEST_F(ListeningSocketTest, OfServicesThatStartAtOnceExactlyOneSucceeds) {
+  for (int round = 0; round < 50; ++round) {
+    ::close(BoundSocket(path_, SOCK_STREAM));  // stale
+    std::latch go(4);
+    std::vector<std::optional<ListeningSocket>> sockets(4);
+    std::vector<std::thread> services;
+    for (auto& mine : sockets) {
+      services.emplace_back([&] {
+        go.arrive_and_wait();
+        if (auto socket = ListeningSocket::listeningAt(path_))
+          mine.emplace(std::move(socket.value()));
+      });
+    }
+    for (std::thread& service : services) service.join();
+    ASSERT_EQ(std::ranges::count_if(sockets, [](const auto& each) { return each.has_value(); }), 1);
+  }
 }
 
 }  // namespace
