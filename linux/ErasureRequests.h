@@ -28,14 +28,21 @@ class ErasureRequests {
   ErasureRequests& operator=(const ErasureRequests&) = delete;
 
  private:
+  // On `queue_`.
+
+  /// Carries out every request in the directory.
   void answerAll();
+  /// Carries out one request and replaces its file by the answer.
   void answer(const std::filesystem::path& request);
+  /// Erases rows while the exporters are held. Returns their number; blocks until the store has
+  /// erased them. Errors: the store's.
   [[nodiscard]] Result<std::int64_t> erase(const ErasureSelection& selection);
 
+  // Constant after construction.
   const std::filesystem::path directory_;
   TelemetryStore& store_;
   Exporters& exporters_;
-  const std::unique_ptr<WorkQueue> queue_;
+  const std::unique_ptr<WorkQueue> queue_;  // serial: one request at a time
 };
 
 }  // namespace quarvel

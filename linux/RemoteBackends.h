@@ -27,10 +27,14 @@ class RemoteBackends {
   /// The engines that the service knows, for its configuration. Constant.
   [[nodiscard]] static std::span<const BackendKind> kinds();
 
+  /// The exporters that were started; may be none. Any thread.
   [[nodiscard]] Exporters& exporters() { return exporters_; }
 
  private:
+  /// Has the consent read again at each change of the preferences.
   void followConsent();
+  /// On `queue_`: reads `[agent] export` from the configuration file and passes it to the
+  /// exporters.
   void readConsentAgain();
 
   const std::filesystem::path configurationFile_;

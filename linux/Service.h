@@ -37,6 +37,8 @@ namespace quarvel {
 /// still hold threads then.
 class Service {
  public:
+  /// Reads the configuration, starts every part and opens store and socket; clients may connect
+  /// from then on, and are served by `listener().resume()`. Blocks while the store is opened.
   Service();
   Service(const Service&) = delete;
   Service& operator=(const Service&) = delete;
@@ -50,22 +52,39 @@ class Service {
   /// The running service. There is one.
   [[nodiscard]] static Service& current();
 
+  // The parts, each with threads and locks as its own header says. They live as long as the
+  // service.
+
+  /// Directories of the service, as its environment names them.
   [[nodiscard]] const StandardPaths& paths() const { return paths_; }
   [[nodiscard]] Log& log() { return log_; }
   [[nodiscard]] const Log& log() const { return log_; }
+  /// Work that must be done before the process exits, and the exit itself.
   [[nodiscard]] ProcessExit& processExit() { return processExit_; }
+  /// `quarvel.toml` as it was at the start.
   [[nodiscard]] const Configuration& configuration() const { return configuration_; }
   [[nodiscard]] WorkQueues& queues() { return queues_; }
+  /// The queue of every server instance; null until the core makes it, once.
   [[nodiscard]] std::unique_ptr<WorkQueue>& serverQueue() { return serverQueue_; }
+  /// Named notifications: files below `notify/`.
   [[nodiscard]] NotificationCenter& notifications() { return notifications_; }
+  /// Preferences domains: files below `preferences/`.
   [[nodiscard]] PreferencesStore& preferences() { return preferences_; }
+  /// Orientation of the device and of its user interface.
   [[nodiscard]] OrientationCenter& orientation() { return orientation_; }
+  /// The configured driver counters.
   [[nodiscard]] const TallixFacility& tallix() const { return tallix_; }
+  /// Counts that the core keeps, for the status file.
   [[nodiscard]] Gauges& gauges() { return gauges_; }
+  /// Serves clients; its `resume` makes the caller the I/O thread.
   [[nodiscard]] SocketListener& listener() { return *listener_; }
+  /// Every row of the service, and the queue in front of it.
   [[nodiscard]] TelemetryStore& store() { return *store_; }
+  /// Events on their way to the store.
   [[nodiscard]] EventQueue& events() { return events_; }
+  /// The sink of analytics events.
   [[nodiscard]] AnalyticsEventSink& analytics() { return analytics_; }
+  /// The agent of messages and their sessions.
   [[nodiscard]] TelemetryAgent& agent() { return agent_; }
 
  private:
@@ -78,10 +97,17 @@ class Service {
     Running& operator=(const Running&) = delete;
   };
 
+  // Steps of the constructor; an error ends the process.
+
+  /// `quarvel.toml` in the configuration directory; may be missing.
   [[nodiscard]] std::filesystem::path configurationFile() const;
+  /// Warns about unknown keys.
   [[nodiscard]] Configuration readConfiguration();
+  /// Starts the source that `[orientation]` names.
   void setOrientationSource();
+  /// Takes the socket that was passed in, or listens at the path of the service.
   [[nodiscard]] std::unique_ptr<SocketListener> openListener();
+  /// Opens or makes the store and starts its threads.
   [[nodiscard]] std::shared_ptr<TelemetryStore> openStore();
 
   const Running running_{*this};  // first: the parts below call the platform's functions

@@ -4,7 +4,6 @@
 #include <utility>
 #include <vector>
 
-#include "queues/PendingWork.h"
 #include "queues/Pool.h"
 
 namespace quarvel {

@@ -15,7 +15,9 @@ class QueueState;
 /// May be opened and closed with a lock held: the locks of the pools call no foreign code.
 class BlockingScope {
  public:
+  /// Begins blocking, unless the thread runs blocks inline; returns at once.
   BlockingScope();
+  /// Ends blocking: the thread counts as running again. Returns at once.
   ~BlockingScope();
   BlockingScope(const BlockingScope&) = delete;
   BlockingScope& operator=(const BlockingScope&) = delete;
@@ -35,6 +37,7 @@ class BlockingScope {
 /// Owned by a scope of that thread, one at a time, and used by that thread alone.
 class InlineRunner {
  public:
+  /// Becomes the calling thread's runner, for 1 ms from now.
   InlineRunner();
   /// Hands the queues that have not run to their pools.
   ~InlineRunner();
@@ -50,12 +53,13 @@ class InlineRunner {
   void add(std::shared_ptr<QueueState> queue, Pool& pool);
   /// Ends inline running: everything from now on goes to the pools.
   void exhaust() { exhausted_ = true; }
+  /// Whether the next block goes to its pool. Reads the clock, but not at every call.
   [[nodiscard]] bool isExhausted();
 
  private:
   const std::chrono::steady_clock::time_point end_;
   bool exhausted_ = false;
-  unsigned checks_ = 0;
+  unsigned checks_ = 0;  // calls of `isExhausted`, of which some read the clock
 };
 
 }  // namespace quarvel

@@ -37,10 +37,12 @@ class CallTracker {
 
   static constexpr std::uint32_t kCompleted = std::uint32_t{1} << 31;
 
+  /// Any thread. `direct`: of the call itself, or of a block that it queued itself.
   void addReference(bool direct) {
     references_.fetch_add(1, std::memory_order_relaxed);
     if (direct) directReferences_.fetch_add(1, std::memory_order_relaxed);
   }
+  /// Any thread; the last reference of each kind reports the progress on the calling thread.
   void removeReference(bool direct) {
     if (direct && directReferences_.fetch_sub(1, std::memory_order_acq_rel) == 1) callExecuted();
     if (references_.fetch_sub(1, std::memory_order_acq_rel) != 1) return;
@@ -73,11 +75,13 @@ class CallRef {
     if (tracker_) tracker_->removeReference(direct_);
   }
 
+  /// The tracker referred to; null when the reference is empty.
   [[nodiscard]] const std::shared_ptr<CallTracker>& tracker() const { return tracker_; }
   /// Whether it belongs to the call, or to a block that the call queued itself.
   [[nodiscard]] bool isDirect() const { return direct_ && tracker_ != nullptr; }
   /// Precondition: not empty. The block with this reference took `time`.
   void blockRan(std::chrono::nanoseconds time) const { tracker_->blockRan(time); }
+  /// Whether it refers to a call.
   explicit operator bool() const { return tracker_ != nullptr; }
 
   /// A further reference to the tracker that is current on this thread; empty when none is.
@@ -104,7 +108,9 @@ class CallScope {
   /// The code that runs in the scope: the call itself, whose blocks are part of executing it, or a
   /// block, whose further blocks are not.
   enum class Of : std::uint8_t { call, block };
+  /// From now on blocks that this thread queues belong to `call`; to no call when that is empty.
   CallScope(Of of, const CallRef& call);
+  /// Makes the tracker of before current again: scopes nest.
   ~CallScope();
   CallScope(const CallScope&) = delete;
   CallScope& operator=(const CallScope&) = delete;

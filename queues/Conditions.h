@@ -26,6 +26,7 @@ class Conditions {
   void endWaits(Date latest) QUARVEL_EXCLUDES(mutex_);
 
  private:
+  /// A condition whose waits are listed in `waiting_`.
   class PooledCondition;
 
   // Beyond these a wait, which counts in nanoseconds, would overflow.
@@ -34,7 +35,8 @@ class Conditions {
 
   std::atomic<Date> latest_{kLatestDeadline};  // no wait goes on for longer
   Mutex mutex_;                                // taken after a condition's own
-  std::list<std::shared_ptr<PooledCondition>> waiting_ QUARVEL_GUARDED_BY(mutex_);
+  std::list<std::shared_ptr<PooledCondition>> waiting_
+      QUARVEL_GUARDED_BY(mutex_);  // one entry for each wait in progress
 };
 
 }  // namespace quarvel

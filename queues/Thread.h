@@ -27,10 +27,11 @@ class JoinedThread {
 
   /// Called once. Returns 0, or the system's error number.
   [[nodiscard]] int start(std::string_view name, int nice, Block body);
+  /// Waits for the thread to end; returns at once when none was started or it was joined before.
   void join();
 
  private:
-  pthread_t thread_{};
+  pthread_t thread_{};    // valid while `started_`
   bool started_ = false;  // and not joined
 };
 

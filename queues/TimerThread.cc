@@ -7,7 +7,6 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "queues/PendingWork.h"
 #include "queues/Pool.h"
 
 namespace quarvel {

@@ -43,6 +43,7 @@ class TimerThread {
   /// order in which they were due.
   void endDelays() QUARVEL_EXCLUDES(mutex_);
 
+  /// 16 MiB: bounds the memory of calls that have completed though a block of theirs is delayed.
   static constexpr std::size_t kUnheldBytes = 16 * 1024 * 1024;
 
  private:
@@ -51,22 +52,24 @@ class TimerThread {
   struct Delayed {
     std::shared_ptr<QueueState> queue;
     Block block;
-    std::shared_ptr<CallTracker> tracker;
-    CallRef held;                 // empty while the tracker may complete
-    std::size_t unheldBytes = 0;  // the delayed block's share of `unheldBytes_`
+    std::shared_ptr<CallTracker> tracker;  // null for work that no call caused
+    CallRef held;                          // empty while the tracker may complete
+    std::size_t unheldBytes = 0;           // the delayed block's share of `unheldBytes_`
   };
 
+  /// The thread's body, until the destructor.
   void run() QUARVEL_EXCLUDES(mutex_);
+  /// Adds the block to its queue, under its tracker. Without the lock.
   static void deliver(Delayed delayed);
 
   PendingWork& pendingWork_;
   Mutex mutex_;
   ConditionVariable changed_;
-  std::vector<Pool*> starts_ QUARVEL_GUARDED_BY(mutex_);
+  std::vector<Pool*> starts_ QUARVEL_GUARDED_BY(mutex_);  // one entry for each thread to start
   // By due time; blocks due at one time in the order in which they came.
   std::map<std::pair<Clock::time_point, std::uint64_t>, Delayed> delayed_
       QUARVEL_GUARDED_BY(mutex_);
-  std::uint64_t delays_ QUARVEL_GUARDED_BY(mutex_) = 0;
+  std::uint64_t delays_ QUARVEL_GUARDED_BY(mutex_) = 0;  // so far, to order equal due times
   std::size_t unheldBytes_ QUARVEL_GUARDED_BY(mutex_) = 0;
   bool delaysEnded_ QUARVEL_GUARDED_BY(mutex_) = false;
   bool ending_ QUARVEL_GUARDED_BY(mutex_) = false;

@@ -7,7 +7,6 @@
 #include "platform/Condition.h"
 #include "platform/WorkQueue.h"
 #include "queues/Conditions.h"
-#include "queues/PendingWork.h"
 #include "queues/Pool.h"
 #include "queues/TimerThread.h"
 
@@ -38,15 +37,16 @@ class WorkQueues {
   [[nodiscard]] bool drain(std::chrono::steady_clock::time_point deadline);
 
  private:
+  /// The pool of the class. Blocks of one class never wait for threads of another.
   [[nodiscard]] Pool& poolOf(QualityOfService qualityOfService);
 
-  PendingWork pendingWork_;
-  Conditions conditions_;
-  Pool userInteractivePool_;
-  Pool utilityPool_;
-  Pool backgroundPool_;
-  TimerThread timers_;  // ends before the pools, whose threads it starts
-  const std::unique_ptr<WorkQueue> background_;
+  PendingWork pendingWork_;                      // of every pool and of the timers
+  Conditions conditions_;                        // has a lock of its own
+  Pool userInteractivePool_;                     // one thread wide: the server queue's
+  Pool utilityPool_;                             // the sessions' queues
+  Pool backgroundPool_;                          // `background_`'s
+  TimerThread timers_;                           // ends before the pools, whose threads it starts
+  const std::unique_ptr<WorkQueue> background_;  // concurrent; constant after construction
 };
 
 }  // namespace quarvel

@@ -19,6 +19,7 @@ namespace quarvel {
 /// Joins a connection and its calls: replies and progress of the calls go to the connection.
 /// Owner: the connection and each call, so it may outlive the connection.
 struct CallChannel {
+  /// I/O thread. `wakeConnection` becomes `wake`; it may outlive the connection.
   CallChannel(const Configuration::Limits& limits, std::function<void()> wakeConnection)
       : wake(std::move(wakeConnection)),
         replies(limits.replyBytes),
@@ -53,6 +54,7 @@ class Call final : public ReplySink, public CallTracker {
   void error(const Error& error) override {
     if (isFirstAnswer()) wakeIf(channel_->replies.addError(messageID_, error));
   }
+  /// The size of the frame.
   [[nodiscard]] std::size_t bytes() const override { return bytes_; }
 
  protected:
@@ -61,6 +63,7 @@ class Call final : public ReplySink, public CallTracker {
   void callCompleted() override { wakeIf(channel_->flow.callCompleted(bytes_)); }
 
  private:
+  /// Whether this answer is to be sent. Any thread; true once, for a notification never.
   [[nodiscard]] bool isFirstAnswer() {
     return !answered_.exchange(true, std::memory_order_relaxed);
   }
@@ -71,9 +74,9 @@ class Call final : public ReplySink, public CallTracker {
   // Constant after construction.
   const std::shared_ptr<CallChannel> channel_;
   const std::size_t bytes_;
-  const std::uint32_t messageID_;
+  const std::uint32_t messageID_;  // of a request
 
-  std::atomic<bool> answered_;
+  std::atomic<bool> answered_;  // or a notification, which has no answer
 };
 
 }  // namespace quarvel

@@ -14,6 +14,7 @@ namespace quarvel {
 class UniqueDescriptor {
  public:
   UniqueDescriptor() = default;
+  /// Takes over an open descriptor; a negative one is none.
   explicit UniqueDescriptor(int descriptor) : descriptor_(descriptor) {}
   UniqueDescriptor(UniqueDescriptor&& other) noexcept : descriptor_(other.release()) {}
   UniqueDescriptor& operator=(UniqueDescriptor&& other) noexcept {
@@ -26,9 +27,11 @@ class UniqueDescriptor {
     if (descriptor_ >= 0) ::close(descriptor_);
   }
 
+  /// The descriptor, still owned; negative when there is none.
   [[nodiscard]] int get() const { return descriptor_; }
   /// Gives the descriptor away.
   [[nodiscard]] int release() { return std::exchange(descriptor_, -1); }
+  /// Whether there is one.
   explicit operator bool() const { return descriptor_ >= 0; }
 
  private:
@@ -52,6 +55,7 @@ class ListeningSocket {
   /// Calls `removeFile`.
   ~ListeningSocket();
 
+  /// For accept(), until `releaseDescriptor`.
   [[nodiscard]] int descriptor() const { return descriptor_.get(); }
   /// Gives the descriptor away. This object still removes the file.
   [[nodiscard]] UniqueDescriptor releaseDescriptor() { return std::move(descriptor_); }

@@ -16,6 +16,7 @@ class ReadBuffer {
   /// The smallest block, 32 KiB: one read of a busy client.
   static constexpr std::size_t kSmallest = std::size_t{32} * 1024;
 
+  /// The bytes held, from the oldest; valid until the next `room` or `release`.
   [[nodiscard]] std::string_view bytes() const { return {block_.get() + begin_, end_ - begin_}; }
   [[nodiscard]] bool empty() const { return begin_ == end_; }
 
@@ -29,10 +30,10 @@ class ReadBuffer {
   void release();
 
  private:
-  std::unique_ptr<char[]> block_;
-  std::size_t capacity_ = 0;
-  std::size_t begin_ = 0;
-  std::size_t end_ = 0;
+  std::unique_ptr<char[]> block_;  // null while released
+  std::size_t capacity_ = 0;       // of `block_`, in bytes
+  std::size_t begin_ = 0;          // of the bytes held, from the start of `block_`
+  std::size_t end_ = 0;            // behind them
 };
 
 }  // namespace quarvel

@@ -24,7 +24,10 @@ struct Request {
 
 // Answers to a well-formed call that cannot be made: domain "quarvel.connection", with a reason
 // that tells the allowed values.
+
+/// Code 1: `interface` has no operation of this name. Null: the delegate has set none.
 [[nodiscard]] Error UnknownMethodError(const ExportedInterface* interface, std::string_view method);
+/// Code 2: arguments of the wrong number, kind or range, or too many targets.
 [[nodiscard]] Error BadArgumentsError(std::string reason);
 
 }  // namespace quarvel

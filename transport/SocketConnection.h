@@ -62,11 +62,19 @@ class SocketConnection final : public ClientConnection,
   [[nodiscard]] static std::shared_ptr<SocketConnection> create(
       std::shared_ptr<ConnectionContext> context, UniqueDescriptor socket, std::uint64_t number);
 
+  /// Of the process that connected, as the kernel tells at accept. Any thread.
   [[nodiscard]] std::int32_t processIdentifier() const override { return processIdentifier_; }
+  // Set by the delegate while it accepts the connection, before `resume`.
+
+  /// `exportedInterface` is constant and outlives the connection.
   void setExportedInterface(const ExportedInterface& exportedInterface) override;
+  /// Holds the object until the connection has ended.
   void setExportedObject(std::shared_ptr<ExportedObject> object) override;
+  /// Null before it is set and after the end.
   [[nodiscard]] std::shared_ptr<ExportedObject> exportedObject() const override;
+  /// Called once, before the invalidation handler, when the client broke the protocol.
   void setInterruptionHandler(std::function<void()> handler) override;
+  /// Called once, when the connection ends, however it ends.
   void setInvalidationHandler(std::function<void()> handler) override;
   /// Any thread.
   void resume() override;
@@ -107,15 +115,21 @@ class SocketConnection final : public ClientConnection,
   void onRepliesOrRoom();
   /// Writes all queued replies, with one write where the socket takes them.
   void flush();
+  /// Has `flush` called when the socket takes bytes again. At most one such wait is pending.
   void waitUntilWritable();
 
   // Time-outs: `limits.frame` for a partial message while the client could send the rest,
   // `limits.stall` while it reads no reply and the most replies are held.
 
+  /// Sets the deadline of a message that has begun, unless one is set.
   void watchFrame();
+  /// Waits for `frameDeadline_`, then ends the client or, if the deadline moved, waits on.
   void awaitFrameDeadline();
+  /// The message is complete, or the service itself holds the client back.
   void unwatchFrame();
+  /// Begins the stall time-out if the socket takes no bytes and the most replies are held.
   void watchStall();
+  /// The client has read replies.
   void unwatchStall();
   /// Exempts calls that wait for a slow backend from the limit on unstored calls, after a time.
   void watchSlowCalls();
@@ -143,17 +157,17 @@ class SocketConnection final : public ClientConnection,
 
   // The I/O thread's.
   asio::posix::stream_descriptor socket_;
-  bool open_ = true;
+  bool open_ = true;  // until `end`
   bool resumed_ = false;
   bool draining_ = false;  // the service ends: no limit applies to calls that have arrived
 
   bool reading_ = false;  // waits until the socket is readable
   ReadBuffer buffer_;
-  MessagePackScanner scanner_;
+  MessagePackScanner scanner_;           // of the first frame in `buffer_`
   std::vector<PayloadValue> arguments_;  // of the current call; a member to reuse its memory
 
   bool writing_ = false;  // waits until the socket is writable
-  std::string sending_;
+  std::string sending_;   // replies that were taken from the queue
   std::size_t sent_ = 0;  // bytes of `sending_`
 
   asio::steady_timer frameTimer_;

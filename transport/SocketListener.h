@@ -18,6 +18,7 @@ namespace quarvel {
 class SocketListener final : public ServiceListener {
  public:
   struct Options {
+    /// Of clients, calls, replies and time, for each connection.
     Configuration::Limits limits;
     /// Signals that end the service as `requestEnd` does; caught from construction on.
     std::vector<int> endSignals;
@@ -37,8 +38,10 @@ class SocketListener final : public ServiceListener {
   /// Errors: domain "quarvel.listener", when the kernel has no descriptor for an event loop.
   [[nodiscard]] static Result<std::unique_ptr<SocketListener>> create(ListeningSocket socket,
                                                                       Options options);
+  /// Removes the socket file. `resume` has returned, or was never called.
   ~SocketListener() override;
 
+  /// Before `resume`. The delegate decides about each client, on the I/O thread.
   void setDelegate(std::shared_ptr<ServiceListenerDelegate> delegate) override;
   /// Blocks until the service was told to end, every connection has ended and `atEnd` is done.
   void resume() override;
@@ -47,7 +50,7 @@ class SocketListener final : public ServiceListener {
   void requestEnd();
 
  private:
-  class Loop;
+  class Loop;  // the event loop and all state, so that the header names no library
   explicit SocketListener(std::unique_ptr<Loop> loop);
 
   const std::unique_ptr<Loop> loop_;

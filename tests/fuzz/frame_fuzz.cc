@@ -29,18 +29,17 @@ constexpr unsigned kDeepest = 32;
 /// Reads one MessagePack value, written from the format's description.
 class Reader {
  public:
-  enum class Finding { whole, cut, wrong };
   explicit Reader(std::string_view bytes) : bytes_(bytes) {}
 
-  Finding skip(unsigned depth = 0) {
+  Progress skip(unsigned depth = 0) {
     const auto first = take(1);
-    if (!first) return Finding::cut;
+    if (!first) return Progress::incomplete;
     const unsigned code = static_cast<unsigned char>(first->front());
-    if (code <= 0x7f || code >= 0xe0) return Finding::whole;
+    if (code <= 0x7f || code >= 0xe0) return Progress::complete;
     if (code <= 0x8f) return items(2 * (code & 0x0f), depth);
     if (code <= 0x9f) return items(code & 0x0f, depth);
     if (code <= 0xbf) return rest(code & 0x1f);
-    if (code == 0xc1) return Finding::wrong;
+    if (code == 0xc1) return Progress::fault;
     // For each code from 0xc0: the octets of the length, the octets that follow besides, and the
     // items for each unit of length, or 0 if the length counts octets.
     constexpr struct {
@@ -52,7 +51,7 @@ class Reader {
                   {2, 0, 1}, {4, 0, 1}, {2, 0, 2}, {4, 0, 2}};
     const auto& [octets, more, times] = kForms[code - 0xc0];
     const auto length = number(octets);
-    if (!length) return Finding::cut;
+    if (!length) return Progress::incomplete;
     return times > 0 ? items(*length * times, depth) : rest(*length + more);
   }
   [[nodiscard]] std::size_t position() const { return position_; }
@@ -70,13 +69,15 @@ class Reader {
     for (const char octet : *taken) result = result * 256 + static_cast<unsigned char>(octet);
     return result;
   }
-  Finding rest(std::size_t count) { return take(count) ? Finding::whole : Finding::cut; }
-  Finding items(std::size_t count, unsigned depth) {
-    if (depth + 1 > kDeepest) return Finding::wrong;
+  Progress rest(std::size_t count) {
+    return take(count) ? Progress::complete : Progress::incomplete;
+  }
+  Progress items(std::size_t count, unsigned depth) {
+    if (depth + 1 > kDeepest) return Progress::fault;
     for (; count > 0; --count) {
-      if (const Finding item = skip(depth + 1); item != Finding::whole) return item;
+      if (const Progress item = skip(depth + 1); item != Progress::complete) return item;
     }
-    return Finding::whole;
+    return Progress::complete;
   }
 
   std::string_view bytes_;
@@ -94,13 +95,11 @@ void Decode(ReadBuffer& buffer, MessagePackScanner& scanner, Decoded& decoded) {
     const std::string_view bytes = buffer.bytes();
     const Progress progress = scanner.scan(bytes);
     if (progress == Progress::incomplete) return;
-    std::string_view fault;
-    const auto request = progress == Progress::complete
-                             ? Request::from(PayloadValue(bytes.data()), fault)
-                             : std::nullopt;
+    std::string_view fault = scanner.fault();
+    std::optional<Request> request;
+    if (progress == Progress::complete) request = Request::from(PayloadValue(bytes.data()), fault);
     if (!request) {
-      Require(progress == Progress::complete ? !fault.empty() : !scanner.fault().empty(),
-              "a fault has a reason");
+      Require(!fault.empty(), "a fault has a reason");
       decoded.faulty = true;
       return;
     }
@@ -135,17 +134,16 @@ void CompareWithReader(std::string_view stream) {
   MessagePackScanner scanner(kLargest, kDeepest);
   Reader reader(stream);
   const Progress progress = scanner.scan(stream);
-  const Reader::Finding finding = reader.skip();
-  if (progress == Progress::complete) {
-    Require(finding == Reader::Finding::whole, "a complete value is whole");
-    Require(scanner.length() == reader.position(), "both see the same end");
-    Require(scanner.length() <= kLargest, "no value is larger than allowed");
-  } else if (progress == Progress::incomplete) {
-    Require(finding == Reader::Finding::cut, "an incomplete value is cut");
-  } else {
-    Require(finding != Reader::Finding::whole || reader.position() > kLargest,
-            "a whole value of an allowed size is no fault");
+  const Progress expected = reader.skip();
+  if (progress == Progress::fault) {
+    Require(expected != Progress::complete || reader.position() > kLargest,
+            "a complete value of an allowed size is no fault");
+    return;
   }
+  Require(progress == expected, "both see a complete value, or both an incomplete one");
+  if (progress == Progress::incomplete) return;
+  Require(scanner.length() == reader.position(), "both see the same end");
+  Require(scanner.length() <= kLargest, "no value is larger than allowed");
 }
 
 }  // namespace

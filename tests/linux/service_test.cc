@@ -1,11 +1,14 @@
 #include "linux/Service.h"
 
 #include <gmock/gmock.h>
+#include <pthread.h>
 #include <sqlite3.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <array>
 #include <chrono>
+#include <cmath>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -18,6 +21,8 @@
 #include "Statistics/Service/ZQReportingServiceDelegate.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Log.h"
+#include "platform/Process.h"
+#include "platform/Random.h"
 #include "tests/TemporaryDirectory.h"
 #include "tests/UnixSocket.h"
 
@@ -39,73 +44,60 @@ std::ptrdiff_t threadCount() {
 std::string valueIn(const std::filesystem::path& store, const char* query) {
   sqlite3* connection = nullptr;
   EXPECT_EQ(sqlite3_open(store.c_str(), &connection), SQLITE_OK);
-  std::string value = "no row";
+  std::string value;
   const auto keep = [](void* out, int, char** values, char**) {
     *static_cast<std::string*>(out) = values[0] == nullptr ? "null" : values[0];
     return 0;
   };
-  EXPECT_EQ(sqlite3_exec(connection, query, keep, &value, nullptr), SQLITE_OK)
-      << sqlite3_errmsg(connection);
+  EXPECT_EQ(sqlite3_exec(connection, query, keep, &value, nullptr), SQLITE_OK);
   sqlite3_close(connection);
   return value;
 }
 
 /// The environment of one service, and a client's view of it.
-class ServiceTest : public ::testing::Test {
- protected:
-  struct Run {
-    TemporaryDirectory directory;
-    std::string status;
-    std::string log;
-  };
-
-  static void setEnvironment(const std::filesystem::path& directory) {
+struct Life {
+  Life() {
     for (const char* name : {"RUNTIME_DIRECTORY", "STATE_DIRECTORY", "CONFIGURATION_DIRECTORY"}) {
-      ::setenv(name, directory.c_str(), 1);
+      ::setenv(name, directory.path().c_str(), 1);
     }
     ::unsetenv("QUARVEL_SOCKET");
   }
 
   /// Runs a service from its start to its end; `use` is given a client on another thread.
   template <class Use>
-  static void serve(Run& run, Use use) {
-    setEnvironment(run.directory.path());
+  void serve(Use use) {
     Service service;
     std::thread outside([&] {
-      auto client = Client::connect((run.directory.path() / "reporting.sock").native());
+      auto client = Client::connect((directory.path() / "reporting.sock").native());
       EXPECT_TRUE(client) << client.error().description();
       if (client) use(client.value());
-      run.status = statusOf(run);
+      directory.write("notify/tarnwick.quarvel.status", "");
+      const auto patience = steady_clock::now() + 30s;
+      while (status.empty() && steady_clock::now() < patience) {
+        std::ifstream file(directory.path() / "status.json");
+        status.assign(std::istreambuf_iterator<char>(file), {});
+      }
       service.listener().requestEnd();
     });
     EXPECT_EQ(ServiceMain(), 0);
     outside.join();
   }
 
-  /// Asks for the status by the notification, and waits for the file.
-  static std::string statusOf(const Run& run) {
-    run.directory.write("notify/tarnwick.quarvel.status", "");
-    const auto patience = steady_clock::now() + 30s;
-    std::string text;
-    while (text.empty() && steady_clock::now() < patience) {
-      std::ifstream file(run.directory.path() / "status.json");
-      text.assign(std::istreambuf_iterator<char>(file), {});
-    }
-    return text;
-  }
+  TemporaryDirectory directory;
+  std::string status;  // asked for by the notification
+  std::string log;
 };
 
 // Queues, log, notifications, counters and store of the second must be its own.
-TEST_F(ServiceTest, TwoServicesRunOneAfterTheOtherInOneProcess) {
+TEST(ServiceTest, TwoServicesRunOneAfterTheOtherInOneProcess) {
   const auto threads = threadCount();
-  Run runs[2];
-  for (Run& run : runs) {
+  for (const std::int64_t number : {1, 2}) {
+    Life run;
     run.directory.write(
         "quarvel.toml",
         "[orientation]\nsource = \"files\"\n[device]\nDeviceClassNumber = 4\n[lgo]\n");
-    const std::int64_t number = 1 + (&run - runs);
     ::testing::internal::CaptureStderr();
-    serve(run, [number](Client& client) {
+    run.serve([number](Client& client) {
       EXPECT_EQ(DevicePropertyInteger("DeviceClassNumber"), 4);
       EXPECT_FALSE(DevicePropertyBoolean("DeviceClassNumber"));
       EXPECT_FALSE(DevicePropertyBoolean("Absent"));
@@ -121,15 +113,10 @@ TEST_F(ServiceTest, TwoServicesRunOneAfterTheOtherInOneProcess) {
     });
     run.log = ::testing::internal::GetCapturedStderr();
     EXPECT_EQ(Service::running(), nullptr);
-  }
-  for (const Run& run : runs) {
-    const std::string number = std::to_string(1 + (&run - runs));
-    const std::filesystem::path store = run.directory.path() / "telemetry.db";
-    for (const char* key : {"run", "late"}) {
-      const std::string messages =
-          std::string("SELECT group_concat(json_extract(payload, '$.") + key + "')) FROM message";
-      EXPECT_EQ(valueIn(store, messages.c_str()), number) << key;
-    }
+    EXPECT_EQ(valueIn(run.directory.path() / "telemetry.db",
+                      "SELECT group_concat(json_extract(payload, '$.run')) || ' ' || "
+                      "group_concat(json_extract(payload, '$.late')) FROM message"),
+              std::to_string(number) + " " + std::to_string(number));
     EXPECT_THAT(run.status, HasSubstr("\"healthy\":true"));
     EXPECT_THAT(run.status, HasSubstr("\"clients\":1,"));
     EXPECT_THAT(run.log, HasSubstr("quarvel.toml:5: lgo is no key of ours."));
@@ -140,9 +127,9 @@ TEST_F(ServiceTest, TwoServicesRunOneAfterTheOtherInOneProcess) {
   EXPECT_EQ(threadCount(), threads) << "threads of the services are left";
 }
 
-TEST_F(ServiceTest, StartsNotAtAllWithoutItsSocketOrItsConfiguration) {
-  const TemporaryDirectory directory;
-  setEnvironment(directory.path());
+TEST(ServiceTest, StartsNotAtAllWithoutItsSocketOrItsConfiguration) {
+  const Life run;
+  const TemporaryDirectory& directory = run.directory;
   const int other = BoundSocket(directory.path() / "reporting.sock", SOCK_STREAM);
   ASSERT_EQ(::listen(other, 1), 0);
   EXPECT_EXIT(Service(), ::testing::ExitedWithCode(1), "another service is listening there");
@@ -153,7 +140,7 @@ TEST_F(ServiceTest, StartsNotAtAllWithoutItsSocketOrItsConfiguration) {
   EXPECT_EXIT(Service(), ::testing::ExitedWithCode(1), "quarvel.toml:2: log.level");
 }
 
-TEST_F(ServiceTest, LogsToStandardErrorWithoutAService) {
+TEST(ServiceTest, LogsToStandardErrorWithoutAService) {
   ZQ_FUNCTION("before");
   ::testing::internal::CaptureStderr();
   ZQ_LOG(nullptr, standard, "a line");
@@ -161,6 +148,28 @@ TEST_F(ServiceTest, LogsToStandardErrorWithoutAService) {
   const std::string text = ::testing::internal::GetCapturedStderr();
   EXPECT_THAT(text, HasSubstr("before: a line\n"));
   EXPECT_THAT(text, Not(HasSubstr("below")));
+}
+
+// Folding 2^32 numbers onto this bound without care makes the lowest third twice as likely.
+TEST(RandomTest, IsUniformWhereTheBoundDoesNotDivideTheRange) {
+  constexpr std::uint32_t kThird = std::uint32_t{1} << 30;
+  constexpr int kDraws = 200'000;
+  std::array<int, 3> thirds{};
+  for (int i = 0; i < kDraws; ++i) ++thirds.at(RandomBelow(3 * kThird) / kThird);
+  for (const int count : thirds) EXPECT_NEAR(count, kDraws / 3, 7 * std::sqrt(kDraws * 2 / 9.0));
+}
+
+TEST(ProcessTest, NamesProcessesByTheirShortCommandNameIfItIsText) {
+  EXPECT_EQ(OwnProcessIdentifier(), getpid());
+  EXPECT_EQ(OwnProcessName(), "service_test");
+  EXPECT_EQ(ProcessCommandName(getpid()), "service_test");
+  for (const int none : {0, -5, 0x7fffffff}) EXPECT_EQ(ProcessCommandName(none), std::nullopt);
+  std::thread([] {
+    pthread_setname_np(pthread_self(), "caf\xc3\xa9 x\n");
+    EXPECT_EQ(ProcessCommandName(gettid()), "caf\xc3\xa9 x\n");
+    pthread_setname_np(pthread_self(), "\xff\xfe");
+    EXPECT_EQ(ProcessCommandName(gettid()), std::nullopt);
+  }).join();
 }
 
 }  // namespace

@@ -17,6 +17,12 @@ FlowInstant Clock() {
 /// Calls of one byte each.
 class CallFlowTest : public ::testing::Test {
  protected:
+  void execute(std::size_t calls, std::chrono::nanoseconds each) {
+    for (; calls > 0; --calls) {
+      flow_.blockRan(each);
+      wakes_ += flow_.callExecuted() ? 1 : 0;
+    }
+  }
   /// Takes calls in until the limit. With `executed`, each is executed at once and stays unstored.
   std::size_t fill(bool executed = false) {
     std::size_t calls = 0;
@@ -25,12 +31,6 @@ class CallFlowTest : public ::testing::Test {
       if (executed) execute(1, 1us);
     }
     return calls;
-  }
-  void execute(std::size_t calls, std::chrono::nanoseconds each) {
-    for (; calls > 0; --calls) {
-      flow_.blockRan(each);
-      wakes_ += flow_.callExecuted() ? 1 : 0;
-    }
   }
   void complete(std::size_t calls) {
     for (; calls > 0; --calls) wakes_ += flow_.callCompleted(1) ? 1 : 0;
@@ -63,23 +63,20 @@ TEST_F(CallFlowTest, TurnFollowsTheTimeOfCallsAndGrowsAgain) {
 }
 
 TEST_F(CallFlowTest, UnstoredLimitFollowsTheStoreAndGrowsAgain) {
-  const struct {
-    std::chrono::nanoseconds took;
-    std::size_t limit;
-  } steps[] = {
+  const std::pair<std::chrono::nanoseconds, std::size_t> steps[] = {
       {2001us, 64}, {2000us, 64}, {5s, 32},     {500us, 32}, {499us, 64},
       {1us, 128},   {1us, 128},   {2001us, 64}, {3ms, 32},   {3ms, 16},
       {3ms, 8},     {3ms, 4},     {3ms, 2},     {3ms, 1},    {3ms, 1},
   };
   std::size_t limit = fill(true);
   EXPECT_EQ(limit, 128U);
-  for (const auto& step : steps) {
-    now += step.took;
+  for (const auto& [took, newLimit] : steps) {
+    now += took;
     complete(limit - limit / 2 - 1);
     EXPECT_TRUE(flow_.mustWait(Clock)) << "less than half is stored";
     complete(limit / 2 + 1);
     limit = fill(true);
-    EXPECT_EQ(limit, step.limit) << step.took.count() << " ns";
+    EXPECT_EQ(limit, newLimit) << took.count() << " ns";
   }
 }
 
