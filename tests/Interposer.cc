@@ -23,7 +23,6 @@ namespace {
 constexpr std::size_t kFrameHeadBytes = 24;
 
 std::atomic<bool> watchingFiles{false};
-thread_local bool onThread = false;  // whether this one is watched
 
 bool IsLog(std::string_view path) {
   return path.ends_with("-wal");
@@ -36,11 +35,6 @@ bool IsCommit(std::string_view bytes) {
 
 }  // namespace
 
-Interposer& Interposer::instance() {
-  static Interposer& interposer = *new Interposer;
-  return interposer;
-}
-
 Interposer& Interposer::watch(const std::filesystem::path& directory) {
   Interposer& all = instance();
   const MutexLock lock(all.mutex_);
@@ -48,14 +42,6 @@ Interposer& Interposer::watch(const std::filesystem::path& directory) {
   all.released_.notifyAll();
   watchingFiles = !directory.empty();
   return all;
-}
-
-Interposer::WatchedThread::WatchedThread() {
-  onThread = true;
-}
-
-Interposer::WatchedThread::~WatchedThread() {
-  onThread = false;
 }
 
 void Interposer::release() {
@@ -71,12 +57,6 @@ void Interposer::passHold(Purpose purpose) {
   ++data_.held;
   const std::size_t before = data_.releases;
   while (data_.releases == before) released_.wait(mutex_);
-}
-
-std::vector<Interposer::Change> Interposer::takeRecord() {
-  const MutexLock lock(mutex_);
-  data_.recording = false;
-  return std::exchange(data_.record, {});
 }
 
 void Interposer::changed(Change change) {

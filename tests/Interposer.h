@@ -17,19 +17,24 @@
 
 namespace quarvel::testing {
 
+inline thread_local bool onThread = false;  // whether this thread is watched
+
 /// Stands between this program, SQLite included, and the C library: counts and records calls, holds
 /// them up, makes them fail. Watches calls for files below one directory, and all calls of threads
 /// that ask for it. One for the process, never destroyed; any thread.
 class Interposer {
  public:
-  [[nodiscard]] static Interposer& instance();
+  [[nodiscard]] static Interposer& instance() {
+    static Interposer& interposer = *new Interposer;
+    return interposer;
+  }
   /// Forgets everything and watches files below `directory` that are opened from now on; no files
   /// when it is empty.
   static Interposer& watch(const std::filesystem::path& directory = {});
   /// Watches all calls of the thread on which it lives.
   struct WatchedThread {
-    WatchedThread();
-    ~WatchedThread();
+    WatchedThread() { onThread = true; }
+    ~WatchedThread() { onThread = false; }
     WatchedThread(const WatchedThread&) = delete;
     WatchedThread& operator=(const WatchedThread&) = delete;
   };
@@ -88,7 +93,10 @@ class Interposer {
   void record() { set(&Data::recording, true); }
   void mark(off_t promise) { changed({.kind = Change::Kind::mark, .offset = promise}); }
   /// Ends the record.
-  [[nodiscard]] std::vector<Change> takeRecord();
+  [[nodiscard]] std::vector<Change> takeRecord() {
+    set(&Data::recording, false);
+    return get(&Data::record);
+  }
 
  private:
   friend struct StandIns;  // the C library's functions
