@@ -13,6 +13,7 @@ EventQueue::EventQueue(std::shared_ptr<TelemetryStore> store)
 
 template <class Add>
 void EventQueue::enqueue(Add add) {
+  // Before the call: from now on later events queue up behind this one.
   ++waiting_;
   queue_->async([this, add = std::move(add)] {
     add();

@@ -23,12 +23,18 @@ namespace quarvel {
 /// Owned by the service; must outlive the events it has queued. Any thread.
 class EventQueue {
  public:
+  /// Shares the store; its serial queue runs at utility priority.
   explicit EventQueue(std::shared_ptr<TelemetryStore> store);
 
+  // Any thread; never wait for room. A refusal (store closed, event too large) is counted by the
+  // store and reported to no caller. Events of one caller are stored in the order of its calls.
+
   void addAnalyticsEvent(std::string_view name, const Payload& payload);
+  /// `domain` is stored as given.
   void addPowerEvent(std::int32_t domain, std::string_view name, const Payload& payload);
 
  private:
+  /// Runs `add` on the serial queue, where it may wait for room.
   template <class Add>
   void enqueue(Add add);
 
@@ -46,7 +52,8 @@ class AnalyticsEventSink {
   /// event that matches none is not wanted.
   AnalyticsEventSink(EventQueue& queue, std::vector<std::string> wanted);
 
-  /// Implements `VistrelSendEventLazy`.
+  /// Implements `VistrelSendEventLazy`: calls `payload` at once, on this thread, and only for an
+  /// event that is wanted.
   void sendEventLazy(std::string_view name, const std::function<Payload()>& payload);
 
  private:
@@ -54,7 +61,7 @@ class AnalyticsEventSink {
 
   EventQueue& queue_;
   const std::vector<std::string> wanted_;
-  const bool wantsAll_;
+  const bool wantsAll_;  // "*" is among them, so that no pattern has to be tried
 };
 
 }  // namespace quarvel

@@ -4,9 +4,10 @@ namespace quarvel {
 
 namespace {
 
-constexpr std::size_t kKeptText = 1
-                                  << 20;  // memory beyond this is freed after a burst of long texts
+// Memory for texts beyond 1 MiB is freed after a burst of long ones.
+constexpr std::size_t kKeptText = 1 << 20;
 
+// The part of a row whose length is not in `texts`; null when there is none.
 const Payload* PayloadOf(const AgentSessionRow& row) {
   return &row.userInfo;
 }
@@ -51,6 +52,7 @@ const std::function<void(const std::optional<Error>&)>* StoreBatch::completion(
 }
 
 bool StoreBatch::isCounted(const StoreRow& row) {
+  // Rows of clients alone: neither sessions nor requests to the writer.
   return !std::holds_alternative<AgentSessionRow>(row) &&
          !std::holds_alternative<ErasureRow>(row) && completion(row) == nullptr;
 }

@@ -29,7 +29,7 @@ namespace quarvel {
 class StoreDatabase {
  public:
   struct Options {
-    std::filesystem::path path;
+    std::filesystem::path path;  // of the database file
     Retention::Bounds bounds;
     int logPages = 1024;  // see `TelemetryStore::Options::logPages`
     /// Known from an earlier opening in this process: ids that were given, rows that were removed.
@@ -37,7 +37,7 @@ class StoreDatabase {
     StoreDrops knownDrops{};
   };
 
-  /// Calls `OpenStore` and logs its notices.
+  /// Calls `OpenStore` and logs its notices. `isSuspect`: as for `OpenStore`. Waits for the medium.
   [[nodiscard]] static Result<std::unique_ptr<StoreDatabase>> open(const Options& options, Date now,
                                                                    bool isSuspect);
   StoreDatabase(const StoreDatabase&) = delete;
@@ -71,9 +71,9 @@ class StoreDatabase {
   /// Returns when the task in flight has ended, with or without success.
   void waitForSync();
   struct SyncResult {
-    bool durable;  // everything committed when the task began
-    StoreIDs ids;  // the last ids at that time
-    bool syncFailed;
+    bool durable;     // everything committed when the task began
+    StoreIDs ids;     // the last ids at that time
+    bool syncFailed;  // the task was a sync, and not a checkpoint
   };
   /// The result of a task that has ended.
   [[nodiscard]] std::optional<SyncResult> takeSyncResult();
@@ -110,25 +110,33 @@ class StoreDatabase {
 
  private:
   StoreDatabase(SqliteConnection connection, const Options& options);
+  /// Prepares the statements, reads ids and counts, adds the ids and drops that only this process
+  /// knows. False when it failed.
   [[nodiscard]] bool prepare(const Options& options, Date now);
   [[nodiscard]] bool readLastIDs();
   /// Writes ids and drops that this process knows and the file does not.
   [[nodiscard]] bool addKnown(const Options& options);
   [[nodiscard]] std::string message() const;
 
+  /// Begins a transaction that commits as `synchronous`.
   bool begin(Synchronous synchronous);
+  // In the open transaction; false when a statement failed.
   bool insert(const StoreBatch& batch, const AgentSessionRow& row);
   bool insert(const StoreBatch& batch, const MessageRow& row);
   bool insert(const StoreBatch& batch, const AnalyticsEventRow& row);
   bool insert(const StoreBatch& batch, const PowerEventRow& row);
   bool insert(const StoreBatch& batch, const FlushRow& row);
+  /// Writes the counts in `meta` that differ from the file's.
   bool keepDrops(const StoreDrops& drops);
   bool insert(const StoreBatch& batch, const ExportedRow& row);
   bool insert(const StoreBatch&, const ErasureRow&) { return true; }
   [[nodiscard]] bool logIsLong() const;
   void beginTask(StoreSyncer::Task task);
+  /// Runs the task in flight on this thread, for lack of a thread or a descriptor.
   void runTaskHere();
+  /// Notes how much of the log a task has moved, and whether its sync failed.
   void taskEnded(const StoreSyncer::TaskResult& result);
+  /// A payload as JSON text; valid until the next call.
   std::string_view json(const Payload& payload);
   /// The id in the file of a session that may have a provisional one.
   [[nodiscard]] std::int64_t storedID(std::int64_t session) const;
@@ -139,9 +147,10 @@ class StoreDatabase {
   SqliteStatement markFlushed_, keepDrops_;
   SqliteStatement moveCursor_, writeLedger_, trimLedger_;
   Synchronous synchronous_ = Synchronous::normal;  // the connection's setting
-  const int logPages_;
-  const int longestLogPages_;
-  bool logIsTooLong_ = false;
+  const int logPages_;                             // from here on the log is moved
+  const int
+      longestLogPages_;  // from here on rows wait: a reader keeps the log from beginning again
+  bool logIsTooLong_ = false;  // it has reached that length
   // The log at the last checkpoint.
   int checkpointedPages_ = 0;  // its length when that began
   int movedPages_ = 0;
@@ -160,8 +169,8 @@ class StoreDatabase {
   std::function<void()> onSyncDone_ = [] {};
   std::unique_ptr<StoreSyncer> syncer_;  // null before it is needed
   struct InFlight {
-    StoreIDs ids;
-    std::optional<StoreSyncer::TaskResult> result;
+    StoreIDs ids;                                   // the last committed ones at its beginning
+    std::optional<StoreSyncer::TaskResult> result;  // once it has ended
     StoreSyncer::Task task;
   };
   std::optional<InFlight> inFlight_;

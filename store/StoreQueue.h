@@ -24,6 +24,7 @@ class StoreQueue {
  public:
   using Instant = StoreBatch::Instant;
 
+  /// `maximumRows`: the upper end of the bound that `StoreDepth` learns.
   StoreQueue(std::size_t maximumRows, std::size_t maximumBytes)
       : maximumBytes_(maximumBytes), depth_(maximumRows) {}
 
@@ -73,6 +74,7 @@ class StoreQueue {
 
   // Counts of messages that are accepted and not pushed yet. Any thread; never blocks.
 
+  /// A message was accepted and will be pushed later, or dropped.
   void countAccepted() { ++unqueued_; }
   /// An accepted message was pushed or refused.
   void countQueued() { --unqueued_; }
@@ -82,6 +84,7 @@ class StoreQueue {
   /// Refuses further rows and wakes every waiting thread; messages that are accepted and not pushed
   /// count as dropped. Any thread.
   void close() QUARVEL_EXCLUDES(mutex_);
+  /// Whether `close` was called. Any thread; may be out of date on return.
   [[nodiscard]] bool isClosed() const QUARVEL_EXCLUDES(mutex_);
 
   // The writer's, except where any thread is named.
@@ -99,9 +102,10 @@ class StoreQueue {
   /// Amounts that count against the bounds; `counted` of the rows are counted from acceptance on.
   struct Tally {
     std::size_t rows = 0;
-    std::size_t bytes = 0;
+    std::size_t bytes = 0;  // as `StoreBatch::bytes`
     std::size_t counted = 0;
 
+    /// Adds one row of a batch.
     void add(const StoreRow& row);
   };
   // Makes room: rows that were taken are now in the database, in a transaction of `time`, or lost.
@@ -113,6 +117,7 @@ class StoreQueue {
   /// Stored rows were removed from the database: they count as dropped instead of stored.
   void droppedFromStore(StoreDrop reason, std::uint64_t rows) QUARVEL_EXCLUDES(mutex_);
 
+  /// In every result accepted = stored + waiting + dropped. Any thread.
   [[nodiscard]] StoreCounters counters() const QUARVEL_EXCLUDES(mutex_);
   /// Rows and bytes that count against the bounds now.
   [[nodiscard]] Tally outstanding() const QUARVEL_EXCLUDES(mutex_);
@@ -124,6 +129,7 @@ class StoreQueue {
   void awaitRoom() QUARVEL_REQUIRES(mutex_);
   /// Counts a refused row (`counted` is 0 or 1) and tells why it is refused.
   Error refuse(std::uint64_t counted) QUARVEL_REQUIRES(mutex_);
+  /// Counts rows as accepted and dropped: they will not be queued.
   void dropAccepted(StoreDrop reason, std::uint64_t rows) QUARVEL_REQUIRES(mutex_);
   /// Rows no longer count against the bounds.
   void release(const Tally& tally) QUARVEL_REQUIRES(mutex_);
@@ -134,6 +140,7 @@ class StoreQueue {
     waiting_.append(std::forward<Row>(row), texts);
     appended();
   }
+  /// Counts the row that was appended last and wakes the writer.
   void appended() QUARVEL_REQUIRES(mutex_);
 
   const std::size_t maximumBytes_;
@@ -145,12 +152,12 @@ class StoreQueue {
   ConditionVariable roomFree_;  // senders wait
   ConditionVariable closing_;   // the writer waits for space on the disk
   bool closed_ QUARVEL_GUARDED_BY(mutex_) = false;
-  bool writerWaits_ QUARVEL_GUARDED_BY(mutex_) = false;
-  bool called_ QUARVEL_GUARDED_BY(mutex_) = false;
+  bool writerWaits_ QUARVEL_GUARDED_BY(mutex_) = false;  // for rows: `appended` has to wake it
+  bool called_ QUARVEL_GUARDED_BY(mutex_) = false;       // and `take` has not returned since
   std::size_t waitingSenders_ QUARVEL_GUARDED_BY(mutex_) = 0;
-  StoreBatch waiting_ QUARVEL_GUARDED_BY(mutex_);
-  Tally outstanding_ QUARVEL_GUARDED_BY(mutex_);  // queued, or taken and not yet committed
-  StoreDepth depth_ QUARVEL_GUARDED_BY(mutex_);
+  StoreBatch waiting_ QUARVEL_GUARDED_BY(mutex_);  // rows that `take` has not given out
+  Tally outstanding_ QUARVEL_GUARDED_BY(mutex_);   // queued, or taken and not yet committed
+  StoreDepth depth_ QUARVEL_GUARDED_BY(mutex_);    // the bound on rows, from the time of commits
   StoreCounters counters_ QUARVEL_GUARDED_BY(mutex_);  // without `unqueued_`
 };
 

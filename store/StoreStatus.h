@@ -10,7 +10,8 @@
 
 namespace quarvel {
 
-/// The service's present numbers, in the order of `Gauge`.
+/// The service's present numbers, in the order of `Gauge`. Written by any thread; the status reads
+/// each by itself, so that together they may not be of one moment.
 using Gauges = std::array<std::atomic<std::int64_t>, 3>;
 
 /// Adds the store, its queue and its counters, and the service's gauges, to the status. The status

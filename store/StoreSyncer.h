@@ -20,6 +20,7 @@ namespace quarvel {
 /// file is closed or a sync fails.
 class StoreSyncer {
  public:
+  /// `sync`: syncs the log. `checkpoint`: syncs it and moves it into the database file.
   enum class Task : std::uint8_t { sync, checkpoint };
   struct TaskResult {
     Task task;
@@ -43,12 +44,14 @@ class StoreSyncer {
 
   /// Only after the result of the task before has been taken.
   void begin(Task task) QUARVEL_EXCLUDES(mutex_);
+  /// The result of a task that has ended; none while it runs, and once it was taken.
   [[nodiscard]] std::optional<TaskResult> takeResult() QUARVEL_EXCLUDES(mutex_);
   /// Returns when no task is in flight.
   void wait() QUARVEL_EXCLUDES(mutex_);
 
  private:
   StoreSyncer(SqliteConnection connection, std::function<void()> done);
+  /// The thread: waits for tasks until the destructor.
   void run() QUARVEL_EXCLUDES(mutex_);
   [[nodiscard]] TaskResult runTask(Task task);
 

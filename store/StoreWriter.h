@@ -27,13 +27,14 @@ namespace quarvel {
 /// for `problem` and `followDurableExtent`.
 class StoreWriter {
  public:
+  /// See `TelemetryStore::Options`.
   struct Options {
     StoreDatabase::Options database;
     std::chrono::milliseconds sync{1000};
-    BackOff::Bounds backOff;
+    BackOff::Bounds backOff;  // between attempts
     std::chrono::days maximumAge{14};
     std::chrono::milliseconds ageing{std::chrono::hours{1}};
-    std::function<Date()> clock;
+    std::function<Date()> clock;  // never empty
   };
 
   /// `database` is null when the file could not be opened, for the reason `failure`, and has to be
@@ -56,36 +57,47 @@ class StoreWriter {
 
   /// When work is due although no row comes.
   [[nodiscard]] std::optional<Instant> nextDeadline() const;
+  /// Begins a new file in place of a corrupt one; one step of erasure and one of removal.
   void atDeadline();
+  /// Takes the result of a task that has ended and begins the sync or checkpoint that is due.
   void pollSync();
   void waitForSync();
 
+  /// Commits a batch, one transaction for each 1,024 rows; an erasure ends its transaction.
   void write(const StoreBatch& batch);
   /// Commits rows and retries until it succeeds. False when the store was closed before.
   bool writeRows(const StoreBatch& batch, std::size_t first, std::size_t last);
+  /// One attempt; false when it failed, with nothing written.
   [[nodiscard]] bool tryToWrite(const StoreBatch& batch, std::size_t first, std::size_t last);
+  /// Whether the commit has to be durable by itself, instead of by a later sync.
   [[nodiscard]] bool needsFullCommit(const StoreBatch& batch, std::size_t last) const;
+  /// Calls the completions of rows that are committed, or lost with `error`.
   void completeRows(const StoreBatch& batch, std::size_t first, std::size_t last,
                     const std::optional<Error>& error);
+  /// The store was closed before rows `first` and later were committed: counts them as lost.
   void loseRows(const StoreBatch& batch, std::size_t first);
 
   /// One step of the first erasure.
   void erase();
+  /// Calls the first erasure's completion; the next one becomes the first.
   void endErasure(const Result<std::int64_t>& rows);
 
   /// Opens the file again.
   [[nodiscard]] bool reopen(bool isSuspect);
+  /// Has durability and ageing work on an opened file, and the queue take over its counts.
   void use(std::unique_ptr<StoreDatabase> database);
   /// After a failure: closes a file that turns out to be corrupt. The next opening sets it aside.
   void closeIfCorrupt();
+  /// Closes the file; keeps the ids and drops that the next opening has to know.
   void close();
   /// Rows in a file that was removed or renamed would be lost with its last descriptor.
   void restoreFileIfGone();
+  /// The end: refuses erasures, syncs, completes the flushes and closes the file.
   void finish();
 
   struct PendingErasure {
     ErasureRow wanted;
-    StoreIDs through;
+    StoreIDs through;  // rows that were added later stay
   };
 
   const Options options_;

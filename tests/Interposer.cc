@@ -12,10 +12,9 @@
 #include <unistd.h>
 
 #include <atomic>
-#include <cerrno>
 #include <cstdarg>
 #include <cstring>
-#include <utility>
+#include <string_view>
 
 namespace quarvel::testing {
 
@@ -24,7 +23,6 @@ namespace {
 constexpr std::size_t kFrameHeadBytes = 24;
 
 std::atomic<bool> watchingFiles{false};
-thread_local bool watchingThread = false;
 
 bool IsLog(std::string_view path) {
   return path.ends_with("-wal");
@@ -37,415 +35,301 @@ bool IsCommit(std::string_view bytes) {
 
 }  // namespace
 
-Interposer& Interposer::instance() {
-  static Interposer& interposer = *new Interposer;
-  return interposer;
-}
-
 Interposer& Interposer::watch(const std::filesystem::path& directory) {
-  instance().reset(directory);
+  Interposer& all = instance();
+  const MutexLock lock(all.mutex_);
+  all.data_ = {.directory = directory.string(), .releases = all.data_.releases + 1};
+  all.released_.notifyAll();
   watchingFiles = !directory.empty();
-  return instance();
-}
-
-Interposer::WatchedThread::WatchedThread() {
-  watchingThread = true;
-}
-
-Interposer::WatchedThread::~WatchedThread() {
-  watchingThread = false;
-}
-
-bool Interposer::watchesThread() {
-  return watchingThread;
-}
-
-void Interposer::reset(const std::filesystem::path& directory) {
-  MutexLock lock(mutex_);
-  directory_ = directory.string();
-  open_.clear();
-  counts_ = {};
-  releaseHeld();
-  recording_ = false;
-  fault_.reset();
-  calls_.clear();
-  callsFor_ = {};
-  allCalls_ = failedCalls_ = 0;
-  record_.clear();
-}
-
-Interposer::Counts Interposer::counts() {
-  MutexLock lock(mutex_);
-  return counts_;
-}
-
-std::map<std::string, std::size_t> Interposer::calls() {
-  MutexLock lock(mutex_);
-  return calls_;
-}
-
-void Interposer::hold(Purpose purpose) {
-  MutexLock lock(mutex_);
-  hold_ = purpose;
+  return all;
 }
 
 void Interposer::release() {
-  MutexLock lock(mutex_);
-  releaseHeld();
-}
-
-void Interposer::releaseHeld() {
-  hold_.reset();
-  held_ = 0;
-  ++releases_;
+  const MutexLock lock(mutex_);
+  data_.hold.reset();
+  data_.held = 0;
+  ++data_.releases;
   released_.notifyAll();
 }
 
-bool Interposer::holdsOne() {
-  MutexLock lock(mutex_);
-  return held_ > 0;
-}
-
-void Interposer::inject(const Fault& fault) {
-  MutexLock lock(mutex_);
-  fault_ = fault;
-}
-
-void Interposer::lift() {
-  MutexLock lock(mutex_);
-  fault_.reset();
-}
-
-std::size_t Interposer::failedCalls() {
-  MutexLock lock(mutex_);
-  return failedCalls_;
-}
-
-void Interposer::record() {
-  MutexLock lock(mutex_);
-  recording_ = true;
-}
-
-void Interposer::mark(off_t promise) {
-  changed({.kind = Change::Kind::mark, .path = {}, .offset = promise});
-}
-
-std::vector<Interposer::Change> Interposer::takeRecord() {
-  MutexLock lock(mutex_);
-  recording_ = false;
-  return std::exchange(record_, {});
-}
-
-std::optional<std::string> Interposer::pathOf(int descriptor) {
-  if (!watchingFiles) return std::nullopt;
-  MutexLock lock(mutex_);
-  const auto found = open_.find(descriptor);
-  return found == open_.end() ? std::nullopt : std::optional(found->second);
-}
-
-bool Interposer::watches(const char* path) {
-  if (!watchingFiles || path == nullptr) return false;
-  MutexLock lock(mutex_);
-  return std::string_view(path).starts_with(directory_);
-}
-
-int Interposer::admit(const char* function, Purpose purpose) {
-  MutexLock lock(mutex_);
-  std::size_t& callsFor = callsFor_[static_cast<std::size_t>(purpose)];
-  std::size_t& calls = calls_[function];
-  const std::size_t all = allCalls_++;
-  const std::size_t nthFor = callsFor++;
-  const std::size_t nth = calls++;
-  if (!fault_) return 0;
-  if (fault_->only && fault_->only != purpose) return 0;
-  if (!fault_->function.empty() && fault_->function != function) return 0;
-  const std::size_t number = !fault_->function.empty() ? nth : fault_->only ? nthFor : all;
-  // Among calls for files, only a write can be half done.
-  const bool isShort = fault_->error == 0;
-  if (number < fault_->at) return 0;
-  if (isShort && fault_->function.empty() && purpose != Purpose::write) return 0;
-  const int error = isShort ? -1 : fault_->error;
-  if (!fault_->forever) fault_.reset();
-  ++failedCalls_;
-  return error;
-}
-
 void Interposer::passHold(Purpose purpose) {
-  if (hold_ != purpose) return;
-  ++held_;
-  const std::size_t before = releases_;
-  while (releases_ == before) released_.wait(mutex_);
-}
-
-void Interposer::passWrite(std::string_view path) {
-  MutexLock lock(mutex_);
-  if (IsLog(path)) passHold(Purpose::write);
-}
-
-void Interposer::opened(int descriptor, const char* path, bool created) {
-  {
-    MutexLock lock(mutex_);
-    open_[descriptor] = path;
-  }
-  if (created) changed({.kind = Change::Kind::create, .path = path});
-}
-
-void Interposer::closed(int descriptor) {
-  if (!watchingFiles) return;
-  MutexLock lock(mutex_);
-  open_.erase(descriptor);
+  if (data_.hold != purpose) return;
+  ++data_.held;
+  const std::size_t before = data_.releases;
+  while (data_.releases == before) released_.wait(mutex_);
 }
 
 void Interposer::changed(Change change) {
-  MutexLock lock(mutex_);
-  if (change.kind == Change::Kind::write && IsLog(change.path)) {
-    if (std::exchange(commitIsNext_, IsCommit(change.text))) {
-      ++counts_.commits;
-      ++counts_.unsynced;
+  const MutexLock lock(mutex_);
+  changedLocked(std::move(change));
+}
+
+void Interposer::changedLocked(Change change) {
+  if (change.kind == Change::Kind::write && IsLog(change.path) &&
+      std::exchange(data_.commitIsNext, IsCommit(change.text))) {
+    ++data_.counts.commits;
+    ++data_.counts.unsynced;
+  }
+  if (data_.recording) data_.record.push_back(std::move(change));
+}
+
+/// The work of the functions below that stand in for the C library's.
+struct StandIns {
+  using Kind = Interposer::Change::Kind;
+  using Purpose = Interposer::Purpose;
+
+  static Interposer& all() { return Interposer::instance(); }
+
+  /// The path of a descriptor of a watched file.
+  static std::optional<std::string> pathOf(int descriptor) {
+    if (!watchingFiles) return std::nullopt;
+    const MutexLock lock(all().mutex_);
+    const auto found = all().data_.open.find(descriptor);
+    return found == all().data_.open.end() ? std::nullopt : std::optional(found->second);
+  }
+  static bool isFile(int descriptor) { return pathOf(descriptor).has_value(); }
+  static bool isPath(const char* path) {
+    return watchingFiles && path != nullptr &&
+           std::string_view(path).starts_with(all().get(&Interposer::Data::directory));
+  }
+
+  /// Counts a call. Returns the error number with which it has to fail, -1 for half a transfer, or
+  /// 0.
+  static int admit(const char* function, Purpose purpose) {
+    const MutexLock lock(all().mutex_);
+    Interposer::Data& data = all().data_;
+    const std::size_t all = data.allCalls++;
+    const std::size_t nthFor = data.callsFor[static_cast<std::size_t>(purpose)]++;
+    const std::size_t nth = data.calls[function]++;
+    if (!data.fault) return 0;
+    const Interposer::Fault& fault = *data.fault;
+    const bool isNamed = !fault.function.empty();
+    if (fault.only && fault.only != purpose) return 0;
+    if (isNamed && fault.function != function) return 0;
+    if ((isNamed ? nth : fault.only ? nthFor : all) < fault.at) return 0;
+    // Among calls for files, only a write can be half done.
+    if (fault.error == 0 && !isNamed && purpose != Purpose::write) return 0;
+    const int error = fault.error == 0 ? -1 : fault.error;
+    if (!fault.forever) data.fault.reset();
+    ++data.failedCalls;
+    return error;
+  }
+  /// Makes a call, unless it is watched and has to fail.
+  template <class Call>
+  static auto admitted(bool isWatched, const char* function, Purpose purpose, Call call)
+      -> decltype(call()) {
+    const int error = isWatched ? admit(function, purpose) : 0;
+    if (error == 0) return call();
+    errno = error < 0 ? EIO : error;
+    if constexpr (std::is_pointer_v<decltype(call())>) {
+      return MAP_FAILED;
+    } else {
+      return -1;
     }
   }
-  if (recording_) record_.push_back(std::move(change));
-}
+  static int changed(bool isWatched, int result, Interposer::Change change) {
+    if (isWatched && result == 0) all().changed(std::move(change));
+    return result;
+  }
 
-Interposer::Sync Interposer::syncBegins() {
-  MutexLock lock(mutex_);
-  const Sync begun{record_.size(), counts_.commits};
-  passHold(Purpose::sync);
-  return begun;
-}
+  static int open(int (*real)(const char*, int, ...), const char* function, const char* path,
+                  int flags, mode_t mode) {
+    const bool isWatched = isPath(path);
+    return admitted(isWatched || onThread, function, Purpose::open, [&] {
+      struct stat status {};
+      const bool isNew = isWatched && (flags & O_CREAT) != 0 && ::lstat(path, &status) != 0;
+      const int descriptor = real(path, flags, mode);
+      if (!isWatched || descriptor < 0) return descriptor;
+      const MutexLock lock(all().mutex_);
+      all().data_.open[descriptor] = path;
+      if (isNew) all().changedLocked({.kind = Kind::create, .path = path});
+      return descriptor;
+    });
+  }
+  static void close(int descriptor) {
+    if (!watchingFiles) return;
+    const MutexLock lock(all().mutex_);
+    all().data_.open.erase(descriptor);
+  }
 
-void Interposer::synced(const std::string& path, const Sync& begun, bool failed) {
-  {
-    MutexLock lock(mutex_);
-    if (!failed && IsLog(path)) {
-      ++counts_.logSyncs;
-      counts_.unsynced = counts_.commits - begun.commits;
+  /// `real(bytes)` transfers so many bytes.
+  template <class Real>
+  static ssize_t write(const char* function, int descriptor, const void* bytes, std::size_t count,
+                       off_t offset, Real real) {
+    const auto path = pathOf(descriptor);
+    if (!path && !onThread) return real(count);
+    if (path && IsLog(*path)) {
+      const MutexLock lock(all().mutex_);
+      all().passHold(Purpose::write);
     }
+    const int error = admit(function, Purpose::write);
+    if (error > 0) {
+      errno = error;
+      return -1;
+    }
+    const ssize_t written = real(error < 0 ? (count + 1) / 2 : count);
+    if (path && written > 0) {
+      std::string text(static_cast<const char*>(bytes), static_cast<std::size_t>(written));
+      all().changed(
+          {.kind = Kind::write, .path = *path, .text = std::move(text), .offset = offset});
+    }
+    return written;
   }
-  changed({.kind = Change::Kind::sync, .path = path, .failed = failed, .begun = begun.changes});
-}
 
-namespace {
-
-using Kind = Interposer::Change::Kind;
-using Purpose = Interposer::Purpose;
-
-Interposer& Calls() {
-  return Interposer::instance();
-}
-
-bool OnThread() {
-  return Interposer::watchesThread();
-}
-
-bool IsFile(int descriptor) {
-  return Calls().pathOf(descriptor).has_value();
-}
-
-bool IsPath(const char* path) {
-  return Calls().watches(path);
-}
-
-template <class Function>
-Function* Next(const char* name) {
-  return reinterpret_cast<Function*>(::dlsym(RTLD_NEXT, name));
-}
-
-/// Makes a call, unless it is watched and has to fail.
-template <class Call>
-auto Admitted(bool isWatched, const char* function, Purpose purpose, Call call)
-    -> decltype(call()) {
-  const int error = isWatched ? Calls().admit(function, purpose) : 0;
-  if (error == 0) return call();
-  errno = error < 0 ? EIO : error;
-  if constexpr (std::is_pointer_v<decltype(call())>) {
-    return MAP_FAILED;
-  } else {
-    return -1;
+  /// A sync covers the changes and commits from before its beginning.
+  static int sync(int (*real)(int), const char* function, int descriptor) {
+    const auto path = pathOf(descriptor);
+    if (!path) return real(descriptor);
+    const int error = admit(function, Purpose::sync);
+    Interposer::Data& data = all().data_;
+    std::size_t changes = 0;
+    int commits = 0;
+    {
+      const MutexLock lock(all().mutex_);
+      changes = data.record.size();
+      commits = data.counts.commits;
+      all().passHold(Purpose::sync);
+    }
+    const int result = error == 0 ? real(descriptor) : -1;
+    if (error != 0) errno = error;
+    const MutexLock lock(all().mutex_);
+    if (result == 0 && IsLog(*path)) {
+      ++data.counts.logSyncs;
+      data.counts.unsynced = data.counts.commits - commits;
+    }
+    all().changedLocked(
+        {.kind = Kind::sync, .path = *path, .failed = result != 0, .begun = changes});
+    return result;
   }
-}
 
-int Open(int (*real)(const char*, int, ...), const char* function, const char* path, int flags,
-         mode_t mode) {
-  const bool isPath = IsPath(path);
-  return Admitted(isPath || OnThread(), function, Purpose::open, [&] {
-    struct stat status {};
-    const bool isNew = isPath && (flags & O_CREAT) != 0 && ::lstat(path, &status) != 0;
-    const int descriptor = real(path, flags, mode);
-    if (isPath && descriptor >= 0) Calls().opened(descriptor, path, isNew);
-    return descriptor;
-  });
-}
-
-/// `real(bytes)` transfers so many bytes.
-template <class Real>
-ssize_t Write(const char* function, int descriptor, const void* bytes, std::size_t count,
-              off_t offset, Real real) {
-  const auto path = Calls().pathOf(descriptor);
-  if (!path && !OnThread()) return real(count);
-  if (path) Calls().passWrite(*path);
-  const int error = Calls().admit(function, Purpose::write);
-  if (error > 0) {
-    errno = error;
-    return -1;
+  template <class Function>
+  static Function* next(const char* name) {
+    return reinterpret_cast<Function*>(::dlsym(RTLD_NEXT, name));
   }
-  const ssize_t written = real(error < 0 ? (count + 1) / 2 : count);
-  if (path && written > 0) {
-    const std::string_view whole(static_cast<const char*>(bytes), count);
-    Calls().changed({.kind = Kind::write,
-                     .path = *path,
-                     .text = std::string(whole.substr(0, static_cast<std::size_t>(written))),
-                     .offset = offset});
-  }
-  return written;
-}
-
-int Sync(int (*real)(int), const char* function, int descriptor) {
-  const auto path = Calls().pathOf(descriptor);
-  if (!path) return real(descriptor);
-  const int error = Calls().admit(function, Purpose::sync);
-  const Interposer::Sync begun = Calls().syncBegins();
-  const int result = error == 0 ? real(descriptor) : -1;
-  if (error != 0) errno = error;
-  Calls().synced(*path, begun, result != 0);
-  return result;
-}
-
-int Changed(bool isWatched, int result, Interposer::Change change) {
-  if (isWatched && result == 0) Calls().changed(std::move(change));
-  return result;
-}
-
-}  // namespace
+};
 
 }  // namespace quarvel::testing
 
 // The C library's functions, as this program and the libraries that it loads find them.
 
-using namespace quarvel::testing;
+using quarvel::testing::onThread;
+using quarvel::testing::StandIns;
+using Kind = StandIns::Kind;
+using Purpose = StandIns::Purpose;
 
-#define QUARVEL_CALL(type, name, parameters, arguments, watched, purpose)              \
-  type name parameters {                                                               \
-    static auto* const real = Next<type parameters>(#name);                            \
-    return Admitted(watched, #name, Purpose::purpose, [&] { return real arguments; }); \
+#define QUARVEL_REAL(name) static auto* const real = StandIns::next<decltype(::name)>(#name)
+#define QUARVEL_CALL(type, name, watched, parameters, arguments)                               \
+  type name parameters {                                                                       \
+    QUARVEL_REAL(name);                                                                        \
+    return StandIns::admitted(watched, #name, Purpose::other, [&] { return real arguments; }); \
   }
+#define QUARVEL_CALL_1(type, name, watched, A) QUARVEL_CALL(type, name, watched, (A a), (a))
+#define QUARVEL_CALL_2(type, name, watched, A, B) \
+  QUARVEL_CALL(type, name, watched, (A a, B b), (a, b))
+#define QUARVEL_CALL_3(type, name, watched, A, B, C) \
+  QUARVEL_CALL(type, name, watched, (A a, B b, C c), (a, b, c))
+#define QUARVEL_CALL_4(type, name, watched, A, B, C, D) \
+  QUARVEL_CALL(type, name, watched, (A a, B b, C c, D d), (a, b, c, d))
 #define QUARVEL_OPEN(name)                                                      \
   int name(const char* path, int flags, ...) {                                  \
-    static auto* const real = Next<int(const char*, int, ...)>(#name);          \
+    QUARVEL_REAL(name);                                                         \
     va_list arguments;                                                          \
     va_start(arguments, flags);                                                 \
     const mode_t mode = (flags & O_CREAT) != 0 ? va_arg(arguments, mode_t) : 0; \
     va_end(arguments);                                                          \
-    return Open(real, #name, path, flags, mode);                                \
+    return StandIns::open(real, #name, path, flags, mode);                      \
   }
-#define QUARVEL_SYNC(name)                           \
-  int name(int descriptor) {                         \
-    static auto* const real = Next<int(int)>(#name); \
-    return Sync(real, #name, descriptor);            \
+#define QUARVEL_SYNC(name)                          \
+  int name(int descriptor) {                        \
+    QUARVEL_REAL(name);                             \
+    return StandIns::sync(real, #name, descriptor); \
   }
 
 extern "C" {
 
 // Sockets and events, of watched threads.
-QUARVEL_CALL(int, socket, (int domain, int type, int protocol), (domain, type, protocol),
-             OnThread(), other)
-QUARVEL_CALL(int, bind, (int descriptor, const sockaddr* address, socklen_t length),
-             (descriptor, address, length), OnThread(), other)
-QUARVEL_CALL(int, listen, (int descriptor, int backlog), (descriptor, backlog), OnThread(), other)
-QUARVEL_CALL(int, accept4, (int descriptor, sockaddr* address, socklen_t* length, int flags),
-             (descriptor, address, length, flags), OnThread(), other)
-QUARVEL_CALL(int, connect, (int descriptor, const sockaddr* address, socklen_t length),
-             (descriptor, address, length), OnThread(), other)
-QUARVEL_CALL(ssize_t, recv, (int descriptor, void* bytes, size_t count, int flags),
-             (descriptor, bytes, count, flags), OnThread(), other)
-QUARVEL_CALL(int, shutdown, (int descriptor, int how), (descriptor, how), OnThread(), other)
-QUARVEL_CALL(int, getsockopt, (int descriptor, int level, int name, void* value, socklen_t* length),
-             (descriptor, level, name, value, length), OnThread(), other)
-QUARVEL_CALL(int, epoll_create1, (int flags), (flags), OnThread(), other)
-QUARVEL_CALL(int, epoll_ctl, (int events, int operation, int descriptor, epoll_event* event),
-             (events, operation, descriptor, event), OnThread(), other)
-QUARVEL_CALL(int, epoll_wait, (int events, epoll_event* ready, int most, int timeout),
-             (events, ready, most, timeout), OnThread(), other)
-QUARVEL_CALL(int, eventfd, (unsigned value, int flags), (value, flags), OnThread(), other)
-QUARVEL_CALL(int, timerfd_create, (int clock, int flags), (clock, flags), OnThread(), other)
-QUARVEL_CALL(int, timerfd_settime,
-             (int timer, int flags, const itimerspec* time, itimerspec* before),
-             (timer, flags, time, before), OnThread(), other)
-QUARVEL_CALL(ssize_t, read, (int descriptor, void* bytes, size_t count), (descriptor, bytes, count),
-             OnThread(), other)
-QUARVEL_CALL(int, mkdir, (const char* path, mode_t mode), (path, mode), OnThread(), other)
-QUARVEL_CALL(int, flock, (int descriptor, int operation), (descriptor, operation), OnThread(),
-             other)
-QUARVEL_CALL(int, chmod, (const char* path, mode_t mode), (path, mode), OnThread(), other)
-QUARVEL_CALL(int, lstat, (const char* path, struct stat* status), (path, status), OnThread(), other)
+QUARVEL_CALL_3(int, socket, onThread, int, int, int)
+QUARVEL_CALL_3(int, bind, onThread, int, const sockaddr*, socklen_t)
+QUARVEL_CALL_2(int, listen, onThread, int, int)
+QUARVEL_CALL_4(int, accept4, onThread, int, sockaddr*, socklen_t*, int)
+QUARVEL_CALL_3(int, connect, onThread, int, const sockaddr*, socklen_t)
+QUARVEL_CALL_4(ssize_t, recv, onThread, int, void*, size_t, int)
+QUARVEL_CALL_2(int, shutdown, onThread, int, int)
+QUARVEL_CALL(int, getsockopt, onThread, (int a, int b, int c, void* d, socklen_t* e),
+             (a, b, c, d, e))
+QUARVEL_CALL_1(int, epoll_create1, onThread, int)
+QUARVEL_CALL_4(int, epoll_ctl, onThread, int, int, int, epoll_event*)
+QUARVEL_CALL_4(int, epoll_wait, onThread, int, epoll_event*, int, int)
+QUARVEL_CALL_2(int, eventfd, onThread, unsigned, int)
+QUARVEL_CALL_2(int, timerfd_create, onThread, int, int)
+QUARVEL_CALL_4(int, timerfd_settime, onThread, int, int, const itimerspec*, itimerspec*)
+QUARVEL_CALL_3(ssize_t, read, onThread, int, void*, size_t)
+QUARVEL_CALL_2(int, mkdir, onThread, const char*, mode_t)
+QUARVEL_CALL_2(int, flock, onThread, int, int)
+QUARVEL_CALL_2(int, chmod, onThread, const char*, mode_t)
+QUARVEL_CALL_2(int, lstat, onThread, const char*, struct stat*)
 
 ssize_t send(int descriptor, const void* bytes, size_t count, int flags) {
-  static auto* const real = Next<ssize_t(int, const void*, size_t, int)>("send");
-  return Write("send", descriptor, bytes, count, 0,
-               [&](size_t part) { return real(descriptor, bytes, part, flags); });
+  QUARVEL_REAL(send);
+  return StandIns::write("send", descriptor, bytes, count, 0,
+                         [&](size_t part) { return real(descriptor, bytes, part, flags); });
 }
 
 // Files. Libraries call a function under the one name or the other.
-QUARVEL_CALL(ssize_t, pread64, (int descriptor, void* bytes, size_t count, off64_t offset),
-             (descriptor, bytes, count, offset), IsFile(descriptor), other)
-QUARVEL_CALL(void*, mmap64,
-             (void* address, size_t length, int protection, int flags, int descriptor,
-              off64_t offset),
-             (address, length, protection, flags, descriptor, offset),
-             descriptor >= 0 && IsFile(descriptor), other)
-QUARVEL_CALL(int, fstat64, (int descriptor, struct stat64* status), (descriptor, status),
-             IsFile(descriptor), other)
-QUARVEL_CALL(int, stat64, (const char* path, struct stat64* status), (path, status), IsPath(path),
-             other)
-QUARVEL_CALL(int, fchmod, (int descriptor, mode_t mode), (descriptor, mode),
-             OnThread() || IsFile(descriptor), other)
+QUARVEL_CALL_4(ssize_t, pread64, StandIns::isFile(a), int, void*, size_t, off64_t)
+QUARVEL_CALL(void*, mmap64, e >= 0 && StandIns::isFile(e),
+             (void* a, size_t b, int c, int d, int e, off64_t f), (a, b, c, d, e, f))
+QUARVEL_CALL_2(int, fstat64, StandIns::isFile(a), int, struct stat64*)
+QUARVEL_CALL_2(int, stat64, StandIns::isPath(a), const char*, struct stat64*)
+QUARVEL_CALL_2(int, fchmod, onThread || StandIns::isFile(a), int, mode_t)
 QUARVEL_OPEN(open)
 QUARVEL_OPEN(open64)
 QUARVEL_SYNC(fsync)
 QUARVEL_SYNC(fdatasync)
 
 int close(int descriptor) {
-  static auto* const real = Next<int(int)>("close");
-  Calls().closed(descriptor);
+  QUARVEL_REAL(close);
+  StandIns::close(descriptor);
   return real(descriptor);
 }
 
 ssize_t write(int descriptor, const void* bytes, size_t count) {
-  static auto* const real = Next<ssize_t(int, const void*, size_t)>("write");
-  const off_t offset = IsFile(descriptor) ? ::lseek(descriptor, 0, SEEK_CUR) : 0;
-  return Write("write", descriptor, bytes, count, offset,
-               [&](size_t part) { return real(descriptor, bytes, part); });
+  QUARVEL_REAL(write);
+  const off_t offset = StandIns::isFile(descriptor) ? ::lseek(descriptor, 0, SEEK_CUR) : 0;
+  return StandIns::write("write", descriptor, bytes, count, offset,
+                         [&](size_t part) { return real(descriptor, bytes, part); });
 }
 
 ssize_t pwrite64(int descriptor, const void* bytes, size_t count, off64_t offset) {
-  static auto* const real = Next<ssize_t(int, const void*, size_t, off64_t)>("pwrite64");
-  if (!IsFile(descriptor)) return real(descriptor, bytes, count, offset);
-  return Write("pwrite64", descriptor, bytes, count, offset,
-               [&](size_t part) { return real(descriptor, bytes, part, offset); });
+  QUARVEL_REAL(pwrite64);
+  if (!StandIns::isFile(descriptor)) return real(descriptor, bytes, count, offset);
+  return StandIns::write("pwrite64", descriptor, bytes, count, offset,
+                         [&](size_t part) { return real(descriptor, bytes, part, offset); });
 }
 
 int ftruncate64(int descriptor, off64_t size) {
-  static auto* const real = Next<int(int, off64_t)>("ftruncate64");
-  const auto path = Calls().pathOf(descriptor);
-  const int result = Admitted(path.has_value(), "ftruncate64", Purpose::write,
-                              [&] { return real(descriptor, size); });
-  return Changed(path.has_value(), result,
-                 {.kind = Kind::truncate, .path = path.value_or(""), .offset = size});
+  QUARVEL_REAL(ftruncate64);
+  const auto path = StandIns::pathOf(descriptor);
+  const int result = StandIns::admitted(path.has_value(), "ftruncate64", Purpose::write,
+                                        [&] { return real(descriptor, size); });
+  return StandIns::changed(path.has_value(), result,
+                           {.kind = Kind::truncate, .path = path.value_or(""), .offset = size});
 }
 
 int unlink(const char* path) {
-  static auto* const real = Next<int(const char*)>("unlink");
-  const bool isPath = IsPath(path);
+  QUARVEL_REAL(unlink);
+  const bool isPath = StandIns::isPath(path);
   const int result =
-      Admitted(isPath || OnThread(), "unlink", Purpose::write, [&] { return real(path); });
-  return Changed(isPath, result, {.kind = Kind::remove, .path = path});
+      StandIns::admitted(isPath || onThread, "unlink", Purpose::write, [&] { return real(path); });
+  return StandIns::changed(isPath, result, {.kind = Kind::remove, .path = path});
 }
 
 int rename(const char* from, const char* to) {
-  static auto* const real = Next<int(const char*, const char*)>("rename");
-  const bool isPath = IsPath(from);
-  const int result = Admitted(isPath, "rename", Purpose::write, [&] { return real(from, to); });
-  return Changed(isPath, result, {.kind = Kind::rename, .path = from, .text = to});
+  QUARVEL_REAL(rename);
+  const bool isPath = StandIns::isPath(from);
+  const int result =
+      StandIns::admitted(isPath, "rename", Purpose::write, [&] { return real(from, to); });
+  return StandIns::changed(isPath, result, {.kind = Kind::rename, .path = from, .text = to});
 }
 
 }  // extern "C"

@@ -10,43 +10,44 @@
 #include <map>
 #include <optional>
 #include <string>
-#include <string_view>
+#include <utility>
 #include <vector>
 
 #include "base/Mutex.h"
 
 namespace quarvel::testing {
 
+inline thread_local bool onThread = false;  // whether this thread is watched
+
 /// Stands between this program, SQLite included, and the C library: counts and records calls, holds
 /// them up, makes them fail. Watches calls for files below one directory, and all calls of threads
 /// that ask for it. One for the process, never destroyed; any thread.
 class Interposer {
  public:
-  [[nodiscard]] static Interposer& instance();
+  [[nodiscard]] static Interposer& instance() {
+    static Interposer& interposer = *new Interposer;
+    return interposer;
+  }
   /// Forgets everything and watches files below `directory` that are opened from now on; no files
   /// when it is empty.
   static Interposer& watch(const std::filesystem::path& directory = {});
   /// Watches all calls of the thread on which it lives.
-  class WatchedThread {
-   public:
-    WatchedThread();
-    ~WatchedThread();
+  struct WatchedThread {
+    WatchedThread() { onThread = true; }
+    ~WatchedThread() { onThread = false; }
     WatchedThread(const WatchedThread&) = delete;
     WatchedThread& operator=(const WatchedThread&) = delete;
   };
-
-  // Counts.
 
   struct Counts {
     int commits = 0;   // transactions written to a write-ahead log
     int logSyncs = 0;  // syncs of a write-ahead log
     int unsynced = 0;  // transactions since the last of them
   };
-  [[nodiscard]] Counts counts() QUARVEL_EXCLUDES(mutex_);
+  [[nodiscard]] Counts counts() { return get(&Data::counts); }
   /// Watched calls, by function.
-  [[nodiscard]] std::map<std::string, std::size_t> calls() QUARVEL_EXCLUDES(mutex_);
-
-  // Faults.
+  [[nodiscard]] std::map<std::string, std::size_t> calls() { return get(&Data::calls); }
+  [[nodiscard]] std::size_t failedCalls() { return get(&Data::failedCalls); }
 
   enum class Purpose : std::uint8_t { open, write, sync, other };
   struct Fault {
@@ -61,19 +62,17 @@ class Interposer {
     std::string function{};
   };
   static Fault fullDisk() { return {.error = ENOSPC, .forever = true, .only = Purpose::write}; }
-  void inject(const Fault& fault) QUARVEL_EXCLUDES(mutex_);
-  void lift() QUARVEL_EXCLUDES(mutex_);
-  [[nodiscard]] std::size_t failedCalls() QUARVEL_EXCLUDES(mutex_);
+  void inject(const Fault& fault) { set(&Data::fault, fault); }
+  void lift() { set(&Data::fault, std::nullopt); }
 
   /// From now on writes to a write-ahead log, or syncs of any file, block until `release`, which
   /// releases all calls that block then.
-  void hold(Purpose purpose = Purpose::write) QUARVEL_EXCLUDES(mutex_);
-  void release() QUARVEL_EXCLUDES(mutex_);
+  void hold(Purpose purpose = Purpose::write) { set(&Data::hold, purpose); }
+  void release();
   /// Whether a call blocks.
-  [[nodiscard]] bool holdsOne() QUARVEL_EXCLUDES(mutex_);
+  [[nodiscard]] bool holdsOne() { return get(&Data::held) > 0; }
 
-  // The record of changes to files and names, and of the syncs that make them durable.
-
+  /// A change of files and names, or a sync that makes changes durable.
   struct Change {
     enum class Kind : std::uint8_t {
       create,    // of `path`
@@ -85,60 +84,56 @@ class Interposer {
       mark,      // no change: `offset` tells the promise from here on
     };
     Kind kind;
-    std::string path;
+    std::string path{};
     std::string text{};
     off_t offset = 0;
     bool failed = false;    // a sync
     std::size_t begun = 0;  // a sync: the number of changes recorded when it began
   };
-  void record() QUARVEL_EXCLUDES(mutex_);
-  void mark(off_t promise) QUARVEL_EXCLUDES(mutex_);
-  [[nodiscard]] std::vector<Change> takeRecord() QUARVEL_EXCLUDES(mutex_);
-
-  // Called by the stand-ins for the C library's functions.
-
-  [[nodiscard]] static bool watchesThread();
-  /// The path of a descriptor of a watched file.
-  [[nodiscard]] std::optional<std::string> pathOf(int descriptor) QUARVEL_EXCLUDES(mutex_);
-  [[nodiscard]] bool watches(const char* path) QUARVEL_EXCLUDES(mutex_);
-  /// Counts a call. Returns the error number with which it has to fail, -1 for half a transfer, or
-  /// 0.
-  [[nodiscard]] int admit(const char* function, Purpose purpose) QUARVEL_EXCLUDES(mutex_);
-  /// Blocks while writes to a log are held.
-  void passWrite(std::string_view path) QUARVEL_EXCLUDES(mutex_);
-  void opened(int descriptor, const char* path, bool created) QUARVEL_EXCLUDES(mutex_);
-  void closed(int descriptor) QUARVEL_EXCLUDES(mutex_);
-  void changed(Change change) QUARVEL_EXCLUDES(mutex_);
-  /// A sync covers the changes and commits from before its beginning.
-  struct Sync {
-    std::size_t changes;
-    int commits;
-  };
-  /// Blocks while syncs are held.
-  [[nodiscard]] Sync syncBegins() QUARVEL_EXCLUDES(mutex_);
-  void synced(const std::string& path, const Sync& begun, bool failed) QUARVEL_EXCLUDES(mutex_);
+  void record() { set(&Data::recording, true); }
+  void mark(off_t promise) { changed({.kind = Change::Kind::mark, .offset = promise}); }
+  /// Ends the record.
+  [[nodiscard]] std::vector<Change> takeRecord() {
+    set(&Data::recording, false);
+    return get(&Data::record);
+  }
 
  private:
-  void reset(const std::filesystem::path& directory) QUARVEL_EXCLUDES(mutex_);
-  void releaseHeld() QUARVEL_REQUIRES(mutex_);
+  friend struct StandIns;  // the C library's functions
+  struct Data {
+    std::string directory{};
+    std::size_t releases = 0;
+    std::map<int, std::string> open{};  // watched files by descriptor
+    Counts counts{};
+    std::map<std::string, std::size_t> calls{};
+    std::array<std::size_t, 4> callsFor{};  // in the order of `Purpose`
+    std::size_t allCalls = 0;
+    std::size_t failedCalls = 0;
+    std::optional<Fault> fault{};
+    bool commitIsNext = false;  // the page of a last frame
+    std::optional<Purpose> hold{};
+    int held = 0;
+    bool recording = false;
+    std::vector<Change> record{};
+  };
+
+  template <class T>
+  T get(T Data::*member) {
+    const MutexLock lock(mutex_);
+    return data_.*member;
+  }
+  template <class T>
+  void set(T Data::*member, std::type_identity_t<T> value) {
+    const MutexLock lock(mutex_);
+    data_.*member = std::move(value);
+  }
+  void changed(Change change);
+  void changedLocked(Change change) QUARVEL_REQUIRES(mutex_);
   void passHold(Purpose purpose) QUARVEL_REQUIRES(mutex_);
 
   Mutex mutex_;
   ConditionVariable released_;
-  std::string directory_ QUARVEL_GUARDED_BY(mutex_);
-  std::map<int, std::string> open_ QUARVEL_GUARDED_BY(mutex_);
-  Counts counts_ QUARVEL_GUARDED_BY(mutex_);
-  std::map<std::string, std::size_t> calls_ QUARVEL_GUARDED_BY(mutex_);
-  std::array<std::size_t, 4> callsFor_ QUARVEL_GUARDED_BY(mutex_){};  // in the order of `Purpose`
-  std::size_t allCalls_ QUARVEL_GUARDED_BY(mutex_) = 0;
-  std::size_t failedCalls_ QUARVEL_GUARDED_BY(mutex_) = 0;
-  std::optional<Fault> fault_ QUARVEL_GUARDED_BY(mutex_);
-  bool commitIsNext_ QUARVEL_GUARDED_BY(mutex_) = false;  // the page of a last frame
-  std::optional<Purpose> hold_ QUARVEL_GUARDED_BY(mutex_);
-  int held_ QUARVEL_GUARDED_BY(mutex_) = 0;
-  std::size_t releases_ QUARVEL_GUARDED_BY(mutex_) = 0;
-  bool recording_ QUARVEL_GUARDED_BY(mutex_) = false;
-  std::vector<Change> record_ QUARVEL_GUARDED_BY(mutex_);
+  Data data_ QUARVEL_GUARDED_BY(mutex_);
 };
 
 }  // namespace quarvel::testing

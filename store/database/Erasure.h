@@ -42,6 +42,7 @@ class Erasure {
 
   enum class Progress : std::uint8_t { more, done, failed };
   /// A step that `failed` has changed nothing and may be tried again.
+  /// After `done` no further step may follow.
   [[nodiscard]] Progress step();
 
   /// Rows of all kinds that were removed so far.
@@ -52,33 +53,38 @@ class Erasure {
   [[nodiscard]] bool logRemains() const { return logRemains_; }
 
  private:
+  /// The rows that one step has removed from a table.
   struct Slice {
-    std::int64_t lastID = 0;
+    std::int64_t lastID = 0;  // the last one that was searched
     std::int64_t rows = 0;
-    std::int64_t bytes = 0;
+    std::int64_t bytes = 0;  // of their payloads
   };
 
+  /// Writes the line of the ledger, once. False, here and below: a statement failed.
   [[nodiscard]] bool begin();
   [[nodiscard]] bool removeSlice();
   [[nodiscard]] bool removeRows(StoreTable table, Slice& slice);
+  /// Adds a slice to the ledger's line and to the drops in `meta`, and keeps the last ids there.
   [[nodiscard]] bool record(StoreTable table, const Slice& slice);
   [[nodiscard]] bool write(const std::string& statement);
+  /// The SQL condition for the selected rows of a table.
   [[nodiscard]] std::string condition(StoreTable table) const;
+  /// Rewrites the file and empties the log.
   [[nodiscard]] Progress giveBack();
 
   SqliteConnection& connection_;
   const ErasureSelection selection_;
-  StoreIDs ownLastIDs_;
-  const StoreIDs& lastIDs_;
-  StoreIDs through_;
+  StoreIDs ownLastIDs_;      // without a service; otherwise unused
+  const StoreIDs& lastIDs_;  // of the service, or `ownLastIDs_`
+  StoreIDs through_;         // rows with greater ids stay
   const Date now_;
-  std::optional<std::int64_t> ledgerLine_;
-  std::size_t table_ = 0;   // of kErased, under way
-  std::int64_t after_ = 0;  // the last id of it that was searched
+  std::optional<std::int64_t> ledgerLine_;  // its id, once it is written
+  std::size_t table_ = 0;                   // of kErased, under way
+  std::int64_t after_ = 0;                  // the last id of it that was searched
   std::int64_t rows_ = 0;
-  std::uint64_t counted_ = 0;
-  bool rewritten_ = false;
-  int truncations_ = 0;  // tried
+  std::uint64_t counted_ = 0;  // since `takeCounted`
+  bool rewritten_ = false;     // the file
+  int truncations_ = 0;        // tried
   bool logRemains_ = false;
 };
 

@@ -26,7 +26,7 @@ namespace quarvel {
 class Retention {
  public:
   struct Bounds {
-    std::uint64_t maximumBytes = 268'435'456;
+    std::uint64_t maximumBytes = 268'435'456;  // of the database file
     /// The backends whose cursors say which rows have been exported; with none, no row waits.
     std::vector<std::string> remoteBackends;
   };
@@ -70,6 +70,7 @@ class Retention {
     StoreIDs lastIDs;      // up to these ids
     bool exportedOnly;
   };
+  /// Find and remove the oldest rows of one table.
   struct Statements {
     SqliteStatement oldest, remove;
   };
@@ -80,13 +81,19 @@ class Retention {
     std::int64_t exportedThrough = 0;
   };
 
+  /// Removes rows of about `bytes`: exported ones, or others when there are none left.
   Progress makeRoom(std::uint64_t bytes);
   /// Removes rows, oldest first.
   Progress removeOldest(std::uint64_t bytes, Removal removal);
+  /// Removes the rows of the windows up to the time of `removal`. False, here and below: a
+  /// statement failed.
   bool removeWithin(const PerStoreTable<Window>& windows, const Removal& removal, Removed& removed);
+  /// Removes sessions that ended before every message that is left.
   bool removeSessions(const Removal& removal);
+  /// Keeps the last ids and adds to the drops in `meta`.
   bool record(std::int64_t removed);
   std::optional<Window> window(StoreTable table, std::uint64_t bytes, const Removal& removal);
+  /// The last id that every remote backend has had.
   std::optional<std::int64_t> exportedThrough(StoreTable table);
   std::optional<std::int64_t> value(SqliteStatement& statement);
 
@@ -94,12 +101,12 @@ class Retention {
   SqliteConnection& connection_;
   const StoreIDs& lastIDs_;
   ClockMarks clockMarks_;
-  std::int64_t lastEarlierSession_ = 0;
-  std::int64_t openedAt_ = 0;  // microseconds
-  std::uint64_t pageBytes_ = 0;
+  std::int64_t lastEarlierSession_ = 0;  // given before this run
+  std::int64_t openedAt_ = 0;            // microseconds
+  std::uint64_t pageBytes_ = 0;          // of the file
   PerStoreTable<Statements> statements_;
   SqliteStatement pages_, freePages_, cursor_, removeSessions_, keepLastID_, countDropped_;
-  Removed removed_;
+  Removed removed_;  // since `takeRemoved`
 };
 
 }  // namespace quarvel

@@ -23,7 +23,7 @@ struct StoreColumn {
 
   const char* name;
   Kind kind;
-  bool mayBeNull = false;
+  bool mayBeNull = false;  // otherwise NOT NULL
   /// Filled in by a later UPDATE: neither inserted with the row nor exported. Such columns stand
   /// behind all others.
   bool isSetLater = false;
@@ -33,7 +33,7 @@ struct StoreColumn {
 
 /// A table. Lives as long as the program.
 struct TableDescription {
-  const char* name;
+  const char* name;  // in the file
   /// All columns but `id`.
   std::span<const StoreColumn> columns;
   /// Empty: the key is a column `id` in front of the others. Otherwise the columns of the key.
@@ -51,6 +51,7 @@ enum class StoreTable : std::uint8_t { agentSession, message, analyticsEvent, po
 inline constexpr std::array kAllStoreTables{StoreTable::agentSession, StoreTable::message,
                                             StoreTable::analyticsEvent, StoreTable::powerEvent};
 
+// The columns, in the order of the file. A store of this version has exactly these.
 namespace columns {
 using Kind = StoreColumn::Kind;
 
@@ -87,19 +88,23 @@ inline constexpr std::array kMeta{StoreColumn{"key", Kind::text, true},
                                   StoreColumn{"value", Kind::text}};
 }  // namespace columns
 
+/// Agent sessions. Their rows are not counted: a session is no message.
 inline constexpr TableDescription kAgentSessionTable{.name = "agent_session",
                                                      .columns = columns::kAgentSession,
                                                      .timeColumn = "opened_at",
                                                      .sessionColumn = "session_id"};
+/// Messages, of agent sessions and single ones.
 inline constexpr TableDescription kMessageTable{.name = "message",
                                                 .columns = columns::kMessage,
                                                 .timeColumn = "sent_at",
                                                 .sessionColumn = "session_id",
                                                 .isCounted = true};
+/// Events of the analytics sink; they name no session.
 inline constexpr TableDescription kAnalyticsEventTable{.name = "analytics_event",
                                                        .columns = columns::kAnalyticsEvent,
                                                        .timeColumn = "recorded_at",
                                                        .isCounted = true};
+/// Events of the power log; they name no session.
 inline constexpr TableDescription kPowerEventTable{.name = "power_event",
                                                    .columns = columns::kPowerEvent,
                                                    .timeColumn = "recorded_at",
@@ -121,6 +126,7 @@ inline constexpr std::array<const TableDescription*, 7> kTables{
     &kPowerEventTable,   &kBackendCursorTable, &kExportLogTable,
     &kMetaTable};
 
+/// The description of a table of rows. Lives as long as the program.
 [[nodiscard]] constexpr const TableDescription& Describe(StoreTable table) {
   return *kTables[static_cast<std::size_t>(table)];
 }
@@ -160,6 +166,7 @@ inline constexpr std::array<const TableDescription*, 7> kTables{
 
 /// One CREATE TABLE for each table, each ended with a semicolon.
 [[nodiscard]] std::string CreateTablesSql();
+/// The same for one table.
 [[nodiscard]] std::string CreateTableSql(const TableDescription& table);
 /// INSERT of `InsertedColumns`, with the key's `id` first. NULL for `id` takes the next one.
 [[nodiscard]] std::string InsertSql(const TableDescription& table);
@@ -209,8 +216,8 @@ using StoreIDs = PerStoreTable<std::int64_t>;
 
 /// How far a store is durable. A power cut may lose later rows and give their ids to other rows.
 struct DurableExtent {
-  std::string storeID;
-  StoreIDs lastIDs;
+  std::string storeID;  // empty before the file was opened
+  StoreIDs lastIDs;     // rows with greater ids are not durable yet
 
   bool operator==(const DurableExtent&) const = default;
 };

@@ -87,7 +87,7 @@ class ExportFixture : public StoreFixture {
     return wakeUps;
   }
   std::vector<std::string> names(int first, int last, const std::string& table = "message") const {
-    const std::string storeID = value("SELECT value FROM meta WHERE key = 'store_id'");
+    const std::string storeID = this->storeID();
     std::vector<std::string> names;
     for (int id = first; id <= last; ++id) {
       names.push_back(storeID + "-" + table + "-" + std::to_string(id));

@@ -18,11 +18,8 @@ using namespace std::chrono_literals;
 
 class ErasureTest : public ExportFixture {
  protected:
-  static constexpr std::int64_t kErasedSession = 4102;
-
   void addSecret(std::int64_t sessionID, int count) {
-    const std::int64_t session =
-        addSession(*store_, sessionID, Payload(Dictionary{{"App", "secret"}}));
+    const auto session = addSession(*store_, sessionID, Payload(Dictionary{{"App", "secret"}}));
     for (int i = 0; i < count; ++i) {
       // So long that some rows have pages of their own.
       const Payload payload(Dictionary{{"secret", std::string(i % 10 == 0 ? 9000 : 90, 's')}});
@@ -44,10 +41,10 @@ class ErasureTest : public ExportFixture {
 TEST_F(ErasureTest, LeavesNothingOfWhatWasErasedInTheFilesAndOneLineInTheLedger) {
   begin();
   addMessages(2000);
-  addSecret(kErasedSession, 1500);
+  addSecret(4102, 1500);
   addMessages(2000);
   ASSERT_TRUE(filesHold("secret") || store_->counters().waiting > 0);
-  EXPECT_EQ(Get(erase({kErasedSession})).value(), 1501);
+  EXPECT_EQ(Get(erase({4102})).value(), 1501);
   EXPECT_FALSE(filesHold("secret"));
   EXPECT_EQ(value("SELECT count(*) FROM message"), "4000");
   EXPECT_THAT(rows("SELECT backend, table_name, first_id, rows, bytes > 100000, outcome FROM "

@@ -10,37 +10,10 @@
 
 namespace quarvel::testing {
 
-namespace {
-
-std::filesystem::path Medium(bool memory) {
-  const std::filesystem::path shared = "/dev/shm";
-  return memory && std::filesystem::is_directory(shared) ? shared
-                                                         : std::filesystem::temp_directory_path();
-}
-
-std::vector<std::string> RunSql(const std::filesystem::path& path, const std::string& sql) {
-  sqlite3* connection = nullptr;
-  EXPECT_EQ(sqlite3_open(path.c_str(), &connection), SQLITE_OK);
-  sqlite3_busy_timeout(connection, 10'000);
-  std::vector<std::string> rows;
-  const auto collect = [](void* out, int columns, char** values, char**) {
-    std::string row;
-    for (int i = 0; i < columns; ++i) {
-      if (i > 0) row += '|';
-      row += values[i] == nullptr ? "-" : values[i];
-    }
-    static_cast<std::vector<std::string>*>(out)->push_back(std::move(row));
-    return 0;
-  };
-  EXPECT_EQ(sqlite3_exec(connection, sql.c_str(), collect, &rows, nullptr), SQLITE_OK)
-      << sqlite3_errmsg(connection);
-  sqlite3_close(connection);
-  return rows;
-}
-
-}  // namespace
-
-StoreFixture::StoreFixture(bool memory) : made_(Medium(memory)) {}
+StoreFixture::StoreFixture(bool memory)
+    : made_(memory && std::filesystem::is_directory("/dev/shm")
+                ? "/dev/shm"
+                : std::filesystem::temp_directory_path()) {}
 
 StoreFixture::~StoreFixture() {
   Interposer::watch({});
@@ -71,17 +44,29 @@ std::unique_ptr<TelemetryStore> StoreFixture::open(TelemetryStore::Options optio
 }
 
 std::vector<std::string> StoreFixture::rows(const std::string& query) const {
-  return RunSql(path_, query);
+  sqlite3* connection = nullptr;
+  EXPECT_EQ(sqlite3_open(path_.c_str(), &connection), SQLITE_OK);
+  sqlite3_busy_timeout(connection, 10'000);
+  std::vector<std::string> rows;
+  const auto collect = [](void* out, int columns, char** values, char**) {
+    std::string row;
+    for (int i = 0; i < columns; ++i) {
+      if (i > 0) row += '|';
+      row += values[i] == nullptr ? "-" : values[i];
+    }
+    static_cast<std::vector<std::string>*>(out)->push_back(std::move(row));
+    return 0;
+  };
+  EXPECT_EQ(sqlite3_exec(connection, query.c_str(), collect, &rows, nullptr), SQLITE_OK)
+      << sqlite3_errmsg(connection);
+  sqlite3_close(connection);
+  return rows;
 }
 
 std::string StoreFixture::value(const std::string& query) const {
   const std::vector<std::string> found = rows(query);
   EXPECT_EQ(found.size(), 1U) << query;
   return found.empty() ? "" : found.front();
-}
-
-void StoreFixture::execute(const std::string& statements) const {
-  (void)RunSql(path_, statements);
 }
 
 Outcome StoreFixture::send(TelemetryStore& store, const Payload& payload) {

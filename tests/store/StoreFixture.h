@@ -3,11 +3,13 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
+#include <cstdlib>
 #include <filesystem>
 #include <future>
 #include <map>
 #include <stdexcept>
 #include <string>
+#include <string_view>
 #include <thread>
 #include <vector>
 
@@ -25,17 +27,25 @@ template <class Condition>
 void Await(Condition condition) {
   const auto never = std::chrono::steady_clock::now() + kNever;
   while (!condition()) {
-    if (std::chrono::steady_clock::now() > never) throw std::runtime_error("waited in vain");
+    if (std::chrono::steady_clock::now() > never) {
+      ADD_FAILURE() << "waited in vain";
+      throw std::runtime_error("the test cannot go on");
+    }
     std::this_thread::sleep_for(std::chrono::microseconds(100));
   }
 }
 /// Waits for the value of a future.
 template <class Future>
 auto Get(Future&& future) {
-  if (future.wait_for(kNever) != std::future_status::ready) {
-    throw std::runtime_error("waited in vain");
-  }
+  Await(
+      [&future] { return future.wait_for(std::chrono::seconds(0)) == std::future_status::ready; });
   return future.get();
+}
+
+/// Whether the harnesses run for as long as a night allows.
+inline bool IsNightly() {
+  const char* nightly = std::getenv("QUARVEL_NIGHTLY");
+  return nightly != nullptr && std::string_view(nightly) == "1";
 }
 
 /// A directory of its own for each test, and the content of its store, read as another program
@@ -56,7 +66,10 @@ class StoreFixture : public ::testing::Test {
   /// The rows of a query, columns joined by "|" and NULL as "-".
   [[nodiscard]] std::vector<std::string> rows(const std::string& query) const;
   [[nodiscard]] std::string value(const std::string& query) const;
-  void execute(const std::string& statements) const;
+  [[nodiscard]] std::string storeID() const {
+    return value("SELECT value FROM meta WHERE key = 'store_id'");
+  }
+  void execute(const std::string& statements) const { (void)rows(statements); }
 
   /// A message of no agent session.
   static Outcome send(TelemetryStore& store, const Payload& payload);

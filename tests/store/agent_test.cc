@@ -22,7 +22,6 @@ using ::testing::StartsWith;
 class AgentTest : public StoreFixture {
  protected:
   std::shared_ptr<TelemetryStore> store_ = open({.clock = [] { return Date{}; }});
-
   static std::optional<Error> flush(RelmReportingSession& session) {
     std::promise<std::optional<Error>> done;
     session.flushMessages([&done](const std::optional<Error>& error) { done.set_value(error); });
@@ -48,11 +47,10 @@ TEST_F(AgentTest, MissingAndMisshapenInformationStillMakesARow) {
 }
 
 TEST_F(AgentTest, ConfigurationFindsTheBackendsThatCanTakeDataNow) {
-  const auto found = [this,
-                      asking = std::this_thread::get_id()](std::vector<std::string> configured) {
-    TelemetryAgent agent(store_, std::move(configured));
+  const auto asking = std::this_thread::get_id();
+  const auto found = [&](std::vector<std::string> configured) {
     std::promise<std::optional<std::vector<std::string>>> answer;
-    const auto session = agent.createAgentSession({}, {});
+    const auto session = TelemetryAgent(store_, std::move(configured)).createAgentSession({}, {});
     session->startConfiguration([&](const auto& backends) {
       EXPECT_NE(std::this_thread::get_id(), asking);
       answer.set_value(backends);
@@ -95,8 +93,9 @@ TEST_F(AgentTest, EventsWaitForRoomInOrderAndTheirSendersDoNot) {
   files.release();
   ASSERT_TRUE(FolderQueues().drain(std::chrono::steady_clock::now() + std::chrono::seconds(60)));
   store_->close();
-  EXPECT_EQ(value("SELECT count(*), min(name = id - 1) FROM analytics_event"), "20|1");
-  EXPECT_EQ(value("SELECT count(*), min(name = id - 1) FROM power_event"), "20|1");
+  for (const std::string table : {"analytics_event", "power_event"}) {
+    EXPECT_EQ(value("SELECT count(*), min(name = id - 1) FROM " + table), "20|1");
+  }
 }
 
 }  // namespace

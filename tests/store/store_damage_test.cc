@@ -1,7 +1,8 @@
 #include <fmt/format.h>
 #include <gmock/gmock.h>
 
-#include <cstdlib>
+#include <algorithm>
+#include <functional>
 #include <random>
 
 #include "store/database/StoreFile.h"
@@ -36,7 +37,6 @@ class DamageTest : public StoreFixture {
     leftBehind_.erase("telemetry.db-shm");
     store.reset();
     closed_ = files();
-    storeID_ = value("SELECT value FROM meta WHERE key = 'store_id'");
   }
   std::int64_t intactRows() {
     return std::stoll(
@@ -45,45 +45,40 @@ class DamageTest : public StoreFixture {
   }
 
   Files closed_, leftBehind_;
-  std::string storeID_;
 };
 
+using Random = std::mt19937;
 struct Damage {
   const char* name;
-  void (*inflict)(std::string& content, std::mt19937& random);
+  void (*inflict)(std::string& content, Random& random);
 };
 
-void Flip(std::string& content, std::mt19937& random) {
+void Flip(std::string& content, Random& random) {
   content[random() % content.size()] ^= static_cast<char>(1U << random() % 8);
+}
+char* RandomPage(std::string& content, Random& random) {
+  return &content[random() % (content.size() / kPage) * kPage];
 }
 
 const Damage kDamages[] = {
     {"a bit flipped", Flip},
     {"ten bits flipped",
-     [](std::string& content, std::mt19937& random) {
+     [](auto& content, auto& random) {
        for (int i = 0; i < 10; ++i) Flip(content, random);
      }},
     {"a page overwritten",
-     [](std::string& content, std::mt19937& random) {
-       const std::size_t page = random() % (content.size() / kPage);
-       for (std::size_t i = 0; i < kPage; ++i) {
-         content[page * kPage + i] = static_cast<char>(random());
-       }
+     [](auto& content, auto& random) {
+       std::generate_n(RandomPage(content, random), kPage, std::ref(random));
      }},
     {"a page of zeros",
-     [](std::string& content, std::mt19937& random) {
-       const std::size_t page = random() % (content.size() / kPage);
-       content.replace(page * kPage, kPage, kPage, '\0');
-     }},
-    {"cut short",
-     [](std::string& content, std::mt19937& random) { content.resize(random() % content.size()); }},
+     [](auto& content, auto& random) { std::fill_n(RandomPage(content, random), kPage, '\0'); }},
+    {"cut short", [](auto& content, auto& random) { content.resize(random() % content.size()); }},
 };
 
 TEST_F(DamageTest, AStoreAlwaysOpensAndKeepsReadableRows) {
   fill();
-  const char* nightly = std::getenv("QUARVEL_NIGHTLY");
-  const int cases = nightly != nullptr && std::string_view(nightly) == "1" ? 4'000 : 200;
-  std::mt19937 random(20'260'131);
+  const int cases = IsNightly() ? 4'000 : 200;
+  Random random(20'260'131);
   for (const Damage& damage : kDamages) {
     int setAside = 0;
     std::int64_t kept = 0;
@@ -122,14 +117,13 @@ TEST_F(DamageTest, AStoreAlwaysOpensAndKeepsReadableRows) {
 
 TEST_F(DamageTest, OnlyTheRowsOfADamagedPageAreLostAndNamesStay) {
   fill();
+  const std::string storeID = this->storeID();
   // The middle leaf of the table of messages: header byte 13, cells counted in bytes 3 and 4.
   std::string& content = closed_["telemetry.db"];
   std::vector<std::size_t> leaves;
-  const auto cells = [&content](std::size_t page) {
-    const auto byte = [&](std::size_t at) {
-      return static_cast<unsigned char>(content[page * kPage + at]);
-    };
-    return byte(0) == 13 ? byte(3) * 256 + byte(4) : 0;
+  const auto cells = [bytes = reinterpret_cast<const unsigned char*>(content.data())](auto page) {
+    const auto* head = bytes + page * kPage;
+    return head[0] == 13 ? head[3] * 256 + head[4] : 0;
   };
   for (std::size_t page = 1; page < content.size() / kPage; ++page) {
     if (cells(page) > 40) leaves.push_back(page);
@@ -147,8 +141,7 @@ TEST_F(DamageTest, OnlyTheRowsOfADamagedPageAreLostAndNamesStay) {
   store.reset();
   EXPECT_EQ(intactRows(), static_cast<std::int64_t>(kRows + 1 - lost));
   EXPECT_EQ(value("SELECT count(*) FROM agent_session"), "21");
-  EXPECT_EQ(value("SELECT value FROM meta WHERE key = 'store_id'"), storeID_);
-
+  EXPECT_EQ(this->storeID(), storeID);
   // The counters hold after a restart, and nothing is salvaged twice.
   LogRecorder::take();
   store = open();
