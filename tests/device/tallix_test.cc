@@ -5,15 +5,10 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <filesystem>
 #include <fstream>
 #include <future>
-#include <limits>
 #include <sstream>
-#include <string>
 #include <thread>
-#include <utility>
-#include <vector>
 
 #include "device/TallixFacility.h"
 #include "device/TallixSampling.h"
@@ -24,10 +19,8 @@
 namespace quarvel {
 namespace {
 
-using ::testing::ElementsAre;
-using ::testing::HasSubstr;
-using testing::LogRecorder;
-using ::testing::Pair;
+using ::testing::ElementsAre, ::testing::HasSubstr, testing::LogRecorder, ::testing::Pair;
+using enum TallixErrorCode;
 namespace fs = std::filesystem;
 
 using Figures = std::vector<std::pair<std::string, std::int64_t>>;
@@ -43,12 +36,9 @@ Figures figures(const TallixSamples& samples) {
   return all;
 }
 
-std::int64_t code(const std::optional<Error>& error) {
-  return error ? error->code : 0;
-}
-
-std::int64_t number(TallixErrorCode code) {
-  return static_cast<std::int64_t>(code);
+constexpr TallixErrorCode kNone{};
+TallixErrorCode code(const std::optional<Error>& error) {
+  return error ? static_cast<TallixErrorCode>(error->code) : kNone;
 }
 
 /// A subscription to all that one lookup finds.
@@ -110,7 +100,7 @@ TEST_F(TallixTest, LookupMatchesGroupsAndSubgroups) {
     SCOPED_TRACE(c.name);
     std::optional<Error> error;
     const TallixChannels channels = facility.channelsInGroup(c.group, c.subgroup, error);
-    EXPECT_EQ(code(error), 0);
+    EXPECT_EQ(code(error), kNone);
     ASSERT_EQ(channels != nullptr, c.found.has_value());
     if (!channels) continue;
     std::vector<std::string> names;
@@ -122,7 +112,7 @@ TEST_F(TallixTest, LookupMatchesGroupsAndSubgroups) {
 
 TEST_F(TallixTest, SamplesAndDeltasFollowTheCounters) {
   directory.write("tree/G/Down", "50\n");
-  directory.write("tree/G/Low", std::to_string(std::numeric_limits<std::int64_t>::min()));
+  directory.write("tree/G/Low", std::to_string(INT64_MIN));
   directory.write("tree/G/Up", "  100\n");
   Subscribed subscribed(configuration());
   const TallixSamples earlier = subscribed.sample();
@@ -135,9 +125,8 @@ TEST_F(TallixTest, SamplesAndDeltasFollowTheCounters) {
   EXPECT_THAT(figures(later), ElementsAre(Pair("Down", -20), Pair("Low", 1), Pair("Up", 107)));
   std::optional<Error> error;
   EXPECT_THAT(figures(TallixCreateSamplesDelta(earlier, later, error)),
-              ElementsAre(Pair("Down", -70), Pair("Low", std::numeric_limits<std::int64_t>::max()),
-                          Pair("Up", 7)));
-  EXPECT_EQ(code(error), 0);
+              ElementsAre(Pair("Down", -70), Pair("Low", INT64_MAX), Pair("Up", 7)));
+  EXPECT_EQ(code(error), kNone);
 
   int visited = 0;
   TallixIterate(*later, [&visited](const TallixChannelSample&) { return ++visited == 2 ? 1 : 0; });
@@ -151,35 +140,34 @@ TEST_F(TallixTest, SamplesOfOtherChannelsAreRefused) {
   Subscribed b(configuration(), "B");
   std::optional<Error> error;
   EXPECT_EQ(TallixCreateSamplesDelta(nullptr, a.sample(), error), nullptr);
-  EXPECT_EQ(code(error), number(TallixErrorCode::noEarlierSamples));
+  EXPECT_EQ(code(error), noEarlierSamples);
   EXPECT_EQ(TallixCreateSamplesDelta(b.sample(), a.sample(), error), nullptr);
-  EXPECT_EQ(code(error), number(TallixErrorCode::differentChannels));
+  EXPECT_EQ(code(error), differentChannels);
   EXPECT_EQ(TallixCreateSamples(*a.subscription, b.channels, error), nullptr);
-  EXPECT_EQ(code(error), number(TallixErrorCode::notSubscribed));
+  EXPECT_EQ(code(error), notSubscribed);
 }
 
 TEST_F(TallixTest, ChannelWithoutAnIntegerIsAnErrorUntilItHasOne) {
   const fs::path file = directory.write("tree/G/Counter", "1");
   Subscribed subscribed(configuration());
   const std::vector<std::pair<std::string, TallixErrorCode>> cases{
-      {"", TallixErrorCode::noInteger},
-      {"12 34", TallixErrorCode::noInteger},
-      {"0x10", TallixErrorCode::noInteger},
-      {std::string(3, '\0'), TallixErrorCode::noInteger},
-      {std::string(5000, ' ') + "1", TallixErrorCode::noInteger},
-      {"9223372036854775808", TallixErrorCode::integerOutOfRange},
-      {std::string(5000, '9'), TallixErrorCode::integerOutOfRange},
+      {"", noInteger},
+      {"12 34", noInteger},
+      {"0x10", noInteger},
+      {std::string(3, '\0'), noInteger},
+      {std::string(5000, ' ') + "1", noInteger},
+      {"9223372036854775808", integerOutOfRange},
+      {std::string(5000, '9'), integerOutOfRange},
   };
   for (const auto& [content, expected] : cases) {
     SCOPED_TRACE(content.substr(0, 30));
     directory.write("tree/G/Counter", content);
     EXPECT_EQ(subscribed.sample(), nullptr);
-    EXPECT_EQ(code(subscribed.error), number(expected));
+    EXPECT_EQ(code(subscribed.error), expected);
     EXPECT_THAT(LogRecorder::nextError(), HasSubstr(file.native()));
   }
   directory.write("tree/G/Counter", "9223372036854775807");
-  EXPECT_THAT(figures(subscribed.sample()),
-              ElementsAre(Pair("Counter", std::numeric_limits<std::int64_t>::max())));
+  EXPECT_THAT(figures(subscribed.sample()), ElementsAre(Pair("Counter", INT64_MAX)));
 }
 
 TEST_F(TallixTest, VanishedChannelIsAnErrorAndMayComeBack) {
@@ -187,7 +175,7 @@ TEST_F(TallixTest, VanishedChannelIsAnErrorAndMayComeBack) {
   Subscribed subscribed(configuration());
   fs::remove(file);
   EXPECT_EQ(subscribed.sample(), nullptr);
-  EXPECT_EQ(code(subscribed.error), number(TallixErrorCode::channelUnreadable));
+  EXPECT_EQ(code(subscribed.error), channelUnreadable);
   directory.write("tree/G/Counter", "2");
   EXPECT_THAT(figures(subscribed.sample()), ElementsAre(Pair("Counter", 2)));
   // A program that publishes a counter by renaming must not leave us with its first value.
@@ -200,7 +188,7 @@ TEST_F(TallixTest, ChannelsThatCannotBeReadLeaveTheOthers) {
   const TallixFacility facility(
       configuration({{"Speaker", "", "Clips", directory.write("counter", "7"), ""}}));
   const TallixChannels channels = facility.channelsInGroup("Speaker", std::nullopt, error);
-  EXPECT_EQ(code(error), number(TallixErrorCode::unreadableGroups)) << "there is no tree";
+  EXPECT_EQ(code(error), unreadableGroups) << "there is no tree";
   ASSERT_NE(channels, nullptr);
   EXPECT_EQ(TallixGetChannelCount(*channels), 1);
 
@@ -210,7 +198,7 @@ TEST_F(TallixTest, ChannelsThatCannotBeReadLeaveTheOthers) {
   EXPECT_THAT(LogRecorder::nextError(), HasSubstr("Absent"));
   ASSERT_EQ(TallixGetChannelCount(*subscribed.channels), 2);
   EXPECT_EQ(subscribed.sample(), nullptr);  // a directory opens but cannot be read
-  EXPECT_EQ(code(subscribed.error), number(TallixErrorCode::channelUnreadable));
+  EXPECT_EQ(code(subscribed.error), channelUnreadable);
 }
 
 // The service hung in open(2) of a named pipe without a writer.
@@ -218,19 +206,19 @@ TEST_F(TallixTest, NamedPipeInPlaceOfACounterBlocksNothing) {
   const fs::path pipe = directory.path() / "pipe";
   ASSERT_EQ(mkfifo(pipe.c_str(), 0600), 0);
   fs::create_directories(directory.path() / "tree");
-  std::promise<std::int64_t> sampled;
+  std::promise<TallixErrorCode> sampled;
   std::thread sampling([&] {
     Subscribed subscribed(configuration({{"G", "", "Pipe", pipe, ""}}));
     EXPECT_EQ(subscribed.sample(), nullptr);
     sampled.set_value(code(subscribed.error));
   });
-  std::future<std::int64_t> result = sampled.get_future();
+  std::future<TallixErrorCode> result = sampled.get_future();
   const bool inTime = result.wait_for(std::chrono::seconds(5)) == std::future_status::ready;
   EXPECT_TRUE(inTime);
   const int writer = inTime ? -1 : ::open(pipe.c_str(), O_WRONLY | O_NONBLOCK);  // ends the hang
   sampling.join();
   ::close(writer);
-  EXPECT_EQ(result.get(), number(TallixErrorCode::channelUnreadable));
+  EXPECT_EQ(result.get(), channelUnreadable);
 }
 
 TEST_F(TallixTest, PatternsFindTheirIntegersInOneLongReport) {
@@ -257,7 +245,7 @@ TEST_F(TallixTest, PatternsFindTheirIntegersInOneLongReport) {
 
   Subscribed beyond(configuration({{"Irq", "", "Beyond", line, "x (5)"}}));
   EXPECT_EQ(beyond.sample(), nullptr);
-  EXPECT_EQ(code(beyond.error), number(TallixErrorCode::noInteger));
+  EXPECT_EQ(code(beyond.error), noInteger);
 
   // The kernel returns a report of its own page by page.
   const fs::path maps = "/proc/self/maps";

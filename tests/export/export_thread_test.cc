@@ -17,8 +17,7 @@ constexpr std::int64_t kDisconnected = 0;
 class HangingEngine : public ExportEngine {
  public:
   struct Seen {
-    Collected<std::int64_t> taken;  // and `kDisconnected`
-    Collected<std::int64_t> hung;
+    Collected<std::int64_t> taken, hung;  // `kDisconnected` counts as taken
     std::atomic<bool> hangs = false;
   };
   explicit HangingEngine(Seen& seen) : seen_(seen) {}
@@ -50,25 +49,22 @@ class HangingEngine : public ExportEngine {
 
 class ExportThreadTest : public StoreFixture {
  protected:
-  void start(std::initializer_list<std::pair<const char*, HangingEngine::Seen*>> engines,
-             bool exports = true) {
+  void start(bool exports = true) {
     std::vector<Exporters::Backend> backends;
-    for (const auto& [name, seen] : engines) {
-      backends.push_back({{name, 1'000'000}, std::make_unique<HangingEngine>(*seen)});
-    }
+    backends.push_back({{"dead", 1'000'000}, std::make_unique<HangingEngine>(dead_)});
+    backends.push_back({{"alive", 1'000'000}, std::make_unique<HangingEngine>(alive_)});
     exporters_.emplace(*store_, std::move(backends), exports);
   }
   void addMessage() { ASSERT_TRUE(send(*store_, Payload())); }
 
   std::unique_ptr<TelemetryStore> store_ = open({.sync = 0ms, .remoteBackends = {"dead", "alive"}});
-  HangingEngine::Seen dead_;
-  HangingEngine::Seen alive_;
+  HangingEngine::Seen dead_, alive_;
   std::optional<Exporters> exporters_;
 };
 
 TEST_F(ExportThreadTest, ADeadEngineDelaysNeitherAnotherNorTheEnd) {
   dead_.hangs = true;
-  start({{"dead", &dead_}, {"alive", &alive_}});
+  start();
   for (std::int64_t id = 1; id <= 3; ++id) {
     addMessage();
     EXPECT_EQ(alive_.taken.next(), id);
@@ -84,8 +80,8 @@ TEST_F(ExportThreadTest, ADeadEngineDelaysNeitherAnotherNorTheEnd) {
 
 TEST_F(ExportThreadTest, HeldItHoldsNoRowAndReleasedItGoesOn) {
   alive_.hangs = true;
-  start({{"alive", &alive_}});
-  ExportThread& thread = *exporters_->threads().front();
+  start();
+  ExportThread& thread = *exporters_->threads().back();
   addMessage();
   EXPECT_EQ(alive_.hung.next(), 1);
   thread.hold();
@@ -104,7 +100,7 @@ TEST_F(ExportThreadTest, HeldItHoldsNoRowAndReleasedItGoesOn) {
 TEST_F(ExportThreadTest, WithoutConsentAtTheStartNoRowLeaves) {
   addMessage();
   awaitStored(*store_);
-  start({{"alive", &alive_}}, /*exports=*/false);
+  start(/*exports=*/false);
   EXPECT_EQ(alive_.taken.next(), kDisconnected) << "it must be held before its first row";
   EXPECT_EQ(alive_.taken.size(), 0U);
   exporters_->setExports(true);
