@@ -2,7 +2,7 @@
 
 #include <gmock/gmock.h>
 
-#include "export/ExportDevice.h"
+#include "export/ExportSettings.h"
 #include "export/Exporters.h"
 #include "export/otlp/OtlpEngine.h"
 #include "tests/LogRecorder.h"
