@@ -25,7 +25,7 @@ class CounterPattern {
   [[nodiscard]] std::string_view find(std::string_view content) const;
 
  private:
-  struct Compiled;
+  struct Compiled;  // the C library's form; freed with the last copy
   explicit CounterPattern(std::shared_ptr<const Compiled> compiled);
 
   std::shared_ptr<const Compiled> compiled_;
@@ -48,14 +48,19 @@ class CounterFile {
     oneInteger,  // up to kIntegerBytes, by one read
     lines,       // a report of many lines, up to kReportBytes
   };
+  /// A 64-bit integer has 20 characters; the rest is room for blanks around it.
   static constexpr std::size_t kIntegerBytes = 64;
   static constexpr std::size_t kReportBytes = 65536;
 
+  /// Opens nothing.
   CounterFile(std::filesystem::path path, Extent extent);
+  /// `other` no longer owns the descriptor.
   CounterFile(CounterFile&& other) noexcept;
   CounterFile& operator=(CounterFile&&) = delete;
+  /// Closes the file.
   ~CounterFile();
 
+  /// The path given at construction, for messages.
   [[nodiscard]] const std::filesystem::path& path() const { return path_; }
   /// Opens the file; never waits, not even for a named pipe. Returns 0 or the system's error
   /// number.
@@ -65,14 +70,16 @@ class CounterFile {
   [[nodiscard]] int read(std::string& buffer, std::string_view& content);
 
  private:
+  /// Closes the descriptor if there is one.
   void close();
   /// Whether the open file has no name any more.
   [[nodiscard]] bool wasReplaced() const;
+  /// One read of the open file, from its beginning. Returns 0 or the system's error number.
   [[nodiscard]] int readOnce(std::string& buffer, std::string_view& content) const;
 
   std::filesystem::path path_;  // constant after construction
   Extent extent_;               // constant after construction
-  int descriptor_ = -1;
+  int descriptor_ = -1;         // -1: not open
 };
 
 }  // namespace quarvel

@@ -19,6 +19,7 @@ class DirectoryWatch {
   /// any file may have changed. One change may be reported more than once.
   using Handler = std::function<void(std::string_view file)>;
 
+  /// Takes no descriptor and no thread before the first `add`.
   DirectoryWatch() = default;
   DirectoryWatch(const DirectoryWatch&) = delete;
   DirectoryWatch& operator=(const DirectoryWatch&) = delete;
@@ -34,21 +35,26 @@ class DirectoryWatch {
   void end() QUARVEL_EXCLUDES(mutex_);
 
  private:
+  /// One call of `add`. Two of them may name the same directory.
   struct Watched {
     int identifier;  // the kernel's
     std::filesystem::path directory;
     std::shared_ptr<const Handler> handler;
   };
 
+  /// Starts the thread if it has not started. Returns 0 or the system's error number.
   [[nodiscard]] int start() QUARVEL_REQUIRES(mutex_);
+  /// The thread. `descriptor` is the kernel's queue of events, closed after the thread has ended.
   void run(int descriptor);
+  /// Blocks in read(2) between events.
   void reportUntilEnd(int descriptor);
+  /// Calls the handlers of one directory, or of all when `file` is empty. Without the lock.
   void report(int identifier, std::string_view file);
   /// Drops a directory that was removed. Returns whether the thread is to end.
   [[nodiscard]] bool dropDirectory(int identifier);
 
-  Mutex mutex_;
-  int descriptor_ QUARVEL_GUARDED_BY(mutex_) = -1;
+  Mutex mutex_;                                     // never held while a handler runs
+  int descriptor_ QUARVEL_GUARDED_BY(mutex_) = -1;  // -1: not started, or ended
   bool ending_ QUARVEL_GUARDED_BY(mutex_) = false;
   bool running_ QUARVEL_GUARDED_BY(mutex_) = false;  // the thread
   ConditionVariable ended_;                          // it no longer runs

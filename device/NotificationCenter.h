@@ -23,7 +23,10 @@ class NotificationCenter {
   NotificationCenter(std::filesystem::path directory, DirectoryWatch& watch)
       : directory_(std::move(directory)), watch_(watch) {}
 
-  /// As `RegisterForNotification`.
+  /// Calls `handler` on `queue` with `token` after each posting of `name`, for as long as the
+  /// process lives: `queue` must live as long. Postings before a queued call begins are one call.
+  /// Returns 0, or the system's error number and no token when the directory cannot be watched; the
+  /// next call tries again. Tokens count from 1.
   [[nodiscard]] int add(std::string_view name, NotificationToken& token, WorkQueue& queue,
                         NotificationHandler handler);
 
@@ -45,8 +48,9 @@ class NotificationCenter {
   void post(std::string_view name);
 
   const std::filesystem::path directory_;
-  DirectoryWatch& watch_;
-  Mutex mutex_;
+  DirectoryWatch& watch_;  // calls `post` on its thread
+  Mutex mutex_;  // taken by the thread of `watch_` too; never held while a handler is queued
+  // The directory exists and is watched.
   bool watching_ QUARVEL_GUARDED_BY(mutex_) = false;
   std::vector<std::shared_ptr<Registration>> registrations_ QUARVEL_GUARDED_BY(mutex_);
 };

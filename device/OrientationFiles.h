@@ -18,13 +18,18 @@ namespace quarvel {
 /// thread that registers the first handler.
 class OrientationFiles final : public OrientationSource {
  public:
+  /// Watches nothing yet. `center` owns this; `directory` holds both files and is made when
+  /// missing.
   OrientationFiles(OrientationCenter& center, std::filesystem::path directory,
                    DirectoryWatch& watch);
 
+  /// Watches the directory from the first call on, then reads the file of `kind`.
   std::optional<Orientation> start(OrientationKind kind) override;
+  /// Goes on watching, since a watch costs nothing while no file changes.
   void stop(OrientationKind kind) override;
 
  private:
+  /// None when the file is missing or, after a log line, wrong.
   [[nodiscard]] std::optional<Orientation> read(OrientationKind kind) const;
   /// Reports the orientation in a file that was written; an empty name stands for both files.
   void reportWritten(std::string_view file);

@@ -17,19 +17,26 @@ namespace quarvel {
 /// news.
 class OrientationSensor final : public OrientationSource {
  public:
+  /// Starts no thread and asks for no bus before `start`.
   explicit OrientationSensor(OrientationCenter& center) : center_(center) {}
   OrientationSensor(const OrientationSensor&) = delete;
   OrientationSensor& operator=(const OrientationSensor&) = delete;
+  /// Closes the connection to the bus and waits for the thread.
   ~OrientationSensor() override;
 
+  /// Always none: the orientation follows when the proxy has answered. The sensor knows nothing of
+  /// the user interface, so that kind is ignored.
   std::optional<Orientation> start(OrientationKind kind) override;
   void stop(OrientationKind kind) override;
 
  private:
-  class Connection;
+  class Connection;  // to the bus; used on the thread alone
 
+  /// Tells the thread whether a handler is registered.
   void setWanted(bool wanted);
+  /// The thread.
   void run();
+  /// Connects while a handler is registered and hands each orientation to the center.
   void followUntilEnd();
   /// Waits for the bus, when there is a `connection`, or for `wakeDescriptor_`.
   void wait(const Connection* connection) const;

@@ -20,14 +20,18 @@ class PreferencesStore {
   /// Larger files are an error: settings made by people are far below.
   static constexpr std::size_t kMaximumBytes = 65'536;
 
+  /// Reads nothing yet. A directory that is missing means that no domain has values.
   explicit PreferencesStore(std::filesystem::path directory) : directory_(std::move(directory)) {}
 
-  /// As `OpenPreferencesDomain`. The same error is logged once, until the file is right again.
+  /// Reads the file of the domain `name` now and returns its values, which later changes of the
+  /// file leave alone. While the file is wrong or unreadable, the last valid values. The same error
+  /// is logged once, until the file is right again.
   [[nodiscard]] PreferencesDomain open(std::string_view name);
 
  private:
+  /// A domain that has been opened.
   struct Domain {
-    Dictionary lastValid;
+    Dictionary lastValid;   // empty when the file is missing
     std::string lastError;  // as it was logged; empty while the file is right
   };
 

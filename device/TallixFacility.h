@@ -24,13 +24,15 @@ struct DriverChannel {
   [[nodiscard]] std::string description() const;
 };
 
-/// Immutable; shared by references from any thread.
+/// The channels that one lookup found, in the order of group, subgroup and name. Immutable; shared
+/// by references from any thread.
 class TallixChannelSet {
  public:
   explicit TallixChannelSet(std::vector<DriverChannel> list) : channels(std::move(list)) {}
   const std::vector<DriverChannel> channels;
 };
 
+/// An error of the domain of driver counters, with `reason` as its text.
 [[nodiscard]] Error TallixError(TallixErrorCode code, std::string reason);
 
 /// Finds channels in two places: a tree of files ROOT/<group>/<channel> and
@@ -43,14 +45,17 @@ class TallixFacility {
   /// A single channel with a wrong pattern is logged and left out.
   explicit TallixFacility(const Configuration::Tallix& configuration);
 
-  /// As `TallixCopyChannelsInGroup`.
+  /// The channels with this group and this subgroup; an absent argument admits every one. Reads the
+  /// directories of the tree on the calling thread, but no counter. Null when there is no such
+  /// group. `error` is set when the tree cannot be read; the single channels are returned all the
+  /// same.
   [[nodiscard]] TallixChannels channelsInGroup(std::optional<std::string_view> group,
                                                std::optional<std::string_view> subgroup,
                                                std::optional<Error>& error) const;
 
  private:
-  std::filesystem::path root_;
-  std::vector<DriverChannel> single_;
+  std::filesystem::path root_;         // empty: no tree
+  std::vector<DriverChannel> single_;  // of the configuration, with compiled patterns
 };
 
 }  // namespace quarvel

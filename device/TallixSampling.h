@@ -23,9 +23,10 @@ class TallixChannelSample {
 /// The values of a subscription at one time. Immutable; any thread.
 class TallixSampleSet {
  public:
+  /// `list` has one value for each channel of `set`.
   TallixSampleSet(TallixChannels set, std::vector<std::int64_t> list)
       : channels(std::move(set)), values(std::move(list)) {}
-  const TallixChannels channels;
+  const TallixChannels channels;           // samples of the same set alone can be compared
   const std::vector<std::int64_t> values;  // one for each channel, in their order
 };
 
@@ -38,19 +39,21 @@ class TallixSubscription {
 
   /// The channels with open files.
   [[nodiscard]] const TallixChannels& channels() const { return subscribed_; }
-  /// Reads every file once, also when it holds many channels. Errors: as `TallixCreateSamples`.
+  /// Waits while another thread samples. Reads every file once, also when it holds many channels.
+  /// Errors: as `TallixCreateSamples`.
   [[nodiscard]] Result<TallixSamples> sample();
 
  private:
   /// An open file and its channels.
   struct Source {
-    CounterFile file;
+    CounterFile file;                   // read once a sample
     std::vector<std::size_t> channels;  // indices in `subscribed_`
   };
 
   TallixChannels subscribed_;  // constant after construction
   Mutex mutex_;                // held while the files are read
   std::vector<Source> sources_ QUARVEL_GUARDED_BY(mutex_);
+  // The content of the file that is read, kept to save allocations.
   std::string buffer_ QUARVEL_GUARDED_BY(mutex_);
 };
 

@@ -15,13 +15,18 @@ namespace quarvel {
 /// blocks of its queue, on which later reads run.
 class VerbosePreferences {
  public:
+  /// Reads the preferences of the registered scopes on the calling thread. Without notifications,
+  /// after a log line, nothing is read again.
   VerbosePreferences();
   VerbosePreferences(const VerbosePreferences&) = delete;
   VerbosePreferences& operator=(const VerbosePreferences&) = delete;
+  /// Scopes that are registered later stay silent; the others keep their switch.
   ~VerbosePreferences();
 
  private:
+  /// Reads one scope's switch, on the thread that registers it.
   void add(LogHandle scope) QUARVEL_EXCLUDES(mutex_);
+  /// Reads all switches, each domain once, on `queue_`.
   void readAgain() QUARVEL_EXCLUDES(mutex_);
 
   const std::unique_ptr<WorkQueue> queue_;

@@ -20,7 +20,7 @@ using ExportValue = std::variant<std::monostate, std::int64_t, double, std::stri
 
 /// One row, with its values in the order of `ExportColumns`.
 struct ExportRow {
-  std::int64_t id = 0;
+  std::int64_t id = 0;    // in the store; rises within a table and is given once
   std::size_t bytes = 0;  // of its values; a number counts 8
   std::vector<ExportValue> values;
 };
@@ -28,8 +28,8 @@ struct ExportRow {
 /// Rows of one table in the order of their ids. Made by `ExportSource::read`, handed to the engine
 /// on the same thread, and gone when the delivery has been recorded.
 struct ExportBatch {
-  StoreTable table{};
-  std::string storeID;
+  StoreTable table{};   // of all its rows
+  std::string storeID;  // of the store that the rows were read from
   std::vector<ExportRow> rows;
 
   /// The stable name of a row, by which engines drop repeats: "<store_id>-<table>-<id>".
@@ -42,7 +42,7 @@ struct ExportBatch {
 }
 
 /// Appends a row as one JSON object: its id, then its columns under their names, absent ones as
-/// null.
+/// null, 64-bit integers as numbers, JSON columns unquoted. Pure; `row` must be of `table`.
 void AppendRowJson(std::string& out, StoreTable table, const ExportRow& row);
 
 }  // namespace quarvel

@@ -3,12 +3,16 @@
 #include <chrono>
 #include <cstddef>
 #include <cstdint>
+#include <memory>
 #include <optional>
 #include <string>
 
 #include "export/ExportBatch.h"
 
 namespace quarvel {
+
+struct BackendSettings;
+struct ExportDevice;
 
 /// The outcome of one batch.
 struct Delivery {
@@ -21,8 +25,8 @@ struct Delivery {
 
   std::size_t taken = 0;  // rows that are safe with the engine, counted from the first
   Remainder remainder = Remainder::none;
-  std::size_t refused = 0;
-  std::string reason{};  // of the remainder; a sentence without its full stop
+  std::size_t refused = 0;  // rows after the taken ones; 0 unless `remainder` is `refused`
+  std::string reason{};     // of the remainder; a sentence without its full stop
   /// Time that the engine asks for before the remaining rows are sent.
   std::optional<std::chrono::seconds> after{};
   /// Number of taken rows that the engine dropped without naming them, for `reason`.
@@ -44,8 +48,23 @@ class ExportEngine {
   virtual void disconnect() = 0;
 
   /// Any thread. Between `stop` and `resume` a delivery ends at once, also one in flight.
+  /// The delivery in flight returns `stopped`.
   virtual void stop() = 0;
+  /// Lets later deliveries run again.
   virtual void resume() = 0;
 };
+
+/// The function that an engine's module exports under `kEngineModuleEntry`. `settings` are of the
+/// engine's own type: its own reader made them.
+using MakeEngine = ExportEngine* (*)(const BackendSettings& settings, const ExportDevice& device);
+inline constexpr const char* kEngineModuleEntry = "QuarvelMakeEngine";
+
+/// Makes the engine of a backend from its module, `export-<backend>.so`, which is loaded now and
+/// never closed. An engine's libraries are larger than all the rest of the service, and most
+/// devices need one engine or none. When the module cannot be loaded, the result is an engine that
+/// takes nothing and gives the reason. Blocks while the module is loaded.
+[[nodiscard]] std::unique_ptr<ExportEngine> LoadEngine(const std::string& backend,
+                                                       const BackendSettings& settings,
+                                                       const ExportDevice& device);
 
 }  // namespace quarvel

@@ -23,10 +23,12 @@ namespace quarvel {
 class ExportSource {
  public:
   /// `store` must outlive this.
+  /// `path` is the store's file, `backend` the name of the cursor. Opens nothing yet.
   ExportSource(TelemetryStore& store, std::filesystem::path path, std::string backend);
 
+  /// The point up to which the backend has had all rows.
   struct Position {
-    std::string storeID;
+    std::string storeID;                 // changes when another store took the place
     StoreIDs exportedThrough;            // the cursors
     std::optional<Date> acknowledgedAt;  // the last time by the ledger
   };
@@ -36,6 +38,7 @@ class ExportSource {
   /// Whether the file that was opened is still the store.
   [[nodiscard]] bool isCurrent() { return isOpen_ && !connection_.hasMoved(); }
 
+  /// The limits of one batch.
   struct Bounds {
     std::int64_t after = 0;    // ids above this,
     std::int64_t through = 0;  // and up to this
@@ -44,7 +47,7 @@ class ExportSource {
   };
   /// Reads rows that `position` found; none when they have been removed.
   [[nodiscard]] Result<ExportBatch> read(StoreTable table, const Bounds& bounds);
-  /// Number of rows after the cursors.
+  /// Number of rows after the cursors, of all tables. Counts them in the store's file.
   [[nodiscard]] Result<std::int64_t> backlog(const StoreIDs& exportedThrough);
 
   /// Hands a record to the store's writer and waits until it is stored. Errors: the store is
@@ -53,7 +56,7 @@ class ExportSource {
 
   // Any thread. Between `stop` and `resume`, `record` does not wait.
   void stop();
-  void resume();
+  void resume();  // later records wait again
   [[nodiscard]] bool isStopped() const;
 
  private:
@@ -67,7 +70,9 @@ class ExportSource {
     bool stopped QUARVEL_GUARDED_BY(mutex) = false;
   };
 
+  /// Opens the store's file for reading and prepares the statements.
   [[nodiscard]] Outcome open();
+  /// The error of the connection's last call.
   [[nodiscard]] Error failed() const;
 
   TelemetryStore& store_;
@@ -78,8 +83,8 @@ class ExportSource {
     SqliteStatement select, count;
   };
   PerStoreTable<Statements> statements_;
-  bool isOpen_ = false;
-  std::string storeID_;
+  bool isOpen_ = false;        // the connection and all statements are usable
+  std::string storeID_;        // of the file that is open
   std::uint64_t records_ = 0;  // handed to the writer
   const std::shared_ptr<Pending> pending_ = std::make_shared<Pending>();
 };

@@ -27,6 +27,7 @@ class ExportThread {
   ExportThread(const ExportThread&) = delete;
   ExportThread& operator=(const ExportThread&) = delete;
 
+  /// Starts the thread; called once, at most.
   void start();
   /// Tells how far the store is durable now. Takes the lock only; called by the store's writer.
   void extend(const DurableExtent& extent) QUARVEL_EXCLUDES(mutex_);
@@ -34,6 +35,7 @@ class ExportThread {
   /// Sends nothing until `release`. Abandons a batch in flight; when this returns, the thread holds
   /// no row. May be called several times, each with its `release`.
   void hold() QUARVEL_EXCLUDES(mutex_);
+  /// Ends one `hold`; the last one lets the thread go on, with a new connection.
   void release() QUARVEL_EXCLUDES(mutex_);
 
   /// Abandons a batch in flight and ends the thread. `awaitEnd`, for one caller only, waits for the
@@ -42,9 +44,11 @@ class ExportThread {
   [[nodiscard]] bool awaitEnd(std::chrono::steady_clock::time_point deadline)
       QUARVEL_EXCLUDES(mutex_);
 
+  /// A copy of the exporter's state, with the thread's wake-ups.
   [[nodiscard]] ExportStatus status() const QUARVEL_EXCLUDES(mutex_);
 
  private:
+  /// The thread: steps of the exporter, with waits in between.
   void run() QUARVEL_EXCLUDES(mutex_);
   /// Waits until the next step is due; false when the thread is to end.
   [[nodiscard]] bool awaitWork(const Exporter::Next& next) QUARVEL_REQUIRES(mutex_);
@@ -59,13 +63,14 @@ class ExportThread {
   Exporter exporter_;
 
   mutable Mutex mutex_;
-  ConditionVariable changed_;
+  ConditionVariable changed_;  // any of the members below
+  // The durable part of the store, as `extend` said last.
   DurableExtent extent_ QUARVEL_GUARDED_BY(mutex_);
   bool extended_ QUARVEL_GUARDED_BY(mutex_) = false;  // since the last step
-  int holds_ QUARVEL_GUARDED_BY(mutex_) = 0;
-  bool parked_ QUARVEL_GUARDED_BY(mutex_) = true;
+  int holds_ QUARVEL_GUARDED_BY(mutex_) = 0;          // without a release so far
+  bool parked_ QUARVEL_GUARDED_BY(mutex_) = true;     // the thread holds no row
   bool stopping_ QUARVEL_GUARDED_BY(mutex_) = false;
-  bool ended_ QUARVEL_GUARDED_BY(mutex_) = true;
+  bool ended_ QUARVEL_GUARDED_BY(mutex_) = true;  // the thread; also before `start`
   std::uint64_t wakeUps_ QUARVEL_GUARDED_BY(mutex_) = 0;
   std::thread thread_;  // constant after `start`
 };

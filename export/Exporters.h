@@ -35,7 +35,7 @@ class Exporters {
   /// deliveries in flight to be abandoned.
   class Hold {
    public:
-    explicit Hold(Exporters& exporters);
+    explicit Hold(Exporters& exporters);  // which outlives this
     ~Hold();
     Hold(const Hold&) = delete;
     Hold& operator=(const Hold&) = delete;
@@ -47,13 +47,14 @@ class Exporters {
   /// Abandons batches in flight and ends the threads; waits for them until `deadline`.
   void stop(std::chrono::steady_clock::time_point deadline);
 
+  /// One for each backend, in the order of the constructor's list.
   [[nodiscard]] const std::vector<std::unique_ptr<ExportThread>>& threads() const {
     return threads_;
   }
 
  private:
-  void hold();
-  void release();
+  void hold();     // all threads, one after the other
+  void release();  // likewise
 
   TelemetryStore& store_;
   std::vector<std::unique_ptr<ExportThread>> threads_;  // constant after construction

@@ -8,7 +8,7 @@
 #include <utility>
 #include <vector>
 
-#include "export/EngineModule.h"
+#include "export/ExportEngine.h"
 #include "export/nats/NatsSettings.h"
 #include "export/otlp/OtlpSettings.h"
 #include "platform/Log.h"

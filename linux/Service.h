@@ -22,7 +22,6 @@
 #include "system/ProcessExit.h"
 #include "system/ServiceManager.h"
 #include "system/Status.h"
-#include "system/StatusFile.h"
 #include "transport/SocketListener.h"
 
 namespace quarvel {

@@ -53,10 +53,10 @@ struct Configuration {
 
   /// [agent]
   struct Agent {
-    std::vector<std::string> backends{"store"};
-    bool exports = true;                      // consent to rows leaving the device
-    std::uint32_t drainRowsPerSecond = 2000;  // rate limit of draining a backlog
-    std::string device;                       // empty: the host's name
+    std::vector<std::string> backends{"store"};  // in order, each once; may be empty
+    bool exports = true;                         // consent to rows leaving the device
+    std::uint32_t drainRowsPerSecond = 2000;     // rate limit of draining a backlog
+    std::string device;                          // empty: the host's name
     /// By the name of each remote backend that the service knows, also of the ones not in
     /// `backends`.
     std::map<std::string, std::shared_ptr<const BackendSettings>, std::less<>> settings;
@@ -70,18 +70,22 @@ struct Configuration {
 
   /// [[tallix.channel]]: one driver counter in a file of its own or in a report.
   struct TallixChannel {
-    std::string group, subgroup, name;
-    std::filesystem::path file;
-    std::string pattern;  // empty: the file holds the integer alone
+    std::string group, subgroup, name;  // no subgroup: empty
+    std::filesystem::path file;         // read when samples are taken, not here
+    std::string pattern;                // empty: the file holds the integer alone
   };
   /// [tallix]
   struct Tallix {
-    std::filesystem::path root;  // empty: no tree
-    std::vector<TallixChannel> channels;
+    std::filesystem::path root;           // empty: no tree
+    std::vector<TallixChannel> channels;  // in the file's order
   } tallix;
 
   /// [orientation]
-  enum class OrientationSource { none, files, iio };
+  enum class OrientationSource {
+    none,   // no orientation is ever reported
+    files,  // two files in the runtime directory
+    iio,    // the sensor proxy on the system bus
+  };
   OrientationSource orientation = OrientationSource::none;
 
   /// [limits]

@@ -31,6 +31,7 @@ class ConfigurationSection {
  public:
   /// Checks one string; the error text says which ones it admits.
   using IsAllowed = std::function<bool(std::string_view value)>;
+  /// Checks an entry of a table of strings.
   using IsAllowedPair = std::function<bool(std::string_view name, std::string_view value)>;
   /// The kinds of value in sections with free keys.
   using Scalar = std::variant<bool, std::int64_t, std::string>;
@@ -38,14 +39,16 @@ class ConfigurationSection {
   /// As the upper bound of an integer: none.
   static constexpr std::int64_t kAnyPositive = std::numeric_limits<std::int64_t>::max();
 
+  /// `other` then reports no unknown keys.
   ConfigurationSection(ConfigurationSection&& other) noexcept;
   ConfigurationSection& operator=(ConfigurationSection&&) = delete;
+  /// Reports the keys that were not read.
   ~ConfigurationSection();
 
   // Each `read` replaces `out` by the value of `key` if that is present and right.
   void read(std::string_view key, bool& out);
   void read(std::string_view key, std::string& out);
-  void read(std::string_view key, std::filesystem::path& out);
+  void read(std::string_view key, std::filesystem::path& out);  // any string
   /// A string that `isAllowed` admits. `allowed` completes the error text "<key> must be ...", here
   /// and below.
   void read(std::string_view key, std::string_view allowed, const IsAllowed& isAllowed,
@@ -101,7 +104,7 @@ class ConfigurationSection {
       const std::function<void(ConfigurationSection& root)>& read,
       std::vector<std::string>& warnings);
 
-  struct State;
+  struct State;  // the parsed table, its name, and the place of errors and warnings
   explicit ConfigurationSection(std::unique_ptr<State> state);
 
   // None when the key is absent or its value wrong. `readChoice` returns an index in `names`.

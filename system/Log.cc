@@ -6,7 +6,6 @@
 #include <vector>
 
 #include "platform/Clock.h"
-#include "system/LogLine.h"
 
 namespace quarvel {
 

@@ -19,12 +19,14 @@ namespace quarvel {
 /// for the switch, which any thread may set and read.
 class LogScope {
  public:
+  /// `domain` and `key` must live as long as the process.
   LogScope(std::string fullName, std::string_view domain, std::string_view key, int mask)
       : name(std::move(fullName)), subsystem(domain), verboseKey(key), levelMask(mask) {}
 
-  const std::string name;
+  const std::string name;             // "subsystem[name]", as lines show it
   const std::string_view subsystem;   // the preferences domain
   const std::string_view verboseKey;  // the preference that switches verbose lines on
+  /// Bit n: lines of level n may be written at all.
   const int levelMask;
 
   [[nodiscard]] bool isVerbose() const { return verbose_.load(std::memory_order_relaxed); }
@@ -41,9 +43,11 @@ class LogScopes {
  public:
   using Follower = std::function<void(LogHandle)>;
 
+  /// The one set of the process, made on first use.
   [[nodiscard]] static LogScopes& process();
 
-  /// As `ZQLogRegister`.
+  /// Registers a scope under its four-character `code`. A code that is registered already keeps its
+  /// first scope, which is returned. Never null.
   [[nodiscard]] LogHandle add(std::uint32_t code, std::string_view scope,
                               std::string_view subsystem, std::string_view verboseKey,
                               int levelMask) QUARVEL_EXCLUDES(mutex_);
@@ -69,12 +73,14 @@ class Log {
   /// The least urgent level that is written. Verbose lines follow their scope's switch instead; the
   /// verbose lines of the default log, which has none, are written at `debug`.
   void setLevel(LogLevel level) { level_.store(level, std::memory_order_relaxed); }
+  /// The level set last.
   [[nodiscard]] LogLevel level() const { return level_.load(std::memory_order_relaxed); }
 
   /// As `ZQLogEnabled`, with `level` as the least urgent level that is written.
   [[nodiscard]] static bool isEnabled(LogLevel line, LogHandle scope, LogLevel level);
 
-  /// As `ZQLogWrite`.
+  /// Formats a line on the calling thread and queues it. `scope` is null for the default log;
+  /// `file` and `function` live as long as the process. May block as `LogWriter::write` does.
   void write(LogHandle scope, LogLevel level, const char* file, int line, const char* function,
              std::string_view message);
   /// As `write`, straight to standard error: for a process that has no log.
@@ -86,7 +92,7 @@ class Log {
 
  private:
   std::atomic<LogLevel> level_{kFirstLevel};
-  LogWriter writer_;
+  LogWriter writer_;  // ends first, with all lines written
 };
 
 }  // namespace quarvel

@@ -32,11 +32,13 @@ class ProcessExit {
   [[noreturn]] void exit(int status) QUARVEL_EXCLUDES(mutex_);
 
  private:
+  /// Removes the work that was added last; an empty block when there is none.
   [[nodiscard]] Block takeLast() QUARVEL_EXCLUDES(mutex_);
 
-  Log& log_;
+  Log& log_;                      // outlives this
   std::atomic<pid_t> ending_{0};  // the thread that ends the process; 0: none
   Mutex mutex_;
+  // Not run yet, in the order in which it was added.
   std::vector<Block> work_ QUARVEL_GUARDED_BY(mutex_);
 };
 

@@ -13,13 +13,14 @@ namespace quarvel {
 /// outlives the blocks of its queue. Any thread.
 class ServiceManager {
  public:
+  /// Makes the queue of the pings; says nothing to the manager yet.
   ServiceManager();
   ServiceManager(const ServiceManager&) = delete;
   ServiceManager& operator=(const ServiceManager&) = delete;
 
-  /// Reports that clients are served.
+  /// Reports that clients are served: the socket listens. Sends at once, on the calling thread.
   void reportReady();
-  /// Reports that the service is ending in order.
+  /// Reports that the service is ending in order. Sends like `reportReady`.
   void reportStopping();
 
   /// How often the manager is to hear that the process is alive: half of its time-out
@@ -27,12 +28,12 @@ class ServiceManager {
   [[nodiscard]] static std::chrono::microseconds pingInterval();
   /// Pings the manager once the work of clients moves: a block of their class has to get its turn.
   /// Work that waits for room in the store lends its place and does not delay the ping; work that
-  /// hangs does.
+  /// hangs does. Returns at once; a call while a ping is queued does nothing.
   void ping();
 
  private:
-  const std::unique_ptr<WorkQueue> queue_;
-  std::atomic<bool> pinging_{false};  // a ping is queued
+  const std::unique_ptr<WorkQueue> queue_;  // of the clients' class
+  std::atomic<bool> pinging_{false};        // a ping is queued
 };
 
 }  // namespace quarvel

@@ -4,8 +4,8 @@
 #include <optional>
 #include <string>
 
-#include "export/ExportDevice.h"
 #include "export/ExportEngine.h"
+#include "export/ExportSettings.h"
 #include "export/nats/NatsSettings.h"
 
 namespace quarvel {
@@ -20,6 +20,7 @@ namespace quarvel {
 /// used as `ExportEngine` says.
 class NatsEngine final : public ExportEngine {
  public:
+  /// Connects to no server before the first delivery.
   NatsEngine(NatsSettings settings, const ExportDevice& device);
   ~NatsEngine() override;
 
@@ -29,8 +30,8 @@ class NatsEngine final : public ExportEngine {
   void resume() override;
 
  private:
-  class Acknowledgements;
-  class Connection;
+  class Acknowledgements;  // of the batch in flight; filled by the library's threads
+  class Connection;        // to one of the servers, with the stream checked
 
   const NatsSettings settings_;
   const std::string name_;              // of the connection

@@ -1,4 +1,4 @@
-#include "export/EngineModule.h"
+#include "export/ExportEngine.h"
 #include "export/nats/NatsEngine.h"
 
 extern "C" __attribute__((visibility("default"))) quarvel::ExportEngine* QuarvelMakeEngine(

@@ -21,23 +21,24 @@ class HttpPoster {
   static constexpr std::size_t kMaximumBody = 64 * 1024;
 
   struct Options {
-    std::string url;
-    std::map<std::string, std::string> headers;
+    std::string url;                             // complete, with its path
+    std::map<std::string, std::string> headers;  // sent with each request; may hold secrets
     TlsSettings tls;
-    std::chrono::seconds connect{5};
+    std::chrono::seconds connect{5};   // of one connection attempt
     std::chrono::seconds timeout{10};  // of a whole request
   };
+  /// Opens no connection before the first `post`.
   explicit HttpPoster(Options options);
   ~HttpPoster();
   HttpPoster(const HttpPoster&) = delete;
   HttpPoster& operator=(const HttpPoster&) = delete;
 
   struct Response {
-    long status = 0;        // 0: there was no response
-    std::string failure{};  // the reason why there was none
-    bool stopped = false;   // by `stop`
-    std::string body{};
-    std::optional<std::chrono::seconds> retryAfter{};
+    long status = 0;                                   // 0: there was no response
+    std::string failure{};                             // the reason why there was none
+    bool stopped = false;                              // by `stop`
+    std::string body{};                                // complete, kMaximumBody at most
+    std::optional<std::chrono::seconds> retryAfter{};  // the header, as a time from now
   };
   /// Blocks until the response is complete, `timeout` is over or `stop` is called.
   [[nodiscard]] Response post(std::string_view body) QUARVEL_EXCLUDES(mutex_);
@@ -49,8 +50,9 @@ class HttpPoster {
   void resume() QUARVEL_EXCLUDES(mutex_);
 
  private:
-  struct Connection;
+  struct Connection;  // of the library
 
+  /// The open connection, or a new one.
   Connection& connection() QUARVEL_EXCLUDES(mutex_);
   [[nodiscard]] bool isStopped() const QUARVEL_EXCLUDES(mutex_);
 

@@ -6,7 +6,7 @@
 
 #include "base/Error.h"
 #include "export/ExportBatch.h"
-#include "export/ExportDevice.h"
+#include "export/ExportSettings.h"
 
 namespace quarvel {
 

@@ -2,8 +2,8 @@
 
 #include <string>
 
-#include "export/ExportDevice.h"
 #include "export/ExportEngine.h"
+#include "export/ExportSettings.h"
 #include "export/otlp/HttpPoster.h"
 #include "export/otlp/OtlpSettings.h"
 
@@ -14,6 +14,7 @@ namespace quarvel {
 /// Owned and used as `ExportEngine` says. Memory: one request, compressed when configured.
 class OtlpEngine final : public ExportEngine {
  public:
+  /// Opens no connection before the first delivery.
   OtlpEngine(const OtlpSettings& settings, ExportDevice device);
 
   [[nodiscard]] Delivery deliver(const ExportBatch& batch) override;
@@ -23,7 +24,7 @@ class OtlpEngine final : public ExportEngine {
 
  private:
   const ExportDevice device_;
-  const bool gzip_;
+  const bool gzip_;  // requests are compressed
   HttpPoster poster_;
 };
 

@@ -16,13 +16,14 @@ struct OtlpSettings : BackendSettings {
   std::string endpoint = "http://localhost:4318";
   /// Sent with each request besides the protocol's own. May hold secrets.
   std::map<std::string, std::string> headers;
-  bool gzip = true;
+  bool gzip = true;  // requests are compressed
   TlsSettings tls;
   std::chrono::seconds connect{5};   // of one connection attempt
   std::chrono::seconds timeout{10};  // of a whole request
 };
 
-/// Reads and checks the section, without the engine and its library.
+/// Reads and checks the section, without the engine and its library. Errors go to `section`. Never
+/// null.
 [[nodiscard]] std::shared_ptr<const BackendSettings> ReadOtlpSettings(
     ConfigurationSection& section);
 

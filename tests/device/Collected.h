@@ -1,8 +1,6 @@
 #pragma once
 
 #include <chrono>
-#include <cstddef>
-#include <deque>
 #include <optional>
 #include <utility>
 #include <vector>
@@ -28,14 +26,13 @@ class Collected {
       if (!added_.waitUntil(mutex_, deadline)) return std::nullopt;
     }
     std::optional<T> item(std::move(items_.front()));
-    items_.pop_front();
+    items_.erase(items_.begin());
     return item;
   }
   /// All items so far.
   std::vector<T> take() {
     const MutexLock lock(mutex_);
-    const std::deque<T> taken = std::exchange(items_, {});
-    return {taken.begin(), taken.end()};
+    return std::exchange(items_, {});
   }
   std::size_t size() {
     const MutexLock lock(mutex_);
@@ -45,7 +42,7 @@ class Collected {
  private:
   Mutex mutex_;
   ConditionVariable added_;
-  std::deque<T> items_ QUARVEL_GUARDED_BY(mutex_);
+  std::vector<T> items_ QUARVEL_GUARDED_BY(mutex_);
 };
 
 }  // namespace quarvel

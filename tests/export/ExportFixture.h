@@ -2,12 +2,7 @@
 
 #include <atomic>
 #include <functional>
-#include <optional>
-#include <string>
-#include <vector>
 
-#include "base/Mutex.h"
-#include "export/ExportEngine.h"
 #include "export/Exporter.h"
 #include "tests/store/StoreFixture.h"
 
@@ -16,8 +11,6 @@ namespace quarvel::testing {
 /// Records the names of the rows that it takes, and answers each batch with `answer`.
 class RecordingEngine : public ExportEngine {
  public:
-  using Answer = std::function<Delivery(const ExportBatch&)>;
-
   static Delivery takeAll(const ExportBatch& batch) { return {.taken = batch.rows.size()}; }
   static Delivery down(const ExportBatch&) {
     return {.remainder = Delivery::Remainder::again, .reason = "no answer"};
@@ -33,7 +26,7 @@ class RecordingEngine : public ExportEngine {
   void stop() override {}
   void resume() override {}
 
-  Answer answer = takeAll;
+  std::function<Delivery(const ExportBatch&)> answer = takeAll;
   std::vector<std::string> taken;
   int deliveries = 0;
   int disconnects = 0;
@@ -74,30 +67,26 @@ class ExportFixture : public StoreFixture {
   /// Runs the exporter's steps that are due within `duration`; returns the number of wake-ups.
   int runFor(Duration duration) {
     const Instant end = now_ + duration;
-    int wakeUps = 0;
-    for (;;) {
+    for (int wakeUps = 0;; ++wakeUps) {
       if (next_.uponRows && extended_) next_.at = now_;
-      if (!next_.at || *next_.at > end) break;
-      advance(std::max(*next_.at, now_) - now_);
+      const bool isDue = next_.at && *next_.at <= end;
+      const Duration passed = std::max(isDue ? *next_.at : end, now_) - now_;
+      now_ += passed;
+      date_ = date() + std::chrono::duration_cast<Date::duration>(passed);
+      if (!isDue) return wakeUps;
       extended_ = false;
       next_ = exporter_->step(extent());
-      ++wakeUps;
     }
-    if (now_ < end) advance(end - now_);
-    return wakeUps;
   }
   std::vector<std::string> names(int first, int last, const std::string& table = "message") const {
-    const std::string storeID = this->storeID();
+    const std::string stem = storeID() + "-" + table;
     std::vector<std::string> names;
-    for (int id = first; id <= last; ++id) {
-      names.push_back(storeID + "-" + table + "-" + std::to_string(id));
-    }
+    for (int id = first; id <= last; ++id) names.push_back(stem + "-" + std::to_string(id));
     return names;
   }
   std::vector<std::string> ledger() const {
     return rows(
-        "SELECT backend, table_name, first_id, last_id, rows, outcome FROM export_log"
-        " ORDER BY id");
+        "SELECT backend, table_name, first_id, last_id, rows, outcome FROM export_log ORDER BY id");
   }
 
   [[nodiscard]] Date date() const { return date_; }
@@ -110,13 +99,8 @@ class ExportFixture : public StoreFixture {
   double jitter_ = 1;
 
  private:
-  void advance(Duration duration) {
-    now_ += duration;
-    date_ = date() + std::chrono::duration_cast<Date::duration>(duration);
-  }
-
-  std::atomic<Date> date_{
-      Date(std::chrono::seconds(1'700'000'000))};  // the store's writer reads it
+  // The store's writer reads it too.
+  std::atomic<Date> date_{Date(std::chrono::seconds(1'700'000'000))};
   Exporter::Next next_;
   bool extended_ = false;
 };

@@ -2,26 +2,39 @@
 
 #include <gmock/gmock.h>
 
-#include "export/ExportDevice.h"
+#include "export/ExportSettings.h"
+#include "export/Exporters.h"
 #include "export/otlp/OtlpEngine.h"
 #include "tests/LogRecorder.h"
+#include "tests/device/Collected.h"
 #include "tests/export/ExportFixture.h"
 
 namespace quarvel::testing {
 namespace {
 
-using ::testing::AllOf;
-using ::testing::Contains;
-using ::testing::ElementsAre;
-using ::testing::Ge;
-using ::testing::HasSubstr;
-using ::testing::IsEmpty;
-using ::testing::Le;
-using ::testing::Optional;
+using ::testing::AllOf, ::testing::Contains, ::testing::ElementsAre, ::testing::Ge,
+    ::testing::HasSubstr, ::testing::IsEmpty, ::testing::Le, ::testing::Optional;
 using namespace std::chrono_literals;
 using Remainder = Delivery::Remainder;
 
-class ExporterTest : public ExportFixture {};
+using Names = std::vector<std::string>;
+Names operator+(Names names, const Names& more) {
+  names.insert(names.end(), more.begin(), more.end());
+  return names;
+}
+
+class ExporterTest : public ExportFixture {
+ protected:
+  /// The engine refuses a batch for ever if it holds one of these rows.
+  void refuse(std::int64_t first, std::int64_t last, const char* reason) {
+    engine_.answer = [=](const ExportBatch& batch) {
+      const auto wrong = [=](const ExportRow& row) { return row.id >= first && row.id <= last; };
+      if (std::ranges::none_of(batch.rows, wrong)) return RecordingEngine::takeAll(batch);
+      return Delivery{
+          .remainder = Remainder::refused, .refused = batch.rows.size(), .reason = reason};
+    };
+  }
+};
 
 TEST_F(ExporterTest, CarriesEveryTableOutOnceInOrderAndSaysSo) {
   begin();
@@ -44,12 +57,8 @@ TEST_F(ExporterTest, CarriesEveryTableOutOnceInOrderAndSaysSo) {
               R"({"id":2500,"agent_session":null,"session_id":7,"client_name":"client",)"
               R"("service_name":"service","category":1,"type":2,"payload":{"n":1},)"
               R"("sent_at":1700000000000000})");
-  auto expected = names(1, 1, "agent_session");
-  for (const auto& more :
-       {names(1, 2500), names(1, 1, "analytics_event"), names(1, 1, "power_event")}) {
-    expected.insert(expected.end(), more.begin(), more.end());
-  }
-  EXPECT_EQ(engine_.taken, expected);
+  EXPECT_EQ(engine_.taken, names(1, 1, "agent_session") + names(1, 2500) +
+                               names(1, 1, "analytics_event") + names(1, 1, "power_event"));
   EXPECT_THAT(ledger(), ElementsAre("engine|agent_session|1|1|1|acknowledged",
                                     "engine|message|1|1000|1000|acknowledged",
                                     "engine|message|1001|2000|1000|acknowledged",
@@ -131,32 +140,25 @@ TEST_F(ExporterTest, GoesOnBehindRowsThatRetentionHasTaken) {
 
 TEST_F(ExporterTest, BackOffFollowsTheJitterAndTheEnginesWish) {
   const struct {
-    const char* name;
     double jitter;
     std::optional<std::chrono::seconds> asked;
     std::chrono::seconds took;  // by the engine, and no part of the back-off
     std::chrono::milliseconds expected;
-  } cases[] = {
-      {"most jitter", 1, {}, 0s, 1s},
-      {"least jitter", 0, {}, 0s, 500ms},
-      {"a slow engine", 1, {}, 10s, 1s},
-      {"the engine asks for more", 1, 90s, 0s, 90s},
-      {"the engine asks for less", 1, 0s, 0s, 1s},
-      {"the engine asks for more than an hour", 1, 86'400s, 0s, 3600s},
-  };
-  for (const auto& c : cases) {
-    SCOPED_TRACE(c.name);
+  } cases[] = {{1, {}, 0s, 1s},   {0, {}, 0s, 500ms}, {1, {}, 10s, 1s},
+               {1, 90s, 0s, 90s}, {1, 0s, 0s, 1s},    {1, 86'400s, 0s, 3600s}};
+  for (const auto& [jitter, asked, took, expected] : cases) {
+    SCOPED_TRACE(expected.count());
     begin();
-    jitter_ = c.jitter;
-    engine_.answer = [&](const ExportBatch&) {
-      now_ += c.took;
-      return Delivery{.remainder = Remainder::again, .reason = "busy", .after = c.asked};
+    jitter_ = jitter;
+    engine_.answer = [this, &asked = asked, &took = took](const ExportBatch&) {
+      now_ += took;
+      return Delivery{.remainder = Remainder::again, .reason = "busy", .after = asked};
     };
     addMessages(1);
     runFor(0s);
     engine_.answer = RecordingEngine::takeAll;
     const int before = engine_.deliveries;
-    runFor(c.expected - 1ms);
+    runFor(expected - 1ms);
     EXPECT_EQ(engine_.deliveries, before);
     runFor(1ms);
     EXPECT_EQ(engine_.deliveries, before + 1);
@@ -187,19 +189,9 @@ TEST_F(ExporterTest, TakenRowsOfABatchAreNotSentAgain) {
 TEST_F(ExporterTest, ARefusedRowIsSetAsideAlone) {
   begin();
   addMessages(1000);
-  engine_.answer = [](const ExportBatch& batch) {
-    for (const ExportRow& row : batch.rows) {
-      if (row.id == 778) {
-        return Delivery{
-            .remainder = Remainder::refused, .refused = batch.rows.size(), .reason = "bad row"};
-      }
-    }
-    return RecordingEngine::takeAll(batch);
-  };
+  refuse(778, 778, "bad row");
   runFor(1s);
-  auto expected = names(1, 1000);
-  expected.erase(expected.begin() + 777);
-  EXPECT_EQ(engine_.taken, expected);
+  EXPECT_EQ(engine_.taken, names(1, 777) + names(779, 1000));
   EXPECT_LE(engine_.deliveries, 30);
   EXPECT_THAT(ledger(), Contains("engine|message|778|778|1|refused: bad row"));
   EXPECT_EQ(value("SELECT count(*) FROM message WHERE id = 778"), "1") << "it stays in the store";
@@ -209,10 +201,7 @@ TEST_F(ExporterTest, ARefusedRowIsSetAsideAlone) {
 TEST_F(ExporterTest, AnEngineThatRefusesEverythingIsNotAskedRowByRow) {
   begin();
   addMessages(3000);
-  engine_.answer = [](const ExportBatch& batch) {
-    return Delivery{
-        .remainder = Remainder::refused, .refused = batch.rows.size(), .reason = "nonsense"};
-  };
+  refuse(1, 3000, "nonsense");
   runFor(1s);
   const int firstSecond = engine_.deliveries;
   EXPECT_LE(firstSecond, 25);
@@ -235,10 +224,7 @@ TEST_F(ExporterTest, ACrashRepeatsOneBatchAtMost) {
   begin();
   addMessages(0);
   runFor(1s);
-  auto expected = names(1, 2000);
-  const auto repeated = names(1001, 3000);
-  expected.insert(expected.end(), repeated.begin(), repeated.end());
-  EXPECT_EQ(engine_.taken, expected);
+  EXPECT_EQ(engine_.taken, names(1, 2000) + names(1001, 3000));
 }
 
 TEST_F(ExporterTest, AStoreThatTakesThePlaceOfAnotherIsExportedFromItsBeginning) {
@@ -246,10 +232,7 @@ TEST_F(ExporterTest, AStoreThatTakesThePlaceOfAnotherIsExportedFromItsBeginning)
   addMessages(10);
   runFor(1s);
   store_->close();
-  for (const char* suffix : {"", "-wal", "-shm"}) {
-    std::error_code ignored;
-    std::filesystem::rename(path_.string() + suffix, path_.string() + ".aside" + suffix, ignored);
-  }
+  for (const char* suffix : {"", "-wal", "-shm"}) std::filesystem::remove(path_.string() + suffix);
   store_ = open({.sync = 0ms});
   source_.emplace(*store_, path_, "engine");
   engine_.taken.clear();
@@ -269,15 +252,110 @@ TEST_F(ExporterTest, RowsThatAPowerCutMayTakeAreNotSent) {
   EXPECT_EQ(engine_.taken, names(1, 4));
 }
 
+constexpr std::int64_t kDisconnected = 0;
+
+/// Reports the ids of the rows that it takes. While `hangs`, a delivery waits until it is stopped.
+class HangingEngine : public ExportEngine {
+ public:
+  struct Seen {
+    Collected<std::int64_t> taken, hung;  // `kDisconnected` counts as taken
+    std::atomic<bool> hangs = false;
+  };
+  explicit HangingEngine(Seen& seen) : seen_(seen) {}
+
+  Delivery deliver(const ExportBatch& batch) override {
+    const MutexLock lock(mutex_);
+    if (seen_.hangs && !stopped_) seen_.hung.add(batch.rows.front().id);
+    while (seen_.hangs && !stopped_) changed_.wait(mutex_);
+    if (stopped_) return {.remainder = Delivery::Remainder::stopped};
+    for (const ExportRow& row : batch.rows) seen_.taken.add(row.id);
+    return {.taken = batch.rows.size()};
+  }
+  void disconnect() override { seen_.taken.add(kDisconnected); }
+  void stop() override { setStopped(true); }
+  void resume() override { setStopped(false); }
+
+ private:
+  void setStopped(bool stopped) {
+    const MutexLock lock(mutex_);
+    stopped_ = stopped;
+    changed_.notifyAll();
+  }
+
+  Seen& seen_;
+  Mutex mutex_;
+  ConditionVariable changed_;
+  bool stopped_ QUARVEL_GUARDED_BY(mutex_) = false;
+};
+
+class ExportThreadTest : public StoreFixture {
+ protected:
+  void start(bool exports = true) {
+    std::vector<Exporters::Backend> backends;
+    backends.push_back({{"dead", 1'000'000}, std::make_unique<HangingEngine>(dead_)});
+    backends.push_back({{"alive", 1'000'000}, std::make_unique<HangingEngine>(alive_)});
+    exporters_.emplace(*store_, std::move(backends), exports);
+  }
+  void addMessage() { ASSERT_TRUE(send(*store_, Payload())); }
+
+  std::unique_ptr<TelemetryStore> store_ = open({.sync = 0ms, .remoteBackends = {"dead", "alive"}});
+  HangingEngine::Seen dead_, alive_;
+  std::optional<Exporters> exporters_;
+};
+
+TEST_F(ExportThreadTest, ADeadEngineDelaysNeitherAnotherNorTheEnd) {
+  dead_.hangs = true;
+  start();
+  for (std::int64_t id = 1; id <= 3; ++id) {
+    addMessage();
+    EXPECT_EQ(alive_.taken.next(), id);
+  }
+  EXPECT_EQ(dead_.hung.next(), 1);
+  // Each row wakes it up when it is stored, and again when the cursor is.
+  EXPECT_LE(exporters_->threads().back()->status().wakeUps, 10U) << "it polls";
+  ExportThread& hanging = *exporters_->threads().front();
+  hanging.stop();
+  EXPECT_TRUE(hanging.awaitEnd(std::chrono::steady_clock::now() + 30s));
+  EXPECT_EQ(value("SELECT count(*) FROM backend_cursor WHERE backend = 'dead'"), "0");
+}
+
+TEST_F(ExportThreadTest, HeldItHoldsNoRowAndReleasedItGoesOn) {
+  alive_.hangs = true;
+  start();
+  ExportThread& thread = *exporters_->threads().back();
+  addMessage();
+  EXPECT_EQ(alive_.hung.next(), 1);
+  thread.hold();
+  thread.hold();
+  alive_.hangs = false;
+  addMessage();
+  thread.release();
+  EXPECT_EQ(alive_.taken.next(), kDisconnected);
+  EXPECT_EQ(alive_.taken.size(), 0U);
+  thread.release();
+  EXPECT_EQ(alive_.taken.next(), 1);
+  EXPECT_EQ(alive_.taken.next(), 2);
+}
+
+// Rows left when the service was started with `export = false`.
+TEST_F(ExportThreadTest, WithoutConsentAtTheStartNoRowLeaves) {
+  addMessage();
+  awaitStored(*store_);
+  start(/*exports=*/false);
+  EXPECT_EQ(alive_.taken.next(), kDisconnected) << "it must be held before its first row";
+  EXPECT_EQ(alive_.taken.size(), 0U);
+  exporters_->setExports(true);
+  EXPECT_EQ(alive_.taken.next(), 1);
+}
+
 TEST(OtlpDeliveryTest, OnlyAStatusAboutTheRowsRefusesThem) {
-  for (const long status :
-       {0L, 301L, 401L, 403L, 404L, 405L, 407L, 408L, 415L, 429L, 502L, 503L, 504L}) {
+  for (const int status : {0, 301, 401, 403, 404, 405, 407, 408, 415, 429, 502, 503, 504}) {
     const Delivery delivery = DeliveryFromResponse({.status = status, .retryAfter = 7s}, 3);
     EXPECT_EQ(delivery.remainder, Remainder::again) << status;
     EXPECT_EQ(delivery.taken + delivery.refused, 0U) << status;
     EXPECT_EQ(delivery.after.has_value(), status != 0) << status;
   }
-  for (const long status : {400L, 413L, 422L, 500L, 501L}) {
+  for (const int status : {400, 413, 422, 500, 501}) {
     const Delivery delivery = DeliveryFromResponse({.status = status}, 3);
     EXPECT_EQ(delivery.remainder, Remainder::refused) << status;
     EXPECT_EQ(delivery.refused, 3U) << status;

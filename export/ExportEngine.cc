@@ -1,4 +1,4 @@
-#include "export/EngineModule.h"
+#include "export/ExportEngine.h"
 
 #include <dlfcn.h>
 #include <fmt/format.h>
