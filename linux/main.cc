@@ -1,4 +1,4 @@
-#include "Statistics/Service/ZQReportingServiceDelegate.h"
+#include "Statistics/Service/ServiceMain.h"
 #include "linux/Service.h"
 #include "platform/Process.h"
 

@@ -528,12 +528,4 @@ void ZQReportingServerInstance::handleConnectionError() {
   });
 }
 
-int ServiceMain() {
-  const auto delegate = ZQReportingServiceDelegate::create();
-  ServiceListener& listener = ProcessServiceListener();
-  listener.setDelegate(delegate);
-  listener.resume();
-  return 0;
-}
-
 }  // namespace quarvel

@@ -210,10 +210,6 @@ class ZQReportingServiceDelegate final
   std::optional<ZQReportingDriverUtility> driverUtility_;  // present and constant after `create`
 };
 
-/// The process entry: makes the delegate, gives it to the process's listener and serves clients
-/// until the service is told to end. On the main thread. Returns the exit status of the process.
-[[nodiscard]] int ServiceMain();
-
 /// The short name of a client's process, if it is known: the own one for the own process, and none
 /// for a process that has ended. From any thread.
 [[nodiscard]] std::optional<std::string> ProcessNameForPID(std::int32_t pid);

@@ -18,7 +18,7 @@
 
 #include <quarvel/client.hpp>
 
-#include "Statistics/Service/ZQReportingServiceDelegate.h"
+#include "Statistics/Service/ServiceMain.h"
 #include "platform/DeviceProperties.h"
 #include "platform/Log.h"
 #include "platform/Process.h"

@@ -2,6 +2,7 @@
 
 #include <functional>
 
+#include "Statistics/Service/ServiceMain.h"
 #include "Statistics/Service/ZQReportingServiceDelegate.h"
 #include "Statistics/Service/ZQReportingSession.h"
 #include "tests/simulated/Simulation.h"

@@ -1,91 +1,13 @@
-// Queues, conditions, run loops and threads: all wait in the scheduler, whose baton guards them.
+#include "platform/RunLoop.h"
+
 #include <algorithm>
 
-#include "platform/Condition.h"
-#include "platform/RunLoop.h"
 #include "tests/simulated/Simulation.h"
+
+// Timers wait in the scheduler, whose baton guards them.
 
 namespace quarvel {
 namespace {
-
-class SimulatedWorkQueue final : public WorkQueue {
- public:
-  explicit SimulatedWorkQueue(std::shared_ptr<Scheduler::Queue> queue) : queue_(std::move(queue)) {}
-  [[nodiscard]] std::string_view label() const override { return queue_->name; }
-  void async(Block block) override {
-    TheScheduler().enqueue(queue_, std::move(block));
-    TheScheduler().mayYield();
-  }
-  void asyncBrief(Block block) override {
-    ++Simulation::current().briefBlocks;
-    async(std::move(block));
-  }
-  void after(std::chrono::milliseconds delay, Block block) override {
-    TheScheduler().after(delay, [queue = queue_, late = std::move(block)]() mutable {
-      TheScheduler().enqueue(queue, std::move(late));
-    });
-  }
-  [[nodiscard]] bool isCurrent() const override { return TheScheduler().isCurrent(*queue_); }
-
- private:
-  const std::shared_ptr<Scheduler::Queue> queue_;
-};
-
-// The analysis does not know the baton.
-class SimulatedCondition final : public Condition {
- public:
-  void lock() override QUARVEL_NO_THREAD_SAFETY_ANALYSIS {
-    while (owner_ != nullptr) {
-      lockers_.push_back(TheScheduler().current());
-      TheScheduler().park("a condition's lock");
-    }
-    owner_ = TheScheduler().current();
-  }
-  void unlock() override QUARVEL_NO_THREAD_SAFETY_ANALYSIS {
-    release();
-    TheScheduler().mayYield();
-  }
-  void signal() override QUARVEL_NO_THREAD_SAFETY_ANALYSIS {
-    expectHeld("signalled");
-    std::vector<Scheduler::Thread*> parked;
-    std::ranges::copy_if(waiters_, std::back_inserter(parked), &Scheduler::isParked);
-    if (parked.empty()) return;
-    Scheduler::Thread* chosen = parked[TheScheduler().choose(parked.size())];
-    std::erase(waiters_, chosen);
-    TheScheduler().wake(*chosen);
-  }
-  bool waitUntil(Date deadline) override QUARVEL_NO_THREAD_SAFETY_ANALYSIS {
-    expectHeld("waited in");
-    Scheduler::Thread* self = TheScheduler().current();
-    waiters_.push_back(self);
-    const auto left = deadline - TheScheduler().wallClock();
-    Scheduler::WakeUp spurious;
-    if (Simulation::current().spuriousWakeUps && left.count() > 0 && TheScheduler().choose(2) > 0) {
-      const auto delay = TheScheduler().choose(static_cast<std::uint64_t>(left.count()));
-      spurious = TheScheduler().wakeAfter(Scheduler::Duration(delay));
-    }
-    release();
-    const bool woken = TheScheduler().park("a signal", deadline);
-    spurious.reset();
-    std::erase(waiters_, self);
-    lock();
-    return woken;
-  }
-
- private:
-  void release() {
-    owner_ = nullptr;
-    for (Scheduler::Thread* locker : std::exchange(lockers_, {})) TheScheduler().wake(*locker);
-  }
-  void expectHeld(const char* use) const {
-    EXPECT_EQ(owner_, TheScheduler().current())
-        << "a condition is " << use << " by a thread that does not hold its lock";
-  }
-
-  const Scheduler::Thread* owner_ = nullptr;
-  std::vector<Scheduler::Thread*> lockers_;
-  std::vector<Scheduler::Thread*> waiters_;
-};
 
 class SimulatedRunLoop;
 
@@ -181,23 +103,6 @@ class SimulatedWorkerThread final : public WorkerThread {
 };
 
 }  // namespace
-
-std::unique_ptr<WorkQueue> CreateSerialQueue(std::string_view label, QualityOfService) {
-  auto queue = TheScheduler().makeQueue(std::string(label), true);
-  Simulation::current().queues.emplace_back(label, queue->number);
-  return std::make_unique<SimulatedWorkQueue>(std::move(queue));
-}
-std::unique_ptr<WorkQueue>& ProcessServerQueue() {
-  return Simulation::current().serverQueue;
-}
-WorkQueue& BackgroundQueue() {
-  static SimulatedWorkQueue queue(std::make_shared<Scheduler::Queue>("background", false));
-  return queue;
-}
-
-std::shared_ptr<Condition> CreateCondition() {
-  return std::make_shared<SimulatedCondition>();
-}
 
 RunLoop& RunLoop::current() {
   static thread_local SimulatedRunLoop loop;
