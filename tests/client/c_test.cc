@@ -94,11 +94,11 @@ TEST_F(CTest, EveryKindOfReplyArrives) {
   quarvel_create_reporting_session(client, 7, Notes<bool>::add, &notes);
   quarvel_get_service_name_for_reporter_id(client, 7, Notes<std::uint16_t>::add, &notes);
   quarvel_reporter_id(client, 7, Notes<std::int64_t, std::uint16_t>::add, &notes);
-  const auto ids = [](void* to, const std::int64_t* ids, std::size_t n,
+  const auto add = [](void* to, const std::int64_t* ids, std::size_t n,
                       const quarvel_error* error) {
     Notes<std::size_t, std::int64_t>::add(to, n, ids[1], error);
   };
-  quarvel_get_all_reporters(client, ids, &notes);
+  quarvel_get_all_reporters(client, add, &notes);
   for (int i = 0; i < 3; ++i) {
     quarvel_send_message(client, nullptr, QUARVEL_KIND_VOLUME, 0, nullptr, 0, Notes<>::add, &notes);
   }
