@@ -121,13 +121,13 @@ void TrapSystemCalls() {
 std::vector<std::string> Watch(const std::function<void()>& produce) {
   callCount = 0;
   pthread_t thread{};
-  const auto run = [](void* produce) -> void* {
+  const auto run = [](void* given) -> void* {
     // malloc prepares each thread at its first call; then an allocation is no system call as well.
     void* volatile first = ::malloc(1);
     ::free(first);
     TrapSystemCalls();
     watched = true;
-    (*static_cast<const std::function<void()>*>(produce))();
+    (*static_cast<const std::function<void()>*>(given))();
     watched = false;
     ::syscall(SYS_exit, 0);  // the ordinary end of a thread makes more system calls
     return nullptr;
