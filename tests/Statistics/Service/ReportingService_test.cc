@@ -234,13 +234,16 @@ SEEDED_TEST(Routing, AFullAgentDelaysNoReply, RunningService) {
 }
 
 TEST(Preferences, AForeignNotificationAndAFailedRegistrationChangeNothing) {
-  RunningService service(
-      1, [](Simulation& simulation) { simulation.notifications.registrationStatus = 5; });
-  EXPECT_EQ(service.log.texts("default").at(0),
-            "default zqrs " + kDelegate + "listenForDefaultsNotification]: notify setup result 5");
-  const auto created = service.connect(42).create(7);
-  service.run();
-  EXPECT_THAT(created->results, ElementsAre(kYes));
+  {
+    RunningService service(
+        1, [](Simulation& simulation) { simulation.notifications.registrationStatus = 5; });
+    EXPECT_EQ(
+        service.log.texts("default").at(0),
+        "default zqrs " + kDelegate + "listenForDefaultsNotification]: notify setup result 5");
+    const auto created = service.connect(42).create(7);
+    service.run();
+    EXPECT_THAT(created->results, ElementsAre(kYes));
+  }
   RunningService listening(1);
   listening.log.lines.clear();
   listening.notifications.post("tarnwick.quarvel.reporting", 1);
