@@ -56,8 +56,8 @@ class QUARVEL_CAPABILITY("queue") WorkQueue {
 /// The process-wide concurrent queue of the background class.
 [[nodiscard]] WorkQueue& BackgroundQueue();
 
-/// The place of the core's process-wide server queue, which lives as long as the other queues. Empty
-/// until the core sets it, before any other thread uses it.
+/// The place of the core's process-wide server queue, which lives as long as the other queues.
+/// Empty until the core sets it, before any other thread uses it.
 [[nodiscard]] std::unique_ptr<WorkQueue>& ProcessServerQueue();
 
 }  // namespace quarvel
